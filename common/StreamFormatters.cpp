@@ -1,0 +1,107 @@
+#include <qel/common/StreamFormatters.hpp>
+#include <qel/common/TypeInfo.hpp>
+
+#include <csignal>
+#include <cstring>
+#include <iomanip>
+
+namespace qel {
+
+namespace {
+
+constexpr std::uint64_t kDumpBytesPerLine = 16;
+
+/// @return the C library's description of a signal, null when it has none
+const char* signalDescription(int number) noexcept
+{
+    constexpr int kSignals = 65; // the table covers the signals 0 to 64
+    if (number < 0 || number >= kSignals) return nullptr;
+#if defined(__GLIBC__) && __GLIBC_PREREQ(2, 32)
+    return ::sigdescr_np(number); // reads the table that was called sys_siglist before
+#elif defined(__GLIBC__)
+    return ::sys_siglist[number];
+#else
+    // strsignal makes up a text for numbers that have no description; these have one everywhere.
+    return number >= 1 && number <= 31 ? ::strsignal(number) : nullptr;
+#endif
+}
+
+} // namespace
+
+std::ostream& operator<<(std::ostream& os, const HexStringFormatter& formatter)
+{
+    formatter.pSetupStream(os, 2);
+    const auto* bytes = static_cast<const unsigned char*>(formatter.mPtr);
+    for (std::uint64_t i = 0; i < formatter.mLength; ++i) {
+        os << std::setw(2) << static_cast<unsigned int>(bytes[i]);
+    }
+    os.width(0); // with no byte to use it up, the width would pad whatever is printed next
+    return os;
+}
+
+std::ostream& operator<<(std::ostream& os, const HexDumpFormatter& formatter)
+{
+    const auto* bytes = static_cast<const unsigned char*>(formatter.mPtr);
+    const auto address = static_cast<std::uint64_t>(reinterpret_cast<std::uintptr_t>(formatter.mPtr));
+
+    os << std::hex << std::setfill('0');
+    for (std::uint64_t i = 0; i < formatter.mLength; ++i) {
+        if (i % kDumpBytesPerLine == 0) {
+            if (i != 0) os << std::endl;
+            if (formatter.mPrintAddr) (os << std::setw(16) << address + i).put(':');
+        }
+        if (i % 2 == 0) os.put(' ');
+        os << std::setw(2) << static_cast<unsigned int>(bytes[i]);
+    }
+    return os << std::endl << std::endl;
+}
+
+std::ostream& operator<<(std::ostream& os, const CharArrayFormatter& formatter)
+{
+    return os.write(formatter.mBuffer, static_cast<std::streamsize>(formatter.mLength));
+}
+
+std::ostream& operator<<(std::ostream& os, const SignalFormatter& formatter)
+{
+    os << decFormat(formatter.mCode);
+    if (const char* description = signalDescription(formatter.mCode)) os << " (" << description << ")";
+    return os;
+}
+
+std::ostream& operator<<(std::ostream& os, const ExceptionInfo& info)
+{
+    return os << TypeInfo::getTypeName(info.mExc) << ": " << info.mExc.what();
+}
+
+std::ostream& operator<<(std::ostream& os, const Indent& indent)
+{
+    for (std::uint64_t i = 0; i < indent.mCount; ++i) {
+        os.put(indent.mValue);
+    }
+    return os;
+}
+
+std::ostream& operator<<(std::ostream& os, const DHMSDurationFormatter& formatter)
+{
+    using Days = std::chrono::duration<std::int32_t, std::ratio<86400>>;
+
+    // Remainders, not differences: those would overflow for durations whose days do not fit their count.
+    const std::chrono::milliseconds total = formatter.mDuration;
+    const auto days = std::chrono::duration_cast<Days>(total).count();
+    const auto hours = std::chrono::duration_cast<std::chrono::hours>(total % Days(1)).count();
+    const auto minutes = std::chrono::duration_cast<std::chrono::minutes>(total % std::chrono::hours(1)).count();
+    const auto seconds = std::chrono::duration_cast<std::chrono::seconds>(total % std::chrono::minutes(1)).count();
+    const auto milliseconds = (total % std::chrono::seconds(1)).count();
+
+    const std::ios_base::fmtflags flags = os.flags();
+    os << std::dec << std::right << std::setfill('0');
+    os << std::setw(3) << days << "d:";
+    os << std::setw(2) << hours << "h:";
+    os << std::setw(2) << minutes << "m:";
+    os << std::setw(2) << seconds << '.';
+    os << std::setw(3) << milliseconds << 's';
+    os.flags(flags);
+    return os;
+}
+
+} // namespace qel

@@ -1,0 +1,40 @@
+#include <qel/common/util/TimeProvider.hpp>
+
+namespace qel {
+
+namespace {
+
+// Log lines may be written by static initialisers and static destructors anywhere in the process. So the default
+// provider is there before the first of them runs (both objects are initialised by constants) and is never destroyed
+// (the destructor of a union leaves its member alone).
+union DefaultProviderStorage {
+    constexpr DefaultProviderStorage() noexcept : provider() {}
+    ~DefaultProviderStorage() {}
+    DefaultTimeProvider provider;
+};
+
+DefaultProviderStorage sDefault;
+TimeProvider* sCurrent = &sDefault.provider;
+
+} // namespace
+
+std::chrono::system_clock::time_point TimeProvider::system() { return sCurrent->pSystem(); }
+
+std::chrono::steady_clock::time_point TimeProvider::steady() { return sCurrent->pSteady(); }
+
+TimeProvider::~TimeProvider() { pUnregister(); }
+
+void TimeProvider::pRegister() noexcept { sCurrent = this; }
+
+void TimeProvider::pUnregister() noexcept
+{
+    if (sCurrent == this) sCurrent = &sDefault.provider;
+}
+
+DefaultTimeProvider::~DefaultTimeProvider() = default;
+
+std::chrono::system_clock::time_point DefaultTimeProvider::pSystem() { return std::chrono::system_clock::now(); }
+
+std::chrono::steady_clock::time_point DefaultTimeProvider::pSteady() { return std::chrono::steady_clock::now(); }
+
+} // namespace qel

@@ -1,0 +1,627 @@
+#include <qel/common/StreamFormatters.hpp>
+#include <qel/common/util/PosixError.hpp>
+
+#include "support/Bytes.hpp"
+
+#include <chrono>
+#include <climits>
+#include <cstdio>
+#include <cstring>
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+#include <iomanip>
+#include <list>
+#include <locale>
+#include <sstream>
+#include <stdexcept>
+#include <vector>
+
+namespace qel {
+
+enum FormatterTestCode : unsigned short { FormatterTestCodeFive = 5 };
+template <>
+struct HexWidth<FormatterTestCode> : std::integral_constant<std::size_t, 8> {};
+
+namespace {
+
+enum ByteEnumeration : unsigned char { kByteFlag = 0x40 };
+enum class SignedByteEnumeration : signed char { Negative = -1 };
+enum WordEnumeration : unsigned short { kWord = 0x6003 };
+enum class WideEnumeration : int { Value = 5, Negative = -5 };
+
+template <typename T>
+std::string printed(const T& value)
+{
+    std::ostringstream os;
+    os << value;
+    return os.str();
+}
+
+// ---------------------------------------------------------------------------------------------- hexadecimal numbers
+
+TEST(HexFormat, PrintsTwoDigitsForEachByteOfTheType)
+{
+    EXPECT_EQ(printed(hexFormat(static_cast<unsigned char>(10))), "0x0A");
+    EXPECT_EQ(printed(hexFormat(std::uint16_t(0x1F))), "0x001F");
+    EXPECT_EQ(printed(hexFormat(0x1FU)), "0x0000001F");
+    EXPECT_EQ(printed(hexFormat(std::uint64_t(0x1F))), "0x000000000000001F");
+}
+
+TEST(HexFormat, PrintsEveryDigitOfAFullValue)
+{
+    EXPECT_EQ(printed(hexFormat(static_cast<unsigned char>(0xFE))), "0xFE");
+    EXPECT_EQ(printed(hexFormat(std::uint16_t(0xFEDC))), "0xFEDC");
+    EXPECT_EQ(printed(hexFormat(0xFEDCBA98U)), "0xFEDCBA98");
+    EXPECT_EQ(printed(hexFormat(std::uint64_t(0xFEDCBA9876543210))), "0xFEDCBA9876543210");
+}
+
+TEST(HexFormat, PrintsCharactersAsNumbers)
+{
+    EXPECT_EQ(printed(hexFormat('A')), "0x41");
+    EXPECT_EQ(printed(hexFormat('\0')), "0x00");
+    EXPECT_EQ(printed(hexFormat('\x7F')), "0x7F");
+    EXPECT_EQ(printed(hexFormat(true)), "0x01");
+}
+
+TEST(HexFormat, SignExtendsANegativeCharacterToFourDigits)
+{
+    EXPECT_EQ(printed(hexFormat('\x80')), "0xFF80");
+    EXPECT_EQ(printed(hexFormat('\xFF')), "0xFFFF");
+    EXPECT_EQ(printed(hexFormat(static_cast<signed char>(-2))), "0xFFFE");
+    EXPECT_EQ(printed(hexFormat(static_cast<unsigned char>(0x80))), "0x80");
+}
+
+TEST(HexFormat, PrintsNegativeNumbersAsTheirBits)
+{
+    EXPECT_EQ(printed(hexFormat(static_cast<short>(-1))), "0xFFFF");
+    EXPECT_EQ(printed(hexFormat(-1)), "0xFFFFFFFF");
+    EXPECT_EQ(printed(hexFormat(INT_MIN)), "0x80000000");
+    EXPECT_EQ(printed(hexFormat(-1L)), std::string("0x") + std::string(2 * sizeof(long), 'F'));
+}
+
+TEST(HexFormat, PrintsEnumerationsAsTheirNumbers)
+{
+    EXPECT_EQ(printed(hexFormat(kByteFlag)), "0x40");
+    EXPECT_EQ(printed(hexFormat(kWord)), "0x6003");
+    EXPECT_EQ(printed(hexFormat(WideEnumeration::Value)), "0x00000005");
+    EXPECT_EQ(printed(hexFormat(SignedByteEnumeration::Negative)), "0xFFFF");
+}
+
+TEST(HexFormat, ATypeCanAskForAnotherWidth)
+{
+    EXPECT_EQ(printed(hexFormat(FormatterTestCodeFive)), "0x00000005");
+    EXPECT_EQ(printed(hexFormat(FormatterTestCodeFive).noPrefix()), "00000005");
+    EXPECT_EQ(printed(decFormat(FormatterTestCodeFive)), "5");
+}
+
+TEST(HexFormat, PrintsWireIntegersAsTheirHostValue)
+{
+    EXPECT_EQ(printed(hexFormat(be_uint16_t(0x1F))), "0x001F");
+    EXPECT_EQ(printed(hexFormat(be_uint32_t(0xDECAFF20))), "0xDECAFF20");
+    EXPECT_EQ(printed(hexFormat(endian_uint<unsigned char, 4321>(0x0A))), "0x0A");
+}
+
+TEST(HexFormat, PrintsBinaryCodedDecimalsAsTheirDecodedValue)
+{
+    EXPECT_EQ(printed(hexFormat(bcd_uint8_t(99))), "0x63");
+    EXPECT_EQ(printed(hexFormat(bcd_uint16_t(2024))), "0x07E8");
+}
+
+TEST(HexFormat, NoPrefixLeavesThePrefixOutAndChains)
+{
+    EXPECT_EQ(printed(hexFormat(std::uint16_t(0x1F)).noPrefix()), "001F");
+    auto formatter = hexFormat(std::uint16_t(0x1F));
+    EXPECT_EQ(&formatter.noPrefix(), &formatter);
+    EXPECT_EQ(printed(formatter), "001F");
+    EXPECT_EQ(printed(formatter), "001F");
+}
+
+TEST(HexFormat, PrefixesCanBeTakenByReference)
+{
+    const char* const& prefix = HexFormatterBase::PREFIX;
+    const char* const& noPrefix = HexFormatterBase::NO_PREFIX;
+    EXPECT_STREQ(prefix, "0x");
+    EXPECT_STREQ(noPrefix, "");
+}
+
+TEST(HexFormat, LeavesTheStreamInUpperCaseHexadecimalWithZeroFill)
+{
+    std::ostringstream os;
+    os << hexFormat(std::uint16_t(1)) << ' ' << 171 << ' ' << std::setw(4) << 1;
+    EXPECT_EQ(os.str(), "0x0001 AB 0001");
+    EXPECT_EQ(os.fill(), '0');
+    EXPECT_EQ(os.flags() & std::ios_base::basefield, std::ios_base::hex);
+    EXPECT_NE(os.flags() & std::ios_base::uppercase, std::ios_base::fmtflags());
+}
+
+TEST(HexFormat, ReturnsTheStream)
+{
+    std::ostringstream os;
+    EXPECT_EQ(&(os << hexFormat(1)), &os);
+    EXPECT_EQ(&(os << decFormat(1)), &os);
+}
+
+TEST(HexFormat, HoldsACopyOfTheValue)
+{
+    unsigned int value = 1;
+    const auto hexadecimal = hexFormat(value);
+    const auto decimal = decFormat(value);
+    value = 2;
+    EXPECT_EQ(printed(hexadecimal), "0x00000001");
+    EXPECT_EQ(printed(decimal), "1");
+}
+
+// -------------------------------------------------------------------------------------------------- decimal numbers
+
+TEST(DecFormat, SwitchesTheStreamBackToDecimal)
+{
+    std::ostringstream os;
+    os << hexFormat(std::uint16_t(255)) << ' ' << decFormat(255) << ' ' << 255;
+    EXPECT_EQ(os.str(), "0x00FF 255 255");
+}
+
+TEST(DecFormat, KeepsTheSignOfEverythingWiderThanAByte)
+{
+    EXPECT_EQ(printed(decFormat(static_cast<short>(-1))), "-1");
+    EXPECT_EQ(printed(decFormat(-42)), "-42");
+    EXPECT_EQ(printed(decFormat(LLONG_MIN)), "-9223372036854775808");
+    EXPECT_EQ(printed(decFormat(ULLONG_MAX)), "18446744073709551615");
+    EXPECT_EQ(printed(decFormat(WideEnumeration::Negative)), "-5");
+}
+
+TEST(DecFormat, WidensOneByteTypesToUnsignedSixteenBits)
+{
+    EXPECT_EQ(printed(decFormat('A')), "65");
+    EXPECT_EQ(printed(decFormat(static_cast<unsigned char>(200))), "200");
+    EXPECT_EQ(printed(decFormat('\x80')), "65408");
+    EXPECT_EQ(printed(decFormat(static_cast<signed char>(-1))), "65535");
+    EXPECT_EQ(printed(decFormat(kByteFlag)), "64");
+}
+
+TEST(DecFormat, PrintsWireIntegersAndBinaryCodedDecimals)
+{
+    EXPECT_EQ(printed(decFormat(be_uint16_t(0x1234))), "4660");
+    EXPECT_EQ(printed(decFormat(be_uint32_t(0xFFFFFFFF))), "4294967295");
+    EXPECT_EQ(printed(decFormat(bcd_uint8_t(59))), "59");
+    EXPECT_EQ(printed(decFormat(bcd_uint16_t(2024))), "2024");
+}
+
+TEST(DecFormat, RestoresNeitherBaseNorFill)
+{
+    std::ostringstream os;
+    os << std::setfill('*') << std::hex << decFormat(10) << ' ' << std::setw(4) << 10;
+    EXPECT_EQ(os.str(), "10 **10");
+}
+
+// ------------------------------------------------------------------------------------------------------ byte strings
+
+TEST(HexString, PrintsOneRunOfDigitsWithOnePrefix)
+{
+    const std::vector<char> data = test::bytes({0x01, 0xAB, 0x00});
+    EXPECT_EQ(printed(HexStringFormatter(data.data(), data.size())), "0x01AB00");
+}
+
+TEST(HexString, PrintsBytesAboveSevenBitsWithTwoDigits)
+{
+    const std::vector<char> data = test::bytes({0x80, 0xFF});
+    EXPECT_EQ(printed(HexStringFormatter(data.data(), data.size())), "0x80FF");
+}
+
+TEST(HexString, ReadsExactlyTheGivenBytes)
+{
+    const std::vector<char> data = test::bytes({0xDE, 0xCA, 0xFF, 0x20});
+    const std::unique_ptr<char[]> copy = test::heapCopy(data);
+    EXPECT_EQ(printed(HexStringFormatter(copy.get(), data.size())), "0xDECAFF20");
+}
+
+TEST(HexString, OfNoBytesIsThePrefix) { EXPECT_EQ(printed(HexStringFormatter(nullptr, 0)), "0x"); }
+
+TEST(HexString, NoPrefixLeavesThePrefixOutAndChains)
+{
+    const std::vector<char> data = test::bytes({0x01, 0xAB});
+    HexStringFormatter formatter(data.data(), data.size());
+    EXPECT_EQ(&formatter.noPrefix(), &formatter);
+    EXPECT_EQ(printed(formatter), "01AB");
+    EXPECT_EQ(printed(HexStringFormatter(data.data(), 1).noPrefix()), "01");
+}
+
+TEST(HexString, LeavesTheStreamInUpperCaseHexadecimal)
+{
+    std::ostringstream os;
+    os << HexStringFormatter("\x01", 1) << ' ' << 171;
+    EXPECT_EQ(os.str(), "0x01 AB");
+}
+
+// --------------------------------------------------------------------------------------------------------- hex dumps
+
+std::string countingBytes(std::size_t length)
+{
+    std::string data;
+    for (std::size_t i = 0; i < length; ++i) {
+        data += static_cast<char>(static_cast<unsigned char>(i));
+    }
+    return data;
+}
+
+TEST(HexDump, PrintsSixteenBytesInEightGroupsOfTwo)
+{
+    const std::string data = countingBytes(16);
+    EXPECT_EQ(printed(HexDumpFormatter(data.data(), data.size(), false)),
+              " 0001 0203 0405 0607 0809 0a0b 0c0d 0e0f\n\n");
+}
+
+TEST(HexDump, StartsALineAfterSixteenBytes)
+{
+    const std::string data = countingBytes(17);
+    EXPECT_EQ(printed(HexDumpFormatter(data.data(), data.size(), false)),
+              " 0001 0203 0405 0607 0809 0a0b 0c0d 0e0f\n 10\n\n");
+}
+
+TEST(HexDump, LengthsAroundTheGroupsAndLines)
+{
+    struct Row {
+        std::size_t length;
+        const char* text;
+    };
+    const Row rows[] = {
+        {0, "\n\n"},
+        {1, " 00\n\n"},
+        {2, " 0001\n\n"},
+        {3, " 0001 02\n\n"},
+        {15, " 0001 0203 0405 0607 0809 0a0b 0c0d 0e\n\n"},
+        {32, " 0001 0203 0405 0607 0809 0a0b 0c0d 0e0f\n 1011 1213 1415 1617 1819 1a1b 1c1d 1e1f\n\n"},
+        {33, " 0001 0203 0405 0607 0809 0a0b 0c0d 0e0f\n 1011 1213 1415 1617 1819 1a1b 1c1d 1e1f\n 20\n\n"},
+    };
+    for (const Row& row : rows) {
+        SCOPED_TRACE(row.length);
+        const std::unique_ptr<char[]> data = test::heapCopy(countingBytes(row.length));
+        EXPECT_EQ(printed(HexDumpFormatter(data.get(), row.length, false)), row.text);
+    }
+}
+
+TEST(HexDump, OfNoBytesPrintsOnlyTheTwoLineEnds)
+{
+    EXPECT_EQ(printed(HexDumpFormatter(nullptr, 0, false)), "\n\n");
+    EXPECT_EQ(printed(HexDumpFormatter(nullptr, 0, true)), "\n\n");
+}
+
+TEST(HexDump, PrintsTheAddressOfTheFirstByteOfEachLine)
+{
+    const std::string data = countingBytes(17);
+    char expected[128];
+    const auto address = static_cast<unsigned long long>(reinterpret_cast<std::uintptr_t>(data.data()));
+    std::snprintf(expected, sizeof(expected), "%016llx: 0001 0203 0405 0607 0809 0a0b 0c0d 0e0f\n%016llx: 10\n\n",
+                  address, address + 16);
+    EXPECT_EQ(printed(HexDumpFormatter(data.data(), data.size(), true)), expected);
+}
+
+TEST(HexDump, IsUpperCaseAfterAHexadecimalFormatter)
+{
+    std::ostringstream os;
+    os << hexFormat(std::uint16_t(1)) << HexDumpFormatter("\xAB\xCD", 2, false);
+    EXPECT_EQ(os.str(), "0x0001 ABCD\n\n");
+}
+
+TEST(HexDump, IsLowerCaseOnAFreshStream) { EXPECT_EQ(printed(HexDumpFormatter("\xAB\xCD", 2, false)), " abcd\n\n"); }
+
+TEST(HexDump, SetsBaseAndFillItself)
+{
+    std::ostringstream os;
+    os << std::dec << std::setfill('*') << HexDumpFormatter("\x0A", 1, false) << 16;
+    EXPECT_EQ(os.str(), " 0a\n\n10");
+    EXPECT_EQ(os.fill(), '0');
+}
+
+class SyncCountingBuffer : public std::stringbuf {
+public:
+    int syncs() const { return mSyncs; }
+
+protected:
+    int sync() override
+    {
+        ++mSyncs;
+        return std::stringbuf::sync();
+    }
+
+private:
+    int mSyncs = 0;
+};
+
+TEST(HexDump, FlushesAtEachLineEnd)
+{
+    SyncCountingBuffer buffer;
+    std::ostream os(&buffer);
+    const std::string data = countingBytes(33);
+    os << HexDumpFormatter(data.data(), data.size(), false);
+    EXPECT_EQ(buffer.syncs(), 4); // after lines one, two and three, and after the empty line
+}
+
+// ---------------------------------------------------------------------------------------------------- character runs
+
+TEST(CharArray, PrintsExactlyTheGivenCharacters)
+{
+    const char text[] = {'a', '\0', 'b', '\n', 'c'};
+    EXPECT_EQ(printed(CharArrayFormatter(text, sizeof(text))), std::string("a\0b\nc", 5));
+    EXPECT_EQ(printed(CharArrayFormatter(text, 1)), "a");
+    EXPECT_EQ(printed(CharArrayFormatter(nullptr, 0)), "");
+}
+
+TEST(CharArray, IsNotPaddedToAPendingWidth)
+{
+    std::ostringstream os;
+    os << std::setw(6) << std::setfill('*') << CharArrayFormatter("ab", 2);
+    EXPECT_EQ(os.str(), "ab");
+}
+
+// ----------------------------------------------------------------------------------------------------------- signals
+
+TEST(Signal, PrintsTheDescriptionOfEverySignalThatHasOne)
+{
+    for (int number = 1; number <= 31; ++number) {
+        SCOPED_TRACE(number);
+        EXPECT_EQ(printed(SignalFormatter(number)), std::to_string(number) + " (" + ::strsignal(number) + ")");
+    }
+}
+
+TEST(Signal, PrintsTheKnownTexts)
+{
+    EXPECT_EQ(printed(SignalFormatter(1)), "1 (Hangup)");
+    EXPECT_EQ(printed(SignalFormatter(11)), "11 (Segmentation fault)");
+    EXPECT_EQ(printed(SignalFormatter(15)), "15 (Terminated)");
+}
+
+TEST(Signal, PrintsANumberWithoutADescriptionAlone)
+{
+    EXPECT_EQ(printed(SignalFormatter(0)), "0");
+    for (int number = 32; number <= 64; ++number) {
+        EXPECT_EQ(printed(SignalFormatter(number)), std::to_string(number));
+    }
+}
+
+TEST(Signal, PrintsANumberOutsideTheTableAlone)
+{
+    EXPECT_EQ(printed(SignalFormatter(65)), "65");
+    EXPECT_EQ(printed(SignalFormatter(-1)), "-1");
+    EXPECT_EQ(printed(SignalFormatter(INT_MAX)), "2147483647");
+    EXPECT_EQ(printed(SignalFormatter(INT_MIN)), "-2147483648");
+}
+
+TEST(Signal, IsDecimalAfterAHexadecimalFormatter)
+{
+    std::ostringstream os;
+    os << hexFormat(std::uint16_t(1)) << ' ' << SignalFormatter(15);
+    EXPECT_EQ(os.str(), "0x0001 15 (Terminated)");
+}
+
+// -------------------------------------------------------------------------------------------------------- exceptions
+
+class FormatterTestException : public std::runtime_error {
+public:
+    using std::runtime_error::runtime_error;
+};
+
+TEST(ExceptionInfo, PrintsTypeAndText)
+{
+    const FileIOError error(PosixErrorCode(5), "disk");
+    EXPECT_EQ(printed(ExceptionInfo(error)), "qel::FileIOError: disk: 5 (Input/output error)");
+    EXPECT_EQ(printed(ExceptionInfo(std::runtime_error("text"))), "std::runtime_error: text");
+}
+
+TEST(ExceptionInfo, PrintsTheDynamicType)
+{
+    try {
+        throw FormatterTestException("text");
+    } catch (const std::exception& exception) {
+        EXPECT_EQ(printed(ExceptionInfo(exception)), "qel::(anonymous namespace)::FormatterTestException: text");
+    }
+}
+
+// ------------------------------------------------------------------------------------------------------- indentation
+
+TEST(IndentFormatter, PrintsCopiesOfItsCharacter)
+{
+    EXPECT_EQ(printed(Indent(3, ' ')), "   ");
+    EXPECT_EQ(printed(Indent(2, '*')), "**");
+    EXPECT_EQ(printed(Indent(0, '*')), "");
+}
+
+TEST(IndentFormatter, PlusMakesADeeperOneAndKeepsTheOriginal)
+{
+    const Indent outer(1, '.');
+    const Indent inner = outer + 2;
+    EXPECT_EQ(printed(inner), "...");
+    EXPECT_EQ(printed(outer), ".");
+    EXPECT_EQ(printed(outer + 0), ".");
+}
+
+TEST(IndentFormatter, PlusAssignDeepensInPlaceAndChains)
+{
+    Indent indent(1, '.');
+    EXPECT_EQ(&(indent += 2), &indent);
+    EXPECT_EQ(printed(indent), "...");
+    (indent += 1) += 1;
+    EXPECT_EQ(printed(indent), ".....");
+}
+
+TEST(IndentFormatter, NeitherAppliesNorUsesUpAPendingWidth)
+{
+    std::ostringstream os;
+    os << std::setfill('*') << std::setw(4) << Indent(2, ' ') << 7;
+    EXPECT_EQ(os.str(), "  ***7");
+}
+
+// --------------------------------------------------------------------------------------------------------- durations
+
+using std::chrono::milliseconds;
+
+constexpr long long kDay = 86400000;
+constexpr long long kHour = 3600000;
+constexpr long long kMinute = 60000;
+constexpr long long kSecond = 1000;
+
+TEST(DHMSDuration, PrintsDaysHoursMinutesSecondsAndMilliseconds)
+{
+    struct Row {
+        long long milliseconds;
+        const char* text;
+    };
+    const Row rows[] = {
+        {0, "000d:00h:00m:00.000s"},
+        {1, "000d:00h:00m:00.001s"},
+        {999, "000d:00h:00m:00.999s"},
+        {kSecond, "000d:00h:00m:01.000s"},
+        {kMinute - 1, "000d:00h:00m:59.999s"},
+        {kMinute, "000d:00h:01m:00.000s"},
+        {kHour - 1, "000d:00h:59m:59.999s"},
+        {kHour, "000d:01h:00m:00.000s"},
+        {kDay - 1, "000d:23h:59m:59.999s"},
+        {kDay, "001d:00h:00m:00.000s"},
+        {kDay + 2 * kHour + 3 * kMinute + 4 * kSecond + 5, "001d:02h:03m:04.005s"},
+        {999 * kDay, "999d:00h:00m:00.000s"},
+        {1000 * kDay, "1000d:00h:00m:00.000s"},
+        {INT_MAX * kDay + kDay - 1, "2147483647d:23h:59m:59.999s"},
+        {-1, "000d:00h:00m:00.0-1s"},
+        {-kSecond, "000d:00h:00m:-1.000s"},
+        {-kDay - 2 * kHour, "0-1d:-2h:00m:00.000s"},
+    };
+    for (const Row& row : rows) {
+        SCOPED_TRACE(row.milliseconds);
+        EXPECT_EQ(printed(DHMSDurationFormatter(milliseconds(row.milliseconds))), row.text);
+    }
+}
+
+TEST(DHMSDuration, TheLargestDurationsAreNoError)
+{
+    EXPECT_THAT(printed(DHMSDurationFormatter(milliseconds::max())), testing::EndsWith("d:07h:12m:55.807s"));
+    EXPECT_THAT(printed(DHMSDurationFormatter(milliseconds::min())), testing::EndsWith("d:-7h:-12m:-55.-808s"));
+}
+
+TEST(DHMSDuration, IsDecimalAndRightAlignedWhateverTheStreamWas)
+{
+    std::ostringstream os;
+    os << hexFormat(std::uint16_t(1)) << std::left << ' '
+       << DHMSDurationFormatter(milliseconds(10 * kDay + 11 * kHour + 12 * kMinute + 13 * kSecond + 14));
+    EXPECT_EQ(os.str(), "0x0001 010d:11h:12m:13.014s");
+}
+
+TEST(DHMSDuration, RestoresTheFlagsButNotTheFill)
+{
+    std::ostringstream os;
+    os << std::hex << std::uppercase << std::left << std::setfill('*');
+    const std::ios_base::fmtflags before = os.flags();
+    os << DHMSDurationFormatter(milliseconds(0));
+    EXPECT_EQ(os.flags(), before);
+    EXPECT_EQ(os.fill(), '0');
+    os.str("");
+    os << 171;
+    EXPECT_EQ(os.str(), "AB");
+}
+
+// ----------------------------------------------------------------------------------------------------------- joining
+
+struct Element {
+    int number;
+};
+std::ostream& operator<<(std::ostream& os, const Element& element) { return os << '<' << element.number << '>'; }
+
+TEST(Join, WritesTheSeparatorBetweenTheElements)
+{
+    const std::vector<int> numbers{1, 2, 3};
+    EXPECT_EQ(printed(join(numbers, ", ")), "1, 2, 3");
+    EXPECT_EQ(printed(join(numbers, "")), "123");
+}
+
+TEST(Join, OneElementHasNoSeparator)
+{
+    const std::vector<int> numbers{1};
+    EXPECT_EQ(printed(join(numbers, ", ")), "1");
+}
+
+TEST(Join, AnEmptyRangePrintsNothing)
+{
+    const std::vector<int> numbers;
+    std::ostringstream os;
+    os << '[' << join(numbers, ", ") << ']';
+    EXPECT_EQ(os.str(), "[]");
+}
+
+TEST(Join, UsesTheInsertionOperatorOfTheElements)
+{
+    const std::list<Element> elements{{1}, {2}};
+    EXPECT_EQ(printed(join(elements, "-")), "<1>-<2>");
+}
+
+TEST(Join, TakesAPairOfIterators)
+{
+    const std::vector<std::string> words{"a", "b", "c", "d"};
+    EXPECT_EQ(printed(join(words.begin() + 1, words.end() - 1, "; ")), "b; c");
+    EXPECT_EQ(printed(join(words.begin(), words.begin(), "; ")), "");
+}
+
+TEST(Join, TakesAPlainArray)
+{
+    const int numbers[] = {4, 5};
+    EXPECT_EQ(printed(join(numbers, "+")), "4+5");
+}
+
+TEST(Join, PrintsNumbersInTheBaseOfTheStream)
+{
+    const std::vector<int> numbers{10, 171};
+    std::ostringstream os;
+    os << hexFormat(std::uint16_t(1)) << ' ' << join(numbers, ",");
+    EXPECT_EQ(os.str(), "0x0001 A,AB");
+}
+
+TEST(Join, OwnsItsSeparator)
+{
+    const std::vector<int> numbers{1, 2};
+    std::string separator = " and then ";
+    const auto joined = join(numbers, separator);
+    separator = "overwritten";
+    EXPECT_EQ(printed(joined), "1 and then 2");
+}
+
+TEST(Join, CanBePrintedTwice)
+{
+    const std::vector<int> numbers{1, 2};
+    const auto joined = join(numbers, ",");
+    EXPECT_EQ(printed(joined), "1,2");
+    EXPECT_EQ(printed(joined), "1,2");
+}
+
+// ---------------------------------------------------------------------------------------------------------- toString
+
+class ThousandsSeparator : public std::numpunct<char> {
+protected:
+    char do_thousands_sep() const override { return '.'; }
+    std::string do_grouping() const override { return "\3"; }
+};
+
+class GroupingLocale {
+public:
+    GroupingLocale() : mBefore(std::locale::global(std::locale(std::locale::classic(), new ThousandsSeparator))) {}
+    ~GroupingLocale() { std::locale::global(mBefore); }
+    GroupingLocale(const GroupingLocale&) = delete;
+    GroupingLocale& operator=(const GroupingLocale&) = delete;
+
+private:
+    std::locale mBefore;
+};
+
+TEST(ToString, IsWhatTheValuePrints)
+{
+    EXPECT_EQ(toString(42), "42");
+    EXPECT_EQ(toString(std::string("text")), "text");
+    EXPECT_EQ(toString(hexFormat(std::uint16_t(0x1F))), "0x001F");
+    EXPECT_EQ(toString(Element{7}), "<7>");
+}
+
+TEST(ToString, IsTheSameInEveryLocale)
+{
+    const GroupingLocale grouping;
+    EXPECT_EQ(printed(4711), "4.711"); // the locale is in force
+    EXPECT_EQ(toString(4711), "4711");
+}
+
+} // namespace
+} // namespace qel
