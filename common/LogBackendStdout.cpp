@@ -1,0 +1,14 @@
+#include <qel/common/LogBackendStdout.hpp>
+
+#include <cstdio>
+
+namespace qel {
+
+LogBackendStdout::~LogBackendStdout() = default;
+
+void LogBackendStdout::pLog(const std::string& line)
+{
+    std::puts(line.c_str()); // nobody to tell when it fails
+}
+
+} // namespace qel

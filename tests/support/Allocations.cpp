@@ -1,0 +1,65 @@
+#include "support/Allocations.hpp"
+
+#include <cstdlib>
+#include <new>
+
+namespace qel::test {
+
+namespace {
+
+// Plain data: operator new runs before any initialiser and must not allocate.
+thread_local bool tWatching = false;
+thread_local bool tFailing = false;
+thread_local std::size_t tCount = 0;
+
+[[maybe_unused]] void* allocate(std::size_t size)
+{
+    if (tWatching) ++tCount;
+    if (tFailing) throw std::bad_alloc();
+    void* const block = std::malloc(size != 0 ? size : 1);
+    if (block == nullptr) throw std::bad_alloc();
+    return block;
+}
+
+} // namespace
+
+Allocations::Allocations()
+{
+    tCount = 0;
+    tWatching = true;
+}
+
+Allocations::~Allocations()
+{
+    tWatching = false;
+    tFailing = false;
+}
+
+std::size_t Allocations::count() const { return tCount; }
+
+void Allocations::failAll() { tFailing = true; }
+
+void Allocations::succeedAgain() { tFailing = false; }
+
+Allocations::Exempt::Exempt() : mWatching(tWatching), mFailing(tFailing)
+{
+    tWatching = false;
+    tFailing = false;
+}
+
+Allocations::Exempt::~Exempt()
+{
+    tWatching = mWatching;
+    tFailing = mFailing;
+}
+
+} // namespace qel::test
+
+#if QEL_TEST_OWN_OPERATOR_NEW
+void* operator new(std::size_t size) { return qel::test::allocate(size); }
+void* operator new[](std::size_t size) { return qel::test::allocate(size); }
+void operator delete(void* block) noexcept { std::free(block); }
+void operator delete[](void* block) noexcept { std::free(block); }
+void operator delete(void* block, std::size_t) noexcept { std::free(block); }
+void operator delete[](void* block, std::size_t) noexcept { std::free(block); }
+#endif

@@ -1,0 +1,55 @@
+#pragma once
+
+#include <cstddef>
+
+/// @file
+/// Counts what the code under test allocates, and lets it run out of memory. A program that links Allocations.cpp
+/// replaces the global operator new, for shared libraries too.
+
+// clang's thread sanitizer brings an operator new of its own and tolerates no other.
+#if defined(__has_feature)
+#if __has_feature(thread_sanitizer)
+#define QEL_TEST_OWN_OPERATOR_NEW 0
+#endif
+#endif
+#ifndef QEL_TEST_OWN_OPERATOR_NEW
+#define QEL_TEST_OWN_OPERATOR_NEW 1
+#endif
+
+/// To be said first in each test that makes an Allocations: skips it in builds that cannot count.
+#define QEL_TEST_NEEDS_ALLOCATIONS()                                                                                   \
+    if (!QEL_TEST_OWN_OPERATOR_NEW) GTEST_SKIP() << "this build cannot count allocations"
+
+namespace qel::test {
+
+/// Counts the calls of operator new on the thread that made this object, from its construction on.
+/// Thread safety: used by that thread alone; allocations of other threads do not count and never fail.
+class Allocations {
+public:
+    Allocations();
+    ~Allocations();
+    Allocations(const Allocations&) = delete;
+    Allocations& operator=(const Allocations&) = delete;
+
+    /// @return the allocations so far
+    std::size_t count() const;
+
+    /// Makes every allocation from now on fail with std::bad_alloc, until this object goes or succeedAgain is called.
+    void failAll();
+    void succeedAgain();
+
+    /// What a fake allocates in the middle of the code under test neither counts nor fails while it holds one of these.
+    class Exempt {
+    public:
+        Exempt();
+        ~Exempt();
+        Exempt(const Exempt&) = delete;
+        Exempt& operator=(const Exempt&) = delete;
+
+    private:
+        const bool mWatching;
+        const bool mFailing;
+    };
+};
+
+} // namespace qel::test

@@ -1,0 +1,38 @@
+#pragma once
+
+#include <cstddef>
+#include <string>
+#include <vector>
+
+/// @file
+/// The file calls of the code under test, seen and broken on purpose. A program that links FileCalls.cpp replaces the C
+/// library's functions by ones that pass on to them, for the calls of shared libraries too.
+
+namespace qel::test {
+
+/// Records file calls, and makes some fail, from its construction to its destruction. One at a time; without one the
+/// calls pass through unchanged.
+/// Thread safety: one thread.
+class FileCalls {
+public:
+    enum Call { Open, Lseek, Writev, Fsync, Close, Rename, Unlink, kCallCount };
+
+    FileCalls();
+    ~FileCalls();
+    FileCalls(const FileCalls&) = delete;
+    FileCalls& operator=(const FileCalls&) = delete;
+
+    /// Makes calls fail with an error number instead of being carried out: first `after` calls of that kind succeed,
+    /// then `count` fail.
+    void fail(Call call, int error, unsigned count = 1, unsigned after = 0);
+
+    /// Makes the next writev write so many bytes only and say so.
+    void shortenNextWrite(std::size_t bytes);
+
+    /// @return the calls so far, which are forgotten: the name of the function, the file names without their
+    /// directories, and what else matters: "rename log.3 log.4", "open log 2102 644" (flags in hexadecimal, mode in
+    /// octal), "writev 6+1" (bytes of each piece). Failed ones are among them.
+    std::vector<std::string> take();
+};
+
+} // namespace qel::test

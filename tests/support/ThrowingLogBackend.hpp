@@ -1,0 +1,17 @@
+#pragma once
+
+#include <qel/common/LogBackend.hpp>
+#include <qel/common/LogLevel.hpp>
+
+#include <stdexcept>
+#include <string>
+
+namespace qel::test {
+
+/// A back-end that breaks the rule that back-ends do not throw: every line ends in std::runtime_error("back-end").
+class ThrowingLogBackend : public LogBackend {
+public:
+    void log(LogLevel::Level, const std::string&) override { throw std::runtime_error("back-end"); }
+};
+
+} // namespace qel::test
