@@ -1,0 +1,42 @@
+# What `cmake --install` puts under the prefix: the library, its headers, and the two ways in which other projects find
+# them, a CMake package and a pkg-config file. Nothing installed contains the prefix, so the tree may be moved; for
+# that the directories have to be relative to it.
+
+include(CMakePackageConfigHelpers)
+
+foreach(directory IN ITEMS CMAKE_INSTALL_INCLUDEDIR CMAKE_INSTALL_LIBDIR)
+  if(IS_ABSOLUTE "${${directory}}")
+    message(FATAL_ERROR "${directory} must be relative to the prefix: the installed package is relocatable")
+  endif()
+endforeach()
+
+# Two components: what programs need to run, and what is needed to build them.
+install(TARGETS qelcommon EXPORT qelTargets
+  LIBRARY DESTINATION ${CMAKE_INSTALL_LIBDIR}
+    COMPONENT qel_runtime NAMELINK_COMPONENT qel_development)
+install(DIRECTORY
+    ${PROJECT_SOURCE_DIR}/headers/include/qel
+    ${PROJECT_BINARY_DIR}/headers/include/qel
+  DESTINATION ${CMAKE_INSTALL_INCLUDEDIR}
+  COMPONENT qel_development
+  FILES_MATCHING PATTERN "*.hpp")
+
+set(qel_package_dir ${CMAKE_INSTALL_LIBDIR}/cmake/qel)
+configure_package_config_file(
+  ${PROJECT_SOURCE_DIR}/packaging/qelConfig.cmake.in ${PROJECT_BINARY_DIR}/packaging/qelConfig.cmake
+  INSTALL_DESTINATION ${qel_package_dir})
+write_basic_package_version_file(${PROJECT_BINARY_DIR}/packaging/qelConfigVersion.cmake
+  COMPATIBILITY SameMajorVersion)
+install(EXPORT qelTargets NAMESPACE qel:: DESTINATION ${qel_package_dir} COMPONENT qel_development)
+install(FILES
+    ${PROJECT_BINARY_DIR}/packaging/qelConfig.cmake
+    ${PROJECT_BINARY_DIR}/packaging/qelConfigVersion.cmake
+  DESTINATION ${qel_package_dir}
+  COMPONENT qel_development)
+
+file(RELATIVE_PATH qel_pc_to_prefix /${CMAKE_INSTALL_LIBDIR}/pkgconfig /)
+string(REGEX REPLACE "/$" "" qel_pc_to_prefix "${qel_pc_to_prefix}")
+configure_file(${PROJECT_SOURCE_DIR}/packaging/qel.pc.in ${PROJECT_BINARY_DIR}/packaging/qel.pc @ONLY)
+install(FILES ${PROJECT_BINARY_DIR}/packaging/qel.pc
+  DESTINATION ${CMAKE_INSTALL_LIBDIR}/pkgconfig
+  COMPONENT qel_development)

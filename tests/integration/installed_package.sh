@@ -1,0 +1,115 @@
+#!/bin/sh
+# What a user gets: installs the library to a scratch prefix, moves the installed tree to another place, builds and runs
+# the example project against it there, once found by CMake and once by pkg-config.
+#
+#   installed_package.sh BUILD SOURCE VERSION
+#
+# From the environment: CMAKE and READELF (the programs), CXX and CXXFLAGS (what the library was built with, as far as
+# a program that links it needs the same), CMAKE_GENERATOR.
+set -eu
+
+build=$1
+source=$2
+version=$3
+major=${version%%.*}
+cmake=${CMAKE:-cmake}
+readelf=${READELF:-readelf}
+cxx=${CXX:-c++}
+
+fail() {
+    echo "installed_package: FAILED: $*" >&2
+    exit 1
+}
+
+# Runs a command quietly; shows what it printed if it fails.
+quietly() {
+    "$@" >"$work/log" 2>&1 || {
+        cat "$work/log" >&2
+        fail "$*"
+    }
+}
+
+work=$(mktemp -d "$build/installed_package.XXXXXX")
+trap 'rm -rf "$work"' EXIT
+trap 'exit 1' INT TERM
+
+# --- install and move
+
+quietly "$cmake" --install "$build" --prefix "$work/first" --component qel_runtime
+quietly "$cmake" --install "$build" --prefix "$work/first" --component qel_development
+moved="$work/second/place"
+mkdir "$work/second"
+mv "$work/first" "$moved"
+
+library=$(find "$moved" -name libqelcommon.so)
+[ -n "$library" ] || fail "no libqelcommon.so"
+libdir=$(dirname "$library")
+pcdir="$libdir/pkgconfig"
+
+# --- what is there
+
+soname=$("$readelf" -d "$library" | sed -n 's/.*SONAME.*\[\(.*\)\].*/\1/p')
+[ "$soname" = "libqelcommon.so.$major" ] || fail "the library calls itself '$soname'"
+[ "$(readlink "$library")" = "$soname" ] || fail "libqelcommon.so does not lead to $soname"
+[ "$(readlink "$libdir/$soname")" = "libqelcommon.so.$version" ] || fail "$soname does not lead to version $version"
+[ -f "$libdir/libqelcommon.so.$version" ] || fail "no libqelcommon.so.$version"
+
+(cd "$source/headers/include" && find . -name '*.hpp') >"$work/headers.unsorted"
+echo ./qel/common/QelVersion.hpp >>"$work/headers.unsorted"
+sort "$work/headers.unsorted" >"$work/headers.expected"
+(cd "$moved/include" && find . -type f) | sort >"$work/headers.installed"
+diff "$work/headers.expected" "$work/headers.installed" >&2 || fail "other headers are installed than there are"
+
+# Nothing leads back to where it was built or first installed, and our warnings stay ours.
+for place in "$source" "$build" "$work/first"; do
+    if grep -rIlF "$place" "$moved" >&2; then fail "these files name $place"; fi
+done
+if grep -rIE -e '-W[a-z]|-fsanitize|--coverage' "$libdir/cmake" "$pcdir" >&2; then
+    fail "our own flags reach the users"
+fi
+
+# --- found by CMake
+
+quietly "$cmake" -S "$source/examples" -B "$work/by-cmake" -DCMAKE_PREFIX_PATH="$moved" -DCMAKE_BUILD_TYPE=Debug
+quietly "$cmake" --build "$work/by-cmake"
+"$work/by-cmake/send_receive" >"$work/by-cmake.out" || fail "the example built with CMake ended with an error"
+
+# Asks for a version; answers whether the package takes it.
+takes() {
+    mkdir -p "$work/ask"
+    cat >"$work/ask/CMakeLists.txt" <<EOF
+cmake_minimum_required(VERSION 3.20)
+project(ask LANGUAGES CXX)
+find_package(qel $1 REQUIRED)
+EOF
+    rm -rf "$work/ask/build"
+    "$cmake" -S "$work/ask" -B "$work/ask/build" -DCMAKE_PREFIX_PATH="$moved" >"$work/ask/log" 2>&1
+}
+takes "" || fail "the package is not found without a version"
+takes "$version EXACT" || fail "the package does not take its own version"
+takes "$((major + 1))" && fail "the package takes a newer major version"
+takes "$major.999" && fail "the package takes a newer minor version"
+
+# --- found by pkg-config
+
+PKG_CONFIG_PATH="$pcdir"
+export PKG_CONFIG_PATH
+[ "$(pkg-config --modversion qel)" = "$version" ] || fail "pkg-config tells another version"
+eval "set -- $(pkg-config --cflags --libs qel)" # pkg-config writes words for a shell
+# shellcheck disable=SC2086 # CXXFLAGS are several words
+quietly "$cxx" -std=c++17 ${CXXFLAGS-} "$source/examples/send_receive.cpp" -o "$work/by-pkg-config" "$@"
+LD_LIBRARY_PATH="$libdir" "$work/by-pkg-config" >"$work/by-pkg-config.out" ||
+    fail "the example built with pkg-config ended with an error"
+"$readelf" -d "$work/by-pkg-config" | grep NEEDED | grep -qF "[$soname]" || fail "the example does not need $soname"
+
+# --- what the example says
+
+cat >"$work/expected" <<EOF
+QEL common library $version
+received [CID: 0x00000002, FN: 0x6003, OP: 0x0101, FL: 0x80, DL: 48, ST: 0x00000000:0000]
+from tool console-1 of type 2
+EOF
+for way in by-cmake by-pkg-config; do
+    diff "$work/expected" "$work/$way.out" >&2 || fail "the example ($way) printed something else"
+done
+echo "installed_package: PASSED"
