@@ -1,0 +1,7 @@
+#include <qel/common/net/SocketIF.hpp>
+
+namespace qel {
+
+SocketIF::~SocketIF() = default;
+
+} // namespace qel

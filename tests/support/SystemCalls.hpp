@@ -1,0 +1,42 @@
+#pragma once
+
+#include <cstddef>
+#include <functional>
+#include <poll.h>
+#include <sys/socket.h>
+#include <sys/types.h>
+
+namespace qel::test {
+
+/// Stands in for system calls of the library, so that a test can make one fail, cut a transfer short, deliver a signal
+/// at an exact moment, or look at the arguments. A test program that links SystemCalls.cpp defines these functions of
+/// the C library itself; the library then calls the test program's.
+///
+/// A call goes to the member of its name when that is set, otherwise to the system. A stand-in sets errno itself. While
+/// it runs it is switched off, so it may make the real call.
+///
+/// In force for the thread that makes it, from construction to destruction; they nest.
+class SystemCalls {
+public:
+    SystemCalls();
+    ~SystemCalls();
+    SystemCalls(const SystemCalls&) = delete;
+    SystemCalls& operator=(const SystemCalls&) = delete;
+
+    std::function<ssize_t(int fd, void* buffer, std::size_t length)> read;
+    std::function<ssize_t(int fd, const void* buffer, std::size_t length, int flags)> send;
+    std::function<int(pollfd* fds, nfds_t count, int timeout)> poll;
+    std::function<int(int family, int type, int protocol)> socket;
+    std::function<int(int fd, const sockaddr* address, socklen_t length)> connect;
+    std::function<int(int fd, const sockaddr* address, socklen_t length)> bind;
+    std::function<int(int fd, sockaddr* address, socklen_t* length, int flags)> accept4;
+    std::function<int(int fd, int level, int name, void* value, socklen_t* length)> getsockopt;
+    std::function<int(int fd, int level, int name, const void* value, socklen_t length)> setsockopt;
+    std::function<int(unsigned int count, int flags)> eventfd;
+    std::function<int(int fd)> close;
+
+private:
+    SystemCalls* const mOuter; // in force again when this one ends
+};
+
+} // namespace qel::test
