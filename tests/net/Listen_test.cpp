@@ -57,6 +57,12 @@ TEST_P(ListenOn, IsABlockingStreamThatDoesNotSurviveAnExec)
     EXPECT_EQ(listener.getFlags() & O_NONBLOCK, 0);
 }
 
+TEST_P(ListenOn, PassesTheBacklogOn)
+{
+    EXPECT_EQ(test::backlogOf(listenOn(test::loopback(GetParam()), 3)), 3U);
+    EXPECT_EQ(test::backlogOf(listenOn(test::loopback(GetParam()), 8)), 8U);
+}
+
 TEST_P(ListenOn, TakesAPortOfWhichConnectionsStillLinger)
 {
     // Keeps other programs from taking the port between the two listeners.
@@ -145,12 +151,23 @@ TEST(ListenOnAnything, AFailedListenIsReported)
 {
     CapturedLog log(LogLevel::Info);
     // Two sockets may be bound to one port with SO_REUSEADDR, but only one of them may listen.
-    Socket bound(IPFamily::IPv4, SOCK_STREAM | SOCK_CLOEXEC, 0);
-    bound.setSocketOption(SOL_SOCKET, SO_REUSEADDR, 1);
-    bound.bind(test::loopback());
-    const Socket listener = listenOn(bound.getSocketName(), 4);
-    EXPECT_THAT([&] { bound.listen(4); },
+    Socket faster(IPFamily::IPv4, SOCK_STREAM | SOCK_CLOEXEC, 0);
+    faster.setSocketOption(SOL_SOCKET, SO_REUSEADDR, 1);
+    faster.bind(test::loopback());
+    const IPEndpoint endpoint = faster.getSocketName();
+    test::SystemCalls calls;
+    int failing = -1;
+    calls.bind = [&](int fd, const sockaddr* address, socklen_t length) {
+        failing = fd;
+        const int result = ::bind(fd, address, length);
+        faster.listen(4);
+        return result;
+    };
+    EXPECT_THAT([&] { listenOn(endpoint, 4); },
                 ThrowsPosixError(EADDRINUSE, "Failed to listen on socket: 98 (Address already in use)"));
+    EXPECT_THAT(log.lines(), ElementsAre("E: Failed to listen on socket " + std::to_string(failing) +
+                                         ": 98 (Address already in use)"));
+    EXPECT_EQ(::fcntl(failing, F_GETFD), -1) << "the socket is closed";
 }
 
 } // namespace

@@ -4,6 +4,7 @@
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
+#include <iomanip>
 #include <sstream>
 #include <stdexcept>
 #include <string>
@@ -66,6 +67,14 @@ TEST(MACAddress, PrintsUpperCasePairsWithColons)
     EXPECT_EQ(print(MACAddress{0xAA, 0xBB, 0xCC, 0x00, 0x11, 0x22}), "AA:BB:CC:00:11:22");
     EXPECT_EQ(print(MACAddress{0x00, 0x01, 0x02, 0x0A, 0x0B, 0x0C}), "00:01:02:0A:0B:0C");
     EXPECT_EQ(print(MACAddress()), "00:00:00:00:00:00");
+}
+
+TEST(MACAddress, LeavesTheStreamInUpperCaseHexadecimal)
+{
+    std::ostringstream os;
+    os << std::setfill('*') << MACAddress{0x0A, 0, 1, 2, 3, 4} << ' ' << 0xAB;
+    EXPECT_EQ(os.str(), "0A:00:01:02:03:04 AB");
+    EXPECT_EQ(os.fill(), '0');
 }
 
 TEST(MACAddress, OrderIsThatOfTheBytes)

@@ -4,6 +4,7 @@
 #include <chrono>
 #include <cstring>
 #include <netinet/in.h>
+#include <netinet/tcp.h>
 #include <sys/socket.h>
 #include <unistd.h>
 #include <utility>
@@ -59,6 +60,14 @@ Socket makeRefusingSocket(IPFamily family)
     Socket socket(family, SOCK_STREAM | SOCK_CLOEXEC, 0);
     socket.bind(loopback(family));
     return socket;
+}
+
+unsigned int backlogOf(const Socket& listener)
+{
+    tcp_info info{};
+    std::size_t length = sizeof(info);
+    listener.getSocketOption(IPPROTO_TCP, TCP_INFO, &info, length);
+    return info.tcpi_sacked; // of a listener: the most connections that may wait
 }
 
 std::string whyNoLoopback(IPFamily family)

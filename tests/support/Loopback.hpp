@@ -54,6 +54,9 @@ private:
 ///         getSocketName() are refused, and nobody else can take the port
 Socket makeRefusingSocket(IPFamily family = IPFamily::IPv4);
 
+/// @return the backlog that a listening TCP socket was given, as the kernel keeps it (tcp(7), TCP_INFO)
+unsigned int backlogOf(const Socket& listener);
+
 /// @return why this machine has no loopback address of the family; empty when it has
 std::string whyNoLoopback(IPFamily family);
 

@@ -2,6 +2,7 @@
 
 #include <atomic>
 #include <exception>
+#include <future>
 #include <gtest/gtest.h>
 #include <thread>
 
@@ -26,7 +27,9 @@ int callUnderSignals(int flags, const std::function<void()>& call, const std::fu
 
     const pthread_t receiver = ::pthread_self();
     std::atomic<bool> returned{false};
+    std::promise<void> ready;
     std::thread sender([&] {
+        ready.set_value();
         while (!returned && until()) {
             const int handled = sHandled;
             EXPECT_EQ(::pthread_kill(receiver, SIGUSR1), 0);
@@ -37,6 +40,8 @@ int callUnderSignals(int flags, const std::function<void()>& call, const std::fu
                 std::this_thread::yield();
         }
     });
+    // A call with a short deadline must not be over before the sender has come to run at all.
+    ready.get_future().wait();
     try {
         call();
     } catch (const std::exception& error) {

@@ -81,6 +81,7 @@ public:
     /// @return the status flags of the descriptor, such as O_NONBLOCK (fcntl(2), F_GETFL)
     /// @throws PosixError  "Failed to get socket fd flags"
     int getFlags() const;
+    /// @param flags  all status flags that it shall have (fcntl(2), F_SETFL)
     /// @throws PosixError  "Failed to set socket fd flags"
     void setFlags(int flags);
 

@@ -25,6 +25,7 @@ public:
     /// @return the bytes read, at least 1; 0 at the end of the stream (or for length 0); negative with errno set
     virtual ssize_t read(char* buffer, std::size_t length) = 0;
 
+    /// @param buffer  length bytes; borrowed for the call
     /// @return the bytes written, which may be fewer than length; negative with errno set. Never raises SIGPIPE.
     virtual ssize_t write(const char* buffer, std::size_t length) = 0;
 

@@ -53,9 +53,9 @@ public:
     std::size_t read(char* buffer, std::size_t length) override;
 
     /// Writes all bytes. A wait that a signal cuts short goes on with the time that is left.
+    /// @param buffer  length bytes; borrowed for the call
     /// @throws StreamIOException  "socket stream send failure" with a nested PosixError of the same text (EPIPE when
-    /// the
-    ///                            peer has closed; never a signal), or "I/O deadline"
+    ///                            the peer has closed; never a signal), or "I/O deadline"
     void write(const char* buffer, std::size_t length) override;
 
     /// @return the socket, for its names and its descriptor; owned by the stream
