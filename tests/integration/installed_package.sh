@@ -102,6 +102,33 @@ LD_LIBRARY_PATH="$libdir" "$work/by-pkg-config" >"$work/by-pkg-config.out" ||
     fail "the example built with pkg-config ended with an error"
 "$readelf" -d "$work/by-pkg-config" | grep NEEDED | grep -qF "[$soname]" || fail "the example does not need $soname"
 
+# --- a program that uses TLS
+
+mkdir "$work/tls"
+cat >"$work/tls/CMakeLists.txt" <<EOF
+cmake_minimum_required(VERSION 3.20)
+project(tls LANGUAGES CXX)
+find_package(qel REQUIRED)
+add_executable(tls $source/tests/integration/installed_tls.cpp)
+target_link_libraries(tls PRIVATE qel::common)
+target_compile_options(tls PRIVATE -Wall -Wextra -Werror)
+EOF
+quietly "$cmake" -S "$work/tls" -B "$work/tls/by-cmake" -DCMAKE_PREFIX_PATH="$moved" -DCMAKE_BUILD_TYPE=Debug
+quietly "$cmake" --build "$work/tls/by-cmake"
+# shellcheck disable=SC2086
+quietly "$cxx" -std=c++17 -Wall -Wextra -Werror ${CXXFLAGS-} "$source/tests/integration/installed_tls.cpp" \
+    -o "$work/tls/by-pkg-config" "$@"
+cat >"$work/tls/expected" <<EOF
+connection: 1, key: 1
+X509 certificate string is not in a supported format
+EOF
+"$work/tls/by-cmake/tls" >"$work/tls/by-cmake.out" || fail "the TLS program built with CMake ended with an error"
+LD_LIBRARY_PATH="$libdir" "$work/tls/by-pkg-config" >"$work/tls/by-pkg-config.out" ||
+    fail "the TLS program built with pkg-config ended with an error"
+for way in by-cmake by-pkg-config; do
+    diff "$work/tls/expected" "$work/tls/$way.out" >&2 || fail "the TLS program ($way) printed something else"
+done
+
 # --- what the example says
 
 cat >"$work/expected" <<EOF

@@ -1,0 +1,25 @@
+#pragma once
+
+#include <functional>
+#include <set>
+#include <string>
+
+namespace qel::test {
+
+/// Runs an action twice, the second time with a look at which calls of OpenSSL it makes; then once more for each of
+/// them, with that call failing. Expects each time that the action throws SSLException "An SSL error occurred at
+/// FILE:LINE", that the call stands there in the source, that OpenSSL's own reason is in the log, and that the error
+/// queue is empty.
+/// @param action      makes the same calls each time
+/// @param exceptions  calls that cannot fail or whose failure shows otherwise: names, or whole calls as
+///                    OpenSSLCalls::calls() has them
+/// @return how many calls were made to fail
+unsigned expectEveryFailureIsReported(const std::function<void()>& action,
+                                      const std::set<std::string>& exceptions = {});
+
+/// Expects SSLException "An SSL error occurred at .../FILE:LINE" from common/security, and the error queue to be empty
+/// after it.
+/// @param file  the name of the source file
+void expectSSLErrorAt(const std::string& file, const std::function<void()>& action);
+
+} // namespace qel::test
