@@ -16,10 +16,13 @@ const char* signalDescription(int number) noexcept
 {
     constexpr int kSignals = 65; // the table covers the signals 0 to 64
     if (number < 0 || number >= kSignals) return nullptr;
-#if defined(__GLIBC__) && __GLIBC_PREREQ(2, 32)
+// Two lines, not one condition: other C libraries have no macro __GLIBC_PREREQ, and its call would not even parse.
+#if defined(__GLIBC__)
+#if __GLIBC_PREREQ(2, 32)
     return ::sigdescr_np(number); // reads the table that was called sys_siglist before
-#elif defined(__GLIBC__)
+#else
     return ::sys_siglist[number];
+#endif
 #else
     // strsignal makes up a text for numbers that have no description; these have one everywhere.
     return number >= 1 && number <= 31 ? ::strsignal(number) : nullptr;

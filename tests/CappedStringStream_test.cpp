@@ -159,7 +159,7 @@ TEST(CappedStringStream, StrIsACopy)
 {
     CappedStringStream stream(100);
     stream << "one";
-    const std::string text = stream.str();
+    const std::string& text = stream.str();
     stream << " two";
     EXPECT_EQ(text, "one");
     EXPECT_EQ(stream.str(), "one two");

@@ -501,17 +501,22 @@ TEST_F(LogBackendRotatingTest, RunningOutOfMemoryInARotationClosesItWithoutAnExc
     QEL_TEST_NEEDS_ALLOCATIONS();
     // Long enough that the names of the files do not fit into strings without an allocation.
     const std::string name(100, 'n');
-    LogBackendRotating backend(LogLevel::Inherit, mDirectory.path(), name, 2);
-    log(backend, "a");
     const std::string line = "b";
-    {
-        Allocations allocations;
-        allocations.failAll();
-        log(backend, line);
+    for (std::size_t succeeding = 0; succeeding < 4; ++succeeding) {
+        SCOPED_TRACE(succeeding);
+        const TemporaryDirectory directory;
+        LogBackendRotating backend(LogLevel::Inherit, directory.path(), name, 2);
+        log(backend, "a");
+        {
+            Allocations allocations;
+            allocations.failAfter(succeeding);
+            log(backend, line);
+        }
+        log(backend, "c");
+        EXPECT_EQ(Utilities::readFile(directory.file(name)), "a\n");
+        EXPECT_NE(::access(directory.file(name + ".1").c_str(), F_OK), 0);
+        EXPECT_THAT(mSystemLog.take(), IsEmpty());
     }
-    log(backend, "c");
-    EXPECT_EQ(files(), (Files{{name, "a\n"}}));
-    EXPECT_THAT(mSystemLog.take(), IsEmpty());
 }
 
 // Failed writes
@@ -623,19 +628,22 @@ TEST_F(LogBackendRotatingTest, ALostLineBeforeARotationIsReportedAfterIt)
 TEST_F(LogBackendRotatingTest, RunningOutOfMemoryCostsTheTextOfTheErrorAtMost)
 {
     QEL_TEST_NEEDS_ALLOCATIONS();
-    const auto backend = make();
     const std::string line = "lost";
-    {
-        FileCalls calls;
-        calls.fail(FileCalls::Writev, ENOSPC);
-        Allocations allocations;
-        allocations.failAll();
-        log(*backend, line);
+    for (std::size_t succeeding = 0; succeeding < 4; ++succeeding) {
+        SCOPED_TRACE(succeeding);
+        const auto backend = make();
+        {
+            FileCalls calls;
+            calls.fail(FileCalls::Writev, ENOSPC);
+            Allocations allocations;
+            allocations.failAfter(succeeding);
+            log(*backend, line);
+        }
+        const std::vector<SystemLogMessage> messages = mSystemLog.take();
+        ASSERT_EQ(messages.size(), 1U);
+        EXPECT_EQ(messages[0].priority, LOG_ERR);
+        EXPECT_THAT(messages[0].text, StartsWith("cannot write to log " + path("log") + ": errno "));
     }
-    const std::vector<SystemLogMessage> messages = mSystemLog.take();
-    ASSERT_EQ(messages.size(), 1U);
-    EXPECT_EQ(messages[0].priority, LOG_ERR);
-    EXPECT_THAT(messages[0].text, StartsWith("cannot write to log " + path("log") + ": errno "));
 }
 
 TEST_F(LogBackendRotatingTest, ItsTroubleNeverReachesTheLogger)

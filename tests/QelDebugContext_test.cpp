@@ -7,12 +7,14 @@
 
 #include "support/Allocations.hpp"
 #include "support/CapturedLog.hpp"
+#include "support/GroupingLocale.hpp"
+#include "support/ProcessIdCalls.hpp"
 #include "support/SettableClock.hpp"
 #include "support/ThrowingLogBackend.hpp"
+#include "support/TimeZoneScope.hpp"
 
 #include <chrono>
 #include <csignal>
-#include <cstdlib>
 #include <ctime>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
@@ -252,20 +254,11 @@ TEST_F(QelDebugContextTest, TheTimeIsUtcWithoutFractionAndZone)
 
 TEST_F(QelDebugContextTest, TheZoneOfTheProcessDoesNotMatter)
 {
-    const char* const before = std::getenv("TZ");
-    const std::string saved = before != nullptr ? before : "";
-    ::setenv("TZ", "XYZ-05:30", 1);
-    ::tzset();
+    const TimeZoneScope zone("XYZ-05:30");
     mClock.advance(seconds(1)); // a second that no line has shown yet
     {
         QelDebugContext(QelLogger::get(), LogLevel::Error) << "text";
     }
-    if (before != nullptr) {
-        ::setenv("TZ", saved.c_str(), 1);
-    } else {
-        ::unsetenv("TZ");
-    }
-    ::tzset();
     ASSERT_EQ(mLog.rawLines().size(), 1U);
     EXPECT_THAT(mLog.rawLines()[0], StartsWith("[2026-03-01 17:04:10] "));
 }
@@ -302,30 +295,17 @@ TEST(QelDebugContext, ShowsTheTimeOfWhicheverClockIsInForce)
     expectRealTime();
 }
 
-class CountingClock : public TimeProvider {
-public:
-    CountingClock() { pRegister(); }
-    unsigned mSystemReads = 0;
-
-private:
-    system_clock::time_point pSystem() override
-    {
-        ++mSystemReads;
-        return system_clock::from_time_t(kExampleTime);
-    }
-    std::chrono::steady_clock::time_point pSteady() override { return {}; }
-};
-
 TEST(QelDebugContext, ReadsTheClockOncePerLine)
 {
     const CapturedLog log;
-    const CountingClock clock;
+    const SettableClock clock;
     for (unsigned i = 1; i <= 3; ++i) {
         {
             QelDebugContext(QelLogger::get(), LogLevel::Error) << "text";
         }
-        EXPECT_EQ(clock.mSystemReads, i);
+        EXPECT_EQ(clock.systemReads(), i);
     }
+    EXPECT_EQ(clock.steadyReads(), 0U);
 }
 
 // The ids
@@ -389,30 +369,32 @@ TEST(QelDebugContextFork, AChildOfAnotherThreadShowsItsOwnIds)
     EXPECT_TRUE(showsOwnIds());
 }
 
+/// Writes a line. @return how often it asked for the id of the process
+unsigned processIdCallsOfALine()
+{
+    const unsigned before = processIdCalls();
+    {
+        QelDebugContext(QelLogger::get(), LogLevel::Error) << "text";
+    }
+    return processIdCalls() - before;
+}
+
+TEST(QelDebugContextFork, IdsAreKeptUntilAForkAndAskedForAgainOnBothSidesOfIt)
+{
+    const SettableClock clock;
+    const CapturedLog log;
+    processIdCallsOfALine();
+    EXPECT_EQ(processIdCallsOfALine(), 0U);
+    EXPECT_TRUE(holdsInChild([] { return processIdCallsOfALine() == 1 && processIdCallsOfALine() == 0; }));
+    EXPECT_EQ(processIdCallsOfALine(), 1U);
+    EXPECT_EQ(processIdCallsOfALine(), 0U);
+}
+
 // The locale
-
-/// Prints 4711 as 4.711 and 0.5 as 0,5.
-class GroupingNumbers : public std::numpunct<char> {
-protected:
-    char do_decimal_point() const override { return ','; }
-    char do_thousands_sep() const override { return '.'; }
-    std::string do_grouping() const override { return "\3"; }
-};
-
-class GlobalLocale {
-public:
-    explicit GlobalLocale(const std::locale& locale) : mSaved(std::locale::global(locale)) {}
-    ~GlobalLocale() { std::locale::global(mSaved); }
-    GlobalLocale(const GlobalLocale&) = delete;
-    GlobalLocale& operator=(const GlobalLocale&) = delete;
-
-private:
-    const std::locale mSaved;
-};
 
 TEST_F(QelDebugContextTest, NumbersIgnoreTheGlobalLocale)
 {
-    const GlobalLocale grouping(std::locale(std::locale::classic(), new GroupingNumbers));
+    const GroupingLocale grouping;
     mClock.advance(seconds(1)); // so that the prefix, too, is composed under that locale
     {
         QelDebugContext line(QelLogger::get(), LogLevel::Error);
@@ -450,6 +432,22 @@ TEST_F(QelDebugContextTest, WithoutMemoryTheLineIsEmptyAndNothingIsThrown)
         line << "text";
         allocations.succeedAgain();
         EXPECT_EQ(line.str(), "");
+    }
+}
+
+TEST_F(QelDebugContextTest, AsLongAsThereIsMemoryTheLineIsKeptAndNothingIsThrown)
+{
+    QEL_TEST_NEEDS_ALLOCATIONS();
+    QelDebug::globals().resetLoggers();
+    const std::string text(300, 'x'); // more than a line has room for at first
+    {
+        Allocations allocations;
+        allocations.failAfter(1);
+        QelDebugContext line(QelLogger::get(), LogLevel::Error);
+        line << text;
+        allocations.succeedAgain();
+        EXPECT_TRUE(line.bad());
+        EXPECT_EQ(line.str(), kExampleText + idsOfThisThread() + "(E): ");
     }
 }
 

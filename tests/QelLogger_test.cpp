@@ -353,6 +353,29 @@ TEST_F(QelLoggerTest, ABackendIsEnteredByOneThreadAtATime)
     EXPECT_FALSE(backend->overlapped());
 }
 
+/// Looks at the levels and changes them while it is given a line, hence with the lock of the registry held.
+class LevelChangingBackend : public LogBackend {
+public:
+    void log(LogLevel::Level, const std::string&) override
+    {
+        QelLogger& root = QelLogger::get();
+        mWasEnabled = root.isLevelEnabled(LogLevel::Debug);
+        root.setLevel(LogLevel::Debug).propagate(true);
+        mIsEnabled = root.isLevelEnabled(LogLevel::Debug);
+    }
+    bool mWasEnabled = true;
+    bool mIsEnabled = false;
+};
+
+TEST_F(QelLoggerTest, LevelsAreTestedAndChangedWithoutTheLock)
+{
+    const auto backend = std::make_shared<LevelChangingBackend>();
+    QelLogger::get().addBackend(backend);
+    QelLogger::get().send(LogLevel::Error, "line"); // comes back: nobody waits for a lock that this thread holds
+    EXPECT_FALSE(backend->mWasEnabled);
+    EXPECT_TRUE(backend->mIsEnabled);
+}
+
 TEST_F(QelLoggerTest, EverythingMayBeChangedWhileOthersLog)
 {
     std::atomic<bool> stop{false};

@@ -495,6 +495,7 @@ TEST(CatalogBuilders, TakeNoCallerIdWhenOneIsGiven)
 
 TEST(CatalogBuilders, TakeOneBlockOfTheFinalSize)
 {
+    QEL_TEST_NEEDS_ALLOCATIONS();
     for (const auto* builders : {&buildersWithNewId(), &buildersWithGivenId()}) {
         for (const Builder& row : *builders) {
             SCOPED_TRACE(row.name);
@@ -511,6 +512,7 @@ TEST(CatalogBuilders, TakeOneBlockOfTheFinalSize)
 
 TEST_P(ReceivedClass, TakesOneBlockForTheObjectAndOneForTheFrame)
 {
+    QEL_TEST_NEEDS_ALLOCATIONS();
     const OddBytes bytes(frame().bytes());
     std::size_t blocks = 0;
     {

@@ -4,6 +4,7 @@
 #include "support/Bytes.hpp"
 #include "support/CallerIdScope.hpp"
 #include "support/CatalogFrames.hpp"
+#include "support/MessageProbe.hpp"
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
@@ -16,7 +17,7 @@ namespace {
 using test::bytes;
 using test::CallerIdScope;
 using test::detailsOf;
-using test::hex;
+using test::frameOf;
 using test::newFrame;
 using test::oldFrame;
 using test::Payload;
@@ -35,8 +36,6 @@ const char* const kMessageTooLong = "message greater than maximum acceptable siz
 const char* const kToolIdTooLong = "toolIdLen greater than maximum acceptable size";
 
 std::string zeros(std::size_t count) { return std::string(2 * count, '0'); }
-
-std::string frameOf(const QelMessage& message) { return hex(message.serialize(), message.msgLength()); }
 
 auto refused(const char* phrase) { return ThrowsMessage<QelMessageValidationException>(StrEq(phrase)); }
 

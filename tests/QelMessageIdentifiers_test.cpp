@@ -1,7 +1,6 @@
 #include <qel/common/QelMessageIdentifiers.hpp>
 #include <qel/common/StreamFormatters.hpp>
 
-#include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <iomanip>
 #include <set>
@@ -12,9 +11,6 @@
 
 namespace qel {
 namespace {
-
-using testing::EndsWith;
-using testing::StartsWith;
 
 template <typename T>
 std::string printed(const T& value)
@@ -317,10 +313,15 @@ TEST(QelMessageFlags, CombineWithoutLosingTheirType)
 {
     static_assert(std::is_same<decltype(MsgResponse | MsgResponseExpected), QelMessageFlags>::value, "");
     static_assert(std::is_same<decltype(MsgResponse & MsgResponseExpected), QelMessageFlags>::value, "");
+    static_assert(std::is_same<decltype(~MsgResponse), QelMessageFlags>::value, "");
     EXPECT_EQ(MsgResponse | MsgResponseExpected, 0xC0);
     EXPECT_EQ(MsgResponse | NoFlagSet, 0x40);
     EXPECT_EQ(MsgResponse & MsgResponseExpected, NoFlagSet);
     EXPECT_EQ(static_cast<QelMessageFlags>(0xFF) & MsgResponseExpected, 0x80);
+    EXPECT_EQ(~MsgResponse, 0xBF);
+    QelMessageFlags flags = MsgResponse;
+    flags |= MsgResponseExpected;
+    EXPECT_EQ(printed(flags), "0xC0 (MsgResponse, MsgResponseExpected)");
 }
 
 TEST(QelMessageClassification, HasItsValues)
@@ -359,14 +360,14 @@ TEST(QelMessageClassification, ComesFromTheTwoTopBitsOfEveryFlagByte)
 
 // --- the stream
 
-TEST(QelMessageIdentifiers, PrintTheSameOnAStreamInAnyState)
+TEST(QelMessageIdentifiers, PrintTheSameWhateverBaseCaseAndFillTheStreamWasLeftIn)
 {
     std::ostringstream os;
-    os << std::oct << std::left << std::showbase << std::setfill('*') << std::noshowbase << QelMessageFunctionDax << ' '
-       << operationOf(0x7000, 0xA009) << ' ' << QelMessageStatusCmdFailed << ' ' << MsgResponse;
-    // Left alignment is not for these to change; the numbers fill their width, so it does not show.
-    EXPECT_THAT(os.str(), StartsWith("0x7000 (QelMessageFunctionDax) 0xA009 (QelMessageOpSendKrogConnectionClosed) "));
-    EXPECT_THAT(os.str(), EndsWith(" (MsgResponse)"));
+    os << std::oct << std::nouppercase << std::setfill('*') << QelMessageFunctionDax << ' ' << std::dec
+       << std::setfill('*') << operationOf(0x7000, 0xA009) << ' ' << std::dec << std::setfill('*')
+       << QelMessageStatusCmdFailed << ' ' << std::dec << std::setfill('*') << static_cast<QelMessageFlags>(0x0F);
+    EXPECT_EQ(os.str(), "0x7000 (QelMessageFunctionDax) 0xA009 (QelMessageOpSendKrogConnectionClosed) "
+                        "0x00000006 (QelMessageStatusCmdFailed) 0x0F (no flags set)");
 }
 
 TEST(QelMessageIdentifiers, LeaveTheStreamInUpperCaseHexadecimal)

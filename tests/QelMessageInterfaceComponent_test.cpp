@@ -3,13 +3,13 @@
 #include "support/Bytes.hpp"
 #include "support/CallerIdScope.hpp"
 #include "support/CatalogFrames.hpp"
+#include "support/MessageProbe.hpp"
+#include "support/TimeZoneScope.hpp"
 
-#include <cstdlib>
 #include <ctime>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <limits>
-#include <optional>
 #include <stdexcept>
 #include <string>
 
@@ -19,6 +19,7 @@ namespace {
 using test::bytes;
 using test::CallerIdScope;
 using test::detailsOf;
+using test::frameOf;
 using test::hex;
 using test::newFrame;
 using test::oldFrame;
@@ -32,8 +33,6 @@ using testing::ThrowsMessage;
 const char* const kTooShort = "dataLength smaller than minimum acceptable size";
 
 std::string zeros(std::size_t count) { return std::string(2 * count, '0'); }
-
-std::string frameOf(const QelMessage& message) { return hex(message.serialize(), message.msgLength()); }
 
 auto refused(const char* phrase) { return ThrowsMessage<QelMessageValidationException>(StrEq(phrase)); }
 
@@ -863,31 +862,6 @@ TEST(BroadcastReq, PrintsTheOffsetAsItCame)
 
 using TodRsp = QelMessageGetQelTodRsp;
 
-/// Sets the local time zone for the length of a test.
-class TimeZoneScope {
-public:
-    explicit TimeZoneScope(const char* zone)
-    {
-        if (const char* const previous = std::getenv("TZ")) mPrevious = previous;
-        ::setenv("TZ", zone, 1);
-        ::tzset();
-    }
-    ~TimeZoneScope()
-    {
-        if (mPrevious) {
-            ::setenv("TZ", mPrevious->c_str(), 1);
-        } else {
-            ::unsetenv("TZ");
-        }
-        ::tzset();
-    }
-    TimeZoneScope(const TimeZoneScope&) = delete;
-    TimeZoneScope& operator=(const TimeZoneScope&) = delete;
-
-private:
-    std::optional<std::string> mPrevious;
-};
-
 constexpr std::time_t kMarch2024 = 1709618828;   // 2024-03-05 06:07:08
 constexpr std::time_t kYear0 = -62167219200;     // 0000-01-01 00:00:00
 constexpr std::time_t kYear10000 = 253402300800; // 10000-01-01 00:00:00
@@ -925,7 +899,7 @@ TEST(TodRsp, CarriesTheCallerIdOfItsRequest)
 
 TEST(TodRsp, CarriesUtcWhateverTheTimeZone)
 {
-    const TimeZoneScope zone("TST-13:30"); // 13 and a half hours ahead
+    const test::TimeZoneScope zone("TST-13:30"); // 13 and a half hours ahead
     std::tm local{};
     ASSERT_NE(::localtime_r(&kMarch2024, &local), nullptr);
     ASSERT_EQ(local.tm_hour, 19); // the zone is in force

@@ -500,6 +500,17 @@ TEST(QelMessageRegistry, LetsOtherExceptionsPassWithoutALine)
     EXPECT_THAT(log.lines(), IsEmpty());
 }
 
+TEST(QelMessageRegistry, NeverChangesOnceItIsBuilt)
+{
+    static_assert(!std::is_copy_assignable<QelMessageRegistry>::value, "threads read it without a lock");
+    static_assert(!std::is_move_assignable<QelMessageRegistry>::value, "threads read it without a lock");
+    static_assert(!std::is_copy_assignable<QelInternalMessageRegistry>::value, "all of the process read it");
+
+    const QelMessageRegistry original({QelMessageRegistry::Entry<Example>()});
+    const QelMessageRegistry copy(original);
+    EXPECT_EQ(classOf(*deserialize(copy, exampleFrame().bytes())), typeid(Example));
+}
+
 TEST(QelMessageRegistry, IsReadByAnyNumberOfThreads)
 {
     const QelMessageRegistry registry;

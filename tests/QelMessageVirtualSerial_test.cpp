@@ -3,6 +3,7 @@
 #include "support/Bytes.hpp"
 #include "support/CallerIdScope.hpp"
 #include "support/CatalogFrames.hpp"
+#include "support/MessageProbe.hpp"
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
@@ -14,7 +15,7 @@ namespace {
 using test::bytes;
 using test::CallerIdScope;
 using test::detailsOf;
-using test::hex;
+using test::frameOf;
 using test::newFrame;
 using test::oldFrame;
 using test::Payload;
@@ -32,8 +33,6 @@ using DataToOs = QelMessageVirtualSerialDataToOsAsync;
 using DataToDax = QelMessageVirtualSerialDataToDaxAsync;
 
 const char* const kTooShort = "dataLength shorter than actual data size";
-
-std::string frameOf(const QelMessage& message) { return hex(message.serialize(), message.msgLength()); }
 
 /// The address that the tests use: partition 4660, connection 17.
 Payload address() { return Payload().u16(0x1234).u16(17); }

@@ -2,6 +2,7 @@
 #include <qel/common/util/PosixError.hpp>
 
 #include "support/Bytes.hpp"
+#include "support/GroupingLocale.hpp"
 
 #include <chrono>
 #include <climits>
@@ -11,7 +12,6 @@
 #include <gtest/gtest.h>
 #include <iomanip>
 #include <list>
-#include <locale>
 #include <sstream>
 #include <stdexcept>
 #include <vector>
@@ -591,23 +591,6 @@ TEST(Join, CanBePrintedTwice)
 
 // ---------------------------------------------------------------------------------------------------------- toString
 
-class ThousandsSeparator : public std::numpunct<char> {
-protected:
-    char do_thousands_sep() const override { return '.'; }
-    std::string do_grouping() const override { return "\3"; }
-};
-
-class GroupingLocale {
-public:
-    GroupingLocale() : mBefore(std::locale::global(std::locale(std::locale::classic(), new ThousandsSeparator))) {}
-    ~GroupingLocale() { std::locale::global(mBefore); }
-    GroupingLocale(const GroupingLocale&) = delete;
-    GroupingLocale& operator=(const GroupingLocale&) = delete;
-
-private:
-    std::locale mBefore;
-};
-
 TEST(ToString, IsWhatTheValuePrints)
 {
     EXPECT_EQ(toString(42), "42");
@@ -618,7 +601,7 @@ TEST(ToString, IsWhatTheValuePrints)
 
 TEST(ToString, IsTheSameInEveryLocale)
 {
-    const GroupingLocale grouping;
+    const test::GroupingLocale grouping;
     EXPECT_EQ(printed(4711), "4.711"); // the locale is in force
     EXPECT_EQ(toString(4711), "4711");
 }

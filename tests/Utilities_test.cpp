@@ -1,6 +1,7 @@
 #include <qel/common/Utilities.hpp>
 #include <qel/common/util/PosixError.hpp>
 
+#include "support/Allocations.hpp"
 #include "support/TemporaryDirectory.hpp"
 
 #include <cerrno>
@@ -205,6 +206,25 @@ TEST(UtilitiesPath, NormalizeReportsTheNumberOfItsOwnFailureHoweverLongThePath)
                 ThrowsMessage<PosixError>(StrEq("Failed to normalize path : 2 (No such file or directory)")));
 }
 
+/// @return the number that a failed function reports when composing the text of the error changes errno
+template <typename Function>
+int numberReportedBy(Function function)
+{
+    try {
+        const test::Allocations allocations; // the text is longer than what fits into a string without one
+        function();
+    } catch (const PosixError& error) {
+        return error.getErrorCode().getCode();
+    }
+    return -1;
+}
+
+TEST(UtilitiesPath, NormalizeReportsTheNumberOfItsOwnFailureThoughErrnoHasChangedSince)
+{
+    QEL_TEST_NEEDS_ALLOCATIONS();
+    EXPECT_EQ(numberReportedBy([] { Utilities::normalizePath("/missing"); }), ENOENT);
+}
+
 TEST(UtilitiesPath, NormalizeOfALinkLoopThrows)
 {
     const TemporaryDirectory directory;
@@ -282,6 +302,14 @@ TEST(UtilitiesFile, ReadingReportsTheNumberOfItsOwnFailure)
     const std::string tooLong = directory.file(std::string(5000, 'x'));
     EXPECT_THAT([&] { Utilities::readFile(tooLong); },
                 failsWith("Failed to read contents of file " + tooLong + ": 36 (File name too long)", ENAMETOOLONG));
+}
+
+TEST(UtilitiesFile, ReadingAndWritingReportTheNumberOfTheirOwnFailureThoughErrnoHasChangedSince)
+{
+    QEL_TEST_NEEDS_ALLOCATIONS();
+    EXPECT_EQ(numberReportedBy([] { Utilities::readFile("/missing"); }), ENOENT);
+    EXPECT_EQ(numberReportedBy([] { Utilities::writeFile("/missing/file", ""); }), ENOENT);
+    EXPECT_EQ(numberReportedBy([] { Utilities::writeFile("/dev/full", "x"); }), ENOSPC);
 }
 
 TEST(UtilitiesFile, WritingInAMissingDirectoryThrows)

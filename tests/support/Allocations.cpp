@@ -1,5 +1,6 @@
 #include "support/Allocations.hpp"
 
+#include <cerrno>
 #include <cstdlib>
 #include <new>
 
@@ -10,14 +11,19 @@ namespace {
 // Plain data: operator new runs before any initialiser and must not allocate.
 thread_local bool tWatching = false;
 thread_local bool tFailing = false;
+thread_local std::size_t tBeforeFailing = 0; // allocations that still succeed while tFailing
 thread_local std::size_t tCount = 0;
 
 [[maybe_unused]] void* allocate(std::size_t size)
 {
     if (tWatching) ++tCount;
-    if (tFailing) throw std::bad_alloc();
+    if (tFailing) {
+        if (tBeforeFailing == 0) throw std::bad_alloc();
+        --tBeforeFailing;
+    }
     void* const block = std::malloc(size != 0 ? size : 1);
     if (block == nullptr) throw std::bad_alloc();
+    if (tWatching) errno = Allocations::kErrno;
     return block;
 }
 
@@ -37,7 +43,11 @@ Allocations::~Allocations()
 
 std::size_t Allocations::count() const { return tCount; }
 
-void Allocations::failAll() { tFailing = true; }
+void Allocations::failAfter(std::size_t count)
+{
+    tBeforeFailing = count;
+    tFailing = true;
+}
 
 void Allocations::succeedAgain() { tFailing = false; }
 

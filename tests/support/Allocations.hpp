@@ -22,10 +22,13 @@
 
 namespace qel::test {
 
-/// Counts the calls of operator new on the thread that made this object, from its construction on.
-/// Thread safety: used by that thread alone; allocations of other threads do not count and never fail.
+/// Counts the calls of operator new on the thread that made this object, from its construction on. Each of them leaves
+/// kErrno in errno, as a call that succeeds may: whoever looks for the error of an earlier call by then finds it gone.
+/// Thread safety: used by that thread alone; allocations of other threads do not count, never fail and keep errno.
 class Allocations {
 public:
+    static constexpr int kErrno = 4711; // no error has this number
+
     Allocations();
     ~Allocations();
     Allocations(const Allocations&) = delete;
@@ -34,8 +37,10 @@ public:
     /// @return the allocations so far
     std::size_t count() const;
 
-    /// Makes every allocation from now on fail with std::bad_alloc, until this object goes or succeedAgain is called.
-    void failAll();
+    /// Lets so many more allocations succeed and makes every one after them fail with std::bad_alloc, until this object
+    /// goes or succeedAgain is called.
+    void failAfter(std::size_t count);
+    void failAll() { failAfter(0); }
     void succeedAgain();
 
     /// What a fake allocates in the middle of the code under test neither counts nor fails while it holds one of these.

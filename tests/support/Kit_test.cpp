@@ -16,6 +16,7 @@
 #include "support/ThrowingLogBackend.hpp"
 
 #include <atomic>
+#include <cerrno>
 #include <chrono>
 #include <fstream>
 #include <gmock/gmock.h>
@@ -381,6 +382,53 @@ TEST(AllocationsTest, ExemptOnesNeitherCountNorFail)
     EXPECT_FALSE(failed);
     EXPECT_EQ(count, 0U);
     EXPECT_TRUE(failedBehind);
+}
+
+TEST(AllocationsTest, LetsSomeSucceedBeforeItFails)
+{
+    QEL_TEST_NEEDS_ALLOCATIONS();
+    unsigned succeeded = 0;
+    unsigned failed = 0;
+    {
+        Allocations allocations;
+        allocations.failAfter(2);
+        for (int i = 0; i < 5; ++i) {
+            try {
+                allocateAndRelease();
+                ++succeeded;
+            } catch (const std::bad_alloc&) {
+                ++failed;
+            }
+        }
+    }
+    EXPECT_EQ(succeeded, 2U);
+    EXPECT_EQ(failed, 3U);
+}
+
+TEST(AllocationsTest, ChangesErrnoWhileItCounts)
+{
+    QEL_TEST_NEEDS_ALLOCATIONS();
+    int before = 0;
+    int exempted = 0;
+    int counted = 0;
+    {
+        const Allocations allocations;
+        errno = 5;
+        before = errno;
+        {
+            const Allocations::Exempt exempt;
+            allocateAndRelease();
+            exempted = errno;
+        }
+        allocateAndRelease();
+        counted = errno;
+    }
+    errno = 5;
+    allocateAndRelease();
+    EXPECT_EQ(errno, 5);
+    EXPECT_EQ(before, 5);
+    EXPECT_EQ(exempted, 5);
+    EXPECT_EQ(counted, Allocations::kErrno);
 }
 
 TEST(AllocationsTest, FailsUntilToldToSucceedOrGone)

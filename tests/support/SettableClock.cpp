@@ -31,9 +31,15 @@ void SettableClock::advance(std::chrono::nanoseconds duration)
     mSteady += std::chrono::duration_cast<SteadyClock::duration>(duration).count();
 }
 
+unsigned SettableClock::systemReads() const { return mSystemReads; }
+
 unsigned SettableClock::steadyReads() const { return mSteadyReads; }
 
-SystemClock::time_point SettableClock::pSystem() { return SystemClock::time_point(SystemClock::duration(mSystem)); }
+SystemClock::time_point SettableClock::pSystem()
+{
+    ++mSystemReads;
+    return SystemClock::time_point(SystemClock::duration(mSystem));
+}
 
 SteadyClock::time_point SettableClock::pSteady()
 {

@@ -22,7 +22,8 @@ public:
     /// Moves both clocks, forwards or, with a negative duration, backwards.
     void advance(std::chrono::nanoseconds duration);
 
-    /// @return how often the steady clock has been read
+    /// @return how often each clock has been read
+    unsigned systemReads() const;
     unsigned steadyReads() const;
 
 private:
@@ -31,6 +32,7 @@ private:
 
     std::atomic<std::chrono::system_clock::rep> mSystem; // ticks since the epoch
     std::atomic<std::chrono::steady_clock::rep> mSteady; // ticks since the epoch
+    std::atomic<unsigned> mSystemReads{0};
     std::atomic<unsigned> mSteadyReads{0};
 };
 

@@ -54,6 +54,8 @@ TEST(BitmaskEnum, CombinesInPlaceAndReturnsTheLeftSide)
     EXPECT_EQ(options, Option::Second);
     EXPECT_EQ(&(options ^= Option::First), &options);
     EXPECT_EQ(options, Option::First | Option::Second);
+    options ^= Option::Second;
+    EXPECT_EQ(options, Option::First);
 }
 
 TEST(BitmaskEnum, GivesTheSameType)

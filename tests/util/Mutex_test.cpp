@@ -2,6 +2,7 @@
 
 #include <gtest/gtest.h>
 #include <stdexcept>
+#include <system_error>
 #include <thread>
 #include <type_traits>
 #include <vector>
@@ -93,12 +94,61 @@ TEST(MutexLock, OnlyOneThreadAtATimeIsInside)
     EXPECT_EQ(counter.value, kThreads * kRounds);
 }
 
-TEST(Mutex, NeitherIsCopied)
+TEST(UniqueMutexLock, HoldsTheMutexForTheLengthOfABlock)
+{
+    Mutex mutex;
+    {
+        const UniqueMutexLock lock(mutex);
+        EXPECT_TRUE(lock.ownsLock());
+        EXPECT_FALSE(anotherThreadCanTake(mutex));
+    }
+    EXPECT_TRUE(anotherThreadCanTake(mutex));
+}
+
+TEST(UniqueMutexLock, GivesTheMutexBackMeanwhileAndTakesItAgain)
+{
+    Mutex mutex;
+    {
+        UniqueMutexLock lock(mutex);
+        lock.unlock();
+        EXPECT_FALSE(lock.ownsLock());
+        EXPECT_TRUE(anotherThreadCanTake(mutex));
+        lock.lock();
+        EXPECT_TRUE(lock.ownsLock());
+        EXPECT_FALSE(anotherThreadCanTake(mutex));
+    }
+    EXPECT_TRUE(anotherThreadCanTake(mutex));
+}
+
+TEST(UniqueMutexLock, LeavesTheBlockWithoutTheMutexToo)
+{
+    Mutex mutex;
+    {
+        UniqueMutexLock lock(mutex);
+        lock.unlock();
+    }
+    EXPECT_TRUE(anotherThreadCanTake(mutex));
+}
+
+#if !defined(__clang__) // the analysis refuses both already when they are compiled
+TEST(UniqueMutexLock, RefusesToTakeWhatItHoldsAndToGiveBackWhatItDoesNotHold)
+{
+    Mutex mutex;
+    UniqueMutexLock lock(mutex);
+    EXPECT_THROW(lock.lock(), std::system_error);
+    lock.unlock();
+    EXPECT_THROW(lock.unlock(), std::system_error);
+}
+#endif
+
+TEST(Mutex, NoneOfThemIsCopied)
 {
     EXPECT_FALSE(std::is_copy_constructible<Mutex>::value);
     EXPECT_FALSE(std::is_copy_assignable<Mutex>::value);
     EXPECT_FALSE(std::is_copy_constructible<MutexLock>::value);
     EXPECT_FALSE(std::is_copy_assignable<MutexLock>::value);
+    EXPECT_FALSE(std::is_copy_constructible<UniqueMutexLock>::value);
+    EXPECT_FALSE(std::is_copy_assignable<UniqueMutexLock>::value);
 }
 
 } // namespace

@@ -15,6 +15,7 @@
 #include <fcntl.h>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
+#include <iomanip>
 #include <memory>
 #include <poll.h>
 #include <sstream>
@@ -135,6 +136,13 @@ TEST(PollFd, PrintingLeavesTheFlagsOfTheStreamAsTheyWere)
     std::ostringstream plain;
     plain << PollFd(10, PollEvents::Read) << ' ' << 255;
     EXPECT_EQ(plain.str(), "(fd=10, mask=0x0039, results=0x0000) 255");
+}
+
+TEST(PollFd, PrintingLeavesTheFillCharacterOfTheHexadecimalForm)
+{
+    std::ostringstream os;
+    os << std::setfill('*') << PollFd(10, PollEvents::Read);
+    EXPECT_EQ(os.fill(), '0') << "only the flags are put back";
 }
 
 TEST(PollFd, PrintsTheDescriptorInDecimalOnAHexadecimalStream)

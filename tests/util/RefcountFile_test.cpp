@@ -194,6 +194,41 @@ TEST(RefcountFile, ANegativeDescriptorStartsClosedAndIsNeverClosed)
     EXPECT_EQ(errno, 0);
 }
 
+/// Frees the number 0 for the length of a test, whatever the process has there.
+class DescriptorZero {
+public:
+    DescriptorZero() : mSaved(::fcntl(0, F_DUPFD_CLOEXEC, 3)) { ::close(0); }
+    ~DescriptorZero()
+    {
+        if (mSaved < 0) return;
+        ::dup2(mSaved, 0);
+        ::close(mSaved);
+    }
+    DescriptorZero(const DescriptorZero&) = delete;
+    DescriptorZero& operator=(const DescriptorZero&) = delete;
+
+private:
+    const int mSaved;
+};
+
+TEST(RefcountFile, ZeroIsADescriptorLikeAnyOther)
+{
+    WatchedPipe pipe;
+    const DescriptorZero zero;
+    const int writer = pipe.giveAway();
+    ASSERT_EQ(::dup2(writer, 0), 0);
+    ASSERT_EQ(::close(writer), 0);
+    RefcountFile file(0);
+    {
+        const RefcountFile::Guard guard(file);
+        EXPECT_TRUE(guard.isValid());
+        EXPECT_EQ(guard.getFd(), 0);
+        file.close();
+        EXPECT_TRUE(pipe.writerIsOpen());
+    }
+    EXPECT_FALSE(pipe.writerIsOpen());
+}
+
 TEST(RefcountFile, CopiesShareOneDescriptor)
 {
     WatchedPipe pipe;

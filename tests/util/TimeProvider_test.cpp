@@ -201,14 +201,16 @@ TEST(SettableClock, SetsEachClockAlone)
     EXPECT_EQ(TimeProvider::steady(), kSteadyTime);
 }
 
-TEST(SettableClock, CountsTheReadingsOfTheSteadyClock)
+TEST(SettableClock, CountsTheReadingsOfEachClock)
 {
     const SettableClock clock;
     EXPECT_EQ(clock.steadyReads(), 0U);
+    EXPECT_EQ(clock.systemReads(), 0U);
     TimeProvider::steady();
     TimeProvider::system();
     TimeProvider::steady();
     EXPECT_EQ(clock.steadyReads(), 2U);
+    EXPECT_EQ(clock.systemReads(), 1U);
 }
 
 } // namespace

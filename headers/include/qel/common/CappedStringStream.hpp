@@ -38,7 +38,7 @@ private:
 
 /// An output stream whose text is cut at a limit. The write that does not fit is cut there and puts the stream into its
 /// failed state (badbit), so that everything after it is dropped; nothing marks the cut. Text that exactly fits is no
-/// failure.
+/// failure. Text for which there is no memory is one, and is dropped likewise.
 /// Thread safety: one thread at a time.
 class QEL_EXPORT CappedStringStream : public std::ostream {
 public:

@@ -123,7 +123,7 @@ public:
         be_uint32_t mReserved3;    // 28  sent as zero, not checked when received
     };
 
-    /// A frame of the new form without payload, all of whose other fields are zero.
+    /// A frame of the new form without payload: eyecatcher, version and frame length, and zeros in all other fields.
     QelMessage();
 
     /// A frame of the new form without payload.

@@ -8,9 +8,12 @@ namespace qel {
 
 class QelMessage;
 
-/// Prints a message as one short line of raw numbers, for log lines: "[CID: 0x00000002, FN: 0x6003, OP: 0x0101, FL:
-/// 0x80, DL: 48, ST: 0x00000000:0000]" (on one line). "DL" is the payload length in bytes, decimal; all else is
-/// hexadecimal. The part from the colon after the status on is the status detail and missing for a 24-byte header.
+/// Prints a message as one short line of raw numbers, for log lines:
+/// @code
+/// [CID: 0x00000002, FN: 0x6003, OP: 0x0101, FL: 0x80, DL: 48, ST: 0x00000000:0000]
+/// @endcode
+/// Caller id, function, operation, flags, payload length in bytes (decimal, all else is hexadecimal), status and, from
+/// the colon on, the status detail, which a 24-byte header does not have.
 /// Lifetime: borrows the message, which must be alive while this is printed; stream it at once, do not keep it.
 class QEL_EXPORT QelMessageIDFormatter {
 public:

@@ -16,7 +16,8 @@ namespace qel {
 /// Ownership and thread safety: as QelMessage.
 class QEL_EXPORT QelMessageGeneric : public QelMessage {
 public:
-    /// A frame of the new form without payload, all of whose fields are zero; no caller id is taken.
+    /// A frame of the new form without payload: eyecatcher, version and frame length, and zeros in all other fields. No
+    /// caller id is taken.
     QelMessageGeneric();
 
     /// A frame of the new form without payload.

@@ -2,6 +2,7 @@
 
 #include <qel/common/QelExport.hpp>
 #include <qel/common/StreamFormatters.hpp>
+#include <qel/common/util/BitmaskEnum.hpp>
 
 #include <cstddef>
 #include <iosfwd>
@@ -129,17 +130,9 @@ enum QEL_EXPORT QelMessageFlags : unsigned char {
     MsgResponseExpected = 0x80 ///< the message is a request
 };
 
-/// All flags that are set in either operand.
-constexpr QelMessageFlags operator|(QelMessageFlags left, QelMessageFlags right) noexcept
-{
-    return static_cast<QelMessageFlags>(static_cast<unsigned>(left) | static_cast<unsigned>(right));
-}
-
-/// The flags that are set in both operands.
-constexpr QelMessageFlags operator&(QelMessageFlags left, QelMessageFlags right) noexcept
-{
-    return static_cast<QelMessageFlags>(static_cast<unsigned>(left) & static_cast<unsigned>(right));
-}
+/// Flags combine with `|`, `&` and the like and stay flags, so that what is combined still prints by name.
+template <>
+struct is_bitmask_enum<QelMessageFlags> : std::true_type {};
 
 /// Whether a message asks, answers or merely tells. A scope for the enumeration and its two conversions; it has no
 /// objects.

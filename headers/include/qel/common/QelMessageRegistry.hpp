@@ -17,13 +17,14 @@ namespace qel {
 
 /// Turns received frames into objects of their message classes. It knows a factory for each identity and falls back to
 /// a plain QelMessage for frames it does not know or that their own class refuses.
-/// Thread safety: filled when built and only read afterwards; any number of threads may deserialize at once.
+/// Thread safety: filled when built and never changed afterwards; any number of threads may deserialize at once.
 class QEL_EXPORT QelMessageRegistry {
 public:
     /// What a message is: function code, operation, classification. The same as QelMessageMetadata::getMessageID().
     using Identifier = std::tuple<unsigned short, unsigned short, QelMessageClassification::Value>;
 
-    /// Builds a message from a frame (bytes, length); throws QelMessageValidationException when it refuses the frame.
+    /// Builds a message from a frame (bytes, length), never null; throws QelMessageValidationException when it refuses
+    /// the frame. Called by every thread that deserializes, without a lock.
     using Factory = std::function<std::unique_ptr<QelMessage>(const char*, unsigned int)>;
 
     /// The first 22 bytes of a frame, of which only the identity is read; nothing is checked.
@@ -49,6 +50,10 @@ public:
     /// A registry with exactly these entries; of several with the same identity the first one stands.
     QelMessageRegistry(std::initializer_list<std::pair<const Identifier, Factory>> entries);
 
+    /// A copy has the same entries. There is no assignment: others may be reading the entries.
+    QelMessageRegistry(const QelMessageRegistry&) = default;
+    QelMessageRegistry& operator=(const QelMessageRegistry&) = delete;
+
     virtual ~QelMessageRegistry();
 
     /// The entry for a message class, for the list of the constructor above.
@@ -72,7 +77,7 @@ public:
     std::unique_ptr<QelMessage> deserialize(const char* buffer, unsigned int length) const;
 
 private:
-    std::map<Identifier, Factory> mEntries;
+    const std::map<Identifier, Factory> mEntries;
 };
 
 static_assert(sizeof(QelMessageRegistry::FastHeader) == 22 && alignof(QelMessageRegistry::FastHeader) == 1,

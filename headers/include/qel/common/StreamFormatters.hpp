@@ -26,7 +26,8 @@
 ///
 /// State of the stream: the hexadecimal and decimal formatters do not restore base, case and fill. A plain integer
 /// printed after hexFormat() appears in upper-case hexadecimal; print it through decFormat() to be sure. Each formatter
-/// that prints numbers sets the base it needs first.
+/// that prints numbers sets the base it needs first. Alignment is the caller's: on a stream set to std::left the zeros
+/// that fill a hexadecimal number up come behind its digits.
 ///
 /// Thread safety: formatters are values; the stream belongs to one thread at a time. They throw only what the stream
 /// throws (nothing, unless its exceptions were switched on).
@@ -181,8 +182,7 @@ DecFormatter<T> decFormat(const T& value) noexcept
 /// 01 AB 00 print as 0x01AB00.
 class HexStringFormatter : public HexFormatterBase {
 public:
-    /// @param ptr    the first of `length` bytes, borrowed until the formatter is printed; may be null when `length` is
-    /// 0
+    /// @param ptr    the first of `length` bytes, borrowed until the formatter is printed; may be null if `length` is 0
     /// @param length number of bytes
     HexStringFormatter(const void* ptr, std::size_t length) noexcept : mPtr(ptr), mLength(length) {}
 

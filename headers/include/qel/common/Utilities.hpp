@@ -29,9 +29,8 @@ QEL_EXPORT std::string rstrip(const std::string& text, const char* chars);
 QEL_EXPORT std::string strip(const std::string& text, const char* chars);
 
 /// Splits a text at a separator, from the left. Empty pieces are kept.
-/// @param limit at most so many splits are made; what is left, separators included, is the last piece. 0 splits
-/// nothing,
-///              a negative limit means no limit
+/// @param limit at most so many splits are made, and what is left, separators included, is the last piece; 0 splits
+///              nothing, and a negative limit means no limit
 /// @return at least one piece; the empty text gives one empty piece
 QEL_EXPORT std::vector<std::string> split(const std::string& text, char separator, long limit = -1);
 

@@ -25,6 +25,7 @@ public:
     class Guard;
 
     /// @param fd a descriptor, owned from here on; with a negative one the object starts closed
+    /// @throws std::bad_alloc the descriptor is then still the caller's
     explicit RefcountFile(int fd);
 
     /// Copies share one descriptor; moving copies, so that the source stays usable.
