@@ -1,0 +1,316 @@
+#include <qel/common/QelMessageRegistry.hpp>
+#include <qel/common/QelMessageVirtualSerial.hpp>
+#include <qel/common/io/QelMessageStream.hpp>
+#include <qel/common/io/Stream.hpp>
+#include <qel/common/io/StreamIOException.hpp>
+#include <qel/common/net/IPEndpoint.hpp>
+#include <qel/common/net/Listen.hpp>
+#include <qel/common/net/Socket.hpp>
+#include <qel/common/net/SocketStream.hpp>
+
+#include "Contest.hpp"
+
+#include <boost/asio.hpp>
+#include <chrono>
+#include <cstring>
+#include <memory>
+#include <stdexcept>
+#include <string>
+#include <sys/socket.h>
+#include <unistd.h>
+#include <vector>
+#include <zmq.h>
+
+namespace qel::bench {
+
+namespace {
+
+constexpr std::size_t kPrefix = 8; // what is read first: it tells the length of the frame
+constexpr std::size_t kShortest = 40;
+constexpr std::size_t kFixedPart = 38; // of a serial-data frame: header, address and length
+
+/// A frame of exactly so many bytes.
+std::unique_ptr<QelMessage> messageOf(std::size_t length)
+{
+    const std::vector<char> data(length - kFixedPart, 'x');
+    return std::make_unique<QelMessageVirtualSerialDataToOsAsync>(static_cast<std::uint16_t>(1),
+                                                                  static_cast<std::uint16_t>(0),
+                                                                  static_cast<std::uint16_t>(data.size()), data.data());
+}
+
+/// Both ends of a TCP connection over loopback, tuned as the library tunes them.
+struct TcpPair {
+    TcpPair()
+    {
+        Socket listener = listenOn(IPEndpoint("127.0.0.1:0"), 1);
+        Socket connecting(IPFamily::IPv4, SOCK_STREAM | SOCK_CLOEXEC, 0);
+        connecting.connect(listener.getSocketName(), std::chrono::seconds(5));
+        near = std::make_unique<SocketStream>(std::move(connecting));
+        far = std::make_unique<SocketStream>(listener.accept());
+    }
+
+    int nearFd() const { return near->getSocket().getFd(); }
+    int farFd() const { return far->getSocket().getFd(); }
+
+    std::unique_ptr<SocketStream> near;
+    std::unique_ptr<SocketStream> far;
+};
+
+void readAll(int descriptor, char* buffer, std::size_t length)
+{
+    while (length > 0) {
+        const ssize_t count = ::read(descriptor, buffer, length);
+        if (count <= 0) throw std::runtime_error("read");
+        buffer += count;
+        length -= static_cast<std::size_t>(count);
+    }
+}
+
+void sendAll(int descriptor, const char* buffer, std::size_t length)
+{
+    while (length > 0) {
+        const ssize_t count = ::send(descriptor, buffer, length, MSG_NOSIGNAL);
+        if (count <= 0) throw std::runtime_error("send");
+        buffer += count;
+        length -= static_cast<std::size_t>(count);
+    }
+}
+
+std::size_t frameLength(const char* prefix)
+{
+    be_uint32_t length;
+    std::memcpy(&length, prefix + 4, sizeof(length));
+    return length;
+}
+
+/// A stream over a descriptor and nothing more: what the message stream costs without the care of SocketStream.
+class DescriptorStream : public Stream {
+public:
+    explicit DescriptorStream(int descriptor) : mDescriptor(descriptor) {}
+    ~DescriptorStream() override { ::close(mDescriptor); }
+    void close() override { ::shutdown(mDescriptor, SHUT_RDWR); }
+    std::size_t read(char* buffer, std::size_t length) override
+    {
+        const ssize_t count = ::read(mDescriptor, buffer, length);
+        if (count < 0) throw StreamIOException("read");
+        return static_cast<std::size_t>(count);
+    }
+    void write(const char* buffer, std::size_t length) override { sendAll(mDescriptor, buffer, length); }
+    int descriptor() const { return mDescriptor; }
+
+private:
+    int mDescriptor;
+};
+
+struct LocalPair {
+    LocalPair()
+    {
+        int ends[2];
+        if (::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, ends) != 0) throw std::runtime_error("socketpair");
+        near = std::make_unique<DescriptorStream>(ends[0]);
+        far = std::make_unique<DescriptorStream>(ends[1]);
+    }
+    int nearFd() const { return near->descriptor(); }
+    int farFd() const { return far->descriptor(); }
+
+    std::unique_ptr<DescriptorStream> near;
+    std::unique_ptr<DescriptorStream> far;
+};
+
+/// One frame over: one write and two reads.
+template <typename Pair>
+void oursOneWay(benchmark::State& state, std::size_t length)
+{
+    Pair pair;
+    QelMessageRegistry registry;
+    QelMessageStream sender(*pair.near, registry);
+    QelMessageStream receiver(*pair.far, registry);
+    const std::unique_ptr<QelMessage> message = messageOf(length);
+    for (auto _ : state) {
+        sender.write(*message);
+        benchmark::DoNotOptimize(receiver.read());
+    }
+}
+
+template <typename Pair>
+void rawOneWay(benchmark::State& state, std::size_t length)
+{
+    Pair pair;
+    const std::unique_ptr<QelMessage> message = messageOf(length);
+    std::vector<char> buffer(QelMessage::MtuMax);
+    for (auto _ : state) {
+        sendAll(pair.nearFd(), message->serialize(), message->msgLength());
+        readAll(pair.farFd(), buffer.data(), kPrefix);
+        readAll(pair.farFd(), buffer.data() + kPrefix, frameLength(buffer.data()) - kPrefix);
+        benchmark::DoNotOptimize(buffer.data());
+    }
+}
+
+/// The other ends of the pair's descriptors for Boost.Asio, which wants descriptors of its own.
+struct AsioPair {
+    AsioPair()
+        : near(context, boost::asio::ip::tcp::v4(), ::dup(pair.nearFd())),
+          far(context, boost::asio::ip::tcp::v4(), ::dup(pair.farFd()))
+    {}
+
+    TcpPair pair;
+    boost::asio::io_context context{1};
+    boost::asio::ip::tcp::socket near;
+    boost::asio::ip::tcp::socket far;
+};
+
+/// What a program that uses Boost.Asio would receive into: a message that owns its bytes.
+struct OwnedMessage {
+    std::unique_ptr<char[]> bytes;
+    std::size_t length;
+};
+
+std::unique_ptr<OwnedMessage> asioRead(boost::asio::ip::tcp::socket& socket)
+{
+    char prefix[kPrefix];
+    boost::asio::read(socket, boost::asio::buffer(prefix, kPrefix));
+    auto message = std::make_unique<OwnedMessage>();
+    message->length = frameLength(prefix);
+    message->bytes.reset(new char[message->length]);
+    std::memcpy(message->bytes.get(), prefix, kPrefix);
+    boost::asio::read(socket, boost::asio::buffer(message->bytes.get() + kPrefix, message->length - kPrefix));
+    return message;
+}
+
+void asioOneWay(benchmark::State& state, std::size_t length)
+{
+    AsioPair pair;
+    const std::unique_ptr<QelMessage> message = messageOf(length);
+    for (auto _ : state) {
+        boost::asio::write(pair.near, boost::asio::buffer(message->serialize(), message->msgLength()));
+        benchmark::DoNotOptimize(asioRead(pair.far));
+    }
+}
+
+/// Two connected ZeroMQ sockets of the given kinds over loopback, with one I/O thread between them.
+class ZmqPair {
+public:
+    ZmqPair(int nearKind, int farKind) : context(::zmq_ctx_new())
+    {
+        far = ::zmq_socket(context, farKind);
+        near = ::zmq_socket(context, nearKind);
+        char endpoint[64];
+        std::size_t length = sizeof(endpoint);
+        if (::zmq_bind(far, "tcp://127.0.0.1:*") != 0 ||
+            ::zmq_getsockopt(far, ZMQ_LAST_ENDPOINT, endpoint, &length) != 0 || ::zmq_connect(near, endpoint) != 0) {
+            throw std::runtime_error("zmq");
+        }
+    }
+    ~ZmqPair()
+    {
+        ::zmq_close(near);
+        ::zmq_close(far);
+        ::zmq_ctx_term(context);
+    }
+    ZmqPair(const ZmqPair&) = delete;
+    ZmqPair& operator=(const ZmqPair&) = delete;
+
+    void* context;
+    void* near;
+    void* far;
+};
+
+void zmqReceive(void* socket)
+{
+    zmq_msg_t received;
+    ::zmq_msg_init(&received);
+    if (::zmq_msg_recv(&received, socket, 0) < 0) throw std::runtime_error("zmq_msg_recv");
+    benchmark::DoNotOptimize(::zmq_msg_data(&received));
+    ::zmq_msg_close(&received);
+}
+
+void zmqSend(void* socket, const QelMessage& message)
+{
+    if (::zmq_send(socket, message.serialize(), message.msgLength(), 0) < 0) throw std::runtime_error("zmq_send");
+}
+
+void zmqOneWay(benchmark::State& state, std::size_t length)
+{
+    ZmqPair pair(ZMQ_PAIR, ZMQ_PAIR);
+    const std::unique_ptr<QelMessage> message = messageOf(length);
+    for (auto _ : state) {
+        zmqSend(pair.near, *message);
+        zmqReceive(pair.far);
+    }
+}
+
+void oursThereAndBack(benchmark::State& state)
+{
+    TcpPair pair;
+    QelMessageRegistry registry;
+    QelMessageStream console(*pair.near, registry);
+    QelMessageStream hypervisor(*pair.far, registry);
+    const QelMessageVirtualSerialOpenReq request(1, 0, false);
+    const QelMessageVirtualSerialOpenRsp response(request.getCallerId(), 1, 0);
+    for (auto _ : state) {
+        console.write(request);
+        benchmark::DoNotOptimize(hypervisor.read());
+        hypervisor.write(response);
+        benchmark::DoNotOptimize(console.read());
+    }
+}
+
+void rawThereAndBack(benchmark::State& state)
+{
+    TcpPair pair;
+    const QelMessageVirtualSerialOpenReq message(1, 0, false);
+    std::vector<char> buffer(QelMessage::MtuMax);
+    const auto oneWay = [&](int from, int to) {
+        sendAll(from, message.serialize(), message.msgLength());
+        readAll(to, buffer.data(), kPrefix);
+        readAll(to, buffer.data() + kPrefix, frameLength(buffer.data()) - kPrefix);
+    };
+    for (auto _ : state) {
+        oneWay(pair.nearFd(), pair.farFd());
+        oneWay(pair.farFd(), pair.nearFd());
+    }
+}
+
+void zmqThereAndBack(benchmark::State& state)
+{
+    ZmqPair pair(ZMQ_REQ, ZMQ_REP);
+    const QelMessageVirtualSerialOpenReq message(1, 0, false);
+    for (auto _ : state) {
+        zmqSend(pair.near, message);
+        zmqReceive(pair.far);
+        zmqSend(pair.far, message);
+        zmqReceive(pair.near);
+    }
+}
+
+Contest::Body of(std::size_t length, void (*body)(benchmark::State&, std::size_t))
+{
+    return [length, body](benchmark::State& state) { body(state, length); };
+}
+
+} // namespace
+
+void addTransportContests()
+{
+    struct Size {
+        const char* name;
+        std::size_t bytes;
+        double zmqAtMost;
+    };
+    for (const Size& size : {Size{"40 B", kShortest, 0}, Size{"1 KiB", 1024, 0}, Size{"16 KiB", 16384, 0.5}}) {
+        contest(std::string("frame over loopback TCP, ") + size.name)
+            .ours(of(size.bytes, oursOneWay<TcpPair>))
+            .floor("raw send and two reads", 1.08, of(size.bytes, rawOneWay<TcpPair>))
+            .peer("Boost.Asio, an owned message", 1.0, of(size.bytes, asioOneWay))
+            .peer("ZeroMQ", size.zmqAtMost, of(size.bytes, zmqOneWay));
+    }
+    contest("request and response over loopback TCP, 40 B")
+        .ours(oursThereAndBack)
+        .floor("raw send and two reads each way", 1.04, rawThereAndBack)
+        .peer("ZeroMQ", 0.38, zmqThereAndBack);
+    contest("frame over a socket pair, 40 B")
+        .ours(of(kShortest, oursOneWay<LocalPair>))
+        .floor("raw send and two reads", 0, of(kShortest, rawOneWay<LocalPair>));
+}
+
+} // namespace qel::bench
