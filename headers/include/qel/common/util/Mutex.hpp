@@ -52,6 +52,8 @@ public:
     bool try_lock() QEL_TRY_ACQUIRE(true) { return mMutex.try_lock(); }
 
 private:
+    friend class ConditionVariable;
+
     std::mutex mMutex;
 };
 
@@ -66,6 +68,33 @@ public:
 
 private:
     Mutex& mMutex;
+};
+
+/// Holds a Mutex for the length of a block, and can give it back meanwhile: around a wait for the network, say.
+/// Lifetime: borrows the mutex, which must outlive it.
+/// Thread safety: belongs to the thread that made it.
+class QEL_SCOPED_CAPABILITY UniqueMutexLock {
+public:
+    // The bodies are exempt from the analysis, which does not know std::unique_lock; the callers are not.
+
+    /// Blocks until the calling thread holds the mutex.
+    explicit UniqueMutexLock(Mutex& mutex) QEL_ACQUIRE(mutex) QEL_NO_THREAD_SAFETY_ANALYSIS : mLock(mutex) {}
+    /// Gives the mutex back, if it is held just then.
+    ~UniqueMutexLock() QEL_RELEASE() QEL_NO_THREAD_SAFETY_ANALYSIS {}
+    UniqueMutexLock(const UniqueMutexLock&) = delete;
+    UniqueMutexLock& operator=(const UniqueMutexLock&) = delete;
+
+    /// Takes the mutex again. @throws std::system_error  it is held already
+    void lock() QEL_ACQUIRE() QEL_NO_THREAD_SAFETY_ANALYSIS { mLock.lock(); }
+    /// Gives the mutex back early. @throws std::system_error  it is not held
+    void unlock() QEL_RELEASE() QEL_NO_THREAD_SAFETY_ANALYSIS { mLock.unlock(); }
+    /// @return whether the mutex is held through this object
+    bool ownsLock() const noexcept { return mLock.owns_lock(); }
+
+private:
+    friend class ConditionVariable;
+
+    std::unique_lock<Mutex> mLock;
 };
 
 } // namespace qel

@@ -1,0 +1,323 @@
+// What the world may do to the hypervisor end: broken bytes, consoles that vanish, no descriptors.
+
+#include "integration/TestConsole.hpp"
+
+#include <algorithm>
+#include <filesystem>
+#include <gmock/gmock.h>
+#include <random>
+#include <sys/resource.h>
+#include <thread>
+
+namespace qel::test {
+
+namespace {
+
+using ::testing::HasSubstr;
+using ::testing::StartsWith;
+
+std::size_t count(const std::string& text, const std::string& part)
+{
+    std::size_t found = 0;
+    for (std::size_t at = text.find(part); at != std::string::npos; at = text.find(part, at + 1))
+        ++found;
+    return found;
+}
+
+/// Waits for a condition that another process brings about.
+template <typename F>
+bool comesTrue(F condition)
+{
+    const auto end = std::chrono::steady_clock::now() + Process::kDeadline;
+    while (std::chrono::steady_clock::now() < end) {
+        if (condition()) return true;
+        std::this_thread::sleep_for(std::chrono::milliseconds(5));
+    }
+    return condition();
+}
+
+/// Gives a process fewer descriptors, until release() or the end.
+class DescriptorLimit {
+public:
+    DescriptorLimit(pid_t pid, std::size_t descriptors) : mPid(pid)
+    {
+        ::prlimit(mPid, RLIMIT_NOFILE, nullptr, &mBefore);
+        rlimit low = mBefore;
+        low.rlim_cur = descriptors;
+        if (::prlimit(mPid, RLIMIT_NOFILE, &low, nullptr) != 0) throw std::runtime_error("prlimit");
+    }
+    ~DescriptorLimit() { release(); }
+    void release() { ::prlimit(mPid, RLIMIT_NOFILE, &mBefore, nullptr); }
+    DescriptorLimit(const DescriptorLimit&) = delete;
+    DescriptorLimit& operator=(const DescriptorLimit&) = delete;
+
+private:
+    pid_t mPid;
+    rlimit mBefore{};
+};
+
+/// The limit with which the server can open as many more descriptors and not one beyond.
+std::size_t descriptorsFor(ServeProcess& server, std::size_t more)
+{
+    const std::string directory = "/proc/" + std::to_string(server.process().pid()) + "/fd/";
+    std::size_t limit = 0;
+    for (std::size_t free = 0;; ++limit) {
+        if (std::filesystem::is_symlink(directory + std::to_string(limit))) continue;
+        if (free == more) return limit;
+        ++free;
+    }
+}
+
+TEST(ServeFaults, GarbageEndsItsOwnConnectionOnly)
+{
+    ServeProcess server({"--log-level", "warn", "--partition", "1=cat"});
+    TestConsole good(server.endpoint());
+    good.openSession("good");
+    good.openSerial(1);
+    std::mt19937 random(4711);
+    for (int round = 0; round < 50; ++round) {
+        SCOPED_TRACE(round);
+        TestConsole bad(server.endpoint());
+        std::string garbage(8 + random() % 200, '\0');
+        std::generate(garbage.begin(), garbage.end(), [&] { return static_cast<char>(random()); });
+        garbage[4] = '\x01'; // the length: far beyond what is allowed, so that the server need not wait for more
+        bad.messages().sendBytes(garbage);
+        EXPECT_TRUE(bad.messages().isClosed());
+        const std::string line = "round " + std::to_string(round);
+        good.type(1, line + "\n");
+        good.readUntil(1, line + "\r\n" + line + "\r\n");
+    }
+    const auto result = server.stop();
+    EXPECT_EQ(count(result.errors, "closed for a broken frame: Invalid length"), 50U);
+}
+
+TEST(ServeFaults, AFrameThatIsCutShortAtAnyByteHarmsNobody)
+{
+    ServeProcess server({"--log-level", "warn"});
+    const QelMessageGetEnclTypeAndInterfaceVersionReq request(1, 1, 1, 1, "cut");
+    const std::string frame(request.serialize(), request.msgLength());
+    for (std::size_t length = 0; length < frame.size(); ++length) {
+        TestConsole console(server.endpoint());
+        console.messages().sendBytes(frame.substr(0, length));
+        console.vanish();
+    }
+    TestConsole(server.endpoint()).introduce("whole");
+    server.stop();
+}
+
+TEST(ServeFaults, EveryCorruptedByteOfAFrameHarmsNobody)
+{
+    ServeProcess server({"--log-level", "critical"});
+    const QelMessageGetEnclTypeAndInterfaceVersionReq request(1, 1, 1, 1, "corrupt");
+    const std::string frame(request.serialize(), request.msgLength());
+    for (std::size_t at = 0; at < frame.size(); ++at) {
+        TestConsole console(server.endpoint());
+        std::string corrupt = frame;
+        corrupt[at] = static_cast<char>(~corrupt[at]);
+        console.messages().sendBytes(corrupt);
+        console.vanish();
+    }
+    EXPECT_TRUE(comesTrue([&] { return server.call({"time"}).exitStatus == 0; }));
+    server.stop();
+}
+
+TEST(ServeFaults, ConsolesThatVanishLeaveNothingBehind)
+{
+    ServeProcess server({"--max-consoles", "200", "--partition", "1=cat", "--log-level", "critical"});
+    const std::size_t threads = server.threads();
+    const auto quiet = [&] { return server.threads() == threads; };
+    {
+        TestConsole first(server.endpoint());
+        first.openSession("first");
+        first.openSerial(1); // so that the command is there before and after
+    }
+    ASSERT_TRUE(comesTrue(quiet));
+    const std::size_t before = server.process().descriptors();
+    for (int round = 0; round < 20; ++round) {
+        std::vector<std::unique_ptr<TestConsole>> consoles;
+        for (int i = 0; i < 5; ++i) {
+            consoles.push_back(std::make_unique<TestConsole>(server.endpoint()));
+            if (i > 0) consoles.back()->openSession(std::to_string(round) + "/" + std::to_string(i));
+        }
+        ASSERT_TRUE(comesTrue([&] {
+            return consoles[1]->statusOf(QelMessageVirtualSerialOpenReq(1, 0, false)) == 0; // free again
+        }));
+        consoles[1]->messages().send(QelMessageVirtualSerialSetupSessionReq(1, 0));
+        consoles[2]->messages().sendBytes("\xDE\xCA\xFF");
+        for (std::size_t i = 0; i < consoles.size(); ++i) {
+            if (i % 2 == 0) {
+                consoles[i]->reset();
+            } else {
+                consoles[i]->vanish();
+            }
+        }
+    }
+    EXPECT_TRUE(comesTrue(quiet));
+    EXPECT_EQ(server.process().descriptors(), before);
+    server.stop();
+}
+
+TEST(ServeFaults, CommandsThatEndLeaveNothingBehind)
+{
+    ServeProcess server({"--partition", "1=exit 0", "--log-level", "critical"});
+    TestConsole console(server.endpoint());
+    console.openSession("a");
+    const std::size_t before = server.process().descriptors();
+    for (int round = 0; round < 30; ++round) {
+        console.openSerial(1);
+        ASSERT_EQ(console.awaitClosed(1), 4U);
+    }
+    EXPECT_EQ(server.process().descriptors(), before);
+    const auto children = [&] {
+        return run({"/bin/ps", "-o", "pid=", "--ppid", std::to_string(server.process().pid())}).output;
+    };
+    EXPECT_TRUE(comesTrue([&] { return children().empty(); }));
+    server.stop();
+}
+
+/// Servers that run out of descriptors.
+class ServeDescriptors : public ::testing::Test {
+protected:
+    void SetUp() override
+    {
+#ifdef QEL_SANITIZES_UNDEFINED
+        GTEST_SKIP() << "the sanitizer needs descriptors for its check of object types and sees errors without them";
+#endif
+    }
+};
+
+TEST_F(ServeDescriptors, WithoutAnyConnectionsWaitAndTheOthersGoOn)
+{
+    ServeProcess server({"--log-level", "warn", "--partition", "1=cat"});
+    TestConsole present(server.endpoint());
+    present.openSession("present");
+    present.openSerial(1);
+    DescriptorLimit limit(server.process().pid(), descriptorsFor(server, 0));
+    TestConsole late(server.endpoint()); // the system completes the connection, the server cannot take it
+    late.messages().send(QelMessageGetEnclTypeAndInterfaceVersionReq(1, 1, 1, 1, "late"));
+    server.process().awaitErrors("(E): [qel] cannot accept a connection: 24 (Too many open files)");
+    present.type(1, "still served\n");
+    present.readUntil(1, "still served\r\nstill served\r\n");
+    // It does not try without a pause: at most once a second.
+    const auto begin = std::chrono::steady_clock::now();
+    ASSERT_TRUE(comesTrue([&] { return count(server.process().errors(), "cannot accept") >= 2; }));
+    const auto seconds = std::chrono::duration_cast<std::chrono::seconds>(std::chrono::steady_clock::now() - begin);
+    EXPECT_LE(count(server.process().errors(), "cannot accept"), static_cast<std::size_t>(seconds.count()) + 3);
+
+    limit.release();
+    EXPECT_EQ(late.messages().receive()->getStatus(), 0U);
+    server.stop();
+}
+
+TEST_F(ServeDescriptors, TheEndOfAConnectionMakesRoomForTheOneThatWaits)
+{
+    ServeProcess server({"--log-level", "warn"});
+    auto present = std::make_unique<TestConsole>(server.endpoint());
+    present->introduce("present");
+    const DescriptorLimit limit(server.process().pid(), descriptorsFor(server, 0));
+    TestConsole late(server.endpoint());
+    late.messages().send(QelMessageGetEnclTypeAndInterfaceVersionReq(1, 1, 1, 1, "late"));
+    server.process().awaitErrors("cannot accept a connection");
+    present.reset();
+    EXPECT_EQ(late.messages().receive()->getStatus(), 0U);
+    server.stop();
+}
+
+TEST_F(ServeDescriptors, AConnectionThatCannotBeKeptIsClosed)
+{
+    ServeProcess server({"--log-level", "warn"});
+    DescriptorLimit limit(server.process().pid(), descriptorsFor(server, 1)); // the socket, but no wake-up
+    TestConsole unlucky(server.endpoint());
+    EXPECT_TRUE(unlucky.messages().isClosed());
+    server.process().awaitErrors("cannot accept a connection: cannot open a wake-up: 24 (Too many open files)");
+    limit.release();
+    TestConsole(server.endpoint()).introduce("lucky");
+    server.stop();
+}
+
+TEST_F(ServeDescriptors, APartitionThatCannotStartIsARefusedRequest)
+{
+    ServeProcess server({"--log-level", "error", "--partition", "1=echo hello; cat"});
+    TestConsole console(server.endpoint());
+    console.openSession("a");
+    {
+        const DescriptorLimit limit(server.process().pid(), descriptorsFor(server, 0));
+        EXPECT_EQ(console.statusOf(QelMessageVirtualSerialOpenReq(1, 0, false)), 6U);
+    }
+    console.openSerial(1);
+    console.readUntil(1, "hello");
+    EXPECT_THAT(server.stop().errors,
+                HasSubstr("partition 1: cannot open a pseudo-terminal: 24 (Too many open files)"));
+}
+
+TEST(ServeFaults, AConsoleThatSaysNothingIsClosed)
+{
+    ServeProcess server({"--handshake-timeout", "0.05", "--log-level", "warn"});
+    TestConsole silent(server.endpoint());
+    EXPECT_TRUE(silent.messages().isClosed());
+    EXPECT_THAT(server.stop().errors, HasSubstr("console 1: closed, it did not introduce itself in time"));
+}
+
+TEST(ServeFaults, ManyConnectionsAtOnceAreServed)
+{
+    ServeProcess server({"--max-consoles", "60", "--log-level", "warn"});
+    std::vector<std::unique_ptr<TestConsole>> consoles;
+    for (int i = 0; i < 50; ++i) {
+        consoles.push_back(std::make_unique<TestConsole>(server.endpoint()));
+        consoles.back()->messages().send(
+            QelMessageGetEnclTypeAndInterfaceVersionReq(1, 1, 1, 1, "console " + std::to_string(i)));
+    }
+    for (const auto& console : consoles)
+        EXPECT_EQ(console->messages().receive()->getStatus(), 0U);
+    for (const auto& console : consoles)
+        EXPECT_EQ(console->statusOf(QelMessageGetQelTodReq()), 0U);
+    server.stop();
+}
+
+TEST(ServeFaults, AnEndpointThatIsTakenCannotBeListenedOn)
+{
+    ServeProcess server;
+    const auto second = runQel({"serve", "--plain", "--listen", server.endpoint()});
+    EXPECT_EQ(second.exitStatus, 3);
+    EXPECT_THAT(second.errors, HasSubstr("qel: cannot listen on " + server.endpoint() +
+                                         ": socket bind failed: 98 (Address already in use)\n"));
+    EXPECT_EQ(second.output, "");
+    server.stop();
+}
+
+TEST(ServeFaults, AServerThatCannotSayWhereItListensDoesNotServe)
+{
+    const auto result = run({"/bin/sh", "-c", "exec \"$0\" serve --plain > /dev/full", QEL_PROGRAM});
+    EXPECT_EQ(result.exitStatus, 4);
+    EXPECT_THAT(result.errors, HasSubstr("qel: cannot write to standard output\n"));
+}
+
+TEST(ServeFaults, ALogThatNobodyReadsDoesNotEndTheServer)
+{
+    // Standard error is a pipe whose reader goes at once; standard output stays the test's.
+    Process shell({"/bin/sh", "-c",
+                   "exec 3>&1; sh -c 'echo $$ >&3; exec \"$0\" serve --plain --log-level debug >&3 3>&-' \"$0\" 2>&1 "
+                   "| true",
+                   QEL_PROGRAM});
+    const pid_t server = std::stoi(shell.readLine());
+    const std::string endpoint = shell.readLine();
+    for (int i = 0; i < 5; ++i) {
+        TestConsole console(endpoint);
+        console.introduce(std::to_string(i));
+        EXPECT_EQ(console.statusOf(QelMessageGetQelTodReq()), 0U);
+        if (i == 4) break;
+        console.reset();
+        // Each round must be over before the next: two consoles are all there can be.
+        ASSERT_TRUE(comesTrue([&] {
+            const auto call = runQel(
+                {"call", "--connect", endpoint, "--plain", "--tool-id", std::to_string(i), "--tool-type", "5", "time"});
+            return call.exitStatus == 0;
+        }));
+    }
+    ::kill(server, SIGTERM);
+    EXPECT_EQ(shell.wait().exitStatus, 0);
+}
+
+} // namespace
+
+} // namespace qel::test

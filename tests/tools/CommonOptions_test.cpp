@@ -1,0 +1,112 @@
+#include "CommonOptions.hpp"
+
+#include <gmock/gmock.h>
+#include <string>
+#include <unistd.h>
+#include <vector>
+
+namespace qel::test {
+
+namespace {
+
+using ::testing::HasSubstr;
+using ::testing::ThrowsMessage;
+
+bool isLoopback(const std::string& endpoint) { return tool::isLoopback(IPEndpoint(endpoint).getAddress()); }
+
+TEST(CommonOptions, LoopbackAddressesAreKnown)
+{
+    for (const char* endpoint :
+         {"127.0.0.1:1", "127.255.255.255:1", "127.0.0.0:1", "[::1]:1", "[::ffff:127.0.0.1]:1"}) {
+        EXPECT_TRUE(isLoopback(endpoint)) << endpoint;
+    }
+}
+
+TEST(CommonOptions, EverythingElseIsNoLoopbackAddress)
+{
+    for (const char* endpoint : {"126.255.255.255:1", "128.0.0.1:1", "0.0.0.0:1", "10.0.0.1:1", "[::]:1", "[::2]:1",
+                                 "[fe80::1]:1", "[1::1]:1", "[::ffff:10.0.0.1]:1", "[::7f00:1]:1"}) {
+        EXPECT_FALSE(isLoopback(endpoint)) << endpoint;
+    }
+}
+
+TEST(CommonOptions, PlainIsNeededAndAllowsLoopbackAlone)
+{
+    EXPECT_EQ(tool::checkedEndpoint("127.0.0.1:80", true), IPEndpoint("127.0.0.1:80"));
+    EXPECT_THAT([] { tool::checkedEndpoint("127.0.0.1:80", false); },
+                ThrowsMessage<CLI::ValidationError>(HasSubstr("--plain: is required")));
+    EXPECT_THAT(
+        [] { tool::checkedEndpoint("10.0.0.1:80", true); },
+        ThrowsMessage<CLI::ValidationError>("--plain: is refused for 10.0.0.1:80, which is no loopback address"));
+}
+
+TEST(CommonOptions, TheIdentityHasADefaultOfItsOwn)
+{
+    tool::IdentityOptions options;
+    EXPECT_EQ(tool::completeIdentity(options).toolId, "qel-" + std::to_string(::getpid()));
+    options.toolId = "mine";
+    options.toolType = 9;
+    EXPECT_EQ(tool::completeIdentity(options).toolId, "mine");
+    EXPECT_EQ(tool::completeIdentity(options).toolType, 9U);
+}
+
+struct Parsed {
+    tool::ConnectOptions options;
+    int status = 0;
+};
+
+Parsed parse(std::vector<std::string> arguments)
+{
+    Parsed parsed;
+    CLI::App app;
+    tool::addConnectOptions(app, parsed.options);
+    try {
+        app.parse(std::vector<std::string>(arguments.rbegin(), arguments.rend())); // the parser wants them reversed
+    } catch (const CLI::ParseError& error) {
+        parsed.status = error.get_exit_code();
+    }
+    return parsed;
+}
+
+TEST(CommonOptions, ConnectOptionsAreRead)
+{
+    const Parsed parsed = parse({"--connect", "[::1]:80", "--plain", "--timeout", "0.25", "--tool-type", "0xFFFFFFFF",
+                                 "--tool-id", std::string(32, 'x')});
+    EXPECT_EQ(parsed.status, 0);
+    EXPECT_EQ(parsed.options.endpoint, "[::1]:80");
+    EXPECT_TRUE(parsed.options.plain);
+    EXPECT_EQ(parsed.options.timeout(), std::chrono::milliseconds(250));
+    EXPECT_EQ(parsed.options.identity.toolType, 0xFFFFFFFFU);
+    EXPECT_EQ(parsed.options.identity.toolId, std::string(32, 'x'));
+}
+
+TEST(CommonOptions, WithoutATimeoutItIsTenSeconds)
+{
+    EXPECT_EQ(parse({"--connect", "127.0.0.1:80"}).options.timeout(), std::chrono::seconds(10));
+}
+
+TEST(CommonOptions, BadConnectOptionsAreRefused)
+{
+    const std::vector<std::vector<std::string>> bad{
+        {},
+        {"--connect"},
+        {"--connect", "localhost:80"},
+        {"--connect", "127.0.0.1"},
+        {"--connect", "127.0.0.1:65536"},
+        {"--connect", "::1:80"},
+        {"--connect", "127.0.0.1:80", "--timeout", "0"},
+        {"--connect", "127.0.0.1:80", "--timeout", "-1"},
+        {"--connect", "127.0.0.1:80", "--timeout", "86401"},
+        {"--connect", "127.0.0.1:80", "--timeout", "soon"},
+        {"--connect", "127.0.0.1:80", "--tool-type", "4294967296"},
+        {"--connect", "127.0.0.1:80", "--tool-type", "-1"},
+        {"--connect", "127.0.0.1:80", "--tool-id", std::string(33, 'x')},
+        {"--connect", "127.0.0.1:80", "--nonsense"},
+    };
+    for (const auto& arguments : bad)
+        EXPECT_NE(parse(arguments).status, 0) << CLI::detail::join(arguments, " ");
+}
+
+} // namespace
+
+} // namespace qel::test

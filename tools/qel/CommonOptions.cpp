@@ -1,0 +1,92 @@
+#include "CommonOptions.hpp"
+
+#include <exception>
+#include <unistd.h>
+
+namespace qel::tool {
+
+namespace {
+
+constexpr std::size_t kToolIdBytes = 32;
+constexpr double kShortestTimeout = 0.001;
+constexpr double kLongestTimeout = 24 * 60 * 60;
+
+std::string checkEndpoint(std::string& text)
+{
+    try {
+        static_cast<void>(IPEndpoint(text));
+    } catch (const std::exception& error) {
+        return "'" + text + "' is no endpoint: " + error.what();
+    }
+    return {};
+}
+
+std::string checkToolId(std::string& text)
+{
+    return text.size() <= kToolIdBytes ? std::string() : "the tool id is longer than 32 bytes";
+}
+
+} // namespace
+
+std::chrono::milliseconds ConnectOptions::timeout() const
+{
+    return std::chrono::duration_cast<std::chrono::milliseconds>(std::chrono::duration<double>(timeoutSeconds));
+}
+
+void addConnectOptions(CLI::App& app, ConnectOptions& options)
+{
+    app.add_option("--connect", options.endpoint, "The hypervisor end, as 127.0.0.1:PORT or [::1]:PORT")
+        ->required()
+        ->type_name("ENDPOINT")
+        ->check(endpointValidator());
+    addPlainOption(app, options.plain);
+    app.add_option("--timeout", options.timeoutSeconds, "Seconds for connecting and all answers together")
+        ->type_name("SECONDS")
+        ->check(CLI::Range(kShortestTimeout, kLongestTimeout))
+        ->capture_default_str();
+    app.add_option("--tool-type", options.identity.toolType, "Type that this console introduces itself with")
+        ->capture_default_str();
+    app.add_option("--tool-id", options.identity.toolId,
+                   "Id that this console introduces itself with, at most 32 bytes; qel-<process id> unless given")
+        ->check(CLI::Validator(checkToolId, ""));
+}
+
+void addJsonOption(CLI::App& app, bool& json)
+{
+    app.add_flag("--json", json, "Print one JSON document instead of text for people");
+}
+
+void addPlainOption(CLI::App& app, bool& plain)
+{
+    app.add_flag("--plain", plain, "Let the connection go unprotected; for loopback addresses only");
+}
+
+CLI::Validator endpointValidator() { return CLI::Validator(checkEndpoint, ""); }
+
+IPEndpoint checkedEndpoint(const std::string& endpoint, bool plain)
+{
+    if (!plain) throw CLI::ValidationError("--plain", "is required: connections are not protected");
+    const IPEndpoint parsed(endpoint);
+    if (!isLoopback(parsed.getAddress())) {
+        throw CLI::ValidationError("--plain", "is refused for " + endpoint + ", which is no loopback address");
+    }
+    return parsed;
+}
+
+bool isLoopback(const IPAddress& address)
+{
+    constexpr unsigned char kLoopbackNet = 127;
+    if (address.getFamily() == IPFamily::IPv4) return address.getIPv4().bytes()[0] == kLoopbackNet;
+    const IPv6Address& ipv6 = address.getIPv6();
+    if (ipv6.isIPv4Mapped()) return ipv6.bytes()[12] == kLoopbackNet;
+    return ipv6.str() == "::1";
+}
+
+IdentityOptions completeIdentity(const IdentityOptions& options)
+{
+    IdentityOptions identity = options;
+    if (identity.toolId.empty()) identity.toolId = "qel-" + std::to_string(::getpid());
+    return identity;
+}
+
+} // namespace qel::tool

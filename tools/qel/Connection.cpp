@@ -1,0 +1,163 @@
+#include "Connection.hpp"
+
+#include <qel/common/QelMessageExceptions.hpp>
+#include <qel/common/util/TimeProvider.hpp>
+
+#include "Failures.hpp"
+#include "Logging.hpp"
+#include "MessageRegistry.hpp"
+
+#include <poll.h>
+#include <utility>
+
+namespace qel::tool {
+
+namespace {
+
+/// Reports that the other end has closed its side, even while data it sent before is still unread.
+PollFd hangUpOf(int descriptor)
+{
+    PollFd fd(descriptor, PollEvents::Error);
+    fd.mFd.events |= POLLRDHUP;
+    return fd;
+}
+
+} // namespace
+
+Connection::Connection(Hypervisor& hypervisor, std::unique_ptr<Stream> stream, int descriptor, std::string peer,
+                       ConnectionTimes times, std::function<void()> onEnd)
+    : mHypervisor(hypervisor), mStream(std::move(stream)), mHangUp(hangUpOf(descriptor)), mPeer(std::move(peer)),
+      mTimes(times), mOnEnd(std::move(onEnd)), mMessages(*mStream, messageRegistry()), mOutbox([this] {
+          resumeReading();
+          mHypervisor.outputDrained();
+      })
+{}
+
+Connection::~Connection()
+{
+    if (!mEnded) abort();
+    if (mReader.joinable()) mReader.join();
+    if (mWriter.joinable()) mWriter.join();
+}
+
+void Connection::start()
+{
+    mHandshake = TimeProvider::steady() + mTimes.handshake;
+    mStream->setReadDeadline(mTimes.handshake);
+    mId = mHypervisor.connect(*this, mPeer);
+    try {
+        mWriter = std::thread([this] { pWrite(); });
+        mReader = std::thread([this] { pRead(); });
+    } catch (...) {
+        mHypervisor.disconnect(mId);
+        mOutbox.abandon();
+        mEnded = true;
+        throw;
+    }
+}
+
+void Connection::abort()
+{
+    mOutbox.abandon();
+    pCloseStream();
+}
+
+void Connection::post(std::unique_ptr<QelMessage> message) { mOutbox.post(std::move(message)); }
+
+bool Connection::hasRoom() const { return mOutbox.hasRoom(); }
+
+void Connection::resumeReading() { mWake.interrupt(); }
+
+void Connection::finish() { mOutbox.finish(); }
+
+void Connection::pRead() noexcept
+{
+    try {
+        pReceiveAll();
+    } catch (const QelMessageValidationException& error) {
+        logLine(LogLevel::Warn, "console ", mId, ": closed for a broken frame: ", error.what());
+    } catch (const StreamIOException& error) {
+        pReport(error);
+    } catch (const std::exception& error) {
+        logLine(LogLevel::Error, "console ", mId, ": ", explain(error));
+    }
+    pEnd();
+}
+
+void Connection::pReceiveAll()
+{
+    bool introduced = false;
+    while (pWaitForTurn()) {
+        const std::unique_ptr<QelMessage> message = mMessages.read();
+        const ConsoleState state = mHypervisor.receive(mId, *message);
+        if (!introduced && state == ConsoleState::Identified) {
+            introduced = true;
+            mHandshake = PollDeadline();
+            mStream->clearReadDeadline();
+        }
+    }
+}
+
+/// @return false: there is nobody left to read from
+bool Connection::pWaitForTurn()
+{
+    while (!mHypervisor.mayReceive(mId)) {
+        const PollSet set{mWake.getPollFd(), mHangUp};
+        const auto now = TimeProvider::steady();
+        if (mHandshake.isExpired(now)) throw StreamIOException("I/O deadline");
+        const PollResult result = set.wait(mHandshake.getTimeout(now));
+        if (result.contains(mWake.getPollFd())) mWake.eoi();
+        if (result.contains(mHangUp)) return false;
+    }
+    return true;
+}
+
+/// The reader's last act: the hypervisor forgets the console, and what it still has for it may go out.
+void Connection::pEnd()
+{
+    mHypervisor.disconnect(mId);
+    mOutbox.finish();
+    if (!mOutbox.waitUntilWritten(mTimes.linger)) abort();
+    mEnded = true;
+    mOnEnd();
+}
+
+void Connection::pReport(const StreamIOException& error) const
+{
+    if (exitStatusOf(error) == ExitStatus::DeadlinePassed) {
+        logLine(LogLevel::Warn, "console ", mId, ": closed, it did not introduce itself in time");
+    } else {
+        logLine(LogLevel::Info, "console ", mId, ": ", explain(error));
+    }
+}
+
+void Connection::pWrite() noexcept
+{
+    try {
+        pSendAll();
+    } catch (const StreamIOException& error) {
+        logLine(LogLevel::Info, "console ", mId, ": ", explain(error));
+    } catch (const std::exception& error) {
+        logLine(LogLevel::Error, "console ", mId, ": ", explain(error));
+    }
+    mOutbox.abandon();
+    pCloseStream(); // wakes the reader
+    mOutbox.setWritten();
+}
+
+void Connection::pSendAll()
+{
+    while (const std::unique_ptr<QelMessage> message = mOutbox.take())
+        mMessages.write(*message);
+}
+
+void Connection::pCloseStream() noexcept
+{
+    try {
+        mStream->close();
+    } catch (const std::exception& error) {
+        logLine(LogLevel::Warn, "console ", mId, ": cannot close: ", explain(error));
+    }
+}
+
+} // namespace qel::tool

@@ -1,0 +1,43 @@
+#pragma once
+
+#include <qel/common/LogLevel.hpp>
+#include <qel/common/QelDebugContext.hpp>
+#include <qel/common/QelLogger.hpp>
+
+#include <CLI/CLI.hpp>
+#include <cstddef>
+#include <string>
+
+namespace qel::tool {
+
+/// Where the log goes and how much of it is written.
+struct LogOptions {
+    std::string directory; ///< of the rotating files; empty: standard error
+    std::string level;     ///< as LogLevel::parse() takes it; empty: not said
+    std::size_t fileBytes = 1024 * 1024;
+};
+
+/// Adds --log-dir, --log-level and --log-size.
+void addLogOptions(CLI::App& app, LogOptions& options);
+
+/// Gives the root logger its back-end and level.
+/// @param name  of the log file within the directory
+/// @param quiet  without any of the options nothing is logged at all: for commands whose output is their answer
+/// @param level  taken when the options name none
+void startLogging(const LogOptions& options, const std::string& name, LogLevel::Level level, bool quiet);
+
+/// The logger of this program's own lines, which tells them from the library's: "[qel] ".
+/// Thread safety: any thread.
+QelLogger& programLogger();
+
+/// Writes one line to the program's logger when its level is enabled.
+template <typename... Parts>
+void logLine(LogLevel::Level level, const Parts&... parts)
+{
+    QelLogger& logger = programLogger();
+    if (!logger.isLevelEnabled(level)) return;
+    QelDebugContext line(logger, level);
+    (line << ... << parts);
+}
+
+} // namespace qel::tool

@@ -1,0 +1,23 @@
+#include "CaCommand.hpp"
+#include "CallCommand.hpp"
+#include "ConsoleCommand.hpp"
+#include "DecodeCommand.hpp"
+#include "Program.hpp"
+#include "ServeCommand.hpp"
+
+int main(int argc, char** argv)
+{
+    CLI::App app("Both ends of the QEL management protocol", "qel");
+    qel::tool::Action action;
+    qel::tool::addStandardFlags(app);
+    app.require_subcommand(1);
+
+    // One line for each subcommand, in the order in which --help lists them.
+    qel::tool::addServeCommand(app, action);
+    qel::tool::addCallCommand(app, action);
+    qel::tool::addConsoleCommand(app, action);
+    qel::tool::addDecodeCommand(app, action);
+    qel::tool::addCaCommand(app, action);
+
+    return qel::tool::runProgram(app, action, argc, argv);
+}
