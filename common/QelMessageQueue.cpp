@@ -1,0 +1,181 @@
+#include <qel/common/QelMessageQueue.hpp>
+#include <qel/common/StreamFormatters.hpp>
+#include <qel/common/util/TimeProvider.hpp>
+
+#include "LogLine.hpp"
+
+#include <stdexcept>
+#include <utility>
+
+// How threads are woken. Each call decides under the lock whom it has to wake, releases the lock, and wakes them then:
+// a thread that is woken while the lock is held has to go back to sleep at once to wait for it, which doubles the time
+// of a hand-over (measured). Deciding under the lock loses nobody, because a thread counts itself among the waiting
+// before it releases the lock. The thread that is woken may destroy the queue before the one that woke it is done with
+// it; mWakings holds the destructor back for that long.
+
+namespace qel {
+
+namespace {
+
+/// Longer waits are without end. Far below the range of the clocks, to which the wait's deadline has to be added.
+constexpr std::chrono::hours kForEver{24 * 365 * 100};
+
+} // namespace
+
+QelMessageQueue::QelMessageQueue(std::size_t sizeLimit)
+    : mNormalPriorityLimiter(sizeLimit), mLowPriorityLimiter(pGetLowPrioritySize(sizeLimit))
+{}
+
+QelMessageQueue::~QelMessageQueue()
+{
+    {
+        const MutexLock lock(mLock);
+    } // whoever holds it yet, such as a shutdown() that this thread has seen the flag of
+    mWakings.wait();
+}
+
+std::uint64_t QelMessageQueue::pGetLowPrioritySize(std::size_t size) noexcept
+{
+    return size / 2 + size % 2; // (size + 1) / 2 would be 0, no limit at all, for the largest size
+}
+
+QelMessageQueue::RateLimiter& QelMessageQueue::pGetRateLimiter(MessageQueuingOptions options) noexcept
+{
+    const bool lowPriority = (options & MessageQueuingOptions::LOW_PRIORITY) != MessageQueuingOptions::DEFAULT;
+    return lowPriority ? mLowPriorityLimiter : mNormalPriorityLimiter;
+}
+
+void QelMessageQueue::RateLimiter::wait(UniqueMutexLock& lock)
+{
+    logLine(LogLevel::Debug, "Message queue limit of ", decFormat(mSizeLimit), " reached, waiting");
+    mWaiter.wait(lock);
+    logLine(LogLevel::Debug, "Unblocking message queue rate limiter (limit ", decFormat(mSizeLimit), ")");
+}
+
+QelMessageQueue::ReturnCode QelMessageQueue::enqueue(std::unique_ptr<QelMessage> message, MessageQueuingOptions options)
+{
+    if (message == nullptr) throw std::invalid_argument("message");
+
+    const bool blocking = (options & MessageQueuingOptions::BLOCKING) != MessageQueuingOptions::DEFAULT;
+    RateLimiter& limiter = pGetRateLimiter(options);
+    const auto startTime = TimeProvider::steady();
+
+    UniqueMutexLock lock(mLock);
+    ReturnCode result = OK;
+    try {
+        result = pEnqueueLocked(lock, limiter, message, blocking, startTime);
+    } catch (...) {
+        limiter.notifyOne(); // this thread may have been woken to fill room that is still there
+        throw;
+    }
+    if (result != OK || !mDequeueWaiter.hasWaiters()) return result;
+
+    mWakings.enter();
+    lock.unlock();
+    mDequeueWaiter.notifyOne();
+    mWakings.leave();
+    return result;
+}
+
+QelMessageQueue::ReturnCode QelMessageQueue::pEnqueueLocked(UniqueMutexLock& lock, RateLimiter& limiter,
+                                                            std::unique_ptr<QelMessage>& message, bool blocking,
+                                                            std::chrono::steady_clock::time_point startTime)
+{
+    for (;;) {
+        if (mShutdown) return SHUTDOWN;
+        if (limiter.canEnqueue(mStats.getPending().mBytes)) break;
+        if (!blocking) {
+            mStats.dropped(*message);
+            return DROPPED;
+        }
+        limiter.wait(lock);
+    }
+
+    // Memory first, and the clocks before any figure: if one of them fails, nothing has changed.
+    const auto now = TimeProvider::steady();
+    QueueEntry& entry = mQueue.emplace();
+    try {
+        mStats.enqueued(*message, now - startTime);
+    } catch (...) {
+        mQueue.popBack();
+        throw;
+    }
+    entry.mMessage = std::move(message);
+    entry.mStartTime = startTime;
+    return OK;
+}
+
+std::unique_ptr<QelMessage> QelMessageQueue::waitForMsg(const std::chrono::milliseconds& timeout)
+{
+    UniqueMutexLock lock(mLock);
+    pWaitForMsgLocked(lock, timeout);
+    if (mShutdown || mQueue.empty()) return nullptr;
+
+    std::unique_ptr<QelMessage> message;
+    try {
+        message = pDequeueLocked();
+    } catch (...) {
+        mDequeueWaiter.notifyOne(); // this thread may have been woken for the message that is still there
+        throw;
+    }
+
+    const std::uint64_t pendingBytes = mStats.getPending().mBytes;
+    const bool wakeNormal = mNormalPriorityLimiter.hasWorkFor(pendingBytes);
+    const bool wakeLow = mLowPriorityLimiter.hasWorkFor(pendingBytes);
+    if (!wakeNormal && !wakeLow) return message;
+    mWakings.enter();
+    lock.unlock();
+    if (wakeNormal) mNormalPriorityLimiter.notifyOne();
+    if (wakeLow) mLowPriorityLimiter.notifyOne();
+    mWakings.leave();
+    return message;
+}
+
+void QelMessageQueue::pWaitForMsgLocked(UniqueMutexLock& lock, const std::chrono::milliseconds& timeout)
+{
+    if (pHasEndedWaitLocked() || timeout <= std::chrono::milliseconds::zero()) return;
+    if (timeout > kForEver) {
+        while (!pHasEndedWaitLocked())
+            mDequeueWaiter.wait(lock);
+        return;
+    }
+    // The real clock: the thread sleeps in real time, whatever a substitute says.
+    const auto deadline = std::chrono::steady_clock::now() + timeout;
+    while (!pHasEndedWaitLocked()) {
+        if (!mDequeueWaiter.waitUntil(lock, deadline)) return; // a message may have come at the last moment
+    }
+}
+
+std::unique_ptr<QelMessage> QelMessageQueue::pDequeueLocked()
+{
+    QueueEntry& entry = mQueue.front();
+    mStats.dequeued(*entry.mMessage, TimeProvider::steady() - entry.mStartTime);
+    std::unique_ptr<QelMessage> message = std::move(entry.mMessage);
+    mQueue.pop();
+    return message;
+}
+
+void QelMessageQueue::shutdown()
+{
+    UniqueMutexLock lock(mLock);
+    if (mShutdown) return;
+    mShutdown = true;
+    logLine(LogLevel::Debug, "MQ: Shutdown!");
+
+    mWakings.enter();
+    lock.unlock();
+    mLowPriorityLimiter.notifyAll();
+    mNormalPriorityLimiter.notifyAll();
+    mDequeueWaiter.notifyAll();
+    mWakings.leave();
+}
+
+void QelMessageQueue::dumpStatistics(std::ostream& os, const Indent& indent) const
+{
+    const MutexLock lock(mLock);
+    os << indent << "Limits:         " << decFormat(mLowPriorityLimiter.getSizeLimit()) << '/'
+       << decFormat(mNormalPriorityLimiter.getSizeLimit()) << '\n';
+    mStats.dump(os, indent);
+}
+
+} // namespace qel

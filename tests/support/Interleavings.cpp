@@ -1,0 +1,528 @@
+#include "support/Interleavings.hpp"
+
+#include "support/Fiber.hpp"
+
+#include <algorithm>
+#include <map>
+#include <stdexcept>
+#include <unordered_set>
+
+namespace qel::test {
+
+namespace {
+
+using Operation = Interleavings::Operation;
+using Fault = Interleavings::Fault;
+
+constexpr std::size_t kNobody = static_cast<std::size_t>(-1);
+
+const char* const kOperations[] = {"goes on",      "locks",  "sleeps",        "notifies one",
+                                   "notifies all", "leaves", "waits for zero"};
+
+struct Object {
+    std::size_t number = 0; // in the order in which they were made
+    const char* kind = "";
+    std::size_t owner = kNobody; // of a mutex
+    std::size_t inFlight = 0;    // of a count of calls
+};
+
+struct Thread {
+    Operation next = Operation::Step;
+    const void* object = nullptr; // of the next operation
+    const void* mutex = nullptr;  // that a sleeper takes again
+    bool ended = false;
+    bool timed = false;
+    bool woken = false;
+    bool timedOut = false;
+    std::uint64_t past = 0x9E3779B97F4A7C15U; // everything that decides what it does, since here(); it has not begun
+    std::uint64_t place = 0;                  // of the last here()
+    std::vector<const void*> notified;
+};
+
+/// One way to go on: which thread, and which alternative of its operation.
+struct Turn {
+    std::size_t thread;
+    std::size_t alternative;
+};
+
+// The alternatives of a sleeper.
+constexpr std::size_t kWake = 0;
+constexpr std::size_t kTimeOut = 1;
+constexpr std::size_t kNoCause = 2;
+
+/// A turn that was taken.
+struct Scene {
+    std::size_t thread;
+    Operation operation;
+    std::size_t object; // its number
+    const char* kind;
+    std::size_t alternative;
+};
+
+std::uint64_t mix(std::uint64_t hash, std::uint64_t value)
+{
+    // The finishing steps of the 64-bit MurmurHash3.
+    hash ^= value + 0x9E3779B97F4A7C15U + (hash << 6) + (hash >> 2);
+    hash ^= hash >> 33;
+    hash *= 0xFF51AFD7ED558CCDU;
+    hash ^= hash >> 33;
+    hash *= 0xC4CEB9FE1A85EC53U;
+    return hash ^ hash >> 33;
+}
+
+/// One run of a program, and what all runs have in common.
+class Explorer {
+public:
+    explicit Explorer(const Interleavings::Options& options) : mOptions(options) {}
+
+    Interleavings::Result explore(const std::function<std::unique_ptr<Interleavings::Program>()>& make)
+    {
+        do {
+            if (++mResult.runs > mOptions.mostRuns) {
+                mResult.failure = "more runs than were allowed";
+                break;
+            }
+            pRun(make);
+        } while (mResult.failure.empty() && pNextDecisions());
+        mResult.states = mVisited.size();
+        return mResult;
+    }
+
+    // What running threads ask for.
+
+    void perform(Operation operation, const void* object)
+    {
+        if (!mRunning) return;
+        Thread& self = pSelf();
+        self.next = operation;
+        self.object = object;
+        mFibers[mCurrent]->suspend(); // a place where the turn may change
+    }
+
+    bool sleep(const void* condition, const void* mutex, bool timed)
+    {
+        if (!mRunning) return true;
+        unlock(mutex);
+        Thread& self = pSelf();
+        self.mutex = mutex;
+        self.timed = timed;
+        self.woken = false;
+        self.timedOut = false;
+        if (mOptions.sleepersForget) self.past = mix(self.place, pNumber(condition));
+        perform(Operation::Sleep, condition);
+        return !self.timedOut;
+    }
+
+    void unlock(const void* mutex)
+    {
+        if (!mRunning) return;
+        Object* const object = pObject(mutex);
+        if (object == nullptr) return;
+        if (object->owner != mCurrent) return fail("a mutex is given back by a thread that does not hold it");
+        object->owner = kNobody;
+    }
+
+    void enter(const void* calls)
+    {
+        if (!mRunning) return;
+        if (Object* const object = pObject(calls)) ++object->inFlight;
+    }
+
+    bool hasSleepers(const void* condition)
+    {
+        if (!mRunning || mOptions.fault == Fault::NobodySeemsToWait) return false;
+        const bool answer = std::any_of(mThreads.begin(), mThreads.end(), [condition](const Thread& thread) {
+            return thread.next == Operation::Sleep && thread.object == condition;
+        });
+        pSelf().past = mix(pSelf().past, answer ? 2 : 1);
+        return answer;
+    }
+
+    void create(const void* object, const char* kind)
+    {
+        Object& created = mObjects[object];
+        created = Object();
+        created.number = mCreated++;
+        created.kind = kind;
+    }
+
+    void destroy(const void* object)
+    {
+        const auto found = mObjects.find(object);
+        if (found == mObjects.end()) return;
+        const std::string what = pName(object);
+        if (mRunning) {
+            if (found->second.owner != kNobody) fail(what + " is destroyed while it is held");
+            if (found->second.inFlight != 0) fail(what + " is destroyed while calls are in flight");
+            for (const Thread& thread : mThreads) {
+                if (thread.ended || &thread == &mThreads[mCurrent]) continue;
+                if (thread.object == object || thread.mutex == object) {
+                    fail(what + " is destroyed while another thread is about to use it");
+                }
+            }
+        }
+        mObjects.erase(found);
+    }
+
+    void here(std::uint64_t place)
+    {
+        pSelf().past = place;
+        pSelf().place = place;
+        pSelf().notified.clear();
+    }
+
+    void fail(const std::string& what)
+    {
+        if (mGivingUp || !mResult.failure.empty()) return;
+        mResult.failure = what;
+        for (const Scene& scene : mStory) {
+            mResult.story.push_back(
+                "thread " + std::to_string(scene.thread) + " " +
+                kOperations[static_cast<std::size_t>(scene.operation)] +
+                (scene.object == kNobody ? "" : std::string(" ") + scene.kind + " " + std::to_string(scene.object)) +
+                " (" + std::to_string(scene.alternative) + ")");
+        }
+    }
+
+    std::size_t current() const { return mCurrent; }
+    const Thread& thread(std::size_t number) const { return mThreads.at(number); }
+
+private:
+    Thread& pSelf() { return mThreads[mCurrent]; }
+
+    Object* pObject(const void* object)
+    {
+        const auto found = mObjects.find(object);
+        if (found != mObjects.end()) return &found->second;
+        fail("something is used after its end");
+        return nullptr;
+    }
+
+    std::string pName(const void* object) const
+    {
+        const auto found = mObjects.find(object);
+        if (found == mObjects.end()) return "";
+        return std::string(found->second.kind) + " " + std::to_string(found->second.number);
+    }
+
+    void pResume(std::size_t thread)
+    {
+        mCurrent = thread;
+        mFibers[thread]->resume();
+        if (!mFibers[thread]->hasJob()) {
+            mThreads[thread].ended = true;
+            mThreads[thread].object = nullptr;
+            mThreads[thread].mutex = nullptr;
+            mThreads[thread].next = Operation::Step;
+        }
+        mCurrent = kNobody;
+    }
+
+    void pRun(const std::function<std::unique_ptr<Interleavings::Program>()>& make)
+    {
+        mObjects.clear();
+        mStory.clear();
+        mCreated = 0;
+        mSpuriousLeft = mOptions.spuriousWakeups;
+        mGivingUp = false;
+        mDepth = 0;
+        const std::unique_ptr<Interleavings::Program> program = make();
+
+        mThreads.assign(program->threads.size(), Thread());
+        while (mFibers.size() < mThreads.size())
+            mFibers.push_back(std::make_unique<Fiber>());
+        for (std::size_t i = 0; i < mThreads.size(); ++i)
+            mFibers[i]->assign(program->threads[i]);
+
+        mRunning = true;
+        while (mResult.failure.empty() && pTurn(*program)) {
+        }
+        mRunning = false;
+        pGiveUp(*program);
+    }
+
+    /// Runs every thread that has not ended to its end, one after the other.
+    void pGiveUp(Interleavings::Program& program)
+    {
+        mGivingUp = true;
+        program.giveUp();
+        for (std::size_t i = 0; i < mThreads.size(); ++i) {
+            if (mThreads[i].ended) continue;
+            mThreads[i].timedOut = false;
+            pResume(i);
+            if (!mThreads[i].ended) throw std::logic_error("a thread stops where nothing stops it");
+        }
+    }
+
+    /// One thread goes on to its next operation. @return false when the run is over
+    bool pTurn(Interleavings::Program& program)
+    {
+        const std::vector<Turn> turns = pPossibleTurns();
+        if (turns.empty()) {
+            ++mResult.rests;
+            pCheckRest();
+            program.atRest();
+            return false;
+        }
+        if (mDepth == mDecisions.size()) {
+            std::string state;
+            program.describe(state);
+            if (!mVisited.insert(pStateHash(state)).second && mOptions.merge) return false;
+            mDecisions.push_back({0, turns.size()});
+        }
+        const Decision& decision = mDecisions[mDepth++];
+        if (decision.alternatives != turns.size()) throw std::logic_error("the program does not repeat itself");
+        pTake(program, turns[decision.chosen]);
+        return true;
+    }
+
+    std::vector<Turn> pPossibleTurns() const
+    {
+        std::vector<Turn> turns;
+        for (std::size_t i = 0; i < mThreads.size(); ++i) {
+            const Thread& thread = mThreads[i];
+            if (thread.ended) continue;
+            const auto found = mObjects.find(thread.object);
+            const bool exists = found != mObjects.end(); // if not, going on shows it
+            switch (thread.next) {
+            case Operation::Lock:
+                if (!exists || found->second.owner == kNobody) turns.push_back({i, 0});
+                break;
+            case Operation::WaitZero:
+                if (!exists || found->second.inFlight == 0 || mOptions.fault == Fault::WaitZeroDoesNotWait) {
+                    turns.push_back({i, 0});
+                }
+                break;
+            case Operation::Sleep:
+                pAddTurnsOfSleeper(i, turns);
+                break;
+            case Operation::NotifyOne:
+                pAddTurnsOfNotifier(i, turns);
+                break;
+            case Operation::Step:
+            case Operation::NotifyAll:
+            case Operation::Leave:
+                turns.push_back({i, 0});
+                break;
+            }
+        }
+        return turns;
+    }
+
+    void pAddTurnsOfSleeper(std::size_t number, std::vector<Turn>& turns) const
+    {
+        const Thread& thread = mThreads[number];
+        if (!thread.woken && !thread.timedOut) {
+            if (thread.timed) turns.push_back({number, kTimeOut});
+            if (mSpuriousLeft != 0) turns.push_back({number, kNoCause});
+            return;
+        }
+        const auto mutex = mObjects.find(thread.mutex);
+        if (mutex == mObjects.end() || mutex->second.owner == kNobody) turns.push_back({number, kWake});
+    }
+
+    void pAddTurnsOfNotifier(std::size_t number, std::vector<Turn>& turns) const
+    {
+        const std::size_t sleepers = pSleepers(mThreads[number].object).size();
+        for (std::size_t i = 0; i < std::max<std::size_t>(sleepers, 1); ++i)
+            turns.push_back({number, i});
+    }
+
+    /// The threads that a notification can wake.
+    std::vector<std::size_t> pSleepers(const void* condition) const
+    {
+        std::vector<std::size_t> sleepers;
+        for (std::size_t i = 0; i < mThreads.size(); ++i) {
+            const Thread& thread = mThreads[i];
+            if (thread.next != Operation::Sleep || thread.object != condition) continue;
+            if (thread.woken || thread.timedOut) continue;
+            sleepers.push_back(i);
+        }
+        return sleepers;
+    }
+
+    void pTake(Interleavings::Program& program, const Turn& turn)
+    {
+        Thread& thread = mThreads[turn.thread];
+        const auto object = mObjects.find(thread.object);
+        const bool exists = object != mObjects.end();
+        mStory.push_back({turn.thread, thread.next, exists ? object->second.number : kNobody,
+                          exists ? object->second.kind : "", turn.alternative});
+
+        if (thread.next == Operation::Sleep && turn.alternative != kWake) {
+            // It is awake, and has yet to take the mutex again.
+            (turn.alternative == kTimeOut ? thread.timedOut : thread.woken) = true;
+            if (turn.alternative == kNoCause) --mSpuriousLeft;
+            return;
+        }
+        if (thread.object != nullptr && !pCarryOut(turn)) return;
+        pRemember(program, thread, turn);
+        thread.next = Operation::Step;
+        thread.object = nullptr;
+        thread.mutex = nullptr;
+        pResume(turn.thread);
+    }
+
+    /// @return false when that is not possible any more
+    bool pCarryOut(const Turn& turn)
+    {
+        Thread& thread = mThreads[turn.thread];
+        Object* const object = pObject(thread.next == Operation::Sleep ? thread.mutex : thread.object);
+        if (object == nullptr || pObject(thread.object) == nullptr) return false;
+        switch (thread.next) {
+        case Operation::Lock:
+        case Operation::Sleep:
+            object->owner = turn.thread;
+            break;
+        case Operation::NotifyOne: {
+            thread.notified.push_back(thread.object);
+            const std::vector<std::size_t> sleepers = pSleepers(thread.object);
+            if (mOptions.fault == Fault::NotifyOneDoesNothing || sleepers.empty()) break;
+            mThreads[sleepers[turn.alternative]].woken = true;
+            break;
+        }
+        case Operation::NotifyAll:
+            if (mOptions.fault == Fault::NotifyAllDoesNothing) break;
+            for (const std::size_t sleeper : pSleepers(thread.object))
+                mThreads[sleeper].woken = true;
+            break;
+        case Operation::Leave:
+            if (object->inFlight == 0) fail("more calls leave than have entered");
+            --object->inFlight;
+            break;
+        case Operation::Step:
+        case Operation::WaitZero:
+            break;
+        }
+        return true;
+    }
+
+    /// A thread that goes on remembers what it does and what it sees then.
+    void pRemember(Interleavings::Program& program, Thread& thread, const Turn& turn)
+    {
+        thread.past = mix(thread.past, static_cast<std::uint64_t>(thread.next));
+        thread.past = mix(thread.past, turn.alternative);
+        thread.past = mix(thread.past, thread.timedOut ? 1 : 0);
+        const bool looks = thread.next == Operation::Lock || thread.next == Operation::Sleep ||
+                           thread.next == Operation::Step || thread.next == Operation::WaitZero;
+        if (!looks) return;
+        std::string state;
+        program.describeWhatThreadsSee(state);
+        thread.past = mix(thread.past, std::hash<std::string>()(state));
+    }
+
+    void pCheckRest()
+    {
+        for (const Thread& thread : mThreads) {
+            if (thread.ended) continue;
+            if (thread.next == Operation::Lock || (thread.next == Operation::Sleep && thread.woken)) {
+                fail("a thread waits for a mutex for ever");
+            }
+            if (thread.next == Operation::WaitZero) fail("a thread waits for calls in flight for ever");
+        }
+    }
+
+    std::uint64_t pStateHash(const std::string& described) const
+    {
+        std::uint64_t hash = std::hash<std::string>()(described);
+        hash = mix(hash, mSpuriousLeft);
+        for (const Thread& thread : mThreads) {
+            hash = mix(hash, static_cast<std::uint64_t>(thread.next));
+            hash = mix(hash, pNumber(thread.object));
+            hash = mix(hash, pNumber(thread.mutex));
+            hash = mix(hash, (thread.ended ? 8U : 0U) + (thread.timed ? 4U : 0U) + (thread.woken ? 2U : 0U) +
+                                 (thread.timedOut ? 1U : 0U));
+            hash = mix(hash, thread.past);
+        }
+        std::vector<std::uint64_t> objects(mCreated * 2, kNobody - 1);
+        for (const auto& [address, object] : mObjects) {
+            objects[object.number * 2] = object.owner;
+            objects[object.number * 2 + 1] = object.inFlight;
+        }
+        for (const std::uint64_t value : objects)
+            hash = mix(hash, value);
+        return hash;
+    }
+
+    std::uint64_t pNumber(const void* object) const
+    {
+        const auto found = mObjects.find(object);
+        return found == mObjects.end() ? kNobody : found->second.number;
+    }
+
+    /// To the next run. @return false when there is none
+    bool pNextDecisions()
+    {
+        while (!mDecisions.empty() && mDecisions.back().chosen + 1 == mDecisions.back().alternatives) {
+            mDecisions.pop_back();
+        }
+        if (mDecisions.empty()) return false;
+        ++mDecisions.back().chosen;
+        return true;
+    }
+
+    struct Decision {
+        std::size_t chosen;
+        std::size_t alternatives;
+    };
+
+    const Interleavings::Options mOptions;
+    Interleavings::Result mResult;
+    std::vector<Decision> mDecisions;
+    std::unordered_set<std::uint64_t> mVisited;
+    std::vector<std::unique_ptr<Fiber>> mFibers;
+
+    // This run.
+    std::map<const void*, Object> mObjects;
+    std::vector<Thread> mThreads;
+    std::vector<Scene> mStory;
+    std::size_t mCreated = 0;
+    std::size_t mDepth = 0;
+    std::size_t mCurrent = kNobody;
+    unsigned int mSpuriousLeft = 0;
+    bool mRunning = false;
+    bool mGivingUp = false;
+};
+
+Explorer* sExplorer = nullptr;
+
+} // namespace
+
+Interleavings::Program::~Program() = default;
+
+Interleavings::Result Interleavings::exploreAll(const Options& options,
+                                                const std::function<std::unique_ptr<Program>()>& make)
+{
+    Explorer explorer(options);
+    sExplorer = &explorer;
+    Result result = explorer.explore(make);
+    sExplorer = nullptr;
+    return result;
+}
+
+void Interleavings::step() { sExplorer->perform(Operation::Step, nullptr); }
+void Interleavings::here(std::uint64_t place) { sExplorer->here(place); }
+void Interleavings::fail(const std::string& what) { sExplorer->fail(what); }
+std::size_t Interleavings::thread() { return sExplorer->current(); }
+bool Interleavings::hasEnded(std::size_t thread) { return sExplorer->thread(thread).ended; }
+
+bool Interleavings::sleeps(std::size_t thread)
+{
+    const Thread& asked = sExplorer->thread(thread);
+    return !asked.ended && asked.next == Operation::Sleep && !asked.woken && !asked.timedOut;
+}
+
+const std::vector<const void*>& Interleavings::notified() { return sExplorer->thread(thread()).notified; }
+
+void Interleavings::create(const void* object, const char* kind) { sExplorer->create(object, kind); }
+void Interleavings::destroy(const void* object) { sExplorer->destroy(object); }
+void Interleavings::perform(Operation operation, const void* object) { sExplorer->perform(operation, object); }
+bool Interleavings::sleep(const void* condition, const void* mutex, bool timed)
+{
+    return sExplorer->sleep(condition, mutex, timed);
+}
+void Interleavings::unlock(const void* mutex) { sExplorer->unlock(mutex); }
+void Interleavings::enter(const void* calls) { sExplorer->enter(calls); }
+bool Interleavings::hasSleepers(const void* condition) { return sExplorer->hasSleepers(condition); }
+
+} // namespace qel::test

@@ -1,1 +1,0 @@
-// The kit of fakes that the tests share; see the headers beside this file.
