@@ -1,0 +1,36 @@
+#pragma once
+
+#include <cstddef>
+#include <functional>
+#include <openssl/bio.h>
+#include <openssl/ssl.h>
+
+namespace qel::test {
+
+/// Stands in for calls of OpenSSL, as SystemCalls does for those of the system: to reach failures that OpenSSL has no
+/// way to be driven into from outside. A test program that links TlsCalls.cpp defines these functions itself; the
+/// library and OpenSSL then call the test program's.
+///
+/// A call goes to the member of its name when that is set, otherwise to OpenSSL. While a stand-in runs it is switched
+/// off, so it may make the real call.
+///
+/// In force for the thread that makes it, from construction to destruction; they nest.
+class TlsCalls {
+public:
+    TlsCalls();
+    ~TlsCalls();
+    TlsCalls(const TlsCalls&) = delete;
+    TlsCalls& operator=(const TlsCalls&) = delete;
+
+    std::function<int(BIO** first, std::size_t firstBytes, BIO** second, std::size_t secondBytes)> BIO_new_bio_pair;
+    std::function<int(BIO* bio, void* buffer, int length)> BIO_read;
+    std::function<int(BIO* bio, const void* buffer, int length)> BIO_write;
+    std::function<int(const SSL* ssl, int result)> SSL_get_error;
+    std::function<int(SSL* ssl, void* buffer, int length)> SSL_read;
+    std::function<int(SSL* ssl, const void* buffer, int length)> SSL_write;
+
+private:
+    TlsCalls* const mOuter; // in force again when this one ends
+};
+
+} // namespace qel::test

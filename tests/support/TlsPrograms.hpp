@@ -1,0 +1,69 @@
+#pragma once
+
+#include <qel/common/net/Socket.hpp>
+#include <qel/common/security/SSLStream.hpp>
+
+#include "support/Process.hpp"
+#include "support/TemporaryDirectory.hpp"
+#include "support/TlsKit.hpp"
+
+#include <functional>
+#include <gtest/gtest.h>
+#include <memory>
+#include <string>
+#include <vector>
+
+/// @file
+/// TLS programs of others as peers of our streams.
+
+namespace qel::test {
+
+/// Credentials as files, for the length of a test.
+class CredentialFiles {
+public:
+    explicit CredentialFiles(const SSLCredentials& credentials);
+
+    std::string certificate() const { return mDirectory.file("cert.pem"); }
+    std::string key() const { return mDirectory.file("key.pem"); }
+    std::string root() const { return mDirectory.file("root.pem"); }
+
+private:
+    TemporaryDirectory mDirectory;
+};
+
+/// @return whether a program can be started by its name
+bool hasProgram(const std::string& name);
+
+/// Our end of a connection to a program, over TCP. Whatever the program does not do in time fails.
+class ProgramTest : public TlsTest {
+protected:
+    /// The end of the test that a program is missing for. To be called in SetUp().
+    static void skipWithout(const std::string& program);
+
+    /// Starts a program that is found by its name.
+    static std::unique_ptr<Process> start(std::vector<std::string> command);
+
+    // We accept.
+
+    /// @return a port at which acceptClient() waits
+    std::string listen();
+    /// Takes the next connection, as a server with the credentials of an identity.
+    std::unique_ptr<SSLStream> acceptClient(Identity identity = Identity::Server);
+
+    // They accept.
+
+    /// Connects to the port of 127.0.0.1 at which a program listens, once it does.
+    std::unique_ptr<SSLStream> connectTo(const Process& program, Identity identity = Identity::Client);
+
+    /// Waits until the program has sent something that our end has not read.
+    void awaitBytes() const;
+
+private:
+    /// @return a stream over the socket, with deadlines
+    std::unique_ptr<Stream> pStreamOver(Socket socket);
+
+    Socket mListener{-1};
+    int mConnection = -1; // the descriptor of our end; owned by the stream
+};
+
+} // namespace qel::test
