@@ -127,14 +127,28 @@ TEST_F(CaFaults, ATemporaryNameThatIsTakenIsLeftAlone)
 // Not every file system can rename without replacing.
 TEST_F(CaFaults, WhereRenamingCannotKeepFilesLinksDo)
 {
+    bring({"root.crt", "root.key", "server.csr"});
     for (const int error : {EINVAL, ENOSYS}) {
         SCOPED_TRACE(error);
-        const TemporaryDirectory directory;
-        const auto cannot = faults({{"CALL", "renameat2"}, {"ERROR", std::to_string(error)}});
-        ASSERT_EQ(runCa({"request", directory.path(), "console", "--subject", "CN=console"}, cannot).exitStatus, 0);
-        const auto files = runOpenssl({"req", "-in", directory.file("console.csr"), "-verify", "-noout"});
-        EXPECT_EQ(files.exitStatus, 0) << files.errors;
+        const auto result =
+            runCa({"sign", path(), "server"}, faults({{"CALL", "renameat2"}, {"ERROR", std::to_string(error)}}));
+        EXPECT_EQ(result.exitStatus, 0) << result.errors;
+        EXPECT_THAT(names(), ElementsAre("root.crt", "root.key", "server.crt", "server.csr"));
+        EXPECT_NO_THROW(SSLCertificate(read("server.crt")));
+        EXPECT_EQ(modeOf("server.crt"), "644");
+        std::filesystem::remove(file("server.crt"));
     }
+}
+
+// Any other error is one.
+TEST_F(CaFaults, WhereRenamingFailsThereIsNoFile)
+{
+    bring({"root.crt", "root.key", "server.csr"});
+    const auto result =
+        runCa({"sign", path(), "server"}, faults({{"CALL", "renameat2"}, {"ERROR", std::to_string(EPERM)}}));
+    EXPECT_EQ(result.exitStatus, 4);
+    EXPECT_EQ(result.errors, "qel: cannot name " + file("server.crt") + ": 1 (Operation not permitted)\n");
+    EXPECT_THAT(names(), ElementsAre("root.crt", "root.key", "server.csr"));
 }
 
 // Another program makes the certificate when key and request have their names already.
