@@ -29,8 +29,8 @@ QelMessageQueue::QelMessageQueue(std::size_t sizeLimit)
 QelMessageQueue::~QelMessageQueue()
 {
     {
-        const MutexLock lock(mLock);
-    } // whoever holds it yet, such as a shutdown() that this thread has seen the flag of
+        const MutexLock lock(mLock); // lets go of it whoever holds it yet: a shutdown() whose flag this thread has seen
+    }
     mWakings.wait();
 }
 
@@ -65,14 +65,15 @@ QelMessageQueue::ReturnCode QelMessageQueue::enqueue(std::unique_ptr<QelMessage>
     try {
         result = pEnqueueLocked(lock, limiter, message, blocking, startTime);
     } catch (...) {
-        limiter.notifyOne(); // this thread may have been woken to fill room that is still there
+        // This thread may have been woken to fill room that is still there.
+        if (limiter.claimOne(mStats.getPending().mBytes)) limiter.notifyOne();
         throw;
     }
-    if (result != OK || !mDequeueWaiter.hasWaiters()) return result;
+    if (result != OK || !mDequeueWaiter.claimOne()) return result;
 
     mWakings.enter();
     lock.unlock();
-    mDequeueWaiter.notifyOne();
+    mDequeueWaiter.wakeOne();
     mWakings.leave();
     return result;
 }
@@ -115,13 +116,14 @@ std::unique_ptr<QelMessage> QelMessageQueue::waitForMsg(const std::chrono::milli
     try {
         message = pDequeueLocked();
     } catch (...) {
-        mDequeueWaiter.notifyOne(); // this thread may have been woken for the message that is still there
+        // This thread may have been woken for the message that is still there.
+        if (mDequeueWaiter.claimOne()) mDequeueWaiter.wakeOne();
         throw;
     }
 
     const std::uint64_t pendingBytes = mStats.getPending().mBytes;
-    const bool wakeNormal = mNormalPriorityLimiter.hasWorkFor(pendingBytes);
-    const bool wakeLow = mLowPriorityLimiter.hasWorkFor(pendingBytes);
+    const bool wakeNormal = mNormalPriorityLimiter.claimOne(pendingBytes);
+    const bool wakeLow = mLowPriorityLimiter.claimOne(pendingBytes);
     if (!wakeNormal && !wakeLow) return message;
     mWakings.enter();
     lock.unlock();
@@ -166,7 +168,7 @@ void QelMessageQueue::shutdown()
     lock.unlock();
     mLowPriorityLimiter.notifyAll();
     mNormalPriorityLimiter.notifyAll();
-    mDequeueWaiter.notifyAll();
+    mDequeueWaiter.wakeAll();
     mWakings.leave();
 }
 

@@ -186,6 +186,12 @@ TEST_P(SSLStreamCredentials, AreRefused)
     EXPECT_EQ(outcomes.client.log, row.clientLog);
 }
 
+/// "socket stream send failure" or what a stream in memory says: this end has been closed.
+auto failsClosed()
+{
+    return AnyOf("StreamIOException: memory stream closed", "StreamIOException: socket stream send failure");
+}
+
 // Our end in either role against OpenSSL alone
 
 class SSLStreamAgainst : public TlsTest, public ::testing::WithParamInterface<std::tuple<RawTlsPeer::Role, Transport>> {
@@ -552,6 +558,39 @@ TEST_P(SSLStreamAgainst, AReaderSendsNoAnswerToNewKeys)
     EXPECT_EQ(readSome(*mStream, 10), "x");
 }
 
+TEST_P(SSLStreamAgainst, OneDemandForNewKeysInTheMiddleOfAWriteIsMet)
+{
+    connect();
+    bool read = false;
+    mHooks.beforeWrite = [this, &read] {
+        if (std::exchange(read, true)) return;
+        mPeer->updateKeys(true);
+        mPeer->write("x");
+        EXPECT_EQ(readSome(*mStream, 10), "x");
+    };
+    writeText(*mStream, pattern(20000));
+    EXPECT_EQ(mPeer->read(20000), pattern(20000));
+    writeText(*mStream, "new keys");
+    EXPECT_EQ(mPeer->read(8), "new keys");
+}
+
+TEST_P(SSLStreamAgainst, TwoDemandsForNewKeysInTheMiddleOfAWriteAreFatal)
+{
+    connect();
+    bool read = false;
+    mHooks.beforeWrite = [this, &read] {
+        if (std::exchange(read, true)) return;
+        mPeer->updateKeys(true);
+        mPeer->updateKeys(true);
+        mPeer->write("x");
+        const Outcome reader = here([this] { readSome(*mStream, 10); });
+        EXPECT_EQ(reader.failure, kSSLError1);
+    };
+    EXPECT_THAT(here([this] { writeText(*mStream, pattern(20000)); }).failure,
+                AnyOf(failsClosed(), "StreamIOException: SSL error 5"));
+    EXPECT_EQ(mStream->getStatus(), SSLStream::STATUS_CLOSED);
+}
+
 TEST_P(SSLStreamAgainst, TicketsOfAServerAreAccepted)
 {
     RawTlsPeer::Options options = usualOptions();
@@ -630,12 +669,6 @@ TEST_P(SSLStreamAgainst, RecordsMadeByHandAreReadWhenTheyAreProper)
 }
 
 // Two of our ends
-
-/// "socket stream send failure" or what a stream in memory says: this end has been closed.
-auto failsClosed()
-{
-    return AnyOf("StreamIOException: memory stream closed", "StreamIOException: socket stream send failure");
-}
 
 class SSLStreamOver : public TlsTest, public ::testing::WithParamInterface<Transport> {
 protected:

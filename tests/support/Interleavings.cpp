@@ -16,8 +16,8 @@ using Fault = Interleavings::Fault;
 
 constexpr std::size_t kNobody = static_cast<std::size_t>(-1);
 
-const char* const kOperations[] = {"goes on",      "locks",  "sleeps",        "notifies one",
-                                   "notifies all", "leaves", "waits for zero"};
+const char* const kOperations[] = {"goes on",      "locks",  "unlocks", "sleeps",        "notifies one",
+                                   "notifies all", "enters", "leaves",  "waits for zero"};
 
 struct Object {
     std::size_t number = 0; // in the order in which they were made
@@ -102,7 +102,7 @@ public:
     bool sleep(const void* condition, const void* mutex, bool timed)
     {
         if (!mRunning) return true;
-        unlock(mutex);
+        if (Object* const object = pObject(mutex)) pRelease(*object, mCurrent);
         Thread& self = pSelf();
         self.mutex = mutex;
         self.timed = timed;
@@ -111,31 +111,6 @@ public:
         if (mOptions.sleepersForget) self.past = mix(self.place, pNumber(condition));
         perform(Operation::Sleep, condition);
         return !self.timedOut;
-    }
-
-    void unlock(const void* mutex)
-    {
-        if (!mRunning) return;
-        Object* const object = pObject(mutex);
-        if (object == nullptr) return;
-        if (object->owner != mCurrent) return fail("a mutex is given back by a thread that does not hold it");
-        object->owner = kNobody;
-    }
-
-    void enter(const void* calls)
-    {
-        if (!mRunning) return;
-        if (Object* const object = pObject(calls)) ++object->inFlight;
-    }
-
-    bool hasSleepers(const void* condition)
-    {
-        if (!mRunning || mOptions.fault == Fault::NobodySeemsToWait) return false;
-        const bool answer = std::any_of(mThreads.begin(), mThreads.end(), [condition](const Thread& thread) {
-            return thread.next == Operation::Sleep && thread.object == condition;
-        });
-        pSelf().past = mix(pSelf().past, answer ? 2 : 1);
-        return answer;
     }
 
     void create(const void* object, const char* kind)
@@ -168,6 +143,7 @@ public:
     {
         pSelf().past = place;
         pSelf().place = place;
+        pSelf().timedOut = false;
         pSelf().notified.clear();
     }
 
@@ -300,7 +276,9 @@ private:
                 pAddTurnsOfNotifier(i, turns);
                 break;
             case Operation::Step:
+            case Operation::Unlock:
             case Operation::NotifyAll:
+            case Operation::Enter:
             case Operation::Leave:
                 turns.push_back({i, 0});
                 break;
@@ -363,6 +341,12 @@ private:
         pResume(turn.thread);
     }
 
+    void pRelease(Object& mutex, std::size_t thread)
+    {
+        if (mutex.owner != thread) return fail("a mutex is given back by a thread that does not hold it");
+        mutex.owner = kNobody;
+    }
+
     /// @return false when that is not possible any more
     bool pCarryOut(const Turn& turn)
     {
@@ -373,6 +357,9 @@ private:
         case Operation::Lock:
         case Operation::Sleep:
             object->owner = turn.thread;
+            break;
+        case Operation::Unlock:
+            pRelease(*object, turn.thread);
             break;
         case Operation::NotifyOne: {
             thread.notified.push_back(thread.object);
@@ -385,6 +372,9 @@ private:
             if (mOptions.fault == Fault::NotifyAllDoesNothing) break;
             for (const std::size_t sleeper : pSleepers(thread.object))
                 mThreads[sleeper].woken = true;
+            break;
+        case Operation::Enter:
+            ++object->inFlight;
             break;
         case Operation::Leave:
             if (object->inFlight == 0) fail("more calls leave than have entered");
@@ -512,6 +502,8 @@ bool Interleavings::sleeps(std::size_t thread)
     return !asked.ended && asked.next == Operation::Sleep && !asked.woken && !asked.timedOut;
 }
 
+bool Interleavings::timedOut() { return sExplorer->thread(thread()).timedOut; }
+
 const std::vector<const void*>& Interleavings::notified() { return sExplorer->thread(thread()).notified; }
 
 void Interleavings::create(const void* object, const char* kind) { sExplorer->create(object, kind); }
@@ -521,8 +513,5 @@ bool Interleavings::sleep(const void* condition, const void* mutex, bool timed)
 {
     return sExplorer->sleep(condition, mutex, timed);
 }
-void Interleavings::unlock(const void* mutex) { sExplorer->unlock(mutex); }
-void Interleavings::enter(const void* calls) { sExplorer->enter(calls); }
-bool Interleavings::hasSleepers(const void* condition) { return sExplorer->hasSleepers(condition); }
 
 } // namespace qel::test

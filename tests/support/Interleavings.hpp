@@ -30,9 +30,11 @@ public:
     enum class Operation {
         Step,      ///< something that touches no modelled object
         Lock,      ///< take a mutex; can go on while nobody holds it
+        Unlock,    ///< give it back
         Sleep,     ///< wait at a condition variable; can go on when woken, or, if the wait is timed, at any time
         NotifyOne, ///< wake one thread that sleeps at a condition variable, any of them
         NotifyAll, ///< wake all of them
+        Enter,     ///< count up
         Leave,     ///< count down
         WaitZero   ///< can go on when the count is zero
     };
@@ -103,6 +105,8 @@ public:
     static bool hasEnded(std::size_t thread);
     /// Whether that thread sleeps at a condition variable and was not woken.
     static bool sleeps(std::size_t thread);
+    /// Whether the calling thread's latest sleep since its last here() has ended because its time has passed.
+    static bool timedOut();
     /// On which objects the calling thread has called notifyOne() since its last here(), in order.
     static const std::vector<const void*>& notified();
 
@@ -114,9 +118,6 @@ public:
     static void perform(Operation operation, const void* object);
     /// Gives the mutex back and sleeps. @return false when the time of a timed wait has passed
     static bool sleep(const void* condition, const void* mutex, bool timed);
-    static void unlock(const void* mutex);
-    static void enter(const void* calls);
-    static bool hasSleepers(const void* condition);
 };
 
 } // namespace qel::test

@@ -23,7 +23,10 @@ public:
     {
         test::Interleavings::perform(test::Interleavings::Operation::Lock, this);
     }
-    void unlock() QEL_RELEASE() QEL_NO_THREAD_SAFETY_ANALYSIS { test::Interleavings::unlock(this); }
+    void unlock() QEL_RELEASE() QEL_NO_THREAD_SAFETY_ANALYSIS
+    {
+        test::Interleavings::perform(test::Interleavings::Operation::Unlock, this);
+    }
 };
 
 class QEL_SCOPED_CAPABILITY ModelledMutexLock {
@@ -85,7 +88,6 @@ public:
         return test::Interleavings::sleep(this, &lock.mMutex, true);
     }
 
-    bool hasWaiters() const { return test::Interleavings::hasSleepers(this); }
     void notifyOne() { test::Interleavings::perform(test::Interleavings::Operation::NotifyOne, this); }
     void notifyAll() { test::Interleavings::perform(test::Interleavings::Operation::NotifyAll, this); }
 };
@@ -97,7 +99,7 @@ public:
     ModelledCallsInFlight(const ModelledCallsInFlight&) = delete;
     ModelledCallsInFlight& operator=(const ModelledCallsInFlight&) = delete;
 
-    void enter() { test::Interleavings::enter(this); }
+    void enter() { test::Interleavings::perform(test::Interleavings::Operation::Enter, this); }
     void leave() { test::Interleavings::perform(test::Interleavings::Operation::Leave, this); }
     void wait() const { test::Interleavings::perform(test::Interleavings::Operation::WaitZero, this); }
 };

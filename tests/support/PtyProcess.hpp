@@ -37,6 +37,9 @@ public:
     pid_t pid() const { return mPid; }
     const Pty& terminal() const { return mPty; }
 
+    /// True while the terminal is as it was before the process was started.
+    bool isTerminalUntouched() const { return mPty.attributes() == mOriginal; }
+
     void type(const std::string& text) const { mPty.type(text); }
     void signal(int number) const;
 
@@ -54,6 +57,7 @@ private:
     [[noreturn]] void fail(const std::string& what) const;
 
     Pty mPty;
+    const termios mOriginal = mPty.attributes();
     pid_t mPid = -1;
     bool mReaped = false;
     Result mResult{};

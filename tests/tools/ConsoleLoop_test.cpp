@@ -10,6 +10,7 @@
 #include "tools/FakeHypervisorEnd.hpp"
 
 #include <array>
+#include <atomic>
 #include <csignal>
 #include <fcntl.h>
 #include <fstream>
@@ -79,6 +80,7 @@ protected:
             ++dataMessages;
             sent.append(data->getSerialData(), data->getSerialDataLength());
             onInput(sent);
+            hasSent = true;
         };
     }
 
@@ -109,12 +111,13 @@ protected:
     {
         end->push(ClosedNotice(kPartition, 0, reason));
     }
-    /// Reads so many bytes from the pipe that the loop writes to; fewer when it ends.
+    /// Reads so many bytes from the pipe that the loop writes to; fewer when it ends, or when they do not come.
     std::string readOutput(std::size_t length) const
     {
+        const PollSet output(PollFd(outputRead.get(), PollEvents::Read));
         std::string text(length, '\0');
         std::size_t there = 0;
-        while (there < length) {
+        while (there < length && output.wait(std::chrono::seconds(20)).anyReady()) {
             const ssize_t count = ::read(outputRead.get(), text.data() + there, length - there);
             if (count <= 0) break;
             there += static_cast<std::size_t>(count);
@@ -158,6 +161,7 @@ protected:
     std::unique_ptr<ClientConnection> connection;
     std::unique_ptr<ConsoleSession> session;
     std::string sent; // serial data
+    std::atomic<bool> hasSent{false};
     unsigned int dataMessages = 0;
 
     void SetUp() override
@@ -233,6 +237,27 @@ TEST_F(ConsoleLoopTest, ThePartitionIsToldAgainAfterEverySecondOfSilence)
     EXPECT_EQ(sent, "\x04\x04\x04\x04");
 }
 
+TEST_F(ConsoleLoopTest, EachSecondOfSilenceIsCountedFromTheLastTime)
+{
+    SettableClock clock;
+    std::thread other;
+    open([&](const std::string& all) {
+        if (all == "\x04") return clock.advance(ConsoleLoop::kTellAgain);
+        ASSERT_EQ(all, "\x04\x04");
+        clock.advance(ConsoleLoop::kTellAgain - std::chrono::nanoseconds(1));
+        other = std::thread([&, before = clock.steadyReads()] {
+            while (clock.steadyReads() < before + 10)
+                std::this_thread::yield(); // it looks, and nothing has happened
+            closeSession();
+        });
+    });
+    inputWrite.reset();
+    EXPECT_EQ(run().departure, Departure::Ended);
+    ASSERT_TRUE(other.joinable());
+    other.join();
+    EXPECT_EQ(sent, "\x04\x04");
+}
+
 TEST_F(ConsoleLoopTest, OutputIsNoSilence)
 {
     constexpr auto kAlmost = ConsoleLoop::kTellAgain - std::chrono::nanoseconds(1);
@@ -287,6 +312,32 @@ TEST_F(ConsoleLoopTest, AfterTheLingerTimeOfSilenceTheSessionIsLeft)
     reader.join();
     EXPECT_EQ(sent, "x\x04") << "the end is told once";
     EXPECT_EQ(session->getEnd(), SessionEnd::None);
+}
+
+TEST_F(ConsoleLoopTest, TheLingerTimeDoesNotRunWhileOutputWaits)
+{
+    SettableClock clock;
+    ConsoleManners manners;
+    manners.linger = std::chrono::seconds(5);
+    fillOutput();
+    open([&](const std::string& all) {
+        if (all != "\x04") return;
+        clock.advance(std::chrono::seconds(5));
+        output("one");
+    });
+    std::thread reader([&] {
+        while (!hasSent || unreadBytes() != 0)
+            std::this_thread::yield();
+        EXPECT_EQ(readOutput(kPipeBytes), std::string(kPipeBytes, '-'));
+        EXPECT_EQ(readOutput(3), "one");
+        output("two");
+        EXPECT_EQ(readOutput(3), "two");
+        clock.advance(std::chrono::seconds(5));
+        end->push(QelMessageDaxBroadcastOutboundAsync(2, 1, "them", "hi")); // makes the loop look at the clock
+    });
+    inputWrite.reset();
+    EXPECT_EQ(run(manners).departure, Departure::Lingered);
+    reader.join();
 }
 
 TEST_F(ConsoleLoopTest, NoLingerTimeLeavesAtOnce)
@@ -350,6 +401,29 @@ TEST_F(ConsoleLoopTest, OutputIsReadWhileTheConnectionTakesNoInput)
     EXPECT_EQ(run().departure, Departure::Ended);
     reader.join();
     EXPECT_EQ(sent, "x\x04");
+}
+
+TEST_F(ConsoleLoopTest, NoMoreInputIsReadThanIsSent)
+{
+    const TemporaryDirectory directory; // a file is ready at all times
+    const std::string path = directory.file("input");
+    std::ofstream(path) << std::string(1000000, 'i');
+    inputRead = UniqueFd(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
+    open([&](const std::string& all) {
+        if (all.back() == '\x04') closeSession();
+    });
+    end->stopTaking();
+    output("a");
+    std::thread reader([&] {
+        EXPECT_EQ(readOutput(1), "a");
+        output("b");
+        EXPECT_EQ(readOutput(1), "b"); // the loop has gone round several times
+        EXPECT_EQ(::lseek(inputRead.get(), 0, SEEK_CUR), static_cast<off_t>(ConsoleSession::kMostData));
+        end->takeAgain();
+    });
+    EXPECT_EQ(run().departure, Departure::Ended);
+    reader.join();
+    EXPECT_EQ(sent.size(), 1000001U);
 }
 
 TEST_F(ConsoleLoopTest, InputIsSentWhileTheOutputTakesNothing)
@@ -432,6 +506,30 @@ TEST_F(ConsoleLoopTest, AHypervisorThatTakesNothingMoreMayHaveSaidWhy)
     EXPECT_EQ(run().departure, Departure::Ended);
     EXPECT_EQ(session->getEnd(), SessionEnd::ShutDown);
     EXPECT_EQ(written(), "last words");
+}
+
+TEST_F(ConsoleLoopTest, NobodyLingersOnAConnectionThatTakesNothingMore)
+{
+    std::atomic<bool> isBroken{false};
+    open([](const std::string&) {});
+    end->failWrites([&] {
+        isBroken = true;
+        throw StreamIOException("socket stream send failure");
+    });
+    ConsoleManners manners;
+    manners.linger = std::chrono::milliseconds(0);
+    std::thread reader([&] {
+        while (!isBroken)
+            std::this_thread::yield();
+        for (const char* const text : {"a", "b", "c"}) {
+            output(text);
+            EXPECT_EQ(readOutput(1), text);
+        }
+        closeSession();
+    });
+    inputWrite.reset();
+    EXPECT_EQ(run(manners).departure, Departure::Ended);
+    reader.join();
 }
 
 TEST_F(ConsoleLoopTest, AHypervisorThatTakesNothingMoreMayHaveSaidNothing)
@@ -658,11 +756,11 @@ TEST_F(ConsoleLoopTest, GoingOnEntersRawModeAgain)
     pty.type("x");
     std::thread person([&] {
         EXPECT_EQ(pty.read(8), "going on");
-        pty.type("y");
+        pty.type("y\r"); // a whole line, so that it comes in any mode
     });
     EXPECT_EQ(run(ConsoleManners(), &pty).departure, Departure::Ended);
     person.join();
-    EXPECT_EQ(sent, "xy");
+    EXPECT_EQ(sent, "xy\r");
 }
 
 } // namespace

@@ -1,6 +1,9 @@
 #include "ConsoleScreen.hpp"
+#include "UniqueFd.hpp"
 #include "support/Pty.hpp"
+#include "support/TemporaryDirectory.hpp"
 
+#include <fcntl.h>
 #include <gtest/gtest.h>
 #include <sstream>
 #include <string>
@@ -11,6 +14,7 @@ namespace {
 
 using tool::ConsoleScreen;
 using tool::TerminalMode;
+using tool::UniqueFd;
 
 void show(ConsoleScreen& screen, const std::string& text) { screen.onOutput(text.data(), text.size()); }
 
@@ -79,6 +83,17 @@ TEST_F(ConsoleScreenTest, LinesThatGoElsewhereAreNotTouchedByRawMode)
     show(apart, "$ ");
     apart.say("hello");
     EXPECT_EQ(errors.str(), "qel: hello\n");
+}
+
+TEST_F(ConsoleScreenTest, OutputThatGoesElsewhereLeavesNoLineToEnd)
+{
+    const TemporaryDirectory directory;
+    const UniqueFd file(::open(directory.file("output").c_str(), O_WRONLY | O_CREAT | O_CLOEXEC, 0600));
+    ConsoleScreen screen(file.get(), errors, true, mode);
+    mode.enterRaw();
+    show(screen, "$ ");
+    screen.say("hello");
+    EXPECT_EQ(errors.str(), "qel: hello\r\n");
 }
 
 TEST_F(ConsoleScreenTest, ABroadcastSaysWhoSentIt)

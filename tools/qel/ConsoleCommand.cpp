@@ -111,10 +111,9 @@ ConsoleLoop::Outcome attend(ClientConnection& connection, ConsoleSession& sessio
     }
 }
 
-/// Ends this process by a signal, so that whoever started it sees why it ended.
+/// Ends this process by a signal that it had only postponed, so that whoever started it sees why it ended.
 [[noreturn]] void endBy(int signal)
 {
-    static_cast<void>(std::signal(signal, SIG_DFL));
     static_cast<void>(::raise(signal));
     throw CommandFailure(ExitStatus::Failed, "signal " + std::to_string(signal) + " did not end this process");
 }
@@ -144,8 +143,7 @@ ExitStatus runConsole(const ConsoleOptions& options)
     startLogging(options.log, "qel-console.log", LogLevel::Warn, true);
     static_cast<void>(std::signal(SIGPIPE, SIG_IGN)); // nobody reads the output: still the terminal is to be put back
     TerminalMode mode(STDIN_FILENO);
-    const bool isOneTerminal = ::isatty(STDOUT_FILENO) == 1 && ::isatty(STDERR_FILENO) == 1;
-    ConsoleScreen screen(STDOUT_FILENO, std::cerr, isOneTerminal, mode);
+    ConsoleScreen screen(STDOUT_FILENO, std::cerr, ::isatty(STDERR_FILENO) == 1, mode);
     try {
         const auto connection = connectConsole(options.connect);
         ConsoleSession session(*connection, options.address, options.connect.timeout(), screen);

@@ -184,8 +184,7 @@ void ConsoleLoop::pReadInput()
     const ssize_t count = ::read(mInput, buffer.data(), buffer.size());
     const int error = errno;
     if (count > 0) return pTakeTyped(buffer.data(), static_cast<std::size_t>(count));
-    const bool isTerminalGone = error == EIO && mMode.isTerminal();
-    if (count == 0 || isTerminalGone) return pEndInput();
+    if (count == 0) return pEndInput();
     if (error != EAGAIN && error != EINTR) throw PosixError(error, "cannot read standard input");
 }
 
@@ -219,7 +218,7 @@ void ConsoleLoop::pObey(EscapeFilter::Command command)
 
 void ConsoleLoop::pEndInput()
 {
-    if (mMode.isTerminal()) return pDepart(Departure::Left);
+    if (mMode.isTerminal()) return pDepart(Departure::Left); // it is gone: in raw mode there is no other end
     mInputOpen = false;
     mQuietSince = TimeProvider::steady();
     if (mManners.tellsEnd) mPending += kEndOfFile;

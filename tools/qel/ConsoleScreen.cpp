@@ -2,10 +2,13 @@
 
 #include "Text.hpp"
 
+#include <unistd.h>
+
 namespace qel::tool {
 
-ConsoleScreen::ConsoleScreen(int output, std::ostream& errors, bool isOneTerminal, const TerminalMode& mode)
-    : mOutput(output), mErrors(errors), mIsOneTerminal(isOneTerminal), mMode(mode)
+ConsoleScreen::ConsoleScreen(int output, std::ostream& errors, bool errorsOnTerminal, const TerminalMode& mode)
+    : mOutput(output), mErrors(errors), mErrorsOnTerminal(errorsOnTerminal),
+      mIsOneTerminal(errorsOnTerminal && ::isatty(output) == 1), mMode(mode)
 {}
 
 void ConsoleScreen::say(const std::string& text)
@@ -15,7 +18,7 @@ void ConsoleScreen::say(const std::string& text)
     mErrors << "qel: " << text << lineEnd() << std::flush;
 }
 
-const char* ConsoleScreen::lineEnd() const { return mIsOneTerminal && mMode.isRaw() ? "\r\n" : "\n"; }
+const char* ConsoleScreen::lineEnd() const { return mErrorsOnTerminal && mMode.isRaw() ? "\r\n" : "\n"; }
 
 void ConsoleScreen::onOutput(const char* data, std::size_t length) { mOutput.append(data, length); }
 

@@ -16,14 +16,14 @@ class ConsoleScreen final : public ConsoleSession::Receiver {
 public:
     /// @param output  a descriptor for the partition's output
     /// @param errors  for the lines of this program
-    /// @param isOneTerminal  the two go to the same terminal, which `mode` may have put into raw mode
+    /// @param errorsOnTerminal  these go to the terminal, which `mode` may have put into raw mode
     /// Borrows all of them.
-    ConsoleScreen(int output, std::ostream& errors, bool isOneTerminal, const TerminalMode& mode);
+    ConsoleScreen(int output, std::ostream& errors, bool errorsOnTerminal, const TerminalMode& mode);
 
     /// Prints "qel: " and the text on a line of its own.
     void say(const std::string& text);
 
-    /// What ends a line on the terminal in its present mode.
+    /// What ends such a line in the present mode of the terminal.
     const char* lineEnd() const;
 
     /// The partition's output on its way out.
@@ -38,7 +38,8 @@ public:
 private:
     DescriptorOutput mOutput;
     std::ostream& mErrors;
-    const bool mIsOneTerminal;
+    const bool mErrorsOnTerminal;
+    const bool mIsOneTerminal; ///< both are seen there
     const TerminalMode& mMode;
 };
 

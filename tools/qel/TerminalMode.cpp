@@ -13,8 +13,6 @@ termios rawFrom(const termios& original)
 {
     termios raw = original;
     ::cfmakeraw(&raw);
-    raw.c_cc[VMIN] = 1;
-    raw.c_cc[VTIME] = 0;
     return raw;
 }
 

@@ -6,8 +6,8 @@
 #include <qel/common/stats/QelMessageQueueStatistics.hpp>
 #include <qel/common/util/BitmaskEnum.hpp>
 #include <qel/common/util/CallsInFlight.hpp>
-#include <qel/common/util/ConditionVariable.hpp>
 #include <qel/common/util/Mutex.hpp>
+#include <qel/common/util/Waiters.hpp>
 
 #include <atomic>
 #include <chrono>
@@ -105,8 +105,8 @@ private:
         std::chrono::steady_clock::time_point mStartTime; // of the call of enqueue()
     };
 
-    /// The messages in their order. A failed enqueue() takes its message back from the end, which std::queue has but
-    /// does not offer.
+    /// The messages in their order. A failed enqueue() gives its place at the end back, which std::queue has but does
+    /// not offer.
     struct Fifo : std::queue<QueueEntry> {
         void popBack() { c.pop_back(); }
     };
@@ -125,19 +125,16 @@ private:
         /// Waits once, perhaps without cause, and logs that it does.
         void wait(UniqueMutexLock& lock);
 
-        /// @return whether notifyOne() has anything to do
-        bool hasWorkFor(std::uint64_t pendingBytes) const noexcept
-        {
-            return mWaiter.hasWaiters() && canEnqueue(pendingBytes);
-        }
+        /// @return whether a producer is to be woken, for which there must be room; if so, call notifyOne()
+        bool claimOne(std::uint64_t pendingBytes) noexcept { return canEnqueue(pendingBytes) && mWaiter.claimOne(); }
 
-        // These two are called without the lock.
-        void notifyOne() noexcept { mWaiter.notifyOne(); }
-        void notifyAll() noexcept { mWaiter.notifyAll(); }
+        // These two may be called without the lock.
+        void notifyOne() noexcept { mWaiter.wakeOne(); }
+        void notifyAll() noexcept { mWaiter.wakeAll(); }
 
     private:
         const std::uint64_t mSizeLimit; // bytes; 0: no limit
-        ConditionVariable mWaiter;      // for room, by producers
+        Waiters mWaiter;                // for room, producers
     };
 
     static std::uint64_t pGetLowPrioritySize(std::size_t size) noexcept;
@@ -150,10 +147,10 @@ private:
     bool pHasEndedWaitLocked() const QEL_REQUIRES(mLock) { return mShutdown || !mQueue.empty(); }
     std::unique_ptr<QelMessage> pDequeueLocked() QEL_REQUIRES(mLock);
 
-    // The lock guards all that follows, but for what the two condition variables are notified of after it is released.
+    // The lock guards all that follows; those who were claimed under it are woken after it is released.
     mutable Mutex mLock;
     Fifo mQueue QEL_GUARDED_BY(mLock);
-    ConditionVariable mDequeueWaiter; // for a message, by consumers
+    Waiters mDequeueWaiter; // for a message, consumers
     RateLimiter mNormalPriorityLimiter;
     RateLimiter mLowPriorityLimiter;
     std::atomic<bool> mShutdown{false}; // written under the lock, read without it by isShutdown()

@@ -25,11 +25,14 @@ class SSLContext;
 /// fatal: like every exception from underneath it leaves this stream closed, since nobody could say where in a record
 /// the transfer stopped. To interrupt a reader that waits, and go on without it, call close() from another thread.
 ///
-/// What it does not do: it sends no alert, neither when it closes nor when a handshake fails, so a peer sees the end of
-/// the stream; and it tells an end of the stream underneath from a proper end of TLS only in that the latter is an
-/// error ("SSL error 6"). Who needs to know that nothing was cut off must see it from the data. Renegotiation and
-/// resumption do not exist. Any certificate that the context's root issued is accepted: who the peer is tells
-/// getPeerCertificate().
+/// It sends no alert, neither when it closes nor when a handshake fails: the peer sees the end of the stream. What
+/// reads as the end here is the end of the stream underneath, whether the peer meant it or the connection was cut; a
+/// peer that closes TLS itself (close_notify) is an error, "SSL error 6". Who needs to know that nothing is missing
+/// must see it from the data. Renegotiation and resumption do not exist. Any certificate that the context's root issued
+/// is accepted: who the peer is tells getPeerCertificate().
+///
+/// A peer may change its keys at any time; new keys that it asks for in return go out with the next write. Asking twice
+/// while one long write is under way ends the connection.
 ///
 /// Failures of TLS itself are StreamIOException with fixed texts; OpenSSL's reasons are in the log at Error.
 ///
@@ -67,12 +70,11 @@ public:
     ///
     /// After any exception the stream is closed, also when the state was the wrong one: a second handshake() ends a
     /// connection that works.
-    /// @throws StreamIOException  "Invalid state for SSL stream operation": called before, or closed, perhaps
-    /// meanwhile;
-    ///                            "EOF": the peer ended the connection; "SSL error " and a number of SSL_get_error(3):
-    ///                            TLS failed, 1 for a refused certificate as for anything that is not proper TLS 1.3;
-    ///                            "BIO_read failed" or "BIO_write failed": OpenSSL's buffers failed
-    /// @throws ...                whatever the stream underneath throws, unchanged
+    /// @throws StreamIOException  "Invalid state for SSL stream operation": called before, or the stream was closed,
+    ///                            perhaps meanwhile. "EOF": the peer ended the connection. "SSL error " and a number of
+    ///                            SSL_get_error(3): TLS failed, 1 for a refused certificate as for anything that is not
+    ///                            proper TLS 1.3. "BIO_read failed" or "BIO_write failed": OpenSSL's buffers failed.
+    ///                            Whatever the stream underneath throws comes through unchanged.
     void handshake();
 
     /// Closes the stream underneath; whoever waits in it is woken. The peer sees the end of the stream. Never throws:
@@ -96,16 +98,16 @@ public:
     /// @throws StreamIOException  "Invalid state for SSL stream operation": no handshake yet, or closed; the stream is
     ///                            left as it was. "SSL error " and a number: 6 when the peer closed TLS, 1 for anything
     ///                            that does not belong into the stream; "SSL stream peer attempted renegotiation";
-    ///                            "BIO_write failed". After these the stream is closed.
-    /// @throws ...                whatever the stream underneath throws, unchanged; the stream is closed
+    ///                            "BIO_write failed". Whatever the stream underneath throws comes through unchanged.
+    ///                            After all but the first the stream is closed.
     std::size_t read(char* buffer, std::size_t length) override;
 
     /// Encrypts and writes all bytes.
     /// @throws StreamIOException  "Invalid state for SSL stream operation", as read(). "SSL error " and a number, such
     ///                            as 5 when the reading thread has met a fatal error meanwhile;
-    ///                            "SSL stream peer attempted renegotiation"; "BIO_read failed". After these the stream
-    ///                            is closed.
-    /// @throws ...                whatever the stream underneath throws, unchanged; the stream is closed
+    ///                            "SSL stream peer attempted renegotiation"; "BIO_read failed". Whatever the stream
+    ///                            underneath throws comes through unchanged. After all but the first the stream is
+    ///                            closed.
     void write(const char* buffer, std::size_t length) override;
 
     ~SSLStream() override;

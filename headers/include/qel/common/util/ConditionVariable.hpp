@@ -4,18 +4,16 @@
 
 #include <chrono>
 #include <condition_variable>
-#include <cstddef>
 #include <mutex>
 
 namespace qel {
 
 /// Where threads wait for other threads to change what a Mutex guards: a std::condition_variable that works with
-/// UniqueMutexLock, and that knows whether anybody waits. So whoever has nobody to wake can leave it out, and whoever
-/// has can decide it under the mutex and do it after giving the mutex back.
+/// UniqueMutexLock.
 ///
 /// Waits may end without cause, as those of the standard do: wait in a loop that looks at the condition again.
 /// Lifetime: must outlive every wait and every notify call.
-/// Thread safety: waits and hasWaiters() need the one mutex that goes with this object; the notify calls need none.
+/// Thread safety: all waits of one time need one and the same mutex; the notify calls need none.
 class ConditionVariable {
 public:
     ConditionVariable() = default;
@@ -23,11 +21,11 @@ public:
     ConditionVariable& operator=(const ConditionVariable&) = delete;
 
     /// Gives the mutex back, sleeps until woken, and takes the mutex again.
-    /// @param lock  held; the same mutex in every wait
+    /// @param lock  holds its mutex
     void wait(UniqueMutexLock& lock)
     {
-        Wait wait(*this, lock);
-        mCondition.wait(wait.mStdLock);
+        const Loan loan(lock);
+        mCondition.wait(*loan);
     }
 
     /// As wait(), but no longer than until the given time.
@@ -35,13 +33,9 @@ public:
     template <typename Clock, typename Duration>
     bool waitUntil(UniqueMutexLock& lock, const std::chrono::time_point<Clock, Duration>& deadline)
     {
-        Wait wait(*this, lock);
-        return mCondition.wait_until(wait.mStdLock, deadline) == std::cv_status::no_timeout;
+        const Loan loan(lock);
+        return mCondition.wait_until(*loan, deadline) == std::cv_status::no_timeout;
     }
-
-    /// @return whether any thread is inside a wait, those included that have been woken and do not hold the mutex yet.
-    /// Call it with the mutex held.
-    bool hasWaiters() const noexcept { return mWaiters != 0; }
 
     /// Wakes one of the threads that wait, if there is one.
     void notifyOne() noexcept { mCondition.notify_one(); }
@@ -49,27 +43,20 @@ public:
     void notifyAll() noexcept { mCondition.notify_all(); }
 
 private:
-    /// Counts one wait, and lends the mutex to the standard's condition variable for its length.
-    struct Wait {
-        Wait(ConditionVariable& condition, UniqueMutexLock& lock)
-            : mWaiters(condition.mWaiters), mStdLock(lock.mLock.mutex()->mMutex, std::adopt_lock)
-        {
-            ++mWaiters;
-        }
-        ~Wait()
-        {
-            --mWaiters;
-            mStdLock.release(); // still locked, and `lock` goes on holding it
-        }
-        Wait(const Wait&) = delete;
-        Wait& operator=(const Wait&) = delete;
+    /// Lends the mutex that a lock holds to the standard's condition variable, and takes it back still locked.
+    class Loan {
+    public:
+        explicit Loan(UniqueMutexLock& lock) : mLock(lock.mLock.mutex()->mMutex, std::adopt_lock) {}
+        ~Loan() { mLock.release(); }
+        Loan(const Loan&) = delete;
+        Loan& operator=(const Loan&) = delete;
+        std::unique_lock<std::mutex>& operator*() const { return mLock; }
 
-        std::size_t& mWaiters;
-        std::unique_lock<std::mutex> mStdLock;
+    private:
+        mutable std::unique_lock<std::mutex> mLock;
     };
 
     std::condition_variable mCondition;
-    std::size_t mWaiters = 0; // guarded by the mutex that the waits are given
 };
 
 } // namespace qel
