@@ -214,6 +214,21 @@ TEST(QelMessageQueueThreads, AProducerWhoseLogLineFailsMakesWayForAnother)
     failWhenLetIn(&ThrowingClock::failOnceAfter);
 }
 
+TEST(QelMessageQueueThreads, AShutdownWhoseLogLineFailsSendsEverybodyHomeAllTheSame)
+{
+    const CapturedLog log;
+    ThrowingClock clock;
+    QelMessageQueue queue(32);
+    queue.enqueue(sized(32));
+    std::thread producer([&] { EXPECT_EQ(queue.enqueue(sized(32), kBlocking), QelMessageQueue::SHUTDOWN); });
+    waitForSleepers(log, queue, 1);
+    clock.failOnceAfter(0);
+    EXPECT_THROW(queue.shutdown(), std::runtime_error);
+    producer.join();
+    EXPECT_TRUE(queue.isShutdown());
+    EXPECT_EQ(queue.waitForMsg(kForEver), nullptr);
+}
+
 // Consumers.
 
 TEST(QelMessageQueueThreads, AConsumerWaitsForAMessage)

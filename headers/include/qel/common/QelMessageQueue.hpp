@@ -90,6 +90,7 @@ public:
 
     /// Ends the work of this queue for good: producers and consumers that wait return now, later ones at once, and
     /// messages still in it stay there until it is destroyed. Further calls do nothing.
+    /// @throws what a substitute clock throws for the log line; the queue is shut down all the same
     void shutdown();
 
     /// @return whether shutdown() has been called. Takes no lock.
@@ -146,6 +147,7 @@ private:
     void pWaitForMsgLocked(UniqueMutexLock& lock, const std::chrono::milliseconds& timeout) QEL_REQUIRES(mLock);
     bool pHasEndedWaitLocked() const QEL_REQUIRES(mLock) { return mShutdown || !mQueue.empty(); }
     std::unique_ptr<QelMessage> pDequeueLocked() QEL_REQUIRES(mLock);
+    void pWakeEverybody() noexcept;
 
     // The lock guards all that follows; those who were claimed under it are woken after it is released.
     mutable Mutex mLock;
