@@ -3,7 +3,6 @@
 #include <qel/common/QelMessageVirtualSerial.hpp>
 
 #include "Contest.hpp"
-
 #include "messages.pb.h"
 #include "messages_generated.h"
 
@@ -45,58 +44,54 @@ const std::string& bytes(std::size_t length)
 /// Serial data for an operating system: few fields, most of the frame is data.
 struct SerialData {
     using Message = QelMessageVirtualSerialDataToOsAsync;
-    using Proto = proto::SerialData;
+    using Flat = flat::SerialData;
 
     static Message build() { return Message(kLparId, kConnection, kSerialDataLength, bytes(kSerialDataLength).data()); }
     static void read(const Message& message)
     {
-        benchmark::DoNotOptimize(message.getCallerId());
         benchmark::DoNotOptimize(message.getLpId());
         benchmark::DoNotOptimize(message.getVssConnectionNumber());
         benchmark::DoNotOptimize(message.getSerialDataLength());
         benchmark::DoNotOptimize(message.getSerialData());
     }
 
-    static void buildFlat(flatbuffers::FlatBufferBuilder& builder, std::uint32_t callerId)
+    static flatbuffers::Offset<Flat> buildFlat(flatbuffers::FlatBufferBuilder& builder)
     {
-        const auto data = builder.CreateVector(
-            reinterpret_cast<const std::uint8_t*>(bytes(kSerialDataLength).data()), kSerialDataLength);
-        builder.Finish(flat::CreateSerialData(builder, callerId, kLparId, kConnection, data));
+        const auto data = builder.CreateVector(reinterpret_cast<const std::uint8_t*>(bytes(kSerialDataLength).data()),
+                                               kSerialDataLength);
+        return flat::CreateSerialData(builder, kLparId, kConnection, data);
     }
-    static bool readFlat(const std::uint8_t* received, std::size_t length)
+    static void readFlat(const Flat& message)
     {
-        flatbuffers::Verifier verifier(received, length);
-        if (!verifier.VerifyBuffer<flat::SerialData>(nullptr)) return false;
-        const auto* const message = flatbuffers::GetRoot<flat::SerialData>(received);
-        benchmark::DoNotOptimize(message->caller_id());
-        benchmark::DoNotOptimize(message->lpar_id());
-        benchmark::DoNotOptimize(message->connection());
-        benchmark::DoNotOptimize(message->data()->size());
-        benchmark::DoNotOptimize(message->data()->data());
-        return true;
+        benchmark::DoNotOptimize(message.lpar_id());
+        benchmark::DoNotOptimize(message.connection());
+        benchmark::DoNotOptimize(message.data()->size());
+        benchmark::DoNotOptimize(message.data()->data());
     }
 
-    static void fillProto(Proto& message, std::uint32_t callerId)
+    static void fillProto(proto::Frame& frame)
     {
-        message.set_caller_id(callerId);
+        proto::SerialData& message = *frame.mutable_serial_data();
         message.set_lpar_id(kLparId);
         message.set_connection(kConnection);
         message.set_data(bytes(kSerialDataLength));
     }
-    static void readProto(const Proto& message)
+    static bool readProto(const proto::Frame& frame)
     {
-        benchmark::DoNotOptimize(message.caller_id());
+        if (!frame.has_serial_data()) return false;
+        const proto::SerialData& message = frame.serial_data();
         benchmark::DoNotOptimize(message.lpar_id());
         benchmark::DoNotOptimize(message.connection());
         benchmark::DoNotOptimize(message.data().size());
         benchmark::DoNotOptimize(message.data().data());
+        return true;
     }
 };
 
 /// A broadcast from one console to another: numbers, a text and data.
 struct Broadcast {
     using Message = QelMessageDaxBroadcastReq;
-    using Proto = proto::Broadcast;
+    using Flat = flat::Broadcast;
 
     static Message build()
     {
@@ -104,50 +99,65 @@ struct Broadcast {
     }
     static void read(const Message& message)
     {
-        benchmark::DoNotOptimize(message.getCallerId());
         benchmark::DoNotOptimize(message.getBroadcastMode());
         benchmark::DoNotOptimize(message.getToolType());
         benchmark::DoNotOptimize(message.getToolId());
         benchmark::DoNotOptimize(message.getDaxPacket());
     }
 
-    static void buildFlat(flatbuffers::FlatBufferBuilder& builder, std::uint32_t callerId)
+    static flatbuffers::Offset<Flat> buildFlat(flatbuffers::FlatBufferBuilder& builder)
     {
         const auto id = builder.CreateString(toolId());
-        const auto data =
-            builder.CreateVector(reinterpret_cast<const std::uint8_t*>(bytes(kBroadcastLength).data()), kBroadcastLength);
-        builder.Finish(flat::CreateBroadcast(builder, callerId, kBroadcastType, kToolType, id, data));
+        const auto data = builder.CreateVector(reinterpret_cast<const std::uint8_t*>(bytes(kBroadcastLength).data()),
+                                               kBroadcastLength);
+        return flat::CreateBroadcast(builder, kBroadcastType, kToolType, id, data);
     }
-    static bool readFlat(const std::uint8_t* received, std::size_t length)
+    static void readFlat(const Flat& message)
     {
-        flatbuffers::Verifier verifier(received, length);
-        if (!verifier.VerifyBuffer<flat::Broadcast>(nullptr)) return false;
-        const auto* const message = flatbuffers::GetRoot<flat::Broadcast>(received);
-        benchmark::DoNotOptimize(message->caller_id());
-        benchmark::DoNotOptimize(message->type());
-        benchmark::DoNotOptimize(message->tool_type());
-        benchmark::DoNotOptimize(message->tool_id()->str()); // a string of its own, as ours is
-        benchmark::DoNotOptimize(message->message()->data());
-        return true;
+        benchmark::DoNotOptimize(message.type());
+        benchmark::DoNotOptimize(message.tool_type());
+        benchmark::DoNotOptimize(message.tool_id()->str()); // a string of its own, as ours is
+        benchmark::DoNotOptimize(message.message()->data());
     }
 
-    static void fillProto(Proto& message, std::uint32_t callerId)
+    static void fillProto(proto::Frame& frame)
     {
-        message.set_caller_id(callerId);
+        proto::Broadcast& message = *frame.mutable_broadcast();
         message.set_type(kBroadcastType);
         message.set_tool_type(kToolType);
         message.set_tool_id(toolId());
         message.set_message(bytes(kBroadcastLength));
     }
-    static void readProto(const Proto& message)
+    static bool readProto(const proto::Frame& frame)
     {
-        benchmark::DoNotOptimize(message.caller_id());
+        if (!frame.has_broadcast()) return false;
+        const proto::Broadcast& message = frame.broadcast();
         benchmark::DoNotOptimize(message.type());
         benchmark::DoNotOptimize(message.tool_type());
         benchmark::DoNotOptimize(message.tool_id());
         benchmark::DoNotOptimize(message.message().data());
+        return true;
     }
 };
+
+// What every frame carries besides its body.
+constexpr std::uint8_t kFlags = QelMessageClassification::toFlags(QelMessageClassification::Request);
+
+template <typename Kind>
+void finishFlat(flatbuffers::FlatBufferBuilder& builder, std::uint32_t callerId)
+{
+    const auto body = Kind::buildFlat(builder).Union();
+    builder.Finish(
+        flat::CreateFrame(builder, callerId, kFlags, 0, 0, flat::BodyTraits<typename Kind::Flat>::enum_value, body));
+}
+
+template <typename Kind>
+void fillProto(proto::Frame& frame, std::uint32_t callerId)
+{
+    frame.set_caller_id(callerId);
+    frame.set_flags(kFlags);
+    Kind::fillProto(frame);
+}
 
 /// The frame as it is received.
 template <typename Kind>
@@ -156,6 +166,21 @@ std::vector<char> frameOf(benchmark::State& state)
     const typename Kind::Message message = Kind::build();
     if (message.msgLength() != kFrameLength) state.SkipWithError("the frame is not 100 bytes long");
     return std::vector<char>(message.serialize(), message.serialize() + message.msgLength());
+}
+
+// A received frame is an object of its class, in one block, and the bytes it owns, in another.
+template <typename Kind>
+void copyIntoTwoBlocks(benchmark::State& state)
+{
+    const std::vector<char> received = frameOf<Kind>(state);
+    for (auto _ : state) {
+        std::unique_ptr<char[]> object(new char[sizeof(typename Kind::Message)]);
+        benchmark::DoNotOptimize(object.get());
+        std::unique_ptr<char[]> copy(new char[received.size()]);
+        std::memcpy(copy.get(), received.data(), received.size());
+        benchmark::DoNotOptimize(copy.get());
+        benchmark::ClobberMemory();
+    }
 }
 
 // What no way of receiving or building can do without: memory of its own, and a copy.
@@ -179,34 +204,50 @@ void deserialiseOurs(benchmark::State& state)
     for (auto _ : state) {
         const std::unique_ptr<QelMessage> message =
             registry.deserialize(received.data(), static_cast<unsigned int>(received.size()));
+        benchmark::DoNotOptimize(message->getCallerId());
         Kind::read(static_cast<const typename Kind::Message&>(*message));
     }
+}
+
+template <typename Kind>
+bool readFlat(const std::uint8_t* received, std::size_t length)
+{
+    flatbuffers::Verifier verifier(received, length);
+    if (!verifier.VerifyBuffer<flat::Frame>(nullptr)) return false;
+    const auto* const frame = flatbuffers::GetRoot<flat::Frame>(received);
+    const auto* const message = frame->template body_as<typename Kind::Flat>();
+    if (message == nullptr) return false;
+    benchmark::DoNotOptimize(frame->caller_id());
+    Kind::readFlat(*message);
+    return true;
 }
 
 template <typename Kind>
 void deserialiseFlat(benchmark::State& state)
 {
     flatbuffers::FlatBufferBuilder builder;
-    Kind::buildFlat(builder, 1);
-    const std::vector<std::uint8_t> received(builder.GetBufferPointer(), builder.GetBufferPointer() + builder.GetSize());
+    finishFlat<Kind>(builder, 1);
+    const std::vector<std::uint8_t> received(builder.GetBufferPointer(),
+                                             builder.GetBufferPointer() + builder.GetSize());
     for (auto _ : state) {
         std::unique_ptr<std::uint8_t[]> copy(new std::uint8_t[received.size()]);
         std::memcpy(copy.get(), received.data(), received.size());
         benchmark::DoNotOptimize(copy.get());
-        if (!Kind::readFlat(copy.get(), received.size())) state.SkipWithError("not verified");
+        if (!readFlat<Kind>(copy.get(), received.size())) state.SkipWithError("not verified");
     }
 }
 
 template <typename Kind>
 void deserialiseProto(benchmark::State& state)
 {
-    typename Kind::Proto sent;
-    Kind::fillProto(sent, 1);
+    proto::Frame sent;
+    fillProto<Kind>(sent, 1);
     const std::string received = sent.SerializeAsString();
     for (auto _ : state) {
-        const auto message = std::make_unique<typename Kind::Proto>();
-        if (!message->ParseFromString(received)) state.SkipWithError("not parsed");
-        Kind::readProto(*message);
+        const auto frame = std::make_unique<proto::Frame>();
+        if (!frame->ParseFromString(received)) state.SkipWithError("not parsed");
+        benchmark::DoNotOptimize(frame->caller_id());
+        if (!Kind::readProto(*frame)) state.SkipWithError("another message");
     }
 }
 
@@ -227,7 +268,7 @@ void buildFlatReused(benchmark::State& state)
     std::uint32_t callerId = 0;
     for (auto _ : state) {
         builder.Clear();
-        Kind::buildFlat(builder, ++callerId);
+        finishFlat<Kind>(builder, ++callerId);
         benchmark::DoNotOptimize(builder.GetBufferPointer());
         benchmark::ClobberMemory();
     }
@@ -236,13 +277,13 @@ void buildFlatReused(benchmark::State& state)
 template <typename Kind>
 void buildProtoReused(benchmark::State& state)
 {
-    typename Kind::Proto message;
+    proto::Frame frame;
     std::string serialised;
     std::uint32_t callerId = 0;
     for (auto _ : state) {
-        message.Clear();
-        Kind::fillProto(message, ++callerId);
-        message.SerializeToString(&serialised);
+        frame.Clear();
+        fillProto<Kind>(frame, ++callerId);
+        frame.SerializeToString(&serialised);
         benchmark::DoNotOptimize(serialised.data());
         benchmark::ClobberMemory();
     }
@@ -282,7 +323,8 @@ void printInto(benchmark::State& state, const Print& print)
     const SerialData::Message message = SerialData::build();
     DroppingBuffer buffer;
     std::ostream os(&buffer);
-    for (auto _ : state) print(os, message);
+    for (auto _ : state)
+        print(os, message);
 }
 
 void printId(benchmark::State& state)
@@ -300,13 +342,12 @@ void printIdByC(benchmark::State& state)
 {
     printInto(state, [](std::ostream& os, const QelMessage& message) {
         char text[128];
-        const int length = std::snprintf(text, sizeof(text),
-                                         "[CID: 0x%08X, FN: 0x%04X, OP: 0x%04X, FL: 0x%02X, DL: %u, ST: 0x%08X:%04X]",
-                                         message.getCallerId(), static_cast<unsigned>(message.getFunction()),
-                                         static_cast<unsigned>(message.getOperation()),
-                                         static_cast<unsigned>(message.getFlags()), message.dataLength(),
-                                         static_cast<unsigned>(message.getStatus()),
-                                         static_cast<unsigned>(message.getStatusDetail()));
+        const int length = std::snprintf(
+            text, sizeof(text), "[CID: 0x%08X, FN: 0x%04X, OP: 0x%04X, FL: 0x%02X, DL: %u, ST: 0x%08X:%04X]",
+            message.getCallerId(), static_cast<unsigned>(message.getFunction()),
+            static_cast<unsigned>(message.getOperation()), static_cast<unsigned>(message.getFlags()),
+            message.dataLength(), static_cast<unsigned>(message.getStatus()),
+            static_cast<unsigned>(message.getStatusDetail()));
         os.write(text, length);
     });
 }
@@ -330,6 +371,7 @@ void addMessageContests(const std::string& kind)
     contest("deserialise 100 bytes, read 5 fields: " + kind)
         .ours(deserialiseOurs<Kind>)
         .floor("a copy into new memory", 0, copyIntoNewMemory<Kind>)
+        .peer("two blocks of memory and a copy", 0, copyIntoTwoBlocks<Kind>)
         .peer("FlatBuffers: copy, verify, read", 1.0, deserialiseFlat<Kind>)
         .peer("protobuf: a fresh object", 0.4, deserialiseProto<Kind>);
     contest("build 100 bytes from arguments: " + kind)
