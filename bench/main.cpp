@@ -115,6 +115,7 @@ int main(int argc, char** argv)
     qel::bench::addFrameContests();
     qel::bench::addLoggingContests(memory, disk);
     qel::bench::addTransportContests();
+    qel::bench::addTlsContests();
     qel::bench::addQueueContests();
 
     RoundCollector rounds;

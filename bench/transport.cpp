@@ -3,16 +3,12 @@
 #include <qel/common/io/QelMessageStream.hpp>
 #include <qel/common/io/Stream.hpp>
 #include <qel/common/io/StreamIOException.hpp>
-#include <qel/common/net/IPEndpoint.hpp>
-#include <qel/common/net/Listen.hpp>
-#include <qel/common/net/Socket.hpp>
-#include <qel/common/net/SocketStream.hpp>
 
 #include "Contest.hpp"
+#include "Loopback.hpp"
 
 #include <boost/asio.hpp>
-#include <chrono>
-#include <cstring>
+#include <cstddef>
 #include <memory>
 #include <stdexcept>
 #include <string>
@@ -25,36 +21,7 @@ namespace qel::bench {
 
 namespace {
 
-constexpr std::size_t kPrefix = 8; // what is read first: it tells the length of the frame
 constexpr std::size_t kShortest = 40;
-constexpr std::size_t kFixedPart = 38; // of a serial-data frame: header, address and length
-
-/// A frame of exactly so many bytes.
-std::unique_ptr<QelMessage> messageOf(std::size_t length)
-{
-    const std::vector<char> data(length - kFixedPart, 'x');
-    return std::make_unique<QelMessageVirtualSerialDataToOsAsync>(static_cast<std::uint16_t>(1),
-                                                                  static_cast<std::uint16_t>(0),
-                                                                  static_cast<std::uint16_t>(data.size()), data.data());
-}
-
-/// Both ends of a TCP connection over loopback, tuned as the library tunes them.
-struct TcpPair {
-    TcpPair()
-    {
-        Socket listener = listenOn(IPEndpoint("127.0.0.1:0"), 1);
-        Socket connecting(IPFamily::IPv4, SOCK_STREAM | SOCK_CLOEXEC, 0);
-        connecting.connect(listener.getSocketName(), std::chrono::seconds(5));
-        near = std::make_unique<SocketStream>(std::move(connecting));
-        far = std::make_unique<SocketStream>(listener.accept());
-    }
-
-    int nearFd() const { return near->getSocket().getFd(); }
-    int farFd() const { return far->getSocket().getFd(); }
-
-    std::unique_ptr<SocketStream> near;
-    std::unique_ptr<SocketStream> far;
-};
 
 void readAll(int descriptor, char* buffer, std::size_t length)
 {
@@ -74,13 +41,6 @@ void sendAll(int descriptor, const char* buffer, std::size_t length)
         buffer += count;
         length -= static_cast<std::size_t>(count);
     }
-}
-
-std::size_t frameLength(const char* prefix)
-{
-    be_uint32_t length;
-    std::memcpy(&length, prefix + 4, sizeof(length));
-    return length;
 }
 
 /// A stream over a descriptor and nothing more: what the message stream costs without the care of SocketStream.
@@ -158,24 +118,6 @@ struct AsioPair {
     boost::asio::ip::tcp::socket near;
     boost::asio::ip::tcp::socket far;
 };
-
-/// What a program that uses Boost.Asio would receive into: a message that owns its bytes.
-struct OwnedMessage {
-    std::unique_ptr<char[]> bytes;
-    std::size_t length;
-};
-
-std::unique_ptr<OwnedMessage> asioRead(boost::asio::ip::tcp::socket& socket)
-{
-    char prefix[kPrefix];
-    boost::asio::read(socket, boost::asio::buffer(prefix, kPrefix));
-    auto message = std::make_unique<OwnedMessage>();
-    message->length = frameLength(prefix);
-    message->bytes.reset(new char[message->length]);
-    std::memcpy(message->bytes.get(), prefix, kPrefix);
-    boost::asio::read(socket, boost::asio::buffer(message->bytes.get() + kPrefix, message->length - kPrefix));
-    return message;
-}
 
 void asioOneWay(benchmark::State& state, std::size_t length)
 {
