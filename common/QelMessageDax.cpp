@@ -2,6 +2,8 @@
 #include <qel/common/QelMessageInterfaceComponent.hpp>
 #include <qel/common/StreamFormatters.hpp>
 
+#include "WireChecks.hpp"
+
 #include <cstring>
 #include <ostream>
 #include <stdexcept>
@@ -11,15 +13,6 @@ namespace qel {
 namespace {
 
 using OutboundData = QelMessageDaxBroadcastOutboundAsync::Data;
-
-void require(bool condition, const char* phrase)
-{
-    if (!condition) throw QelMessageValidationException(phrase);
-}
-
-// The length field is 16 bits wide, and an id of 65536 bytes or more wraps in it. What is checked and copied is what
-// the peer will see.
-std::uint16_t wireLength(const std::string& toolId) { return static_cast<std::uint16_t>(toolId.size()); }
 
 // The checks of the arguments give the payload length: they run before there is a frame, and before a caller id is
 // taken.

@@ -1,6 +1,8 @@
 #include <qel/common/QelMessageInterfaceComponent.hpp>
 #include <qel/common/StreamFormatters.hpp>
 
+#include "WireChecks.hpp"
+
 #include <algorithm>
 #include <cstring>
 #include <ostream>
@@ -12,16 +14,7 @@ namespace {
 
 constexpr const char* kPayloadTooShort = "dataLength smaller than minimum acceptable size";
 
-void require(bool condition, const char* phrase)
-{
-    if (!condition) throw QelMessageValidationException(phrase);
-}
-
 void copyText(char* field, const std::string& text) { std::memcpy(field, text.data(), text.size()); }
-
-// The length fields are 16 bits wide, and a text of 65536 bytes or more wraps in them. The peer sees the wrapped number
-// only, so whatever is checked or copied by that number must use it too.
-std::uint16_t wireLength(const std::string& text) { return static_cast<std::uint16_t>(text.size()); }
 
 // The checks of a builder's arguments stand in functions that give the payload length: they run before there is a
 // frame, and before a caller id is taken.

@@ -1,6 +1,8 @@
 #include <qel/common/QelMessageVirtualSerial.hpp>
 #include <qel/common/StreamFormatters.hpp>
 
+#include "WireChecks.hpp"
+
 #include <cstring>
 #include <ostream>
 #include <stdexcept>
@@ -9,10 +11,7 @@ namespace qel {
 
 namespace {
 
-void require(bool payloadIsLongEnough)
-{
-    if (!payloadIsLongEnough) throw QelMessageValidationException("dataLength shorter than actual data size");
-}
+constexpr const char* kPayloadTooShort = "dataLength shorter than actual data size";
 
 // The check of a data message's arguments gives the payload length: it runs before there is a frame, and before a
 // caller id is taken.
@@ -50,7 +49,7 @@ QelMessageVirtualSerialOpenReq::QelMessageVirtualSerialOpenReq(std::uint16_t lpI
 QelMessageVirtualSerialOpenReq::QelMessageVirtualSerialOpenReq(const char* i_buffer, unsigned int i_length)
     : QelMessageMetadata(i_buffer, i_length)
 {
-    require(dataLength() >= sizeof(Data));
+    require(dataLength() >= sizeof(Data), kPayloadTooShort);
 }
 
 QelMessageVirtualSerialOpenReq::~QelMessageVirtualSerialOpenReq() = default;
@@ -73,7 +72,7 @@ QelMessageVirtualSerialOpenRsp::QelMessageVirtualSerialOpenRsp(std::uint32_t cal
 QelMessageVirtualSerialOpenRsp::QelMessageVirtualSerialOpenRsp(const char* i_buffer, unsigned int i_length)
     : QelMessageMetadata(i_buffer, i_length)
 {
-    require(dataLength() >= sizeof(Data));
+    require(dataLength() >= sizeof(Data), kPayloadTooShort);
 }
 
 QelMessageVirtualSerialOpenRsp::~QelMessageVirtualSerialOpenRsp() = default;
@@ -95,7 +94,7 @@ QelMessageVirtualSerialCloseReq::QelMessageVirtualSerialCloseReq(std::uint16_t l
 QelMessageVirtualSerialCloseReq::QelMessageVirtualSerialCloseReq(const char* i_buffer, unsigned int i_length)
     : QelMessageMetadata(i_buffer, i_length)
 {
-    require(dataLength() >= sizeof(Data));
+    require(dataLength() >= sizeof(Data), kPayloadTooShort);
 }
 
 QelMessageVirtualSerialCloseReq::~QelMessageVirtualSerialCloseReq() = default;
@@ -126,7 +125,7 @@ QelMessageVirtualSerialGetMaxSessionsRsp::QelMessageVirtualSerialGetMaxSessionsR
                                                                                    unsigned int i_length)
     : QelMessageMetadata(i_buffer, i_length)
 {
-    require(dataLength() >= sizeof(Data));
+    require(dataLength() >= sizeof(Data), kPayloadTooShort);
 }
 
 QelMessageVirtualSerialGetMaxSessionsRsp::~QelMessageVirtualSerialGetMaxSessionsRsp() = default;
@@ -157,8 +156,8 @@ QelMessageVirtualSerialDataAsync<Derived, FunctionCode, OpType>::QelMessageVirtu
                                                                                                   unsigned int i_length)
     : Metadata(i_buffer, i_length)
 {
-    require(this->dataLength() >= sizeof(Data));
-    require(getSerialDataLength() <= this->dataLength() - sizeof(Data));
+    require(this->dataLength() >= sizeof(Data), kPayloadTooShort);
+    require(getSerialDataLength() <= this->dataLength() - sizeof(Data), kPayloadTooShort);
 }
 
 template <typename Derived, QelMessageFunctionCodes FunctionCode, QelMessageOpTypes OpType>
@@ -216,7 +215,7 @@ QelMessageVirtualSerialSetupSessionReq::QelMessageVirtualSerialSetupSessionReq(c
                                                                                unsigned int i_length)
     : QelMessageMetadata(i_buffer, i_length)
 {
-    require(dataLength() >= sizeof(Data));
+    require(dataLength() >= sizeof(Data), kPayloadTooShort);
 }
 
 QelMessageVirtualSerialSetupSessionReq::~QelMessageVirtualSerialSetupSessionReq() = default;
@@ -242,7 +241,7 @@ QelMessageVirtualSerialSessionClosedAsync::QelMessageVirtualSerialSessionClosedA
                                                                                      unsigned int i_length)
     : QelMessageMetadata(i_buffer, i_length)
 {
-    require(dataLength() >= sizeof(Data));
+    require(dataLength() >= sizeof(Data), kPayloadTooShort);
 }
 
 QelMessageVirtualSerialSessionClosedAsync::~QelMessageVirtualSerialSessionClosedAsync() = default;
