@@ -95,6 +95,11 @@ takes "$major.999" && fail "the package takes a newer minor version"
 PKG_CONFIG_PATH="$pcdir"
 export PKG_CONFIG_PATH
 [ "$(pkg-config --modversion qel)" = "$version" ] || fail "pkg-config tells another version"
+# Before glibc 2.34 the functions for threads are in a library of their own.
+case " $(pkg-config --libs qel) " in
+*" -pthread "*) ;;
+*) fail "pkg-config does not name the threads of the C library" ;;
+esac
 eval "set -- $(pkg-config --cflags --libs qel)" # pkg-config writes words for a shell
 # shellcheck disable=SC2086 # CXXFLAGS are several words
 quietly "$cxx" -std=c++17 ${CXXFLAGS-} "$source/examples/send_receive.cpp" -o "$work/by-pkg-config" "$@"
