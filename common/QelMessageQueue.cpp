@@ -146,7 +146,8 @@ void QelMessageQueue::pWaitForMsgLocked(UniqueMutexLock& lock, const std::chrono
             mDequeueWaiter.wait(lock);
         return;
     }
-    // The real clock: the thread sleeps in real time, whatever a substitute says.
+    // The one clock here that is not read through TimeProvider: the thread sleeps in real time, so its deadline must be
+    // of real time as well. By a substitute that stands still, or runs elsewhere, it would wake at once or never.
     const auto deadline = std::chrono::steady_clock::now() + timeout;
     while (!pHasEndedWaitLocked()) {
         if (!mDequeueWaiter.waitUntil(lock, deadline)) return; // a message may have come at the last moment
