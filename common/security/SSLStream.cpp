@@ -92,7 +92,7 @@ std::unique_ptr<SSLCertificate> SSLStream::getPeerCertificate() const
         certificate.reset(SSL_get_peer_certificate(mSSL.get()));
     }
     if (certificate == nullptr) return nullptr;
-    const auto write = [&certificate](BIO* bio) { return PEM_write_bio_X509(bio, certificate.get()) == 1; };
+    const auto write = [&certificate](BIO* bio) { checkSSL(PEM_write_bio_X509(bio, certificate.get()) == 1); };
     return std::make_unique<SSLCertificate>(writePEM(write));
 }
 

@@ -50,6 +50,7 @@ QEL_TEST_CALL(int, BIO_new_bio_pair, (BIO * *first, std::size_t firstBytes, BIO*
               first, firstBytes, second, secondBytes)
 QEL_TEST_CALL(int, BIO_read, (BIO * bio, void* buffer, int length), bio, buffer, length)
 QEL_TEST_CALL(int, BIO_write, (BIO * bio, const void* buffer, int length), bio, buffer, length)
+QEL_TEST_CALL(int, PEM_write_bio_X509, (BIO * bio, qel::test::WrittenCertificate certificate), bio, certificate)
 QEL_TEST_CALL(int, SSL_get_error, (const SSL* ssl, int result), ssl, result)
 QEL_TEST_CALL(int, SSL_read, (SSL * ssl, void* buffer, int length), ssl, buffer, length)
 QEL_TEST_CALL(int, SSL_write, (SSL * ssl, const void* buffer, int length), ssl, buffer, length)

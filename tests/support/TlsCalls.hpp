@@ -3,9 +3,21 @@
 #include <cstddef>
 #include <functional>
 #include <openssl/bio.h>
+#include <openssl/pem.h>
 #include <openssl/ssl.h>
 
 namespace qel::test {
+
+template <typename Function>
+struct SecondParameter;
+
+template <typename Result, typename First, typename Second>
+struct SecondParameter<Result(First, Second)> {
+    using Type = Second;
+};
+
+/// A certificate that is to be written: const in OpenSSL 3, not in 1.1.1.
+using WrittenCertificate = SecondParameter<decltype(::PEM_write_bio_X509)>::Type;
 
 /// Stands in for calls of OpenSSL, as SystemCalls does for those of the system: to reach failures that OpenSSL has no
 /// way to be driven into from outside. A test program that links TlsCalls.cpp defines these functions itself; the
@@ -25,6 +37,7 @@ public:
     std::function<int(BIO** first, std::size_t firstBytes, BIO** second, std::size_t secondBytes)> BIO_new_bio_pair;
     std::function<int(BIO* bio, void* buffer, int length)> BIO_read;
     std::function<int(BIO* bio, const void* buffer, int length)> BIO_write;
+    std::function<int(BIO* bio, WrittenCertificate certificate)> PEM_write_bio_X509;
     std::function<int(const SSL* ssl, int result)> SSL_get_error;
     std::function<int(SSL* ssl, void* buffer, int length)> SSL_read;
     std::function<int(SSL* ssl, const void* buffer, int length)> SSL_write;
