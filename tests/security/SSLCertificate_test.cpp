@@ -316,6 +316,15 @@ TEST(SSLCertificateSubject, ReadsAFieldOfManyNumbers)
     EXPECT_EQ(certificate.getSubject(), (SSLSubject{{numbers, "a"}}));
 }
 
+TEST(SSLCertificateSubject, ReadsAFieldThatHasNoShortName)
+{
+    const char* const numbers = "1.2.3.4.6";
+    static const int nid = OBJ_create(numbers, nullptr, "a long name only"); // stays for the rest of the program
+    ASSERT_NE(nid, NID_undef);
+    const SSLCertificate certificate(SSLSubject{{numbers, "a"}}, kPeriod);
+    EXPECT_EQ(certificate.getSubject(), (SSLSubject{{numbers, "a"}}));
+}
+
 TEST(SSLCertificateSubject, ReportsAValueThatIsNoText)
 {
     const SSLCertificate certificate = changed([](X509* x509) {
