@@ -37,8 +37,13 @@ void SSLException::flushErrorQueue()
     // would go over all its places.
     const char* file = nullptr;
     int line = 0;
-    while (const unsigned long code = ERR_get_error_line(&file, &line))
-        logError(file, line, code);
+    try {
+        while (const unsigned long code = ERR_get_error_line(&file, &line))
+            logError(file, line, code);
+    } catch (...) {
+        ERR_clear_error();
+        throw;
+    }
 }
 
 } // namespace qel

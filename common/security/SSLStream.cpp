@@ -66,14 +66,24 @@ std::size_t SSLStream::read(char* buffer, std::size_t length)
 {
     UniqueMutexLock lock(mLock);
     pCheckStatusLocked(STATUS_ENCRYPTED);
-    return pRead(lock, buffer, length);
+    try {
+        return pRead(lock, buffer, length);
+    } catch (...) {
+        pEnd(lock);
+        throw;
+    }
 }
 
 void SSLStream::write(const char* buffer, std::size_t length)
 {
     UniqueMutexLock lock(mLock);
     pCheckStatusLocked(STATUS_ENCRYPTED);
-    pWrite(lock, buffer, length);
+    try {
+        pWrite(lock, buffer, length);
+    } catch (...) {
+        pEnd(lock);
+        throw;
+    }
 }
 
 SSLStream::Status SSLStream::getStatus() const
@@ -109,8 +119,7 @@ void SSLStream::handshake()
     try {
         pHandshake(lock);
     } catch (...) {
-        pRelock(lock);
-        pCloseLocked();
+        pEnd(lock);
         throw; // not a copy: the cause may be nested inside
     }
 }
@@ -139,11 +148,19 @@ void SSLStream::pHandshake(UniqueMutexLock& lock)
     mStatus = STATUS_ENCRYPTED;
 }
 
+/// Leaves the stream closed when an exception is on its way out. Most exceptions come from where it has been closed
+/// already, but not all: a line of log may fail, since a substitute clock may throw, in front of anything.
 // Exempt from the analysis: whether the lock is held is known only at run time, when an exception has come from either
 // side of the end of the stream.
-void SSLStream::pRelock(UniqueMutexLock& lock) QEL_NO_THREAD_SAFETY_ANALYSIS
+void SSLStream::pEnd(UniqueMutexLock& lock) QEL_NO_THREAD_SAFETY_ANALYSIS
 {
     if (!lock.ownsLock()) lock.lock();
+    if (mStatus != STATUS_CLOSED) pCloseLocked();
+    try {
+        SSLException::flushErrorQueue();
+    } catch (...) {
+        // The queue is empty all the same, and the first exception is the one to know of.
+    }
 }
 
 void SSLStream::pCheckStatusLocked(Status status) const

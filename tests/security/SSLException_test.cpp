@@ -2,6 +2,7 @@
 #include <qel/common/security/SSLException.hpp>
 
 #include "support/CapturedLog.hpp"
+#include "support/ThrowingClock.hpp"
 
 #include <array>
 #include <gmock/gmock.h>
@@ -16,6 +17,7 @@ namespace qel {
 namespace {
 
 using test::CapturedLog;
+using test::ThrowingClock;
 using ::testing::ElementsAre;
 using ::testing::IsEmpty;
 
@@ -103,6 +105,21 @@ TEST(SSLErrorQueue, IsEmptiedWhenItWasFull)
     EXPECT_EQ(ERR_peek_error(), 0UL);
     ASSERT_FALSE(log.lines().empty());
     EXPECT_EQ(log.lines().back(), "E: [libssl] many.c:100: " + errorText(kMoreThanItHolds));
+}
+
+TEST(SSLErrorQueue, IsEmptiedEvenWhenALineCannotBeWritten)
+{
+    const CapturedLog log;
+    ThrowingClock clock;
+    for (const int linesBefore : {0, 1, 2}) {
+        SCOPED_TRACE(linesBefore);
+        putError(1, "first.c", 11);
+        putError(2, "second.c", 12);
+        putError(3, "third.c", 13);
+        clock.failOnceAfter(linesBefore);
+        EXPECT_THROW(SSLException::flushErrorQueue(), std::runtime_error);
+        EXPECT_EQ(ERR_peek_error(), 0UL);
+    }
 }
 
 TEST(SSLErrorQueue, OfAnotherThreadIsNotTouched)

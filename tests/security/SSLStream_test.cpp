@@ -12,6 +12,7 @@
 #include "support/CapturedLog.hpp"
 #include "support/HookedStream.hpp"
 #include "support/MemoryStreamPair.hpp"
+#include "support/ThrowingClock.hpp"
 #include "support/TlsCalls.hpp"
 #include "support/TlsKit.hpp"
 
@@ -50,6 +51,7 @@ using test::readExactly;
 using test::readSome;
 using test::runEnds;
 using test::serverContext;
+using test::ThrowingClock;
 using test::TlsCalls;
 using test::writeText;
 using ::testing::Contains;
@@ -862,6 +864,79 @@ TEST_F(EncryptedPair, AFailureToPutCiphertextIntoTheBufferIsFatal)
     EXPECT_EQ(mClient.getStatus(), SSLStream::STATUS_CLOSED);
     EXPECT_EQ(mMemory.client().closeCount(), 1U);
 }
+
+// Lines of log that cannot be written
+
+class SSLStreamWithoutClock : public EncryptedPair {
+protected:
+    /// No line of log can be written while this is done. It fails for that reason and leaves the client closed.
+    void expectClosedBy(const std::function<void()>& work)
+    {
+        ThrowingClock clock;
+        clock.failAfter(0);
+        const Outcome outcome = here(work);
+        clock.work();
+        EXPECT_EQ(outcome.failure, "std::exception: clock");
+        EXPECT_THAT(outcome.log, IsEmpty());
+        EXPECT_EQ(mClient.getStatus(), SSLStream::STATUS_CLOSED);
+        EXPECT_EQ(mMemory.client().closeCount(), 1U);
+        EXPECT_EQ(here([this] { readSome(mClient, 1); }).failure, kInvalidState);
+    }
+};
+
+TEST_F(SSLStreamWithoutClock, AFatalErrorOfReadingClosesAllTheSame)
+{
+    mMemory.client().deliver(std::string(100, 'x'));
+    expectClosedBy([this] { readSome(mClient, 1); });
+}
+
+TEST_F(SSLStreamWithoutClock, AFatalErrorOfWritingClosesAllTheSame)
+{
+    TlsCalls calls;
+    calls.SSL_write = [](SSL*, const void*, int) {
+        spoilErrorQueue();
+        return -1;
+    };
+    calls.SSL_get_error = [](const SSL*, int) { return SSL_ERROR_SSL; };
+    expectClosedBy([this] { writeText(mClient, "x"); });
+}
+
+TEST_F(SSLStreamWithoutClock, RefusingRenegotiationClosesAllTheSame)
+{
+    TlsCalls calls;
+    calls.SSL_get_error = [](const SSL*, int) { return SSL_ERROR_WANT_READ; };
+    expectClosedBy([this] { writeText(mClient, "x"); });
+}
+
+TEST_F(SSLStreamWithoutClock, AFailureToTakeCiphertextFromTheBufferClosesAllTheSame)
+{
+    TlsCalls calls;
+    calls.BIO_read = [](BIO*, void*, int) {
+        spoilErrorQueue();
+        spoilErrorQueue();
+        return -1;
+    };
+    expectClosedBy([this] { writeText(mClient, "x"); });
+}
+
+TEST_F(SSLStreamWithoutClock, DataThatARefusedLineOfLogHasLostIsTheEnd)
+{
+    writeText(mServer, "hello"); // whoever went on behind it would take what comes next for it
+    expectClosedBy([this] { readSome(mClient, 10); });
+}
+
+TEST_F(SSLStreamPair, AHandshakeWhoseFailureCannotBeLoggedLeavesNothingBehind)
+{
+    mMemory.client().deliver(std::string(100, 'x'));
+    ThrowingClock clock;
+    clock.failAfter(0);
+    EXPECT_EQ(here([this] { mClient.handshake(); }).failure, "std::exception: clock");
+    clock.work();
+    EXPECT_EQ(mClient.getStatus(), SSLStream::STATUS_CLOSED);
+    EXPECT_GE(mMemory.client().closeCount(), 1U);
+}
+
+// The error queue
 
 TEST_F(SSLStreamPair, StaleEntriesOfTheErrorQueueAttachToNoCall)
 {

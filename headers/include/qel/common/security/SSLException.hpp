@@ -33,6 +33,7 @@ public:
     /// Call it before each TLS operation as well as after a failed one: with a stale entry in the queue,
     /// SSL_get_error(3) reports a failure that did not happen.
     /// Thread safety: every thread has a queue of its own, and this touches no other.
+    /// @throws what a substitute clock throws for a line of log; the queue is empty all the same
     static void flushErrorQueue();
 };
 

@@ -74,7 +74,9 @@ public:
     ///                            perhaps meanwhile. "EOF": the peer ended the connection. "SSL error " and a number of
     ///                            SSL_get_error(3): TLS failed, 1 for a refused certificate as for anything that is not
     ///                            proper TLS 1.3. "BIO_read failed" or "BIO_write failed": OpenSSL's buffers failed.
-    ///                            Whatever the stream underneath throws comes through unchanged.
+    ///                            "SSL stream peer attempted renegotiation", as read() and write().
+    ///                            Whatever the stream underneath throws comes through unchanged, and so does what a
+    ///                            substitute clock throws for a line of log.
     void handshake();
 
     /// Closes the stream underneath; whoever waits in it is woken. The peer sees the end of the stream. Never throws:
@@ -98,16 +100,18 @@ public:
     /// @throws StreamIOException  "Invalid state for SSL stream operation": no handshake yet, or closed; the stream is
     ///                            left as it was. "SSL error " and a number: 6 when the peer closed TLS, 1 for anything
     ///                            that does not belong into the stream; "SSL stream peer attempted renegotiation";
-    ///                            "BIO_write failed". Whatever the stream underneath throws comes through unchanged.
-    ///                            After all but the first the stream is closed.
+    ///                            "BIO_write failed". Whatever the stream underneath throws comes through unchanged,
+    ///                            and so does what a substitute clock throws for a line of log. After all but the
+    ///                            first the stream is closed.
     std::size_t read(char* buffer, std::size_t length) override;
 
-    /// Encrypts and writes all bytes.
+    /// Encrypts and writes all bytes. For length 0 nothing is sent.
+    /// @param buffer  length bytes, borrowed for the call
     /// @throws StreamIOException  "Invalid state for SSL stream operation", as read(). "SSL error " and a number, such
     ///                            as 5 when the reading thread has met a fatal error meanwhile;
     ///                            "SSL stream peer attempted renegotiation"; "BIO_read failed". Whatever the stream
-    ///                            underneath throws comes through unchanged. After all but the first the stream is
-    ///                            closed.
+    ///                            underneath throws comes through unchanged, and so does what a substitute clock
+    ///                            throws for a line of log. After all but the first the stream is closed.
     void write(const char* buffer, std::size_t length) override;
 
     ~SSLStream() override;
@@ -127,7 +131,7 @@ public:
 
 private:
     void pHandshake(UniqueMutexLock& lock) QEL_REQUIRES(mLock);
-    void pRelock(UniqueMutexLock& lock) QEL_ACQUIRE(mLock);
+    void pEnd(UniqueMutexLock& lock) QEL_ACQUIRE(mLock);
     void pCheckStatusLocked(Status status) const QEL_REQUIRES(mLock);
     void pCloseLocked() noexcept QEL_REQUIRES(mLock);
     int pHandleErrorLocked(int result) QEL_REQUIRES(mLock);
