@@ -21,6 +21,7 @@
 #include <set>
 #include <stdexcept>
 #include <string>
+#include <thread>
 #include <type_traits>
 #include <utility>
 #include <vector>
@@ -820,6 +821,28 @@ TEST(SSLCertificateSigning, LeavesTheRequestAsItIs)
     sharedRoot().sign(request, kPeriod);
     EXPECT_EQ(request.getPEM(), trusted().clientRequest().getPEM());
     EXPECT_EQ(request.getPrivateKey()->getPEM(), trusted().clientRequest().getPrivateKey()->getPEM());
+}
+
+TEST(SSLCertificateSigning, IsDoneByManyThreadsAtTheSameTime)
+{
+    constexpr int kThreads = 4;
+    constexpr int kRounds = 10;
+    SSLCertificateRequest request = copyOf(trusted().clientRequest()); // only read
+    const SSLCertificate& root = sharedRoot();
+    const std::string pem = root.getPEM();
+    std::vector<std::thread> threads;
+    for (int i = 0; i < kThreads; ++i)
+        threads.emplace_back([&] {
+            for (int round = 0; round < kRounds; ++round) {
+                const SSLCertificate issued = root.sign(request, kPeriod);
+                EXPECT_TRUE(isSignedBy(issued, *root.getPrivateKey()));
+                EXPECT_EQ(SSLCertificate(root).getPEM(), pem);
+                EXPECT_EQ(root.getSubject(), issued.getIssuer());
+            }
+        });
+    for (std::thread& thread : threads)
+        thread.join();
+    EXPECT_EQ(request.getPEM(), trusted().clientRequest().getPEM());
 }
 
 TEST(SSLCertificateSigning, NeedsAPrivateKey)

@@ -111,6 +111,8 @@ const Identity kExpired = Identity::Expired;
 const Identity kNotYetValid = Identity::NotYetValid;
 const Identity kOtherRoot = Identity::OtherRoot;
 const Identity kWithSubjectOfRoot = Identity::WithSubjectOfRoot;
+const Identity kWithKeyOfAnother = Identity::WithKeyOfAnother;
+const Identity kStranger = Identity::Stranger;
 
 /// The server refuses the client, for whom the TLS handshake is over by then.
 CredentialsRow refusedClient(const std::string& name, const Identity* client, long reason)
@@ -137,6 +139,10 @@ std::vector<CredentialsRow> credentialsRows()
         refusedServer("BothExpired", &kExpired, &kExpired, X509_V_ERR_CERT_HAS_EXPIRED),
         // The server sends its root along, and the client trusts nobody.
         refusedServer("ClientWithoutCredentials", nullptr, &kServer, X509_V_ERR_SELF_SIGNED_CERT_IN_CHAIN),
+        refusedServer("ClientOfAnotherAuthority", &kStranger, &kServer, X509_V_ERR_SELF_SIGNED_CERT_IN_CHAIN),
+        // Their own credentials were refused. Nobody's certificate is, so no line says that one was.
+        {"ClientWithoutCertificate", &kWithKeyOfAnother, &kServer, kEOF, endedAfterHandshake(), kSSLError1, kRefusal},
+        {"ServerWithoutCertificate", &kClient, &kWithKeyOfAnother, kEOF, {kEOFInHandshake}, kSSLError1, kRefusal},
         {"ServerWithoutCredentials", &kClient, nullptr, kEOF, {kEOFInHandshake}, kSSLError1, kRefusal},
         {"NobodyHasCredentials", nullptr, nullptr, kEOF, {kEOFInHandshake}, kSSLError1, kRefusal},
     };

@@ -40,6 +40,7 @@ using test::CapturedLog;
 using test::clientContext;
 using test::decryptedLine;
 using test::encryptedLine;
+using test::failureOf;
 using test::handshakeLines;
 using test::HookedStream;
 using test::Identity;
@@ -183,6 +184,32 @@ TEST_F(SSLStreamTest, OutlivesItsContext)
     context.reset();
     SSLStream server(serverContext(), memory.takeServer());
     encrypt(client, server);
+}
+
+TEST_F(SSLStreamTest, ManyThreadsShakeHandsWithTheSameContexts)
+{
+    constexpr int threads = 4;
+    constexpr int rounds = 5;
+    SSLClientContext& clientSide = clientContext();
+    SSLServerContext& serverSide = serverContext();
+    std::atomic<int> done{0};
+    const auto shakeMany = [&] {
+        for (int round = 0; round < rounds; ++round) {
+            MemoryStreamPair memory;
+            SSLStream client(clientSide, memory.takeClient());
+            SSLStream server(serverSide, memory.takeServer());
+            std::thread other([&server] { EXPECT_EQ(failureOf([&server] { server.handshake(); }), ""); });
+            EXPECT_EQ(failureOf([&client] { client.handshake(); }), "");
+            other.join();
+            if (server.getStatus() == SSLStream::STATUS_ENCRYPTED) ++done;
+        }
+    };
+    std::vector<std::thread> all;
+    for (int i = 0; i < threads; ++i)
+        all.emplace_back(shakeMany);
+    for (std::thread& thread : all)
+        thread.join();
+    EXPECT_EQ(done, threads * rounds);
 }
 
 TEST_F(SSLStreamTest, ThereIsNoStreamWithoutItsBuffers)

@@ -53,6 +53,11 @@ SSLCredentials makeCredentials(Identity identity)
                               Authority::stranger().client().getPrivateKey()->getPEM(), authority.root().getPEM()};
     case Identity::WithSubjectOfRoot:
         return issue(SSLCertificateRequest(authority.root().getSubject()), hours(-24), hours(24));
+    case Identity::WithKeyOfAnother:
+        return SSLCredentials{authority.client().getPEM(), authority.server().getPrivateKey()->getPEM(),
+                              authority.root().getPEM()};
+    case Identity::Stranger:
+        return Authority::stranger().clientCredentials();
     }
     throw std::logic_error("no such identity");
 }
@@ -66,7 +71,11 @@ Context& contextOf(Identity identity)
     const auto found = contexts.find(identity);
     if (found != contexts.end()) return found->second;
     Context& context = contexts[identity];
-    context.setCredentials(credentialsOf(identity));
+    if (identity == Identity::WithKeyOfAnother) {
+        EXPECT_THROW(context.setCredentials(credentialsOf(identity)), SSLException);
+    } else {
+        context.setCredentials(credentialsOf(identity));
+    }
     return context;
 }
 

@@ -21,8 +21,8 @@
 
 namespace qel::test {
 
-/// Who an end of a test connection says it is. All trust the same root, that of Authority::trusted(), so that only what
-/// they present differs.
+/// Who an end of a test connection says it is. All but the last trust the same root, that of Authority::trusted(), so
+/// that only what they present differs.
 enum class Identity {
     Client,            ///< issued by the root to "client"
     Server,            ///< issued by the root to "server"
@@ -30,6 +30,9 @@ enum class Identity {
     NotYetValid,       ///< issued by the root, from tomorrow
     OtherRoot,         ///< issued by somebody else
     WithSubjectOfRoot, ///< issued by the root to the subject that is the root's own
+    WithKeyOfAnother,  ///< issued by the root, but with a key that is not its own: contexts refuse these credentials
+                       ///< and are left with the root, to trust, and nothing to present
+    Stranger,          ///< issued by somebody else, whom alone it trusts
 };
 
 /// @return the credentials of an identity: made when they are first asked for, and then the same all the time
