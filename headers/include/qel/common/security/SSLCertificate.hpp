@@ -95,7 +95,7 @@ public:
     /// Who the certificate is for. Look at this, after a handshake, to know whom one is talking to.
     /// @return the subject by short field names, or numbers in dots for fields that have none; values in UTF-8. A field
     ///         that stands there several times has its values in one text, in their order, with a line feed between
-    ///         them: such a text equals no single value.
+    ///         them: such a text equals no single value, unless that itself holds a line feed, which nothing forbids.
     /// @throws SSLException  "An SSL error occurred at ...": a value is no text
     SSLSubject getSubject() const;
 

@@ -34,7 +34,9 @@ class SSLContext;
 /// A peer may change its keys at any time; new keys that it asks for in return go out with the next write. Asking twice
 /// while one long write is under way ends the connection.
 ///
-/// Failures of TLS itself are StreamIOException with fixed texts; OpenSSL's reasons are in the log at Error.
+/// Failures of TLS itself are StreamIOException with fixed texts; OpenSSL's reasons are in the log at Error. Lines of
+/// log are written with the lock of the stream held, so a log back-end must not call the stream, or it waits for itself
+/// for ever; only the deadline setters take no lock.
 ///
 /// Ownership: owns the stream underneath. close() only ends the transfer; a peer that is blocked in a write is woken
 /// for certain only when the descriptor is closed, so destroy streams that are done with.

@@ -7,7 +7,8 @@
 
 namespace qel {
 
-/// From when until when a certificate is valid, both ends included. A value in whole seconds of the calendar.
+/// From when until when a certificate is valid, both ends included (RFC 5280, 4.1.2.5). A value in whole seconds of the
+/// calendar.
 /// Thread safety: that of a plain value.
 class QEL_EXPORT SSLValidityPeriod {
 public:
