@@ -105,13 +105,23 @@ std::string ProgramTest::listen()
 
 std::unique_ptr<SSLStream> ProgramTest::acceptClient(Identity identity)
 {
+    return acceptClient(serverContext(identity));
+}
+
+std::unique_ptr<SSLStream> ProgramTest::acceptClient(SSLServerContext& context)
+{
     // accept() knows no deadline of its own, but heeds that of the socket.
     const timeval patience{kPatience.count(), 0};
     mListener.setSocketOption(SOL_SOCKET, SO_RCVTIMEO, &patience, sizeof(patience));
-    return std::make_unique<SSLStream>(serverContext(identity), pStreamOver(mListener.accept()));
+    return std::make_unique<SSLStream>(context, pStreamOver(mListener.accept()));
 }
 
 std::unique_ptr<SSLStream> ProgramTest::connectTo(const Process& program, Identity identity)
+{
+    return connectTo(program, clientContext(identity));
+}
+
+std::unique_ptr<SSLStream> ProgramTest::connectTo(const Process& program, SSLClientContext& context)
 {
     const auto end = std::chrono::steady_clock::now() + kPatience;
     std::uint16_t port = 0;
@@ -121,7 +131,7 @@ std::unique_ptr<SSLStream> ProgramTest::connectTo(const Process& program, Identi
     }
     Socket socket(IPFamily::IPv4, SOCK_STREAM | SOCK_CLOEXEC, 0);
     socket.connect(IPEndpoint(IPv4Address{127, 0, 0, 1}, port), kPatience);
-    return std::make_unique<SSLStream>(clientContext(identity), pStreamOver(std::move(socket)));
+    return std::make_unique<SSLStream>(context, pStreamOver(std::move(socket)));
 }
 
 void ProgramTest::awaitBytes() const

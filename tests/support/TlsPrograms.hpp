@@ -49,11 +49,15 @@ protected:
     std::string listen();
     /// Takes the next connection, as a server with the credentials of an identity.
     std::unique_ptr<SSLStream> acceptClient(Identity identity = Identity::Server);
+    /// The same with credentials of the test's own.
+    std::unique_ptr<SSLStream> acceptClient(SSLServerContext& context);
 
     // They accept.
 
     /// Connects to the port of 127.0.0.1 at which a program listens, once it does.
     std::unique_ptr<SSLStream> connectTo(const Process& program, Identity identity = Identity::Client);
+    /// The same with credentials of the test's own.
+    std::unique_ptr<SSLStream> connectTo(const Process& program, SSLClientContext& context);
 
     /// Waits until the program has sent something that our end has not read.
     void awaitBytes() const;
