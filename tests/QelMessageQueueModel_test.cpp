@@ -120,7 +120,7 @@ public:
         state += '|';
         for (const unsigned int numbers : mAccepted)
             state += std::to_string(numbers) + ',';
-        state += std::to_string(mFailures);
+        state += std::to_string(mFailures) + '|' + std::to_string(mShutdownsThatWoke);
     }
 
     void describeWhatThreadsSee(std::string& state) const override
@@ -150,6 +150,7 @@ public:
 
 protected:
     enum class Role { Producer, Consumer, Other };
+    using Woken = std::vector<const void*>; // condition variables at which threads were woken, in order
 
     static constexpr unsigned int kMostNumbers = 32; // messages of a producer
     static constexpr unsigned int kOthers = 0xFFFF;  // the caller id of messages that are not counted
@@ -163,12 +164,14 @@ protected:
     {
         const auto mine = static_cast<unsigned int>(threads.size());
         pAdd(Role::Producer, [this, mine, options, lengths, failsAfter] {
+            const Woken consumer = {&queue().mDequeueWaiter.mCondition};
             for (unsigned int i = 0; i < lengths.size(); ++i) {
                 const bool over = mShutdownReturned;
                 Interleavings::here(2 * i + over);
                 if (failsAfter >= 0) mClock.failAfter(failsAfter);
                 try {
                     const auto result = queue().enqueue(sized(lengths[i], mine * kMostNumbers + i), options);
+                    pCheckWoken(result == Queue::OK, consumer);
                     if (over && result != Queue::SHUTDOWN) Interleavings::fail("a message was taken in after shutdown");
                     if (result == Queue::SHUTDOWN) break;
                     if (result == Queue::OK) mAccepted[mine] |= 1U << i;
@@ -211,8 +214,16 @@ protected:
     void addShutdown()
     {
         pAdd(Role::Other, [this] {
+            // Producers of low priority first, then those of normal priority, then consumers.
+            const Woken everybody = {&queue().mLowPriorityLimiter.mWaiter.mCondition,
+                                     &queue().mNormalPriorityLimiter.mWaiter.mCondition,
+                                     &queue().mDequeueWaiter.mCondition};
             queue().shutdown();
             mShutdownReturned = true;
+            if (!Interleavings::notified().empty()) Interleavings::fail("shutdown has woken a single thread");
+            const Woken& woken = Interleavings::notifiedAll();
+            if (!woken.empty() && woken != everybody) Interleavings::fail("shutdown has woken others, or in disorder");
+            if (!woken.empty()) ++mShutdownsThatWoke;
             Interleavings::here(kEnd);
         });
     }
@@ -258,13 +269,23 @@ protected:
         return Opened::of(queue().mQueue);
     }
 
+    /// A message put in wakes at most one consumer; one that was refused wakes nobody.
+    static void pCheckWoken(bool queued, const Woken& consumer)
+    {
+        const Woken& woken = Interleavings::notified();
+        if (!Interleavings::notifiedAll().empty()) Interleavings::fail("a message has woken a crowd");
+        if (!woken.empty() && !queued) Interleavings::fail("a refused message has woken somebody");
+        if (!woken.empty() && woken != consumer) Interleavings::fail("a message has woken more than one consumer");
+    }
+
     /// Each message taken wakes at most one producer of normal priority, and then one of low; otherwise nobody is
     /// woken.
     void pCheckNotifications(bool taken)
     {
+        if (!Interleavings::notifiedAll().empty()) Interleavings::fail("a crowd was woken for one message");
         const void* const normal = &queue().mNormalPriorityLimiter.mWaiter.mCondition;
         const void* const low = &queue().mLowPriorityLimiter.mWaiter.mCondition;
-        std::vector<const void*> notified = Interleavings::notified();
+        Woken notified = Interleavings::notified();
         if (!taken && !notified.empty()) Interleavings::fail("producers were woken for nothing");
         if (!notified.empty() && notified.front() == normal) notified.erase(notified.begin());
         if (!notified.empty() && notified.front() == low) notified.erase(notified.begin());
@@ -321,6 +342,7 @@ protected:
     std::vector<unsigned int> mAccepted;              // by producer: bits of the numbers that were taken in
     std::vector<std::vector<unsigned int>> mReceived; // the same, as received, by consumer and producer
     unsigned int mFailures = 0;                       // exceptions
+    unsigned int mShutdownsThatWoke = 0;
 };
 
 /// How a program is tried.
@@ -516,10 +538,14 @@ public:
         addShutdown();
         addShutdown();
     }
-    void atRest() override { pCheckAllEnded(); }
+    void atRest() override
+    {
+        pCheckAllEnded();
+        if (mShutdownsThatWoke != 1) Interleavings::fail("not one of two shutdowns has woken everybody");
+    }
 };
 
-TEST(QelMessageQueueModel, ShutdownMayComeTwice) { expectRight<TwoShutdowns>({}); }
+TEST(QelMessageQueueModel, OfTwoShutdownsOneWakesEverybodyAndTheOtherDoesNothing) { expectRight<TwoShutdowns>({}); }
 
 // Consumers whose time may pass at any moment: also when a message has just been put in for them.
 class Impatience : public QueueProgram {

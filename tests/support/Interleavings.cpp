@@ -37,6 +37,7 @@ struct Thread {
     std::uint64_t past = 0x9E3779B97F4A7C15U; // everything that decides what it does, since here(); it has not begun
     std::uint64_t place = 0;                  // of the last here()
     std::vector<const void*> notified;
+    std::vector<const void*> notifiedAll;
 };
 
 /// One way to go on: which thread, and which alternative of its operation.
@@ -145,6 +146,7 @@ public:
         pSelf().place = place;
         pSelf().timedOut = false;
         pSelf().notified.clear();
+        pSelf().notifiedAll.clear();
     }
 
     void fail(const std::string& what)
@@ -369,6 +371,7 @@ private:
             break;
         }
         case Operation::NotifyAll:
+            thread.notifiedAll.push_back(thread.object);
             if (mOptions.fault == Fault::NotifyAllDoesNothing) break;
             for (const std::size_t sleeper : pSleepers(thread.object))
                 mThreads[sleeper].woken = true;
@@ -505,6 +508,7 @@ bool Interleavings::sleeps(std::size_t thread)
 bool Interleavings::timedOut() { return sExplorer->thread(thread()).timedOut; }
 
 const std::vector<const void*>& Interleavings::notified() { return sExplorer->thread(thread()).notified; }
+const std::vector<const void*>& Interleavings::notifiedAll() { return sExplorer->thread(thread()).notifiedAll; }
 
 void Interleavings::create(const void* object, const char* kind) { sExplorer->create(object, kind); }
 void Interleavings::destroy(const void* object) { sExplorer->destroy(object); }

@@ -44,7 +44,6 @@ public:
         None,
         NotifyOneDoesNothing,
         NotifyAllDoesNothing,
-        NobodySeemsToWait,  ///< ConditionVariable::hasWaiters() tells false
         WaitZeroDoesNotWait ///< CallsInFlight::wait() returns at once
     };
 
@@ -109,6 +108,8 @@ public:
     static bool timedOut();
     /// On which objects the calling thread has called notifyOne() since its last here(), in order.
     static const std::vector<const void*>& notified();
+    /// The same for notifyAll().
+    static const std::vector<const void*>& notifiedAll();
 
     // For ModelledSync.hpp. Objects are known by their address from create() to destroy(). Where no thread of the
     // program runs, as in its constructor, nothing waits for anything.

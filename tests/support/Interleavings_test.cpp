@@ -269,6 +269,7 @@ public:
             }
             all ? mCondition.notifyAll() : mCondition.notifyOne();
             if (Interleavings::notified().size() != (all ? 0U : 1U)) Interleavings::fail("not counted");
+            if (Interleavings::notifiedAll().size() != (all ? 1U : 0U)) Interleavings::fail("not all counted");
         });
     }
     void describe(std::string& state) const override { state += std::to_string(mAsleep); }
