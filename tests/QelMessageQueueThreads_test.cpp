@@ -42,6 +42,7 @@ using testing::UnorderedElementsAre;
 
 constexpr MessageQueuingOptions kBlocking = MessageQueuingOptions::BLOCKING;
 constexpr MessageQueuingOptions kLow = MessageQueuingOptions::LOW_PRIORITY;
+constexpr MessageQueuingOptions kBestEffort = MessageQueuingOptions::BEST_EFFORT; // nobody looks at it
 constexpr milliseconds kForEver = milliseconds::max();
 
 std::string dumpOf(const QelMessageQueue& queue)
@@ -117,7 +118,8 @@ TEST(QelMessageQueueThreads, BlockedProducersReturnAtShutdownAndAreNotCountedAsD
     QelMessageQueue queue(100);
     queue.enqueue(sized(100, 1));
     std::vector<std::thread> producers;
-    for (const MessageQueuingOptions options : {kBlocking, kBlocking | kLow, kBlocking, kBlocking | kLow}) {
+    for (const MessageQueuingOptions options :
+         {kBlocking, kBlocking | kLow, kBlocking | kBestEffort, kBlocking | kLow | kBestEffort}) {
         producers.emplace_back([&queue, &census, options] {
             EXPECT_EQ(queue.enqueue(std::make_unique<CountedMessage>(census, 32), options), QelMessageQueue::SHUTDOWN);
         });

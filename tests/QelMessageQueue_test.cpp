@@ -3,6 +3,7 @@
 
 #include <qel/common/QelMessageQueue.hpp>
 #include <qel/common/StreamFormatters.hpp>
+#include <qel/common/util/TimeProvider.hpp>
 
 #include "support/Allocations.hpp"
 #include "support/CapturedLog.hpp"
@@ -484,6 +485,56 @@ TEST(QelMessageQueue, EndToEndLatencyCountsFromTheCall)
     const std::string text = dumpOf(queue);
     EXPECT_THAT(text, HasSubstr("0-1ms:      2            1            0           \n"));
     EXPECT_THAT(text, HasSubstr("1-10s:      0            1            2           \n"));
+}
+
+/// Time that goes on by one second with each reading of either clock, so that every duration tells which readings it
+/// lies between.
+class TickingClock : public TimeProvider {
+public:
+    TickingClock() { pRegister(); }
+
+private:
+    std::chrono::system_clock::time_point pSystem() override { return std::chrono::system_clock::time_point(pTick()); }
+    std::chrono::steady_clock::time_point pSteady() override { return std::chrono::steady_clock::time_point(pTick()); }
+    std::chrono::seconds pTick() { return std::chrono::seconds(mReadings++); }
+
+    int mReadings = 0;
+};
+
+TEST(QelMessageQueue, TheClocksAreReadInTheOrderOfWhatTheyTell)
+{
+    TickingClock clock;
+    QelMessageQueue queue(0);
+    queue.enqueue(sized(100, 1)); // 0 its call, 1 its admission, 2 it is at the head
+    take(queue);                  // 3 its latency, 4 it leaves the head, 5 the event's begin, 6 its time-out
+    queue.enqueue(sized(200, 2)); // 7, 8, 9
+    EXPECT_EQ(figure(queue, "Head Wait"), "1000000 us"); // 10
+    take(queue); // 11 its latency, 12 it leaves the head, 13 the event's time-out, 14 its end
+
+    EXPECT_EQ(dumpOf(queue), "Limits:         0/0\n"
+                             "Max Size (HWM): 200 B\n"
+                             "Pending:        0 (0 B)\n"
+                             "Dropped:        0 (0 B)\n"
+                             "Completed:      2 (300 B)\n"
+                             "Throughput:     0 m/s (60 B/s)\n" // 2 s and 3 s at the head
+                             "Latency Buckets:\n"
+                             "              Enqueue      Dequeue      E2E         \n"
+                             "  0-1ms:      0            0            0           \n"
+                             "  1-10ms:     0            0            0           \n"
+                             "  10-100ms:   0            0            0           \n"
+                             "  100-1000ms: 2            0            0           \n" // 1 s each
+                             "  1-10s:      0            2            2           \n"
+                             "  10+s:       0            0            0           \n"
+                             "Maximum Latency:\n"
+                             "  [CID=0x00000002 FN=0x6003 OP=0x8001 T=4000000us]\n"
+                             "Latency Events:\n"
+                             "  (A) [1970-01-01 00:00:05 - 1970-01-01 00:00:14 UTC]\n"
+                             "      Duration:       000d:00h:00m:09.000s\n"
+                             "      First:          [CID=0x00000001 FN=0x6003 OP=0x8001 T=3000000us]\n"
+                             "      Last:           [CID=0x00000002 FN=0x6003 OP=0x8001 T=4000000us]\n"
+                             "      Completed:      2 (300 B)\n"
+                             "      Max Latency:    4000000 us\n"
+                             "      Avg Latency:    3500000 us\n");
 }
 
 TEST(QelMessageQueue, TheClockIsReadNoMoreThanNeeded)
