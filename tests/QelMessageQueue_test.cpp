@@ -19,8 +19,10 @@
 #include <limits>
 #include <memory>
 #include <new>
+#include <ostream>
 #include <sstream>
 #include <stdexcept>
+#include <streambuf>
 #include <string>
 #include <type_traits>
 #include <utility>
@@ -669,6 +671,18 @@ TEST(QelMessageQueue, TheLockIsFreeAfterAFailure)
     EXPECT_THROW(queue.enqueue(sized(32)), std::runtime_error);
     clock.work();
     EXPECT_THAT(dumpOf(queue), HasSubstr("Pending:        0 (0 B)\n")); // takes the lock
+}
+
+TEST(QelMessageQueue, TheLockIsFreeAfterADumpToAStreamThatFails)
+{
+    struct FullDisk : std::streambuf {}; // takes nothing
+    FullDisk disk;
+    std::ostream os(&disk);
+    os.exceptions(std::ios_base::badbit);
+    QelMessageQueue queue(0);
+    queue.enqueue(sized(32, 7));
+    EXPECT_THROW(queue.dumpStatistics(os, Indent(0, ' ')), std::ios_base::failure);
+    EXPECT_EQ(take(queue), 7U);
 }
 
 } // namespace

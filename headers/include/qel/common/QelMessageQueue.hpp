@@ -48,7 +48,8 @@ struct is_bitmask_enum<MessageQueuingOptions> : std::true_type {};
 /// such calls still have to do, which is to wake other threads. Nobody may be asleep in the queue any more: shut it
 /// down and join those threads first.
 /// Thread safety: every operation but destruction from any thread. One lock guards everything. Log lines of a waiting
-/// producer and of shutdown() are written with the lock held, so a log back-end must not use the queue.
+/// producer and of shutdown() are written, and dumpStatistics() prints, with the lock held: neither a log back-end nor
+/// the stream that is printed to may use the queue, and while one of them is slow everybody waits.
 ///
 /// Clock: enqueue() reads TimeProvider::steady() when it is called, once more when the message is admitted, and a third
 /// time if the queue was empty; waitForMsg() reads it twice for each message, and more while messages are slow (see
@@ -64,6 +65,7 @@ public:
 
     /// @param sizeLimit  bytes of waiting messages from which on none of normal priority is admitted; for those of low
     ///                   priority it is half of that, rounded up. 0: no limit for either.
+    /// @throws std::bad_alloc
     explicit QelMessageQueue(std::size_t sizeLimit);
 
     /// Destroys the messages that were not taken. See above for when it may be called.
@@ -90,14 +92,18 @@ public:
 
     /// Ends the work of this queue for good: producers and consumers that wait return now, later ones at once, and
     /// messages still in it stay there until it is destroyed. Further calls do nothing.
-    /// @throws what a substitute clock throws for the log line; the queue is shut down all the same
+    /// @throws std::bad_alloc and what a substitute clock throws, for the log line; the queue is shut down all the same
     void shutdown();
 
     /// @return whether shutdown() has been called. Takes no lock.
     bool isShutdown() const noexcept { return mShutdown; }
 
-    /// Prints the limits, low priority first, and then the statistics.
+    /// Prints the limits, low priority first, and then the statistics, all as they were at one moment. Print into a
+    /// string first where the stream may be slow: producers and consumers wait for it.
+    /// @param os  is left in the state that QelMessageQueueStatistics::dump() tells
     /// @param indent  in front of every line
+    /// @throws std::bad_alloc, what a substitute clock throws, and what the stream throws if it was told to; part of
+    /// the text may have been printed then
     void dumpStatistics(std::ostream& os, const Indent& indent) const;
 
 private:

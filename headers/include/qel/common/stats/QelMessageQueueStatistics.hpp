@@ -44,6 +44,8 @@ public:
 
     /// Prints everything, each line behind the indent. Reads the steady clock once if the queue is not empty. The
     /// stream is left as the formatters leave it: upper-case digits, fill character '0' or a blank.
+    /// @throws std::bad_alloc, what a substitute clock throws, and what the stream throws if it was told to; part of
+    /// the text may have been printed then
     void dump(std::ostream& os, const Indent& indent) const;
 
 private:
