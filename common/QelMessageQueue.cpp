@@ -62,10 +62,10 @@ QelMessageQueue::ReturnCode QelMessageQueue::enqueue(std::unique_ptr<QelMessage>
     if (message == nullptr) throw std::invalid_argument("message");
 
     const bool blocking = (options & MessageQueuingOptions::BLOCKING) != MessageQueuingOptions::DEFAULT;
-    RateLimiter& limiter = pGetRateLimiter(options);
     const auto startTime = TimeProvider::steady();
 
     UniqueMutexLock lock(mLock);
+    RateLimiter& limiter = pGetRateLimiter(options);
     ReturnCode result = OK;
     try {
         result = pEnqueueLocked(lock, limiter, message, blocking, startTime);
@@ -78,7 +78,7 @@ QelMessageQueue::ReturnCode QelMessageQueue::enqueue(std::unique_ptr<QelMessage>
 
     mWakings.enter();
     lock.unlock();
-    mDequeueWaiter.wakeOne();
+    pWakeConsumer();
     mWakings.leave();
     return result;
 }
@@ -122,7 +122,7 @@ std::unique_ptr<QelMessage> QelMessageQueue::waitForMsg(const std::chrono::milli
         message = pDequeueLocked();
     } catch (...) {
         // This thread may have been woken for the message that is still there.
-        if (mDequeueWaiter.claimOne()) mDequeueWaiter.wakeOne();
+        if (mDequeueWaiter.claimOne()) pWakeConsumer();
         throw;
     }
 
@@ -132,8 +132,7 @@ std::unique_ptr<QelMessage> QelMessageQueue::waitForMsg(const std::chrono::milli
     if (!wakeNormal && !wakeLow) return message;
     mWakings.enter();
     lock.unlock();
-    if (wakeNormal) mNormalPriorityLimiter.notifyOne();
-    if (wakeLow) mLowPriorityLimiter.notifyOne();
+    pWakeProducers(wakeNormal, wakeLow);
     mWakings.leave();
     return message;
 }
@@ -179,13 +178,6 @@ void QelMessageQueue::shutdown()
     lock.unlock();
     pWakeEverybody();
     mWakings.leave();
-}
-
-void QelMessageQueue::pWakeEverybody() noexcept
-{
-    mLowPriorityLimiter.notifyAll();
-    mNormalPriorityLimiter.notifyAll();
-    mDequeueWaiter.wakeAll();
 }
 
 void QelMessageQueue::dumpStatistics(std::ostream& os, const Indent& indent) const

@@ -146,21 +146,35 @@ private:
 
     static std::uint64_t pGetLowPrioritySize(std::size_t size) noexcept;
 
-    RateLimiter& pGetRateLimiter(MessageQueuingOptions options) noexcept;
+    RateLimiter& pGetRateLimiter(MessageQueuingOptions options) noexcept QEL_REQUIRES(mLock);
 
     ReturnCode pEnqueueLocked(UniqueMutexLock& lock, RateLimiter& limiter, std::unique_ptr<QelMessage>& message,
                               bool blocking, std::chrono::steady_clock::time_point startTime) QEL_REQUIRES(mLock);
     void pWaitForMsgLocked(UniqueMutexLock& lock, const std::chrono::milliseconds& timeout) QEL_REQUIRES(mLock);
     bool pHasEndedWaitLocked() const QEL_REQUIRES(mLock) { return mShutdown || !mQueue.empty(); }
     std::unique_ptr<QelMessage> pDequeueLocked() QEL_REQUIRES(mLock);
-    void pWakeEverybody() noexcept;
 
-    // The lock guards all that follows; those who were claimed under it are woken after it is released.
+    // Those who were claimed under the lock are woken after it is released. Waking needs no lock, but the analysis
+    // knows only that what it is done with is guarded, so it is done here and nowhere else.
+    void pWakeConsumer() noexcept QEL_NO_THREAD_SAFETY_ANALYSIS { mDequeueWaiter.wakeOne(); }
+    void pWakeProducers(bool normal, bool low) noexcept QEL_NO_THREAD_SAFETY_ANALYSIS
+    {
+        if (normal) mNormalPriorityLimiter.notifyOne();
+        if (low) mLowPriorityLimiter.notifyOne();
+    }
+    void pWakeEverybody() noexcept QEL_NO_THREAD_SAFETY_ANALYSIS
+    {
+        mLowPriorityLimiter.notifyAll();
+        mNormalPriorityLimiter.notifyAll();
+        mDequeueWaiter.wakeAll();
+    }
+
+    // The lock guards all that follows.
     mutable Mutex mLock;
     Fifo mQueue QEL_GUARDED_BY(mLock);
-    Waiters mDequeueWaiter; // for a message, consumers
-    RateLimiter mNormalPriorityLimiter;
-    RateLimiter mLowPriorityLimiter;
+    Waiters mDequeueWaiter QEL_GUARDED_BY(mLock); // for a message, consumers
+    RateLimiter mNormalPriorityLimiter QEL_GUARDED_BY(mLock);
+    RateLimiter mLowPriorityLimiter QEL_GUARDED_BY(mLock);
     std::atomic<bool> mShutdown{false}; // written under the lock, read without it by isShutdown()
     CallsInFlight mWakings;             // calls that wake others after releasing the lock
     QelMessageQueueStatistics mStats QEL_GUARDED_BY(mLock);
