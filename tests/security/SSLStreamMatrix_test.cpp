@@ -22,6 +22,7 @@
 #include <gtest/gtest.h>
 #include <memory>
 #include <openssl/x509_vfy.h>
+#include <ostream>
 #include <string>
 #include <thread>
 #include <tuple>
@@ -54,6 +55,7 @@ using test::TlsTest;
 using test::Transport;
 using test::writeText;
 using ::testing::AnyOf;
+using ::testing::Each;
 using ::testing::IsEmpty;
 
 using Lines = std::vector<std::string>;
@@ -104,6 +106,8 @@ struct CredentialsRow {
     std::string serverFailure;
     Lines serverLog;
 };
+
+void PrintTo(const CredentialsRow& row, std::ostream* os) { *os << row.name; }
 
 const Identity kClient = Identity::Client;
 const Identity kServer = Identity::Server;
@@ -591,6 +595,7 @@ TEST_P(SSLStreamAgainst, TwoDemandsForNewKeysInTheMiddleOfAWriteAreFatal)
         mPeer->write("x");
         const Outcome reader = here([this] { readSome(*mStream, 10); });
         EXPECT_EQ(reader.failure, kSSLError1);
+        EXPECT_EQ(reader.log, kRefusal);
     };
     EXPECT_THAT(here([this] { writeText(*mStream, pattern(20000)); }).failure,
                 AnyOf(failsClosed(), "StreamIOException: SSL error 5"));
@@ -730,8 +735,13 @@ TEST_P(SSLStreamOver, ClosingFromAnotherThreadBeforeTheHandshake)
 {
     elsewhere([this] { mClient->close(); });
     EXPECT_EQ(mClient->getStatus(), SSLStream::STATUS_CLOSED);
-    EXPECT_EQ(here([this] { mClient->handshake(); }).failure, kInvalidState);
-    EXPECT_EQ(here([this] { mServer->handshake(); }).failure, kEOF);
+    const Outcome client = here([this] { mClient->handshake(); });
+    EXPECT_EQ(client.failure, kInvalidState);
+    EXPECT_THAT(client.log, IsEmpty());
+    const Outcome server = here([this] { mServer->handshake(); });
+    EXPECT_EQ(server.failure, kEOF);
+    EXPECT_EQ(server.log, Lines{kEOFInHandshake});
+    EXPECT_EQ(mServer->getStatus(), SSLStream::STATUS_CLOSED);
 }
 
 TEST_P(SSLStreamOver, ClosingFromAnotherThreadWhileTheHandshakeReads)
@@ -770,8 +780,11 @@ TEST_P(SSLStreamOver, ClosingFromAnotherThreadWakesAReader)
     auto reader =
         std::async(std::launch::async, [this] { return failureOf([this] { EXPECT_EQ(readSome(*mClient, 1), ""); }); });
     reading.get_future().wait();
-    mClient->close(); // does not wait for the reader
+    const Outcome closing = here([this] { mClient->close(); }); // does not wait for the reader
+    EXPECT_EQ(closing.failure, "");
+    EXPECT_THAT(closing.log, IsEmpty());
     EXPECT_EQ(reader.get(), "");
+    EXPECT_EQ(readSome(*mServer, 1), "");
     EXPECT_EQ(mClient->getStatus(), SSLStream::STATUS_CLOSED);
     EXPECT_EQ(here([this] { readSome(*mClient, 1); }).failure, kInvalidState);
 }
@@ -855,6 +868,7 @@ TEST_P(SSLStreamOver, AReadDeadlineIsFatal)
     mClient->setReadDeadline(milliseconds(20));
     const Outcome outcome = here([this] { readSome(*mClient, 1); });
     EXPECT_THAT(outcome.failure, passesReadDeadline());
+    EXPECT_THAT(outcome.log, IsEmpty());
     EXPECT_EQ(mClient->getStatus(), SSLStream::STATUS_CLOSED);
     EXPECT_EQ(here([this] { readSome(*mClient, 1); }).failure, kInvalidState);
     EXPECT_EQ(readSome(*mServer, 1), "");
@@ -867,6 +881,8 @@ TEST_P(SSLStreamOver, AWriteDeadlineIsFatal)
     const Outcome outcome = here([this] { writeText(*mClient, pattern(8000000)); });
     EXPECT_THAT(outcome.failure, AnyOf("StreamIOException: memory stream deadline", "StreamIOException: I/O deadline",
                                        "StreamIOException: socket stream send failure"));
+    // Whole records may have gone out before; beyond that, nothing of TLS is to be said.
+    EXPECT_THAT(outcome.log, Each(encryptedLine(16384)));
     EXPECT_EQ(mClient->getStatus(), SSLStream::STATUS_CLOSED);
     EXPECT_EQ(here([this] { writeText(*mClient, "x"); }).failure, kInvalidState);
 }
