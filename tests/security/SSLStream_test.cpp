@@ -571,21 +571,6 @@ TEST_F(SSLStreamPair, KnowsThePeerFromTheHandshakeUntilItIsClosed)
     EXPECT_NE(mServer.getPeerCertificate(), nullptr);
 }
 
-TEST_F(EncryptedPair, ThePeersCertificateIsAllThereOrReportedAsAFailure)
-{
-    TlsCalls calls;
-    calls.PEM_write_bio_X509 = [](BIO* bio, test::WrittenCertificate certificate) {
-        EXPECT_EQ(PEM_write_bio_X509(bio, certificate), 1); // there is a text, but it is not said to be whole
-        spoilErrorQueue();
-        return 0;
-    };
-    const Outcome outcome = here([this] { mClient.getPeerCertificate(); });
-    EXPECT_THAT(outcome.failure,
-                MatchesRegex("SSLException: An SSL error occurred at .*common/security/SSLStream.cpp:[0-9]+"));
-    EXPECT_THAT(outcome.log, ElementsAre(kLibssl));
-    EXPECT_EQ(mClient.getStatus(), SSLStream::STATUS_ENCRYPTED);
-}
-
 // The lock and the deadlines
 
 /// Remembers the deadlines that are set.
@@ -890,6 +875,21 @@ TEST_F(EncryptedPair, AFailureToPutCiphertextIntoTheBufferIsFatal)
     EXPECT_THAT(outcome.log, ElementsAre(kLibssl, "E: SSLStream hit BIO_write failure: 0x00000016"));
     EXPECT_EQ(mClient.getStatus(), SSLStream::STATUS_CLOSED);
     EXPECT_EQ(mMemory.client().closeCount(), 1U);
+}
+
+TEST_F(EncryptedPair, ThePeersCertificateIsAllThereOrReportedAsAFailure)
+{
+    TlsCalls calls;
+    calls.PEM_write_bio_X509 = [](BIO* bio, test::WrittenCertificate certificate) {
+        EXPECT_EQ(PEM_write_bio_X509(bio, certificate), 1); // there is a text, but it is not said to be whole
+        spoilErrorQueue();
+        return 0;
+    };
+    const Outcome outcome = here([this] { mClient.getPeerCertificate(); });
+    EXPECT_THAT(outcome.failure,
+                MatchesRegex("SSLException: An SSL error occurred at .*common/security/SSLStream.cpp:[0-9]+"));
+    EXPECT_THAT(outcome.log, ElementsAre(kLibssl));
+    EXPECT_EQ(mClient.getStatus(), SSLStream::STATUS_ENCRYPTED);
 }
 
 // Lines of log that cannot be written
