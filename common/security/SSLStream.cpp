@@ -113,6 +113,21 @@ std::string SSLStream::getCipher() const
     return SSL_CIPHER_get_name(SSL_get_current_cipher(mSSL.get()));
 }
 
+bool SSLStream::hasPending() const
+{
+    const MutexLock lock(mLock);
+    if (mStatus != STATUS_ENCRYPTED) return false;
+    // Ciphertext first waits in the pair of buffers, then, record by record, in the engine.
+    return BIO_ctrl_pending(SSL_get_rbio(mSSL.get())) > 0 || SSL_has_pending(mSSL.get()) == 1;
+}
+
+std::string SSLStream::getVerificationFailure() const
+{
+    const MutexLock lock(mLock);
+    const long result = SSL_get_verify_result(mSSL.get());
+    return result == X509_V_OK ? std::string() : X509_verify_cert_error_string(result);
+}
+
 void SSLStream::handshake()
 {
     UniqueMutexLock lock(mLock);

@@ -571,6 +571,69 @@ TEST_F(SSLStreamPair, KnowsThePeerFromTheHandshakeUntilItIsClosed)
     EXPECT_NE(mServer.getPeerCertificate(), nullptr);
 }
 
+TEST_F(SSLStreamTest, TellsWhyThePeersCertificateWasRefused)
+{
+    MemoryStreamPair memory;
+    SSLStream client(clientContext(Identity::Expired), memory.takeClient());
+    SSLStream server(serverContext(), memory.takeServer());
+    shakeHands(client, server);
+    EXPECT_EQ(server.getVerificationFailure(), "certificate has expired");
+    EXPECT_EQ(client.getVerificationFailure(), "");
+    EXPECT_EQ(server.getStatus(), SSLStream::STATUS_CLOSED);
+}
+
+TEST_F(SSLStreamPair, HasNoVerificationFailureBeforeAndAfterAGoodHandshake)
+{
+    EXPECT_EQ(mClient.getVerificationFailure(), "");
+    encrypt();
+    EXPECT_EQ(mClient.getVerificationFailure(), "");
+    mClient.close();
+    EXPECT_EQ(mClient.getVerificationFailure(), "");
+}
+
+// What poll(2) cannot know
+
+TEST_F(SSLStreamPair, HasNothingPendingUnlessItIsEncrypted)
+{
+    EXPECT_FALSE(mServer.hasPending());
+    encrypt();
+    EXPECT_FALSE(mClient.hasPending());
+    EXPECT_FALSE(mServer.hasPending());
+    writeText(mClient, "ab");
+    EXPECT_EQ(readSome(mServer, 1), "a");
+    EXPECT_TRUE(mServer.hasPending());
+    mServer.close();
+    EXPECT_FALSE(mServer.hasPending());
+}
+
+TEST_F(EncryptedPair, WhatTheStreamUnderneathHasGivenUpIsPendingUntilItIsRead)
+{
+    writeText(mClient, "ab");
+    writeText(mClient, "c");
+    EXPECT_FALSE(mServer.hasPending()) << "it is still underneath";
+    EXPECT_EQ(readSome(mServer, 1), "a");
+    EXPECT_TRUE(mServer.hasPending()) << "a part of a record and a whole one";
+    EXPECT_EQ(readSome(mServer, 1), "b");
+    EXPECT_TRUE(mServer.hasPending()) << "a whole record";
+    EXPECT_EQ(readSome(mServer, 1), "c");
+    EXPECT_FALSE(mServer.hasPending());
+}
+
+TEST_F(EncryptedPair, TheBeginningOfARecordIsPending)
+{
+    constexpr std::size_t kRecord = 24; // of two bytes
+    for (const std::size_t begun : {1U, 4U, 5U, 6U, 23U}) {
+        SCOPED_TRACE(begun);
+        mMemory.server().deliverAtMost(kRecord + begun);
+        writeText(mClient, "ab");
+        writeText(mClient, "cd");
+        EXPECT_EQ(readSome(mServer, 2), "ab");
+        EXPECT_TRUE(mServer.hasPending());
+        EXPECT_EQ(readSome(mServer, 3), "cd");
+        EXPECT_FALSE(mServer.hasPending());
+    }
+}
+
 // The lock and the deadlines
 
 /// Remembers the deadlines that are set.

@@ -41,8 +41,9 @@ class SSLContext;
 /// Ownership: owns the stream underneath. close() only ends the transfer; a peer that is blocked in a write is woken
 /// for certain only when the descriptor is closed, so destroy streams that are done with.
 /// Thread safety: one reader thread and one writer thread at a time, also at the same time; the deadline setters belong
-/// to the thread of their direction. close(), getStatus(), getPeerCertificate() and getCipher() may be called from any
-/// thread at any time and do not wait for a thread that waits in the stream underneath.
+/// to the thread of their direction. close(), getStatus(), getPeerCertificate(), getCipher(), hasPending() and
+/// getVerificationFailure() may be called from any thread at any time and do not wait for a thread that waits in the
+/// stream underneath.
 class QEL_EXPORT SSLStream : public Stream {
 public:
     enum Status : unsigned int {
@@ -130,6 +131,17 @@ public:
     /// @return the name of the cipher in use, such as "TLS_AES_256_GCM_SHA384"; empty unless the status is
     ///         STATUS_ENCRYPTED
     std::string getCipher() const;
+
+    /// Whether bytes of the peer have been taken from the stream underneath that no read() has returned yet. To wait
+    /// for several things at once with poll(2), ask this first: the descriptor underneath says nothing of such bytes.
+    /// They may be the beginning of a record only, so that the next read() waits for the rest of it.
+    /// @return false unless the status is STATUS_ENCRYPTED
+    bool hasPending() const;
+
+    /// Why the peer's certificate was refused, such as "certificate has expired". Stays after the stream was closed, so
+    /// that a failed handshake() can be explained.
+    /// @return the text of X509_verify_cert_error_string(3); empty when no certificate was refused
+    std::string getVerificationFailure() const;
 
 private:
     void pHandshake(UniqueMutexLock& lock) QEL_REQUIRES(mLock);
