@@ -64,7 +64,7 @@ TEST(CommandLine, AnythingThatCannotBeCarriedOutIsUsage)
         {"nonsense"},
         {"--nonsense"},
         {"serve", "extra"},
-        {"serve"}, // without --plain
+        {"serve"}, // neither with credentials nor with --plain
         {"serve", "--plain", "--listen", "localhost:0"},
         {"serve", "--plain", "--listen", "127.0.0.1"},
         {"serve", "--plain", "--listen", "0.0.0.0:0"},
@@ -97,7 +97,7 @@ TEST(CommandLine, AnythingThatCannotBeCarriedOutIsUsage)
         {"serve", "--plain", "--log-dir", directory.file("missing")},
         {"call"},
         {"call", "time"},
-        {"call", "--connect", "127.0.0.1:1", "time"}, // without --plain
+        {"call", "--connect", "127.0.0.1:1", "time"}, // the same
         {"call", "--connect", "127.0.0.1:1", "--plain"},
         {"call", "--connect", "127.0.0.1:1", "--plain", "nonsense"},
         {"call", "--connect", "127.0.0.1:1", "--plain", "time", "extra"},
@@ -129,9 +129,11 @@ TEST(CommandLine, AnythingThatCannotBeCarriedOutIsUsage)
     }
 }
 
-TEST(CommandLine, TheReasonForRefusingPlainIsSaid)
+TEST(CommandLine, TheReasonForRefusingATransportIsSaid)
 {
-    EXPECT_THAT(runQel({"serve"}).errors, HasSubstr("--plain: is required: connections are not protected\n"));
+    EXPECT_THAT(runQel({"serve"}).errors,
+                HasSubstr("--credentials DIR --name NAME: is required, or --cert, --key and --root, or --plain for a "
+                          "loopback address\n"));
     EXPECT_THAT(runQel({"serve", "--plain", "--listen", "0.0.0.0:0"}).errors,
                 HasSubstr("--plain: is refused for 0.0.0.0:0, which is no loopback address\n"));
 }

@@ -335,19 +335,21 @@ TEST_P(ServeStop, ASignalStopsItCleanly)
     EXPECT_FALSE(exists(pid));
 }
 
-std::string nameOf(const ::testing::TestParamInfo<int>& info)
-{
-    switch (info.param) {
-    case SIGTERM:
-        return "SIGTERM";
-    case SIGINT:
-        return "SIGINT";
-    default:
-        return "SIGHUP";
-    }
-}
+std::string nameOf(const ::testing::TestParamInfo<int>& info) { return info.param == SIGTERM ? "SIGTERM" : "SIGINT"; }
 
-INSTANTIATE_TEST_SUITE_P(Signals, ServeStop, ::testing::Values(SIGTERM, SIGINT, SIGHUP), nameOf);
+INSTANTIATE_TEST_SUITE_P(Signals, ServeStop, ::testing::Values(SIGTERM, SIGINT), nameOf);
+
+TEST(Serve, WithoutTlsThereIsNothingToLoadAgain)
+{
+    ServeProcess server;
+    TestConsole console(server.endpoint());
+    console.introduce("a");
+    server.process().signal(SIGHUP);
+    server.process().awaitErrors("(I): [qel] SIGHUP: connections are plain, there is nothing to load\n");
+    EXPECT_EQ(console.statusOf(QelMessageGetQelTodReq()), 0U);
+    TestConsole(server.endpoint()).introduce("b");
+    server.stop();
+}
 
 TEST(Serve, BeingAskedToStopMoreThanOnceChangesNothing)
 {

@@ -8,9 +8,11 @@ namespace qel::test {
 
 namespace {
 
-std::vector<std::string> serveArguments(const std::vector<std::string>& options, const std::string& listen)
+std::vector<std::string> serveArguments(const std::vector<std::string>& options, const std::string& listen,
+                                        const std::vector<std::string>& transport)
 {
-    std::vector<std::string> arguments{"serve", "--plain", "--listen", listen};
+    std::vector<std::string> arguments{"serve", "--listen", listen};
+    arguments.insert(arguments.end(), transport.begin(), transport.end());
     arguments.insert(arguments.end(), options.begin(), options.end());
     return qelCommand(arguments);
 }
@@ -26,8 +28,9 @@ std::vector<std::string> qelCommand(const std::vector<std::string>& arguments)
 
 Process::Result runQel(const std::vector<std::string>& arguments) { return run(qelCommand(arguments)); }
 
-ServeProcess::ServeProcess(const std::vector<std::string>& options, const std::string& listen)
-    : mProcess(serveArguments(options, listen)), mEndpoint(mProcess.readLine())
+ServeProcess::ServeProcess(const std::vector<std::string>& options, const std::string& listen,
+                           const std::vector<std::string>& transport)
+    : mProcess(serveArguments(options, listen, transport)), mEndpoint(mProcess.readLine())
 {}
 
 Process::Result ServeProcess::call(const std::vector<std::string>& arguments) const

@@ -23,13 +23,14 @@ Process::Result runQel(const std::vector<std::string>& arguments);
 /// "qel serve" on a port of its own.
 class ServeProcess {
 public:
-    /// @param options  besides --listen and --plain
-    explicit ServeProcess(const std::vector<std::string>& options = {}, const std::string& listen = "127.0.0.1:0");
+    /// @param options  besides --listen and those of the transport
+    explicit ServeProcess(const std::vector<std::string>& options = {}, const std::string& listen = "127.0.0.1:0",
+                          const std::vector<std::string>& transport = {"--plain"});
 
     Process& process() { return mProcess; }
     const std::string& endpoint() const { return mEndpoint; }
 
-    /// "qel call" to it.
+    /// "qel call" to it, plain.
     Process::Result call(const std::vector<std::string>& arguments) const;
 
     /// Asks it to stop and expects that it does so cleanly.

@@ -1,3 +1,4 @@
+#include <qel/common/QelInternalMessageRegistry.hpp>
 #include <qel/common/QelMessageCast.hpp>
 #include <qel/common/QelMessageDax.hpp>
 #include <qel/common/QelMessageExceptions.hpp>
@@ -6,6 +7,7 @@
 #include <qel/common/QelMessageRegistry.hpp>
 #include <qel/common/io/StreamIOException.hpp>
 #include <qel/common/net/Listen.hpp>
+#include <qel/common/net/SocketStream.hpp>
 
 #include "ClientConnection.hpp"
 #include "Failures.hpp"
@@ -105,6 +107,29 @@ TEST_F(ClientConnectionTest, WithoutAHandlerNoticesAreDropped)
     deliver(QelMessageDaxBroadcastOutboundAsync(1, 7, "them", "x"));
     deliver(responseTo(request));
     EXPECT_NE(connection->exchange(request), nullptr);
+}
+
+TEST_F(ClientConnectionTest, AHypervisorThatWantsTlsEndsTheExchange)
+{
+    deliver(QelMessageAbortHandshakeAsync());
+    EXPECT_THAT([&] { connection->exchange(request); },
+                ThrowsMessage<CommandFailure>(
+                    StrEq("the hypervisor end turned this console away: it wants to be asked for TLS")));
+    deliver(QelMessageAbortHandshakeAsync());
+    EXPECT_EQ(exitStatusOf([&] { connection->exchange(request); }), ExitStatus::Refused);
+}
+
+TEST_F(ClientConnectionTest, APlainConnectionIsNotProtectedAndHoldsNothingBack)
+{
+    EXPECT_FALSE(connection->isProtected());
+    EXPECT_FALSE(connection->hasPending());
+}
+
+TEST_F(ClientConnectionTest, LettingInAConnectionWithoutAnEndChangesNoDeadline)
+{
+    connection->letIn();
+    EXPECT_TRUE(stream->readDeadlines().empty());
+    EXPECT_TRUE(stream->writeDeadlines().empty());
 }
 
 TEST_F(ClientConnectionTest, TheNoticeThatTheConnectionClosesEndsTheExchange)
@@ -214,6 +239,15 @@ TEST_F(ClientConnectionTest, OpeningTheSessionIsARequestLikeAnyOther)
 
 // With real sockets.
 
+tool::ConnectOptions plainTo(const IPEndpoint& endpoint, double timeoutSeconds)
+{
+    tool::ConnectOptions options;
+    options.endpoint = endpoint.str();
+    options.transport.plain = true;
+    options.timeoutSeconds = timeoutSeconds;
+    return options;
+}
+
 TEST(ClientConnection, WhereNobodyListensThereIsNoConnection)
 {
     const IPEndpoint endpoint = [] {
@@ -221,7 +255,7 @@ TEST(ClientConnection, WhereNobodyListensThereIsNoConnection)
         return listener.getSocketName();
     }(); // free again by now
     try {
-        ClientConnection::connect(endpoint, std::chrono::seconds(10));
+        ClientConnection::connect(plainTo(endpoint, 10));
         ADD_FAILURE() << "connected";
     } catch (const CommandFailure& failure) {
         EXPECT_EQ(failure.getExitStatus(), ExitStatus::CannotConnect);
@@ -233,7 +267,7 @@ TEST(ClientConnection, WhereNobodyListensThereIsNoConnection)
 TEST(ClientConnection, TheTimeLeftLimitsTheExchange)
 {
     Socket listener = listenOn(IPEndpoint("127.0.0.1:0"), 1);
-    const auto connection = ClientConnection::connect(listener.getSocketName(), std::chrono::milliseconds(100));
+    const auto connection = ClientConnection::connect(plainTo(listener.getSocketName(), 0.1));
     const Socket silent = listener.accept();
     try {
         connection->exchange(QelMessageGetQelTodReq());
@@ -243,10 +277,36 @@ TEST(ClientConnection, TheTimeLeftLimitsTheExchange)
     }
 }
 
+TEST(ClientConnection, TheTimeOfTheHandshakeLimitsTheVersionRequestAndNothingAfterIt)
+{
+    Socket listener = listenOn(IPEndpoint("127.0.0.1:0"), 1);
+    tool::ConnectOptions options = plainTo(listener.getSocketName(), 20);
+    options.transport.handshakeSeconds = 0.1;
+    const auto connection = ClientConnection::connect(options);
+    SocketStream other(listener.accept());
+    EXPECT_THROW(tool::introduce(*connection, {}), StreamIOException);
+
+    const auto patient = ClientConnection::connect(options);
+    SocketStream slow(listener.accept());
+    QelMessageRegistry registry;
+    QelMessageStream messages(slow, registry);
+    std::thread server([&] {
+        const auto version = messages.read();
+        messages.write(responseTo(*version));
+        const auto asked = messages.read();
+        // Not before the time of the handshake is over.
+        PollSet(slow.getSocket().getPollFd(PollEvents::Read)).wait(std::chrono::milliseconds(200));
+        messages.write(responseTo(*asked));
+    });
+    tool::introduce(*patient, {});
+    EXPECT_NO_THROW(patient->exchange(QelMessageGetQelTodReq()));
+    server.join();
+}
+
 TEST(ClientConnection, LeavingWaitsForTheOtherEnd)
 {
     Socket listener = listenOn(IPEndpoint("127.0.0.1:0"), 1);
-    const auto connection = ClientConnection::connect(listener.getSocketName(), std::chrono::seconds(10));
+    const auto connection = ClientConnection::connect(plainTo(listener.getSocketName(), 10));
     Socket other = listener.accept();
     std::string unread(100000, 'x');
     std::thread end([&] {

@@ -1,3 +1,4 @@
+#include <qel/common/QelInternalMessageRegistry.hpp>
 #include <qel/common/QelMessageDax.hpp>
 
 #include "Hypervisor.hpp"
@@ -672,6 +673,53 @@ TEST_F(HypervisorTest, ShuttingDownTwiceIsShuttingDownOnce)
     hypervisor->shutDown();
     hypervisor->shutDown();
     EXPECT_EQ(peer.link.posted(), 1U);
+}
+
+// Before TLS.
+
+TEST_F(HypervisorTest, ConsolesAreTakenUntilThereAreAsManyAsAllowed)
+{
+    tool::HypervisorSettings settings;
+    settings.maxConsoles = 2;
+    makeHypervisor(settings);
+    Peer first;
+    Peer second;
+    Peer unknown;
+    EXPECT_TRUE(hypervisor->takesConsoles());
+    identify(first, "first");
+    connect(unknown);
+    EXPECT_TRUE(hypervisor->takesConsoles());
+    identify(second, "second");
+    EXPECT_FALSE(hypervisor->takesConsoles());
+    hypervisor->disconnect(first.id);
+    EXPECT_TRUE(hypervisor->takesConsoles());
+}
+
+TEST_F(HypervisorTest, AfterShutdownNoConsolesAreTaken)
+{
+    hypervisor->shutDown();
+    EXPECT_FALSE(hypervisor->takesConsoles());
+}
+
+TEST_F(HypervisorTest, AConsoleThatAsksForTlsWhereThereIsNoneIsTurnedAway)
+{
+    Peer peer;
+    connect(peer);
+    EXPECT_EQ(receive(peer, QelMessageUpgradeConnectionAsync()), ConsoleState::Closing);
+    const auto answer = peer.link.take();
+    EXPECT_EQ(answer->getFunction(), QelMessageFunctionQel);
+    EXPECT_EQ(answer->getOperation(), QelMessageOpAbortHandshake);
+    EXPECT_EQ(answer->getClassification(), QelMessageClassification::Async);
+    EXPECT_TRUE(peer.link.finished);
+    EXPECT_THAT(log.lines(), ElementsAre("W: [qel] console 1: closed, it asked for TLS, which is not done here"));
+}
+
+TEST_F(HypervisorTest, TheAbortMessageMeansNothingToTheHypervisor)
+{
+    Peer peer;
+    identify(peer, "a");
+    EXPECT_EQ(receive(peer, QelMessageAbortHandshakeAsync()), ConsoleState::Identified);
+    EXPECT_EQ(peer.link.posted(), 0U);
 }
 
 } // namespace

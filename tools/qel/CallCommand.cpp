@@ -73,7 +73,7 @@ std::unique_ptr<QelMessage> callRequest(ClientConnection& connection, const Iden
 ExitStatus runCall(const CallOptions& options, const CallRequest& request)
 {
     startLogging(options.log, "qel-call.log", LogLevel::Warn, true);
-    const auto connection = ClientConnection::connect(IPEndpoint(options.connect.endpoint), options.connect.timeout());
+    const auto connection = ClientConnection::connect(options.connect);
     try {
         const auto response = callRequest(*connection, options.connect.identity, request);
         connection->leave();
@@ -93,7 +93,7 @@ CLI::App& addRequest(CLI::App& command, Action& action, const std::shared_ptr<Ca
     CLI::App& request = addCommand(command, name, description);
     request.fallthrough(); // so that the options of "call" may also stand behind the request
     request.callback([&action, call, make = std::move(make)] {
-        static_cast<void>(checkedEndpoint(call->options.connect.endpoint, call->options.connect.plain));
+        checkTransport(call->options.connect.transport, call->options.connect.endpoint);
         action = [call, make] { return runCall(call->options, make(call->arguments)); };
     });
     return request;

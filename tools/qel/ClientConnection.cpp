@@ -1,13 +1,16 @@
 #include "ClientConnection.hpp"
 
+#include <qel/common/QelInternalMessageRegistry.hpp>
 #include <qel/common/QelMessageDax.hpp>
 #include <qel/common/QelMessageInterfaceComponent.hpp>
+#include <qel/common/io/StreamIOException.hpp>
 #include <qel/common/net/Socket.hpp>
 #include <qel/common/net/SocketStream.hpp>
 #include <qel/common/util/PosixError.hpp>
 #include <qel/common/util/TimeProvider.hpp>
 
 #include "Failures.hpp"
+#include "Handshake.hpp"
 #include "Logging.hpp"
 #include "MessageRegistry.hpp"
 
@@ -25,7 +28,6 @@ constexpr std::uint32_t kInterfaceVersion = 1;
 constexpr std::uint16_t kMajorVersion = 1;
 constexpr std::uint16_t kMinorVersion = 0;
 
-constexpr std::chrono::milliseconds kShortestWait(1);
 constexpr std::chrono::milliseconds kLongestFarewell(1000);
 
 Socket connectSocket(const IPEndpoint& endpoint, std::chrono::milliseconds timeout)
@@ -49,6 +51,26 @@ std::unique_ptr<SocketStream> tuneSocket(Socket socket, const IPEndpoint& endpoi
     }
 }
 
+using TimePoint = std::chrono::steady_clock::time_point;
+
+/// From a connection in the clear to one that is protected and leads to whom it should.
+std::unique_ptr<Stream> protect(std::unique_ptr<Stream> stream, int descriptor, SSLClientContext& context,
+                                const ConnectOptions& options, TimePoint end)
+{
+    try {
+        limitTo(*stream, end);
+        requestUpgrade(*stream, descriptor);
+        auto tls = std::make_unique<SSLStream>(context, std::move(stream));
+        startTls(*tls);
+        checkPeer(*tls, options.transport.pins);
+        logLine(LogLevel::Info, "connected over TLS to ", describePeer(*tls));
+        return tls;
+    } catch (const CommandFailure& failure) {
+        throw CommandFailure(failure.getExitStatus(),
+                             "no protected connection to " + options.endpoint + ": " + failure.what());
+    }
+}
+
 template <typename T>
 bool is(const QelMessage& message)
 {
@@ -60,21 +82,31 @@ bool is(const QelMessage& message)
 } // namespace
 
 ClientConnection::ClientConnection(std::unique_ptr<Stream> stream, int descriptor)
-    : mStream(std::move(stream)), mDescriptor(descriptor), mMessages(*mStream, messageRegistry())
+    : mStream(std::move(stream)), mTls(dynamic_cast<const SSLStream*>(mStream.get())), mDescriptor(descriptor),
+      mMessages(*mStream, messageRegistry())
 {}
 
 ClientConnection::~ClientConnection() = default;
 
-std::unique_ptr<ClientConnection> ClientConnection::connect(const IPEndpoint& endpoint,
-                                                            std::chrono::milliseconds timeout)
+std::unique_ptr<ClientConnection> ClientConnection::connect(const ConnectOptions& options)
 {
-    const auto end = TimeProvider::steady() + timeout;
-    auto stream = tuneSocket(connectSocket(endpoint, timeout), endpoint);
-    const int descriptor = stream->getSocket().getFd();
+    const IPEndpoint endpoint(options.endpoint);
+    const auto context = makeClientContext(options.transport);
+    const TimePoint end = TimeProvider::steady() + options.timeout();
+    auto socket = tuneSocket(connectSocket(endpoint, options.timeout()), endpoint);
+    const TimePoint handshakeEnd = std::min(end, TimeProvider::steady() + options.transport.handshakeTimeout());
+    const int descriptor = socket->getSocket().getFd();
+    std::unique_ptr<Stream> stream = std::move(socket);
+    if (context != nullptr) stream = protect(std::move(stream), descriptor, *context, options, handshakeEnd);
     auto connection = std::make_unique<ClientConnection>(std::move(stream), descriptor);
-    const auto left = std::chrono::duration_cast<std::chrono::milliseconds>(end - TimeProvider::steady());
-    connection->setDeadline(std::max(left, kShortestWait));
+    limitTo(*connection->mStream, handshakeEnd);
+    connection->mEnd = end;
     return connection;
+}
+
+void ClientConnection::letIn()
+{
+    if (!mEnd.isDisabled()) limitTo(*mStream, mEnd);
 }
 
 void ClientConnection::setDeadline(std::chrono::milliseconds timeout)
@@ -120,6 +152,8 @@ PollFd ClientConnection::getPollFd(PollEvents events) const
     return mDescriptor < 0 ? PollFd::Ignore : PollFd(mDescriptor, events);
 }
 
+bool ClientConnection::hasPending() const { return mTls != nullptr && mTls->hasPending(); }
+
 void ClientConnection::leave() noexcept
 {
     try {
@@ -158,13 +192,17 @@ void ClientConnection::pHandleNotice(const QelMessage& message) const
     if (is<QelMessageKrogConnectionClosedAsync>(message)) {
         throw CommandFailure(ExitStatus::ClosedByPeer, "the hypervisor closed the connection");
     }
+    if (is<QelMessageAbortHandshakeAsync>(message)) {
+        throw CommandFailure(ExitStatus::Refused,
+                             "the hypervisor end turned this console away: it wants to be asked for TLS");
+    }
     logLine(LogLevel::Debug, "notice while waiting for a response: ", message.getLogID());
     if (mNoticeHandler) mNoticeHandler(message);
 }
 
 std::unique_ptr<ClientConnection> connectConsole(const ConnectOptions& options)
 {
-    auto connection = ClientConnection::connect(IPEndpoint(options.endpoint), options.timeout());
+    auto connection = ClientConnection::connect(options);
     static_cast<void>(introduce(*connection, options.identity));
     return connection;
 }
@@ -172,9 +210,19 @@ std::unique_ptr<ClientConnection> connectConsole(const ConnectOptions& options)
 std::unique_ptr<QelMessage> introduce(ClientConnection& connection, const IdentityOptions& identity)
 {
     const IdentityOptions complete = completeIdentity(identity);
-    return connection.require(
-        "version request", QelMessageGetEnclTypeAndInterfaceVersionReq(kInterfaceVersion, complete.toolType,
-                                                                       kMajorVersion, kMinorVersion, complete.toolId));
+    const QelMessageGetEnclTypeAndInterfaceVersionReq request(kInterfaceVersion, complete.toolType, kMajorVersion,
+                                                              kMinorVersion, complete.toolId);
+    try {
+        auto response = connection.require("version request", request);
+        connection.letIn();
+        return response;
+    } catch (const StreamIOException& error) {
+        if (!connection.isProtected() || exitStatusOf(error) != ExitStatus::ClosedByPeer) throw;
+        throw CommandFailure(ExitStatus::ClosedByPeer, "the hypervisor end closed the connection right after the TLS "
+                                                       "handshake, perhaps because it does not know this end's "
+                                                       "certificate: " +
+                                                           explain(error));
+    }
 }
 
 void openHypervisorSession(ClientConnection& connection)

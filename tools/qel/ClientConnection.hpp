@@ -3,7 +3,7 @@
 #include <qel/common/QelMessage.hpp>
 #include <qel/common/io/QelMessageStream.hpp>
 #include <qel/common/io/Stream.hpp>
-#include <qel/common/net/IPEndpoint.hpp>
+#include <qel/common/security/SSLStream.hpp>
 #include <qel/common/util/Poll.hpp>
 
 #include "CommonOptions.hpp"
@@ -29,9 +29,15 @@ public:
     explicit ClientConnection(std::unique_ptr<Stream> stream, int descriptor = -1);
     ~ClientConnection();
 
-    /// Connects over TCP. What is left of the time then limits all sending and receiving, as by setDeadline().
-    /// @throws CommandFailure  CannotConnect
-    static std::unique_ptr<ClientConnection> connect(const IPEndpoint& endpoint, std::chrono::milliseconds timeout);
+    /// Connects over TCP and, unless the options say that the connection is plain, over TLS. The time of the handshake
+    /// then limits all sending and receiving, until letIn() is called.
+    /// @throws CommandFailure  CannotConnect; with TLS also what Handshake.hpp and PeerPins.hpp say
+    /// @throws FileIOError, CommandFailure  the credentials cannot be used, see makeClientContext()
+    static std::unique_ptr<ClientConnection> connect(const ConnectOptions& options);
+
+    /// The handshake is over. What is left of the time for everything now limits sending and receiving; for a
+    /// connection that was not made by connect() nothing changes.
+    void letIn();
 
     /// Limits the time that all sending and all receiving from now on may take together, each counted from its first
     /// use.
@@ -60,10 +66,16 @@ public:
     /// Waits for the next message. @throws StreamIOException, QelMessageValidationException  as QelMessageStream does
     std::unique_ptr<QelMessage> receive();
 
-    /// For waiting on this connection together with something else. The descriptor is that of the socket: a stream that
-    /// holds back bytes it has already taken from the socket is not seen to be readable.
+    /// For waiting on this connection together with something else. The descriptor is that of the socket: ask
+    /// hasPending() before waiting for it to become readable.
     /// @return PollFd::Ignore for a stream without a descriptor
     PollFd getPollFd(PollEvents events) const;
+
+    /// Whether a part of a message has come that the socket does not have any more: TLS has taken it from there.
+    bool hasPending() const;
+
+    /// Whether it goes over TLS, which ends both directions when something fails in one.
+    bool isProtected() const noexcept { return mTls != nullptr; }
 
     /// Ends the connection politely: says that nothing more will come and waits, for a second at most, until the other
     /// end has ended it too. By then the hypervisor has forgotten this console, so that whoever connects next, under
@@ -79,17 +91,21 @@ private:
     void pHandleNotice(const QelMessage& message) const;
 
     std::unique_ptr<Stream> mStream;
+    const SSLStream* mTls; // the same; null for a plain connection
     int mDescriptor;
     QelMessageStream mMessages;
     NoticeHandler mNoticeHandler;
+    PollDeadline mEnd; // of the time for everything; disabled: there is none
 };
 
 /// Connects and introduces this console: what every use of the hypervisor begins with.
 /// @throws what ClientConnection::connect() and require() throw
 std::unique_ptr<ClientConnection> connectConsole(const ConnectOptions& options);
 
-/// Sends the version request. Step 1 of every connection.
+/// Sends the version request. Step 1 of every connection, and the last one of the handshake.
 /// @return the response, granted
+/// @throws CommandFailure  ClosedByPeer: over TLS this is how a hypervisor end that does not know this console's
+///                         certificate turns it away; and what require() throws
 std::unique_ptr<QelMessage> introduce(ClientConnection& connection, const IdentityOptions& identity);
 
 /// Opens the hypervisor session, which everything about virtual serial sessions needs.

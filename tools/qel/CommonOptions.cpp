@@ -39,7 +39,7 @@ void addConnectOptions(CLI::App& app, ConnectOptions& options)
         ->required()
         ->type_name("ENDPOINT")
         ->check(endpointValidator());
-    addPlainOption(app, options.plain);
+    addTransportOptions(app, options.transport);
     app.add_option("--timeout", options.timeoutSeconds, "Seconds for connecting and all answers together")
         ->type_name("SECONDS")
         ->check(CLI::Range(kShortestTimeout, kLongestTimeout))
@@ -56,22 +56,7 @@ void addJsonOption(CLI::App& app, bool& json)
     app.add_flag("--json", json, "Print one JSON document instead of text for people");
 }
 
-void addPlainOption(CLI::App& app, bool& plain)
-{
-    app.add_flag("--plain", plain, "Let the connection go unprotected; for loopback addresses only");
-}
-
 CLI::Validator endpointValidator() { return CLI::Validator(checkEndpoint, ""); }
-
-IPEndpoint checkedEndpoint(const std::string& endpoint, bool plain)
-{
-    if (!plain) throw CLI::ValidationError("--plain", "is required: connections are not protected");
-    const IPEndpoint parsed(endpoint);
-    if (!isLoopback(parsed.getAddress())) {
-        throw CLI::ValidationError("--plain", "is refused for " + endpoint + ", which is no loopback address");
-    }
-    return parsed;
-}
 
 bool isLoopback(const IPAddress& address)
 {

@@ -36,9 +36,9 @@ it is: echo 'uname -srm' | qel console ... PARTITION. When such an input ends, t
 character (control-D), again after every second of silence, and everything it puts out is printed until its command
 ends. The output contains the echo of the input if the partition echoes it, as terminals do.
 
-Exit status: 0 the command ended, or you left; 1 refused, or another console took the session; 2 usage; 3 cannot
-connect; 4 something failed on this machine; 5 the hypervisor end broke the protocol; 6 it did not answer in time; 7 it
-shut down or the connection was lost.)";
+Exit status: 0 the command ended, or you left; 1 refused, or the hypervisor end is not who it should be, or another
+console took the session; 2 usage; 3 cannot connect; 4 something failed on this machine; 5 the hypervisor end broke the
+protocol; 6 it did not answer in time; 7 it shut down or the connection was lost.)";
 
 struct ConsoleOptions {
     ConnectOptions connect;
@@ -198,7 +198,7 @@ CLI::App& addConsoleCommand(CLI::App& parent, Action& action)
     addLogOptions(command, options->log);
     command.footer(kFooter);
     command.callback([&action, options] {
-        static_cast<void>(checkedEndpoint(options->connect.endpoint, options->connect.plain));
+        checkTransport(options->connect.transport, options->connect.endpoint);
         action = [options] { return runConsole(*options); };
     });
     return command;

@@ -115,14 +115,17 @@ void ConsoleLoop::pTurn()
     if (pWantsMessages()) set += messages;
     if (pWantsToSend()) set += sending;
     if (!mScreen.output().isEmpty()) set += output;
-    const PollResult ready = set.wait(pDeadline().getTimeout(TimeProvider::steady()));
+    // What TLS has taken from the socket is there to be received although the socket has nothing.
+    const bool isPending = pWantsMessages() && mSession.hasPending();
+    const auto timeout = pDeadline().getTimeout(TimeProvider::steady());
+    const PollResult ready = isPending ? set.poll() : set.wait(timeout);
 
     if (ready.contains(mSignals.getPollFd())) pHandleSignal();
     if (ready.contains(output)) pWriteOutput();
-    if (pWantsMessages() && ready.contains(messages)) pReceive();
+    if (pWantsMessages() && (isPending || ready.contains(messages))) pReceive();
     if (pWantsToSend() && ready.contains(sending)) pSend();
     if (pWantsInput() && ready.contains(input)) pReadInput();
-    if (!ready.anyReady()) pLookAtTime();
+    if (!ready.anyReady() && !isPending) pLookAtTime();
 }
 
 void ConsoleLoop::pHandleSignal()
@@ -168,11 +171,11 @@ void ConsoleLoop::pSend()
         mQuietSince = TimeProvider::steady();
         mSession.send(mPending);
     } catch (const StreamIOException& error) {
-        // A hypervisor that closes the connection may have said why: that is still to be read.
+        // A hypervisor that closes the connection may have said why: that is still to be read, unless by TLS.
         mPending.clear();
         mInputOpen = false;
         mSendBroken = true;
-        if (exitStatusOf(error) != ExitStatus::DeadlinePassed) return;
+        if (exitStatusOf(error) != ExitStatus::DeadlinePassed && mSession.outlivesFailedSend()) return;
         mFailure = std::current_exception();
         pDepart(Departure::Ended);
     }

@@ -101,6 +101,10 @@ public:
     /// For waiting on messages, or for a message to be taken.
     PollFd getPollFd(PollEvents events) const { return mConnection.getPollFd(events); }
 
+    /// Whether to receive() without waiting, and whether that still makes sense when send() has failed.
+    bool hasPending() const { return mConnection.hasPending(); }
+    bool outlivesFailedSend() const noexcept { return !mConnection.isProtected(); }
+
 private:
     void pHandle(const QelMessage& message);
     void pHandleNotice(const QelMessage& message);

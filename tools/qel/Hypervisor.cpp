@@ -1,5 +1,6 @@
 #include "Hypervisor.hpp"
 
+#include <qel/common/QelInternalMessageRegistry.hpp>
 #include <qel/common/QelMessageDax.hpp>
 #include <qel/common/QelMessageGeneric.hpp>
 #include <qel/common/util/TimeProvider.hpp>
@@ -31,6 +32,14 @@ std::unique_ptr<QelMessage> bareResponse(const QelMessage& request, QelMessageSt
                                                         request.getOperation(), MsgResponse);
     response->setStatus(status);
     return response;
+}
+
+/// The registry of this end does not know the message: it has its place before TLS alone.
+bool isUpgrade(const QelMessage& message)
+{
+    return std::make_tuple(static_cast<unsigned short>(message.getFunction()),
+                           static_cast<unsigned short>(message.getOperation()),
+                           message.getClassification()) == QelMessageUpgradeConnectionAsync::getMessageID();
 }
 
 template <typename T>
@@ -95,6 +104,12 @@ bool Hypervisor::mayReceive(ConsoleId id) const
     const auto found = mConsoles.find(id);
     if (found == mConsoles.end()) return true;
     return found->second.link.hasRoom() && mPartitions.hasInputRoom(found->second);
+}
+
+bool Hypervisor::takesConsoles() const
+{
+    const MutexLock lock(mMutex);
+    return !mShutDown && pCountIdentified() < mSettings.maxConsoles;
 }
 
 void Hypervisor::disconnect(ConsoleId id)
@@ -203,7 +218,16 @@ void Hypervisor::pHandleNotice(Console& console, const QelMessage& notice)
 {
     const auto* data = dynamic_cast<const QelMessageVirtualSerialDataToOsAsync*>(&notice);
     if (data != nullptr && mPartitions.feed(console, *data)) return;
+    if (isUpgrade(notice)) return pRefuseUpgrade(console);
     logLine(LogLevel::Warn, "console ", console.id, ": ignored ", notice.getLogID());
+}
+
+/// A console asks for TLS where there is none, or none any more: it would wait for the answer in vain.
+void Hypervisor::pRefuseUpgrade(Console& console)
+{
+    logLine(LogLevel::Warn, "console ", console.id, ": closed, it asked for TLS, which is not done here");
+    console.link.post(std::make_unique<QelMessageAbortHandshakeAsync>());
+    pClose(console);
 }
 
 /// Everything that can be said about a request before it is looked into.

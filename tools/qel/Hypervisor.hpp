@@ -58,6 +58,9 @@ public:
     /// take its input. ConsoleLink::resumeReading() says when to look again.
     bool mayReceive(ConsoleId id) const;
 
+    /// False when another console would be turned away: as many as allowed are there, or the hypervisor shuts down.
+    bool takesConsoles() const;
+
     /// Forgets a connection; its sessions end. Its link is not called afterwards. Unknown ids are ignored.
     void disconnect(ConsoleId id);
 
@@ -116,6 +119,7 @@ private:
     Console* pFindIdentified(std::uint32_t toolType, const std::string& toolId) QEL_REQUIRES(mMutex);
     std::size_t pCountIdentified() const QEL_REQUIRES(mMutex);
     bool pSendBroadcast(Console& to, const Console& from, const QelMessageDaxBroadcastReq&) QEL_REQUIRES(mMutex);
+    void pRefuseUpgrade(Console& console) QEL_REQUIRES(mMutex);
     void pClose(Console& console) QEL_REQUIRES(mMutex);
 
     const HypervisorSettings mSettings;

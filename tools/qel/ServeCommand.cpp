@@ -12,6 +12,7 @@
 #include "SerialLoop.hpp"
 #include "Server.hpp"
 #include "SignalWatch.hpp"
+#include "TransportOptions.hpp"
 #include "WakeUp.hpp"
 
 #include <csignal>
@@ -30,16 +31,14 @@ namespace {
 constexpr int kBacklog = 64;
 constexpr std::size_t kMostPartitions = 255; // the maximum-sessions response has one byte for them
 constexpr std::size_t kLongestName = 16;
-constexpr double kLongestHandshake = 24 * 60 * 60;
 
-constexpr std::initializer_list<int> kStopSignals{SIGTERM, SIGINT, SIGHUP};
+constexpr std::initializer_list<int> kSignals{SIGTERM, SIGINT, SIGHUP};
 
 struct ServeOptions {
     std::string endpoint = "127.0.0.1:0";
-    bool plain = false;
+    TransportOptions transport;
     std::vector<std::string> partitions; ///< "ID=COMMAND"
     std::uint32_t maxConsoles = 0;
-    double handshakeSeconds = 10;
     std::string family;
     std::string version;
     std::string capabilities = std::string(QelCapabilities::size(), '1');
@@ -136,43 +135,72 @@ struct ServePlan {
     IPEndpoint endpoint;
     std::map<std::uint16_t, std::string> commands;
     HypervisorSettings settings;
-    ConnectionTimes times;
+    TransportOptions transport;
     LogOptions log;
 };
 
 ServePlan makePlan(const ServeOptions& options)
 {
     ServePlan plan;
-    plan.endpoint = checkedEndpoint(options.endpoint, options.plain);
+    checkTransport(options.transport, options.endpoint);
+    plan.endpoint = IPEndpoint(options.endpoint);
+    plan.transport = options.transport;
     plan.commands = parsePartitions(options.partitions);
     plan.settings = parseSettings(options);
-    plan.times.handshake =
-        std::chrono::duration_cast<std::chrono::milliseconds>(std::chrono::duration<double>(options.handshakeSeconds));
     plan.log = options.log;
     return plan;
+}
+
+/// SIGHUP: gives the connections to come the credentials that the files hold now.
+void reload(Server& server, const TransportOptions& transport)
+{
+    if (transport.plain) return logLine(LogLevel::Info, "SIGHUP: connections are plain, there is nothing to load");
+    try {
+        server.setContext(makeServerContext(transport));
+        logLine(LogLevel::Info, "SIGHUP: loaded ", transport.paths().certificate, " for new connections");
+    } catch (const std::exception& error) {
+        logLine(LogLevel::Error, "SIGHUP: the credentials stay as they were: ", explain(error));
+    }
+}
+
+/// @return the signal that asks to stop
+int serveUntilStopped(Server& server, SignalWatch& signals, const TransportOptions& transport)
+{
+    for (;;) {
+        server.run(signals.getPollFd());
+        const int signal = signals.take();
+        if (signal == SIGHUP) {
+            reload(server, transport);
+        } else if (signal != 0) {
+            return signal;
+        }
+    }
 }
 
 ExitStatus runServe(const ServePlan& plan)
 {
     startLogging(plan.log, "qel-serve.log", LogLevel::Info, false);
     static_cast<void>(std::signal(SIGPIPE, SIG_IGN)); // a log that nobody reads any more must not end the server
-    SignalWatch signals(kStopSignals);
+    SignalWatch signals(kSignals);
+    auto context = makeServerContext(plan.transport);
     Socket listener = openListener(plan.endpoint);
     const IPEndpoint listening = listener.getSocketName();
 
     ChildReaper reaper;
     WakeUp serialWake;
     Hypervisor hypervisor(plan.settings, makePartitions(plan.commands, reaper), [&] { serialWake.interrupt(); });
-    Server server(hypervisor, std::move(listener), plan.times);
+    ConnectionTimes times;
+    times.handshake = plan.transport.handshakeTimeout();
+    Server server(hypervisor, std::move(listener), times, std::move(context), plan.transport.pins);
     SerialLoop serial(hypervisor, reaper, serialWake);
 
     std::cout << listening << std::endl;
     flushOutput();
     logLine(LogLevel::Info, "listening on ", listening);
-    server.run(signals.getPollFd());
+    const int signal = serveUntilStopped(server, signals, plan.transport);
 
-    logLine(LogLevel::Info, "stopping: signal ", signals.take());
-    for (const int number : kStopSignals)
+    logLine(LogLevel::Info, "stopping: signal ", signal);
+    for (const int number : kSignals)
         static_cast<void>(std::signal(number, SIG_IGN)); // once is enough
     hypervisor.shutDown();
     server.finish();
@@ -210,7 +238,7 @@ CLI::App& addServeCommand(CLI::App& parent, Action& action)
         ->type_name("ENDPOINT")
         ->check(endpointValidator())
         ->capture_default_str();
-    addPlainOption(command, options->plain);
+    addTransportOptions(command, options->transport);
     command
         .add_option(
             "--partition", options->partitions,
@@ -219,11 +247,6 @@ CLI::App& addServeCommand(CLI::App& parent, Action& action)
         ->allow_extra_args(false);
     command.add_option("--max-consoles", options->maxConsoles, "Consoles served at a time")
         ->check(CLI::Range(1, 255))
-        ->capture_default_str();
-    command
-        .add_option("--handshake-timeout", options->handshakeSeconds, "Seconds that a console has to introduce itself")
-        ->type_name("SECONDS")
-        ->check(CLI::Range(0.001, kLongestHandshake))
         ->capture_default_str();
     addIdentityOptions(command, *options);
     addLogOptions(command, options->log);

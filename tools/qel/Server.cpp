@@ -41,8 +41,10 @@ bool isPassing(int error)
 
 } // namespace
 
-Server::Server(Hypervisor& hypervisor, Socket listener, ConnectionTimes times)
-    : mHypervisor(hypervisor), mListener(std::move(listener)), mTimes(times)
+Server::Server(Hypervisor& hypervisor, Socket listener, ConnectionTimes times,
+               std::unique_ptr<SSLServerContext> context, PeerPins pins)
+    : mHypervisor(hypervisor), mListener(std::move(listener)), mTimes(times), mContext(std::move(context)),
+      mPins(std::move(pins))
 {
     // A connection may be gone between the wait and accept(), which must not wait for the next one then.
     mListener.setFlags(mListener.getFlags() | O_NONBLOCK);
@@ -68,16 +70,20 @@ void Server::run(const PollFd& stop)
 void Server::finish()
 {
     mListener = Socket(-1);
+    mStopping = true;
+    for (const auto& admission : mAdmissions)
+        admission->stop();
     const PollDeadline deadline(TimeProvider::steady() + mTimes.linger);
     for (;;) {
         pDropEnded();
         const auto now = TimeProvider::steady();
-        if (mConnections.empty() || deadline.isExpired(now)) break;
+        if ((mAdmissions.empty() && mConnections.empty()) || deadline.isExpired(now)) break;
         static_cast<void>(PollSet(mConnectionEnded.getPollFd()).wait(deadline.getTimeout(now)));
     }
     for (const auto& connection : mConnections)
         connection->abort();
     mConnections.clear();
+    mAdmissions.clear();
 }
 
 void Server::pAccept()
@@ -103,7 +109,22 @@ void Server::pTakeIn(Socket socket)
         return;
     }
     const int descriptor = stream->getSocket().getFd();
-    auto connection = std::make_unique<Connection>(mHypervisor, std::move(stream), descriptor, peer, mTimes,
+    if (mContext != nullptr) return pAdmit(std::move(stream), peer);
+    pConnect(std::move(stream), descriptor, peer, mTimes);
+}
+
+void Server::pAdmit(std::unique_ptr<SocketStream> stream, const std::string& peer)
+{
+    auto admission = std::make_unique<Admission>(mHypervisor, std::move(stream), peer, *mContext, mPins,
+                                                 TimeProvider::steady() + mTimes.handshake,
+                                                 [this] { mConnectionEnded.interrupt(); });
+    admission->start();
+    mAdmissions.push_back(std::move(admission));
+}
+
+void Server::pConnect(std::unique_ptr<Stream> stream, int descriptor, const std::string& peer, ConnectionTimes times)
+{
+    auto connection = std::make_unique<Connection>(mHypervisor, std::move(stream), descriptor, peer, times,
                                                    [this] { mConnectionEnded.interrupt(); });
     connection->start();
     mConnections.push_back(std::move(connection));
@@ -118,9 +139,29 @@ void Server::pPause(const std::exception& reason)
 void Server::pDropEnded()
 {
     mConnectionEnded.eoi();
-    const std::size_t before = mConnections.size();
+    const std::size_t before = mConnections.size() + mAdmissions.size();
     mConnections.remove_if([](const std::unique_ptr<Connection>& connection) { return connection->hasEnded(); });
-    if (mConnections.size() < before) mPausedUntil = PollDeadline(); // there are descriptors again
+    std::vector<Admission::Admitted> ended;
+    mAdmissions.remove_if([&ended](const std::unique_ptr<Admission>& admission) {
+        if (!admission->hasEnded()) return false;
+        ended.push_back(admission->release());
+        return true;
+    });
+    for (Admission::Admitted& admitted : ended)
+        pLetIn(std::move(admitted));
+    if (mConnections.size() + mAdmissions.size() < before) mPausedUntil = PollDeadline(); // there are descriptors again
+}
+
+void Server::pLetIn(Admission::Admitted admitted)
+{
+    if (admitted.stream == nullptr || mStopping) return;
+    ConnectionTimes times = mTimes;
+    times.handshake = admitted.timeLeft;
+    try {
+        pConnect(std::move(admitted.stream), admitted.descriptor, admitted.peer, times);
+    } catch (const std::exception& error) {
+        pPause(error);
+    }
 }
 
 } // namespace qel::tool

@@ -1,10 +1,13 @@
 #pragma once
 
 #include <qel/common/net/Socket.hpp>
+#include <qel/common/net/SocketStream.hpp>
 #include <qel/common/util/Poll.hpp>
 
+#include "Admission.hpp"
 #include "Connection.hpp"
 #include "Hypervisor.hpp"
+#include "PeerPins.hpp"
 #include "WakeUp.hpp"
 
 #include <chrono>
@@ -19,7 +22,10 @@ class Server {
 public:
     /// @param hypervisor  borrowed; must outlive this object
     /// @param listener  listens already
-    Server(Hypervisor& hypervisor, Socket listener, ConnectionTimes times);
+    /// @param context  for TLS; null: connections are plain
+    /// @param pins  who may come in over TLS
+    Server(Hypervisor& hypervisor, Socket listener, ConnectionTimes times,
+           std::unique_ptr<SSLServerContext> context = nullptr, PeerPins pins = {});
 
     /// Cuts what is left of the connections.
     ~Server();
@@ -27,8 +33,11 @@ public:
     Server(const Server&) = delete;
     Server& operator=(const Server&) = delete;
 
-    /// Accepts connections until `stop` becomes readable.
+    /// Accepts connections until `stop` becomes readable. May be called again.
     void run(const PollFd& stop);
+
+    /// From now on connections are made with this; those that are there keep what they have.
+    void setContext(std::unique_ptr<SSLServerContext> context) { mContext = std::move(context); }
 
     /// Accepts no more, waits for all connections to end and cuts those that have not in time. To be called after
     /// Hypervisor::shutDown(), which makes them end.
@@ -37,14 +46,21 @@ public:
 private:
     void pAccept();
     void pTakeIn(Socket socket);
+    void pAdmit(std::unique_ptr<SocketStream> stream, const std::string& peer);
+    void pConnect(std::unique_ptr<Stream> stream, int descriptor, const std::string& peer, ConnectionTimes times);
     void pPause(const std::exception& reason);
     void pDropEnded();
+    void pLetIn(Admission::Admitted admitted);
 
     Hypervisor& mHypervisor;
     Socket mListener;
     const ConnectionTimes mTimes;
     WakeUp mConnectionEnded;
-    PollDeadline mPausedUntil; // no connection is accepted before; disabled: not paused
+    PollDeadline mPausedUntil;                  // no connection is accepted before; disabled: not paused
+    std::unique_ptr<SSLServerContext> mContext; // null: connections are plain
+    const PeerPins mPins;
+    bool mStopping = false;
+    std::list<std::unique_ptr<Admission>> mAdmissions; // on their way to TLS
     std::list<std::unique_ptr<Connection>> mConnections;
 };
 

@@ -1,0 +1,49 @@
+#pragma once
+
+#include <qel/common/net/SocketStream.hpp>
+#include <qel/common/security/SSLContext.hpp>
+#include <qel/common/security/SSLStream.hpp>
+
+#include "tools/Loopback.hpp"
+
+#include <memory>
+#include <string>
+#include <utility>
+
+namespace qel::test {
+
+/// A console that takes the steps to TLS one at a time, and may stop or go astray at each. Reads have a deadline.
+class TlsConsole {
+public:
+    /// Connects over TCP.
+    explicit TlsConsole(const std::string& endpoint);
+
+    /// Asks for TLS. The answer is left to be taken.
+    void ask();
+    /// Takes a message in the clear. @return its operation: upgrade or abort
+    unsigned int takeAnswer();
+    /// Takes the step to TLS, with the credentials of a client of Authority::trusted().
+    void startTls(const SSLCredentials& credentials);
+    /// All of it, and the version request.
+    void comeIn(const std::string& toolId);
+
+    /// Hands the connection in the clear to somebody else; nothing can be done with this console any more.
+    std::unique_ptr<Stream> takeStream() { return std::move(mStream); }
+
+    /// Bytes as they are, in the clear.
+    void sendBytes(const std::string& bytes) { mStream->write(bytes.data(), bytes.size()); }
+    /// True when the server has ended the connection and nothing was left to read.
+    bool isClosed();
+
+    /// Frames over TLS.
+    LoopbackMessages& messages() { return *mMessages; }
+    SSLStream& tls() { return *mTls; }
+
+private:
+    SSLClientContext mContext;
+    std::unique_ptr<Stream> mStream; // empty once there is mTls
+    std::unique_ptr<SSLStream> mTls;
+    std::unique_ptr<LoopbackMessages> mMessages;
+};
+
+} // namespace qel::test
