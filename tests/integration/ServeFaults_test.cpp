@@ -172,8 +172,8 @@ TEST(ServeFaults, ConsolesThatVanishLeaveNothingBehind)
             }
         }
     }
-    EXPECT_TRUE(comesTrue(quiet));
-    EXPECT_EQ(server.process().descriptors(), before);
+    // A thread ends before its connection is put away, also before the first count.
+    EXPECT_TRUE(comesTrue([&] { return quiet() && server.process().descriptors() <= before; }));
     EXPECT_EQ(childrenOf(server.process().pid()), 1U); // the command goes on
     server.stop();
 }
@@ -188,7 +188,8 @@ TEST(ServeFaults, CommandsThatEndLeaveNothingBehind)
         console.openSerial(1);
         ASSERT_EQ(console.awaitClosed(1), 4U);
     }
-    EXPECT_EQ(server.process().descriptors(), before);
+    // The console is told before the terminal is put away.
+    EXPECT_TRUE(comesTrue([&] { return server.process().descriptors() == before; }));
     EXPECT_TRUE(comesTrue([&] { return childrenOf(server.process().pid()) == 0; }));
     server.stop();
 }
