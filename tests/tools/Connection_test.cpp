@@ -7,6 +7,8 @@
 
 #include <future>
 #include <gmock/gmock.h>
+#include <sstream>
+#include <thread>
 
 namespace qel::test {
 
@@ -14,6 +16,7 @@ namespace {
 
 using ::testing::Contains;
 using ::testing::HasSubstr;
+using ::testing::StartsWith;
 using tool::Connection;
 using tool::ConnectionTimes;
 
@@ -208,6 +211,72 @@ TEST_F(ConnectionTest, AConsoleThatDoesNotReadHoldsUpNobodyElse)
     second.start();
     EXPECT_EQ(frames.ask(versionRequest("b"))->getStatus(), 0U);
     EXPECT_EQ(frames.ask(QelMessageDaxBroadcastReq(0, 1, 0, "", "x"))->getStatus(), 0U);
+}
+
+TEST_F(ConnectionTest, APartitionThatPrintsWithoutEndIsHeldBackAndLeavesRoomForTheRest)
+{
+    start();
+    identify();
+    messages.ask(QelMessageInterfaceCmpOpenKrogSessionReq());
+    messages.ask(QelMessageVirtualSerialOpenReq(1, 0, false));
+    messages.ask(QelMessageVirtualSerialSetupSessionReq(1, 0));
+    unsigned chunks = 0; // the console reads none of them
+    for (unsigned full = 0; full < 50; full = hypervisor->serialWatches().empty() ? full + 1 : 0) {
+        if (full > 0) {
+            std::this_thread::sleep_for(std::chrono::milliseconds(1)); // the system's buffers may still be filling
+            continue;
+        }
+        port1->output = {std::string(4096, static_cast<char>('a' + ++chunks % 26))};
+        hypervisor->serviceSerial(1);
+    }
+    EXPECT_TRUE(hypervisor->mayReceive(1));
+    const QelMessageGetQelTodReq request;
+    messages.send(request);
+
+    // In the queue there are at most half of the limit and one message, one waits for room, and all of the rest must
+    // have been in the buffers of the system.
+    std::ostringstream text;
+    connection->dumpStatistics(text);
+    EXPECT_THAT(text.str(), HasSubstr("\n  Limits:         131072/262144\n"));
+    EXPECT_THAT(text.str(), HasSubstr("\n  Max Size (HWM): 13")); // 131072 to 135211
+    for (unsigned i = 1; i <= chunks; ++i) {
+        const auto data = messages.receive<QelMessageVirtualSerialDataToDaxAsync>();
+        ASSERT_EQ(data->getSerialDataLength(), 4096);
+        ASSERT_EQ(data->getSerialData()[0], static_cast<char>('a' + i % 26)) << i;
+    }
+    EXPECT_EQ(messages.receive()->getCallerId(), request.getCallerId());
+}
+
+TEST_F(ConnectionTest, TheStatisticsSayWhoseTheyAre)
+{
+    ConnectionTimes limits;
+    limits.queueBytes = 1001;
+    start(limits);
+    identify();
+    std::ostringstream text;
+    connection->dumpStatistics(text);
+    EXPECT_THAT(text.str(), StartsWith("Queue of console 1, the test:\n"
+                                       "  Limits:         501/1001\n"
+                                       "  Max Size (HWM): 80 B\n"
+                                       "  Pending:        0 (0 B)\n"
+                                       "  Dropped:        0 (0 B)\n"
+                                       "  Completed:      1 (80 B)\n"));
+}
+
+TEST_F(ConnectionTest, WithTheSmallestQueueThereIsOneMessageAtATime)
+{
+    ConnectionTimes limits;
+    limits.queueBytes = 1;
+    start(limits);
+    identify();
+    std::vector<unsigned int> asked;
+    for (int i = 0; i < 100; ++i) {
+        const QelMessageGetQelTodReq request;
+        asked.push_back(request.getCallerId());
+        messages.send(request);
+    }
+    for (const unsigned int callerId : asked)
+        EXPECT_EQ(messages.receive()->getCallerId(), callerId);
 }
 
 TEST_F(ConnectionTest, AConsoleThatGoesWhileItIsNotReadFromIsNoticed)

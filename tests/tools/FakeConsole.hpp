@@ -14,7 +14,8 @@ namespace qel::test {
 /// The way to a console, as the hypervisor's logic sees it: keeps what is posted.
 class FakeConsole : public tool::ConsoleLink {
 public:
-    bool room = true;
+    bool room = true;       ///< for responses, notices and broadcasts
+    bool serialRoom = true; ///< for serial data
     bool finished = false;
     unsigned resumed = 0;
 
@@ -23,7 +24,18 @@ public:
         if (finished) throw std::logic_error("posted after finish()");
         mPosted.push_back(std::move(message));
     }
+    void postSerial(std::unique_ptr<QelMessage> message) override
+    {
+        if (!serialRoom) throw std::logic_error("serial data without room");
+        post(std::move(message));
+    }
+    bool offer(std::unique_ptr<QelMessage> message) override
+    {
+        if (room) post(std::move(message));
+        return room;
+    }
     bool hasRoom() const override { return room; }
+    bool hasSerialRoom() const override { return serialRoom; }
     void resumeReading() override { ++resumed; }
     void finish() override
     {

@@ -276,20 +276,29 @@ TEST_F(VirtualSerialTest, OutputIsNotReadWhileTheConsoleHasNoRoom)
     setUpSerial(other, "b", 2);
     port1->output = {"one"};
     port2->output = {"two"};
-    slow.link.room = false;
+    slow.link.serialRoom = false;
     EXPECT_THAT(watched(), ElementsAre(2));
     hypervisor->serviceSerial(1);
     hypervisor->serviceSerial(2);
     EXPECT_EQ(port1->reads, 0U);
     EXPECT_EQ(takeData(other, 2), "two"); // the other one is not held up
 
-    slow.link.room = true;
+    slow.link.serialRoom = true;
     const unsigned wakes = serialWakes;
     hypervisor->outputDrained();
     EXPECT_GT(serialWakes, wakes);
     EXPECT_THAT(watched(), ElementsAre(1, 2));
     hypervisor->serviceSerial(1);
     EXPECT_EQ(takeData(slow, 1), "one");
+}
+
+TEST_F(VirtualSerialTest, AConsoleWhoseSerialDataWaitsForRoomIsStillReadFrom)
+{
+    Peer peer;
+    setUpSerial(peer, "a", 1);
+    peer.link.serialRoom = false;
+    EXPECT_TRUE(hypervisor->mayReceive(peer.id));
+    EXPECT_EQ(statusOf(peer, QelMessageGetQelTodReq()), 0U);
 }
 
 TEST_F(VirtualSerialTest, InputThatIsNotTakenIsKeptAndDeliveredInOrder)
@@ -375,13 +384,13 @@ TEST_F(VirtualSerialTest, TheEndWaitsUntilTheHolderHasRoomForWhatCameBefore)
 {
     Peer peer;
     setUpSerial(peer, "a", 1);
-    peer.link.room = false;
+    peer.link.serialRoom = false;
     port1->output = {"last words"};
     port1->ended = true;
     hypervisor->serviceSerial(1);
     EXPECT_EQ(peer.link.posted(), 0U);
     EXPECT_THAT(watched(), IsEmpty()); // a line that has hung up would be reported over and over
-    peer.link.room = true;
+    peer.link.serialRoom = true;
     hypervisor->serviceSerial(1);
     hypervisor->serviceSerial(1);
     EXPECT_EQ(takeData(peer, 1), "last words");
@@ -396,12 +405,12 @@ TEST_F(VirtualSerialTest, InputForACommandThatHasEndedIsDroppedAndHoldsNobodyUp)
     sendData(peer, 1, std::string(60000, 'x'));
     sendData(peer, 1, std::string(60000, 'x'));
     EXPECT_FALSE(hypervisor->mayReceive(peer.id));
-    peer.link.room = false;
+    peer.link.serialRoom = false;
     port1->ended = true;
     hypervisor->serviceSerial(1);
     EXPECT_EQ(peer.link.resumed, 1U);
     EXPECT_THAT(watched(), IsEmpty());
-    peer.link.room = true;
+    peer.link.serialRoom = true;
     EXPECT_TRUE(hypervisor->mayReceive(peer.id));
 }
 

@@ -27,16 +27,15 @@ PollFd hangUpOf(int descriptor)
 Connection::Connection(Hypervisor& hypervisor, std::unique_ptr<Stream> stream, int descriptor, std::string peer,
                        ConnectionTimes times, std::function<void()> onEnd)
     : mHypervisor(hypervisor), mStream(std::move(stream)), mHangUp(hangUpOf(descriptor)), mPeer(std::move(peer)),
-      mTimes(times), mOnEnd(std::move(onEnd)), mMessages(*mStream, messageRegistry()), mOutbox([this] {
-          resumeReading();
-          mHypervisor.outputDrained();
-      })
+      mTimes(times), mOnEnd(std::move(onEnd)), mMessages(*mStream, messageRegistry()),
+      mOutbox([this] { pTellRoom(); }, times.queueBytes)
 {}
 
 Connection::~Connection()
 {
     if (!mEnded) abort();
     if (mReader.joinable()) mReader.join();
+    if (mFeeder.joinable()) mFeeder.join();
     if (mWriter.joinable()) mWriter.join();
 }
 
@@ -47,6 +46,7 @@ void Connection::start()
     mId = mHypervisor.connect(*this, mPeer);
     try {
         mWriter = std::thread([this] { pWrite(); });
+        mFeeder = std::thread([this] { pFeed(); });
         mReader = std::thread([this] { pRead(); });
     } catch (...) {
         mHypervisor.disconnect(mId);
@@ -62,9 +62,21 @@ void Connection::abort()
     pCloseStream();
 }
 
+void Connection::dumpStatistics(std::ostream& os) const
+{
+    os << "Queue of console " << mId << ", " << mPeer << ":\n";
+    mOutbox.dumpStatistics(os, Indent(2, ' '));
+}
+
 void Connection::post(std::unique_ptr<QelMessage> message) { mOutbox.post(std::move(message)); }
 
+void Connection::postSerial(std::unique_ptr<QelMessage> message) { mOutbox.postSerial(std::move(message)); }
+
+bool Connection::offer(std::unique_ptr<QelMessage> message) { return mOutbox.offer(std::move(message)); }
+
 bool Connection::hasRoom() const { return mOutbox.hasRoom(); }
+
+bool Connection::hasSerialRoom() const { return mOutbox.hasSerialRoom(); }
 
 void Connection::resumeReading() { mWake.interrupt(); }
 
@@ -129,6 +141,23 @@ void Connection::pReport(const StreamIOException& error) const
     } else {
         logLine(LogLevel::Info, "console ", mId, ": ", explain(error));
     }
+}
+
+void Connection::pFeed() noexcept
+{
+    try {
+        mOutbox.feed();
+    } catch (const std::exception& error) {
+        logLine(LogLevel::Error, "console ", mId, ": ", explain(error));
+        abort(); // what it had in hand is lost
+    }
+}
+
+/// Something that waited for room is in the queue: whoever held back for it may go on.
+void Connection::pTellRoom()
+{
+    resumeReading();
+    mHypervisor.outputDrained();
 }
 
 void Connection::pWrite() noexcept

@@ -14,24 +14,27 @@
 #include <chrono>
 #include <functional>
 #include <memory>
+#include <ostream>
 #include <string>
 #include <thread>
 
 namespace qel::tool {
 
-/// The times that a connection of the hypervisor end gives its console.
+/// What a connection of the hypervisor end allows its console.
 struct ConnectionTimes {
-    std::chrono::milliseconds handshake{10000}; ///< from connecting to a granted version request
-    std::chrono::milliseconds linger{2000};     ///< to take what is still queued when the connection ends
+    std::chrono::milliseconds handshake{10000};     ///< from connecting to a granted version request
+    std::chrono::milliseconds linger{2000};         ///< to take what is still queued when the connection ends
+    std::size_t queueBytes = Outbox::kDefaultLimit; ///< of frames that may be queued for it; more than 0
 };
 
-/// One connection of the hypervisor end: a thread that reads messages and hands them to the hypervisor, and a thread
-/// that writes what the hypervisor has for this console. Neither waits for another connection.
+/// One connection of the hypervisor end: a thread that reads messages and hands them to the hypervisor, a thread that
+/// writes what the hypervisor has for this console, and one that waits for room in the queue between the two, so that
+/// nobody else has to. None waits for another connection.
 ///
 /// The reader does not read while the hypervisor says that the next message has to wait; then it watches for the
 /// console to go away, so that a console which is gone does not hold its sessions.
 ///
-/// Thread safety: one thread owns it (constructor, start(), destructor); abort() and hasEnded() may come from any.
+/// Thread safety: one thread owns it (constructor, start(), destructor); the other operations may come from any.
 class Connection final : private ConsoleLink {
 public:
     /// @param hypervisor  borrowed; must outlive this object
@@ -46,7 +49,7 @@ public:
     /// Aborts the connection if need be and waits for its threads.
     ~Connection() override;
 
-    /// Starts both threads. @throws std::system_error  there can be no more threads; the connection has ended
+    /// Starts the threads. @throws std::system_error  there can be no more threads; the connection has ended
     void start();
 
     /// Both directions are cut at once; what is queued is lost.
@@ -55,13 +58,21 @@ public:
     /// True once the threads have nothing left to do.
     bool hasEnded() const noexcept { return mEnded; }
 
+    /// Prints a line that says whose queue it is, and the statistics of the queue, indented.
+    void dumpStatistics(std::ostream& os) const;
+
 private:
     void post(std::unique_ptr<QelMessage> message) override;
+    void postSerial(std::unique_ptr<QelMessage> message) override;
+    bool offer(std::unique_ptr<QelMessage> message) override;
     bool hasRoom() const override;
+    bool hasSerialRoom() const override;
     void resumeReading() override;
     void finish() override;
 
     void pRead() noexcept;
+    void pFeed() noexcept;
+    void pTellRoom();
     void pWrite() noexcept;
     void pReceiveAll();
     bool pWaitForTurn();
@@ -83,6 +94,7 @@ private:
     PollDeadline mHandshake;
     std::atomic<bool> mEnded{false};
     std::thread mReader;
+    std::thread mFeeder;
     std::thread mWriter;
 };
 

@@ -394,12 +394,11 @@ std::size_t Hypervisor::pCountIdentified() const
 /// @return false: the console does not take what it is sent fast enough, and did not get this
 bool Hypervisor::pSendBroadcast(Console& to, const Console& from, const QelMessageDaxBroadcastReq& request)
 {
-    if (!to.link.hasRoom()) {
-        logLine(LogLevel::Warn, "console ", to.id, ": too slow for a broadcast of console ", from.id);
-        return false;
+    if (to.link.offer(std::make_unique<QelMessageDaxBroadcastOutboundAsync>(request, from.toolId, from.toolType))) {
+        return true;
     }
-    to.link.post(std::make_unique<QelMessageDaxBroadcastOutboundAsync>(request, from.toolId, from.toolType));
-    return true;
+    logLine(LogLevel::Warn, "console ", to.id, ": too slow for a broadcast of console ", from.id);
+    return false;
 }
 
 void Hypervisor::pClose(Console& console)

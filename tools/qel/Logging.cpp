@@ -6,6 +6,7 @@
 #include <cstdio>
 #include <exception>
 #include <memory>
+#include <sstream>
 
 namespace qel::tool {
 
@@ -62,6 +63,13 @@ void startLogging(const LogOptions& options, const std::string& name, LogLevel::
         LogBackend::registerBackend(
             std::make_shared<LogBackendRotating>(LogLevel::Inherit, options.directory, name, options.fileBytes));
     }
+}
+
+void logLines(LogLevel::Level level, const std::string& text)
+{
+    std::istringstream lines(text);
+    for (std::string line; std::getline(lines, line);)
+        logLine(level, line);
 }
 
 QelLogger& programLogger()

@@ -40,4 +40,7 @@ void logLine(LogLevel::Level level, const Parts&... parts)
     (line << ... << parts);
 }
 
+/// Writes each line of a text as a line of its own.
+void logLines(LogLevel::Level level, const std::string& text);
+
 } // namespace qel::tool

@@ -202,7 +202,7 @@ void PartitionSet::pPumpOutput(Partition& partition)
         pBreak(partition, CloseReason::CloseReasonReadFailure);
         return;
     case SerialPort::LineState::Data:
-        partition.holder->link.post(std::make_unique<QelMessageVirtualSerialDataToDaxAsync>(
+        partition.holder->link.postSerial(std::make_unique<QelMessageVirtualSerialDataToDaxAsync>(
             partition.id, kConnectionNumber, static_cast<std::uint16_t>(result.length), buffer.data()));
         return;
     }
@@ -210,7 +210,7 @@ void PartitionSet::pPumpOutput(Partition& partition)
 
 bool PartitionSet::pWantsOutput(const Partition& partition)
 {
-    return partition.holder != nullptr && partition.setUp && partition.holder->link.hasRoom();
+    return partition.holder != nullptr && partition.setUp && partition.holder->link.hasSerialRoom();
 }
 
 } // namespace qel::tool

@@ -20,6 +20,7 @@
 #include <iostream>
 #include <map>
 #include <memory>
+#include <sstream>
 #include <string>
 #include <utility>
 #include <vector>
@@ -32,13 +33,16 @@ constexpr int kBacklog = 64;
 constexpr std::size_t kMostPartitions = 255; // the maximum-sessions response has one byte for them
 constexpr std::size_t kLongestName = 16;
 
-constexpr std::initializer_list<int> kSignals{SIGTERM, SIGINT, SIGHUP};
+constexpr std::size_t kLargestQueue = 1024 * 1024 * 1024;
+
+constexpr std::initializer_list<int> kSignals{SIGTERM, SIGINT, SIGHUP, SIGUSR1};
 
 struct ServeOptions {
     std::string endpoint = "127.0.0.1:0";
     TransportOptions transport;
     std::vector<std::string> partitions; ///< "ID=COMMAND"
     std::uint32_t maxConsoles = 0;
+    std::size_t queueBytes = ConnectionTimes().queueBytes;
     std::string family;
     std::string version;
     std::string capabilities = std::string(QelCapabilities::size(), '1');
@@ -136,6 +140,7 @@ struct ServePlan {
     std::map<std::uint16_t, std::string> commands;
     HypervisorSettings settings;
     TransportOptions transport;
+    std::size_t queueBytes = 0;
     LogOptions log;
 };
 
@@ -147,6 +152,7 @@ ServePlan makePlan(const ServeOptions& options)
     plan.transport = options.transport;
     plan.commands = parsePartitions(options.partitions);
     plan.settings = parseSettings(options);
+    plan.queueBytes = options.queueBytes;
     plan.log = options.log;
     return plan;
 }
@@ -163,6 +169,14 @@ void reload(Server& server, const TransportOptions& transport)
     }
 }
 
+/// SIGUSR1, and the end: tells what is known about the queues.
+void logStatistics(Server& server)
+{
+    std::ostringstream text;
+    server.dumpStatistics(text);
+    logLines(LogLevel::Info, text.str());
+}
+
 /// @return the signal that asks to stop
 int serveUntilStopped(Server& server, SignalWatch& signals, const TransportOptions& transport)
 {
@@ -171,6 +185,8 @@ int serveUntilStopped(Server& server, SignalWatch& signals, const TransportOptio
         const int signal = signals.take();
         if (signal == SIGHUP) {
             reload(server, transport);
+        } else if (signal == SIGUSR1) {
+            logStatistics(server);
         } else if (signal != 0) {
             return signal;
         }
@@ -191,6 +207,7 @@ ExitStatus runServe(const ServePlan& plan)
     Hypervisor hypervisor(plan.settings, makePartitions(plan.commands, reaper), [&] { serialWake.interrupt(); });
     ConnectionTimes times;
     times.handshake = plan.transport.handshakeTimeout();
+    times.queueBytes = plan.queueBytes;
     Server server(hypervisor, std::move(listener), times, std::move(context), plan.transport.pins);
     SerialLoop serial(hypervisor, reaper, serialWake);
 
@@ -200,6 +217,7 @@ ExitStatus runServe(const ServePlan& plan)
     const int signal = serveUntilStopped(server, signals, plan.transport);
 
     logLine(LogLevel::Info, "stopping: signal ", signal);
+    logStatistics(server);
     for (const int number : kSignals)
         static_cast<void>(std::signal(number, SIG_IGN)); // once is enough
     hypervisor.shutDown();
@@ -247,6 +265,12 @@ CLI::App& addServeCommand(CLI::App& parent, Action& action)
         ->allow_extra_args(false);
     command.add_option("--max-consoles", options->maxConsoles, "Consoles served at a time")
         ->check(CLI::Range(1, 255))
+        ->capture_default_str();
+    command
+        .add_option("--queue-limit", options->queueBytes,
+                    "Bytes that may be queued for a console before it has to wait; half of it for serial data")
+        ->type_name("BYTES")
+        ->check(CLI::Range(std::size_t{1}, kLargestQueue))
         ->capture_default_str();
     addIdentityOptions(command, *options);
     addLogOptions(command, options->log);

@@ -67,6 +67,14 @@ void Server::run(const PollFd& stop)
     }
 }
 
+void Server::dumpStatistics(std::ostream& os)
+{
+    pDropEnded();
+    if (mConnections.empty()) os << "No console is connected.\n";
+    for (const auto& connection : mConnections)
+        connection->dumpStatistics(os);
+}
+
 void Server::finish()
 {
     mListener = Socket(-1);

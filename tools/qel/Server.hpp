@@ -13,6 +13,7 @@
 #include <chrono>
 #include <list>
 #include <memory>
+#include <ostream>
 
 namespace qel::tool {
 
@@ -38,6 +39,9 @@ public:
 
     /// From now on connections are made with this; those that are there keep what they have.
     void setContext(std::unique_ptr<SSLServerContext> context) { mContext = std::move(context); }
+
+    /// Prints what is known about the queue of each connection, in the order in which they came.
+    void dumpStatistics(std::ostream& os);
 
     /// Accepts no more, waits for all connections to end and cuts those that have not in time. To be called after
     /// Hypervisor::shutDown(), which makes them end.
