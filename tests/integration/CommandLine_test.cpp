@@ -122,6 +122,23 @@ TEST(CommandLine, AnythingThatCannotBeCarriedOutIsUsage)
         {"call", "--connect", "127.0.0.1:1", "--plain", "broadcast", "--to-id", "x", "x"},
         {"call", "--connect", "127.0.0.1:1", "--plain", "broadcast", "--type", "1", "--to-id", std::string(33, 'x'),
          "x"},
+        {"bench"},
+        {"bench", "--connect", "127.0.0.1:1"}, // without --plain
+        {"bench", "--connect", "10.0.0.1:1", "--plain"},
+        {"bench", "--connect", "127.0.0.1:1", "--plain", "extra"},
+        {"bench", "--connect", "127.0.0.1:1", "--plain", "--connections", "0"},
+        {"bench", "--connect", "127.0.0.1:1", "--plain", "--connections", "1"},
+        {"bench", "--connect", "127.0.0.1:1", "--plain", "--connections", "3"},
+        {"bench", "--connect", "127.0.0.1:1", "--plain", "--connections", "256"},
+        {"bench", "--connect", "127.0.0.1:1", "--plain", "--size", "0"},
+        {"bench", "--connect", "127.0.0.1:1", "--plain", "--size", "16307"},
+        {"bench", "--connect", "127.0.0.1:1", "--plain", "--rate", "0"},
+        {"bench", "--connect", "127.0.0.1:1", "--plain", "--rate", "1000001"},
+        {"bench", "--connect", "127.0.0.1:1", "--plain", "--count", "0"},
+        {"bench", "--connect", "127.0.0.1:1", "--plain", "--seconds", "0"},
+        {"bench", "--connect", "127.0.0.1:1", "--plain", "--seconds", "604801"},
+        {"bench", "--connect", "127.0.0.1:1", "--plain", "--seconds", "1", "--count", "1"},
+        {"bench", "--connect", "127.0.0.1:1", "--plain", "--tool-id", std::string(29, 'x')},
     };
     for (const auto& arguments : bad) {
         SCOPED_TRACE(joined(arguments).substr(0, 200));

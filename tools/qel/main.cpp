@@ -1,3 +1,4 @@
+#include "BenchCommand.hpp"
 #include "CaCommand.hpp"
 #include "CallCommand.hpp"
 #include "ConsoleCommand.hpp"
@@ -16,6 +17,7 @@ int main(int argc, char** argv)
     qel::tool::addServeCommand(app, action);
     qel::tool::addCallCommand(app, action);
     qel::tool::addConsoleCommand(app, action);
+    qel::tool::addBenchCommand(app, action);
     qel::tool::addDecodeCommand(app, action);
     qel::tool::addCaCommand(app, action);
 
