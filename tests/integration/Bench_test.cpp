@@ -1,6 +1,7 @@
 // "qel bench" as a process, against the real server and against one that goes away.
 
 #include "integration/TestConsole.hpp"
+#include "support/CredentialDirectory.hpp"
 #include "support/PtyProcess.hpp"
 
 #include <chrono>
@@ -154,6 +155,41 @@ TEST(Bench, TheServersQueuesCountTheMessages)
     process.signal(SIGINT);
     EXPECT_EQ(process.wait().exitStatus, 0);
     server.stop();
+}
+
+// Over TLS.
+
+class BenchTls : public ::testing::Test {
+protected:
+    Process::Result bench(const ServeProcess& server, const std::vector<std::string>& options) const
+    {
+        std::vector<std::string> command{"bench", "--connect", server.endpoint()};
+        const auto transport = directory.options("client");
+        command.insert(command.end(), transport.begin(), transport.end());
+        command.insert(command.end(), options.begin(), options.end());
+        return runQel(command);
+    }
+
+    CredentialDirectory directory;
+};
+
+TEST_F(BenchTls, ItPutsLoadOnAProtectedServer)
+{
+    ServeProcess server({"--max-consoles", "4"}, "127.0.0.1:0", directory.options("server"));
+    const json document = parse(bench(server, {"--json", "--connections", "4", "--count", "200", "--size", "16306"}));
+    EXPECT_EQ(document["messages"], 200);
+    EXPECT_EQ(messagesIn(document["histogram"]), 200U);
+    EXPECT_THAT(server.stop().errors, HasSubstr(": over TLS: \"CN=client\""));
+}
+
+TEST_F(BenchTls, MoreConnectionsThanTheServerTakesAreRefused)
+{
+    const ServeProcess server({"--max-consoles", "3"}, "127.0.0.1:0", directory.options("server"));
+    const auto result = bench(server, {"--connections", "4", "--count", "1"});
+    EXPECT_EQ(result.exitStatus, 1);
+    EXPECT_EQ(result.output, "");
+    EXPECT_THAT(result.errors, StartsWith("qel: connection 4 of 4: no protected connection to "));
+    EXPECT_THAT(result.errors, HasSubstr("it takes no more consoles"));
 }
 
 // Ending early.
