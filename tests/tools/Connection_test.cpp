@@ -18,14 +18,14 @@ using ::testing::Contains;
 using ::testing::HasSubstr;
 using ::testing::StartsWith;
 using tool::Connection;
-using tool::ConnectionTimes;
+using tool::ConnectionLimits;
 
 class ConnectionTest : public HypervisorFixture {
 protected:
-    void start(ConnectionTimes times = {})
+    void start(ConnectionLimits limits = {})
     {
         const int descriptor = loopback.far->getSocket().getFd();
-        connection = std::make_unique<Connection>(*hypervisor, std::move(loopback.far), descriptor, "the test", times,
+        connection = std::make_unique<Connection>(*hypervisor, std::move(loopback.far), descriptor, "the test", limits,
                                                   [this] { ended.set_value(); });
         connection->start();
     }
@@ -139,9 +139,9 @@ TEST_F(ConnectionTest, AnswersToWhatCameBeforeABrokenFrameStillGoOut)
 
 TEST_F(ConnectionTest, AConsoleThatSaysNothingIsClosed)
 {
-    ConnectionTimes times;
-    times.handshake = std::chrono::milliseconds(20);
-    start(times);
+    ConnectionLimits limits;
+    limits.handshake = std::chrono::milliseconds(20);
+    start(limits);
     EXPECT_TRUE(messages.isClosed());
     expectEnd();
     EXPECT_THAT(log.lines(), Contains("W: [qel] console 1: closed, it did not introduce itself in time"));
@@ -149,9 +149,9 @@ TEST_F(ConnectionTest, AConsoleThatSaysNothingIsClosed)
 
 TEST_F(ConnectionTest, AConsoleThatAsksWithoutIntroducingItselfIsClosed)
 {
-    ConnectionTimes times;
-    times.handshake = std::chrono::milliseconds(50);
-    start(times);
+    ConnectionLimits limits;
+    limits.handshake = std::chrono::milliseconds(50);
+    start(limits);
     EXPECT_THROW(
         {
             for (;;)
@@ -163,19 +163,19 @@ TEST_F(ConnectionTest, AConsoleThatAsksWithoutIntroducingItselfIsClosed)
 
 TEST_F(ConnectionTest, AConsoleThatNeitherReadsNorIntroducesItselfIsClosed)
 {
-    ConnectionTimes times;
-    times.handshake = std::chrono::milliseconds(400);
-    times.linger = std::chrono::milliseconds(20);
-    start(times);
+    ConnectionLimits limits;
+    limits.handshake = std::chrono::milliseconds(400);
+    limits.linger = std::chrono::milliseconds(20);
+    start(limits);
     sendUntilStuck(QelMessageGetQelTodReq());
     expectEnd();
 }
 
 TEST_F(ConnectionTest, AnIntroducedConsoleMayTakeItsTime)
 {
-    ConnectionTimes times;
-    times.handshake = std::chrono::milliseconds(1000);
-    start(times);
+    ConnectionLimits limits;
+    limits.handshake = std::chrono::milliseconds(1000);
+    start(limits);
     identify();
     EXPECT_EQ(ended.get_future().wait_for(std::chrono::milliseconds(1200)), std::future_status::timeout);
     EXPECT_EQ(messages.ask(QelMessageGetQelTodReq())->getStatus(), 0U);
@@ -249,7 +249,7 @@ TEST_F(ConnectionTest, APartitionThatPrintsWithoutEndIsHeldBackAndLeavesRoomForT
 
 TEST_F(ConnectionTest, TheStatisticsSayWhoseTheyAre)
 {
-    ConnectionTimes limits;
+    ConnectionLimits limits;
     limits.queueBytes = 1001;
     start(limits);
     identify();
@@ -265,7 +265,7 @@ TEST_F(ConnectionTest, TheStatisticsSayWhoseTheyAre)
 
 TEST_F(ConnectionTest, WithTheSmallestQueueThereIsOneMessageAtATime)
 {
-    ConnectionTimes limits;
+    ConnectionLimits limits;
     limits.queueBytes = 1;
     start(limits);
     identify();
@@ -366,7 +366,7 @@ TEST_F(ConnectionTest, AConnectionThatWasNeverStartedCanGoToo)
 {
     const int descriptor = loopback.far->getSocket().getFd();
     connection =
-        std::make_unique<Connection>(*hypervisor, std::move(loopback.far), descriptor, "x", ConnectionTimes(), [] {});
+        std::make_unique<Connection>(*hypervisor, std::move(loopback.far), descriptor, "x", ConnectionLimits(), [] {});
     connection.reset();
     EXPECT_TRUE(messages.isClosed());
 }

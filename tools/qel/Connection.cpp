@@ -25,10 +25,10 @@ PollFd hangUpOf(int descriptor)
 } // namespace
 
 Connection::Connection(Hypervisor& hypervisor, std::unique_ptr<Stream> stream, int descriptor, std::string peer,
-                       ConnectionTimes times, std::function<void()> onEnd)
+                       ConnectionLimits limits, std::function<void()> onEnd)
     : mHypervisor(hypervisor), mStream(std::move(stream)), mHangUp(hangUpOf(descriptor)), mPeer(std::move(peer)),
-      mTimes(times), mOnEnd(std::move(onEnd)), mMessages(*mStream, messageRegistry()),
-      mOutbox([this] { pTellRoom(); }, times.queueBytes)
+      mLimits(limits), mOnEnd(std::move(onEnd)), mMessages(*mStream, messageRegistry()),
+      mOutbox([this] { pTellRoom(); }, limits.queueBytes)
 {}
 
 Connection::~Connection()
@@ -41,8 +41,8 @@ Connection::~Connection()
 
 void Connection::start()
 {
-    mHandshake = TimeProvider::steady() + mTimes.handshake;
-    mStream->setReadDeadline(mTimes.handshake);
+    mHandshake = TimeProvider::steady() + mLimits.handshake;
+    mStream->setReadDeadline(mLimits.handshake);
     mId = mHypervisor.connect(*this, mPeer);
     try {
         mWriter = std::thread([this] { pWrite(); });
@@ -129,7 +129,7 @@ void Connection::pEnd()
 {
     mHypervisor.disconnect(mId);
     mOutbox.finish();
-    if (!mOutbox.waitUntilWritten(mTimes.linger)) abort();
+    if (!mOutbox.waitUntilWritten(mLimits.linger)) abort();
     mEnded = true;
     mOnEnd();
 }

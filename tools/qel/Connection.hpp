@@ -21,7 +21,7 @@
 namespace qel::tool {
 
 /// What a connection of the hypervisor end allows its console.
-struct ConnectionTimes {
+struct ConnectionLimits {
     std::chrono::milliseconds handshake{10000};     ///< from connecting to a granted version request
     std::chrono::milliseconds linger{2000};         ///< to take what is still queued when the connection ends
     std::size_t queueBytes = Outbox::kDefaultLimit; ///< of frames that may be queued for it; more than 0
@@ -44,7 +44,7 @@ public:
     /// @param onEnd  called once, on a thread of this connection, when hasEnded() has become true
     /// @throws PosixError  no descriptor is left for the reader's wake-up
     Connection(Hypervisor& hypervisor, std::unique_ptr<Stream> stream, int descriptor, std::string peer,
-               ConnectionTimes times, std::function<void()> onEnd);
+               ConnectionLimits limits, std::function<void()> onEnd);
 
     /// Aborts the connection if need be and waits for its threads.
     ~Connection() override;
@@ -85,7 +85,7 @@ private:
     const std::unique_ptr<Stream> mStream;
     PollFd mHangUp;
     const std::string mPeer;
-    const ConnectionTimes mTimes;
+    const ConnectionLimits mLimits;
     const std::function<void()> mOnEnd;
     QelMessageStream mMessages;
     Outbox mOutbox;

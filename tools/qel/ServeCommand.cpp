@@ -42,7 +42,7 @@ struct ServeOptions {
     TransportOptions transport;
     std::vector<std::string> partitions; ///< "ID=COMMAND"
     std::uint32_t maxConsoles = 0;
-    std::size_t queueBytes = ConnectionTimes().queueBytes;
+    std::size_t queueBytes = ConnectionLimits().queueBytes;
     std::string family;
     std::string version;
     std::string capabilities = std::string(QelCapabilities::size(), '1');
@@ -205,10 +205,10 @@ ExitStatus runServe(const ServePlan& plan)
     ChildReaper reaper;
     WakeUp serialWake;
     Hypervisor hypervisor(plan.settings, makePartitions(plan.commands, reaper), [&] { serialWake.interrupt(); });
-    ConnectionTimes times;
-    times.handshake = plan.transport.handshakeTimeout();
-    times.queueBytes = plan.queueBytes;
-    Server server(hypervisor, std::move(listener), times, std::move(context), plan.transport.pins);
+    ConnectionLimits limits;
+    limits.handshake = plan.transport.handshakeTimeout();
+    limits.queueBytes = plan.queueBytes;
+    Server server(hypervisor, std::move(listener), limits, std::move(context), plan.transport.pins);
     SerialLoop serial(hypervisor, reaper, serialWake);
 
     std::cout << listening << std::endl;

@@ -41,9 +41,9 @@ bool isPassing(int error)
 
 } // namespace
 
-Server::Server(Hypervisor& hypervisor, Socket listener, ConnectionTimes times,
+Server::Server(Hypervisor& hypervisor, Socket listener, ConnectionLimits limits,
                std::unique_ptr<SSLServerContext> context, PeerPins pins)
-    : mHypervisor(hypervisor), mListener(std::move(listener)), mTimes(times), mContext(std::move(context)),
+    : mHypervisor(hypervisor), mListener(std::move(listener)), mLimits(limits), mContext(std::move(context)),
       mPins(std::move(pins))
 {
     // A connection may be gone between the wait and accept(), which must not wait for the next one then.
@@ -81,7 +81,7 @@ void Server::finish()
     mStopping = true;
     for (const auto& admission : mAdmissions)
         admission->stop();
-    const PollDeadline deadline(TimeProvider::steady() + mTimes.linger);
+    const PollDeadline deadline(TimeProvider::steady() + mLimits.linger);
     for (;;) {
         pDropEnded();
         const auto now = TimeProvider::steady();
@@ -118,21 +118,21 @@ void Server::pTakeIn(Socket socket)
     }
     const int descriptor = stream->getSocket().getFd();
     if (mContext != nullptr) return pAdmit(std::move(stream), peer);
-    pConnect(std::move(stream), descriptor, peer, mTimes);
+    pConnect(std::move(stream), descriptor, peer, mLimits);
 }
 
 void Server::pAdmit(std::unique_ptr<SocketStream> stream, const std::string& peer)
 {
     auto admission = std::make_unique<Admission>(mHypervisor, std::move(stream), peer, *mContext, mPins,
-                                                 TimeProvider::steady() + mTimes.handshake,
+                                                 TimeProvider::steady() + mLimits.handshake,
                                                  [this] { mConnectionEnded.interrupt(); });
     admission->start();
     mAdmissions.push_back(std::move(admission));
 }
 
-void Server::pConnect(std::unique_ptr<Stream> stream, int descriptor, const std::string& peer, ConnectionTimes times)
+void Server::pConnect(std::unique_ptr<Stream> stream, int descriptor, const std::string& peer, ConnectionLimits limits)
 {
-    auto connection = std::make_unique<Connection>(mHypervisor, std::move(stream), descriptor, peer, times,
+    auto connection = std::make_unique<Connection>(mHypervisor, std::move(stream), descriptor, peer, limits,
                                                    [this] { mConnectionEnded.interrupt(); });
     connection->start();
     mConnections.push_back(std::move(connection));
@@ -163,10 +163,10 @@ void Server::pDropEnded()
 void Server::pLetIn(Admission::Admitted admitted)
 {
     if (admitted.stream == nullptr || mStopping) return;
-    ConnectionTimes times = mTimes;
-    times.handshake = admitted.timeLeft;
+    ConnectionLimits limits = mLimits;
+    limits.handshake = admitted.timeLeft;
     try {
-        pConnect(std::move(admitted.stream), admitted.descriptor, admitted.peer, times);
+        pConnect(std::move(admitted.stream), admitted.descriptor, admitted.peer, limits);
     } catch (const std::exception& error) {
         pPause(error);
     }

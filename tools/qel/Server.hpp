@@ -25,7 +25,7 @@ public:
     /// @param listener  listens already
     /// @param context  for TLS; null: connections are plain
     /// @param pins  who may come in over TLS
-    Server(Hypervisor& hypervisor, Socket listener, ConnectionTimes times,
+    Server(Hypervisor& hypervisor, Socket listener, ConnectionLimits limits,
            std::unique_ptr<SSLServerContext> context = nullptr, PeerPins pins = {});
 
     /// Cuts what is left of the connections.
@@ -51,14 +51,14 @@ private:
     void pAccept();
     void pTakeIn(Socket socket);
     void pAdmit(std::unique_ptr<SocketStream> stream, const std::string& peer);
-    void pConnect(std::unique_ptr<Stream> stream, int descriptor, const std::string& peer, ConnectionTimes times);
+    void pConnect(std::unique_ptr<Stream> stream, int descriptor, const std::string& peer, ConnectionLimits limits);
     void pPause(const std::exception& reason);
     void pDropEnded();
     void pLetIn(Admission::Admitted admitted);
 
     Hypervisor& mHypervisor;
     Socket mListener;
-    const ConnectionTimes mTimes;
+    const ConnectionLimits mLimits;
     WakeUp mConnectionEnded;
     PollDeadline mPausedUntil;                  // no connection is accepted before; disabled: not paused
     std::unique_ptr<SSLServerContext> mContext; // null: connections are plain
