@@ -561,6 +561,30 @@ TEST(ServeQueue, WhatIsNoSerialDataStillFindsRoom)
     server.stop();
 }
 
+TEST(ServeQueue, AForcedOpenNeedNotWaitForAHolderThatDoesNotRead)
+{
+    ServeProcess server({"--partition", "1=yes"});
+    TestConsole slow(server.endpoint());
+    slow.openSession("slow");
+    ASSERT_EQ(slow.statusOf(QelMessageVirtualSerialOpenReq(1, 0, false)), 0U);
+    slow.messages().send(QelMessageVirtualSerialSetupSessionReq(1, 0));
+    while (bytesIn(bare(statisticsOf(server)), "Pending:        ") < 131072)
+        continue;
+    TestConsole other(server.endpoint());
+    other.openSession("other");
+    ASSERT_EQ(other.statusOf(QelMessageVirtualSerialOpenReq(1, 0, true)), 0U);
+    ASSERT_EQ(other.statusOf(QelMessageVirtualSerialSetupSessionReq(1, 0)), 0U);
+    other.readUntil(1, "y\r\n");
+
+    // The response to the set-up, then all of the data, then the notice.
+    EXPECT_EQ(slow.messages().receive()->getOperation(), QelMessageOpSetupVirtualSerialSession);
+    EXPECT_EQ(slow.awaitClosed(1), 2U);
+    const QelMessageGetQelTodReq request;
+    slow.messages().send(request);
+    EXPECT_EQ(slow.messages().receive()->getCallerId(), request.getCallerId()); // and no data behind it
+    server.stop();
+}
+
 TEST(ServeQueue, BroadcastsOverTheLimitAreDroppedAndCounted)
 {
     ServeProcess server({"--partition", "1=yes", "--queue-limit", "10000"});
