@@ -3,7 +3,7 @@
 
 #include "BenchPair.hpp"
 #include "Failures.hpp"
-#include "tools/FakeHypervisorEnd.hpp"
+#include "tools/FakeBenchPair.hpp"
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
@@ -15,47 +15,15 @@ namespace {
 using ::testing::Each;
 using ::testing::StrEq;
 using ::testing::ThrowsMessage;
-using tool::BenchConsole;
-using tool::BenchPair;
 using tool::CommandFailure;
 using tool::RequestRefused;
 
-/// Two consoles and a hypervisor that passes on what they send each other, unless a test has other plans.
-class BenchPairTest : public ::testing::Test {
+class BenchPairTest : public ::testing::Test, protected FakeBenchPair {
 protected:
-    BenchPairTest()
-    {
-        BenchConsole one = makeConsole(first, "one");
-        BenchConsole two = makeConsole(second, "two");
-        first->onMessage = [this](const QelMessage& message) { pass(message, *first, *second, "one"); };
-        second->onMessage = [this](const QelMessage& message) { pass(message, *second, *first, "two"); };
-        pair = std::make_unique<BenchPair>(std::move(one), std::move(two), 300, std::chrono::milliseconds(1234));
-    }
-
-    static BenchConsole makeConsole(FakeHypervisorEnd*& borrowed, const std::string& toolId)
-    {
-        auto stream = std::make_unique<FakeHypervisorEnd>();
-        borrowed = stream.get();
-        tool::IdentityOptions identity;
-        identity.toolType = 9;
-        identity.toolId = toolId;
-        return {identity, std::make_unique<tool::ClientConnection>(std::move(stream))};
-    }
-
-    static void pass(const QelMessage& message, FakeHypervisorEnd& from, FakeHypervisorEnd& to, const std::string& name)
-    {
-        from.grant(message);
-        to.push(QelMessageDaxBroadcastOutboundAsync(dynamic_cast<const QelMessageDaxBroadcastReq&>(message), name, 9));
-    }
-
     const QelMessageDaxBroadcastReq& request(const FakeHypervisorEnd& end, std::size_t number) const
     {
         return dynamic_cast<const QelMessageDaxBroadcastReq&>(*end.received.at(number));
     }
-
-    FakeHypervisorEnd* first = nullptr; // owned by the pair
-    FakeHypervisorEnd* second = nullptr;
-    std::unique_ptr<BenchPair> pair;
 };
 
 TEST_F(BenchPairTest, TheyTakeTurns)
