@@ -243,7 +243,7 @@ TEST(BenchEnd, AServerThatDoesNotAnswerDoesNotKeepItFromEnding)
 TEST(BenchProgress, ATerminalShowsABar)
 {
     const ServeProcess server;
-    PtyProcess process(benchCommand(server.endpoint(), {"--seconds", "0.7"}));
+    PtyProcess process(benchCommand(server.endpoint(), {"--seconds", "1.5"}));
     process.await("\r\x1B[K[#");
     process.await(" a second");
     const auto result = process.wait();
@@ -303,7 +303,7 @@ TEST(BenchFaults, AServerThatStopsIsExitStatusSeven)
 TEST(BenchFaults, AServerThatDoesNotAnswerIsExitStatusSix)
 {
     ServeProcess server;
-    Process process(benchCommand(server.endpoint(), {"--seconds", "600", "--timeout", "0.5", "--log-level", "info"}));
+    Process process(benchCommand(server.endpoint(), {"--seconds", "600", "--timeout", "2", "--log-level", "info"}));
     awaitStart(process);
     server.process().signal(SIGSTOP);
     EXPECT_EQ(process.wait().exitStatus, 6);

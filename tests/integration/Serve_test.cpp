@@ -441,7 +441,8 @@ const char* const kDump = "Queue of console 1, 127\\.0\\.0\\.1:[0-9]+:\n"
                           "    10-100ms:   [01]            [01]            [01]           \n"
                           "    100-1000ms: [01]            [01]            [01]           \n"
                           "    1-10s:      0            0            0           \n"
-                          "    10\\+s:       0            0            0           \n";
+                          "    10\\+s:       0            0            0           \n"
+                          "(  Maximum Latency:\n.*)?"; // when this machine has other things to do for a while
 
 TEST(ServeStatistics, ASignalAsksForThemAndServiceGoesOn)
 {
@@ -535,10 +536,10 @@ TEST(ServeQueue, APartitionThatPrintsWithoutEndIsHeldBack)
     while (bytesIn(statistics, "Pending:        ") < kHalf)
         statistics = bare(statisticsOf(server));
     const std::size_t resident = server.process().residentBytes();
-    for (int i = 0; i < 50; ++i)
+    for (int i = 0; i < 100; ++i)
         statistics = bare(statisticsOf(server));
     EXPECT_LE(bytesIn(statistics, "Max Size (HWM): "), kHalf + 4096 + 100);
-    EXPECT_LE(server.process().residentBytes(), resident + 4UL * 1024 * 1024); // yes(1) prints gigabytes a second
+    EXPECT_LE(server.process().residentBytes(), resident + 8UL * 1024 * 1024); // and yes(1) would go on for ever
     server.stop();
 }
 
