@@ -398,7 +398,10 @@ std::string statisticsOf(ServeProcess& server, std::size_t queues = 1)
     server.process().signal(SIGUSR1);
     for (int i = 0; i < 4000; ++i) {
         const std::string text = server.process().errors().substr(before);
-        if (count(text, "[qel]     10+s:") == queues) return text;
+        if (count(text, "[qel]     10+s:") == queues) {
+            // What was logged before the signal may come after it was sent.
+            return text.substr(text.rfind('\n', text.find("[qel] Queue of ")) + 1);
+        }
         std::this_thread::sleep_for(std::chrono::milliseconds(5));
     }
     throw std::runtime_error("no statistics: " + server.process().errors());
