@@ -175,6 +175,9 @@ TEST_F(CaFaults, AFileThatComesAtTheLastMomentIsKept)
 
 TEST_F(CaFaults, AFileThatGrowsTooLargeIsAnError)
 {
+#ifdef QEL_COUNTS_LINES
+    GTEST_SKIP() << "the limit would also hold for the files with the counts, and the program would say so";
+#endif
     bringRoot();
     const auto result = runCaAfter("ulimit -f 1", issueConsole(path())); // 512 bytes, or 1024: a part of the key
     EXPECT_EQ(result.exitStatus, 4);
