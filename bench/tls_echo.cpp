@@ -1,0 +1,312 @@
+#include <qel/common/QelMessageInterfaceComponent.hpp>
+#include <qel/common/util/TimeProvider.hpp>
+
+#include "BenchLoad.hpp"
+#include "Contest.hpp"
+#include "Loopback.hpp"
+#include "TlsEnds.hpp"
+#include "support/Process.hpp"
+#include "support/TemporaryDirectory.hpp"
+
+#include <algorithm>
+#include <array>
+#include <atomic>
+#include <cerrno>
+#include <chrono>
+#include <csignal>
+#include <cstddef>
+#include <cstdint>
+#include <cstdio>
+#include <cstdlib>
+#include <exception>
+#include <memory>
+#include <nlohmann/json.hpp>
+#include <stdexcept>
+#include <string>
+#include <sys/wait.h>
+#include <system_error>
+#include <unistd.h>
+#include <vector>
+
+/// @file
+/// What `qel bench` measures of `qel serve` over mutual TLS 1.3 on loopback, beside an echo of two processes that use
+/// OpenSSL directly. A program of its own, because it starts others. Nothing here passes or fails: the figures are for
+/// people.
+///
+/// The two do not do the same work. A message of ours takes three frames through three threads one after the other: the
+/// sender's request, and the server's notice and response, which two writing threads take from the queues of two
+/// connections. One of the echo takes two records, to a thread that sends back what it gets. So three are held against
+/// two, and there is nothing that ours could be equal to; the ratio tells what the server adds to TLS.
+///
+/// A message of the echo has the bytes of the request's frame in both directions. Both are counted by the same loop:
+/// one message at a time, each from its sending to the end of its last frame or record.
+
+namespace qel::bench {
+
+namespace {
+
+using nlohmann::json;
+using test::Process;
+
+constexpr std::array<std::size_t, 3> kSizes{64, 256, 4096}; // bytes of payload
+constexpr unsigned int kRounds = 5;
+constexpr std::chrono::milliseconds kOursTime(1000);
+constexpr std::chrono::milliseconds kRawTime(500); // twice in a round, before ours and after it
+
+volatile std::sig_atomic_t sStop = 0;
+
+void checkNotStopped()
+{
+    if (sStop != 0) throw std::runtime_error("interrupted");
+}
+
+/// The bytes of the frame that carries so many bytes of payload up to the server.
+std::size_t frameOf(std::size_t payload)
+{
+    const std::vector<char> data(payload, 'q');
+    return QelMessageDaxBroadcastReq(1, static_cast<std::uint16_t>(data.size()), 1, "addressee", data.data())
+        .msgLength();
+}
+
+struct Figures {
+    double perSecond;
+    double p99; // microseconds
+};
+
+/// An echo with OpenSSL on the descriptors, whose far end is a process of its own.
+///
+/// Both ends are connected, and shake hands, before the process comes into being; after that each uses its own.
+class RawEcho {
+public:
+    /// @throws std::system_error, std::runtime_error
+    explicit RawEcho(const RawContexts& contexts) : mTls(contexts, mPair), mBuffer(QelMessage::MtuMax)
+    {
+        mTls.handshake();
+        mFar = ::fork();
+        if (mFar < 0) throw std::system_error(errno, std::generic_category(), "fork");
+        if (mFar == 0) pServe();
+        mTls.far.reset();
+        mPair.far.reset();
+    }
+    ~RawEcho()
+    {
+        ::kill(mFar, SIGKILL);
+        ::waitpid(mFar, nullptr, 0);
+    }
+    RawEcho(const RawEcho&) = delete;
+    RawEcho& operator=(const RawEcho&) = delete;
+
+    Figures measure(std::size_t length)
+    {
+        tool::BenchLoad load;
+        load.time = kRawTime;
+        tool::BenchFigures figures;
+        std::atomic<std::uint64_t> done{0};
+        const tool::BenchShare share(load, 0, TimeProvider::steady());
+        try {
+            share.run([&] { pExchange(length); }, [](tool::BenchShare::TimePoint) { return sStop == 0; }, figures,
+                      done);
+        } catch (const std::exception& error) {
+            throw std::runtime_error(std::string("the echo with OpenSSL: ") + error.what());
+        }
+        checkNotStopped();
+        const std::chrono::duration<double> elapsed(figures.elapsed);
+        const std::chrono::duration<double, std::micro> p99(figures.latency.percentile(990));
+        return {static_cast<double>(figures.latency.count()) / elapsed.count(), p99.count()};
+    }
+
+private:
+    void pExchange(std::size_t length)
+    {
+        rawWrite(mTls.near.get(), mBuffer.data(), length);
+        rawRead(mTls.near.get(), mBuffer.data(), length);
+    }
+
+    /// What the far process does until the near one is gone.
+    [[noreturn]] void pServe()
+    {
+        mPair.near.reset();
+        for (;;) {
+            const int count = SSL_read(mTls.far.get(), mBuffer.data(), static_cast<int>(mBuffer.size()));
+            if (count <= 0) ::_exit(EXIT_SUCCESS);
+            if (SSL_write(mTls.far.get(), mBuffer.data(), count) != count) ::_exit(EXIT_FAILURE);
+        }
+    }
+
+    TcpPair mPair;
+    RawTlsPair mTls;
+    std::vector<char> mBuffer;
+    pid_t mFar = -1;
+};
+
+/// `qel serve`, and certificates for it and for those who connect.
+class OurServer {
+public:
+    /// @throws std::runtime_error  one of the programs failed; what it wrote is in the text
+    OurServer()
+    {
+        pRun({"ca", "init", pCredentials(), "--subject", "CN=bench root"});
+        pRun({"ca", "issue", pCredentials(), "server", "--subject", "CN=server"});
+        pRun({"ca", "issue", pCredentials(), "operator", "--subject", "CN=operator"});
+        mServer = std::make_unique<Process>(std::vector<std::string>{
+            QEL_PROGRAM, "serve", "--listen", "127.0.0.1:0", "--credentials", pCredentials(), "--name", "server"});
+        mEndpoint = mServer->readLine();
+    }
+
+    Figures measure(std::size_t payload)
+    {
+        const std::string seconds = std::to_string(std::chrono::duration<double>(kOursTime).count());
+        Process bench({QEL_PROGRAM, "bench", "--connect", mEndpoint, "--credentials", pCredentials(), "--name",
+                       "operator", "--peer-name", "server", "--json", "--seconds", seconds, "--size",
+                       std::to_string(payload)});
+        awaitEnd(bench);
+        Process::Result result = bench.wait();
+        checkNotStopped();
+        if (result.exitStatus != 0) {
+            result.errors += "qel serve wrote:\n" + mServer->errors();
+            fail("bench", result);
+        }
+        const json report = json::parse(result.output);
+        if (report.at("interrupted").get<bool>()) throw std::runtime_error("qel bench was interrupted");
+        const double nanoseconds = report.at("latencyNanoseconds").at("p99").get<double>();
+        return {report.at("messagesPerSecond").get<double>(), nanoseconds / 1000};
+    }
+
+private:
+    /// Sleeps until the process has ended. Its own wait() looks again and again, on the core that is measured.
+    static void awaitEnd(const Process& process)
+    {
+        siginfo_t info;
+        while (::waitid(P_PID, static_cast<id_t>(process.pid()), &info, WEXITED | WNOWAIT) != 0 && errno == EINTR)
+            continue;
+    }
+
+    [[noreturn]] static void fail(const std::string& command, const Process::Result& result)
+    {
+        throw std::runtime_error("qel " + command + " ended with exit status " + std::to_string(result.exitStatus) +
+                                 ", signal " + std::to_string(result.signal) + "\n" + result.output + result.errors);
+    }
+
+    static void pRun(const std::vector<std::string>& arguments)
+    {
+        std::vector<std::string> command{QEL_PROGRAM};
+        command.insert(command.end(), arguments.begin(), arguments.end());
+        const Process::Result result = test::run(command);
+        checkNotStopped();
+        if (result.exitStatus != 0) fail(arguments.at(0) + " " + arguments.at(1), result);
+    }
+
+    std::string pCredentials() const { return mDirectory.file("authority"); }
+
+    const test::TemporaryDirectory mDirectory;
+    std::unique_ptr<Process> mServer;
+    std::string mEndpoint;
+};
+
+/// What the rounds of one contestant have shown.
+class Series {
+public:
+    void add(const Figures& figures)
+    {
+        mPerSecond.push_back(figures.perSecond);
+        mP99.push_back(figures.p99);
+    }
+    void add(const Series& other)
+    {
+        mPerSecond.insert(mPerSecond.end(), other.mPerSecond.begin(), other.mPerSecond.end());
+        mP99.insert(mP99.end(), other.mP99.begin(), other.mP99.end());
+    }
+    Figures median() const { return {pMedian(mPerSecond), pMedian(mP99)}; }
+
+private:
+    static double pMedian(std::vector<double> values)
+    {
+        std::sort(values.begin(), values.end());
+        const std::size_t middle = values.size() / 2;
+        return values.size() % 2 == 1 ? values[middle] : (values[middle - 1] + values[middle]) / 2;
+    }
+
+    std::vector<double> mPerSecond;
+    std::vector<double> mP99;
+};
+
+struct Row {
+    Series ours;
+    Series raw;
+    Series again;
+};
+
+void printRow(std::size_t size, const Row& row)
+{
+    const Figures ours = row.ours.median();
+    const Figures again = row.again.median();
+    const Figures first = row.raw.median();
+    Series both = row.raw;
+    both.add(row.again);
+    const Figures raw = both.median();
+    std::printf("%8zu %8zu %10.0f %10.0f %7.2f %10.1f %10.1f %7.2f %12.2f %7.2f\n", size, frameOf(size), ours.perSecond,
+                raw.perSecond, ours.perSecond / raw.perSecond, ours.p99, raw.p99, ours.p99 / raw.p99,
+                again.perSecond / first.perSecond, again.p99 / first.p99);
+}
+
+void printTable(const std::array<Row, kSizes.size()>& rows)
+{
+    std::printf(
+        "\nmessages over TLS on loopback, processes of their own on one core, one message at a time; medians of "
+        "%u rounds\n",
+        kRounds);
+    std::printf("%8s %8s %10s %10s %7s %10s %10s %7s %20s\n", "payload", "frame", "ours m/s", "raw m/s", "ratio",
+                "ours p99", "raw p99", "ratio", "(raw against itself)");
+    std::printf("%8s %8s %10s %10s %7s %10s %10s %7s %12s %7s\n", "bytes", "bytes", "", "", "", "us", "us", "", "m/s",
+                "p99");
+    for (std::size_t i = 0; i < rows.size(); ++i)
+        printRow(kSizes[i], rows[i]);
+    std::printf(
+        "ours: qel bench and qel serve; a message is a request up, a notice down to another console and a "
+        "response: three frames, the\n      server's queues, two connections, each sent and received by threads "
+        "of its own.\n"
+        "raw:  OpenSSL on the descriptors, an echo of as many bytes as the request's frame: two records, one "
+        "connection.\n");
+}
+
+void measureAll()
+{
+    // The far ends of the echo must come first: a process that has threads had better not fork.
+    const RawContexts contexts;
+    RawEcho raw(contexts);
+    RawEcho again(contexts);
+    OurServer server;
+    std::array<Row, kSizes.size()> rows;
+    for (unsigned int round = 0; round < kRounds; ++round) {
+        for (std::size_t i = 0; i < kSizes.size(); ++i) {
+            rows[i].raw.add(raw.measure(frameOf(kSizes[i])));
+            rows[i].ours.add(server.measure(kSizes[i]));
+            rows[i].again.add(again.measure(frameOf(kSizes[i])));
+        }
+    }
+    printTable(rows);
+}
+
+void setUpSignals()
+{
+    static_cast<void>(std::signal(SIGPIPE, SIG_IGN)); // an end that is gone shows as a failed write
+    for (const int number : {SIGINT, SIGTERM, SIGHUP})
+        static_cast<void>(std::signal(number, [](int) { sStop = 1; })); // processes and files are to be cleaned up
+}
+
+} // namespace
+
+} // namespace qel::bench
+
+int main()
+{
+    try {
+        qel::bench::setUpSignals();
+        qel::bench::pinToOneCore();
+        qel::bench::measureAll();
+        return EXIT_SUCCESS;
+    } catch (const std::exception& error) {
+        std::fprintf(stderr, "qel_bench_tls_echo: %s\n", error.what());
+        return EXIT_FAILURE;
+    }
+}
