@@ -12,6 +12,7 @@
 #include <fstream>
 #include <functional>
 #include <gmock/gmock.h>
+#include <regex>
 #include <thread>
 #include <unistd.h>
 
@@ -248,6 +249,16 @@ TEST_F(ConsoleTest, TheCommandsAreListed)
     person.await("~x\r\n~x\r\n");
     person.type("~.");
     EXPECT_EQ(person.wait().exitStatus, 0);
+}
+
+TEST_F(ConsoleTest, LogLinesOnTheTerminalReturnTheCarriage)
+{
+    PtyProcess person(console({"2", "--log-level", "debug"}));
+    person.await("qel: connected");
+    person.type("~.");
+    const std::string screen = person.wait().screen;
+    EXPECT_THAT(screen.substr(screen.find("qel: connected")), HasSubstr("(D): "));
+    EXPECT_EQ(std::regex_replace(screen, std::regex("\r\n"), "").find('\n'), std::string::npos) << screen;
 }
 
 TEST_F(ConsoleTest, TheEscapeCharacterCanBeChosen)

@@ -150,6 +150,27 @@ TEST(TerminalMode, ATerminalThatHasGoneNeedsNoRestoring)
     EXPECT_FALSE(mode.isRaw());
 }
 
+TEST(LineEnd, ReturnsTheCarriageOnARawTerminalAlone)
+{
+    const Pty pty;
+    EXPECT_STREQ(tool::lineEndOf(pty.slave()), "\n");
+    TerminalMode mode(pty.slave());
+    mode.enterRaw();
+    EXPECT_STREQ(tool::lineEndOf(pty.slave()), "\r\n");
+    mode.restore();
+    EXPECT_STREQ(tool::lineEndOf(pty.slave()), "\n");
+}
+
+TEST(LineEnd, IsALineFeedWhereThereIsNoTerminal)
+{
+    int ends[2];
+    ASSERT_EQ(::pipe2(ends, O_CLOEXEC), 0);
+    EXPECT_STREQ(tool::lineEndOf(ends[1]), "\n");
+    ::close(ends[0]);
+    ::close(ends[1]);
+    EXPECT_STREQ(tool::lineEndOf(-1), "\n");
+}
+
 } // namespace
 
 } // namespace qel::test

@@ -3,10 +3,13 @@
 #include <qel/common/LogBackendFiltered.hpp>
 #include <qel/common/LogBackendRotating.hpp>
 
+#include "TerminalMode.hpp"
+
 #include <cstdio>
 #include <exception>
 #include <memory>
 #include <sstream>
+#include <unistd.h>
 
 namespace qel::tool {
 
@@ -21,7 +24,7 @@ private:
     void pLog(const std::string& line) override
     {
         // One call a line, so that lines stay whole beside those of other processes on the same terminal.
-        const std::string whole = line + "\n";
+        const std::string whole = line + lineEndOf(STDERR_FILENO);
         static_cast<void>(std::fwrite(whole.data(), 1, whole.size(), stderr));
     }
 };

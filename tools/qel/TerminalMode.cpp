@@ -59,4 +59,11 @@ void TerminalMode::restore() noexcept
     if (!servesAnotherJob(mDescriptor)) static_cast<void>(setAttributes(mDescriptor, mOriginal));
 }
 
+const char* lineEndOf(int descriptor) noexcept
+{
+    termios attributes{};
+    const bool isTerminal = ::tcgetattr(descriptor, &attributes) == 0;
+    return isTerminal && (attributes.c_oflag & OPOST) == 0 ? "\r\n" : "\n";
+}
+
 } // namespace qel::tool

@@ -43,4 +43,8 @@ private:
     termios mOriginal{};
 };
 
+/// What ends a line that is written to a descriptor: "\r\n" for a terminal that does nothing to what is printed, as one
+/// in raw mode, whoever put it there; "\n" for everything else. Sets errno for what is no terminal.
+const char* lineEndOf(int descriptor) noexcept;
+
 } // namespace qel::tool
