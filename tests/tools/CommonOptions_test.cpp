@@ -85,6 +85,9 @@ TEST(CommonOptions, BadConnectOptionsAreRefused)
         {"--connect", "127.0.0.1:80", "--timeout", "-1"},
         {"--connect", "127.0.0.1:80", "--timeout", "86401"},
         {"--connect", "127.0.0.1:80", "--timeout", "soon"},
+        {"--connect", "127.0.0.1:80", "--timeout", "nan"},
+        {"--connect", "127.0.0.1:80", "--timeout", "-NAN"},
+        {"--connect", "127.0.0.1:80", "--timeout", "inf"},
         {"--connect", "127.0.0.1:80", "--tool-type", "4294967296"},
         {"--connect", "127.0.0.1:80", "--tool-type", "-1"},
         {"--connect", "127.0.0.1:80", "--tool-id", std::string(33, 'x')},
@@ -92,6 +95,22 @@ TEST(CommonOptions, BadConnectOptionsAreRefused)
     };
     for (const auto& arguments : bad)
         EXPECT_NE(parse(arguments).status, 0) << CLI::detail::join(arguments, " ");
+}
+
+TEST(CommonOptions, ANumberIsBetweenItsLimits)
+{
+    const CLI::Validator between = tool::numberBetween(0.5, 2);
+    for (const char* text : {"0.5", "1", "2", "2.0", "1e0"})
+        EXPECT_EQ(between(text), "") << text;
+    for (const char* text : {"0.4999", "2.0001", "-1", "inf", "-inf", "", "x", "1x"})
+        EXPECT_NE(between(text), "") << text;
+}
+
+TEST(CommonOptions, WhatIsNoNumberIsNotBetweenAnyLimits)
+{
+    const CLI::Validator between = tool::numberBetween(0.5, 2);
+    EXPECT_EQ(between("nan"), "'nan' is no number");
+    EXPECT_EQ(between("-NaN"), "'-NaN' is no number");
 }
 
 } // namespace

@@ -102,6 +102,7 @@ TEST(TransportOptions, WhatCannotGoTogetherIsRefused)
         {"--handshake-timeout", "0"},
         {"--handshake-timeout", "86401"},
         {"--handshake-timeout", "soon"},
+        {"--handshake-timeout", "nan"},
         {"--peer-name", "one", "two"}, // which would be an argument of its own
     };
     for (const auto& arguments : bad)

@@ -146,7 +146,8 @@ ExitStatus runBench(const BenchOptions& options, const BenchLoad& load)
 
 std::string checkEven(std::string& text)
 {
-    const bool even = !text.empty() && (text.back() - '0') % 2 == 0;
+    unsigned int number = 0;
+    const bool even = CLI::detail::lexical_cast(text, number) && number % 2 == 0;
     return even ? std::string() : "'" + text + "' is no even number: a console at each end of a message";
 }
 
@@ -161,11 +162,11 @@ void addLoadOptions(CLI::App& command, BenchOptions& options)
         ->check(CLI::Range(std::size_t{1}, kLongestBroadcast))
         ->capture_default_str();
     command.add_option("--rate", options.rate, "Messages a second, all connections together; flat out unless given")
-        ->check(CLI::Range(0.001, kHighestRate));
+        ->check(numberBetween(0.001, kHighestRate));
     CLI::Option* const count = command.add_option("--count", options.count, "Messages, all connections together")
                                    ->check(CLI::Range(std::uint64_t{1}, kMostMessages));
     command.add_option("--seconds", options.seconds, "How long to go on; 10 unless this or --count is given")
-        ->check(CLI::Range(0.001, kLongestSeconds))
+        ->check(numberBetween(0.001, kLongestSeconds))
         ->excludes(count);
 }
 

@@ -1,5 +1,6 @@
 #include "CommonOptions.hpp"
 
+#include <cmath>
 #include <exception>
 #include <unistd.h>
 
@@ -42,7 +43,7 @@ void addConnectOptions(CLI::App& app, ConnectOptions& options)
     addTransportOptions(app, options.transport);
     app.add_option("--timeout", options.timeoutSeconds, "Seconds for connecting and all answers together")
         ->type_name("SECONDS")
-        ->check(CLI::Range(kShortestTimeout, kLongestTimeout))
+        ->check(numberBetween(kShortestTimeout, kLongestTimeout))
         ->capture_default_str();
     app.add_option("--tool-type", options.identity.toolType, "Type that this console introduces itself with")
         ->capture_default_str();
@@ -57,6 +58,20 @@ void addJsonOption(CLI::App& app, bool& json)
 }
 
 CLI::Validator endpointValidator() { return CLI::Validator(checkEndpoint, ""); }
+
+CLI::Validator numberBetween(double least, double most)
+{
+    const CLI::Range range(least, most);
+    return CLI::Validator(
+        [range](std::string& text) {
+            const std::string failure = range(text);
+            double number = 0;
+            // A NaN is neither below the one nor above the other, and passes for a number between them.
+            const bool isNumber = CLI::detail::lexical_cast(text, number) && !std::isnan(number);
+            return failure.empty() && !isNumber ? "'" + text + "' is no number" : failure;
+        },
+        range.get_description());
+}
 
 bool isLoopback(const IPAddress& address)
 {

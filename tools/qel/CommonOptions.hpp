@@ -37,6 +37,9 @@ void addJsonOption(CLI::App& app, bool& json);
 /// Accepts the text of an endpoint: "127.0.0.1:4711", "[::1]:4711".
 CLI::Validator endpointValidator();
 
+/// Accepts a number from one to the other, both included, and nothing that is no number, such as "nan".
+CLI::Validator numberBetween(double least, double most);
+
 /// 127.0.0.0/8, ::1, and the former as an IPv4-mapped IPv6 address.
 bool isLoopback(const IPAddress& address);
 

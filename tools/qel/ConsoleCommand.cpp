@@ -174,7 +174,7 @@ void addInputOptions(CLI::App& command, ConsoleOptions& options)
                     "Leave when the partition has been silent for so long after the end of the input, which it is then "
                     "told only once; wait for its command to end unless given")
         ->type_name("SECONDS")
-        ->check(CLI::Range(0.0, kLongestLinger));
+        ->check(numberBetween(0.0, kLongestLinger));
 }
 
 } // namespace

@@ -113,7 +113,7 @@ void addTransportOptions(CLI::App& app, TransportOptions& options)
     app.add_option("--handshake-timeout", options.handshakeSeconds,
                    "Seconds from the connection until the console is let in")
         ->type_name("SECONDS")
-        ->check(CLI::Range(kShortestHandshake, kLongestHandshake))
+        ->check(numberBetween(kShortestHandshake, kLongestHandshake))
         ->capture_default_str();
 }
 
