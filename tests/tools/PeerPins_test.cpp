@@ -150,23 +150,40 @@ TEST_F(CheckPeer, ThePeerIsDescribedBySubjectAndFingerprint)
     EXPECT_EQ(tool::describePeer(client), "\"CN=server\", SHA-256 " + serverFingerprint());
 }
 
-TEST(CheckPeerName, IsTheCommonNameAndNoOtherField)
+class CheckPeerName : public ::testing::Test {
+protected:
+    /// Looks at a server with a certificate of this subject.
+    static void check(const SSLSubject& subject, const std::string& name)
+    {
+        const Authority& authority = Authority::trusted();
+        SSLCertificateRequest request(subject);
+        const SSLCertificate certificate = authority.issue(request, SSLValidityPeriod::days(1));
+        MemoryStreamPair memory;
+        SSLClientContext clientContext;
+        SSLServerContext serverContext;
+        clientContext.setCredentials(authority.clientCredentials());
+        serverContext.setCredentials(authority.credentialsOf(certificate));
+        SSLStream client(clientContext, memory.takeClient());
+        SSLStream server(serverContext, memory.takeServer());
+        std::thread other([&] { server.handshake(); });
+        client.handshake();
+        other.join();
+        tool::checkPeer(client, {{name}, {}});
+    }
+};
+
+TEST_F(CheckPeerName, IsTheCommonNameAndNoOtherField)
 {
-    const Authority& authority = Authority::trusted();
-    SSLCertificateRequest request(SSLSubject{{"CN", "one"}, {"O", "two"}});
-    const SSLCertificate certificate = authority.issue(request, SSLValidityPeriod::days(1));
-    MemoryStreamPair memory;
-    SSLClientContext clientContext;
-    SSLServerContext serverContext;
-    clientContext.setCredentials(authority.clientCredentials());
-    serverContext.setCredentials(authority.credentialsOf(certificate));
-    SSLStream client(clientContext, memory.takeClient());
-    SSLStream server(serverContext, memory.takeServer());
-    std::thread other([&] { server.handshake(); });
-    client.handshake();
-    other.join();
-    EXPECT_NO_THROW(tool::checkPeer(client, {{"one"}, {}}));
-    EXPECT_THROW(tool::checkPeer(client, {{"two"}, {}}), CommandFailure);
+    const SSLSubject subject{{"CN", "one"}, {"O", "two"}};
+    EXPECT_NO_THROW(check(subject, "one"));
+    EXPECT_THROW(check(subject, "two"), CommandFailure);
+}
+
+TEST_F(CheckPeerName, ACertificateWithoutACommonNameHasNoneThatCouldBePinned)
+{
+    const SSLSubject subject{{"O", "two"}};
+    EXPECT_THROW(check(subject, "two"), CommandFailure);
+    EXPECT_THROW(check(subject, ""), CommandFailure); // as from a variable that was not set
 }
 
 } // namespace

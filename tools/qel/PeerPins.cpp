@@ -33,6 +33,7 @@ std::unique_ptr<SSLCertificate> certificateOf(const SSLStream& stream)
     return certificate;
 }
 
+/// @return empty when it has none
 std::string commonNameOf(const SSLCertificate& certificate)
 {
     const SSLSubject subject = certificate.getSubject();
@@ -70,7 +71,8 @@ void checkPeer(const SSLStream& stream, const PeerPins& pins)
     const auto certificate = certificateOf(stream);
     if (!pins.names.empty()) {
         const std::string name = commonNameOf(*certificate);
-        if (!contains(pins.names, name)) refuse("the name " + quoted(name), "--peer-name");
+        // None is not the same as an empty one: no pin names a certificate without a name, not even an empty pin.
+        if (name.empty() || !contains(pins.names, name)) refuse("the name " + quoted(name), "--peer-name");
     }
     if (!pins.fingerprints.empty()) {
         const std::string fingerprint = fingerprintOf(*certificate);
