@@ -1,3 +1,4 @@
+#include <qel/common/QelInternalMessageRegistry.hpp>
 #include <qel/common/QelMessageDax.hpp>
 #include <qel/common/io/StreamIOException.hpp>
 
@@ -49,6 +50,25 @@ protected:
         } catch (const StreamIOException&) {
             return sent;
         }
+    }
+
+    /// Opens partition 1 and lets it print, and the console read nothing, until the partition is held back.
+    /// @return the pieces of 4 KiB that it has printed
+    unsigned printUntilHeldBack()
+    {
+        messages.ask(QelMessageInterfaceCmpOpenKrogSessionReq());
+        messages.ask(QelMessageVirtualSerialOpenReq(1, 0, false));
+        messages.ask(QelMessageVirtualSerialSetupSessionReq(1, 0));
+        unsigned chunks = 0;
+        for (unsigned full = 0; full < 50; full = hypervisor->serialWatches().empty() ? full + 1 : 0) {
+            if (full > 0) {
+                std::this_thread::sleep_for(std::chrono::milliseconds(1)); // the system's buffers may still be filling
+                continue;
+            }
+            port1->output = {std::string(4096, static_cast<char>('a' + ++chunks % 26))};
+            hypervisor->serviceSerial(1);
+        }
+        return chunks;
     }
 
     Loopback loopback;
@@ -217,18 +237,7 @@ TEST_F(ConnectionTest, APartitionThatPrintsWithoutEndIsHeldBackAndLeavesRoomForT
 {
     start();
     identify();
-    messages.ask(QelMessageInterfaceCmpOpenKrogSessionReq());
-    messages.ask(QelMessageVirtualSerialOpenReq(1, 0, false));
-    messages.ask(QelMessageVirtualSerialSetupSessionReq(1, 0));
-    unsigned chunks = 0; // the console reads none of them
-    for (unsigned full = 0; full < 50; full = hypervisor->serialWatches().empty() ? full + 1 : 0) {
-        if (full > 0) {
-            std::this_thread::sleep_for(std::chrono::milliseconds(1)); // the system's buffers may still be filling
-            continue;
-        }
-        port1->output = {std::string(4096, static_cast<char>('a' + ++chunks % 26))};
-        hypervisor->serviceSerial(1);
-    }
+    const unsigned chunks = printUntilHeldBack();
     EXPECT_TRUE(hypervisor->mayReceive(1));
     const QelMessageGetQelTodReq request;
     messages.send(request);
@@ -351,6 +360,32 @@ TEST_F(ConnectionTest, AnAbortedConnectionEndsWhateverItsConsoleDoes)
     messages.ask(QelMessageSetGlobalSaveAreaMetadataReq(std::string(16000, 'm')));
     sendUntilStuck(QelMessageGetGlobalSaveAreaMetadataReq());
     connection->abort();
+    expectEnd();
+}
+
+TEST_F(ConnectionTest, AConsoleThatIsSentAwayAndDoesNotReadIsCut)
+{
+    ConnectionLimits limits;
+    limits.linger = std::chrono::milliseconds(20);
+    start(limits);
+    identify();
+    printUntilHeldBack();
+    messages.send(QelMessageUpgradeConnectionAsync());
+    expectEnd();
+}
+
+TEST_F(ConnectionTest, AConsoleThatIsSentAwayAndReadsGetsEverything)
+{
+    start();
+    identify();
+    const unsigned chunks = printUntilHeldBack();
+    messages.send(QelMessageUpgradeConnectionAsync());
+    for (unsigned i = 1; i <= chunks; ++i)
+        ASSERT_NE(messages.receive<QelMessageVirtualSerialDataToDaxAsync>(), nullptr) << i;
+    const auto last = messages.receive();
+    EXPECT_EQ(last->getFunction(), 0x6001);
+    EXPECT_EQ(last->getOperation(), 0x0002);
+    EXPECT_TRUE(messages.isClosed());
     expectEnd();
 }
 

@@ -102,6 +102,9 @@ void Connection::pReceiveAll()
     while (pWaitForTurn()) {
         const std::unique_ptr<QelMessage> message = mMessages.read();
         const ConsoleState state = mHypervisor.receive(mId, *message);
+        // It is sent away, and nothing it sends is looked at any more. It may take what is queued for it, but not hold
+        // its connection by not taking it.
+        if (state == ConsoleState::Closing && !mOutbox.waitUntilWritten(mLimits.linger)) abort();
         if (!introduced && state == ConsoleState::Identified) {
             introduced = true;
             mHandshake = PollDeadline();
