@@ -162,6 +162,21 @@ TEST_F(BenchShareTest, MessagesThatWereDueAndNotSentAreCounted)
     EXPECT_EQ(figures.unsent, 8U); // ten in a tenth of a second
 }
 
+// One after the other they would take longer to count than anybody waits.
+TEST_F(BenchShareTest, HoweverManyAreUnsentTheyAreCounted)
+{
+    constexpr std::chrono::hours kWeek(7 * 24);
+    load.time = kWeek;
+    load.rate = 1000000;
+    takes = {kWeek + seconds(1)};
+    EXPECT_EQ(run().unsent, 604799999999U);
+    load.pairs = 127;
+    load.count = 1000000000000;
+    clock.setSteady(start);
+    sentAt.clear();
+    EXPECT_EQ(run(126).unsent, 604800000000U / 127 - 1);
+}
+
 TEST_F(BenchShareTest, WithACountNoMoreThanThatCanBeUnsent)
 {
     load.time = milliseconds(100);
@@ -191,6 +206,18 @@ TEST_F(BenchShareTest, AFailureLeavesTheFiguresOfWhatWasDone)
     EXPECT_EQ(figures.latency.count(), 2U);
     EXPECT_EQ(figures.elapsed, milliseconds(2));
     EXPECT_EQ(done, 2U);
+}
+
+TEST_F(BenchShareTest, AFailureTellsWhatWasDueByThen)
+{
+    load.rate = 100;
+    failsAt = 3;
+    takes = {milliseconds(1), milliseconds(1), milliseconds(35)};
+    BenchFigures figures;
+    EXPECT_THROW(run(figures), std::runtime_error);
+    EXPECT_THAT(sentAt, ElementsAre(0, 10, 20));
+    EXPECT_EQ(figures.latency.count(), 2U);
+    EXPECT_EQ(figures.unsent, 3U); // due at 30, 40 and 50 of 55 milliseconds; the one in hand was sent
 }
 
 TEST_F(BenchShareTest, TheClockIsReadOnceForEachMessageAndFlatOutTwice)

@@ -19,7 +19,12 @@ void BenchShare::run(const Exchange& exchange, const WaitUntil& waitUntil, Bench
     for (; sent < messages; ++sent) {
         const TimePoint due = paced ? pDueTime(sent) : TimeProvider::steady();
         if (pIsOver(due) || pIsOver(mStart + figures.elapsed) || !waitUntil(due)) break;
-        exchange();
+        try {
+            exchange();
+        } catch (...) {
+            if (paced) figures.unsent = pUnsent(sent + 1); // this one was sent
+            throw;
+        }
         const TimePoint end = TimeProvider::steady();
         figures.latency.record(end - due);
         figures.elapsed = end - mStart;
@@ -32,10 +37,18 @@ void BenchShare::run(const Exchange& exchange, const WaitUntil& waitUntil, Bench
 std::uint64_t BenchShare::pUnsent(std::uint64_t sent) const
 {
     const TimePoint now = TimeProvider::steady();
-    std::uint64_t next = sent;
-    while (next < pMessages() && pDueTime(next) <= now && !pIsOver(pDueTime(next)))
-        ++next;
-    return next - sent;
+    const auto wasDue = [&](std::uint64_t message) {
+        return message < pMessages() && pDueTime(message) <= now && !pIsOver(pDueTime(message));
+    };
+    // There may be far too many to look at each. Of two the earlier is due first, so the last is closed in on.
+    std::uint64_t step = 1;
+    while (wasDue(sent + step - 1))
+        step *= 2;
+    std::uint64_t unsent = 0;
+    for (; step > 0; step /= 2) {
+        if (wasDue(sent + unsent + step - 1)) unsent += step;
+    }
+    return unsent;
 }
 
 /// How many messages the share has: every pair's number, and every so many from there.
