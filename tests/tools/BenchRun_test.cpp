@@ -1,12 +1,16 @@
+#include <qel/common/io/StreamIOException.hpp>
+
 #include "BenchRun.hpp"
 #include "Failures.hpp"
 #include "tools/FakeBenchPair.hpp"
+#include "tools/Loopback.hpp"
 
 #include <array>
 #include <atomic>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <memory>
+#include <sys/socket.h>
 #include <thread>
 #include <vector>
 
@@ -99,6 +103,62 @@ TEST_F(BenchRunTest, AFailureAfterTheEndIsNone)
     run->stop();
     stopped = true;
     EXPECT_TRUE(run->finish().interrupted);
+}
+
+/// A pair whose hypervisor has stopped: it takes what it is sent, and neither answers nor ends a connection.
+struct StalledPair {
+    StalledPair()
+        : pair(std::make_unique<tool::BenchPair>(console(first), console(second), 1, std::chrono::milliseconds(1)))
+    {}
+
+    static tool::BenchConsole console(Loopback& loopback)
+    {
+        const int descriptor = loopback.near->getSocket().getFd();
+        tool::IdentityOptions identity;
+        identity.toolId = "console";
+        return {identity, std::make_unique<tool::ClientConnection>(std::move(loopback.near), descriptor)};
+    }
+
+    /// Whether a console has said that it will send no more. Takes what it sent before.
+    static bool hasLeft(Loopback& loopback)
+    {
+        std::array<char, 4096> bytes;
+        ssize_t count = 0;
+        do
+            count = ::recv(loopback.far->getSocket().getFd(), bytes.data(), bytes.size(), MSG_DONTWAIT);
+        while (count > 0);
+        return count == 0;
+    }
+
+    Loopback first;
+    Loopback second;
+    std::unique_ptr<tool::BenchPair> pair;
+};
+
+TEST(BenchRunEnd, AllPairsLeaveAtOnceAndAServerThatHasStoppedIsNotWaitedForByOneAfterTheOther)
+{
+    std::array<StalledPair, 4> stalled;
+    std::vector<std::unique_ptr<tool::BenchPair>> pairs;
+    for (StalledPair& entry : stalled)
+        pairs.push_back(std::move(entry.pair));
+    BenchLoad load;
+    load.pairs = stalled.size();
+    BenchRun run(std::move(pairs), load);
+    EXPECT_TRUE(PollSet(run.getPollFd()).wait(std::chrono::seconds(20)).contains(run.getPollFd()));
+    for (StalledPair& entry : stalled) {
+        EXPECT_TRUE(StalledPair::hasLeft(entry.first));
+        EXPECT_TRUE(StalledPair::hasLeft(entry.second));
+    }
+    EXPECT_THROW(run.finish(), StreamIOException);
+}
+
+TEST_F(BenchRunTest, ToldToStopWhenAllIsDoneItWasNotInterrupted)
+{
+    load.count = 10;
+    const auto run = start();
+    EXPECT_TRUE(PollSet(run->getPollFd()).wait(std::chrono::seconds(20)).contains(run->getPollFd()));
+    run->stop();
+    EXPECT_FALSE(run->finish().interrupted);
 }
 
 TEST_F(BenchRunTest, ARunThatNobodyWaitsForEnds)

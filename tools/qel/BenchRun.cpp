@@ -10,7 +10,7 @@ namespace qel::tool {
 
 BenchRun::BenchRun(std::vector<std::unique_ptr<BenchPair>> pairs, const BenchLoad& load)
     : mLoad(load), mPairs(std::move(pairs)), mStart(TimeProvider::steady()), mFigures(mPairs.size()),
-      mRunning(mPairs.size())
+      mRunning(mPairs.size()), mCarrying(mPairs.size())
 {
     try {
         for (std::size_t i = 0; i < mPairs.size(); ++i)
@@ -49,8 +49,6 @@ void BenchRun::cut()
 BenchFigures BenchRun::finish()
 {
     pJoin();
-    for (const auto& pair : mPairs)
-        pair->leave();
     BenchFigures all;
     for (const BenchFigures& figures : mFigures) {
         all.latency.add(figures.latency);
@@ -69,13 +67,21 @@ void BenchRun::pRunPair(std::size_t number) noexcept
     // prctl(2).
     static_cast<void>(::prctl(PR_SET_TIMERSLACK, 1UL));
     try {
-        const BenchShare share(mLoad, static_cast<unsigned int>(number), mStart);
-        share.run([this, number] { mPairs[number]->exchange(); },
-                  [this](BenchShare::TimePoint time) { return pWaitUntil(time); }, mFigures[number], mDone);
+        pCarryShare(number);
     } catch (...) {
         pKeepFailure(std::current_exception());
     }
+    mPairs[number]->leave();
     if (--mRunning == 0) mEnded.interrupt();
+}
+
+void BenchRun::pCarryShare(std::size_t number)
+{
+    const BenchShare share(mLoad, static_cast<unsigned int>(number), mStart);
+    share.run([this, number] { mPairs[number]->exchange(); },
+              [this](BenchShare::TimePoint time) { return pWaitUntil(time); }, mFigures[number], mDone);
+    const MutexLock lock(mMutex);
+    if (--mCarrying == 0) mStop = true; // whoever interrupts it now is too late
 }
 
 bool BenchRun::pWaitUntil(BenchShare::TimePoint time)

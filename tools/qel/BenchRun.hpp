@@ -20,7 +20,8 @@ namespace qel::tool {
 
 /// A run of a benchmark: each pair of consoles on a thread of its own, all from the same moment on.
 ///
-/// When one pair fails, the others end with the message they have in hand.
+/// When one pair fails, the others end with the message they have in hand. A pair that is done leaves politely, on its
+/// own thread: a server that has stopped is waited for once, and not by one pair after the other.
 /// Thread safety: one thread owns it.
 class BenchRun {
 public:
@@ -35,7 +36,7 @@ public:
     BenchRun(const BenchRun&) = delete;
     BenchRun& operator=(const BenchRun&) = delete;
 
-    /// Readable once all pairs are done.
+    /// Readable once all pairs are done and have left.
     PollFd getPollFd() const { return mEnded.getPollFd(); }
 
     /// How many messages are done, so far.
@@ -43,19 +44,20 @@ public:
 
     std::chrono::nanoseconds elapsed() const;
 
-    /// Lets each pair end with the message it has in hand.
+    /// Lets each pair end with the message it has in hand. Changes nothing once all are done.
     void stop();
 
     /// As stop(), but ends the connections at once, messages in hand or not.
     void cut();
 
-    /// Waits for all pairs, and lets them leave politely.
+    /// Waits for all pairs.
     /// @return the figures of all together
     /// @throws what the first pair that failed has thrown, unless that was after stop()
     BenchFigures finish();
 
 private:
     void pRunPair(std::size_t number) noexcept;
+    void pCarryShare(std::size_t number);
     bool pWaitUntil(BenchShare::TimePoint time);
     void pKeepFailure(std::exception_ptr failure);
     void pJoin();
@@ -70,7 +72,8 @@ private:
 
     mutable Mutex mMutex;
     ConditionVariable mStopped;
-    bool mStop QEL_GUARDED_BY(mMutex) = false;
+    std::size_t mCarrying QEL_GUARDED_BY(mMutex);     // pairs that are not done
+    bool mStop QEL_GUARDED_BY(mMutex) = false;        // also once all are done
     bool mInterrupted QEL_GUARDED_BY(mMutex) = false; // by the owner, not by a failure
     std::exception_ptr mFailure QEL_GUARDED_BY(mMutex);
 
