@@ -62,10 +62,11 @@ pid_t spawn(std::vector<std::string> arguments, std::vector<std::string> environ
     sigset_t none;
     ::sigemptyset(&none);
     ::posix_spawnattr_setsigmask(&attributes, &none);
-    sigset_t broken;
-    ::sigemptyset(&broken);
-    ::sigaddset(&broken, SIGPIPE);
-    ::posix_spawnattr_setsigdefault(&attributes, &broken);
+    // Whatever this process ignores, as all that nohup(1) or a shell starts in the background does, would be ignored
+    // there.
+    sigset_t all;
+    ::sigfillset(&all);
+    ::posix_spawnattr_setsigdefault(&attributes, &all);
     ::posix_spawnattr_setflags(&attributes, POSIX_SPAWN_SETSIGMASK | POSIX_SPAWN_SETSIGDEF);
     pid_t pid = -1;
     const int error = ::posix_spawn(&pid, arguments.at(0).c_str(), &actions, &attributes, pointers(arguments).data(),
