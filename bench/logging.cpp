@@ -108,21 +108,24 @@ void disabledSpdlog(benchmark::State& state)
 void countOnly(benchmark::State& state)
 {
     unsigned int number = 0;
-    for (auto _ : state) benchmark::DoNotOptimize(++number);
+    for (auto _ : state)
+        benchmark::DoNotOptimize(++number);
 }
 
 void composeOurs(benchmark::State& state)
 {
     const OurLog log(std::make_shared<DroppingBackend>());
     unsigned int number = 0;
-    for (auto _ : state) ourLine(++number);
+    for (auto _ : state)
+        ourLine(++number);
 }
 
 void composeSpdlog(benchmark::State& state)
 {
     const auto logger = spdLogger(std::make_shared<DroppingSink<std::mutex>>());
     unsigned int number = 0;
-    for (auto _ : state) spdLine(*logger, ++number);
+    for (auto _ : state)
+        spdLine(*logger, ++number);
 }
 
 // The text is ready: it only has to get into memory of its own.
@@ -139,7 +142,8 @@ void fileOurs(benchmark::State& state, const std::string& folder)
 {
     const OurLog log(std::make_shared<LogBackendRotating>(LogLevel::Info, folder, "ours", kRotateSize));
     unsigned int number = 0;
-    for (auto _ : state) ourLine(++number);
+    for (auto _ : state)
+        ourLine(++number);
 }
 
 template <typename Sink>
@@ -152,7 +156,8 @@ void fileSpdlog(benchmark::State& state, const std::string& folder)
 {
     const auto logger = spdRotating<spdlog::sinks::rotating_file_sink_mt>(folder);
     unsigned int number = 0;
-    for (auto _ : state) spdLine(*logger, ++number);
+    for (auto _ : state)
+        spdLine(*logger, ++number);
 }
 
 // One gathered write of a line that is ready.
@@ -181,7 +186,8 @@ template <typename Work>
 void onTwoThreads(benchmark::State& state, const Work& work)
 {
     const auto lines = [&work] {
-        for (unsigned int i = 0; i < kLinesOfThread; ++i) work(i);
+        for (unsigned int i = 0; i < kLinesOfThread; ++i)
+            work(i);
     };
     for (auto _ : state) {
         std::thread other(lines);

@@ -68,7 +68,8 @@ void printRow(const std::string& work, const std::string& rival, double ours, do
 
 void printTable(const RoundCollector& rounds)
 {
-    std::printf("\n%-52s %-34s %10s %10s %7s %7s\n", "work", "held against", "ours ns", "theirs ns", "ratio", "at most");
+    std::printf("\n%-52s %-34s %10s %10s %7s %7s\n", "work", "held against", "ours ns", "theirs ns", "ratio",
+                "at most");
     for (const Contest* contest : qel::bench::contests()) {
         const auto median = [&](const std::string& contestant) {
             return rounds.median(Contest::benchmarkName(contest->work(), contestant));
@@ -99,7 +100,8 @@ int main(int argc, char** argv)
 {
     std::vector<std::string> arguments = withDefaults(argc, argv);
     std::vector<char*> pointers;
-    for (std::string& argument : arguments) pointers.push_back(argument.data());
+    for (std::string& argument : arguments)
+        pointers.push_back(argument.data());
     int count = static_cast<int>(pointers.size());
     benchmark::Initialize(&count, pointers.data());
     if (benchmark::ReportUnrecognizedArguments(count, pointers.data())) return EXIT_FAILURE;
