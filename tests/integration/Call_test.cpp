@@ -4,6 +4,7 @@
 #include <qel/common/QelMessageGeneric.hpp>
 
 #include "integration/TestConsole.hpp"
+#include "integration/WrongServer.hpp"
 
 #include <functional>
 #include <gmock/gmock.h>
@@ -189,36 +190,6 @@ TEST(CallInARow, CallsAreNotInEachOthersWay)
 }
 
 // Servers that misbehave.
-
-/// A server of the test's own: does one thing with the first connection.
-class WrongServer {
-public:
-    explicit WrongServer(std::function<void(LoopbackMessages&)> behave)
-        : mListener(listenOn(IPEndpoint("127.0.0.1:0"), 1)), mEndpoint(mListener.getSocketName().str()),
-          mThread([this, behave = std::move(behave)] {
-              SocketStream stream(mListener.accept());
-              stream.setReadDeadline(Process::kDeadline);
-              LoopbackMessages messages(stream);
-              try {
-                  behave(messages);
-              } catch (const std::exception&) { // the client has gone, which is its right
-              }
-          })
-    {}
-    ~WrongServer() { mThread.join(); }
-
-    Process::Result call(const std::vector<std::string>& arguments) const
-    {
-        std::vector<std::string> command{"call", "--connect", mEndpoint, "--plain"};
-        command.insert(command.end(), arguments.begin(), arguments.end());
-        return runQel(command);
-    }
-
-private:
-    Socket mListener;
-    std::string mEndpoint;
-    std::thread mThread;
-};
 
 /// Grants the version request.
 void welcome(LoopbackMessages& messages)

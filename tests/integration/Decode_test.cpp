@@ -7,7 +7,6 @@
 #include <fstream>
 #include <gmock/gmock.h>
 #include <sys/stat.h>
-#include <unistd.h>
 
 namespace qel::test {
 
@@ -146,16 +145,6 @@ TEST_F(DecodeTest, AFileThatCannotBeReadIsAFailure)
     EXPECT_EQ(result.exitStatus, 4);
     EXPECT_EQ(result.errors, "qel: cannot read the input\n");
     EXPECT_THAT(result.output, IsEmpty());
-}
-
-TEST_F(DecodeTest, AFileThatMayNotBeOpenedIsAFailure)
-{
-    if (::geteuid() == 0) GTEST_SKIP() << "root may open every file";
-    const std::string path = fileWith("");
-    ASSERT_EQ(::chmod(path.c_str(), 0), 0);
-    const auto result = runQel({"decode", path});
-    EXPECT_EQ(result.exitStatus, 4);
-    EXPECT_EQ(result.errors, "qel: cannot open " + path + ": 13 (Permission denied)\n");
 }
 
 TEST_F(DecodeTest, AFileThatCannotBeOpenedIsAFailure)

@@ -1,6 +1,7 @@
 // What the world may do to the hypervisor end: broken bytes, consoles that vanish, no descriptors.
 
 #include "integration/TestConsole.hpp"
+#include "support/ComesTrue.hpp"
 
 #include <algorithm>
 #include <filesystem>
@@ -24,18 +25,6 @@ std::size_t count(const std::string& text, const std::string& part)
     for (std::size_t at = text.find(part); at != std::string::npos; at = text.find(part, at + 1))
         ++found;
     return found;
-}
-
-/// Waits for a condition that another process brings about.
-template <typename F>
-bool comesTrue(F condition)
-{
-    const auto end = std::chrono::steady_clock::now() + Process::kDeadline;
-    while (std::chrono::steady_clock::now() < end) {
-        if (condition()) return true;
-        std::this_thread::sleep_for(std::chrono::milliseconds(5));
-    }
-    return condition();
 }
 
 /// The processes that a process has started and not yet reaped.

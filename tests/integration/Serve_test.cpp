@@ -4,6 +4,7 @@
 #include <qel/common/Utilities.hpp>
 
 #include "integration/TestConsole.hpp"
+#include "support/ComesTrue.hpp"
 #include "support/TemporaryDirectory.hpp"
 
 #include <atomic>
@@ -199,9 +200,7 @@ TEST(Serve, WhatACommandPutsOutWithoutASessionWaitsForTheNextOne)
     console.readUntil(1, "ready\r\n");
     console.type(1, "\n");
     ASSERT_EQ(console.statusOf(QelMessageVirtualSerialCloseReq(1, 0, false)), 0U);
-    for (int i = 0; i < 4000 && !std::ifstream(file).good(); ++i) {
-        std::this_thread::sleep_for(std::chrono::milliseconds(5));
-    }
+    ASSERT_TRUE(comesTrue([&] { return std::ifstream(file).good(); }));
     console.openSerial(1);
     console.readUntil(1, "meanwhile\r\n");
     server.stop();
@@ -396,15 +395,14 @@ std::string statisticsOf(ServeProcess& server, std::size_t queues = 1)
 {
     const std::size_t before = server.process().errors().size();
     server.process().signal(SIGUSR1);
-    for (int i = 0; i < 4000; ++i) {
-        const std::string text = server.process().errors().substr(before);
-        if (count(text, "[qel]     10+s:") == queues) {
-            // What was logged before the signal may come after it was sent.
-            return text.substr(text.rfind('\n', text.find("[qel] Queue of ")) + 1);
-        }
-        std::this_thread::sleep_for(std::chrono::milliseconds(5));
-    }
-    throw std::runtime_error("no statistics: " + server.process().errors());
+    std::string text;
+    const bool told = comesTrue([&] {
+        text = server.process().errors().substr(before);
+        return count(text, "[qel]     10+s:") == queues;
+    });
+    if (!told) throw std::runtime_error("no statistics: " + server.process().errors());
+    // What was logged before the signal may come after it was sent.
+    return text.substr(text.rfind('\n', text.find("[qel] Queue of ")) + 1);
 }
 
 /// The lines that the program itself wrote to a log, without what stands in front of them.

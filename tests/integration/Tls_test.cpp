@@ -9,6 +9,7 @@
 #include "CertificateView.hpp"
 #include "integration/TestConsole.hpp"
 #include "integration/TlsConsole.hpp"
+#include "integration/WrongServer.hpp"
 #include "support/CredentialDirectory.hpp"
 #include "support/RawTlsPeer.hpp"
 
@@ -486,31 +487,6 @@ TEST_F(Tls, TooManyConsolesAreTurnedAwayBeforeTls)
 
 // Servers that go astray before TLS.
 
-/// A server of the test's own: does one thing with the first connection.
-class WrongTlsServer {
-public:
-    explicit WrongTlsServer(std::function<void(LoopbackMessages&)> behave)
-        : mListener(listenOn(IPEndpoint("127.0.0.1:0"), 1)), mEndpoint(mListener.getSocketName().str()),
-          mThread([this, behave = std::move(behave)] {
-              SocketStream stream(mListener.accept());
-              stream.setReadDeadline(Process::kDeadline);
-              LoopbackMessages messages(stream);
-              try {
-                  behave(messages);
-              } catch (const std::exception&) { // the client has gone, which is its right
-              }
-          })
-    {}
-    ~WrongTlsServer() { mThread.join(); }
-
-    const std::string& endpoint() const { return mEndpoint; }
-
-private:
-    Socket mListener;
-    std::string mEndpoint;
-    std::thread mThread;
-};
-
 struct WrongServerRow {
     const char* name;
     std::function<void(LoopbackMessages&)> behave;
@@ -524,7 +500,7 @@ class TlsWrongServer : public Tls, public ::testing::WithParamInterface<WrongSer
 
 TEST_P(TlsWrongServer, HasItsExitStatusAndText)
 {
-    const WrongTlsServer server(GetParam().behave);
+    const WrongServer server(GetParam().behave);
     const auto result = callTo(server.endpoint(), {"--handshake-timeout", "2"});
     EXPECT_EQ(result.exitStatus, GetParam().exitStatus);
     EXPECT_EQ(result.errors, prefix(server.endpoint()) + GetParam().errors + "\n");

@@ -1,0 +1,23 @@
+#pragma once
+
+#include "support/Process.hpp"
+
+#include <chrono>
+#include <thread>
+
+namespace qel::test {
+
+/// Waits for a condition that another process brings about, as long as anything may take.
+/// @return false: it has not come true; to be asserted
+template <typename F>
+[[nodiscard]] bool comesTrue(F condition)
+{
+    const auto end = std::chrono::steady_clock::now() + Process::kDeadline;
+    while (std::chrono::steady_clock::now() < end) {
+        if (condition()) return true;
+        std::this_thread::sleep_for(std::chrono::milliseconds(5));
+    }
+    return condition();
+}
+
+} // namespace qel::test
