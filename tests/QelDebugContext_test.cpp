@@ -273,7 +273,8 @@ TEST(QelDebugContext, ShowsTheTimeOfWhicheverClockIsInForce)
         return log.rawLines().back().substr(0, 22);
     };
     const auto realTime = [] {
-        const std::time_t now = std::time(nullptr);
+        // The same clock: time(2) reads a coarser one, which reaches a new second up to a timer tick later.
+        const std::time_t now = system_clock::to_time_t(system_clock::now());
         std::tm fields = {};
         ::gmtime_r(&now, &fields);
         char text[32];
