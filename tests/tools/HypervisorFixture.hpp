@@ -41,12 +41,23 @@ protected:
     /// Hands the hypervisor the bytes of a message.
     tool::ConsoleState receive(Peer& peer, const QelMessage& message)
     {
-        return hypervisor->receive(peer.id, *registry.deserialize(message.serialize(), message.msgLength()));
+        return receive(peer, message.serialize(), message.msgLength());
     }
     tool::ConsoleState receive(Peer& peer, const std::vector<char>& frame)
     {
-        return hypervisor->receive(peer.id,
-                                   *registry.deserialize(frame.data(), static_cast<unsigned int>(frame.size())));
+        return receive(peer, frame.data(), frame.size());
+    }
+    /// Whoever waits for the lines must hear of it when there are others to wait for.
+    tool::ConsoleState receive(Peer& peer, const char* frame, std::size_t length)
+    {
+        const auto message = registry.deserialize(frame, static_cast<unsigned int>(length));
+        const auto watchedBefore = watchedEvents();
+        const unsigned wakesBefore = serialWakes;
+        const tool::ConsoleState state = hypervisor->receive(peer.id, *message);
+        if (watchedEvents() != watchedBefore) {
+            EXPECT_GT(serialWakes, wakesBefore) << message->getLogID();
+        }
+        return state;
     }
 
     /// Sends a request and takes the one message that answers it.
@@ -102,6 +113,15 @@ protected:
         for (const tool::SerialWatch& watch : hypervisor->serialWatches())
             ids.push_back(watch.partition);
         return ids;
+    }
+
+    /// The partitions that are waited for, each with what it is waited for.
+    std::vector<std::pair<std::uint16_t, short>> watchedEvents() const
+    {
+        std::vector<std::pair<std::uint16_t, short>> events;
+        for (const tool::SerialWatch& watch : hypervisor->serialWatches())
+            events.emplace_back(watch.partition, watch.fd.mFd.events);
+        return events;
     }
 
     CapturedLog log{LogLevel::Warn};

@@ -292,6 +292,36 @@ TEST_F(VirtualSerialTest, OutputIsNotReadWhileTheConsoleHasNoRoom)
     EXPECT_EQ(takeData(slow, 1), "one");
 }
 
+TEST_F(VirtualSerialTest, OnlyWhatTouchesALineWakesTheThreadThatMovesSerialData)
+{
+    Peer peer;
+    Peer other;
+    setUpSerial(peer, "a", 1);
+    identify(other, "b");
+    unsigned wakes = serialWakes;
+    receive(peer, QelMessageGetQelTodReq());
+    receive(peer, QelMessageDaxBroadcastReq(0, 1, 0, "", "x"));
+    receive(other, QelMessageInterfaceCmpOpenKrogSessionReq());
+    receive(other, QelMessageInterfaceCmpCloseKrogSessionReq());
+    sendData(other, 1, "not the holder");
+    EXPECT_EQ(serialWakes, wakes);
+
+    const auto wakesOnce = [&](const char* what, const QelMessage& message) {
+        SCOPED_TRACE(what);
+        receive(peer, message);
+        EXPECT_EQ(serialWakes, wakes + 1);
+        wakes = serialWakes;
+    };
+    wakesOnce("input", QelMessageVirtualSerialDataToOsAsync(1, 0, 1, "x"));
+    wakesOnce("close", QelMessageVirtualSerialCloseReq(1, 0, false));
+    wakesOnce("open", QelMessageVirtualSerialOpenReq(1, 0, false));
+    wakesOnce("set up", QelMessageVirtualSerialSetupSessionReq(1, 0));
+    wakesOnce("end of the session", QelMessageInterfaceCmpCloseKrogSessionReq());
+    port2->failsToStart = true;
+    receive(peer, QelMessageInterfaceCmpOpenKrogSessionReq());
+    wakesOnce("a line that cannot be started", QelMessageVirtualSerialOpenReq(2, 0, false));
+}
+
 TEST_F(VirtualSerialTest, AConsoleWhoseSerialDataWaitsForRoomIsStillReadFrom)
 {
     Peer peer;

@@ -94,7 +94,7 @@ ConsoleState Hypervisor::receive(ConsoleId id, const QelMessage& message)
         logLine(LogLevel::Warn, "console ", id, ": ignored ", message.getLogID());
         break;
     }
-    mWakeSerial();
+    if (mPartitions.takeTouched()) mWakeSerial(); // most messages have nothing to do with serial data
     return console.state;
 }
 

@@ -28,6 +28,7 @@ QelMessageStatusCodes PartitionSet::open(Console& console, std::uint16_t id, std
     const QelMessageStatusCodes found = pFindPartition(id, connection, partition);
     if (found != QelMessageStatusNoError) return found;
     if (partition->holder != nullptr && !force) return QelMessageStatusConnectionNotAvailable;
+    mTouched = true; // even by a line that cannot be started: what was left of it is taken down first
     if (!pStart(*partition)) return QelMessageStatusCmdFailed;
     if (partition->holder != nullptr) pEnd(*partition, CloseReason::CloseReasonForceClose);
     partition->holder = &console;
@@ -41,6 +42,7 @@ QelMessageStatusCodes PartitionSet::setUp(Console& console, std::uint16_t id, st
     if (found != QelMessageStatusNoError) return found;
     if (partition->holder != &console) return QelMessageStatusInvalidCmdSequence;
     partition->setUp = true;
+    mTouched = true;
     return QelMessageStatusNoError;
 }
 
@@ -52,6 +54,7 @@ QelMessageStatusCodes PartitionSet::close(Console& console, std::uint16_t id, st
     if (partition->holder == &console) {
         partition->holder = nullptr;
         partition->setUp = false;
+        mTouched = true;
         return QelMessageStatusNoError;
     }
     if (partition->holder == nullptr || !force) return QelMessageStatusConnectionClosureFailure;
@@ -65,6 +68,7 @@ bool PartitionSet::feed(const Console& console, const QelMessageVirtualSerialDat
     if (partition == nullptr || data.getVssConnectionNumber() != kConnectionNumber) return false;
     if (partition->holder != &console || !partition->setUp) return false;
     if (data.getSerialDataLength() == 0) return true;
+    mTouched = true;
     partition->input.append(data.getSerialData(), data.getSerialDataLength());
     pPumpInput(*partition);
     return true;
@@ -77,6 +81,7 @@ void PartitionSet::release(const Console& console)
         if (partition.holder != &console) continue;
         partition.holder = nullptr;
         partition.setUp = false;
+        mTouched = true;
     }
 }
 
@@ -111,6 +116,8 @@ std::vector<SerialWatch> PartitionSet::watches() const
     }
     return watches;
 }
+
+bool PartitionSet::takeTouched() { return std::exchange(mTouched, false); }
 
 void PartitionSet::service(std::uint16_t id)
 {
@@ -159,6 +166,7 @@ void PartitionSet::pEnd(Partition& partition, CloseReason reason)
     partition.setUp = false;
     holder->link.post(
         std::make_unique<QelMessageVirtualSerialSessionClosedAsync>(partition.id, kConnectionNumber, reason));
+    mTouched = true;
     holder->link.resumeReading(); // it may have waited for this partition to take its input
 }
 

@@ -82,6 +82,10 @@ public:
     /// reported without end.
     std::vector<SerialWatch> watches() const;
 
+    /// Whether sessions, lines or waiting input may have changed since the last call, and watches() with them. What the
+    /// room in a console's link does to watches() is for the link to tell.
+    bool takeTouched();
+
     /// Moves what can be moved on one partition, at most one chunk of output.
     void service(std::uint16_t id);
 
@@ -106,6 +110,7 @@ private:
     static bool pWantsOutput(const Partition& partition);
 
     std::map<std::uint16_t, Partition> mPartitions;
+    bool mTouched = false;
 };
 
 } // namespace qel::tool
