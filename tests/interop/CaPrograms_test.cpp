@@ -152,9 +152,10 @@ TEST_F(CaPrograms, GnutlsServerAndOurClientTalk)
 {
     skipWithout("gnutls-serv");
     if (IsSkipped()) return;
-    const auto server =
-        startWith({"gnutls-serv", "--port", "0", "--echo", "--require-client-cert", "--verify-client-cert"},
-                  gnutlsCredentials("hypervisor"));
+    Options command{"gnutls-serv", "--port", "0", "--echo", "--require-client-cert", "--verify-client-cert"};
+    const Options credentials = gnutlsCredentials("hypervisor");
+    command.insert(command.end(), credentials.begin(), credentials.end());
+    const auto server = startOnLoopback(command);
     const auto client = connectTo(*server, mClientSide);
     {
         // It answers whole lines of text only, so the version that we send must be one.

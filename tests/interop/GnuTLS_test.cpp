@@ -57,7 +57,7 @@ protected:
     {
         Options command{"gnutls-serv", "--port", "0", "--echo", "--require-client-cert", "--verify-client-cert"};
         command.insert(command.end(), more.begin(), more.end());
-        return start(command);
+        return startOnLoopback(command);
     }
 
     CredentialFiles mClientFiles{credentialsOf(Identity::Client)};

@@ -9,6 +9,8 @@
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
+#include <iomanip>
+#include <netinet/in.h>
 #include <poll.h>
 #include <set>
 #include <sstream>
@@ -48,23 +50,56 @@ std::set<std::string> socketsOf(pid_t process)
     return numbers;
 }
 
-/// @return the port at which a process accepts connections of IPv4; 0 when it does not. See proc_net_tcp(5).
-std::uint16_t listeningPort(pid_t process)
+/// What a process listens at. See proc_net_tcp(5).
+struct Listening {
+    std::string address; ///< as in the table: each four bytes of it as the hexadecimal number that they are here
+    std::uint16_t port = 0;
+};
+
+/// @param table  "tcp" for IPv4, "tcp6" for IPv6
+std::vector<Listening> listeningOf(pid_t process, const std::string& table)
 {
+    std::vector<Listening> all;
     const std::set<std::string> own = socketsOf(process);
-    std::ifstream table("/proc/" + std::to_string(process) + "/net/tcp");
+    std::ifstream lines("/proc/" + std::to_string(process) + "/net/" + table);
     std::string line;
-    std::getline(table, line); // the titles
-    while (std::getline(table, line)) {
+    std::getline(lines, line); // the titles
+    while (std::getline(lines, line)) {
         std::istringstream words(line);
         std::vector<std::string> columns;
         for (std::string word; words >> word;)
             columns.push_back(word);
         const bool listens = columns.size() > 9 && columns[3] == "0A";
         if (!listens || own.count(columns[9]) == 0) continue;
-        return static_cast<std::uint16_t>(std::stoul(columns[1].substr(columns[1].find(':') + 1), nullptr, 16));
+        const std::size_t colon = columns[1].find(':');
+        const auto port = static_cast<std::uint16_t>(std::stoul(columns[1].substr(colon + 1), nullptr, 16));
+        all.push_back({columns[1].substr(0, colon), port});
     }
-    return 0;
+    return all;
+}
+
+/// @return four bytes of an address as the tables have them
+std::string inTable(std::uint32_t hostOrder)
+{
+    std::ostringstream text;
+    text << std::hex << std::uppercase << std::setw(8) << std::setfill('0') << htonl(hostOrder);
+    return text.str();
+}
+
+/// @return the port at which a process accepts connections of IPv4; 0 when it does not
+/// @throws std::runtime_error  others than this machine could connect
+std::uint16_t listeningPort(pid_t process)
+{
+    std::uint16_t port = 0;
+    for (const Listening& listening : listeningOf(process, "tcp")) {
+        if (listening.address != inTable(INADDR_LOOPBACK)) throw std::runtime_error("it listens to the whole network");
+        port = listening.port;
+    }
+    for (const Listening& listening : listeningOf(process, "tcp6")) {
+        if (listening.address != inTable(0) + inTable(0) + inTable(0) + inTable(1))
+            throw std::runtime_error("it listens to the whole network");
+    }
+    return port;
 }
 
 } // namespace
@@ -95,6 +130,12 @@ std::unique_ptr<Process> ProgramTest::start(std::vector<std::string> command)
 {
     command.insert(command.begin(), "/usr/bin/env");
     return std::make_unique<Process>(command);
+}
+
+std::unique_ptr<Process> ProgramTest::startOnLoopback(std::vector<std::string> command)
+{
+    command.insert(command.begin(), "LD_PRELOAD=" QEL_LOOPBACK_ONLY); // env(1) takes it
+    return start(std::move(command));
 }
 
 std::string ProgramTest::listen()

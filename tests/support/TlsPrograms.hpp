@@ -42,6 +42,8 @@ protected:
 
     /// Starts a program that is found by its name.
     static std::unique_ptr<Process> start(std::vector<std::string> command);
+    /// Starts one that would listen to the whole network and has no option against that: it is not let.
+    static std::unique_ptr<Process> startOnLoopback(std::vector<std::string> command);
 
     // We accept.
 
@@ -55,6 +57,7 @@ protected:
     // They accept.
 
     /// Connects to the port of 127.0.0.1 at which a program listens, once it does.
+    /// @throws std::runtime_error  it does not, or the rest of the network could connect to it as well
     std::unique_ptr<SSLStream> connectTo(const Process& program, Identity identity = Identity::Client);
     /// The same with credentials of the test's own.
     std::unique_ptr<SSLStream> connectTo(const Process& program, SSLClientContext& context);

@@ -1,0 +1,42 @@
+// A module to be loaded in front of a program (LD_PRELOAD, see ld.so(8)) that would listen to the whole network and
+// cannot be told otherwise: whatever it binds to all addresses is bound to that of this machine itself instead.
+
+#include <arpa/inet.h>
+#include <cstring>
+#include <dlfcn.h>
+#include <netinet/in.h>
+#include <sys/socket.h>
+
+namespace {
+
+/// @return whether the address is one that was passed as what it seems to be
+template <typename Address>
+bool isA(sa_family_t family, const sockaddr* address, socklen_t length)
+{
+    return length >= sizeof(Address) && address->sa_family == family;
+}
+
+} // namespace
+
+extern "C" {
+
+int bind(int socket, const sockaddr* address, socklen_t length)
+{
+    static const auto sOriginal = reinterpret_cast<decltype(&::bind)>(::dlsym(RTLD_NEXT, "bind"));
+    sockaddr_storage changed{};
+    if (isA<sockaddr_in>(AF_INET, address, length)) {
+        auto& own = reinterpret_cast<sockaddr_in&>(changed);
+        std::memcpy(&own, address, sizeof(own));
+        if (own.sin_addr.s_addr == htonl(INADDR_ANY)) own.sin_addr.s_addr = htonl(INADDR_LOOPBACK);
+        return sOriginal(socket, reinterpret_cast<const sockaddr*>(&changed), sizeof(own));
+    }
+    if (isA<sockaddr_in6>(AF_INET6, address, length)) {
+        auto& own = reinterpret_cast<sockaddr_in6&>(changed);
+        std::memcpy(&own, address, sizeof(own));
+        if (IN6_IS_ADDR_UNSPECIFIED(&own.sin6_addr)) own.sin6_addr = in6addr_loopback;
+        return sOriginal(socket, reinterpret_cast<const sockaddr*>(&changed), sizeof(own));
+    }
+    return sOriginal(socket, address, length);
+}
+
+} // extern "C"
