@@ -940,6 +940,22 @@ TEST_F(EncryptedPair, AFailureToPutCiphertextIntoTheBufferIsFatal)
     EXPECT_EQ(mMemory.client().closeCount(), 1U);
 }
 
+TEST_F(EncryptedPair, NoMoreIsTakenFromUnderneathThanTheBufferHasRoomFor)
+{
+    writeText(mServer, "hello");
+    const std::size_t before = mMemory.client().bytesRead();
+    std::vector<std::size_t> transfers;
+    TlsCalls calls;
+    calls.BIO_ctrl_get_write_guarantee = [](BIO*) -> std::size_t { return 10; };
+    calls.BIO_write = [&transfers](BIO* bio, const void* data, int length) {
+        transfers.push_back(static_cast<std::size_t>(length));
+        return BIO_write(bio, data, length);
+    };
+    EXPECT_EQ(readSome(mClient, 5), "hello");
+    EXPECT_THAT(transfers, ElementsAre(10, 10, 7)); // a record of 27 bytes
+    EXPECT_EQ(mMemory.client().bytesRead(), before + 27);
+}
+
 TEST_F(EncryptedPair, ThePeersCertificateIsAllThereOrReportedAsAFailure)
 {
     TlsCalls calls;

@@ -46,6 +46,7 @@ TlsCalls::~TlsCalls() { tCurrent = mOuter; }
         return qel::test::dispatch(&qel::test::TlsCalls::name, sReal, __VA_ARGS__);                                    \
     }
 
+QEL_TEST_CALL(std::size_t, BIO_ctrl_get_write_guarantee, (BIO * bio), bio)
 QEL_TEST_CALL(int, BIO_new_bio_pair, (BIO * *first, std::size_t firstBytes, BIO** second, std::size_t secondBytes),
               first, firstBytes, second, secondBytes)
 QEL_TEST_CALL(int, BIO_read, (BIO * bio, void* buffer, int length), bio, buffer, length)

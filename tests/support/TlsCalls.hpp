@@ -34,6 +34,7 @@ public:
     TlsCalls(const TlsCalls&) = delete;
     TlsCalls& operator=(const TlsCalls&) = delete;
 
+    std::function<std::size_t(BIO* bio)> BIO_ctrl_get_write_guarantee;
     std::function<int(BIO** first, std::size_t firstBytes, BIO** second, std::size_t secondBytes)> BIO_new_bio_pair;
     std::function<int(BIO* bio, void* buffer, int length)> BIO_read;
     std::function<int(BIO* bio, const void* buffer, int length)> BIO_write;
