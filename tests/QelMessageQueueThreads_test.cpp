@@ -13,13 +13,16 @@
 #include <atomic>
 #include <chrono>
 #include <cstdint>
+#include <functional>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <map>
 #include <memory>
 #include <mutex>
+#include <ostream>
 #include <sstream>
 #include <stdexcept>
+#include <streambuf>
 #include <string>
 #include <thread>
 #include <utility>
@@ -149,6 +152,42 @@ TEST(QelMessageQueueThreads, LatenciesCountFromTheCallOfAProducerThatHadToWait)
                                          "  0-1ms:      1            0            0           \n"
                                          "  1-10ms:     0            0            0           \n"
                                          "  10-100ms:   1            1            1           \n"
+                                         "  100-1000ms: 0            1            1           \n"));
+}
+
+/// A stream that lets something happen when the first byte comes.
+class HookedOutput : private std::streambuf, public std::ostream {
+public:
+    explicit HookedOutput(std::function<void()> hook) : std::ostream(this), mHook(std::move(hook)) {}
+
+private:
+    int overflow(int character) override
+    {
+        if (mHook) std::exchange(mHook, nullptr)();
+        return character;
+    }
+
+    std::function<void()> mHook;
+};
+
+TEST(QelMessageQueueThreads, LatenciesCountFromTheCallOfAProducerThatHadToWaitForTheLock)
+{
+    SettableClock clock;
+    QelMessageQueue queue(0);
+    std::thread producer;
+    HookedOutput os([&] { // here the lock is held
+        producer = std::thread([&] { queue.enqueue(sized(32)); });
+        waitUntil([&] { return clock.steadyReads() == 1; });
+        clock.advance(50ms);
+    });
+    queue.dumpStatistics(os, Indent(0, ' '));
+    producer.join();
+    clock.advance(150ms);
+    queue.waitForMsg(0ms); // 150 ms at the head, 200 ms since its producer's call
+    EXPECT_THAT(dumpOf(queue), HasSubstr("              Enqueue      Dequeue      E2E         \n"
+                                         "  0-1ms:      0            0            0           \n"
+                                         "  1-10ms:     0            0            0           \n"
+                                         "  10-100ms:   1            0            0           \n"
                                          "  100-1000ms: 0            1            1           \n"));
 }
 

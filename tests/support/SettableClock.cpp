@@ -37,14 +37,16 @@ unsigned SettableClock::steadyReads() const { return mSteadyReads; }
 
 SystemClock::time_point SettableClock::pSystem()
 {
+    const SystemClock::rep now = mSystem;
     ++mSystemReads;
-    return SystemClock::time_point(SystemClock::duration(mSystem));
+    return SystemClock::time_point(SystemClock::duration(now));
 }
 
 SteadyClock::time_point SettableClock::pSteady()
 {
+    const SteadyClock::rep now = mSteady;
     ++mSteadyReads;
-    return SteadyClock::time_point(SteadyClock::duration(mSteady));
+    return SteadyClock::time_point(SteadyClock::duration(now));
 }
 
 } // namespace qel::test

@@ -22,7 +22,7 @@ public:
     /// Moves both clocks, forwards or, with a negative duration, backwards.
     void advance(std::chrono::nanoseconds duration);
 
-    /// @return how often each clock has been read
+    /// @return how often each clock has been read; who sees a reading counted may move the clock without changing it
     unsigned systemReads() const;
     unsigned steadyReads() const;
 
