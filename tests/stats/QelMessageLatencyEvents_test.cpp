@@ -122,6 +122,21 @@ TEST_F(QelMessageLatencyEventsTest, AnotherSlowMessageExtendsTheEvent)
                          "    Avg Latency:    317000 us\n");
 }
 
+TEST_F(QelMessageLatencyEventsTest, AMessageAtTheThresholdExtendsOneAndAnyBelowWaitsForIt)
+{
+    trace(1, 300ms);
+    trace(2, 249999999ns);
+    EXPECT_EQ(shortForm(), "A1-1x1");
+    trace(3, 250000000ns);
+    EXPECT_EQ(shortForm(), "A1-3x3");
+    mClock.advance(10s);
+    trace(4, 250000000ns); // slow, so it closes nothing
+    EXPECT_EQ(shortForm(), "A1-4x4");
+    mClock.advance(10s);
+    trace(5, 249999999ns);
+    EXPECT_EQ(shortForm(), "C1-4x4");
+}
+
 TEST_F(QelMessageLatencyEventsTest, FastMessagesJoinWhenASlowOneShowsThatItWentOn)
 {
     trace(1, 300ms);
