@@ -262,6 +262,14 @@ TYPED_TEST(SSLContextNewOfEachSide, WritesRecordByRecord)
     EXPECT_EQ(SSL_CTX_get_mode(handleOf(context)) & SSL_MODE_ACCEPT_MOVING_WRITE_BUFFER, 0);
 }
 
+TYPED_TEST(SSLContextNewOfEachSide, LeavesTheSecurityLevelToOpenSSL)
+{
+    const SSL_CTX_PTR untouched(SSL_CTX_new(TLS_method()));
+    TypeParam context;
+    EXPECT_EQ(SSL_CTX_get_security_level(handleOf(context)), SSL_CTX_get_security_level(untouched.get()));
+    EXPECT_EQ(SSL_get_security_level(context.allocateConnection().get()), SSL_CTX_get_security_level(untouched.get()));
+}
+
 TYPED_TEST(SSLContextNewOfEachSide, TrustsAndPresentsNothing)
 {
     TypeParam context;
