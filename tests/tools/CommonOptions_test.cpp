@@ -97,6 +97,44 @@ TEST(CommonOptions, BadConnectOptionsAreRefused)
         EXPECT_NE(parse(arguments).status, 0) << CLI::detail::join(arguments, " ");
 }
 
+TEST(CommonOptions, EndpointsAreAccepted)
+{
+    const CLI::Validator endpoint = tool::endpointValidator();
+    for (const char* text : {"127.0.0.1:0", "127.0.0.1:65535", "10.0.0.1:080", "[::1]:4711", "[fe80::1]:1"})
+        EXPECT_EQ(endpoint(text), "") << text;
+}
+
+TEST(CommonOptions, WhatIsNoEndpointIsToldWhy)
+{
+    struct Row {
+        const char* text;
+        const char* reason;
+    };
+    const CLI::Validator endpoint = tool::endpointValidator();
+    for (const Row& row : {
+             Row{"", "the port is missing"},
+             Row{"127.0.0.1", "the port is missing"},
+             Row{"[]", "the port is missing"},
+             Row{"[::1]", "the port is missing"},
+             Row{":", "the port behind the last ':' is missing"},
+             Row{"127.0.0.1:", "the port behind the last ':' is missing"},
+             Row{"[::1]:", "the port behind the last ':' is missing"},
+             Row{"127.0.0.1:65536", "'65536' is no port from 0 to 65535"},
+             Row{"127.0.0.1:99999999999999999999", "'99999999999999999999' is no port from 0 to 65535"},
+             Row{"127.0.0.1:http", "'http' is no port from 0 to 65535"},
+             Row{"127.0.0.1:+5", "'+5' is no port from 0 to 65535"},
+             Row{"::1:80", "an IPv6 address stands in brackets"},
+             Row{"localhost:80", "'localhost' is no IP address; names are not looked up"},
+             Row{" 127.0.0.1:80", "' 127.0.0.1' is no IP address; names are not looked up"},
+             Row{"[::g]:80", "'[::g]' is no IP address; names are not looked up"},
+             Row{"[127.0.0.1]:80", "'[127.0.0.1]' is no IP address; names are not looked up"},
+             Row{":80", "'' is no IP address; names are not looked up"},
+         }) {
+        EXPECT_EQ(endpoint(row.text), std::string("'") + row.text +
+                                          "' is no endpoint, such as 127.0.0.1:4711 or [::1]:4711: " + row.reason);
+    }
+}
+
 TEST(CommonOptions, ANumberIsBetweenItsLimits)
 {
     const CLI::Validator between = tool::numberBetween(0.5, 2);

@@ -12,14 +12,35 @@ constexpr std::size_t kToolIdBytes = 32;
 constexpr double kShortestTimeout = 0.001;
 constexpr double kLongestTimeout = 24 * 60 * 60;
 
-std::string checkEndpoint(std::string& text)
+bool isEndpoint(const std::string& text)
 {
     try {
         static_cast<void>(IPEndpoint(text));
-    } catch (const std::exception& error) {
-        return "'" + text + "' is no endpoint: " + error.what();
+        return true;
+    } catch (const std::exception&) {
+        return false;
     }
-    return {};
+}
+
+/// Why a text is no endpoint. What the library says is for those who know its parser: it takes any host that is no IPv4
+/// address for an IPv6 address, and for a missing port it has no text of its own.
+std::string reasonAgainst(const std::string& endpoint)
+{
+    const std::size_t colon = endpoint.rfind(':');
+    const bool endsWithHost = colon == std::string::npos || endpoint.back() == ']';
+    if (endsWithHost) return "the port is missing";
+    if (colon + 1 == endpoint.size()) return "the port behind the last ':' is missing";
+    const std::string port = endpoint.substr(colon + 1);
+    if (!isEndpoint("0.0.0.0:" + port)) return "'" + port + "' is no port from 0 to 65535";
+    const std::string host = endpoint.substr(0, colon);
+    if (isEndpoint("[" + host + "]:0")) return "an IPv6 address stands in brackets";
+    return "'" + host + "' is no IP address; names are not looked up";
+}
+
+std::string checkEndpoint(std::string& text)
+{
+    if (isEndpoint(text)) return {};
+    return "'" + text + "' is no endpoint, such as 127.0.0.1:4711 or [::1]:4711: " + reasonAgainst(text);
 }
 
 std::string checkToolId(std::string& text)
