@@ -225,7 +225,7 @@ TEST(CallFaults, GarbageIsExitStatusFive)
     });
     const auto result = server.call({"time"});
     EXPECT_EQ(result.exitStatus, 5);
-    EXPECT_EQ(result.errors, "qel: Invalid length\n");
+    EXPECT_EQ(result.errors, "qel: the other end broke the protocol: Invalid length\n");
 }
 
 TEST(CallFaults, AnAnswerToAnotherRequestIsExitStatusFive)

@@ -484,7 +484,7 @@ TEST(Console, BytesThatAreNoFrameBreakTheProtocol)
     PtyProcess person(consoleTo(hypervisor.endpoint(), {"1"}));
     const auto result = person.wait();
     EXPECT_EQ(result.exitStatus, 5);
-    EXPECT_THAT(result.screen, EndsWith("qel: Invalid length\r\n"));
+    EXPECT_THAT(result.screen, EndsWith("qel: the other end broke the protocol: Invalid length\r\n"));
     EXPECT_TRUE(person.isTerminalUntouched());
 }
 

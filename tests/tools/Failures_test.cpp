@@ -101,6 +101,35 @@ TEST(Failures, TheExplanationGoesDownToTheCause)
     EXPECT_EQ(tool::explain(StreamIOException("EOF")), "EOF");
 }
 
+TEST(Failures, TheComplaintSaysWhatThePhraseOfTheLibraryMeans)
+{
+    struct Row {
+        std::function<void()> fail;
+        std::string text;
+    };
+    for (const Row& row : {
+             Row{[] { throw CommandFailure(ExitStatus::ClosedByPeer, "own words"); }, "own words"},
+             Row{[] { throw RequestRefused("x", refusal()); },
+                 "x refused: 0x00000012 (QelMessageStatusTooManyConnections)"},
+             Row{[] { throw QelMessageValidationException("Invalid length"); },
+                 "the other end broke the protocol: Invalid length"},
+             Row{[] { throw StreamIOException("I/O deadline"); }, "the other end did not answer in time: I/O deadline"},
+             Row{[] { throwStreamFailure(EAGAIN); },
+                 "the other end did not answer in time: socket stream receive failure: socket stream failed to "
+                 "receive: 11 (Resource temporarily unavailable)"},
+             Row{[] { throw StreamIOException("EOF"); }, "connection lost: EOF"},
+             Row{[] { throw PosixError(ENOSPC, "x"); }, "x: 28 (No space left on device)"},
+         }) {
+        SCOPED_TRACE(row.text);
+        try {
+            row.fail();
+            ADD_FAILURE() << "nothing was thrown";
+        } catch (const std::exception& error) {
+            EXPECT_EQ(tool::complain(error), row.text);
+        }
+    }
+}
+
 TEST(Failures, ACauseThatIsNoExceptionIsSaidToBeUnknown)
 {
     try {

@@ -68,4 +68,19 @@ std::string explain(const std::exception& error)
     return text;
 }
 
+std::string complain(const std::exception& error)
+{
+    if (dynamic_cast<const CommandFailure*>(&error) != nullptr) return explain(error);
+    switch (exitStatusOf(error)) {
+    case ExitStatus::ProtocolBroken:
+        return "the other end broke the protocol: " + explain(error);
+    case ExitStatus::DeadlinePassed:
+        return "the other end did not answer in time: " + explain(error);
+    case ExitStatus::ClosedByPeer:
+        return "connection lost: " + explain(error);
+    default:
+        return explain(error);
+    }
+}
+
 } // namespace qel::tool

@@ -18,7 +18,7 @@ constexpr const char* kVersionText = "qel " QEL_PROGRAM_VERSION;
 
 ExitStatus report(const std::exception& error)
 {
-    std::cerr << "qel: " << explain(error) << std::endl;
+    std::cerr << "qel: " << complain(error) << std::endl;
     return exitStatusOf(error);
 }
 
