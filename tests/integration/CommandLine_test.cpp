@@ -56,6 +56,16 @@ TEST(CommandLine, HelpAndVersionStandAtEveryLevel)
     }
 }
 
+TEST(CommandLine, HelpThatCannotBePrintedIsAFailure)
+{
+    for (const std::string arguments : {"--help", "--version", "call --help", "call version --version"}) {
+        SCOPED_TRACE(arguments);
+        const auto result = run({"/bin/sh", "-c", "exec \"$0\" " + arguments + " >/dev/full", QEL_PROGRAM});
+        EXPECT_EQ(result.exitStatus, 4);
+        EXPECT_EQ(result.errors, "qel: cannot write to standard output\n");
+    }
+}
+
 TEST(CommandLine, AnythingThatCannotBeCarriedOutIsUsage)
 {
     const TemporaryDirectory directory;

@@ -28,7 +28,9 @@ ExitStatus parseAndRun(CLI::App& app, Action& action, int argc, const char* cons
         app.parse(argc, argv);
     } catch (const CLI::ParseError& error) {
         // The parser knows many ways to be wrong and the text for each; all of them are one exit status.
-        return app.exit(error) == 0 ? ExitStatus::Done : ExitStatus::Usage;
+        if (app.exit(error) != 0) return ExitStatus::Usage;
+        flushOutput(); // the help or the version
+        return ExitStatus::Done;
     }
     const ExitStatus status = action ? action() : ExitStatus::Usage;
     flushOutput();
