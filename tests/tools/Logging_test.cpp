@@ -35,11 +35,12 @@ TEST_F(LoggingTest, LinesOfTheProgramAreToldFromTheLibrarys)
 
 TEST_F(LoggingTest, AQuietCommandLogsNothingUnlessAsked)
 {
-    tool::startLogging(LogOptions(), "name.log", LogLevel::Info, true);
-    EXPECT_THAT(QelLogger::get().getBackends(), IsEmpty());
     LogOptions options;
+    options.quiet = true;
+    tool::startLogging(options, "name.log");
+    EXPECT_THAT(QelLogger::get().getBackends(), IsEmpty());
     options.level = "debug";
-    tool::startLogging(options, "name.log", LogLevel::Info, true);
+    tool::startLogging(options, "name.log");
     EXPECT_EQ(QelLogger::get().getBackends().size(), 1U);
     EXPECT_EQ(QelLogger::get().getEffectiveLevel(), LogLevel::Debug);
 }
@@ -48,7 +49,7 @@ TEST_F(LoggingTest, WithADirectoryTheLogIsAFile)
 {
     LogOptions options;
     options.directory = directory.path();
-    tool::startLogging(options, "name.log", LogLevel::Info, false);
+    tool::startLogging(options, "name.log");
     tool::logLine(LogLevel::Info, "in the file");
     tool::logLine(LogLevel::Debug, "not in the file");
     const std::string text = Utilities::readFile(directory.file("name.log"));
@@ -60,7 +61,7 @@ TEST_F(LoggingTest, WithoutADirectoryTheLogIsStandardError)
 {
     LogOptions options;
     options.level = "error";
-    tool::startLogging(options, "name.log", LogLevel::Info, false);
+    tool::startLogging(options, "name.log");
     ::testing::internal::CaptureStderr();
     tool::logLine(LogLevel::Error, "to be seen");
     tool::logLine(LogLevel::Warn, "not to be seen");
@@ -81,7 +82,16 @@ TEST_F(LoggingTest, TheOptionsAreChecked)
         {{"--log-level", "WARN"}, true},
         {{"--log-level", "0"}, true},
         {{"--log-level", "loud"}, false},
+        {{"--log-level", "c"}, true},
+        {{"--log-level", "4"}, true},
         {{"--log-level", "5"}, false},
+        {{"--log-level", "1x"}, false},
+        {{"--log-level", "03"}, false},
+        {{"--log-level", " 3"}, false},
+        {{"--log-level", ""}, false},
+        {{"--log-level", "-1"}, false},
+        {{"--log-level", "^"}, false},
+        {{"--log-level", "inherit"}, false},
         {{"--log-dir", directory.path()}, true},
         {{"--log-dir", directory.file("missing")}, false},
         {{"--log-size", "4096"}, true},
@@ -100,6 +110,33 @@ TEST_F(LoggingTest, TheOptionsAreChecked)
         }
         EXPECT_EQ(good, entry.good);
     }
+}
+
+TEST_F(LoggingTest, TheHelpSaysWhatIsLoggedWithoutTheOptions)
+{
+    LogOptions loud;
+    CLI::App loudApp;
+    tool::addLogOptions(loudApp, loud);
+    EXPECT_EQ(loudApp.get_option("--log-level")->get_description(),
+              "Write lines of this level and above: debug, info, warn, error or critical; info unless given");
+    LogOptions quiet;
+    quiet.usual = LogLevel::Warn;
+    quiet.quiet = true;
+    CLI::App quietApp;
+    tool::addLogOptions(quietApp, quiet);
+    EXPECT_EQ(quietApp.get_option("--log-level")->get_description(),
+              "Write lines of this level and above: debug, info, warn, error or critical; nothing is written unless "
+              "this or --log-dir is given, then warn");
+}
+
+TEST_F(LoggingTest, WithADirectoryAQuietCommandLogsFromItsUsualLevelOn)
+{
+    LogOptions options;
+    options.quiet = true;
+    options.usual = LogLevel::Warn;
+    options.directory = directory.path();
+    tool::startLogging(options, "name.log");
+    EXPECT_EQ(QelLogger::get().getEffectiveLevel(), LogLevel::Warn);
 }
 
 } // namespace

@@ -126,7 +126,7 @@ void watchRun(BenchRun& run, const BenchLoad& load, SignalWatch& signals)
 
 ExitStatus runBench(const BenchOptions& options, const BenchLoad& load)
 {
-    startLogging(options.log, "qel-bench.log", LogLevel::Warn, true);
+    startLogging(options.log, "qel-bench.log");
     auto pairs = connectPairs(options);
     SignalWatch signals(kStopSignals);
     BenchRun run(std::move(pairs), load);
@@ -177,8 +177,15 @@ CLI::App& addBenchCommand(CLI::App& parent, Action& action)
     CLI::App& command = addCommand(parent, "bench", "Put load on a hypervisor end and measure how it answers");
     const auto options = std::make_shared<BenchOptions>();
     addConnectOptions(command, options->connect);
+    command.get_option("--timeout")->description("Seconds for each connection to be made, and then for each message");
+    command.get_option("--tool-id")
+        ->description(
+            "What the ids begin with that the consoles introduce themselves with, at most 28 bytes; a dash and "
+            "a number follow; qel-<process id> unless given");
     addLoadOptions(command, *options);
     addJsonOption(command, options->json);
+    options->log.usual = LogLevel::Warn;
+    options->log.quiet = true;
     addLogOptions(command, options->log);
     command.callback([&action, options] {
         checkTransport(options->connect.transport, options->connect.endpoint);

@@ -327,10 +327,11 @@ CLI::App& addSubcommand(CLI::App& command, Action& action, const Options& option
 {
     CLI::App& subcommand = addCommand(command, name, description);
     subcommand.fallthrough(); // so that the options of "ca" may also stand behind the subcommand
+    subcommand.footer("The options of \"qel ca\", such as --log-level, may also stand here.");
     addJsonOption(subcommand, options->json);
     subcommand.callback([&action, options, makeAction = std::move(makeAction)] {
         action = [options, run = makeAction()] {
-            startLogging(options->log, "qel-ca.log", LogLevel::Error, true);
+            startLogging(options->log, "qel-ca.log");
             static_cast<void>(std::signal(SIGXFSZ, SIG_IGN)); // a file that grows too large is an error, not the end
             return run();
         };
@@ -466,6 +467,8 @@ CLI::App& addCaCommand(CLI::App& parent, Action& action)
 {
     CLI::App& command = addCommand(parent, "ca", "Be a small certificate authority");
     const auto options = std::make_shared<CaOptions>();
+    options->log.usual = LogLevel::Error;
+    options->log.quiet = true;
     addLogOptions(command, options->log);
     command.require_subcommand(1);
 

@@ -72,7 +72,7 @@ std::unique_ptr<QelMessage> callRequest(ClientConnection& connection, const Iden
 
 ExitStatus runCall(const CallOptions& options, const CallRequest& request)
 {
-    startLogging(options.log, "qel-call.log", LogLevel::Warn, true);
+    startLogging(options.log, "qel-call.log");
     const auto connection = ClientConnection::connect(options.connect);
     try {
         const auto response = callRequest(*connection, options.connect.identity, request);
@@ -92,6 +92,7 @@ CLI::App& addRequest(CLI::App& command, Action& action, const std::shared_ptr<Ca
 {
     CLI::App& request = addCommand(command, name, description);
     request.fallthrough(); // so that the options of "call" may also stand behind the request
+    request.footer("The options of \"qel call\", such as --connect and --json, may also stand here.");
     request.callback([&action, call, make = std::move(make)] {
         checkTransport(call->options.connect.transport, call->options.connect.endpoint);
         action = [call, make] { return runCall(call->options, make(call->arguments)); };
@@ -197,6 +198,8 @@ CLI::App& addCallCommand(CLI::App& parent, Action& action)
     const auto call = std::make_shared<Call>();
     addConnectOptions(command, call->options.connect);
     addJsonOption(command, call->options.json);
+    call->options.log.usual = LogLevel::Warn;
+    call->options.log.quiet = true;
     addLogOptions(command, call->options.log);
     command.require_subcommand(1);
 

@@ -140,7 +140,7 @@ ExitStatus conclude(const ConsoleLoop::Outcome& outcome, const ConsoleSession& s
 
 ExitStatus runConsole(const ConsoleOptions& options)
 {
-    startLogging(options.log, "qel-console.log", LogLevel::Warn, true);
+    startLogging(options.log, "qel-console.log");
     static_cast<void>(std::signal(SIGPIPE, SIG_IGN)); // nobody reads the output: still the terminal is to be put back
     TerminalMode mode(STDIN_FILENO);
     ConsoleScreen screen(STDOUT_FILENO, std::cerr, ::isatty(STDERR_FILENO) == 1, mode);
@@ -188,6 +188,9 @@ CLI::App& addConsoleCommand(CLI::App& parent, Action& action)
         ->type_name("PARTITION")
         ->check(CLI::Range(0, 65535));
     addConnectOptions(command, options->connect);
+    command.get_option("--timeout")
+        ->description("Seconds for connecting and opening the session together, and then for each answer and for each "
+                      "message that has begun");
     command.add_option("--connection", options->address.connection, "Number of the serial connection")
         ->type_name("N")
         ->check(CLI::Range(0, 65535))
@@ -195,6 +198,8 @@ CLI::App& addConsoleCommand(CLI::App& parent, Action& action)
     command.add_flag("--force", options->force, "Take the session from the console that holds it");
     addEscape(command, *options);
     addInputOptions(command, *options);
+    options->log.usual = LogLevel::Warn;
+    options->log.quiet = true;
     addLogOptions(command, options->log);
     command.footer(kFooter);
     command.callback([&action, options] {

@@ -141,8 +141,7 @@ std::string checkFile(std::string& name)
 
 ExitStatus runDecode(const DecodeOptions& options)
 {
-    // What is wrong with a frame is said once, in the answer; the library's own lines about it come on demand.
-    startLogging(options.log, "qel-decode.log", LogLevel::Error, true);
+    startLogging(options.log, "qel-decode.log");
     std::ios::sync_with_stdio(false); // else a failure to read cannot be told from the end of the input
     if (options.file == "-") return decodeFrames(std::cin, options.notation, options.json, std::cout, std::cerr);
 
@@ -189,6 +188,9 @@ CLI::App& addDecodeCommand(CLI::App& parent, Action& action)
             "The input is hexadecimal text; # begins a comment, digits before ':' are an address")
         ->excludes(raw);
     addJsonOption(command, options->json);
+    // What is wrong with a frame is said once, in the answer; the library's own lines about it come on demand.
+    options->log.usual = LogLevel::Error;
+    options->log.quiet = true;
     addLogOptions(command, options->log);
     command.callback([&action, options] { action = [options] { return runDecode(*options); }; });
     return command;

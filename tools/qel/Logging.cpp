@@ -2,9 +2,11 @@
 
 #include <qel/common/LogBackendFiltered.hpp>
 #include <qel/common/LogBackendRotating.hpp>
+#include <qel/common/Utilities.hpp>
 
 #include "TerminalMode.hpp"
 
+#include <cctype>
 #include <cstdio>
 #include <exception>
 #include <memory>
@@ -29,14 +31,29 @@ private:
     }
 };
 
-std::string checkLevel(std::string& text)
+/// Stricter than the library, which takes a text that begins with a number, and the level of a parent for a level.
+bool isLevel(const std::string& text)
 {
     try {
-        static_cast<void>(LogLevel::parse(text));
+        const LogLevel::Level level = LogLevel::parse(text);
+        const bool isName = std::isalpha(static_cast<unsigned char>(text.front())) != 0;
+        return level != LogLevel::Inherit && (isName || text.size() == 1);
     } catch (const std::exception&) {
-        return "'" + text + "' is no log level: debug, info, warn, error or critical";
+        return false;
     }
-    return {};
+}
+
+std::string checkLevel(std::string& text)
+{
+    return isLevel(text) ? std::string() : "'" + text + "' is no log level: debug, info, warn, error or critical";
+}
+
+std::string describeLevels(const LogOptions& options)
+{
+    const std::string usual = Utilities::lowercase(LogLevel::getName(options.usual));
+    return "Write lines of this level and above: debug, info, warn, error or critical; " +
+           (options.quiet ? "nothing is written unless this or --log-dir is given, then " + usual
+                          : usual + " unless given");
 }
 
 } // namespace
@@ -45,9 +62,9 @@ void addLogOptions(CLI::App& app, LogOptions& options)
 {
     app.add_option("--log-dir", options.directory,
                    "Write the log to files in this directory, five of them at most; without it, to standard error")
-        ->type_name("")
-        ->check(CLI::ExistingDirectory);
-    app.add_option("--log-level", options.level, "Write lines of this level and above")
+        ->type_name("DIR")
+        ->check(CLI::Validator(CLI::ExistingDirectory).description(""));
+    app.add_option("--log-level", options.level, describeLevels(options))
         ->type_name("LEVEL")
         ->check(CLI::Validator(checkLevel, ""));
     app.add_option("--log-size", options.fileBytes, "Bytes that one log file may hold")
@@ -56,10 +73,10 @@ void addLogOptions(CLI::App& app, LogOptions& options)
         ->capture_default_str();
 }
 
-void startLogging(const LogOptions& options, const std::string& name, LogLevel::Level level, bool quiet)
+void startLogging(const LogOptions& options, const std::string& name)
 {
-    if (quiet && options.directory.empty() && options.level.empty()) return;
-    QelLogger::get().setLevel(options.level.empty() ? level : LogLevel::parse(options.level));
+    if (options.quiet && options.directory.empty() && options.level.empty()) return;
+    QelLogger::get().setLevel(options.level.empty() ? options.usual : LogLevel::parse(options.level));
     if (options.directory.empty()) {
         LogBackend::registerBackend(std::make_shared<LogBackendStderr>());
     } else {

@@ -15,16 +15,18 @@ struct LogOptions {
     std::string directory; ///< of the rotating files; empty: standard error
     std::string level;     ///< as LogLevel::parse() takes it; empty: not said
     std::size_t fileBytes = 1024 * 1024;
+
+    LogLevel::Level usual = LogLevel::Info; ///< the level unless one is said
+    bool quiet = false; ///< without any of the options nothing is logged: for commands whose output is their answer
 };
 
-/// Adds --log-dir, --log-level and --log-size.
+/// Adds --log-dir, --log-level and --log-size. The help says what is logged unless they are given, so `usual` and
+/// `quiet` have to be set before.
 void addLogOptions(CLI::App& app, LogOptions& options);
 
 /// Gives the root logger its back-end and level.
 /// @param name  of the log file within the directory
-/// @param quiet  without any of the options nothing is logged at all: for commands whose output is their answer
-/// @param level  taken when the options name none
-void startLogging(const LogOptions& options, const std::string& name, LogLevel::Level level, bool quiet);
+void startLogging(const LogOptions& options, const std::string& name);
 
 /// The logger of this program's own lines, which tells them from the library's: "[qel] ".
 /// Thread safety: any thread.

@@ -195,7 +195,7 @@ int serveUntilStopped(Server& server, SignalWatch& signals, const TransportOptio
 
 ExitStatus runServe(const ServePlan& plan)
 {
-    startLogging(plan.log, "qel-serve.log", LogLevel::Info, false);
+    startLogging(plan.log, "qel-serve.log");
     static_cast<void>(std::signal(SIGPIPE, SIG_IGN)); // a log that nobody reads any more must not end the server
     SignalWatch signals(kSignals);
     auto context = makeServerContext(plan.transport);
