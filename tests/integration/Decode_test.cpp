@@ -1,5 +1,7 @@
 // "qel decode" as a program: files, pipes and exit statuses. What it prints is tested with DecodeCommand.
 
+#include <qel/common/Utilities.hpp>
+
 #include "integration/TestConsole.hpp"
 #include "support/GoldenFrame.hpp"
 #include "support/TemporaryDirectory.hpp"
@@ -88,6 +90,21 @@ TEST_F(DecodeTest, HexadecimalTextIsRead)
         EXPECT_EQ(result.exitStatus, 0);
         EXPECT_EQ(result.output, decode(goldenFrames()).output);
     }
+}
+
+TEST_F(DecodeTest, TheFilesOfGoldenFramesAreRead)
+{
+    std::string together;
+    for (const std::string& name : GoldenFrame::allNames()) {
+        SCOPED_TRACE(name);
+        const std::string path = std::string(QEL_SOURCE_DIR "/vectors/") + name + ".txt";
+        const auto result = runQel({"decode", path});
+        EXPECT_EQ(result.exitStatus, 0);
+        EXPECT_EQ(result.output, decode(GoldenFrame::load(name).bytes()).output);
+        EXPECT_THAT(result.errors, IsEmpty());
+        together += Utilities::readFile(path);
+    }
+    EXPECT_EQ(decode(together).output, decode(goldenFrames()).output);
 }
 
 TEST_F(DecodeTest, ABadFrameMakesTheAnswerNo)

@@ -125,9 +125,12 @@ TEST_F(DecodeCommandTest, ABadFrameIsNamedAndTheNextOneStillPrinted)
 
 TEST_F(DecodeCommandTest, GarbageIsABadFrame)
 {
-    EXPECT_EQ(decode("no frame"), ExitStatus::Refused);
+    EXPECT_EQ(decode("\x01 is no frame"), ExitStatus::Refused);
     EXPECT_EQ(output.str(), "");
     EXPECT_EQ(errors.str(), "qel: bad frame at offset 0: i_buffer bad eyecatcher\n");
+    EXPECT_EQ(decode("no frame"), ExitStatus::Refused);
+    EXPECT_EQ(output.str(), "");
+    EXPECT_EQ(errors.str(), "qel: bad frame at offset 0: line 1: 'n' is no hexadecimal digit\n");
 }
 
 TEST_F(DecodeCommandTest, ACutFrameIsABadFrame)

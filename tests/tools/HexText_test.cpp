@@ -55,6 +55,15 @@ INSTANTIATE_TEST_SUITE_P(
         Row{"Prefixes", "0xDE 0XCA 0xFF20", "DECAFF20"}, Row{"AByteThatLooksLikeHalfAPrefix", "0f 00", "0F00"},
         Row{"Comments", "# first\nDE # 01\n#\nCA#FF", "DECA"}, Row{"OnlyAComment", "# nothing", ""},
         Row{"Addresses", "0000: DE CA\n  0002:FF\n0000000a: 20", "DECAFF20"}, Row{"AnAddressAlone", "0000:\nDE", "DE"},
+        Row{"AGoldenFrame",
+            "name: Any\nclass: Abc\nheader.mFlags: 0x80\npayload.mText: \"0000  AA\"\nframe:\n"
+            "0000  DE CA FF                 # mDesc: eyecatcher\n0003  20                       # mHeaderVersion\n",
+            "DECAFF20"},
+        Row{"GoldenFramesBehindEachOther", "name: a\nframe:\n0000  DE\nname: b\nclass: c\nframe:\n0000  CA # x\n",
+            "DECA"},
+        Row{"AGoldenFrameBehindPlainText", "0000: DE\nname: a\nframe:\n0000  CA", "DECA"},
+        Row{"AGoldenFrameWithCarriageReturns", "name: a\r\nframe:\r\n0000  DE # x\r\n\r\n0001  CA\r\n", "DECA"},
+        Row{"AnAddressAloneInAGoldenFrame", "name: a\nframe:\n0000\n0000 # none\n 0000  DE", "DE"},
         Row{"AnAddressThatIsAComment", "#0000: CA\nDE", "DE"}, Row{"NoEndOfTheLastLine", "DE\nCA", "DECA"}),
     [](const auto& row) { return row.param.name; });
 
@@ -75,18 +84,22 @@ TEST_P(HexTextRefused, WithTheNumberOfItsLine)
 
 INSTANTIATE_TEST_SUITE_P(
     All, HexTextRefused,
-    ::testing::Values(BadRow{"ALetter", "DE CX", "line 1: 'X' is no hexadecimal digit"},
-                      BadRow{"OnALaterLine", "DE\n# x\n\nCA FF\nxy", "line 5: 'x' is no hexadecimal digit"},
-                      BadRow{"APrefixAlone", "0x", "line 1: 'x' is no hexadecimal digit"},
-                      BadRow{"APrefixWithin", "DE0xCA", "line 1: 'x' is no hexadecimal digit"},
-                      BadRow{"ASeparator", "DE,CA", "line 1: ',' is no hexadecimal digit"},
-                      BadRow{"AnAddressWithin", "DE 00: CA", "line 1: ':' is no hexadecimal digit"},
-                      BadRow{"AControlCharacter", "DE \x1B[2J", "line 1: '\\x1b' is no hexadecimal digit"},
-                      BadRow{"AByteThatIsNoAscii", "DE \xC3\x84", "line 1: '\\xc3' is no hexadecimal digit"},
-                      BadRow{"HalfAByte", "DE C", "line 1: 'C' is not a whole number of bytes"},
-                      BadRow{"HalfAByteInAWord", "DECAFF2", "line 1: 'DECAFF2' is not a whole number of bytes"},
-                      BadRow{"HalfAByteBehindAPrefix", "0x123", "line 1: '123' is not a whole number of bytes"},
-                      BadRow{"AByteOverTwoLines", "D\nE", "line 1: 'D' is not a whole number of bytes"}),
+    ::testing::Values(
+        BadRow{"AGoldenFrameWithoutRows", "name: a\nclass: b", "line 2: the line 'frame:' is missing behind it"},
+        BadRow{"AMistakeInAGoldenFrame", "name: a\nframe:\n0000  D", "line 3: 'D' is not a whole number of bytes"},
+        BadRow{"TheHeadOfAGoldenFrameAlone", "class: b", "line 1: 'l' is no hexadecimal digit"},
+        BadRow{"ALetter", "DE CX", "line 1: 'X' is no hexadecimal digit"},
+        BadRow{"OnALaterLine", "DE\n# x\n\nCA FF\nxy", "line 5: 'x' is no hexadecimal digit"},
+        BadRow{"APrefixAlone", "0x", "line 1: 'x' is no hexadecimal digit"},
+        BadRow{"APrefixWithin", "DE0xCA", "line 1: 'x' is no hexadecimal digit"},
+        BadRow{"ASeparator", "DE,CA", "line 1: ',' is no hexadecimal digit"},
+        BadRow{"AnAddressWithin", "DE 00: CA", "line 1: ':' is no hexadecimal digit"},
+        BadRow{"AControlCharacter", "DE \x1B[2J", "line 1: '\\x1b' is no hexadecimal digit"},
+        BadRow{"AByteThatIsNoAscii", "DE \xC3\x84", "line 1: '\\xc3' is no hexadecimal digit"},
+        BadRow{"HalfAByte", "DE C", "line 1: 'C' is not a whole number of bytes"},
+        BadRow{"HalfAByteInAWord", "DECAFF2", "line 1: 'DECAFF2' is not a whole number of bytes"},
+        BadRow{"HalfAByteBehindAPrefix", "0x123", "line 1: '123' is not a whole number of bytes"},
+        BadRow{"AByteOverTwoLines", "D\nE", "line 1: 'D' is not a whole number of bytes"}),
     [](const auto& row) { return row.param.name; });
 
 TEST(HexText, RefusingIsAnswerNo)
@@ -123,12 +136,12 @@ TEST(HexText, WhatStandsBeforeAMistakeIsRead)
 
 TEST(HexText, IsToldFromRawFramesByItsFirstCharacter)
 {
-    for (const char* const text : {"DE", "de", "00", "# comment", " ", "\n", "\t", "\r", "0x"}) {
+    for (const char* const text : {"DE", "de", "00", "# comment", " ", "\n", "\t", "\r", "0x", "name: a", "x", "~"}) {
         std::istringstream stream(text);
         EXPECT_TRUE(looksLikeHexText(stream)) << text;
         EXPECT_EQ(stream.get(), static_cast<unsigned char>(text[0])) << "nothing was taken";
     }
-    for (const char* const text : {"", "\xDE\xCA\xFF", "x", "-", "\x7F", "G"}) {
+    for (const char* const text : {"", "\xDE\xCA\xFF", "\x7F", "\x1F", "\xFF"}) {
         std::istringstream stream(text);
         EXPECT_FALSE(looksLikeHexText(stream)) << text;
     }

@@ -185,7 +185,8 @@ CLI::App& addDecodeCommand(CLI::App& parent, Action& action)
     command
         .add_flag_callback(
             "--hex", [options] { options->notation = FrameNotation::Hex; },
-            "The input is hexadecimal text; # begins a comment, digits before ':' are an address")
+            "The input is hexadecimal text; # begins a comment, digits before ':' are an address. Golden frames are "
+            "such text, too")
         ->excludes(raw);
     addJsonOption(command, options->json);
     // What is wrong with a frame is said once, in the answer; the library's own lines about it come on demand.

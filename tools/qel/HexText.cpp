@@ -13,6 +13,10 @@ namespace {
 
 constexpr const char* kBlanks = " \t\r\v\f";
 
+// The first line of a golden frame, and the one before its rows.
+constexpr const char* kGoldenBegin = "name:";
+constexpr const char* kGoldenRows = "frame:";
+
 bool isHexDigit(char c) { return std::isxdigit(static_cast<unsigned char>(c)) != 0; }
 
 int valueOf(char digit)
@@ -43,6 +47,15 @@ void dropAddress(std::string& line)
     if (end > begin && end < line.size() && line[end] == ':') line.erase(0, end + 1);
 }
 
+/// Takes the first word off the line: the address of a row that ends it with a blank alone.
+void dropFirstWord(std::string& line)
+{
+    const std::size_t begin = std::min(line.find_first_not_of(kBlanks), line.size());
+    line.erase(0, line.find_first_of(kBlanks, begin));
+}
+
+bool beginsWith(const std::string& line, const char* text) { return line.rfind(text, 0) == 0; }
+
 /// The digits of one word, without the "0x" it may begin with.
 std::string digitsOf(const std::string& word, std::size_t lineNumber)
 {
@@ -71,11 +84,30 @@ HexTextBuffer::int_type HexTextBuffer::underflow()
 
 bool HexTextBuffer::pNextLine()
 {
-    if (!std::getline(mText, mLine)) return false;
+    if (!std::getline(mText, mLine)) {
+        if (mPart == Part::GoldenHead) refuse(mLineNumber, "the line 'frame:' is missing behind it");
+        return false;
+    }
     ++mLineNumber;
-    mLine.erase(std::min(mLine.find('#'), mLine.size()));
-    dropAddress(mLine);
+    pPassOver();
     return true;
+}
+
+/// Takes everything off the line that stands for no bytes.
+void HexTextBuffer::pPassOver()
+{
+    if (beginsWith(mLine, kGoldenBegin)) mPart = Part::GoldenHead;
+    if (mPart == Part::GoldenHead) {
+        if (beginsWith(mLine, kGoldenRows)) mPart = Part::GoldenRows;
+        mLine.clear();
+        return;
+    }
+    mLine.erase(std::min(mLine.find('#'), mLine.size()));
+    if (mPart == Part::GoldenRows) {
+        dropFirstWord(mLine);
+    } else {
+        dropAddress(mLine);
+    }
 }
 
 void HexTextBuffer::pDecodeLine()
@@ -96,8 +128,8 @@ bool looksLikeHexText(std::istream& input)
 {
     const auto first = input.peek();
     if (first == std::istream::traits_type::eof()) return false;
-    const char c = std::istream::traits_type::to_char_type(first);
-    return isHexDigit(c) || c == '#' || std::isspace(static_cast<unsigned char>(c)) != 0;
+    const auto c = static_cast<unsigned char>(std::istream::traits_type::to_char_type(first));
+    return (c >= ' ' && c <= '~') || std::isspace(c) != 0;
 }
 
 } // namespace qel::tool
