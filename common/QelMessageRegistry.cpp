@@ -81,6 +81,12 @@ std::unique_ptr<QelMessage> QelMessageRegistry::deserialize(const char* buffer, 
     }
 }
 
+const QelMessageRegistry::Factory* QelMessageRegistry::findFactory(const Identifier& identifier) const
+{
+    const auto entry = mEntries.find(identifier);
+    return entry == mEntries.end() ? nullptr : &entry->second;
+}
+
 std::ostream& operator<<(std::ostream& os, const QelMessageRegistry::FastHeader& header)
 {
     return os << "[FN=" << hexFormat(header.mFunction) << " OP=" << hexFormat(header.mOperation)

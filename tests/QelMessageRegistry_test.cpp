@@ -447,6 +447,35 @@ TEST(QelMessageRegistry, EntryIsTheIdentityAndAFactory)
     EXPECT_EQ(classOf(*message), typeid(Example));
 }
 
+TEST(QelMessageRegistry, GivesTheFactoryOfAnIdentity)
+{
+    const QelMessageRegistry registry({QelMessageRegistry::Entry<Example>()});
+    const QelMessageRegistry::Factory* const factory = registry.findFactory(Example::getMessageID());
+    ASSERT_NE(factory, nullptr);
+    EXPECT_EQ(registry.findFactory(Example::getMessageID()), factory) << "it is the registry's own, not a copy";
+    const std::vector<char> frame = exampleFrame().bytes();
+    EXPECT_EQ(classOf(*(*factory)(frame.data(), static_cast<unsigned int>(frame.size()))), typeid(Example));
+}
+
+TEST(QelMessageRegistry, HasNoFactoryForAnUnknownIdentity)
+{
+    const QelMessageRegistry registry({QelMessageRegistry::Entry<Example>()});
+    EXPECT_EQ(registry.findFactory(Identifier(0x800A, 0x0005, Classification::Response)), nullptr);
+    EXPECT_EQ(registry.findFactory(Identifier(0x800A, 0x0006, Classification::Request)), nullptr);
+    EXPECT_EQ(registry.findFactory(Identifier(0x800B, 0x0005, Classification::Request)), nullptr);
+}
+
+TEST(QelMessageRegistry, TheFactoryTellsWhyAFrameIsRefused)
+{
+    const QelMessageRegistry registry;
+    const auto* const factory = registry.findFactory(Identifier(0x6002, 0x0402, Classification::Request));
+    ASSERT_NE(factory, nullptr);
+    const std::vector<char> frame = RawFrame::newForm().function(0x6002).operation(0x0402).flags(0x80).bytes();
+    EXPECT_THAT(([&] { (*factory)(heapCopy(frame).get(), static_cast<unsigned int>(frame.size())); }),
+                ThrowsMessage<QelMessageValidationException>(StrEq("dataLength shorter than actual data size")));
+    EXPECT_EQ(classOf(*deserialize(registry, frame)), typeid(QelMessage));
+}
+
 TEST(QelMessageRegistry, HandsTheBytesToTheFactoryInPlace)
 {
     const char* seenBuffer = nullptr;

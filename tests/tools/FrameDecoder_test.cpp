@@ -121,6 +121,13 @@ TEST_F(FrameDecoderTest, TheMessagesOfTheConnectionHandshakeAreKnown)
                 ElementsAre("0 QelMessageUpgradeConnectionAsync", "32 QelMessageAbortHandshakeAsync"));
 }
 
+TEST_F(FrameDecoderTest, AMessageOfTheConnectionHandshakeWithTheWrongFlagsIsUnknown)
+{
+    RawFrame frame = RawFrame::newForm();
+    frame.function(0x6001).operation(0x0001).flags(0x80);
+    EXPECT_THAT(decode(text(frame)), ElementsAre("0 QelMessage"));
+}
+
 TEST_F(FrameDecoderTest, GarbageIsNoFrame)
 {
     EXPECT_THAT(decode("this is no frame at all, whatever comes behind it"), ElementsAre("0: i_buffer bad eyecatcher"));

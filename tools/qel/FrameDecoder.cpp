@@ -1,64 +1,47 @@
 #include "FrameDecoder.hpp"
 
 #include <qel/common/QelInternalMessageRegistry.hpp>
-#include <qel/common/QelMessageDax.hpp>
 #include <qel/common/QelMessageExceptions.hpp>
-#include <qel/common/QelMessageInterfaceComponent.hpp>
-#include <qel/common/QelMessageVirtualSerial.hpp>
+#include <qel/common/QelMessageRegistry.hpp>
 #include <qel/common/io/QelMessageStream.hpp>
+
+#include "MessageRegistry.hpp"
 
 #include <algorithm>
 #include <cstring>
-#include <utility>
+#include <typeinfo>
 
 namespace qel::tool {
 
 namespace {
 
 using Prefix = QelMessageStream::MessageHeader;
+using FastHeader = QelMessageRegistry::FastHeader;
 
-/// As a registry's own entry, but says why the class refuses a frame: a registry itself tells only the log.
-template <typename T>
-std::pair<const QelMessageRegistry::Identifier, QelMessageRegistry::Factory> entry(std::string& refusal)
+/// The registry that knows a frame, or else the public one.
+const QelMessageRegistry& registryFor(const char* frame, unsigned int length)
 {
-    return {T::getMessageID(), [&refusal](const char* buffer, unsigned int length) -> std::unique_ptr<QelMessage> {
-                try {
-                    return std::make_unique<T>(buffer, length);
-                } catch (const QelMessageValidationException& error) {
-                    refusal = error.what();
-                    throw;
-                }
-            }};
+    const QelMessageRegistry& handshake = QelInternalMessageRegistry::getInstance();
+    if (length < sizeof(FastHeader)) return messageRegistry();
+    const auto identifier = reinterpret_cast<const FastHeader*>(frame)->getIdentifier();
+    return handshake.findFactory(identifier) != nullptr ? handshake : messageRegistry();
 }
 
-template <typename... Messages>
-QelMessageRegistry registryOf(std::string& refusal)
+/// What the class of a frame says against it; nothing when the identity is of no class. A registry itself tells only
+/// the log.
+std::string refusalOf(const QelMessageRegistry& registry, const char* frame, unsigned int length)
 {
-    return {entry<Messages>(refusal)...};
+    const auto* const factory = registry.findFactory(reinterpret_cast<const FastHeader*>(frame)->getIdentifier());
+    if (factory == nullptr) return {};
+    try {
+        static_cast<void>((*factory)(frame, length));
+        return {};
+    } catch (const QelMessageValidationException& error) {
+        return error.what();
+    }
 }
 
-/// Every message that can be read from a frame, those of the connection handshake included.
-QelMessageRegistry makeRegistry(std::string& refusal)
-{
-    return registryOf<QelMessageGetEnclTypeAndInterfaceVersionReq, QelMessageGetEnclTypeAndInterfaceVersionRsp,
-                      QelMessageInterfaceCmpOpenKrogSessionReq, QelMessageInterfaceCmpOpenKrogSessionRsp,
-                      QelMessageInterfaceCmpCloseKrogSessionReq, QelMessageInterfaceCmpCloseKrogSessionRsp,
-                      QelMessageExchIntCapabilitiesReq, QelMessageExchIntCapabilitiesRsp, QelMessageDaxBroadcastReq,
-                      QelMessageDaxBroadcastRsp, QelMessageGetGlobalModeAttributeReq,
-                      QelMessageGetGlobalModeAttributeRsp, QelMessageSetGlobalSaveAreaMetadataReq,
-                      QelMessageSetGlobalSaveAreaMetadataRsp, QelMessageGetGlobalSaveAreaMetadataReq,
-                      QelMessageGetGlobalSaveAreaMetadataRsp, QelMessageGetInterfaceLimitsReq, QelMessageGetQelTodReq,
-                      QelMessageSetGlobalModeAttributeReq,
-                      // virtual serial sessions
-                      QelMessageVirtualSerialOpenReq, QelMessageVirtualSerialOpenRsp, QelMessageVirtualSerialCloseReq,
-                      QelMessageVirtualSerialCloseRsp, QelMessageVirtualSerialGetMaxSessionsReq,
-                      QelMessageVirtualSerialGetMaxSessionsRsp, QelMessageVirtualSerialSetupSessionReq,
-                      QelMessageVirtualSerialSetupSessionRsp, QelMessageVirtualSerialDataToOsAsync,
-                      QelMessageVirtualSerialDataToDaxAsync, QelMessageVirtualSerialSessionClosedAsync,
-                      // notices to the console, and the connection handshake
-                      QelMessageDaxBroadcastOutboundAsync, QelMessageKrogConnectionClosedAsync,
-                      QelMessageUpgradeConnectionAsync, QelMessageAbortHandshakeAsync>(refusal);
-}
+bool isPlain(const QelMessage& message) { return typeid(message) == typeid(QelMessage); }
 
 bool isRefusedResponse(const QelMessage& message)
 {
@@ -80,7 +63,7 @@ std::string cutShort(std::size_t there, std::size_t wanted)
 
 } // namespace
 
-FrameDecoder::FrameDecoder(std::istream& input) : mInput(input), mRegistry(makeRegistry(mRefusal)) {}
+FrameDecoder::FrameDecoder(std::istream& input) : mInput(input) {}
 
 bool FrameDecoder::next(Item& item)
 {
@@ -115,10 +98,11 @@ void FrameDecoder::pDecode(Item& item)
         return;
     }
     mLost = false;
-    mRefusal.clear();
+    const QelMessageRegistry& registry = registryFor(frame, length);
     try {
-        item.message = mRegistry.deserialize(frame, length);
-        if (!isRefusedResponse(*item.message)) item.reason = mRefusal;
+        item.message = registry.deserialize(frame, length);
+        const bool mayBeRefused = isPlain(*item.message) && !isRefusedResponse(*item.message);
+        if (mayBeRefused) item.reason = refusalOf(registry, frame, length);
     } catch (const QelMessageValidationException& error) {
         item.reason = error.what();
     }

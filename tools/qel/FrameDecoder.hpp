@@ -1,7 +1,6 @@
 #pragma once
 
 #include <qel/common/QelMessage.hpp>
-#include <qel/common/QelMessageRegistry.hpp>
 
 #include <cstdint>
 #include <istream>
@@ -43,8 +42,6 @@ private:
     void pDecode(Item& item);
 
     std::istream& mInput;
-    std::string mRefusal; // why a message class refused the frame that it was last tried on
-    const QelMessageRegistry mRegistry;
     std::uint64_t mOffset = 0;
     bool mLost = false; // the boundaries of the frames
 };

@@ -76,6 +76,11 @@ public:
     ///         Error. Whatever else a factory throws passes unchanged.
     std::unique_ptr<QelMessage> deserialize(const char* buffer, unsigned int length) const;
 
+    /// Looks up the factory of an identity. Calling it tells by its exception what deserialize() tells only the log:
+    /// why a class refuses a frame.
+    /// @return null for an identity that is not known; otherwise lives as long as the registry
+    const Factory* findFactory(const Identifier& identifier) const;
+
 private:
     const std::map<Identifier, Factory> mEntries;
 };
