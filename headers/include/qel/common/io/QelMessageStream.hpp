@@ -32,7 +32,8 @@ public:
     /// two frames and one that cuts a frame short both give "EOF"; a program that must tell them apart wraps its Stream
     /// and counts the bytes.
     /// @return the message, typed if the registry knows and accepts it, otherwise a plain QelMessage; never null
-    /// @throws StreamIOException  the stream failed, ended ("EOF"), or its read deadline passed ("I/O deadline")
+    /// @throws StreamIOException  the stream failed, ended ("EOF"), or its read deadline passed: "I/O deadline" when it
+    ///         had passed before a call of the stream began, else what the stream says of it (see SocketStream)
     /// @throws QelMessageValidationException  "Invalid length": the frame says it has less than 9 or more than
     ///         QelMessage::MtuMax (16384) bytes; only its first 8 bytes were read, so the stream is out of step with
     ///         the frames and the connection is to be dropped. Any other text is the registry's: the frame was read
@@ -43,7 +44,8 @@ public:
     ///
     /// The length is not limited here: a frame of more than QelMessage::MtuMax bytes goes out and is refused by the
     /// stream that receives it.
-    /// @throws StreamIOException  the stream failed, or its write deadline passed
+    /// @throws StreamIOException  the stream failed, or its write deadline passed; part of the frame may have gone out
+    ///         then, so that the connection is of no further use
     void write(const QelMessage& message);
 
 private:

@@ -14,6 +14,7 @@ namespace qel {
 
 /// A socket of the system. Every call goes straight to the system call of the same name; its errors come as PosixError
 /// with a text "WHAT FAILED: NUMBER (DESCRIPTION)", written to the log at Error before the throw except by accept().
+/// read(), write() and shutdown() throw nothing: they do as SocketIF says.
 /// Ownership: owns its descriptor and closes it; movable, not copyable. A moved-from socket holds none (-1) and may be
 /// assigned to or destroyed.
 /// Thread safety: takes no lock. One reader and one writer at a time; shutdown() may be called while they wait.
