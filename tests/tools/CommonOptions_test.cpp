@@ -135,6 +135,15 @@ TEST(CommonOptions, WhatIsNoEndpointIsToldWhy)
     }
 }
 
+TEST(CommonOptions, CapabilitiesAreUpTo32ZerosAndOnes)
+{
+    const CLI::Validator capabilities = tool::capabilityValidator();
+    for (const std::string& text : {std::string(), std::string("0"), std::string("101"), std::string(32, '1')})
+        EXPECT_EQ(capabilities(text), "") << text;
+    EXPECT_EQ(capabilities(std::string(33, '1')), "more than 32 capability bits");
+    EXPECT_EQ(capabilities("012"), "capability bits are written as 0 and 1");
+}
+
 TEST(CommonOptions, ANumberIsBetweenItsLimits)
 {
     const CLI::Validator between = tool::numberBetween(0.5, 2);

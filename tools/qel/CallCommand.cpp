@@ -109,17 +109,6 @@ CLI::Validator longest(std::size_t bytes)
         "");
 }
 
-CLI::Validator capabilityBits()
-{
-    return CLI::Validator(
-        [](std::string& text) -> std::string {
-            if (text.size() > QelCapabilities::size()) return "more than 32 capability bits";
-            if (text.find_first_not_of("01") != std::string::npos) return "capability bits are written as 0 and 1";
-            return {};
-        },
-        "");
-}
-
 void addPlainRequests(CLI::App& command, Action& action, const std::shared_ptr<Call>& call)
 {
     const auto add = [&](const char* name, const char* description, CallRequest (*make)()) {
@@ -140,7 +129,7 @@ void addCapabilities(CLI::App& command, Action& action, const std::shared_ptr<Ca
         [](const RequestArguments& arguments) { return capabilitiesRequest(QelCapabilities(arguments.capabilities)); });
     request.add_option("bits", call->arguments.capabilities, "What this end offers, bit 0 first; all unless given")
         ->type_name("BITS")
-        ->check(capabilityBits());
+        ->check(capabilityValidator());
 }
 
 void addSetMode(CLI::App& command, Action& action, const std::shared_ptr<Call>& call)

@@ -1,5 +1,7 @@
 #include "CommonOptions.hpp"
 
+#include <qel/common/QelCapabilities.hpp>
+
 #include <cmath>
 #include <exception>
 #include <unistd.h>
@@ -43,6 +45,13 @@ std::string checkEndpoint(std::string& text)
     return "'" + text + "' is no endpoint, such as 127.0.0.1:4711 or [::1]:4711: " + reasonAgainst(text);
 }
 
+std::string checkCapabilities(std::string& text)
+{
+    if (text.size() > QelCapabilities::size()) return "more than 32 capability bits";
+    if (text.find_first_not_of("01") != std::string::npos) return "capability bits are written as 0 and 1";
+    return {};
+}
+
 std::string checkToolId(std::string& text)
 {
     return text.size() <= kToolIdBytes ? std::string() : "the tool id is longer than 32 bytes";
@@ -79,6 +88,8 @@ void addJsonOption(CLI::App& app, bool& json)
 }
 
 CLI::Validator endpointValidator() { return CLI::Validator(checkEndpoint, ""); }
+
+CLI::Validator capabilityValidator() { return CLI::Validator(checkCapabilities, ""); }
 
 CLI::Validator numberBetween(double least, double most)
 {

@@ -37,6 +37,9 @@ void addJsonOption(CLI::App& app, bool& json);
 /// Accepts the text of an endpoint: "127.0.0.1:4711", "[::1]:4711".
 CLI::Validator endpointValidator();
 
+/// Accepts the text of a capability set, as QelCapabilities takes it: up to 32 characters 0 and 1.
+CLI::Validator capabilityValidator();
+
 /// Accepts a number from one to the other, both included, and nothing that is no number, such as "nan".
 CLI::Validator numberBetween(double least, double most);
 

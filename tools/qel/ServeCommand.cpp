@@ -95,23 +95,13 @@ void parseVersion(const std::string& text, HypervisorSettings& settings)
     settings.minorVersion = parseNumber(text.substr(dot + 1), 0, "--interface-version");
 }
 
-QelCapabilities parseCapabilities(const std::string& text)
-{
-    try {
-        if (text.size() > QelCapabilities::size()) refuse("--capabilities", "more than 32 capability bits");
-        return QelCapabilities(text);
-    } catch (const std::invalid_argument& error) {
-        refuse("--capabilities", error.what());
-    }
-}
-
 HypervisorSettings parseSettings(const ServeOptions& options)
 {
     HypervisorSettings settings = options.settings;
     if (options.family.size() > 1) refuse("--interface-family", "is one character");
     if (!options.family.empty()) settings.interfaceFamily = options.family.front();
     if (!options.version.empty()) parseVersion(options.version, settings);
-    settings.capabilities = parseCapabilities(options.capabilities);
+    settings.capabilities = QelCapabilities(options.capabilities);
     settings.maxConsoles = static_cast<std::uint8_t>(options.maxConsoles);
     return settings;
 }
@@ -242,7 +232,8 @@ void addIdentityOptions(CLI::App& command, ServeOptions& options)
     command
         .add_option("--capabilities", options.capabilities,
                     "Capabilities to offer, a 0 or 1 for each, bit 0 first; all 32 unless given")
-        ->type_name("BITS");
+        ->type_name("BITS")
+        ->check(capabilityValidator());
 }
 
 } // namespace
