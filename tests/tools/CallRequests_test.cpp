@@ -156,7 +156,11 @@ TEST(CallRequests, TheModeIsSentAndRead)
     EXPECT_EQ(message.getMTMS(), "type*serial");
     EXPECT_EQ(asJson(set, response(0x6003, 0x0108, "")), "{}");
     EXPECT_EQ(asJson(tool::getModeRequest(), QelMessageGetGlobalModeAttributeRsp(1, 200, "type")),
-              R"({"mode":200,"mtms":"type"})");
+              R"({"mode":200,"mtms":"type","mtmsHex":"74797065"})");
+    const std::string bytes("a\0\xFF", 3);
+    EXPECT_EQ(tool::getModeRequest().describe(QelMessageGetGlobalModeAttributeRsp(1, 0, bytes)).json()["mtmsHex"],
+              "6100ff")
+        << "bytes that are no UTF-8 are lost in the text";
 }
 
 TEST(CallRequests, MetadataAreBytes)

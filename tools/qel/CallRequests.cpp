@@ -115,6 +115,7 @@ Answer describeMode(const QelMessage& message)
     Answer answer;
     answer.add("mode", "Mode", response.getMode());
     answer.addText("mtms", "Machine type, model, serial", response.getMTMS());
+    answer.addForPrograms("mtmsHex", hexDigits(response.getMTMS()));
     return answer;
 }
 
