@@ -399,6 +399,21 @@ TEST_F(Ca, ShowRefusesWhatIsNeither)
               "qel: " + file("request") + ": X509 certificate request string is not in a supported format\n");
     fs::create_symlink("/dev/zero", file("endless"));
     EXPECT_EQ(runCa({"show", file("endless")}).errors, "qel: " + file("endless") + " is no regular file\n");
+    EXPECT_EQ(runCa({"show", shared()}).errors, "qel: " + shared() + " is no regular file\n");
+}
+
+TEST_F(Ca, AFileThatIsNotThereIsUsageAndOneThatCannotBeReadAFailure)
+{
+    fs::create_symlink("loop", file("loop"));
+    for (const std::string command : {"show", "check"}) {
+        SCOPED_TRACE(command);
+        const auto missing = runCa({command, file("none")});
+        EXPECT_EQ(missing.exitStatus, 2);
+        EXPECT_THAT(missing.errors, HasSubstr("'" + file("none") + "' does not exist"));
+        const auto unreadable = runCa({command, file("loop")});
+        EXPECT_EQ(unreadable.exitStatus, 4);
+        EXPECT_EQ(unreadable.errors, "qel: cannot open " + file("loop") + ": 40 (Too many levels of symbolic links)\n");
+    }
 }
 
 TEST_F(Ca, CheckAnswersByItsExitStatus)

@@ -382,7 +382,7 @@ void addForce(CLI::App& subcommand, const Options& options)
 
 void addFileArgument(CLI::App& subcommand, const Options& options, const char* description)
 {
-    subcommand.add_option("file", options->file, description)->type_name("FILE")->required()->check(CLI::ExistingFile);
+    subcommand.add_option("file", options->file, description)->type_name("FILE")->required()->check(fileValidator());
 }
 
 SSLSubject subjectOf(const CaOptions& options)

@@ -4,6 +4,8 @@
 
 #include <cmath>
 #include <exception>
+#include <filesystem>
+#include <system_error>
 #include <unistd.h>
 
 namespace qel::tool {
@@ -52,6 +54,13 @@ std::string checkCapabilities(std::string& text)
     return {};
 }
 
+std::string checkFile(std::string& name)
+{
+    std::error_code error; // not looked at: whatever else is wrong with the file shows when it is opened
+    const bool isMissing = std::filesystem::status(name, error).type() == std::filesystem::file_type::not_found;
+    return isMissing ? "'" + name + "' does not exist" : std::string();
+}
+
 std::string checkToolId(std::string& text)
 {
     return text.size() <= kToolIdBytes ? std::string() : "the tool id is longer than 32 bytes";
@@ -90,6 +99,8 @@ void addJsonOption(CLI::App& app, bool& json)
 CLI::Validator endpointValidator() { return CLI::Validator(checkEndpoint, ""); }
 
 CLI::Validator capabilityValidator() { return CLI::Validator(checkCapabilities, ""); }
+
+CLI::Validator fileValidator() { return CLI::Validator(checkFile, ""); }
 
 CLI::Validator numberBetween(double least, double most)
 {

@@ -40,6 +40,10 @@ CLI::Validator endpointValidator();
 /// Accepts the text of a capability set, as QelCapabilities takes it: up to 32 characters 0 and 1.
 CLI::Validator capabilityValidator();
 
+/// Accepts the name of a file that is to be read, unless there is none of that name. A file that cannot be reached or
+/// read is no wrong command line: that shows when it is opened.
+CLI::Validator fileValidator();
+
 /// Accepts a number from one to the other, both included, and nothing that is no number, such as "nan".
 CLI::Validator numberBetween(double least, double most);
 

@@ -13,12 +13,10 @@
 #include "Text.hpp"
 
 #include <cerrno>
-#include <filesystem>
 #include <fstream>
 #include <iostream>
 #include <memory>
 #include <string>
-#include <system_error>
 #include <utility>
 
 namespace qel::tool {
@@ -132,12 +130,7 @@ void decodeBytes(std::istream& bytes, Report& report)
     }
 }
 
-std::string checkFile(std::string& name)
-{
-    std::error_code error; // not looked at: whatever else is wrong with the file shows when it is opened
-    const bool isMissing = std::filesystem::status(name, error).type() == std::filesystem::file_type::not_found;
-    return isMissing && name != "-" ? "'" + name + "' does not exist" : std::string();
-}
+std::string checkInput(std::string& name) { return name == "-" ? std::string() : fileValidator()(name); }
 
 ExitStatus runDecode(const DecodeOptions& options)
 {
@@ -178,7 +171,7 @@ CLI::App& addDecodeCommand(CLI::App& parent, Action& action)
     command.add_option("file", options->file, "The file; - for standard input")
         ->type_name("FILE")
         ->capture_default_str()
-        ->check(CLI::Validator(checkFile, ""));
+        ->check(CLI::Validator(checkInput, ""));
     CLI::Option* const raw = command.add_flag_callback(
         "--raw", [options] { options->notation = FrameNotation::Raw; },
         "The input is the frames as they are on the wire; guessed unless given");
