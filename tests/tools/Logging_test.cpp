@@ -1,11 +1,13 @@
 #include <qel/common/QelDebug.hpp>
 #include <qel/common/Utilities.hpp>
+#include <qel/common/util/PosixError.hpp>
 
 #include "Logging.hpp"
 #include "support/CapturedLog.hpp"
 #include "support/TemporaryDirectory.hpp"
 
 #include <gmock/gmock.h>
+#include <sys/stat.h>
 
 namespace qel::test {
 
@@ -15,6 +17,8 @@ using ::testing::ElementsAre;
 using ::testing::HasSubstr;
 using ::testing::IsEmpty;
 using ::testing::Not;
+using ::testing::StrEq;
+using ::testing::ThrowsMessage;
 using tool::LogOptions;
 
 class LoggingTest : public ::testing::Test {
@@ -55,6 +59,16 @@ TEST_F(LoggingTest, WithADirectoryTheLogIsAFile)
     const std::string text = Utilities::readFile(directory.file("name.log"));
     EXPECT_THAT(text, HasSubstr("[qel] in the file\n"));
     EXPECT_THAT(text, Not(HasSubstr("not in the file")));
+}
+
+TEST_F(LoggingTest, AFileThatCannotBeWrittenIsAFailure)
+{
+    const std::string path = directory.file("name.log");
+    ASSERT_EQ(::mkdir(path.c_str(), 0700), 0);
+    LogOptions options;
+    options.directory = directory.path();
+    EXPECT_THAT([&] { tool::startLogging(options, "name.log"); },
+                ThrowsMessage<FileIOError>(StrEq("cannot write the log " + path + ": 21 (Is a directory)")));
 }
 
 TEST_F(LoggingTest, WithoutADirectoryTheLogIsStandardError)

@@ -3,12 +3,16 @@
 #include <qel/common/LogBackendFiltered.hpp>
 #include <qel/common/LogBackendRotating.hpp>
 #include <qel/common/Utilities.hpp>
+#include <qel/common/util/PosixError.hpp>
 
 #include "TerminalMode.hpp"
+#include "UniqueFd.hpp"
 
 #include <cctype>
+#include <cerrno>
 #include <cstdio>
 #include <exception>
+#include <fcntl.h>
 #include <memory>
 #include <sstream>
 #include <unistd.h>
@@ -56,6 +60,14 @@ std::string describeLevels(const LogOptions& options)
                           : usual + " unless given");
 }
 
+/// The back-end drops its lines without a word when it cannot open its file; whoever wants a log wants to know that.
+void requireWritable(const std::string& path)
+{
+    const UniqueFd file(::open(path.c_str(), O_WRONLY | O_APPEND | O_NONBLOCK | O_CLOEXEC));
+    const PosixErrorCode error = errno;
+    if (file.get() < 0) throw FileIOError(error, "cannot write the log " + path);
+}
+
 } // namespace
 
 void addLogOptions(CLI::App& app, LogOptions& options)
@@ -82,6 +94,7 @@ void startLogging(const LogOptions& options, const std::string& name)
     } else {
         LogBackend::registerBackend(
             std::make_shared<LogBackendRotating>(LogLevel::Inherit, options.directory, name, options.fileBytes));
+        requireWritable(options.directory + "/" + name);
     }
 }
 

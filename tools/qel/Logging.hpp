@@ -26,6 +26,7 @@ void addLogOptions(CLI::App& app, LogOptions& options);
 
 /// Gives the root logger its back-end and level.
 /// @param name  of the log file within the directory
+/// @throws FileIOError  the log file cannot be written; later trouble with it goes to the system log alone
 void startLogging(const LogOptions& options, const std::string& name);
 
 /// The logger of this program's own lines, which tells them from the library's: "[qel] ".
