@@ -457,6 +457,54 @@ TEST_F(HypervisorTest, TheLongestMetadataThatCanBeSetCanBeGot)
     EXPECT_EQ(ask(peer, QelMessageGetGlobalSaveAreaMetadataReq())->msgLength(), 16384U);
 }
 
+// A frame with the old header has room for eight bytes more than one with the new header, which all answers have.
+
+/// A request with the old header, whose payload is the fixed fields and so many more bytes.
+std::vector<char> oldRequest(unsigned int operation, std::vector<char> fixed, std::size_t textLength)
+{
+    fixed.resize(fixed.size() + textLength, 'x');
+    return RawFrame::oldForm().function(0x6003).operation(operation).flags(0x80).payload(std::move(fixed)).bytes();
+}
+
+char high(std::size_t length) { return static_cast<char>(static_cast<unsigned char>(length >> 8)); }
+char low(std::size_t length) { return static_cast<char>(static_cast<unsigned char>(length)); }
+
+TEST_F(HypervisorTest, MetadataThatNoAnswerCouldCarryAreRefusedAndChangeNothing)
+{
+    const auto metadata = [](std::size_t length) { return oldRequest(0x010A, {high(length), low(length)}, length); };
+    Peer peer;
+    identify(peer, "a");
+    receive(peer, metadata(16350));
+    EXPECT_EQ(peer.link.take()->getStatus(), 0U);
+    for (const std::size_t length : {16351, 16358}) {
+        SCOPED_TRACE(length);
+        ASSERT_LE(metadata(length).size(), 16384U);
+        receive(peer, metadata(length));
+        EXPECT_EQ(peer.link.take()->getStatus(), kInvalidData);
+    }
+    EXPECT_EQ(ask(peer, QelMessageGetGlobalSaveAreaMetadataReq())->msgLength(), 16384U);
+}
+
+TEST_F(HypervisorTest, AModeWithATextThatNoAnswerCouldCarryIsRefusedAndChangesNothing)
+{
+    const auto mode = [](char number, std::size_t length) {
+        return oldRequest(0x0108, {number, '\0', high(length), low(length)}, length);
+    };
+    Peer peer;
+    identify(peer, "a");
+    receive(peer, mode(1, 16348));
+    EXPECT_EQ(peer.link.take()->getStatus(), 0U);
+    for (const std::size_t length : {16349, 16356}) {
+        SCOPED_TRACE(length);
+        ASSERT_LE(mode(2, length).size(), 16384U);
+        receive(peer, mode(2, length));
+        EXPECT_EQ(peer.link.take()->getStatus(), kInvalidData);
+    }
+    const auto answer = ask(peer, QelMessageGetGlobalModeAttributeReq());
+    EXPECT_EQ(answer->msgLength(), 16384U);
+    EXPECT_EQ(dynamic_cast<const QelMessageGetGlobalModeAttributeRsp&>(*answer).getMode(), 1U);
+}
+
 // The hypervisor session.
 
 TEST_F(HypervisorTest, ASecondOpenOfTheSessionIsRefused)
@@ -607,6 +655,31 @@ TEST_F(HypervisorTest, TheLongestBroadcastThatComesInFitsAFrameGoingOut)
     identify(sender, std::string(32, 'a'));
     identify(other, "b");
     EXPECT_EQ(statusOf(sender, QelMessageDaxBroadcastReq(0, 16306, 0, "", text.data())), 0U);
+    EXPECT_EQ(other.link.take()->msgLength(), 16380U);
+}
+
+TEST_F(HypervisorTest, ABroadcastLongerThanTheLimitsSayIsRefusedAndGoesToNobody)
+{
+    const auto broadcast = [](std::size_t length) {
+        std::vector<char> fixed(46, '\0');
+        fixed[1] = 46;
+        fixed[4] = high(length);
+        fixed[5] = low(length);
+        return oldRequest(0x0106, std::move(fixed), length);
+    };
+    Peer sender;
+    Peer other;
+    identify(sender, "a");
+    identify(other, "b");
+    for (const std::size_t length : {16307, 16314}) {
+        SCOPED_TRACE(length);
+        ASSERT_LE(broadcast(length).size(), 16384U);
+        receive(sender, broadcast(length));
+        EXPECT_EQ(sender.link.take()->getStatus(), kInvalidData);
+        EXPECT_EQ(other.link.posted(), 0U);
+    }
+    receive(sender, broadcast(16306));
+    EXPECT_EQ(sender.link.take()->getStatus(), 0U);
     EXPECT_EQ(other.link.take()->msgLength(), 16380U);
 }
 

@@ -4,8 +4,8 @@
 #include <qel/common/QelMessage.hpp>
 
 #include "Answer.hpp"
+#include "LongestTexts.hpp"
 
-#include <cstddef>
 #include <cstdint>
 #include <functional>
 #include <memory>
@@ -27,11 +27,6 @@ struct CallRequest {
     /// @throws QelMessageValidationException  the response is not what its identity promises
     std::function<Answer(const QelMessage&)> describe;
 };
-
-/// The longest texts that still fit a frame which a stream accepts, in bytes.
-constexpr std::size_t kLongestMtms = QelMessage::MtuMax - QelMessage::MaxHeaderSize - 4;
-constexpr std::size_t kLongestMetadata = QelMessage::MtuMax - QelMessage::MaxHeaderSize - 2;
-constexpr std::size_t kLongestBroadcast = QelMessage::MtuMax - QelMessage::MaxHeaderSize - 46;
 
 /// To whom a broadcast goes.
 struct BroadcastAddress {

@@ -6,6 +6,7 @@
 #include <qel/common/util/TimeProvider.hpp>
 
 #include "Logging.hpp"
+#include "LongestTexts.hpp"
 
 #include <algorithm>
 #include <chrono>
@@ -294,6 +295,7 @@ Hypervisor::Reply Hypervisor::pLimits(Console&, const QelMessageGetInterfaceLimi
 
 Hypervisor::Reply Hypervisor::pBroadcast(Console& console, const QelMessageDaxBroadcastReq& request)
 {
+    if (request.getBroadcastMsgLen() > kLongestBroadcast) return bareResponse(request, QelMessageStatusInvalidData);
     if (request.getBroadcastMode() == kUnicast) {
         Console* const addressee = pFindIdentified(request.getToolType(), request.getToolId());
         if (addressee == nullptr || addressee == &console) {
@@ -319,6 +321,8 @@ Hypervisor::Reply Hypervisor::pTime(Console&, const QelMessageGetQelTodReq& requ
 
 Hypervisor::Reply Hypervisor::pSetMode(Console&, const QelMessageSetGlobalModeAttributeReq& request)
 {
+    // What cannot be told to whoever asks for it later would break that console's connection.
+    if (request.getMTMSLen() > kLongestMtms) return bareResponse(request, QelMessageStatusInvalidData);
     mMode = request.getMode();
     mMtms = request.getMTMS();
     return bareResponse(request, QelMessageStatusNoError); // the one request that has no response class
@@ -331,6 +335,7 @@ Hypervisor::Reply Hypervisor::pGetMode(Console&, const QelMessageGetGlobalModeAt
 
 Hypervisor::Reply Hypervisor::pSetMetadata(Console&, const QelMessageSetGlobalSaveAreaMetadataReq& request)
 {
+    if (request.getMetadataLen() > kLongestMetadata) return bareResponse(request, QelMessageStatusInvalidData);
     mMetadata = request.getMetadata();
     return std::make_unique<QelMessageSetGlobalSaveAreaMetadataRsp>(request.getCallerId());
 }
