@@ -38,6 +38,9 @@ TEST(CommandLine, HelpAndVersionStandAtEveryLevel)
         {"call", "get-metadata"},
         {"call", "set-metadata"},
         {"call", "broadcast"},
+        {"console"},
+        {"bench"},
+        {"decode"}, // those of "ca" have a test beside the others of "ca"
     };
     for (std::vector<std::string> level : levels) {
         SCOPED_TRACE(joined(level));

@@ -1,6 +1,7 @@
 #!/bin/sh
 # What a user gets: installs the library to a scratch prefix, moves the installed tree to another place, builds and runs
-# the example project against it there, once found by CMake and once by pkg-config.
+# the example project against it there, once found by CMake and once by pkg-config; likewise the lines that README.md
+# shows, with the includes of the example.
 #
 #   installed_package.sh BUILD SOURCE VERSION
 #
@@ -107,6 +108,23 @@ LD_LIBRARY_PATH="$libdir" "$work/by-pkg-config" >"$work/by-pkg-config.out" ||
     fail "the example built with pkg-config ended with an error"
 "$readelf" -d "$work/by-pkg-config" | grep NEEDED | grep -qF "[$soname]" || fail "the example does not need $soname"
 
+# --- the lines that README.md shows
+
+# shellcheck disable=SC2016 # these are no commands
+sed -n '/^```cpp$/,/^```$/p' "$source/README.md" | sed '/^```/d' >"$work/lines"
+[ -s "$work/lines" ] || fail "README.md shows no lines of code"
+{
+    grep '^#include' "$source/examples/send_receive.cpp"
+    echo 'int main()'
+    echo '{'
+    cat "$work/lines"
+    echo '}'
+} >"$work/readme.cpp"
+# shellcheck disable=SC2086
+quietly "$cxx" -std=c++17 -Wall -Wextra -Werror ${CXXFLAGS-} "$work/readme.cpp" -o "$work/readme" "$@"
+LD_LIBRARY_PATH="$libdir" "$work/readme" >"$work/readme.out" ||
+    fail "the lines of README.md ended with an error"
+
 # --- a program that uses TLS
 
 mkdir "$work/tls"
@@ -144,4 +162,7 @@ EOF
 for way in by-cmake by-pkg-config; do
     diff "$work/expected" "$work/$way.out" >&2 || fail "the example ($way) printed something else"
 done
+
+echo '[CID: 0x00000002, FN: 0x6003, OP: 0x0101, FL: 0x80, DL: 48, ST: 0x00000000:0000] from console-1' |
+    diff - "$work/readme.out" >&2 || fail "the lines of README.md printed something else"
 echo "installed_package: PASSED"
