@@ -8,11 +8,12 @@
 
 namespace qel::tool {
 
-/// Sees to it that commands which are no longer wanted end, and that nothing is left of them.
+/// Sees to it that commands which are no longer wanted end, and are reaped.
 ///
-/// A command that is handed over is asked to end (SIGHUP to its process group), killed when it has not within the grace
-/// period (SIGKILL), and reaped in either case. Nothing here waits but finish(): somebody must call reap() from time to
-/// time while it says that commands are left.
+/// A command that is handed over is asked to end (SIGHUP to its process group), killed with its group when it has not
+/// within the grace period (SIGKILL), and reaped in either case. Others of its group that outlive it are left alone:
+/// once it is reaped, the number of the group may come to mean another one. Nothing here waits but finish(): somebody
+/// must call reap() from time to time while it says that commands are left.
 ///
 /// Thread safety: any thread. Its lock is a leaf.
 class ChildReaper {
