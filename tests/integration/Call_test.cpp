@@ -104,6 +104,8 @@ TEST_F(Call, Mode)
     const json mode = parse(server.call({"get-mode", "--json"}));
     EXPECT_EQ(mode["mode"], 1);
     EXPECT_EQ(mode["mtms"], "");
+    expectText({"set-mode", "010"}, "done\n"); // ten, whatever C makes of it
+    EXPECT_EQ(parse(server.call({"get-mode", "--json"}))["mode"], 10);
 }
 
 TEST_F(Call, Metadata)

@@ -393,6 +393,7 @@ TEST_F(ConsoleTest, WhatIsNotThereIsRefused)
     const auto partition = runConsole({"9"}, "");
     EXPECT_EQ(partition.exitStatus, 1);
     EXPECT_EQ(partition.errors, "qel: open serial session refused: 0x00000015 (QelMessageStatusInvalidLparId)\n");
+    EXPECT_EQ(runConsole({"09"}, "").errors, partition.errors); // no octal number, which would be none
     const auto connection = runConsole({"1", "--connection", "1"}, "");
     EXPECT_EQ(connection.exitStatus, 1);
     EXPECT_EQ(connection.errors,

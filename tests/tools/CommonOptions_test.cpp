@@ -160,6 +160,41 @@ TEST(CommonOptions, WhatIsNoNumberIsNotBetweenAnyLimits)
     EXPECT_EQ(between("-NaN"), "'-NaN' is no number");
 }
 
+struct NumberText {
+    const char* text;
+    const char* taken; ///< what the parser then gets; null when it is refused
+};
+
+TEST(CommonOptions, AWholeNumberIsDecimalWhateverZerosStandInFront)
+{
+    const NumberText rows[] = {
+        {"8", "8"},        {"010", "10"},    {"08", "8"},      {"0000000000000000000000000255", "255"},
+        {"255", "255"},    {"0xFF", "255"},  {"0x0b", "11"},   {"0X10", "16"},
+        {"7", nullptr},    {"256", nullptr}, {"007", nullptr}, {"0x100", nullptr},
+        {"-8", nullptr},   {"+8", nullptr},  {"8.0", nullptr}, {"8x", nullptr},
+        {" 8", nullptr},   {"8 ", nullptr},  {"", nullptr},    {"0x", nullptr},
+        {"0x-9", nullptr}, {"nan", nullptr}, {"1e1", nullptr}, {"18446744073709551624", nullptr}, // 8 and 2^64
+    };
+    const CLI::Validator between = tool::wholeNumberBetween(8, 255);
+    for (const NumberText& row : rows) {
+        SCOPED_TRACE(row.text);
+        std::string text = row.text;
+        const std::string failure = between(text);
+        if (row.taken == nullptr) {
+            EXPECT_EQ(failure, "'" + std::string(row.text) + "' is no whole number from 8 to 255");
+            EXPECT_EQ(text, row.text);
+        } else {
+            EXPECT_EQ(failure, "");
+            EXPECT_EQ(text, row.taken);
+        }
+    }
+}
+
+TEST(CommonOptions, TheToolTypeMayHaveZerosInFront)
+{
+    EXPECT_EQ(parse({"--connect", "127.0.0.1:80", "--tool-type", "010"}).options.identity.toolType, 10U);
+}
+
 } // namespace
 
 } // namespace qel::test

@@ -154,17 +154,17 @@ std::string checkEven(std::string& text)
 void addLoadOptions(CLI::App& command, BenchOptions& options)
 {
     command.add_option("--connections", options.connections, "Consoles, of which every two send each other messages")
-        ->check(CLI::Range(2U, kMostConnections))
+        ->transform(wholeNumberBetween(2, kMostConnections))
         ->check(CLI::Validator(checkEven, ""))
         ->capture_default_str();
     command.add_option("--size", options.bytes, "Bytes of payload in a message")
         ->type_name("BYTES")
-        ->check(CLI::Range(std::size_t{1}, kLongestBroadcast))
+        ->transform(wholeNumberBetween(1, kLongestBroadcast))
         ->capture_default_str();
     command.add_option("--rate", options.rate, "Messages a second, all connections together; flat out unless given")
         ->check(numberBetween(0.001, kHighestRate));
     CLI::Option* const count = command.add_option("--count", options.count, "Messages, all connections together")
-                                   ->check(CLI::Range(std::uint64_t{1}, kMostMessages));
+                                   ->transform(wholeNumberBetween(1, kMostMessages));
     command.add_option("--seconds", options.seconds, "How long to go on; 10 unless this or --count is given")
         ->check(numberBetween(0.001, kLongestSeconds))
         ->excludes(count);

@@ -371,7 +371,7 @@ void addDays(CLI::App& subcommand, unsigned long& days)
 {
     subcommand.add_option("--days", days, "Days until the certificate expires")
         ->type_name("DAYS")
-        ->check(CLI::Range(1UL, kMostDays))
+        ->transform(wholeNumberBetween(1, kMostDays))
         ->capture_default_str();
 }
 

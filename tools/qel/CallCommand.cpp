@@ -8,6 +8,7 @@
 
 #include <functional>
 #include <iostream>
+#include <limits>
 #include <memory>
 #include <string>
 #include <utility>
@@ -138,7 +139,7 @@ void addSetMode(CLI::App& command, Action& action, const std::shared_ptr<Call>& 
                                    [](const RequestArguments& arguments) {
                                        return setModeRequest(static_cast<std::uint8_t>(arguments.mode), arguments.mtms);
                                    });
-    request.add_option("mode", call->arguments.mode, "0 to 255")->required()->check(CLI::Range(0, 255));
+    request.add_option("mode", call->arguments.mode, "0 to 255")->required()->transform(wholeNumberBetween(0, 255));
     request.add_option("mtms", call->arguments.mtms, "Machine type, model and serial")->check(longest(kLongestMtms));
 }
 
@@ -165,9 +166,11 @@ void addBroadcast(CLI::App& command, Action& action, const std::shared_ptr<Call>
     request.add_option("text", arguments.broadcast, "What to send")->required()->check(longest(kLongestBroadcast));
     CLI::Option* const type =
         request.add_option("--type", arguments.broadcastType, "Broadcast type; 1 goes to one console alone")
-            ->check(CLI::Range(0, 255))
+            ->transform(wholeNumberBetween(0, 255))
             ->capture_default_str();
-    request.add_option("--to-type", arguments.address.toolType, "Tool type of the console it goes to")->needs(type);
+    request.add_option("--to-type", arguments.address.toolType, "Tool type of the console it goes to")
+        ->transform(wholeNumberBetween(0, std::numeric_limits<std::uint32_t>::max()))
+        ->needs(type);
     request.add_option("--to-id", arguments.address.toolId, "Tool id of the console it goes to")
         ->needs(type)
         ->check(longest(32));

@@ -2,9 +2,11 @@
 
 #include <qel/common/QelCapabilities.hpp>
 
+#include <charconv>
 #include <cmath>
 #include <exception>
 #include <filesystem>
+#include <limits>
 #include <system_error>
 #include <unistd.h>
 
@@ -66,6 +68,16 @@ std::string checkToolId(std::string& text)
     return text.size() <= kToolIdBytes ? std::string() : "the tool id is longer than 32 bytes";
 }
 
+/// @return false: it is none, or has more digits than any number here
+bool parseWholeNumber(const std::string& text, std::uint64_t& number)
+{
+    const bool isHexadecimal = text.size() > 2 && text[0] == '0' && (text[1] == 'x' || text[1] == 'X');
+    const char* const begin = text.data() + (isHexadecimal ? 2 : 0);
+    const char* const end = text.data() + text.size();
+    const auto result = std::from_chars(begin, end, number, isHexadecimal ? 16 : 10);
+    return result.ec == std::errc() && result.ptr == end;
+}
+
 } // namespace
 
 std::chrono::milliseconds ConnectOptions::timeout() const
@@ -85,6 +97,7 @@ void addConnectOptions(CLI::App& app, ConnectOptions& options)
         ->check(numberBetween(kShortestTimeout, kLongestTimeout))
         ->capture_default_str();
     app.add_option("--tool-type", options.identity.toolType, "Type that this console introduces itself with")
+        ->transform(wholeNumberBetween(0, std::numeric_limits<std::uint32_t>::max()))
         ->capture_default_str();
     app.add_option("--tool-id", options.identity.toolId,
                    "Id that this console introduces itself with, at most 32 bytes; qel-<process id> unless given")
@@ -114,6 +127,22 @@ CLI::Validator numberBetween(double least, double most)
             return failure.empty() && !isNumber ? "'" + text + "' is no number" : failure;
         },
         range.get_description());
+}
+
+CLI::Validator wholeNumberBetween(std::uint64_t least, std::uint64_t most)
+{
+    const std::string from = std::to_string(least);
+    const std::string to = std::to_string(most);
+    return CLI::Validator(
+        [least, most, from, to](std::string& text) {
+            std::uint64_t number = 0;
+            if (!parseWholeNumber(text, number) || number < least || number > most) {
+                return "'" + text + "' is no whole number from " + from + " to " + to;
+            }
+            text = std::to_string(number);
+            return std::string();
+        },
+        "INT in [" + from + " - " + to + "]");
 }
 
 bool isLoopback(const IPAddress& address)

@@ -47,6 +47,11 @@ CLI::Validator fileValidator();
 /// Accepts a number from one to the other, both included, and nothing that is no number, such as "nan".
 CLI::Validator numberBetween(double least, double most);
 
+/// For options that take whole numbers: a number from one to the other, both included, in decimal or, behind "0x", in
+/// hexadecimal digits. Zeros in front mean nothing, so that 010 is ten here as it is everywhere else on a command line.
+/// To be used with transform(): the parser itself would take 010 for an octal number.
+CLI::Validator wholeNumberBetween(std::uint64_t least, std::uint64_t most);
+
 /// 127.0.0.0/8, ::1, and the former as an IPv4-mapped IPv6 address.
 bool isLoopback(const IPAddress& address);
 

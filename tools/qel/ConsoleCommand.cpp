@@ -186,14 +186,14 @@ CLI::App& addConsoleCommand(CLI::App& parent, Action& action)
     command.add_option("partition", options->address.partition, "The partition's id")
         ->required()
         ->type_name("PARTITION")
-        ->check(CLI::Range(0, 65535));
+        ->transform(wholeNumberBetween(0, 65535));
     addConnectOptions(command, options->connect);
     command.get_option("--timeout")
         ->description("Seconds for connecting and opening the session together, and then for each answer and for each "
                       "message that has begun");
     command.add_option("--connection", options->address.connection, "Number of the serial connection")
         ->type_name("N")
-        ->check(CLI::Range(0, 65535))
+        ->transform(wholeNumberBetween(0, 65535))
         ->capture_default_str();
     command.add_flag("--force", options->force, "Take the session from the console that holds it");
     addEscape(command, *options);

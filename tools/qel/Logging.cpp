@@ -5,6 +5,7 @@
 #include <qel/common/Utilities.hpp>
 #include <qel/common/util/PosixError.hpp>
 
+#include "CommonOptions.hpp"
 #include "TerminalMode.hpp"
 #include "UniqueFd.hpp"
 
@@ -81,7 +82,7 @@ void addLogOptions(CLI::App& app, LogOptions& options)
         ->check(CLI::Validator(checkLevel, ""));
     app.add_option("--log-size", options.fileBytes, "Bytes that one log file may hold")
         ->type_name("BYTES")
-        ->check(CLI::Range(std::size_t{4096}, std::size_t{1} << 40))
+        ->transform(wholeNumberBetween(4096, std::uint64_t{1} << 40))
         ->capture_default_str();
 }
 

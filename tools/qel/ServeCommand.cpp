@@ -255,13 +255,13 @@ CLI::App& addServeCommand(CLI::App& parent, Action& action)
         ->type_name("ID=COMMAND")
         ->allow_extra_args(false);
     command.add_option("--max-consoles", options->maxConsoles, "Consoles served at a time")
-        ->check(CLI::Range(1, 255))
+        ->transform(wholeNumberBetween(1, 255))
         ->capture_default_str();
     command
         .add_option("--queue-limit", options->queueBytes,
                     "Bytes that may be queued for a console before it has to wait; half of it for serial data")
         ->type_name("BYTES")
-        ->check(CLI::Range(std::size_t{1}, kLargestQueue))
+        ->transform(wholeNumberBetween(1, kLargestQueue))
         ->capture_default_str();
     addIdentityOptions(command, *options);
     addLogOptions(command, options->log);
