@@ -201,6 +201,23 @@ TEST_F(ConnectionTest, AnIntroducedConsoleMayTakeItsTime)
     EXPECT_EQ(messages.ask(QelMessageGetQelTodReq())->getStatus(), 0U);
 }
 
+TEST_F(ConnectionTest, AnIntroducedConsoleMayBeHeldBackForLongerThanItHadToIntroduceItself)
+{
+    ConnectionLimits limits;
+    limits.handshake = std::chrono::milliseconds(1000);
+    start(limits);
+    identify();
+    messages.ask(QelMessageInterfaceCmpOpenKrogSessionReq());
+    messages.ask(QelMessageVirtualSerialOpenReq(1, 0, false));
+    messages.ask(QelMessageVirtualSerialSetupSessionReq(1, 0));
+    port1->takes = 0;
+    const std::string data(16000, 'x');
+    for (int i = 0; i < 5; ++i) // more than the 64 KiB that are kept
+        messages.send(QelMessageVirtualSerialDataToOsAsync(1, 0, 16000, data.data()));
+    EXPECT_EQ(ended.get_future().wait_for(std::chrono::milliseconds(1200)), std::future_status::timeout);
+    EXPECT_FALSE(hypervisor->mayReceive(1));
+}
+
 TEST_F(ConnectionTest, AConsoleThatDoesNotReadItsAnswersIsNotReadFromAndLosesNothing)
 {
     start();

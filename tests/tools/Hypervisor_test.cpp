@@ -166,6 +166,28 @@ TEST_F(HypervisorTest, AnEmptyToolIdIsAnIdentityLikeAnyOther)
     EXPECT_EQ(statusOf(second, versionRequest("", 7)), kAlreadyConnected);
 }
 
+TEST_F(HypervisorTest, AnIdentityOfNothingButZerosIsTakenByNobodyAtFirst)
+{
+    Peer silent;
+    Peer peer;
+    connect(silent);
+    connect(peer);
+    EXPECT_EQ(statusOf(peer, versionRequest("", 0)), 0U);
+}
+
+TEST_F(HypervisorTest, AConsoleThatIsSentAwayGivesItsIdentityAndItsPlaceUpAtOnce)
+{
+    HypervisorSettings settings;
+    settings.maxConsoles = 1;
+    makeHypervisor(settings);
+    Peer first;
+    Peer second;
+    identify(first, "a");
+    EXPECT_EQ(receive(first, QelMessageUpgradeConnectionAsync()), ConsoleState::Closing);
+    connect(second);
+    EXPECT_EQ(statusOf(second, versionRequest("a")), 0U);
+}
+
 TEST_F(HypervisorTest, OneConsoleMoreThanAllowedIsTurnedAwayAndClosed)
 {
     Peer first;

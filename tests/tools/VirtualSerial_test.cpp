@@ -2,6 +2,7 @@
 
 #include "tools/HypervisorFixture.hpp"
 
+#include <functional>
 #include <gmock/gmock.h>
 #include <poll.h>
 
@@ -472,6 +473,7 @@ TEST_F(VirtualSerialTest, ALineThatCannotBeWrittenToEndsTheSession)
     port1->failsToWrite = false;
     openSerial(peer, 1);
     EXPECT_EQ(port1->started, 2U);
+    hypervisor->serviceSerial(1);
     EXPECT_EQ(port1->input, ""); // nothing of the old session comes through
 }
 
@@ -559,6 +561,48 @@ TEST_F(VirtualSerialTest, AConsoleThatGoesReleasesItsSerialSessions)
     EXPECT_EQ(peer.link.posted(), 0U);
     openSerial(other, 1);
     EXPECT_EQ(port1->started, 1U);
+}
+
+TEST_F(VirtualSerialTest, TheNextHolderHasToSetTheSessionUpItself)
+{
+    Peer gone;
+    Peer closed;
+    Peer next;
+    setUpSerial(gone, "a", 1);
+    setUpSerial(closed, "b", 2);
+    hypervisor->disconnect(gone.id);
+    EXPECT_EQ(statusOf(closed, QelMessageInterfaceCmpCloseKrogSessionReq()), 0U);
+
+    openSession(next, "c");
+    openSerial(next, 1);
+    openSerial(next, 2);
+    port1->output = {"early"};
+    port2->output = {"early"};
+    for (const std::uint16_t partition : std::vector<std::uint16_t>{1, 2}) {
+        SCOPED_TRACE(partition);
+        hypervisor->serviceSerial(partition);
+        EXPECT_EQ(next.link.posted(), 0U);
+        sendData(next, partition, "early");
+    }
+    EXPECT_EQ(port1->input + port2->input, "");
+    EXPECT_THAT(watched(), IsEmpty());
+}
+
+TEST_F(VirtualSerialTest, WhateverAConsoleDoesTheSerialLinesAreLookedAtAgain)
+{
+    Peer peer;
+    const auto wakes = [this](const std::function<void()>& action) {
+        const unsigned before = serialWakes;
+        action();
+        return serialWakes > before;
+    };
+    openSession(peer, "a");
+    EXPECT_TRUE(wakes([&] { openSerial(peer, 1); }));
+    EXPECT_TRUE(wakes([&] { EXPECT_EQ(setUp(peer, 1), 0U); }));
+    EXPECT_TRUE(wakes([&] { sendData(peer, 1, "x"); }));
+    EXPECT_TRUE(wakes([&] { EXPECT_EQ(close(peer, 1), 0U); }));
+    EXPECT_TRUE(wakes([&] { hypervisor->disconnect(peer.id); }));
+    EXPECT_TRUE(wakes([&] { hypervisor->shutDown(); }));
 }
 
 TEST_F(VirtualSerialTest, InputThatWasAcceptedIsDeliveredAfterItsConsoleHasGone)
