@@ -498,7 +498,7 @@ TEST_F(HypervisorTest, MetadataThatNoAnswerCouldCarryAreRefusedAndChangeNothing)
     identify(peer, "a");
     receive(peer, metadata(16350));
     EXPECT_EQ(peer.link.take()->getStatus(), 0U);
-    for (const std::size_t length : {16351, 16358}) {
+    for (const std::size_t length : {16351U, 16358U}) {
         SCOPED_TRACE(length);
         ASSERT_LE(metadata(length).size(), 16384U);
         receive(peer, metadata(length));
@@ -516,7 +516,7 @@ TEST_F(HypervisorTest, AModeWithATextThatNoAnswerCouldCarryIsRefusedAndChangesNo
     identify(peer, "a");
     receive(peer, mode(1, 16348));
     EXPECT_EQ(peer.link.take()->getStatus(), 0U);
-    for (const std::size_t length : {16349, 16356}) {
+    for (const std::size_t length : {16349U, 16356U}) {
         SCOPED_TRACE(length);
         ASSERT_LE(mode(2, length).size(), 16384U);
         receive(peer, mode(2, length));
@@ -693,7 +693,7 @@ TEST_F(HypervisorTest, ABroadcastLongerThanTheLimitsSayIsRefusedAndGoesToNobody)
     Peer other;
     identify(sender, "a");
     identify(other, "b");
-    for (const std::size_t length : {16307, 16314}) {
+    for (const std::size_t length : {16307U, 16314U}) {
         SCOPED_TRACE(length);
         ASSERT_LE(broadcast(length).size(), 16384U);
         receive(sender, broadcast(length));
