@@ -1,10 +1,10 @@
 #include <qel/common/QelMessageInterfaceComponent.hpp>
 #include <qel/common/util/TimeProvider.hpp>
 
-#include "BenchLoad.hpp"
 #include "Contest.hpp"
 #include "Loopback.hpp"
 #include "TlsEnds.hpp"
+#include "bench/BenchLoad.hpp"
 #include "support/Process.hpp"
 #include "support/TemporaryDirectory.hpp"
 

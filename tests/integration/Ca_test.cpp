@@ -5,8 +5,8 @@
 #include <qel/common/security/SSLCertificate.hpp>
 #include <qel/common/security/SSLCertificateRequest.hpp>
 
-#include "CertificateState.hpp"
-#include "CertificateView.hpp"
+#include "certificates/CertificateState.hpp"
+#include "certificates/CertificateView.hpp"
 #include "integration/CaKit.hpp"
 
 #include <filesystem>

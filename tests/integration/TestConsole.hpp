@@ -6,7 +6,7 @@
 #include <qel/common/net/SocketStream.hpp>
 
 #include "support/Process.hpp"
-#include "tools/Loopback.hpp"
+#include "tools/transport/Loopback.hpp"
 
 #include <memory>
 #include <string>

@@ -6,7 +6,7 @@
 #include <qel/common/Utilities.hpp>
 #include <qel/common/io/StreamIOException.hpp>
 
-#include "CertificateView.hpp"
+#include "certificates/CertificateView.hpp"
 #include "integration/TestConsole.hpp"
 #include "integration/TlsConsole.hpp"
 #include "integration/WrongServer.hpp"

@@ -1,5 +1,5 @@
 // The library has floors: a file includes only its own floor and those below it. floors.txt beside this file is the
-// table; these tests hold the files on disk against it.
+// table; these tests hold the files on disk against it. The program has rooms that are checked in the same way, below.
 
 #include <algorithm>
 #include <filesystem>
@@ -238,6 +238,65 @@ TEST(IncludeFloorsCheck, RefusesATableThatContradictsItself)
                 ThrowsMessage<std::runtime_error>(HasSubstr("stands there twice: twice")));
     EXPECT_THAT([] { parseTable("only poll.h\n"); }, ThrowsMessage<std::runtime_error>(HasSubstr("a room are needed")));
     EXPECT_THROW(parseTable("ground low\n"), std::invalid_argument);
+}
+
+// The program's rooms are its folders. What each may include beside itself:
+
+using Rooms = std::map<std::string, std::set<std::string>>;
+
+const Rooms& programRooms()
+{
+    static const Rooms rooms{
+        {"base", {}},
+        {"decode", {"base"}},
+        {"certificates", {"base"}},
+        {"transport", {"base", "certificates"}},
+        {"client", {"base", "transport"}},
+        {"console", {"base", "client"}},
+        {"bench", {"base", "client"}},
+        {"serve", {"base", "transport"}},
+    };
+    return rooms;
+}
+
+std::vector<std::string> roomViolations(const std::string& room, const std::string& source)
+{
+    std::vector<std::string> result;
+    for (const Include& include : includesOf(source)) {
+        const std::string other = include.name.substr(0, include.name.find('/'));
+        if (other == room || programRooms().count(other) == 0) continue; // its own, or none of the program's
+        if (programRooms().at(room).count(other) == 0) result.push_back(room + " includes " + include.name);
+    }
+    return result;
+}
+
+TEST(ProgramRooms, NoFileOfTheProgramIncludesARoomThatItsOwnMayNot)
+{
+    std::map<std::string, unsigned> files;
+    const std::filesystem::path root = QEL_SOURCE_DIR "/tools/qel";
+    for (const auto& entry : std::filesystem::recursive_directory_iterator(root)) {
+        const std::filesystem::path name = entry.path().lexically_relative(root);
+        const bool isSource = name.extension() == ".hpp" || name.extension() == ".cpp";
+        if (!isSource || name == "main.cpp") continue; // it knows every command
+        const std::string room = name.begin()->string();
+        ASSERT_EQ(programRooms().count(room), 1U) << name << " stands in no room";
+        ++files[room];
+        std::ifstream stream(entry.path());
+        std::ostringstream text;
+        text << stream.rdbuf();
+        EXPECT_THAT(roomViolations(room, text.str()), IsEmpty()) << name;
+    }
+    for (const auto& [room, allowed] : programRooms())
+        EXPECT_GT(files[room], 2U) << room;
+}
+
+TEST(ProgramRooms, ARoomThatMayNotBeIncludedIsFound)
+{
+    EXPECT_THAT(roomViolations("serve", "#include \"base/Text.hpp\"\n#include \"client/ConnectOptions.hpp\"\n"
+                                        "#include \"serve/Server.hpp\"\n#include <qel/common/net/Socket.hpp>\n"),
+                ElementsAre("serve includes client/ConnectOptions.hpp"));
+    EXPECT_THAT(roomViolations("base", "#include \"transport/PeerPins.hpp\"\n"),
+                ElementsAre("base includes transport/PeerPins.hpp"));
 }
 
 } // namespace

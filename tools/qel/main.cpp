@@ -1,10 +1,10 @@
-#include "BenchCommand.hpp"
-#include "CaCommand.hpp"
-#include "CallCommand.hpp"
-#include "ConsoleCommand.hpp"
-#include "DecodeCommand.hpp"
-#include "Program.hpp"
-#include "ServeCommand.hpp"
+#include "base/Program.hpp"
+#include "bench/BenchCommand.hpp"
+#include "certificates/CaCommand.hpp"
+#include "client/CallCommand.hpp"
+#include "console/ConsoleCommand.hpp"
+#include "decode/DecodeCommand.hpp"
+#include "serve/ServeCommand.hpp"
 
 int main(int argc, char** argv)
 {

@@ -1,0 +1,158 @@
+#include <qel/common/QelDebug.hpp>
+#include <qel/common/Utilities.hpp>
+#include <qel/common/util/PosixError.hpp>
+
+#include "base/Logging.hpp"
+#include "support/CapturedLog.hpp"
+#include "support/TemporaryDirectory.hpp"
+
+#include <gmock/gmock.h>
+#include <sys/stat.h>
+
+namespace qel::test {
+
+namespace {
+
+using ::testing::ElementsAre;
+using ::testing::HasSubstr;
+using ::testing::IsEmpty;
+using ::testing::Not;
+using ::testing::StrEq;
+using ::testing::ThrowsMessage;
+using tool::LogOptions;
+
+class LoggingTest : public ::testing::Test {
+protected:
+    LoggingTest() { QelDebug::globals().resetLoggers(); }
+    ~LoggingTest() override { QelDebug::globals().resetLoggers(); }
+
+    const TemporaryDirectory directory;
+};
+
+TEST_F(LoggingTest, LinesOfTheProgramAreToldFromTheLibrarys)
+{
+    CapturedLog log(LogLevel::Info);
+    tool::logLine(LogLevel::Debug, "hidden");
+    tool::logLine(LogLevel::Info, "shown ", 1);
+    EXPECT_THAT(log.lines(), ElementsAre("I: [qel] shown 1"));
+}
+
+TEST_F(LoggingTest, AQuietCommandLogsNothingUnlessAsked)
+{
+    LogOptions options;
+    options.quiet = true;
+    tool::startLogging(options, "name.log");
+    EXPECT_THAT(QelLogger::get().getBackends(), IsEmpty());
+    options.level = "debug";
+    tool::startLogging(options, "name.log");
+    EXPECT_EQ(QelLogger::get().getBackends().size(), 1U);
+    EXPECT_EQ(QelLogger::get().getEffectiveLevel(), LogLevel::Debug);
+}
+
+TEST_F(LoggingTest, WithADirectoryTheLogIsAFile)
+{
+    LogOptions options;
+    options.directory = directory.path();
+    tool::startLogging(options, "name.log");
+    tool::logLine(LogLevel::Info, "in the file");
+    tool::logLine(LogLevel::Debug, "not in the file");
+    const std::string text = Utilities::readFile(directory.file("name.log"));
+    EXPECT_THAT(text, HasSubstr("[qel] in the file\n"));
+    EXPECT_THAT(text, Not(HasSubstr("not in the file")));
+}
+
+TEST_F(LoggingTest, AFileThatCannotBeWrittenIsAFailure)
+{
+    const std::string path = directory.file("name.log");
+    ASSERT_EQ(::mkdir(path.c_str(), 0700), 0);
+    LogOptions options;
+    options.directory = directory.path();
+    EXPECT_THAT([&] { tool::startLogging(options, "name.log"); },
+                ThrowsMessage<FileIOError>(StrEq("cannot write the log " + path + ": 21 (Is a directory)")));
+}
+
+TEST_F(LoggingTest, WithoutADirectoryTheLogIsStandardError)
+{
+    LogOptions options;
+    options.level = "error";
+    tool::startLogging(options, "name.log");
+    ::testing::internal::CaptureStderr();
+    tool::logLine(LogLevel::Error, "to be seen");
+    tool::logLine(LogLevel::Warn, "not to be seen");
+    const std::string text = ::testing::internal::GetCapturedStderr();
+    EXPECT_THAT(text, HasSubstr("(E): [qel] to be seen\n"));
+    EXPECT_THAT(text, Not(HasSubstr("not to be seen")));
+}
+
+struct Case {
+    std::vector<std::string> arguments;
+    bool good;
+};
+
+TEST_F(LoggingTest, TheOptionsAreChecked)
+{
+    const std::vector<Case> cases{
+        {{}, true},
+        {{"--log-level", "WARN"}, true},
+        {{"--log-level", "0"}, true},
+        {{"--log-level", "loud"}, false},
+        {{"--log-level", "c"}, true},
+        {{"--log-level", "4"}, true},
+        {{"--log-level", "5"}, false},
+        {{"--log-level", "1x"}, false},
+        {{"--log-level", "03"}, false},
+        {{"--log-level", " 3"}, false},
+        {{"--log-level", ""}, false},
+        {{"--log-level", "-1"}, false},
+        {{"--log-level", "^"}, false},
+        {{"--log-level", "inherit"}, false},
+        {{"--log-dir", directory.path()}, true},
+        {{"--log-dir", directory.file("missing")}, false},
+        {{"--log-size", "4096"}, true},
+        {{"--log-size", "4095"}, false},
+    };
+    for (const Case& entry : cases) {
+        SCOPED_TRACE(CLI::detail::join(entry.arguments, " "));
+        LogOptions options;
+        CLI::App app;
+        tool::addLogOptions(app, options);
+        bool good = true;
+        try {
+            app.parse(std::vector<std::string>(entry.arguments.rbegin(), entry.arguments.rend()));
+        } catch (const CLI::ParseError&) {
+            good = false;
+        }
+        EXPECT_EQ(good, entry.good);
+    }
+}
+
+TEST_F(LoggingTest, TheHelpSaysWhatIsLoggedWithoutTheOptions)
+{
+    LogOptions loud;
+    CLI::App loudApp;
+    tool::addLogOptions(loudApp, loud);
+    EXPECT_EQ(loudApp.get_option("--log-level")->get_description(),
+              "Write lines of this level and above: debug, info, warn, error or critical; info unless given");
+    LogOptions quiet;
+    quiet.usual = LogLevel::Warn;
+    quiet.quiet = true;
+    CLI::App quietApp;
+    tool::addLogOptions(quietApp, quiet);
+    EXPECT_EQ(quietApp.get_option("--log-level")->get_description(),
+              "Write lines of this level and above: debug, info, warn, error or critical; nothing is written unless "
+              "this or --log-dir is given, then warn");
+}
+
+TEST_F(LoggingTest, WithADirectoryAQuietCommandLogsFromItsUsualLevelOn)
+{
+    LogOptions options;
+    options.quiet = true;
+    options.usual = LogLevel::Warn;
+    options.directory = directory.path();
+    tool::startLogging(options, "name.log");
+    EXPECT_EQ(QelLogger::get().getEffectiveLevel(), LogLevel::Warn);
+}
+
+} // namespace
+
+} // namespace qel::test

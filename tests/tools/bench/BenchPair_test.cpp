@@ -1,0 +1,114 @@
+#include <qel/common/QelMessageDax.hpp>
+#include <qel/common/QelMessageInterfaceComponent.hpp>
+
+#include "base/Failures.hpp"
+#include "bench/BenchPair.hpp"
+#include "tools/bench/FakeBenchPair.hpp"
+
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+
+namespace qel::test {
+
+namespace {
+
+using ::testing::Each;
+using ::testing::StrEq;
+using ::testing::ThrowsMessage;
+using tool::CommandFailure;
+using tool::RequestRefused;
+
+class BenchPairTest : public ::testing::Test, protected FakeBenchPair {
+protected:
+    const QelMessageDaxBroadcastReq& request(const FakeHypervisorEnd& end, std::size_t number) const
+    {
+        return dynamic_cast<const QelMessageDaxBroadcastReq&>(*end.received.at(number));
+    }
+};
+
+TEST_F(BenchPairTest, TheyTakeTurns)
+{
+    for (int i = 0; i < 3; ++i)
+        pair->exchange();
+    ASSERT_EQ(first->received.size(), 2U);
+    ASSERT_EQ(second->received.size(), 1U);
+    EXPECT_EQ(request(*first, 0).getToolId(), "two");
+    EXPECT_EQ(request(*second, 0).getToolId(), "one");
+    EXPECT_NE(request(*first, 0).getCallerId(), request(*first, 1).getCallerId());
+}
+
+TEST_F(BenchPairTest, AMessageIsABroadcastToTheOtherOneAlone)
+{
+    pair->exchange();
+    const QelMessageDaxBroadcastReq& sent = request(*first, 0);
+    EXPECT_EQ(sent.getBroadcastMode(), 1U);
+    EXPECT_EQ(sent.getToolType(), 9U);
+    EXPECT_EQ(sent.getBroadcastMsgLen(), 300U);
+}
+
+TEST_F(BenchPairTest, EachMessageHasItsTimeAtBothEnds)
+{
+    pair->exchange();
+    pair->exchange();
+    for (const FakeHypervisorEnd* end : {first, second}) {
+        EXPECT_EQ(end->readDeadlines.size(), 2U);
+        EXPECT_THAT(end->readDeadlines, Each(std::chrono::milliseconds(1234)));
+        EXPECT_THAT(end->writeDeadlines, Each(std::chrono::milliseconds(1234)));
+    }
+}
+
+TEST_F(BenchPairTest, BroadcastsOfOthersInBetweenDoNotCount)
+{
+    second->push(QelMessageDaxBroadcastOutboundAsync(1, 9, "three", "x"));
+    second->push(QelMessageDaxBroadcastOutboundAsync(1, 8, "one", "x"));
+    first->push(QelMessageDaxBroadcastOutboundAsync(1, 9, "three", "x"));
+    EXPECT_NO_THROW(pair->exchange());
+}
+
+TEST_F(BenchPairTest, AMessageThatDoesNotArriveIsWaitedFor)
+{
+    first->onMessage = [this](const QelMessage& message) { first->grant(message); };
+    EXPECT_THAT([this] { pair->exchange(); }, ThrowsMessage<StreamIOException>(StrEq("I/O deadline")));
+}
+
+TEST_F(BenchPairTest, AMessageThatArrivesChangedIsNoAnswer)
+{
+    first->onMessage = [this](const QelMessage& message) {
+        first->grant(message);
+        second->push(QelMessageDaxBroadcastOutboundAsync(300, 9, "one", std::string(300, 'x').data()));
+    };
+    EXPECT_THAT([this] { pair->exchange(); },
+                ThrowsMessage<CommandFailure>(StrEq("a message did not arrive as it was sent")));
+}
+
+TEST_F(BenchPairTest, AMessageThatArrivesShortIsNoAnswer)
+{
+    first->onMessage = [this](const QelMessage& message) {
+        first->grant(message);
+        second->push(QelMessageDaxBroadcastOutboundAsync(299, 9, "one", request(*first, 0).getDaxPacket()));
+    };
+    EXPECT_THAT([this] { pair->exchange(); },
+                ThrowsMessage<CommandFailure>(StrEq("a message did not arrive as it was sent")));
+}
+
+TEST_F(BenchPairTest, ARefusalEndsIt)
+{
+    first->onMessage = [this](const QelMessage& message) { first->respond(message, QelMessageStatusCmdFailed); };
+    EXPECT_THAT([this] { pair->exchange(); },
+                ThrowsMessage<RequestRefused>(StrEq("broadcast refused: 0x00000006 (QelMessageStatusCmdFailed)")));
+}
+
+TEST_F(BenchPairTest, AHypervisorThatClosesIsNoticedAtEitherEnd)
+{
+    second->push(QelMessageKrogConnectionClosedAsync());
+    EXPECT_THAT([this] { pair->exchange(); },
+                ThrowsMessage<CommandFailure>(StrEq("the hypervisor closed the connection")));
+    second->push(QelMessageKrogConnectionClosedAsync());
+    second->onMessage = [this](const QelMessage& message) { second->grant(message); };
+    EXPECT_THAT([this] { pair->exchange(); },
+                ThrowsMessage<CommandFailure>(StrEq("the hypervisor closed the connection")));
+}
+
+} // namespace
+
+} // namespace qel::test

@@ -1,0 +1,70 @@
+#include "base/Answer.hpp"
+
+#include <qel/common/StreamFormatters.hpp>
+
+#include "base/Text.hpp"
+
+#include <algorithm>
+
+namespace qel::tool {
+
+namespace {
+
+std::string asText(const nlohmann::ordered_json& value)
+{
+    return value.is_string() ? value.get<std::string>() : value.dump();
+}
+
+} // namespace
+
+void Answer::add(const std::string& key, const std::string& label, nlohmann::ordered_json value)
+{
+    mLines.emplace_back(label, asText(value));
+    mJson[key] = std::move(value);
+}
+
+void Answer::addText(const std::string& key, const std::string& label, const std::string& bytes)
+{
+    mLines.emplace_back(label, printable(bytes));
+    mJson[key] = bytes;
+}
+
+void Answer::addForPrograms(const std::string& key, nlohmann::ordered_json value) { mJson[key] = std::move(value); }
+
+void Answer::print(std::ostream& os) const
+{
+    std::size_t width = 0;
+    for (const auto& line : mLines)
+        width = std::max(width, line.first.size());
+    for (const auto& line : mLines) {
+        os << line.first << ":" << std::string(width - line.first.size() + 1, ' ') << line.second << "\n";
+    }
+}
+
+nlohmann::ordered_json jsonHead(const std::string& request, QelMessageStatusCodes status, unsigned short statusDetail)
+{
+    nlohmann::ordered_json head;
+    head["request"] = request;
+    head["status"] = static_cast<unsigned int>(status);
+    head["statusName"] = statusName(status);
+    head["statusDetail"] = statusDetail;
+    return head;
+}
+
+std::string statusName(QelMessageStatusCodes status)
+{
+    // The library prints a status as "0x00000004 (name)".
+    const std::string text = toString(status);
+    const std::size_t open = text.find('(');
+    const std::size_t close = text.rfind(')');
+    if (open == std::string::npos || close == std::string::npos || close < open) return text;
+    return text.substr(open + 1, close - open - 1);
+}
+
+void printJson(std::ostream& os, const nlohmann::ordered_json& document)
+{
+    constexpr int kIndent = 2;
+    os << document.dump(kIndent, ' ', false, nlohmann::ordered_json::error_handler_t::replace) << "\n";
+}
+
+} // namespace qel::tool

@@ -1,0 +1,116 @@
+#include "base/Logging.hpp"
+
+#include <qel/common/LogBackendFiltered.hpp>
+#include <qel/common/LogBackendRotating.hpp>
+#include <qel/common/Utilities.hpp>
+#include <qel/common/util/PosixError.hpp>
+
+#include "base/OptionChecks.hpp"
+#include "base/TerminalMode.hpp"
+#include "base/UniqueFd.hpp"
+
+#include <cctype>
+#include <cerrno>
+#include <cstdio>
+#include <exception>
+#include <fcntl.h>
+#include <memory>
+#include <sstream>
+#include <unistd.h>
+
+namespace qel::tool {
+
+namespace {
+
+/// Lines to standard error: standard output belongs to what the commands print.
+class LogBackendStderr final : public LogBackendFiltered {
+public:
+    LogBackendStderr() : LogBackendFiltered(LogLevel::Inherit) {}
+
+private:
+    void pLog(const std::string& line) override
+    {
+        // One call a line, so that lines stay whole beside those of other processes on the same terminal.
+        const std::string whole = line + lineEndOf(STDERR_FILENO);
+        static_cast<void>(std::fwrite(whole.data(), 1, whole.size(), stderr));
+    }
+};
+
+/// Stricter than the library, which takes a text that begins with a number, and the level of a parent for a level.
+bool isLevel(const std::string& text)
+{
+    try {
+        const LogLevel::Level level = LogLevel::parse(text);
+        const bool isName = std::isalpha(static_cast<unsigned char>(text.front())) != 0;
+        return level != LogLevel::Inherit && (isName || text.size() == 1);
+    } catch (const std::exception&) {
+        return false;
+    }
+}
+
+std::string checkLevel(std::string& text)
+{
+    return isLevel(text) ? std::string() : "'" + text + "' is no log level: debug, info, warn, error or critical";
+}
+
+std::string describeLevels(const LogOptions& options)
+{
+    const std::string usual = Utilities::lowercase(LogLevel::getName(options.usual));
+    return "Write lines of this level and above: debug, info, warn, error or critical; " +
+           (options.quiet ? "nothing is written unless this or --log-dir is given, then " + usual
+                          : usual + " unless given");
+}
+
+/// The back-end drops its lines without a word when it cannot open its file; whoever wants a log wants to know that.
+void requireWritable(const std::string& path)
+{
+    const UniqueFd file(::open(path.c_str(), O_WRONLY | O_APPEND | O_NONBLOCK | O_CLOEXEC));
+    const PosixErrorCode error = errno;
+    if (file.get() < 0) throw FileIOError(error, "cannot write the log " + path);
+}
+
+} // namespace
+
+void addLogOptions(CLI::App& app, LogOptions& options)
+{
+    app.add_option("--log-dir", options.directory,
+                   "Write the log to files in this directory, five of them at most; without it, to standard error")
+        ->type_name("DIR")
+        ->check(CLI::Validator(CLI::ExistingDirectory).description(""));
+    app.add_option("--log-level", options.level, describeLevels(options))
+        ->type_name("LEVEL")
+        ->check(CLI::Validator(checkLevel, ""));
+    app.add_option("--log-size", options.fileBytes, "Bytes that one log file may hold")
+        ->type_name("BYTES")
+        ->transform(wholeNumberBetween(4096, std::uint64_t{1} << 40))
+        ->capture_default_str();
+}
+
+void startLogging(const LogOptions& options, const std::string& name)
+{
+    if (options.quiet && options.directory.empty() && options.level.empty()) return;
+    QelLogger::get().setLevel(options.level.empty() ? options.usual : LogLevel::parse(options.level));
+    if (options.directory.empty()) {
+        LogBackend::registerBackend(std::make_shared<LogBackendStderr>());
+    } else {
+        LogBackend::registerBackend(
+            std::make_shared<LogBackendRotating>(LogLevel::Inherit, options.directory, name, options.fileBytes));
+        requireWritable(options.directory + "/" + name);
+    }
+}
+
+void logLines(LogLevel::Level level, const std::string& text)
+{
+    std::istringstream lines(text);
+    for (std::string line; std::getline(lines, line);)
+        logLine(level, line);
+}
+
+QelLogger& programLogger()
+{
+    // Loggers live as long as the process; looking this one up by name each time would take the registry's lock.
+    static QelLogger& logger = QelLogger::get("qel");
+    return logger;
+}
+
+} // namespace qel::tool

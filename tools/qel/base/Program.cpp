@@ -1,0 +1,89 @@
+#include "base/Program.hpp"
+
+#include "base/Failures.hpp"
+
+#include <cerrno>
+#include <cstdio>
+#include <exception>
+#include <fcntl.h>
+#include <iostream>
+#include <string>
+#include <unistd.h>
+
+namespace qel::tool {
+
+namespace {
+
+constexpr const char* kVersionText = "qel " QEL_PROGRAM_VERSION;
+
+ExitStatus report(const std::exception& error)
+{
+    std::cerr << "qel: " << complain(error) << std::endl;
+    return exitStatusOf(error);
+}
+
+ExitStatus parseAndRun(CLI::App& app, Action& action, int argc, const char* const* argv)
+{
+    try {
+        app.parse(argc, argv);
+    } catch (const CLI::ParseError& error) {
+        // The parser knows many ways to be wrong and the text for each; all of them are one exit status.
+        if (app.exit(error) != 0) return ExitStatus::Usage;
+        flushOutput(); // the help or the version
+        return ExitStatus::Done;
+    }
+    const ExitStatus status = action ? action() : ExitStatus::Usage;
+    flushOutput();
+    return status;
+}
+
+} // namespace
+
+void addStandardFlags(CLI::App& app)
+{
+    app.set_help_flag("-h,--help", "Print this help and exit");
+    app.set_version_flag("--version", kVersionText);
+}
+
+void addJsonOption(CLI::App& app, bool& json)
+{
+    app.add_flag("--json", json, "Print one JSON document instead of text for people");
+}
+
+CLI::App& addCommand(CLI::App& parent, const char* name, const char* description)
+{
+    CLI::App* const command = parent.add_subcommand(name, description);
+    addStandardFlags(*command);
+    return *command;
+}
+
+int runProgram(CLI::App& app, Action& action, int argc, const char* const* argv) noexcept
+{
+    reserveStandardDescriptors();
+    ExitStatus status = ExitStatus::Failed;
+    try {
+        status = parseAndRun(app, action, argc, argv);
+    } catch (const std::exception& error) {
+        status = report(error);
+    }
+    return static_cast<int>(status);
+}
+
+void reserveStandardDescriptors() noexcept
+{
+    for (int descriptor = STDIN_FILENO; descriptor <= STDERR_FILENO; ++descriptor) {
+        if (::fcntl(descriptor, F_GETFD) != -1) continue;
+        // The lowest free descriptor is this one. It is opened for what is not done with it, so that using it fails
+        // just as it did before.
+        static_cast<void>(::open("/dev/null", descriptor == STDIN_FILENO ? O_WRONLY : O_RDONLY));
+    }
+}
+
+void flushOutput()
+{
+    std::cout.flush();
+    if (std::cout && std::fflush(stdout) == 0) return;
+    throw CommandFailure(ExitStatus::Failed, "cannot write to standard output");
+}
+
+} // namespace qel::tool

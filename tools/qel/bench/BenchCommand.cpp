@@ -1,0 +1,201 @@
+#include "bench/BenchCommand.hpp"
+
+#include "base/Answer.hpp"
+#include "base/Failures.hpp"
+#include "base/Logging.hpp"
+#include "base/OptionChecks.hpp"
+#include "base/SignalWatch.hpp"
+#include "bench/BenchReport.hpp"
+#include "bench/BenchRun.hpp"
+#include "bench/ProgressBar.hpp"
+#include "client/CallRequests.hpp"
+#include "client/ConnectOptions.hpp"
+
+#include <algorithm>
+#include <csignal>
+#include <initializer_list>
+#include <iostream>
+#include <memory>
+#include <string>
+#include <unistd.h>
+#include <utility>
+#include <vector>
+
+namespace qel::tool {
+
+namespace {
+
+constexpr unsigned int kMostConnections = 254; // a server takes 255 consoles at most
+constexpr std::size_t kLongestToolId = 28;     // of 32, for a dash and the number of the connection
+constexpr double kHighestRate = 1e6;
+constexpr std::uint64_t kMostMessages = 1'000'000'000'000;
+constexpr double kUsualSeconds = 10;
+constexpr double kLongestSeconds = 7 * 24 * 60 * 60;
+
+constexpr std::initializer_list<int> kStopSignals{SIGINT, SIGTERM, SIGHUP};
+constexpr std::chrono::milliseconds kProgressInterval(200);
+constexpr std::chrono::milliseconds kGrace(1000); // for the messages in hand when the run is interrupted
+
+struct BenchOptions {
+    ConnectOptions connect;
+    LogOptions log;
+    unsigned int connections = 2;
+    std::size_t bytes = BenchLoad().bytes;
+    double rate = 0;
+    std::uint64_t count = 0;
+    double seconds = 0;
+    bool json = false;
+};
+
+BenchLoad makeLoad(const BenchOptions& options)
+{
+    BenchLoad load;
+    load.pairs = options.connections / 2;
+    load.bytes = options.bytes;
+    load.rate = options.rate;
+    load.count = options.count;
+    const bool unlimited = options.count == 0 && options.seconds <= 0;
+    const std::chrono::duration<double> time(unlimited ? kUsualSeconds : options.seconds);
+    load.time = std::chrono::duration_cast<std::chrono::nanoseconds>(time);
+    return load;
+}
+
+std::string hint(const CommandFailure& failure)
+{
+    const auto* refusal = dynamic_cast<const RequestRefused*>(&failure);
+    const bool full = refusal != nullptr && refusal->getStatus() == QelMessageStatusTooManyConnections;
+    return full ? "; the server takes no more consoles (--max-consoles)" : "";
+}
+
+/// Connects the console of a number, from 1 on, under a name of its own: two of one name are one to the server.
+BenchConsole connectNumber(const BenchOptions& options, unsigned int number)
+{
+    ConnectOptions own = options.connect;
+    own.identity = completeIdentity(options.connect.identity);
+    own.identity.toolId += "-" + std::to_string(number);
+    try {
+        return {own.identity, connectConsole(own)};
+    } catch (const CommandFailure& failure) {
+        if (failure.getExitStatus() != ExitStatus::Refused) throw;
+        throw CommandFailure(ExitStatus::Refused, "connection " + std::to_string(number) + " of " +
+                                                      std::to_string(options.connections) + ": " + failure.what() +
+                                                      hint(failure));
+    }
+}
+
+std::vector<std::unique_ptr<BenchPair>> connectPairs(const BenchOptions& options)
+{
+    std::vector<std::unique_ptr<BenchPair>> pairs;
+    for (unsigned int number = 1; number < options.connections; number += 2) {
+        BenchConsole first = connectNumber(options, number);
+        BenchConsole second = connectNumber(options, number + 1);
+        pairs.push_back(
+            std::make_unique<BenchPair>(std::move(first), std::move(second), options.bytes, options.connect.timeout()));
+    }
+    return pairs;
+}
+
+void showProgress(ProgressBar& bar, const BenchLoad& load, const BenchRun& run)
+{
+    const double seconds = std::chrono::duration<double>(run.elapsed()).count();
+    const auto done = static_cast<double>(run.done());
+    double fraction = 0;
+    if (load.count > 0) fraction = done / static_cast<double>(load.count);
+    if (load.time.count() > 0) {
+        fraction = std::max(fraction, seconds / std::chrono::duration<double>(load.time).count());
+    }
+    const auto perSecond = static_cast<std::uint64_t>(seconds > 0 ? done / seconds : 0);
+    bar.update(fraction, std::to_string(run.done()) + " messages, " + std::to_string(perSecond) + " a second");
+}
+
+/// Waits for the run to end, or for a signal to end it.
+void watchRun(BenchRun& run, const BenchLoad& load, SignalWatch& signals)
+{
+    ProgressBar bar(STDERR_FILENO);
+    for (;;) {
+        const auto interval = bar.isShown() ? kProgressInterval : PollSet::TIMEOUT_INFINITE;
+        const PollResult result = PollSet{signals.getPollFd(), run.getPollFd()}.wait(interval);
+        if (result.contains(run.getPollFd())) return;
+        if (result.contains(signals.getPollFd())) break;
+        showProgress(bar, load, run);
+    }
+    static_cast<void>(signals.take());
+    run.stop();
+    const PollResult result = PollSet{signals.getPollFd(), run.getPollFd()}.wait(kGrace);
+    if (!result.contains(run.getPollFd())) run.cut();
+}
+
+ExitStatus runBench(const BenchOptions& options, const BenchLoad& load)
+{
+    startLogging(options.log, "qel-bench.log");
+    auto pairs = connectPairs(options);
+    SignalWatch signals(kStopSignals);
+    BenchRun run(std::move(pairs), load);
+    logLine(LogLevel::Info, options.connections, " connections are there, and messages on their way");
+    watchRun(run, load, signals);
+    const BenchFigures figures = run.finish();
+    if (options.json) {
+        printJson(std::cout, reportJson(options.connect.endpoint, load, figures));
+    } else {
+        printReport(std::cout, options.connect.endpoint, load, figures);
+    }
+    flushOutput();
+    while (signals.take() != 0)
+        continue; // one that came when all was over must not end the program as if it had been in time
+    return ExitStatus::Done;
+}
+
+std::string checkEven(std::string& text)
+{
+    unsigned int number = 0;
+    const bool even = CLI::detail::lexical_cast(text, number) && number % 2 == 0;
+    return even ? std::string() : "'" + text + "' is no even number: a console at each end of a message";
+}
+
+void addLoadOptions(CLI::App& command, BenchOptions& options)
+{
+    command.add_option("--connections", options.connections, "Consoles, of which every two send each other messages")
+        ->transform(wholeNumberBetween(2, kMostConnections))
+        ->check(CLI::Validator(checkEven, ""))
+        ->capture_default_str();
+    command.add_option("--size", options.bytes, "Bytes of payload in a message")
+        ->type_name("BYTES")
+        ->transform(wholeNumberBetween(1, kLongestBroadcast))
+        ->capture_default_str();
+    command.add_option("--rate", options.rate, "Messages a second, all connections together; flat out unless given")
+        ->check(numberBetween(0.001, kHighestRate));
+    CLI::Option* const count = command.add_option("--count", options.count, "Messages, all connections together")
+                                   ->transform(wholeNumberBetween(1, kMostMessages));
+    command.add_option("--seconds", options.seconds, "How long to go on; 10 unless this or --count is given")
+        ->check(numberBetween(0.001, kLongestSeconds))
+        ->excludes(count);
+}
+
+} // namespace
+
+CLI::App& addBenchCommand(CLI::App& parent, Action& action)
+{
+    CLI::App& command = addCommand(parent, "bench", "Put load on a hypervisor end and measure how it answers");
+    const auto options = std::make_shared<BenchOptions>();
+    addConnectOptions(command, options->connect);
+    command.get_option("--timeout")->description("Seconds for each connection to be made, and then for each message");
+    command.get_option("--tool-id")
+        ->description(
+            "What the ids begin with that the consoles introduce themselves with, at most 28 bytes; a dash and "
+            "a number follow; qel-<process id> unless given");
+    addLoadOptions(command, *options);
+    addJsonOption(command, options->json);
+    options->log.usual = LogLevel::Warn;
+    options->log.quiet = true;
+    addLogOptions(command, options->log);
+    command.callback([&action, options] {
+        checkTransport(options->connect.transport, options->connect.endpoint);
+        if (options->connect.identity.toolId.size() > kLongestToolId) {
+            throw CLI::ValidationError("--tool-id", "longer than 28 bytes: each connection adds its number");
+        }
+        action = [options] { return runBench(*options, makeLoad(*options)); };
+    });
+    return command;
+}
+
+} // namespace qel::tool

@@ -1,0 +1,207 @@
+#include "client/CallCommand.hpp"
+
+#include "base/Failures.hpp"
+#include "base/Logging.hpp"
+#include "base/OptionChecks.hpp"
+#include "client/CallRequests.hpp"
+#include "client/ClientConnection.hpp"
+#include "client/ConnectOptions.hpp"
+
+#include <functional>
+#include <iostream>
+#include <limits>
+#include <memory>
+#include <string>
+#include <utility>
+
+namespace qel::tool {
+
+namespace {
+
+struct CallOptions {
+    ConnectOptions connect;
+    LogOptions log;
+    bool json = false;
+};
+
+/// The arguments of all requests; each request looks at its own.
+struct RequestArguments {
+    std::string capabilities = std::string(QelCapabilities::size(), '1');
+    std::uint32_t mode = 0;
+    std::string mtms;
+    std::string metadata;
+    std::uint32_t broadcastType = 0;
+    BroadcastAddress address;
+    std::string broadcast;
+};
+
+struct Call {
+    CallOptions options;
+    RequestArguments arguments;
+};
+
+using RequestMaker = std::function<CallRequest(const RequestArguments&)>;
+
+void print(const CallOptions& options, const CallRequest& request, const QelMessage& response)
+{
+    const Answer answer = request.describe(response);
+    if (options.json) {
+        auto document = jsonHead(request.name, response.getStatus(), response.getStatusDetail());
+        document.update(answer.json());
+        printJson(std::cout, document);
+    } else if (answer.json().empty()) {
+        std::cout << "done\n";
+    } else {
+        answer.print(std::cout);
+    }
+}
+
+void printRefusal(const CallRequest& request, const RequestRefused& refusal)
+{
+    auto document = jsonHead(request.name, refusal.getStatus(), refusal.getStatusDetail());
+    document["refused"] = refusal.getStep();
+    printJson(std::cout, document);
+}
+
+std::unique_ptr<QelMessage> callRequest(ClientConnection& connection, const IdentityOptions& identity,
+                                        const CallRequest& request)
+{
+    std::unique_ptr<QelMessage> version = introduce(connection, identity);
+    if (request.message == nullptr) return version;
+    if (request.needsSession) openHypervisorSession(connection);
+    return connection.require(request.name, *request.message);
+}
+
+ExitStatus runCall(const CallOptions& options, const CallRequest& request)
+{
+    startLogging(options.log, "qel-call.log");
+    const auto connection = ClientConnection::connect(options.connect);
+    try {
+        const auto response = callRequest(*connection, options.connect.identity, request);
+        connection->leave();
+        print(options, request, *response);
+        return ExitStatus::Done;
+    } catch (const RequestRefused& refusal) {
+        connection->leave();
+        if (options.json) printRefusal(request, refusal);
+        flushOutput();
+        throw;
+    }
+}
+
+CLI::App& addRequest(CLI::App& command, Action& action, const std::shared_ptr<Call>& call, const char* name,
+                     const char* description, RequestMaker make)
+{
+    CLI::App& request = addCommand(command, name, description);
+    request.fallthrough(); // so that the options of "call" may also stand behind the request
+    request.footer("The options of \"qel call\", such as --connect and --json, may also stand here.");
+    request.callback([&action, call, make = std::move(make)] {
+        checkTransport(call->options.connect.transport, call->options.connect.endpoint);
+        action = [call, make] { return runCall(call->options, make(call->arguments)); };
+    });
+    return request;
+}
+
+CLI::Validator longest(std::size_t bytes)
+{
+    return CLI::Validator(
+        [bytes](std::string& text) {
+            return text.size() <= bytes ? std::string() : "longer than " + std::to_string(bytes) + " bytes";
+        },
+        "");
+}
+
+void addPlainRequests(CLI::App& command, Action& action, const std::shared_ptr<Call>& call)
+{
+    const auto add = [&](const char* name, const char* description, CallRequest (*make)()) {
+        addRequest(command, action, call, name, description, [make](const RequestArguments&) { return make(); });
+    };
+    add("version", "What the hypervisor end is and which interface it speaks", versionRequest);
+    add("limits", "How large commands may be and how many consoles are served", limitsRequest);
+    add("time", "The time of day of the hypervisor end", timeRequest);
+    add("max-sessions", "How many virtual serial sessions there can be", maxSessionsRequest);
+    add("get-mode", "The global mode attribute", getModeRequest);
+    add("get-metadata", "The metadata of the global save area", getMetadataRequest);
+}
+
+void addCapabilities(CLI::App& command, Action& action, const std::shared_ptr<Call>& call)
+{
+    CLI::App& request = addRequest(
+        command, action, call, "capabilities", "Exchange capabilities",
+        [](const RequestArguments& arguments) { return capabilitiesRequest(QelCapabilities(arguments.capabilities)); });
+    request.add_option("bits", call->arguments.capabilities, "What this end offers, bit 0 first; all unless given")
+        ->type_name("BITS")
+        ->check(capabilityValidator());
+}
+
+void addSetMode(CLI::App& command, Action& action, const std::shared_ptr<Call>& call)
+{
+    CLI::App& request = addRequest(command, action, call, "set-mode", "Set the global mode attribute",
+                                   [](const RequestArguments& arguments) {
+                                       return setModeRequest(static_cast<std::uint8_t>(arguments.mode), arguments.mtms);
+                                   });
+    request.add_option("mode", call->arguments.mode, "0 to 255")->required()->transform(wholeNumberBetween(0, 255));
+    request.add_option("mtms", call->arguments.mtms, "Machine type, model and serial")->check(longest(kLongestMtms));
+}
+
+void addSetMetadata(CLI::App& command, Action& action, const std::shared_ptr<Call>& call)
+{
+    CLI::App& request =
+        addRequest(command, action, call, "set-metadata", "Set the metadata of the global save area",
+                   [](const RequestArguments& arguments) { return setMetadataRequest(arguments.metadata); });
+    request.add_option("metadata", call->arguments.metadata, "Any text")->required()->check(longest(kLongestMetadata));
+}
+
+CallRequest makeBroadcast(const RequestArguments& arguments)
+{
+    BroadcastAddress address = arguments.address;
+    address.type = static_cast<std::uint8_t>(arguments.broadcastType);
+    return broadcastRequest(address, arguments.broadcast);
+}
+
+void addBroadcast(CLI::App& command, Action& action, const std::shared_ptr<Call>& call)
+{
+    RequestArguments& arguments = call->arguments;
+    CLI::App& request =
+        addRequest(command, action, call, "broadcast", "Send a text to the other consoles", makeBroadcast);
+    request.add_option("text", arguments.broadcast, "What to send")->required()->check(longest(kLongestBroadcast));
+    CLI::Option* const type =
+        request.add_option("--type", arguments.broadcastType, "Broadcast type; 1 goes to one console alone")
+            ->transform(wholeNumberBetween(0, 255))
+            ->capture_default_str();
+    request.add_option("--to-type", arguments.address.toolType, "Tool type of the console it goes to")
+        ->transform(wholeNumberBetween(0, std::numeric_limits<std::uint32_t>::max()))
+        ->needs(type);
+    request.add_option("--to-id", arguments.address.toolId, "Tool id of the console it goes to")
+        ->needs(type)
+        ->check(longest(32));
+    // The library refuses to build a broadcast to one tool that is not named; on a command line that is bad usage.
+    request.parse_complete_callback([&arguments] {
+        if (arguments.broadcastType == 1 && arguments.address.toolId.empty()) {
+            throw CLI::ValidationError("--type 1", "needs --to-id");
+        }
+    });
+}
+
+} // namespace
+
+CLI::App& addCallCommand(CLI::App& parent, Action& action)
+{
+    CLI::App& command = addCommand(parent, "call", "Send one request to a hypervisor end and print the answer");
+    const auto call = std::make_shared<Call>();
+    addConnectOptions(command, call->options.connect);
+    addJsonOption(command, call->options.json);
+    call->options.log.usual = LogLevel::Warn;
+    call->options.log.quiet = true;
+    addLogOptions(command, call->options.log);
+    command.require_subcommand(1);
+
+    addPlainRequests(command, action, call);
+    addCapabilities(command, action, call);
+    addSetMode(command, action, call);
+    addSetMetadata(command, action, call);
+    addBroadcast(command, action, call);
+    return command;
+}
+
+} // namespace qel::tool

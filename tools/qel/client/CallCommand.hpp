@@ -1,0 +1,11 @@
+#pragma once
+
+#include "base/Program.hpp"
+
+namespace qel::tool {
+
+/// Adds "qel call": sends one request to the hypervisor end and prints the answer.
+/// @param action  set when the command line asks for it
+CLI::App& addCallCommand(CLI::App& parent, Action& action);
+
+} // namespace qel::tool

@@ -1,0 +1,169 @@
+#include "serve/PtyPort.hpp"
+
+#include <qel/common/util/Poll.hpp>
+#include <qel/common/util/PosixError.hpp>
+
+#include <array>
+#include <cerrno>
+#include <csignal>
+#include <cstdlib>
+#include <fcntl.h>
+#include <spawn.h>
+#include <sys/ioctl.h>
+#include <sys/wait.h>
+#include <unistd.h>
+#include <utility>
+
+namespace qel::tool {
+
+namespace {
+
+[[noreturn]] void fail(int error, const char* what) { throw PosixError(error, what); }
+
+void check(int error, const char* what)
+{
+    if (error != 0) fail(error, what);
+}
+
+UniqueFd openMaster()
+{
+    UniqueFd master(::posix_openpt(O_RDWR | O_NOCTTY | O_CLOEXEC));
+    if (master.get() < 0) fail(errno, "cannot open a pseudo-terminal");
+    if (::grantpt(master.get()) != 0) fail(errno, "cannot grant a pseudo-terminal");
+    if (::unlockpt(master.get()) != 0) fail(errno, "cannot unlock a pseudo-terminal");
+    if (::fcntl(master.get(), F_SETFL, O_RDWR | O_NONBLOCK) != 0) fail(errno, "cannot set up a pseudo-terminal");
+    winsize size{};
+    size.ws_row = 24;
+    size.ws_col = 80;
+    if (::ioctl(master.get(), TIOCSWINSZ, &size) != 0) fail(errno, "cannot size a pseudo-terminal");
+    return master;
+}
+
+std::string slaveName(int master)
+{
+    std::array<char, 128> name{};
+    check(::ptsname_r(master, name.data(), name.size()), "cannot name a pseudo-terminal");
+    return name.data();
+}
+
+/// posix_spawn_file_actions_t with an owner.
+struct SpawnActions {
+    SpawnActions() { check(::posix_spawn_file_actions_init(&value), "cannot prepare a command"); }
+    ~SpawnActions() { ::posix_spawn_file_actions_destroy(&value); }
+    SpawnActions(const SpawnActions&) = delete;
+    SpawnActions& operator=(const SpawnActions&) = delete;
+
+    posix_spawn_file_actions_t value{};
+};
+
+/// posix_spawnattr_t with an owner.
+struct SpawnAttributes {
+    SpawnAttributes() { check(::posix_spawnattr_init(&value), "cannot prepare a command"); }
+    ~SpawnAttributes() { ::posix_spawnattr_destroy(&value); }
+    SpawnAttributes(const SpawnAttributes&) = delete;
+    SpawnAttributes& operator=(const SpawnAttributes&) = delete;
+
+    posix_spawnattr_t value{};
+};
+
+void setTerminal(SpawnActions& actions, const std::string& terminal)
+{
+    // The leader of a new session that opens a terminal gets it as its controlling one.
+    constexpr const char* kFailure = "cannot prepare the terminal of a command";
+    check(::posix_spawn_file_actions_addopen(&actions.value, STDIN_FILENO, terminal.c_str(), O_RDWR, 0), kFailure);
+    check(::posix_spawn_file_actions_adddup2(&actions.value, STDIN_FILENO, STDOUT_FILENO), kFailure);
+    check(::posix_spawn_file_actions_adddup2(&actions.value, STDIN_FILENO, STDERR_FILENO), kFailure);
+}
+
+void setSignals(SpawnAttributes& attributes)
+{
+    // This program blocks and ignores signals that a command expects to find as usual.
+    constexpr const char* kFailure = "cannot prepare the signals of a command";
+    constexpr int kFlags = POSIX_SPAWN_SETSID | POSIX_SPAWN_SETSIGMASK | POSIX_SPAWN_SETSIGDEF;
+    sigset_t none;
+    sigset_t all;
+    ::sigemptyset(&none);
+    ::sigfillset(&all);
+    check(::posix_spawnattr_setsigmask(&attributes.value, &none), kFailure);
+    check(::posix_spawnattr_setsigdefault(&attributes.value, &all), kFailure);
+    check(::posix_spawnattr_setflags(&attributes.value, static_cast<short>(kFlags)), kFailure);
+}
+
+/// Starts the command on a terminal; not by fork, after which the child would have a copy of all locks of this program
+/// but only one of its threads.
+pid_t spawn(const std::string& command, const std::string& terminal)
+{
+    SpawnActions actions;
+    SpawnAttributes attributes;
+    setTerminal(actions, terminal);
+    setSignals(attributes);
+    std::string shell = "/bin/sh";
+    std::string option = "-c";
+    std::string text = command;
+    std::array<char*, 4> arguments{shell.data(), option.data(), text.data(), nullptr};
+    pid_t pid = -1;
+    check(::posix_spawn(&pid, shell.c_str(), &actions.value, &attributes.value, arguments.data(), environ),
+          "cannot start a command");
+    return pid;
+}
+
+bool isTransient(int error) { return error == EAGAIN || error == EINTR; }
+
+} // namespace
+
+PtyPort::PtyPort(std::string command, ChildReaper& reaper) : mCommand(std::move(command)), mReaper(reaper) {}
+
+PtyPort::~PtyPort() { stop(); }
+
+void PtyPort::start()
+{
+    if (isRunning()) {
+        if (!pHasCommandEnded()) return;
+        stop();
+    }
+    UniqueFd master = openMaster();
+    mLeader = spawn(mCommand, slaveName(master.get()));
+    mMaster = std::move(master);
+}
+
+bool PtyPort::isRunning() const { return mMaster.get() >= 0; }
+
+bool PtyPort::hasHungUp() const { return PollSet(PollFd(mMaster.get(), PollEvents::Error)).poll().anyReady(); }
+
+SerialPort::ReadResult PtyPort::read(char* buffer, std::size_t length)
+{
+    const ssize_t count = ::read(mMaster.get(), buffer, length);
+    const int error = errno;
+    if (count > 0) return {LineState::Data, static_cast<std::size_t>(count)};
+    if (count < 0 && isTransient(error)) return {LineState::Idle, 0};
+    return {LineState::Ended, 0}; // EIO once the other side is closed and empty
+}
+
+std::size_t PtyPort::write(const char* data, std::size_t length)
+{
+    const ssize_t count = ::write(mMaster.get(), data, length);
+    const int error = errno;
+    if (count >= 0) return static_cast<std::size_t>(count);
+    if (isTransient(error)) return 0;
+    throw PosixError(error, "cannot write to the serial line");
+}
+
+int PtyPort::descriptor() const { return mMaster.get(); }
+
+void PtyPort::stop()
+{
+    mMaster.reset(); // hangs up
+    if (mLeader > 0) mReaper.adopt(mLeader);
+    mLeader = -1;
+}
+
+bool PtyPort::pHasCommandEnded()
+{
+    if (mLeader < 0) return true;
+    // An error means that it is gone as well: the system has reaped it, as it does where SIGCHLD is ignored.
+    if (::waitpid(mLeader, nullptr, WNOHANG) == 0) return false;
+    mLeader = -1;
+    return true;
+}
+
+} // namespace qel::tool

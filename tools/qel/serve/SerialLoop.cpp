@@ -1,0 +1,57 @@
+#include "serve/SerialLoop.hpp"
+
+#include "base/Failures.hpp"
+#include "base/Logging.hpp"
+
+#include <chrono>
+#include <vector>
+
+namespace qel::tool {
+
+namespace {
+
+/// How often to look after commands that have been asked to end.
+constexpr std::chrono::milliseconds kReapInterval(50);
+
+/// Before the next try when even waiting fails.
+constexpr std::chrono::milliseconds kPauseAfterFailure(100);
+
+} // namespace
+
+SerialLoop::SerialLoop(Hypervisor& hypervisor, ChildReaper& reaper, PollInterrupt& wake)
+    : mHypervisor(hypervisor), mReaper(reaper), mWake(wake), mThread([this] { pRun(); })
+{}
+
+SerialLoop::~SerialLoop()
+{
+    mStopping = true;
+    mWake.interrupt();
+    mThread.join();
+}
+
+void SerialLoop::pRun() noexcept
+{
+    while (!mStopping) {
+        try {
+            pTurn();
+        } catch (const std::exception& error) {
+            logLine(LogLevel::Error, "serial lines: ", explain(error));
+            std::this_thread::sleep_for(kPauseAfterFailure);
+        }
+    }
+}
+
+void SerialLoop::pTurn()
+{
+    const std::vector<SerialWatch> watches = mHypervisor.serialWatches();
+    PollSet set(mWake.getPollFd());
+    for (const SerialWatch& watch : watches)
+        set += watch.fd;
+    const PollResult result = set.wait(mReaper.reap() ? kReapInterval : PollSet::TIMEOUT_INFINITE);
+    if (result.contains(mWake.getPollFd())) mWake.eoi();
+    for (const SerialWatch& watch : watches) {
+        if (result.contains(watch.fd)) mHypervisor.serviceSerial(watch.partition);
+    }
+}
+
+} // namespace qel::tool

@@ -1,0 +1,38 @@
+#pragma once
+
+#include <qel/common/util/Poll.hpp>
+
+#include "serve/ChildReaper.hpp"
+#include "serve/Hypervisor.hpp"
+
+#include <atomic>
+#include <thread>
+
+namespace qel::tool {
+
+/// The one thread that moves the serial data of all partitions, and reaps the commands that have ended. It waits for
+/// what the hypervisor names, and for the wake-up that says that this has changed.
+/// Thread safety: one thread owns it.
+class SerialLoop {
+public:
+    /// Starts the thread. @param hypervisor, reaper, wake  borrowed; must outlive this object
+    SerialLoop(Hypervisor& hypervisor, ChildReaper& reaper, PollInterrupt& wake);
+
+    /// Stops the thread and waits for it.
+    ~SerialLoop();
+
+    SerialLoop(const SerialLoop&) = delete;
+    SerialLoop& operator=(const SerialLoop&) = delete;
+
+private:
+    void pRun() noexcept;
+    void pTurn();
+
+    Hypervisor& mHypervisor;
+    ChildReaper& mReaper;
+    PollInterrupt& mWake;
+    std::atomic<bool> mStopping{false};
+    std::thread mThread;
+};
+
+} // namespace qel::tool
