@@ -551,6 +551,23 @@ TEST(Console, HelpTellsHowToLeave)
     EXPECT_THAT(runQel({"--help"}).output, HasSubstr("\n  console "));
 }
 
+TEST(Console, WhatCannotBeTheEscapeCharacterIsToldWhy)
+{
+    const Arguments good{"console", "--connect", "127.0.0.1:1", "--plain", "1", "--escape"};
+    const auto said = [&](const std::string& escape) {
+        Arguments arguments = good;
+        arguments.push_back(escape);
+        const auto result = runQel(arguments);
+        EXPECT_EQ(result.exitStatus, 2);
+        return result.errors;
+    };
+    const std::string forms = "one character, ^ and another from @ to _ for a control character, none\n";
+    for (const char* text : {"ab", " ", "^?", "^`"}) {
+        EXPECT_THAT(said(text), HasSubstr("'" + std::string(text) + "' is none of these: " + forms));
+    }
+    EXPECT_THAT(said("^Z"), HasSubstr("'^Z' has a meaning behind the escape\n"));
+}
+
 TEST(Console, AnythingThatCannotBeCarriedOutIsUsage)
 {
     const Arguments good{"console", "--connect", "127.0.0.1:1", "--plain"};

@@ -53,13 +53,18 @@ struct ConsoleOptions {
     ConsoleManners manners() const;
 };
 
-/// "none", a character, or "^" and the letter of a control character.
+/// "^" and the character that a control character is typed with, "^[" for escape.
+bool isControlText(const std::string& text)
+{
+    return text.size() == 2 && text[0] == '^' && text[1] >= '@' && text[1] <= '_';
+}
+
+/// "none", a character, or "^" and the one of a control character.
 std::optional<char> parseEscape(const std::string& text)
 {
     if (text == "none") return std::nullopt;
     constexpr int kControlBits = 0x1F;
-    const bool isControl = text.size() == 2 && text[0] == '^' && text[1] >= '@' && text[1] <= '_';
-    if (isControl) return static_cast<char>(text[1] & kControlBits);
+    if (isControlText(text)) return static_cast<char>(text[1] & kControlBits);
     return text.at(0);
 }
 
@@ -67,8 +72,10 @@ std::string checkEscape(std::string& text)
 {
     if (text == "none") return {};
     const bool isPrintable = text.size() == 1 && text[0] > ' ' && text[0] < '\x7F';
-    const bool isControl = text.size() == 2 && text[0] == '^' && text[1] >= '@' && text[1] <= '_';
-    if (!isPrintable && !isControl) return "is none, one character, or ^ and a capital letter for a control character";
+    if (!isPrintable && !isControlText(text)) {
+        return "'" + text +
+               "' is none of these: one character, ^ and another from @ to _ for a control character, none";
+    }
     if (EscapeFilter::isCommandCharacter(*parseEscape(text))) return "'" + text + "' has a meaning behind the escape";
     return {};
 }
