@@ -240,23 +240,58 @@ TEST(IncludeFloorsCheck, RefusesATableThatContradictsItself)
     EXPECT_THROW(parseTable("ground low\n"), std::invalid_argument);
 }
 
-// The program's rooms are its folders. What each may include beside itself:
+// The program's rooms are its folders. What each may include beside itself stands in docs/architecture.md, in the rows
+// of a table:  | `client/` | what is in it | `base`, `transport` |
 
 using Rooms = std::map<std::string, std::set<std::string>>;
 
+/// The words between backticks.
+std::vector<std::string> quotedWords(const std::string& text)
+{
+    std::vector<std::string> words;
+    std::istringstream parts(text);
+    bool isQuoted = false;
+    for (std::string part; std::getline(parts, part, '`'); isQuoted = !isQuoted)
+        if (isQuoted) words.push_back(part);
+    return words;
+}
+
+Rooms parseRooms(std::istream& document)
+{
+    Rooms rooms;
+    bool isTable = false;
+    for (std::string line; std::getline(document, line);) {
+        if (startsWith(line, "## ")) isTable = line == "## The program's rooms";
+        if (!isTable || !startsWith(line, "| `")) continue;
+        const std::string name = quotedWords(line).front();
+        if (name.back() != '/') continue; // the head of the table
+        const std::size_t end = line.rfind('|');
+        const std::vector<std::string> allowed = quotedWords(line.substr(line.rfind('|', end - 1), end));
+        rooms[name.substr(0, name.size() - 1)] = std::set<std::string>(allowed.begin(), allowed.end());
+    }
+    return rooms;
+}
+
 const Rooms& programRooms()
 {
-    static const Rooms rooms{
-        {"base", {}},
-        {"decode", {"base"}},
-        {"certificates", {"base"}},
-        {"transport", {"base", "certificates"}},
-        {"client", {"base", "transport"}},
-        {"console", {"base", "client"}},
-        {"bench", {"base", "client"}},
-        {"serve", {"base", "transport"}},
-    };
+    static const Rooms rooms = [] {
+        std::ifstream document(QEL_SOURCE_DIR "/docs/architecture.md");
+        if (!document) throw std::runtime_error("architecture.md cannot be read");
+        return parseRooms(document);
+    }();
     return rooms;
+}
+
+TEST(ProgramRooms, AreReadFromTheirTableAlone)
+{
+    std::istringstream document("| `other/` | of another table | `low` |\n"
+                                "## The program's rooms\n"
+                                "| Folder of `tools/qel/` | What is in it | May include |\n|---|---|---|\n"
+                                "| `low/` | texts; `qel low` | |\n"
+                                "| `high/` | the rest | `low`, `middle` |\n"
+                                "## The next\n"
+                                "| `later/` | of a later table | |\n");
+    EXPECT_EQ(parseRooms(document), (Rooms{{"low", {}}, {"high", {"low", "middle"}}}));
 }
 
 std::vector<std::string> roomViolations(const std::string& room, const std::string& source)
@@ -286,8 +321,12 @@ TEST(ProgramRooms, NoFileOfTheProgramIncludesARoomThatItsOwnMayNot)
         text << stream.rdbuf();
         EXPECT_THAT(roomViolations(room, text.str()), IsEmpty()) << name;
     }
-    for (const auto& [room, allowed] : programRooms())
+    ASSERT_FALSE(files.empty());
+    for (const auto& [room, allowed] : programRooms()) {
         EXPECT_GT(files[room], 2U) << room;
+        for (const std::string& other : allowed)
+            EXPECT_EQ(programRooms().count(other), 1U) << other << " is no room";
+    }
 }
 
 TEST(ProgramRooms, ARoomThatMayNotBeIncludedIsFound)

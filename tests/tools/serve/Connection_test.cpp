@@ -72,6 +72,19 @@ protected:
     }
 
     Loopback loopback;
+    /// Sends many requests before it takes the first answer.
+    void expectAnswersInOrder()
+    {
+        std::vector<unsigned int> asked;
+        for (int i = 0; i < 100; ++i) {
+            const QelMessageGetInterfaceLimitsReq request;
+            asked.push_back(request.getCallerId());
+            messages.send(request);
+        }
+        for (const unsigned int callerId : asked)
+            EXPECT_EQ(messages.receive()->getCallerId(), callerId);
+    }
+
     LoopbackMessages messages{*loopback.near};
     std::promise<void> ended;
     std::unique_ptr<Connection> connection; // gone before what it borrows
@@ -81,14 +94,7 @@ TEST_F(ConnectionTest, RequestsAreAnsweredInOrder)
 {
     start();
     identify();
-    std::vector<unsigned int> asked;
-    for (int i = 0; i < 100; ++i) {
-        const QelMessageGetInterfaceLimitsReq request;
-        asked.push_back(request.getCallerId());
-        messages.send(request);
-    }
-    for (const unsigned int callerId : asked)
-        EXPECT_EQ(messages.receive()->getCallerId(), callerId);
+    expectAnswersInOrder();
 }
 
 TEST_F(ConnectionTest, WhenTheConsoleGoesTheConnectionEnds)
@@ -295,14 +301,7 @@ TEST_F(ConnectionTest, WithTheSmallestQueueThereIsOneMessageAtATime)
     limits.queueBytes = 1;
     start(limits);
     identify();
-    std::vector<unsigned int> asked;
-    for (int i = 0; i < 100; ++i) {
-        const QelMessageGetQelTodReq request;
-        asked.push_back(request.getCallerId());
-        messages.send(request);
-    }
-    for (const unsigned int callerId : asked)
-        EXPECT_EQ(messages.receive()->getCallerId(), callerId);
+    expectAnswersInOrder();
 }
 
 TEST_F(ConnectionTest, AConsoleThatGoesWhileItIsNotReadFromIsNoticed)
