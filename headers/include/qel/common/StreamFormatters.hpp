@@ -2,6 +2,7 @@
 
 #include <qel/common/BCDExtensions.hpp>
 #include <qel/common/EndianExtensions.hpp>
+#include <qel/common/HexWidth.hpp>
 #include <qel/common/QelExport.hpp>
 
 #include <chrono>
@@ -84,17 +85,6 @@ struct PrintableInteger<bcd_uint<T>> {
     using Type = typename PrintableInteger<T>::Type;
     static Type convert(const bcd_uint<T>& value) noexcept { return PrintableInteger<T>::convert(value.value()); }
 };
-
-/// With how many digits, at least, hexFormat() prints a value of type T: two for each byte of T.
-///
-/// This is the place where a type asks for another width, without this header knowing the type. The header that owns
-/// the type specialises it beside the type, in namespace qel:
-/// @code
-/// enum QelMessageStatusCodes : unsigned short { ... };
-/// template <> struct HexWidth<QelMessageStatusCodes> : std::integral_constant<std::size_t, 8> {};
-/// @endcode
-template <typename T>
-struct HexWidth : std::integral_constant<std::size_t, 2 * sizeof(T)> {};
 
 /// What the formatters with a prefix in front of hexadecimal digits share.
 class HexFormatterBase {
