@@ -15,24 +15,27 @@ namespace qel {
 
 namespace {
 
-// Tells a thread that its ids may be stale. Starts at 1, so that a thread's first line finds its generation old.
+// Counts forks, so that a thread can see that its ids may be stale. Starts at 1: the zero-initialised prefix of a new
+// thread is out of date.
 std::atomic<std::uint64_t> sForkGeneration{1};
 
 void noteFork() { sForkGeneration.fetch_add(1, std::memory_order_relaxed); }
 
-/// Has noteFork called after every fork, on both sides of it. @return false if that could not be arranged
+/// Arranges for noteFork to run after every fork, in the parent and in the child.
+/// @return false if that failed
 bool watchForks()
 {
     static const bool sWatching = ::pthread_atfork(nullptr, noteFork, noteFork) == 0;
     return sWatching;
 }
 
-/// The prefix of a thread's latest line. Most lines fall into the same second as the one before and show the same ids,
-/// and breaking down the time and asking for the ids costs several times the rest of the line.
+/// The prefix of a thread's latest line. Most lines share their second and ids with the line before; breaking down the
+/// time and asking for the ids costs several times as much as the rest of the line.
 /// Plain zero-initialised data without a destructor: a thread-local object of this kind needs no guard.
 struct Prefix {
     std::time_t second;
-    std::uint64_t generation; // of the ids; 0 when they must not be used again
+    bool hasTime;             // false if the clock failed
+    std::uint64_t generation; // of the ids; 0 if they must not be reused
     long processId;
     long threadId;
     std::size_t length;
@@ -41,41 +44,59 @@ struct Prefix {
 
 thread_local Prefix tPrefix;
 
-constexpr std::size_t kLevelFromEnd = 4; // the level's letter stands in front of "): "
+constexpr std::size_t kLevelFromEnd = 4; // the level's letter precedes "): "
 
-void compose(Prefix& prefix, std::time_t second, std::uint64_t generation)
+/// Reads the clock in force. A substitute may throw; the line then goes out without a time.
+/// @return whether the clock gave a time
+bool readClock(std::time_t& second) noexcept
+{
+    try {
+        second = std::chrono::system_clock::to_time_t(TimeProvider::system());
+        return true;
+    } catch (...) {
+        return false;
+    }
+}
+
+void compose(Prefix& prefix, std::uint64_t generation)
 {
     if (prefix.generation != generation) {
         prefix.generation = watchForks() ? generation : 0;
         prefix.processId = ::getpid();
         prefix.threadId = ::syscall(SYS_gettid); // glibc before 2.30 has no function for it
     }
-    prefix.second = second;
     char time[64] = "";
     std::tm fields = {};
-    if (::gmtime_r(&second, &fields) != nullptr) std::strftime(time, sizeof(time), "%F %T", &fields);
+    if (prefix.hasTime && ::gmtime_r(&prefix.second, &fields) != nullptr) {
+        std::strftime(time, sizeof(time), "%F %T", &fields);
+    }
     const int length = std::snprintf(prefix.text, sizeof(prefix.text), "[%s] (%ld:%ld) (?): ", time, prefix.processId,
                                      prefix.threadId);
     prefix.length = static_cast<std::size_t>(length); // at most 63 + 2 * 20 + 13, which fits
 }
 
-const Prefix& currentPrefix(LogLevel::Level level)
+const Prefix& currentPrefix(LogLevel::Level level) noexcept
 {
-    const std::time_t second = std::chrono::system_clock::to_time_t(TimeProvider::system());
+    std::time_t second = 0;
+    const bool hasTime = readClock(second);
     const std::uint64_t generation = sForkGeneration.load(std::memory_order_relaxed);
     Prefix& prefix = tPrefix;
-    if (prefix.second != second || prefix.generation != generation) compose(prefix, second, generation);
+    if (prefix.second != second || prefix.hasTime != hasTime || prefix.generation != generation) {
+        prefix.second = second;
+        prefix.hasTime = hasTime;
+        compose(prefix, generation);
+    }
     prefix.text[prefix.length - kLevelFromEnd] = LogLevel::getAbbreviatedName(level);
     return prefix;
 }
 
 } // namespace
 
-QelDebugContext::QelDebugContext(QelLogger& logger, LogLevel::Level level)
+QelDebugContext::QelDebugContext(QelLogger& logger, LogLevel::Level level) noexcept
     : CappedStringStream(kMaxLineBytes), mLogger(logger), mLevel(level)
 {
-    // Streams start with the global locale, whose grouping would print 4.711 into numbers. Comparing is much cheaper
-    // than imbuing, and nearly always the global locale is the classic one.
+    // Streams start with the global locale, whose grouping would turn 4711 into 4.711. Comparing is much cheaper than
+    // imbuing, and the global locale is nearly always the classic one.
     const std::locale& classic = std::locale::classic();
     if (getloc() != classic) imbue(classic);
 

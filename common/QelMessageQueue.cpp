@@ -167,12 +167,7 @@ void QelMessageQueue::shutdown()
     UniqueMutexLock lock(mLock);
     if (mShutdown) return;
     mShutdown = true;
-    try {
-        logLine(LogLevel::Debug, "MQ: Shutdown!");
-    } catch (...) {
-        pWakeEverybody(); // it is shut down all the same, and there is no second call that would do it
-        throw;
-    }
+    logLine(LogLevel::Debug, "MQ: Shutdown!");
 
     mWakings.enter();
     lock.unlock();

@@ -1,20 +1,26 @@
-// How the library itself writes a line to the log: a private function that every line of its own goes through.
+// The private function that writes every log line of the library.
+#include <qel/common/QelMessage.hpp>
+#include <qel/common/QelMessageExceptions.hpp>
 #include <qel/common/StreamFormatters.hpp>
 
 #include "LogLine.hpp"
 #include "support/CapturedLog.hpp"
 #include "support/RecordingLogBackend.hpp"
+#include "support/ThrowingClock.hpp"
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <memory>
 #include <ostream>
+#include <stdexcept>
 
 namespace qel::test {
 namespace {
 
 using ::testing::ElementsAre;
 using ::testing::IsEmpty;
+using ::testing::StrEq;
+using ::testing::ThrowsMessage;
 
 /// Counts how often it is printed.
 class PrintCounter {
@@ -66,6 +72,30 @@ TEST(LogLine, FormatsNothingBelowTheThreshold)
     logLine(LogLevel::Warn, counter);
     EXPECT_EQ(counter.prints(), 1U);
     EXPECT_THAT(log.lines(), ElementsAre("W: counter"));
+}
+
+/// Cannot be printed.
+struct Unprintable {
+    friend std::ostream& operator<<(std::ostream&, const Unprintable&) { throw std::runtime_error("unprintable"); }
+};
+
+TEST(LogLine, APartThatCannotBePrintedEndsTheLine)
+{
+    const CapturedLog log;
+    EXPECT_NO_THROW(logLine(LogLevel::Error, "before ", Unprintable(), " after"));
+    EXPECT_THAT(log.lines(), ElementsAre("E: before "));
+}
+
+TEST(LogLine, AFailingClockDoesNotReplaceTheExceptionThatTheLineBelongsTo)
+{
+    const CapturedLog log;
+    ThrowingClock clock;
+    clock.failAfter(0);
+    const char frame[40] = {};
+    EXPECT_THAT([&] { QelMessage(frame, sizeof(frame)); },
+                ThrowsMessage<QelMessageValidationException>(StrEq("i_buffer bad eyecatcher")));
+    ASSERT_EQ(log.lines().size(), 1U);
+    EXPECT_THAT(log.lines()[0], ::testing::StartsWith("E: bad eyecatcher = "));
 }
 
 } // namespace

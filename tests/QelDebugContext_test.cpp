@@ -6,10 +6,12 @@
 #include <qel/common/util/TimeProvider.hpp>
 
 #include "support/Allocations.hpp"
+#include "support/CalendarFailure.hpp"
 #include "support/CapturedLog.hpp"
 #include "support/GroupingLocale.hpp"
 #include "support/ProcessIdCalls.hpp"
 #include "support/SettableClock.hpp"
+#include "support/ThrowingClock.hpp"
 #include "support/ThrowingLogBackend.hpp"
 #include "support/TimeZoneScope.hpp"
 
@@ -108,14 +110,14 @@ TEST_F(QelDebugContextTest, SendsTheBarePrefixWhenNothingIsWritten)
     EXPECT_THAT(mLog.rawLines(), ElementsAre(kExampleText + idsOfThisThread() + "(W): "));
 }
 
-TEST_F(QelDebugContextTest, TestsNoLevelItself)
+TEST_F(QelDebugContextTest, DoesNotTestTheLevel)
 {
     QelLogger::get().setLevel(LogLevel::Critical);
     QelDebugContext(QelLogger::get(), LogLevel::Debug) << "text";
     EXPECT_THAT(mLog.lines(), ElementsAre("D: text"));
 }
 
-TEST_F(QelDebugContextTest, GoesToTheLoggerItWasGiven)
+TEST_F(QelDebugContextTest, SendsToTheGivenLogger)
 {
     const auto backend = std::make_shared<RecordingLogBackend>();
     QelLogger::get("given").propagate(false).addBackend(backend);
@@ -145,7 +147,7 @@ TEST_F(QelDebugContextTest, StartsEveryLineWithAFreshStream)
     EXPECT_THAT(mLog.lines(), ElementsAre("E: FF", "E: 255"));
 }
 
-TEST_F(QelDebugContextTest, TwoLinesMayBeInTheMaking)
+TEST_F(QelDebugContextTest, OneLineMayBeWrittenWhileAnotherIsOpen)
 {
     {
         QelDebugContext outer(QelLogger::get(), LogLevel::Error);
@@ -221,7 +223,7 @@ TEST_F(QelDebugContextTest, TheTimeIsReadForEachLine)
     expect("2026-03-01 17:04:09");
     mClock.advance(milliseconds(1));
     expect("2026-03-01 17:04:10");
-    mClock.advance(-seconds(10)); // somebody sets the clock back
+    mClock.advance(-seconds(10)); // the clock is set back
     expect("2026-03-01 17:04:00");
     mClock.advance(-seconds(4 * 60 + 1));
     expect("2026-03-01 16:59:59");
@@ -252,7 +254,7 @@ TEST_F(QelDebugContextTest, TheTimeIsUtcWithoutFractionAndZone)
     }
 }
 
-TEST_F(QelDebugContextTest, TheZoneOfTheProcessDoesNotMatter)
+TEST_F(QelDebugContextTest, TheTimeIgnoresTheZoneOfTheProcess)
 {
     const TimeZoneScope zone("XYZ-05:30");
     mClock.advance(seconds(1)); // a second that no line has shown yet
@@ -263,7 +265,7 @@ TEST_F(QelDebugContextTest, TheZoneOfTheProcessDoesNotMatter)
     EXPECT_THAT(mLog.rawLines()[0], StartsWith("[2026-03-01 17:04:10] "));
 }
 
-TEST(QelDebugContext, ShowsTheTimeOfWhicheverClockIsInForce)
+TEST(QelDebugContext, ShowsTheTimeOfTheClockInForce)
 {
     const CapturedLog log;
     const auto timeOfALine = [&log] {
@@ -309,6 +311,36 @@ TEST(QelDebugContext, ReadsTheClockOncePerLine)
     EXPECT_EQ(clock.steadyReads(), 0U);
 }
 
+TEST(QelDebugContext, ATimeThatCannotBeBrokenDownIsLeftOut)
+{
+    const CapturedLog log;
+    SettableClock clock; // a second that no other test has shown
+    clock.setSystem(system_clock::from_time_t(kExampleTime + 86400));
+    {
+        const CalendarFailure failure;
+        QelDebugContext(QelLogger::get(), LogLevel::Error) << "text";
+    }
+    EXPECT_THAT(log.rawLines(), ElementsAre("[] " + idsOfThisThread() + "(E): text"));
+}
+
+TEST(QelDebugContext, AClockThatThrowsLeavesTheTimeOut)
+{
+    const CapturedLog log;
+    ThrowingClock clock; // the epoch, when it works
+    clock.failOnceAfter(1);
+    for (int i = 0; i < 3; ++i) {
+        EXPECT_NO_THROW(QelDebugContext(QelLogger::get(), LogLevel::Error) << i);
+    }
+    clock.failAfter(0);
+    for (int i = 3; i < 5; ++i) {
+        EXPECT_NO_THROW(QelDebugContext(QelLogger::get(), LogLevel::Error) << i);
+    }
+    const std::string rest = idsOfThisThread() + "(E): ";
+    EXPECT_THAT(log.rawLines(),
+                ElementsAre("[1970-01-01 00:00:00] " + rest + "0", "[] " + rest + "1",
+                            "[1970-01-01 00:00:00] " + rest + "2", "[] " + rest + "3", "[] " + rest + "4"));
+}
+
 // The ids
 
 TEST_F(QelDebugContextTest, EachThreadShowsItsOwnId)
@@ -343,7 +375,7 @@ bool holdsInChild(Check check)
 
 bool showsOwnIds() { return lineOfThisThread().find("] " + idsOfThisThread() + "(E): text") != std::string::npos; }
 
-TEST(QelDebugContextFork, AChildShowsItsOwnIdsThoughItsParentHasLogged)
+TEST(QelDebugContextFork, AChildShowsItsOwnIdsAfterItsParentHasLogged)
 {
     const SettableClock clock; // all lines fall into one second, so nothing but the fork renews the prefix
     ASSERT_TRUE(showsOwnIds());
@@ -380,7 +412,7 @@ unsigned processIdCallsOfALine()
     return processIdCalls() - before;
 }
 
-TEST(QelDebugContextFork, IdsAreKeptUntilAForkAndAskedForAgainOnBothSidesOfIt)
+TEST(QelDebugContextFork, IdsAreReusedUntilAForkAndReadAgainInParentAndChild)
 {
     const SettableClock clock;
     const CapturedLog log;
@@ -422,7 +454,7 @@ TEST_F(QelDebugContextTest, AShortLineCostsOneAllocation)
     EXPECT_LE(allocations.count(), 1U);
 }
 
-TEST_F(QelDebugContextTest, WithoutMemoryTheLineIsEmptyAndNothingIsThrown)
+TEST_F(QelDebugContextTest, WithoutMemoryTheLineIsEmpty)
 {
     QEL_TEST_NEEDS_ALLOCATIONS();
     QelDebug::globals().resetLoggers();
@@ -436,7 +468,7 @@ TEST_F(QelDebugContextTest, WithoutMemoryTheLineIsEmptyAndNothingIsThrown)
     }
 }
 
-TEST_F(QelDebugContextTest, AsLongAsThereIsMemoryTheLineIsKeptAndNothingIsThrown)
+TEST_F(QelDebugContextTest, KeepsThePartOfTheLineThatThereIsMemoryFor)
 {
     QEL_TEST_NEEDS_ALLOCATIONS();
     QelDebug::globals().resetLoggers();
