@@ -3,6 +3,7 @@
 
 #include "support/CapturedLog.hpp"
 #include "support/RecordingLogBackend.hpp"
+#include "support/VirtualSlot.hpp"
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
@@ -26,6 +27,9 @@ constexpr LogLevel::Level kBelowRange = static_cast<LogLevel::Level>(-2);
 class CollectingBackend : public LogBackendFiltered {
 public:
     using LogBackendFiltered::LogBackendFiltered;
+
+    /// @return the slot of pLog
+    static std::size_t slotOfWrite() { return virtualSlot(&CollectingBackend::pLog); }
 
     std::vector<std::string> mLines;
 
@@ -54,7 +58,18 @@ TEST(LogBackendFiltered, IsAbstract)
     EXPECT_TRUE(std::has_virtual_destructor_v<LogBackend>);
 }
 
-TEST(LogBackendFiltered, PassesFromWarnUpUnlessTold)
+TEST(LogBackend, VirtualOperationsKeepTheirSlots)
+{
+    EXPECT_EQ(virtualSlot(&LogBackend::log), 2U) << "after the destructor";
+}
+
+TEST(LogBackendFiltered, VirtualOperationsKeepTheirSlots)
+{
+    EXPECT_EQ(virtualSlot(&LogBackendFiltered::log), 2U);
+    EXPECT_EQ(CollectingBackend::slotOfWrite(), 3U);
+}
+
+TEST(LogBackendFiltered, PassesWarnAndAboveByDefault)
 {
     CollectingBackend backend;
     EXPECT_EQ(backend.getLogLevel(), LogLevel::Warn);
@@ -81,7 +96,7 @@ TEST(LogBackendFiltered, PassesLinesNotBelowItsThreshold)
     }
 }
 
-TEST(LogBackendFiltered, InheritLetsEvenALineOfLevelInheritPass)
+TEST(LogBackendFiltered, ThresholdInheritPassesALineOfLevelInherit)
 {
     CollectingBackend backend(LogLevel::Inherit);
     backend.log(LogLevel::Inherit, "line");
@@ -104,7 +119,7 @@ TEST(LogBackendFiltered, StartsAtWarnWhenBuiltWithAnInvalidThreshold)
     EXPECT_EQ(CollectingBackend(kBelowRange).getLogLevel(), LogLevel::Warn);
 }
 
-TEST(LogBackendFiltered, HandsTheLineOverUnchanged)
+TEST(LogBackendFiltered, PassesTheLineUnchanged)
 {
     const std::string line("a\0b\nc", 5);
     CollectingBackend backend;
@@ -112,7 +127,7 @@ TEST(LogBackendFiltered, HandsTheLineOverUnchanged)
     EXPECT_THAT(backend.mLines, ElementsAre(line));
 }
 
-TEST(LogBackendFiltered, ItsThresholdMayChangeWhileOthersLog)
+TEST(LogBackendFiltered, TheThresholdMayChangeWhileOtherThreadsLog)
 {
     const CapturedLog log;
     const auto backend = std::make_shared<CollectingBackend>();
@@ -130,7 +145,7 @@ TEST(LogBackendFiltered, ItsThresholdMayChangeWhileOthersLog)
     EXPECT_EQ(backend->mLines.size(), static_cast<std::size_t>(kLines)) << "a Critical line passes all the time";
 }
 
-TEST(LogBackend, RegisteringAddsToTheRootLogger)
+TEST(LogBackend, RegistersWithTheRootLogger)
 {
     const CapturedLog log;
     const auto backend = std::make_shared<RecordingLogBackend>();
@@ -141,7 +156,7 @@ TEST(LogBackend, RegisteringAddsToTheRootLogger)
     EXPECT_THAT(backend->lines(), ElementsAre("to everybody"));
 }
 
-TEST(LogBackend, RegisteringNullIsRefused)
+TEST(LogBackend, RefusesToRegisterNull)
 {
     const CapturedLog log;
     EXPECT_THAT([] { LogBackend::registerBackend(nullptr); }, ThrowsMessage<std::invalid_argument>(StrEq("backend")));

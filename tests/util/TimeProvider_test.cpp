@@ -1,12 +1,14 @@
 #include <qel/common/util/TimeProvider.hpp>
 
 #include "support/SettableClock.hpp"
+#include "support/VirtualSlot.hpp"
 
 #include <chrono>
 #include <cstdlib>
 #include <gtest/gtest.h>
 #include <memory>
 #include <type_traits>
+#include <utility>
 
 namespace qel {
 namespace {
@@ -27,6 +29,12 @@ public:
     explicit FixedClock(int number) : mNumber(number) {}
     using TimeProvider::pRegister;
     using TimeProvider::pUnregister;
+
+    /// @return the slots of the two readings
+    static std::pair<std::size_t, std::size_t> slots()
+    {
+        return {test::virtualSlot(&FixedClock::pSystem), test::virtualSlot(&FixedClock::pSteady)};
+    }
 
 private:
     system_clock::time_point pSystem() override { return kSystemTime + milliseconds(mNumber); }
@@ -54,7 +62,7 @@ bool readsAsTheStandard(typename Clock::time_point (*read)())
 void expectStandardClocks()
 {
     EXPECT_TRUE(readsAsTheStandard<steady_clock>(&TimeProvider::steady));
-    // Somebody may set the system's clock back in the middle, but hardly each time.
+    // The system's clock may be set back between two readings, but hardly three times in a row.
     const auto system = [] { return readsAsTheStandard<system_clock>(&TimeProvider::system); };
     EXPECT_TRUE(system() || system() || system());
 }
@@ -163,12 +171,17 @@ TEST(TimeProvider, AnotherDefaultProviderChangesNothing)
     expectStandardClocks();
 }
 
-TEST(TimeProvider, IsNotCopied)
+TEST(TimeProvider, CannotBeCopied)
 {
     EXPECT_FALSE(std::is_copy_constructible<DefaultTimeProvider>::value);
     EXPECT_FALSE(std::is_copy_assignable<DefaultTimeProvider>::value);
     EXPECT_TRUE(std::has_virtual_destructor<TimeProvider>::value);
     EXPECT_TRUE(std::is_abstract<TimeProvider>::value);
+}
+
+TEST(TimeProvider, VirtualOperationsKeepTheirSlots)
+{
+    EXPECT_EQ(FixedClock::slots(), std::make_pair(std::size_t(2), std::size_t(3))) << "after the destructor";
 }
 
 TEST(SettableClock, IsInForceForItsLifetime)
