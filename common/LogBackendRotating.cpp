@@ -15,8 +15,8 @@ namespace qel {
 
 namespace {
 
-/// The number and the text of an error for the system log; cut or empty when there is no memory for it, since nothing
-/// may be thrown from here.
+/// @return the number and the text of an error, for the system log; empty if there is no memory for it: a back-end must
+/// not throw
 std::string describe(int error) noexcept
 {
     try {
@@ -49,8 +49,8 @@ std::string LogBackendRotating::pGetPath(std::size_t n) const
     return n == 0 ? mPath : mPath + "." + std::to_string(n);
 }
 
-// A rotation moves the files one by one from the oldest down, so one that was cut short leaves a gap; where the move
-// was half done it leaves the same file under two neighbouring names.
+// A rotation moves the files one by one from the oldest down. One that was interrupted leaves a gap, or, in the middle
+// of a move, one file under two neighbouring names.
 void LogBackendRotating::pRepair()
 {
     ino_t previousInode = 0;
@@ -109,13 +109,13 @@ bool LogBackendRotating::pRotate()
 {
     pClose();
     try {
-        // From the oldest down: the other way round each file would overwrite the next before that has moved on.
+        // From the oldest down: the other way round each file would overwrite the next one.
         for (std::size_t i = MAX_FILES_ALLOWED - 1; i > 0; --i)
             pMove(pGetPath(i - 1), pGetPath(i));
     } catch (const std::bad_alloc&) {
-        return false; // no memory for the names; the log stays closed, as when the new file cannot be opened
+        return false; // no memory for the names: the log stays closed, as if the new file could not be opened
     }
-    ::unlink(mPath.c_str()); // only there if the last move failed
+    ::unlink(mPath.c_str()); // exists only if the last move failed
     return pOpen(O_TRUNC);
 }
 
@@ -123,7 +123,7 @@ void LogBackendRotating::pMove(const std::string& from, const std::string& to)
 {
     if (::rename(from.c_str(), to.c_str()) == 0) return;
     const int error = errno;
-    if (error == ENOENT) return; // there are not yet that many files
+    if (error == ENOENT) return; // there are fewer files so far
     ::syslog(LOG_ERR, "Failed to rotate log file %s: errno %s", from.c_str(), describe(error).c_str());
 }
 
@@ -133,17 +133,43 @@ void LogBackendRotating::pLog(const std::string& line)
     const std::uint64_t length = std::min<std::uint64_t>(line.size(), mRotateSize - 1);
     if (length + mFileSize + 1 > mRotateSize && !pRotate()) return;
 
-    // One gathered write: no copy of the line, and other writers of the file cannot come between it and its end.
-    char lineEnd[] = {'\n'};
-    const struct iovec pieces[] = {{const_cast<char*>(line.data()), static_cast<std::size_t>(length)},
-                                   {lineEnd, sizeof(lineEnd)}};
-    const ssize_t written = ::writev(mFileDescriptor, pieces, 2);
+    const auto bytes = static_cast<std::size_t>(length);
+    const ssize_t written = pWrite(line.data(), bytes);
     if (written < 0) {
         const int error = errno;
         pNoteFailed(error);
-    } else {
-        pNoteWritten(static_cast<std::uint64_t>(written));
+        return;
     }
+    // The disk is nearly full: a second call writes the rest, or fails and says why.
+    const auto done = static_cast<std::size_t>(written);
+    if (done <= bytes) {
+        const ssize_t rest = pWrite(line.data() + done, bytes - done);
+        const int error = rest < 0 ? errno : EIO; // short again, without a reason
+        if (rest != static_cast<ssize_t>(bytes - done + 1)) {
+            pDiscardPart();
+            pNoteFailed(error);
+            return;
+        }
+    }
+    pNoteWritten(length + 1);
+}
+
+/// One gathered write of a text and a line end: no copy of the line, and one call for both.
+/// @return the number of bytes written, at most length + 1; -1 with errno set on failure
+ssize_t LogBackendRotating::pWrite(const char* text, std::size_t length)
+{
+    char lineEnd[] = {'\n'};
+    const struct iovec pieces[] = {{const_cast<char*>(text), length}, {lineEnd, sizeof(lineEnd)}};
+    return ::writev(mFileDescriptor, pieces, 2);
+}
+
+/// Removes the part of a line that was written, so that no torn line stays in the file and the next line begins where
+/// this one did. If the file cannot be cut, the next line overwrites the part.
+void LogBackendRotating::pDiscardPart()
+{
+    const auto begin = static_cast<off_t>(mFileSize);
+    static_cast<void>(::ftruncate(mFileDescriptor, begin) == 0);
+    ::lseek(mFileDescriptor, begin, SEEK_SET);
 }
 
 void LogBackendRotating::pNoteWritten(std::uint64_t bytes)

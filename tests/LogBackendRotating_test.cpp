@@ -1,53 +1,19 @@
-#include <qel/common/LogBackendRotating.hpp>
-#include <qel/common/QelDebugContext.hpp>
-#include <qel/common/QelLogger.hpp>
-#include <qel/common/Utilities.hpp>
-
+#include "LogBackendRotatingTest.hpp"
 #include "support/Allocations.hpp"
-#include "support/CapturedLog.hpp"
-#include "support/CapturedSystemLog.hpp"
 #include "support/FileCalls.hpp"
-#include "support/TemporaryDirectory.hpp"
 
 #include <cerrno>
-#include <csignal>
 #include <cstdint>
 #include <cstdio>
-#include <dirent.h>
 #include <fcntl.h>
 #include <gmock/gmock.h>
-#include <gtest/gtest.h>
-#include <map>
-#include <memory>
-#include <string>
-#include <sys/resource.h>
-#include <sys/stat.h>
-#include <syslog.h>
 #include <unistd.h>
-#include <vector>
 
 namespace qel::test {
 namespace {
 
 using ::testing::ElementsAre;
 using ::testing::IsEmpty;
-using ::testing::StartsWith;
-
-using Files = std::map<std::string, std::string>; // content by name
-
-constexpr std::size_t kRoomy = 1000000;
-
-bool isDirectory(const std::string& path)
-{
-    struct stat status = {};
-    return ::lstat(path.c_str(), &status) == 0 && S_ISDIR(status.st_mode);
-}
-
-bool isLink(const std::string& path)
-{
-    struct stat status = {};
-    return ::lstat(path.c_str(), &status) == 0 && S_ISLNK(status.st_mode);
-}
 
 std::uint64_t sizeOf(const std::string& path)
 {
@@ -55,53 +21,6 @@ std::uint64_t sizeOf(const std::string& path)
     EXPECT_EQ(::stat(path.c_str(), &status), 0) << path;
     return static_cast<std::uint64_t>(status.st_size);
 }
-
-/// A directory for the log files of one test, and what the back-end tells the system log about them.
-class LogBackendRotatingTest : public ::testing::Test {
-protected:
-    std::string path(const std::string& name) const { return mDirectory.file(name); }
-
-    void write(const std::string& name, const std::string& content) { Utilities::writeFile(path(name), content); }
-    std::string read(const std::string& name) const { return Utilities::readFile(path(name)); }
-
-    /// The content of the regular files; directories and links show as "<directory>" and "<link>".
-    Files files() const
-    {
-        Files found;
-        DIR* const directory = ::opendir(mDirectory.path().c_str());
-        if (directory == nullptr) return found;
-        while (const struct dirent* const entry = ::readdir(directory)) {
-            const std::string name = entry->d_name;
-            if (name == "." || name == "..") continue;
-            if (isDirectory(path(name))) {
-                found[name] = "<directory>";
-            } else if (isLink(path(name))) {
-                found[name] = "<link>";
-            } else {
-                found[name] = read(name);
-            }
-        }
-        ::closedir(directory);
-        return found;
-    }
-
-    /// A back-end that lets everything through and writes to "log".
-    std::unique_ptr<LogBackendRotating> make(std::size_t rotateSize = kRoomy) const
-    {
-        return std::make_unique<LogBackendRotating>(LogLevel::Inherit, mDirectory.path(), "log", rotateSize);
-    }
-
-    static void log(LogBackendRotating& backend, const std::string& line) { backend.log(LogLevel::Error, line); }
-
-    /// A message to the system log that ends in ": errno " and the error.
-    static SystemLogMessage error(const std::string& text, const std::string& error)
-    {
-        return {LOG_ERR, text + ": errno " + error};
-    }
-
-    TemporaryDirectory mDirectory;
-    CapturedSystemLog mSystemLog;
-};
 
 // Opening
 
@@ -136,7 +55,7 @@ TEST_F(LogBackendRotatingTest, AppendsToAnExistingFile)
     EXPECT_EQ(files(), (Files{{"log", "before\nafter\n"}}));
 }
 
-TEST_F(LogBackendRotatingTest, LinesArriveWithoutDelay)
+TEST_F(LogBackendRotatingTest, WritesEachLineAtOnce)
 {
     const auto backend = make();
     log(*backend, "first");
@@ -153,7 +72,7 @@ TEST_F(LogBackendRotatingTest, WritesAnyByte)
     EXPECT_EQ(read("log"), line + "\n");
 }
 
-TEST_F(LogBackendRotatingTest, PassesFromWarnUpUnlessTold)
+TEST_F(LogBackendRotatingTest, PassesWarnAndAboveByDefault)
 {
     LogBackendRotating backend(mDirectory.path(), "log", kRoomy);
     EXPECT_EQ(backend.getLogLevel(), LogLevel::Warn);
@@ -238,7 +157,26 @@ TEST_F(LogBackendRotatingTest, ReportsADirectoryWithoutPermissionAndAProcessWith
     }
 }
 
-TEST_F(LogBackendRotatingTest, NothingReopensItOnceItIsClosed)
+TEST_F(LogBackendRotatingTest, DescriptorZeroIsADescriptor)
+{
+    // A daemon has closed its standard input, so its log file gets the number 0.
+    const int standardInput = ::fcntl(STDIN_FILENO, F_DUPFD_CLOEXEC, 3);
+    ASSERT_EQ(::close(STDIN_FILENO), standardInput < 0 ? -1 : 0);
+    auto backend = make(12);
+    EXPECT_NE(::fcntl(0, F_GETFD), -1) << "the log file has this number";
+    log(*backend, "first");
+    log(*backend, "second"); // rotates
+    backend.reset();
+    EXPECT_EQ(::fcntl(0, F_GETFD), -1) << "the destructor closes it";
+    if (standardInput >= 0) {
+        ::dup2(standardInput, STDIN_FILENO);
+        ::close(standardInput);
+    }
+    EXPECT_EQ(files(), (Files{{"log", "second\n"}, {"log.1", "first\n"}}));
+    EXPECT_THAT(mSystemLog.take(), IsEmpty());
+}
+
+TEST_F(LogBackendRotatingTest, StaysClosedAfterAFailedOpen)
 {
     LogBackendRotating backend(mDirectory.path() + "/late", "log", kRoomy);
     EXPECT_EQ(mSystemLog.take().size(), 1U);
@@ -248,7 +186,7 @@ TEST_F(LogBackendRotatingTest, NothingReopensItOnceItIsClosed)
     EXPECT_THAT(mSystemLog.take(), IsEmpty());
 }
 
-TEST_F(LogBackendRotatingTest, ReportsAFileThatCannotBeSoughtAndClosesIt)
+TEST_F(LogBackendRotatingTest, ReportsAFailedSeekAndClosesTheFile)
 {
     ASSERT_EQ(::mkfifo(path("log").c_str(), 0600), 0);
     FileCalls calls;
@@ -262,7 +200,7 @@ TEST_F(LogBackendRotatingTest, ReportsAFileThatCannotBeSoughtAndClosesIt)
 
 // Sizes and rotation
 
-TEST_F(LogBackendRotatingTest, CutsALineThatAFileCannotHold)
+TEST_F(LogBackendRotatingTest, CutsALineLongerThanAFile)
 {
     struct {
         std::size_t length;
@@ -286,7 +224,7 @@ TEST_F(LogBackendRotatingTest, WritesALongLineCutIntoAFreshFile)
     EXPECT_EQ(files(), (Files{{"log", std::string(99, 'x') + "\n"}, {"log.1", "short\n"}}));
 }
 
-TEST_F(LogBackendRotatingTest, AFileMayReachTheLimitExactlyAndNotPassIt)
+TEST_F(LogBackendRotatingTest, AFileReachesTheLimitAndNeverExceedsIt)
 {
     const auto backend = make(10);
     log(*backend, "1234");
@@ -299,7 +237,7 @@ TEST_F(LogBackendRotatingTest, AFileMayReachTheLimitExactlyAndNotPassIt)
         << "one byte too many begins a new file";
 }
 
-TEST_F(LogBackendRotatingTest, CountsWhatAnExistingFileHolds)
+TEST_F(LogBackendRotatingTest, CountsTheBytesOfAnExistingFile)
 {
     write("log", "12345");
     const auto backend = make(10);
@@ -309,16 +247,16 @@ TEST_F(LogBackendRotatingTest, CountsWhatAnExistingFileHolds)
     EXPECT_EQ(files(), (Files{{"log", "x\n"}, {"log.1", "123456789\n"}}));
 }
 
-TEST_F(LogBackendRotatingTest, RotatesAnExistingFileThatIsTooLargeAlready)
+TEST_F(LogBackendRotatingTest, RotatesAnExistingFileAboveTheLimit)
 {
     write("log", "this was written under a larger limit\n");
     const auto backend = make(10);
-    EXPECT_EQ(files().size(), 1U) << "not before a line comes";
+    EXPECT_EQ(files().size(), 1U) << "a line rotates, not the construction";
     log(*backend, "x");
     EXPECT_EQ(files(), (Files{{"log", "x\n"}, {"log.1", "this was written under a larger limit\n"}}));
 }
 
-TEST_F(LogBackendRotatingTest, SevenFullFilesLeaveTheFiveYoungest)
+TEST_F(LogBackendRotatingTest, KeepsTheFiveYoungestOfSevenFiles)
 {
     const auto backend = make(2);
     for (char line = '1'; line <= '7'; ++line)
@@ -344,7 +282,7 @@ TEST_F(LogBackendRotatingTest, SurvivesALimitOfZero)
     EXPECT_TRUE(files().count("log"));
 }
 
-TEST_F(LogBackendRotatingTest, KnowsFilesBeyondFourGigabytes)
+TEST_F(LogBackendRotatingTest, CountsFilesAboveFourGigabytes)
 {
     constexpr off_t kFiveGigabytes = 5LL * 1024 * 1024 * 1024;
     write("log", "");
@@ -370,7 +308,7 @@ TEST_F(LogBackendRotatingTest, RotatesFromTheOldestDownAfterClosingTheFile)
                             "rename log log.1", "unlink log", open, "lseek", "writev 1+1"));
 }
 
-TEST_F(LogBackendRotatingTest, EndsWithFlushingAndClosingItsFile)
+TEST_F(LogBackendRotatingTest, DestructorFlushesAndClosesTheFile)
 {
     auto backend = make();
     FileCalls calls;
@@ -378,7 +316,7 @@ TEST_F(LogBackendRotatingTest, EndsWithFlushingAndClosingItsFile)
     EXPECT_THAT(calls.take(), ElementsAre("fsync", "close"));
 }
 
-TEST_F(LogBackendRotatingTest, AClosedOneEndsWithoutATouchOnAnyFile)
+TEST_F(LogBackendRotatingTest, DestructorOfAClosedBackendCallsNothing)
 {
     auto backend = std::make_unique<LogBackendRotating>(path("missing"), "log", kRoomy);
     mSystemLog.take();
@@ -407,12 +345,12 @@ TEST_F(LogBackendRotatingTest, ALineCostsNoAllocation)
     EXPECT_EQ(allocations.count(), 0U);
 }
 
-TEST_F(LogBackendRotatingTest, AFailingMoveIsReportedAndTheRotationCarriesOn)
+TEST_F(LogBackendRotatingTest, ReportsAFailedMoveAndGoesOnRotating)
 {
     const auto backend = make(2);
     for (char line = '1'; line <= '4'; ++line)
         log(*backend, std::string(1, line));
-    ASSERT_EQ(::mkdir(path("log.4").c_str(), 0755), 0); // no file can be moved onto a directory
+    ASSERT_EQ(::mkdir(path("log.4").c_str(), 0755), 0); // a file cannot replace a directory
     log(*backend, "5");
     EXPECT_THAT(mSystemLog.take(),
                 ElementsAre(error("Failed to rotate log file " + path("log.3"), "21 (Is a directory)")));
@@ -420,7 +358,7 @@ TEST_F(LogBackendRotatingTest, AFailingMoveIsReportedAndTheRotationCarriesOn)
               (Files{{"log", "5\n"}, {"log.1", "4\n"}, {"log.2", "3\n"}, {"log.3", "2\n"}, {"log.4", "<directory>"}}));
 }
 
-TEST_F(LogBackendRotatingTest, EveryFailingMoveIsReported)
+TEST_F(LogBackendRotatingTest, ReportsEveryFailedMove)
 {
     write("log.1", "old\n");
     const auto backend = make(2);
@@ -433,10 +371,10 @@ TEST_F(LogBackendRotatingTest, EveryFailingMoveIsReported)
                             error("Failed to rotate log file " + path("log.2"), "13 (Permission denied)"),
                             error("Failed to rotate log file " + path("log.1"), "13 (Permission denied)"),
                             error("Failed to rotate log file " + path("log"), "13 (Permission denied)")));
-    EXPECT_EQ(files(), (Files{{"log", "b\n"}, {"log.1", "old\n"}})) << "the current file begins anew all the same";
+    EXPECT_EQ(files(), (Files{{"log", "b\n"}, {"log.1", "old\n"}})) << "the current file is emptied all the same";
 }
 
-TEST_F(LogBackendRotatingTest, AFailingLastMoveLosesTheCurrentFileThoughItCannotBeRemovedEither)
+TEST_F(LogBackendRotatingTest, TruncatesTheCurrentFileWhenItCanBeNeitherMovedNorRemoved)
 {
     const auto backend = make(2);
     log(*backend, "a");
@@ -449,7 +387,7 @@ TEST_F(LogBackendRotatingTest, AFailingLastMoveLosesTheCurrentFileThoughItCannot
     EXPECT_EQ(files(), (Files{{"log", "b\n"}})) << "it is truncated when it is opened again";
 }
 
-TEST_F(LogBackendRotatingTest, AFailingFlushIsIgnored)
+TEST_F(LogBackendRotatingTest, IgnoresAFailedFlush)
 {
     auto backend = make(2);
     log(*backend, "a");
@@ -461,7 +399,7 @@ TEST_F(LogBackendRotatingTest, AFailingFlushIsIgnored)
     EXPECT_THAT(mSystemLog.take(), IsEmpty());
 }
 
-TEST_F(LogBackendRotatingTest, AFailedReopenClosesItForEver)
+TEST_F(LogBackendRotatingTest, DropsEveryLineAfterAFailedReopen)
 {
     ASSERT_EQ(::mkdir(path("here").c_str(), 0755), 0);
     LogBackendRotating backend(LogLevel::Inherit, path("here"), "log", 2);
@@ -470,18 +408,18 @@ TEST_F(LogBackendRotatingTest, AFailedReopenClosesItForEver)
     log(backend, "b");
     EXPECT_THAT(mSystemLog.take(),
                 ElementsAre(error("Failed to open log " + path("here/log"), "2 (No such file or directory)")))
-        << "files that are not there any more are no failed moves";
+        << "a file that no longer exists is not a failed move";
 
     ASSERT_EQ(::rename(path("gone").c_str(), path("here").c_str()), 0);
     FileCalls calls;
     log(backend, "c");
     log(backend, "d");
     EXPECT_THAT(calls.take(), IsEmpty());
-    EXPECT_THAT(mSystemLog.take(), IsEmpty()) << "nor are the lines counted as dropped";
+    EXPECT_THAT(mSystemLog.take(), IsEmpty()) << "the lines are not counted as dropped";
     EXPECT_EQ(Utilities::readFile(path("here/log")), "a\n");
 }
 
-TEST_F(LogBackendRotatingTest, AFailedSeekAfterARotationClosesItForEverToo)
+TEST_F(LogBackendRotatingTest, DropsEveryLineAfterAFailedSeekInARotation)
 {
     const auto backend = make(2);
     log(*backend, "a");
@@ -496,7 +434,7 @@ TEST_F(LogBackendRotatingTest, AFailedSeekAfterARotationClosesItForEverToo)
     EXPECT_EQ(files(), (Files{{"log", ""}, {"log.1", "a\n"}}));
 }
 
-TEST_F(LogBackendRotatingTest, RunningOutOfMemoryInARotationClosesItWithoutAnException)
+TEST_F(LogBackendRotatingTest, ClosesWithoutAnExceptionWhenARotationRunsOutOfMemory)
 {
     QEL_TEST_NEEDS_ALLOCATIONS();
     // Long enough that the names of the files do not fit into strings without an allocation.
@@ -517,313 +455,6 @@ TEST_F(LogBackendRotatingTest, RunningOutOfMemoryInARotationClosesItWithoutAnExc
         EXPECT_NE(::access(directory.file(name + ".1").c_str(), F_OK), 0);
         EXPECT_THAT(mSystemLog.take(), IsEmpty());
     }
-}
-
-// Failed writes
-
-TEST_F(LogBackendRotatingTest, AFullDiskIsReportedOnceForARunOfLostLines)
-{
-    ASSERT_EQ(::symlink("/dev/full", path("log").c_str()), 0);
-    const auto backend = make();
-    for (int i = 0; i < 3; ++i)
-        log(*backend, "line");
-    EXPECT_THAT(mSystemLog.take(),
-                ElementsAre(error("cannot write to log " + path("log"), "28 (No space left on device)")));
-}
-
-TEST_F(LogBackendRotatingTest, TheFirstWriteThatSucceedsAgainReportsHowManyLinesWereLost)
-{
-    const auto backend = make();
-    log(*backend, "before");
-    FileCalls calls;
-    calls.fail(FileCalls::Writev, ENOSPC, 3);
-    for (int i = 0; i < 3; ++i)
-        log(*backend, "lost");
-    EXPECT_THAT(mSystemLog.take(),
-                ElementsAre(error("cannot write to log " + path("log"), "28 (No space left on device)")));
-    log(*backend, "after");
-    EXPECT_THAT(mSystemLog.take(),
-                ElementsAre(SystemLogMessage{LOG_INFO, "log " + path("log") +
-                                                           " recovered after write error: 3 messages were dropped"}));
-    log(*backend, "and on");
-    EXPECT_THAT(mSystemLog.take(), IsEmpty());
-    EXPECT_EQ(read("log"), "before\nafter\nand on\n");
-}
-
-TEST_F(LogBackendRotatingTest, EveryRunOfFailuresIsReportedAnew)
-{
-    const auto backend = make();
-    for (int run = 0; run < 2; ++run) {
-        SCOPED_TRACE(run);
-        FileCalls calls;
-        calls.fail(FileCalls::Writev, EIO);
-        log(*backend, "lost");
-        EXPECT_THAT(mSystemLog.take(),
-                    ElementsAre(error("cannot write to log " + path("log"), "5 (Input/output error)")));
-        log(*backend, "line");
-        EXPECT_THAT(mSystemLog.take(),
-                    ElementsAre(SystemLogMessage{
-                        LOG_INFO, "log " + path("log") + " recovered after write error: 1 messages were dropped"}));
-    }
-}
-
-TEST_F(LogBackendRotatingTest, AFailedWriteDoesNotCountTowardsTheLimit)
-{
-    const auto backend = make(10);
-    FileCalls calls;
-    calls.fail(FileCalls::Writev, ENOSPC);
-    log(*backend, "lost line");
-    log(*backend, "123456789");
-    EXPECT_EQ(files(), (Files{{"log", "123456789\n"}}));
-    EXPECT_EQ(mSystemLog.take().size(), 2U);
-}
-
-TEST_F(LogBackendRotatingTest, AShortWriteIsASuccessOfSoManyBytes)
-{
-    const auto backend = make(10);
-    FileCalls calls;
-    calls.shortenNextWrite(3);
-    log(*backend, "abcdefgh");
-    log(*backend, "123456");
-    EXPECT_EQ(files(), (Files{{"log", "abc123456\n"}})) << "3 + 6 + 1 bytes fit";
-    log(*backend, "");
-    EXPECT_EQ(files(), (Files{{"log", "\n"}, {"log.1", "abc123456\n"}}));
-    EXPECT_THAT(mSystemLog.take(), IsEmpty());
-}
-
-TEST_F(LogBackendRotatingTest, ALimitOnTheFileSizeCutsALineAndFailsTheNext)
-{
-    const auto backend = make();
-    struct rlimit before = {};
-    ASSERT_EQ(::getrlimit(RLIMIT_FSIZE, &before), 0);
-    const auto handler = std::signal(SIGXFSZ, SIG_IGN);
-    struct rlimit limit = before;
-    limit.rlim_cur = 8;
-    ASSERT_EQ(::setrlimit(RLIMIT_FSIZE, &limit), 0);
-    log(*backend, "12345");
-    log(*backend, "67890");
-    log(*backend, "lost");
-    ASSERT_EQ(::setrlimit(RLIMIT_FSIZE, &before), 0);
-    std::signal(SIGXFSZ, handler);
-    EXPECT_EQ(read("log"), "12345\n67");
-    EXPECT_THAT(mSystemLog.take(), ElementsAre(error("cannot write to log " + path("log"), "27 (File too large)")));
-    log(*backend, "on");
-    EXPECT_EQ(read("log"), "12345\n67on\n");
-    EXPECT_EQ(mSystemLog.take().size(), 1U);
-}
-
-TEST_F(LogBackendRotatingTest, ALostLineBeforeARotationIsReportedAfterIt)
-{
-    const auto backend = make(4);
-    FileCalls calls;
-    log(*backend, "ab");
-    calls.fail(FileCalls::Writev, ENOSPC);
-    log(*backend, "");
-    EXPECT_EQ(mSystemLog.take().size(), 1U);
-    log(*backend, "cd");
-    EXPECT_EQ(files(), (Files{{"log", "cd\n"}, {"log.1", "ab\n"}}));
-    EXPECT_EQ(mSystemLog.take().size(), 1U) << "the count outlives the file";
-}
-
-TEST_F(LogBackendRotatingTest, RunningOutOfMemoryCostsTheTextOfTheErrorAtMost)
-{
-    QEL_TEST_NEEDS_ALLOCATIONS();
-    const std::string line = "lost";
-    for (std::size_t succeeding = 0; succeeding < 4; ++succeeding) {
-        SCOPED_TRACE(succeeding);
-        const auto backend = make();
-        {
-            FileCalls calls;
-            calls.fail(FileCalls::Writev, ENOSPC);
-            Allocations allocations;
-            allocations.failAfter(succeeding);
-            log(*backend, line);
-        }
-        const std::vector<SystemLogMessage> messages = mSystemLog.take();
-        ASSERT_EQ(messages.size(), 1U);
-        EXPECT_EQ(messages[0].priority, LOG_ERR);
-        EXPECT_THAT(messages[0].text, StartsWith("cannot write to log " + path("log") + ": errno "));
-    }
-}
-
-TEST_F(LogBackendRotatingTest, ItsTroubleNeverReachesTheLogger)
-{
-    const CapturedLog captured;
-    ASSERT_EQ(::symlink("/dev/full", path("log").c_str()), 0);
-    QelLogger::get().addBackend(make());
-    QelDebugContext(QelLogger::get(), LogLevel::Error) << "text";
-    EXPECT_THAT(captured.lines(), ElementsAre("E: text"));
-    EXPECT_EQ(mSystemLog.take().size(), 1U);
-}
-
-TEST_F(LogBackendRotatingTest, GetsTheLinesOfTheLogger)
-{
-    const CapturedLog captured;
-    LogBackend::registerBackend(make());
-    QelDebugContext(QelLogger::get(), LogLevel::Error) << "text";
-    ASSERT_EQ(captured.rawLines().size(), 1U);
-    EXPECT_EQ(read("log"), captured.rawLines()[0] + "\n");
-}
-
-// Healing what an interrupted rotation left behind
-
-struct RepairCase {
-    const char* name;
-    // In place of content: "<directory>"; "<link>", to nowhere; ">name", a link to that; "=name", a second name of
-    // that.
-    Files before;
-    Files after; // with the current file created when it is missing
-};
-
-void PrintTo(const RepairCase& repair, std::ostream* os) { *os << repair.name; }
-
-class LogBackendRotatingRepair : public LogBackendRotatingTest, public ::testing::WithParamInterface<RepairCase> {
-protected:
-    void arrange(const Files& wanted)
-    {
-        for (const auto& [name, content] : wanted) {
-            if (content == "<directory>") {
-                ASSERT_EQ(::mkdir(path(name).c_str(), 0755), 0);
-            } else if (content == "<link>") {
-                ASSERT_EQ(::symlink("nowhere/at/all", path(name).c_str()), 0);
-            } else if (content[0] == '>') {
-                ASSERT_EQ(::symlink(content.c_str() + 1, path(name).c_str()), 0);
-            } else if (content[0] == '=') {
-                ASSERT_EQ(::link(path(content.substr(1)).c_str(), path(name).c_str()), 0);
-            } else {
-                write(name, content);
-            }
-        }
-    }
-};
-
-TEST_P(LogBackendRotatingRepair, LeavesFilesWithoutAGap)
-{
-    arrange(GetParam().before);
-    const auto backend = make();
-    EXPECT_EQ(files(), GetParam().after);
-    EXPECT_THAT(mSystemLog.take(), IsEmpty());
-}
-
-std::string nameOfCase(const ::testing::TestParamInfo<RepairCase>& repair) { return repair.param.name; }
-
-INSTANTIATE_TEST_SUITE_P(
-    Cases, LogBackendRotatingRepair,
-    ::testing::Values(
-        RepairCase{"NothingThere", {}, {{"log", ""}}},
-        RepairCase{"NoGap",
-                   {{"log", "0"}, {"log.1", "1"}, {"log.2", "2"}, {"log.3", "3"}, {"log.4", "4"}},
-                   {{"log", "0"}, {"log.1", "1"}, {"log.2", "2"}, {"log.3", "3"}, {"log.4", "4"}}},
-        RepairCase{"CurrentOnly", {{"log", "0"}}, {{"log", "0"}}},
-        RepairCase{"GapInTheMiddle",
-                   {{"log", "0"}, {"log.2", "2"}, {"log.3", "3"}},
-                   {{"log", "0"}, {"log.1", "2"}, {"log.2", "3"}}},
-        RepairCase{"CurrentMissing", {{"log.1", "1"}}, {{"log", "1"}}},
-        RepairCase{"CurrentMissingOfAll",
-                   {{"log.1", "1"}, {"log.2", "2"}, {"log.3", "3"}, {"log.4", "4"}},
-                   {{"log", "1"}, {"log.1", "2"}, {"log.2", "3"}, {"log.3", "4"}}},
-        RepairCase{"OldestOnly", {{"log.4", "4"}}, {{"log", "4"}}},
-        RepairCase{"CurrentAndOldest", {{"log", "0"}, {"log.4", "4"}}, {{"log", "0"}, {"log.1", "4"}}},
-        RepairCase{"SeveralGaps", {{"log.1", "1"}, {"log.3", "3"}}, {{"log", "1"}, {"log.1", "3"}}},
-        RepairCase{"BeyondTheOldestIsNotOurs", {{"log", "0"}, {"log.5", "5"}}, {{"log", "0"}, {"log.5", "5"}}},
-        RepairCase{
-            "OtherNamesAreNotOurs", {{"logs", "x"}, {"log.1x", "y"}}, {{"log", ""}, {"logs", "x"}, {"log.1x", "y"}}},
-        RepairCase{"SecondNameOfTheCurrentFile",
-                   {{"log", "0"}, {"log.1", "=log"}, {"log.2", "2"}},
-                   {{"log", "0"}, {"log.1", "2"}}},
-        RepairCase{"SecondNameOfTheOldestFile",
-                   {{"log", "0"}, {"log.1", "1"}, {"log.2", "2"}, {"log.3", "3"}, {"log.4", "=log.3"}},
-                   {{"log", "0"}, {"log.1", "1"}, {"log.2", "2"}, {"log.3", "3"}}},
-        RepairCase{"SecondNameAfterAGap",
-                   {{"log.1", "1"}, {"log.2", "=log.1"}, {"log.3", "3"}},
-                   {{"log", "1"}, {"log.1", "3"}}},
-        RepairCase{
-            "SecondNameAcrossAGap", {{"log", "0"}, {"log.2", "=log"}, {"log.3", "3"}}, {{"log", "0"}, {"log.1", "3"}}},
-        RepairCase{"ThirdName",
-                   {{"log", "0"}, {"log.1", "=log"}, {"log.2", "=log"}, {"log.3", "3"}},
-                   {{"log", "0"}, {"log.1", "3"}}},
-        RepairCase{"SecondNameThatIsNoNeighbourStays",
-                   {{"log", "0"}, {"log.1", "1"}, {"log.2", "=log"}},
-                   {{"log", "0"}, {"log.1", "1"}, {"log.2", "0"}}},
-        RepairCase{"ALinkIsAGap",
-                   {{"log", "0"}, {"log.1", "1"}, {"log.2", "<link>"}, {"log.3", "3"}},
-                   {{"log", "0"}, {"log.1", "1"}, {"log.2", "3"}}},
-        RepairCase{"ALinkToAFileIsAGapToo",
-                   {{"log", "0"}, {"log.1", ">other"}, {"log.2", "2"}, {"other", "x"}},
-                   {{"log", "0"}, {"log.1", "2"}, {"other", "x"}}},
-        RepairCase{"ALinkToTheCurrentFileIsNoSecondNameOfIt",
-                   {{"log", "0"}, {"log.1", ">log"}},
-                   {{"log", "0"}, {"log.1", "<link>"}}},
-        RepairCase{"ALinkInPlaceOfTheCurrentFileIsReplaced", {{"log", "<link>"}, {"log.1", "1"}}, {{"log", "1"}}},
-        RepairCase{
-            "ALinkWithNothingAfterItStays", {{"log", "0"}, {"log.1", "<link>"}}, {{"log", "0"}, {"log.1", "<link>"}}},
-        RepairCase{"ADirectoryIsAGapThatStopsTheRepair",
-                   {{"log", "0"}, {"log.1", "<directory>"}, {"log.2", "2"}, {"log.4", "4"}},
-                   {{"log", "0"}, {"log.1", "<directory>"}, {"log.2", "2"}, {"log.4", "4"}}},
-        RepairCase{"ADirectoryAfterAGapIsPassedOver",
-                   {{"log", "0"}, {"log.2", "<directory>"}, {"log.3", "3"}},
-                   {{"log", "0"}, {"log.1", "3"}, {"log.2", "<directory>"}}}),
-    nameOfCase);
-
-TEST_F(LogBackendRotatingTest, TheNewestOlderFileIsAppendedToWhenTheCurrentOneIsMissing)
-{
-    write("log.1", "1\n");
-    const auto backend = make();
-    log(*backend, "next");
-    EXPECT_EQ(files(), (Files{{"log", "1\nnext\n"}}));
-}
-
-TEST_F(LogBackendRotatingTest, ADirectoryInPlaceOfTheCurrentFileStopsTheRepairAndTheOpening)
-{
-    ASSERT_EQ(::mkdir(path("log").c_str(), 0755), 0);
-    write("log.1", "1");
-    const auto backend = make();
-    EXPECT_EQ(files(), (Files{{"log", "<directory>"}, {"log.1", "1"}}));
-    EXPECT_THAT(mSystemLog.take(), ElementsAre(error("Failed to open log " + path("log"), "21 (Is a directory)")))
-        << "what stopped the repair is not reported";
-}
-
-TEST_F(LogBackendRotatingTest, AFailingMoveStopsTheRepairSilently)
-{
-    write("log", "0");
-    write("log.2", "2");
-    write("log.3", "3");
-    FileCalls calls;
-    calls.fail(FileCalls::Rename, EACCES);
-    const auto backend = make();
-    EXPECT_EQ(files(), (Files{{"log", "0"}, {"log.2", "2"}, {"log.3", "3"}}));
-    EXPECT_THAT(mSystemLog.take(), IsEmpty());
-}
-
-TEST_F(LogBackendRotatingTest, AFailingRemovalStopsTheRepairSilently)
-{
-    write("log", "0");
-    ASSERT_EQ(::link(path("log").c_str(), path("log.1").c_str()), 0);
-    write("log.3", "3");
-    FileCalls calls;
-    calls.fail(FileCalls::Unlink, EACCES);
-    const auto backend = make();
-    EXPECT_EQ(files(), (Files{{"log", "0"}, {"log.1", "0"}, {"log.3", "3"}}));
-    EXPECT_THAT(mSystemLog.take(), IsEmpty());
-}
-
-TEST_F(LogBackendRotatingTest, RepairsBeforeOpening)
-{
-    write("log.1", "1");
-    FileCalls calls;
-    const auto backend = make();
-    EXPECT_EQ(calls.take().front(), "rename log.1 log");
-}
-
-TEST_F(LogBackendRotatingTest, DoesNotRepairOnRotation)
-{
-    const auto backend = make(2);
-    log(*backend, "a");
-    log(*backend, "b");
-    log(*backend, "c");
-    ASSERT_EQ(::unlink(path("log.1").c_str()), 0);
-    log(*backend, "d");
-    EXPECT_EQ(files(), (Files{{"log", "d\n"}, {"log.1", "c\n"}, {"log.3", "a\n"}}));
 }
 
 } // namespace

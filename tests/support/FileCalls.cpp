@@ -6,6 +6,7 @@
 #include <cerrno>
 #include <cstdarg>
 #include <cstdio>
+#include <deque>
 #include <dlfcn.h>
 #include <fcntl.h>
 #include <gtest/gtest.h>
@@ -26,11 +27,10 @@ struct Fault {
 
 bool sWatching = false;
 Fault sFaults[FileCalls::kCallCount];
-bool sShorten = false;
-std::size_t sShortenTo = 0;
+std::deque<std::size_t> sShortened; // what the next calls of writev may write
 std::vector<std::string> sCalls;
 
-/// The C library's own function behind one of ours.
+/// @return the C library's function that one of ours replaces
 template <typename Function>
 Function* original(const char* name)
 {
@@ -76,7 +76,7 @@ FileCalls::FileCalls()
 {
     if (sWatching) ADD_FAILURE() << "the file calls are watched already";
     std::fill(std::begin(sFaults), std::end(sFaults), Fault());
-    sShorten = false;
+    sShortened.clear();
     sCalls.clear();
     sWatching = true;
 }
@@ -89,11 +89,7 @@ FileCalls::~FileCalls()
 
 void FileCalls::fail(Call call, int error, unsigned count, unsigned after) { sFaults[call] = {after, count, error}; }
 
-void FileCalls::shortenNextWrite(std::size_t bytes)
-{
-    sShorten = true;
-    sShortenTo = bytes;
-}
+void FileCalls::shortenNextWrite(std::size_t bytes) { sShortened.push_back(bytes); }
 
 std::vector<std::string> FileCalls::take() { return std::exchange(sCalls, {}); }
 
@@ -134,10 +130,29 @@ ssize_t writev(int fd, const struct iovec* pieces, int count)
         sizes += (i == 0 ? " " : "+") + std::to_string(pieces[i].iov_len);
     record("writev" + sizes);
     if (fails(FileCalls::Writev)) return -1;
-    if (sWatching && std::exchange(sShorten, false)) {
-        return ::write(fd, pieces[0].iov_base, std::min(sShortenTo, pieces[0].iov_len));
+    if (sWatching && !sShortened.empty()) {
+        const std::size_t bytes = std::min(sShortened.front(), pieces[0].iov_len);
+        sShortened.pop_front();
+        return ::write(fd, pieces[0].iov_base, bytes);
     }
     return original<ssize_t(int, const struct iovec*, int)>("writev")(fd, pieces, count);
+}
+
+ssize_t read(int fd, void* buffer, size_t length)
+{
+    using namespace qel::test;
+    const Allocations::Exempt exempt;
+    if (fails(FileCalls::Read)) return -1;
+    return original<ssize_t(int, void*, size_t)>("read")(fd, buffer, length);
+}
+
+int ftruncate(int fd, off_t length) noexcept
+{
+    using namespace qel::test;
+    const Allocations::Exempt exempt;
+    record("ftruncate " + std::to_string(length));
+    if (fails(FileCalls::Ftruncate)) return -1;
+    return original<int(int, off_t)>("ftruncate")(fd, length);
 }
 
 int fsync(int fd)

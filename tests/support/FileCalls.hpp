@@ -15,7 +15,7 @@ namespace qel::test {
 /// Thread safety: one thread.
 class FileCalls {
 public:
-    enum Call { Open, Lseek, Writev, Fsync, Close, Rename, Unlink, kCallCount };
+    enum Call { Open, Lseek, Read, Writev, Ftruncate, Fsync, Close, Rename, Unlink, kCallCount };
 
     FileCalls();
     ~FileCalls();
@@ -26,12 +26,13 @@ public:
     /// then `count` fail.
     void fail(Call call, int error, unsigned count = 1, unsigned after = 0);
 
-    /// Makes the next writev write so many bytes only and say so.
+    /// Makes the next writev write that many bytes at most and return how many. Called twice, it shortens the next two.
     void shortenNextWrite(std::size_t bytes);
 
     /// @return the calls so far, which are forgotten: the name of the function, the file names without their
     /// directories, and what else matters: "rename log.3 log.4", "open log 2102 644" (flags in hexadecimal, mode in
-    /// octal), "writev 6+1" (bytes of each piece). Failed ones are among them.
+    /// octal), "writev 6+1" (bytes of each piece), "ftruncate 7" (the new size). Failed ones are among them; reads are
+    /// not.
     std::vector<std::string> take();
 };
 
