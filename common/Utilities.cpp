@@ -100,10 +100,13 @@ std::string readFile(const std::string& path)
     std::ostringstream content;
     bool good = file.is_open();
     if (good) {
-        // The fail bit does not count: it is set whenever nothing was copied, as for an empty file.
+        errno = 0;
         content << file.rdbuf();
         error = errno;
-        good = !content.bad();
+        // A failed read sets the fail bit, and so does an empty file, from which nothing is copied. Those two differ by
+        // errno. A directory counts as empty, though reading it fails.
+        const bool isEmpty = content.fail() && (error == 0 || error == EISDIR) && content.str().empty();
+        good = !content.bad() && (!content.fail() || isEmpty);
     }
     if (!good) throw FileIOError(error, "Failed to read contents of file " + path);
     return content.str();
@@ -115,7 +118,7 @@ void writeFile(const std::string& path, const std::string& content)
     int error = errno;
     bool good = file.is_open();
     if (good) {
-        // The flush is a part of the write: short content reaches the system, and an error comes back, only then.
+        // The flush belongs to the write: content that fits into the buffer reaches the system only now.
         file << content << std::flush;
         error = errno;
         good = !file.bad();

@@ -2,6 +2,7 @@
 #include <qel/common/util/PosixError.hpp>
 
 #include "support/Allocations.hpp"
+#include "support/FileCalls.hpp"
 #include "support/TemporaryDirectory.hpp"
 
 #include <cerrno>
@@ -282,6 +283,47 @@ TEST(UtilitiesFile, ReadingADirectoryGivesNothing)
 {
     const TemporaryDirectory directory;
     EXPECT_EQ(Utilities::readFile(directory.path()), "");
+}
+
+TEST(UtilitiesFile, ReadingAnEmptyFileGivesNothing)
+{
+    const TemporaryDirectory directory;
+    Utilities::writeFile(directory.file("f"), "");
+    EXPECT_EQ(Utilities::readFile(directory.file("f")), "");
+    EXPECT_EQ(Utilities::readFile("/dev/null"), "");
+}
+
+TEST(UtilitiesFile, AFailedReadThrowsHoweverManySucceededBefore)
+{
+    const TemporaryDirectory directory;
+    const std::string path = directory.file("f");
+    Utilities::writeFile(path, std::string(100000, 'x'));
+    for (const unsigned reads : {0U, 1U, 2U, 5U}) {
+        SCOPED_TRACE(reads);
+        test::FileCalls calls;
+        calls.fail(test::FileCalls::Read, EIO, 1, reads);
+        EXPECT_THAT([&] { Utilities::readFile(path); },
+                    failsWith("Failed to read contents of file " + path + ": 5 (Input/output error)", EIO));
+    }
+    EXPECT_EQ(Utilities::readFile(path).size(), 100000U);
+}
+
+TEST(UtilitiesFile, AnErrorOfADirectoryInTheMidstOfAFileThrows)
+{
+    const TemporaryDirectory directory;
+    const std::string path = directory.file("f");
+    Utilities::writeFile(path, std::string(100000, 'x'));
+    test::FileCalls calls;
+    calls.fail(test::FileCalls::Read, EISDIR, 1, 1);
+    EXPECT_THAT([&] { Utilities::readFile(path); },
+                failsWith("Failed to read contents of file " + path + ": 21 (Is a directory)", EISDIR));
+}
+
+TEST(UtilitiesFile, ReadingMemoryThatIsNotMappedThrows)
+{
+    // Page 0 of a process is never mapped.
+    EXPECT_THAT([] { Utilities::readFile("/proc/self/mem"); },
+                failsWith("Failed to read contents of file /proc/self/mem: 5 (Input/output error)", EIO));
 }
 
 TEST(UtilitiesFile, ReadingAMissingFileThrows)
