@@ -21,14 +21,17 @@ public:
     explicit CappedStringStreambuf(std::size_t maxSize);
     ~CappedStringStreambuf() override;
 
-    /// @return the text so far; the reference is valid as long as this object
+    /// @return the text so far, not copied; it changes with each write and is valid as long as this object
     const std::string& str() const noexcept { return mBuffer; }
 
 protected:
-    /// Takes as many of the count characters as fit. @return how many it took
+    /// Takes as many of the `count` characters as fit.
+    /// @return the number of characters taken
+    /// @throws std::bad_alloc  no memory; std::ostream turns it into badbit
     std::streamsize xsputn(const char* text, std::streamsize count) override;
-    /// Takes one character. @return a value other than end-of-file when it was taken, end-of-file when the limit is
-    /// reached or the argument is end-of-file
+    /// Takes one character.
+    /// @return end-of-file if the limit is reached or the argument is end-of-file, another value otherwise
+    /// @throws std::bad_alloc  no memory; std::ostream turns it into badbit
     int_type overflow(int_type character) override;
 
 private:
@@ -36,9 +39,9 @@ private:
     std::uint64_t mMaxSize;
 };
 
-/// An output stream whose text is cut at a limit. The write that does not fit is cut there and puts the stream into its
-/// failed state (badbit), so that everything after it is dropped; nothing marks the cut. Text that exactly fits is no
-/// failure. Text for which there is no memory is one, and is dropped likewise.
+/// An output stream whose text is cut at a limit. A write that does not fit is cut there and sets badbit, so that
+/// everything after it is dropped; nothing marks the cut. Text that fits exactly does not set badbit. Text for which
+/// there is no memory sets it and is dropped.
 /// Thread safety: one thread at a time.
 class QEL_EXPORT CappedStringStream : public std::ostream {
 public:

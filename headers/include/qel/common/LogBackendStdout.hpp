@@ -7,8 +7,9 @@
 
 namespace qel {
 
-/// Writes lines to standard output, through the buffer of the C library's stdout. It never flushes that buffer and
-/// ignores output errors. A line that holds a null byte ends there, since it is written with puts.
+/// Writes lines to standard output, through the buffer of the C library's stdout. It never flushes that buffer, ignores
+/// output errors and does not throw. It writes with puts, which cuts a line at its first null byte.
+/// Thread safety: as LogBackendFiltered; the C library locks stdout against the program's own output.
 class QEL_EXPORT LogBackendStdout : public LogBackendFiltered {
 public:
     using LogBackendFiltered::LogBackendFiltered;

@@ -11,14 +11,14 @@ namespace qel {
 
 /// The registry of all loggers of the process: the root logger and the tree of named ones below it.
 ///
-/// Names are dotted: the parent of "a.b.c" is "a.b", whose parent is "a", whose parent is the root. A name stands for
-/// itself even where dots lead, trail or double: ".a" is a child of the logger named "", which is a child of the root
-/// and not the root itself.
+/// Names are dotted: the parent of "a.b.c" is "a.b", whose parent is "a", whose parent is the root. Leading, trailing
+/// and double dots are not special: ".a" is a child of the logger named "", which is a child of the root and not the
+/// root itself.
 ///
-/// Lifetime: created on first use, destroyed at process exit after it has let go of all back-ends.
-/// Thread safety: every operation from any thread. One lock is behind them all; a process that forks while another
-/// thread holds it leaves it locked for ever in the child, so a child of a process with several threads must not log
-/// before it executes another program.
+/// Lifetime: created on first use; destroyed at process exit, after it has released all back-ends.
+/// Thread safety: every operation from any thread. They share one lock. If a process forks while another thread holds
+/// it, it stays locked in the child, so the child of a process with several threads must not log before it executes
+/// another program.
 class QEL_EXPORT QelDebug {
 public:
     /// @return the one registry of the process
@@ -30,16 +30,18 @@ public:
     /// @return the root logger
     QelLogger& getLogger() noexcept { return mRootLogger; }
 
-    /// @return the logger of that name, created together with all its ancestors where missing
+    /// @return the logger of that name; it and its ancestors are created if they do not exist
+    /// @throws std::bad_alloc  no memory; some of the ancestors may have been created
     QelLogger& getLogger(const std::string& name) QEL_EXCLUDES(mLock);
 
-    /// @return the logger of that name, or null if nobody ever asked for it; creates nothing. The root is not found
-    /// under any name.
+    /// @return the logger of that name, or null if it was never created; creates nothing. The root has no name by which
+    /// it could be found.
     QelLogger* tryGetLogger(const std::string& name) QEL_EXCLUDES(mLock);
 
-    /// Returns every logger to its initial state: no back-ends, threshold Warn and no propagation for the root,
-    /// threshold Inherit and propagation for the others. The loggers themselves stay. Back-ends that nobody else owns
-    /// are destroyed before this returns, but after the lock is released.
+    /// Returns every logger to its initial state: no back-ends; threshold Warn and no propagation for the root,
+    /// threshold Inherit and propagation for the others. The loggers stay valid. Back-ends without another owner are
+    /// destroyed before this returns and after the lock is released.
+    /// @throws std::bad_alloc  no memory; no logger has changed
     void resetLoggers() QEL_EXCLUDES(mLock);
 
 private:

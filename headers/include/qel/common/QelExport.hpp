@@ -1,9 +1,8 @@
 #pragma once
 
 /// @file
-/// Which symbols of the shared library its users may see. The library is built with hidden visibility; a class,
-/// exception or free function that carries QEL_EXPORT is part of its binary interface. Exceptions need it above all:
-/// without it a program could not catch them by type across the border of the library.
+/// QEL_EXPORT marks the classes and free functions that belong to the binary interface of the shared library, which is
+/// built with hidden visibility. Exceptions need it too: without it, a program cannot catch them by type.
 
 #if defined(__GNUC__)
 #define QEL_EXPORT __attribute__((visibility("default")))

@@ -20,22 +20,24 @@
 
 /// @file
 /// Small wrapper objects that print a value in the library's one style: `os << hexFormat(length)`. Every diagnostic
-/// text goes through them.
+/// text of the library goes through them.
 ///
-/// Lifetime: a formatter holds pointers or copies and owns no buffer. It is meant to be printed in the statement that
-/// makes it; one that points into a buffer, a container or an exception must not outlive that.
+/// Lifetime: a formatter holds pointers or copies and owns no buffer. Print it in the statement that makes it; one that
+/// points into a buffer, a container or an exception must not outlive that.
 ///
 /// State of the stream: the hexadecimal and decimal formatters do not restore base, case and fill. A plain integer
-/// printed after hexFormat() appears in upper-case hexadecimal; print it through decFormat() to be sure. Each formatter
-/// that prints numbers sets the base it needs first. Alignment is the caller's: on a stream set to std::left the zeros
-/// that fill a hexadecimal number up come behind its digits.
+/// printed after hexFormat() appears in upper-case hexadecimal; decFormat() prints it in decimal. Each formatter that
+/// prints numbers sets the base that it needs. Alignment and locale are those of the stream: on a stream set to
+/// std::left the fill zeros of a hexadecimal number follow its digits, and a locale that groups digits groups
+/// hexadecimal ones, too ("0x6.003"). toString() and log lines use the classic locale.
 ///
-/// Thread safety: formatters are values; the stream belongs to one thread at a time. They throw only what the stream
-/// throws (nothing, unless its exceptions were switched on).
+/// Thread safety: formatters are values; one thread at a time uses a stream.
+/// A stream operator throws what the stream throws (nothing, unless its exceptions are enabled); ExceptionInfo and
+/// toString() may also throw std::bad_alloc, and StringJoiner what the operators of its elements throw.
 
 namespace qel {
 
-/// Into which integer a value is turned before it is printed: `Type` is the printed type, `convert` makes it.
+/// The integer as which a value is printed: `Type` is its type, `convert` computes it.
 ///
 /// Types of one byte become unsigned 16-bit numbers, so that they print as numbers and not as characters; the signed
 /// ones among them are sign-extended. Plain `char` counts as signed on every platform, so the character with code 0x80
@@ -86,7 +88,9 @@ struct PrintableInteger<bcd_uint<T>> {
     static Type convert(const bcd_uint<T>& value) noexcept { return PrintableInteger<T>::convert(value.value()); }
 };
 
-/// What the formatters with a prefix in front of hexadecimal digits share.
+/// The base of the formatters that print a prefix and hexadecimal digits.
+/// They leave the stream in upper-case hexadecimal with fill character '0', and a locale of the stream that groups
+/// digits groups theirs; see the top of this file.
 class HexFormatterBase {
 public:
     static constexpr const char* PREFIX = "0x";
@@ -95,9 +99,9 @@ public:
 protected:
     HexFormatterBase() noexcept : mPrefix(PREFIX) {}
 
-    /// Writes the prefix, then puts the stream into hexadecimal with upper-case digits, fill character '0' and the
-    /// given field width. The prefix comes first because it would take up the field width.
-    /// @param width digits of the number that is printed next
+    /// Writes the prefix, then sets the stream to hexadecimal, upper-case digits, fill character '0' and the given
+    /// field width. The prefix comes first because it would use up the field width.
+    /// @param width the number of digits of the next number
     void pSetupStream(std::ostream& os, std::size_t width) const
     {
         os << mPrefix;
@@ -110,7 +114,8 @@ protected:
     const char* mPrefix; // PREFIX or NO_PREFIX
 };
 
-/// Prints one integer in hexadecimal, "0x" in front, with at least HexWidth<T> digits: 0x001F for a 16-bit 0x1F.
+/// Prints "0x" and one integer in hexadecimal with at least HexWidth<T> digits: 0x001F for a 16-bit 0x1F.
+/// Leaves the stream in upper-case hexadecimal; on a stream whose locale groups digits, 0x6003 prints as "0x6.003".
 /// Made by hexFormat(). Holds a copy of the value.
 template <typename T>
 class HexFormatter : public HexFormatterBase {
@@ -119,7 +124,8 @@ public:
 
     explicit HexFormatter(const T& value) noexcept : mValue(PrintableInteger<T>::convert(value)) {}
 
-    /// Leaves the prefix out. @return this formatter, so that it chains: `os << hexFormat(x).noPrefix()`
+    /// Omits the prefix.
+    /// @return this formatter, so that it chains: `os << hexFormat(x).noPrefix()`
     HexFormatter& noPrefix() noexcept
     {
         mPrefix = NO_PREFIX;
@@ -136,7 +142,8 @@ private:
     ConvertedType mValue;
 };
 
-/// Prints one integer in decimal, whatever base the stream was left in. Made by decFormat(). Holds a copy of the value.
+/// Prints one integer in decimal and leaves the stream in decimal. On a stream whose locale groups digits, 4711 prints
+/// as "4.711". Made by decFormat(). Holds a copy of the value.
 template <typename T>
 class DecFormatter {
 public:
@@ -168,15 +175,16 @@ DecFormatter<T> decFormat(const T& value) noexcept
     return DecFormatter<T>(value);
 }
 
-/// Prints a byte string as one run of hexadecimal digits, two for each byte, with one prefix in front: the bytes
-/// 01 AB 00 print as 0x01AB00.
+/// Prints a byte string as "0x" and two hexadecimal digits for each byte: the bytes 01 AB 00 print as 0x01AB00. Leaves
+/// the stream in upper-case hexadecimal.
 class HexStringFormatter : public HexFormatterBase {
 public:
     /// @param ptr    the first of `length` bytes, borrowed until the formatter is printed; may be null if `length` is 0
     /// @param length number of bytes
     HexStringFormatter(const void* ptr, std::size_t length) noexcept : mPtr(ptr), mLength(length) {}
 
-    /// Leaves the prefix out. @return this formatter, so that it chains
+    /// Omits the prefix.
+    /// @return this formatter, so that it chains
     HexStringFormatter& noPrefix() noexcept
     {
         mPrefix = NO_PREFIX;
@@ -191,10 +199,10 @@ private:
 };
 QEL_EXPORT std::ostream& operator<<(std::ostream& os, const HexStringFormatter& formatter);
 
-/// Prints a hex dump: lines of 16 bytes in eight groups of two, a blank before each group, and an empty line after the
-/// last one: " 0001 0203 0405 0607 0809 0a0b 0c0d 0e0f". The digits are lower case unless an earlier hexadecimal
-/// formatter left the stream in upper case. The stream is left in hexadecimal with fill character '0', and is flushed
-/// at each line end.
+/// Prints a hex dump: lines of 16 bytes in eight groups of two, a blank before each group, and an empty line at the
+/// end: " 0001 0203 0405 0607 0809 0a0b 0c0d 0e0f". The digits are lower case unless an earlier hexadecimal formatter
+/// left the stream in upper case. Flushes the stream at each line end and leaves it in hexadecimal with fill character
+/// '0'.
 class HexDumpFormatter {
 public:
     /// @param ptr       the first of `length` bytes, borrowed until the formatter is printed; may be null when `length`
@@ -215,7 +223,7 @@ private:
 };
 QEL_EXPORT std::ostream& operator<<(std::ostream& os, const HexDumpFormatter& formatter);
 
-/// Prints exactly the given number of characters, zero characters included, without padding.
+/// Prints exactly the given number of characters, null bytes included, without padding.
 class CharArrayFormatter {
 public:
     /// @param buffer the first of `length` characters, borrowed until the formatter is printed; may be null when
@@ -231,9 +239,8 @@ private:
 };
 QEL_EXPORT std::ostream& operator<<(std::ostream& os, const CharArrayFormatter& formatter);
 
-/// Prints a signal number in decimal and, where the C library has a description of it, that in parentheses:
-/// "15 (Terminated)". Numbers without a description, such as 0, the real-time signals and everything outside 0 to 64,
-/// print alone. See sigdescr_np(3).
+/// Prints a signal number in decimal and, if the C library has one, its description in parentheses: "15 (Terminated)".
+/// 0, the real-time signals and numbers outside [0, 64] have none. See sigdescr_np(3).
 class SignalFormatter {
 public:
     explicit SignalFormatter(int code) noexcept : mCode(code) {}
@@ -245,8 +252,8 @@ private:
 };
 QEL_EXPORT std::ostream& operator<<(std::ostream& os, const SignalFormatter& formatter);
 
-/// Prints an exception as its type and its text: "qel::PosixError: 5 (Input/output error)". The type is the dynamic
-/// one.
+/// Prints the dynamic type and the text of an exception: "qel::PosixError: 5 (Input/output error)". Printing throws
+/// std::bad_alloc if there is no memory for the name of the type.
 class ExceptionInfo {
 public:
     /// @param exception borrowed until the formatter is printed
@@ -259,15 +266,15 @@ private:
 };
 QEL_EXPORT std::ostream& operator<<(std::ostream& os, const ExceptionInfo& info);
 
-/// Prints a number of copies of one character, to indent the lines of a dump. A field width that is pending on the
-/// stream is neither applied nor used up.
+/// Prints a number of copies of one character, to indent the lines of a dump. Neither applies nor resets the field
+/// width of the stream.
 class Indent {
 public:
-    /// @param count how many copies
+    /// @param count the number of copies
     /// @param value the character
     Indent(std::size_t count, char value) noexcept : mCount(count), mValue(value) {}
 
-    /// @return an Indent of `count` more copies of the same character, for a nested part
+    /// @return an Indent with `count` more copies of the same character, for a nested part
     Indent operator+(std::size_t count) const noexcept
     {
         Indent deeper(*this);
@@ -290,8 +297,8 @@ private:
 QEL_EXPORT std::ostream& operator<<(std::ostream& os, const Indent& indent);
 
 /// Prints a duration as days, hours, minutes, seconds and milliseconds: 001d:02h:03m:04.005s. More than 999 days take
-/// as many digits as they need. Each part of a negative duration keeps its sign. The stream's flags are restored, its
-/// fill character stays '0'.
+/// as many digits as they need, up to 2147483647 days: the count has 32 bits and wraps around. Each part of a negative
+/// duration keeps its sign. Restores the flags of the stream; its fill character stays '0'.
 class DHMSDurationFormatter {
 public:
     explicit DHMSDurationFormatter(const std::chrono::milliseconds& duration) noexcept : mDuration(duration) {}
@@ -303,8 +310,8 @@ private:
 };
 QEL_EXPORT std::ostream& operator<<(std::ostream& os, const DHMSDurationFormatter& formatter);
 
-/// Prints the elements of a range, each with its own insertion operator, and a separator between them. An empty range
-/// prints nothing. Made by join().
+/// Prints the elements of a range, each with its own stream operator, with a separator between them. An empty range
+/// prints nothing. Made by join(). Holds iterators: the range must not change before the joiner is printed.
 template <typename Iterator>
 class StringJoiner {
 public:
@@ -329,7 +336,8 @@ private:
     std::string mSeparator;
 };
 
-/// @param begin, end the range, borrowed until the result is printed
+/// @param begin      the beginning of the range, which is borrowed until the result is printed
+/// @param end        the end of the range
 /// @param separator  copied
 template <typename Iterator>
 StringJoiner<Iterator> join(Iterator begin, Iterator end, const std::string& separator)
@@ -337,7 +345,7 @@ StringJoiner<Iterator> join(Iterator begin, Iterator end, const std::string& sep
     return StringJoiner<Iterator>(std::move(begin), std::move(end), separator);
 }
 
-/// @param container anything with begin and end, borrowed until the result is printed: only its iterators are kept
+/// @param container any type with begin and end, borrowed until the result is printed: the result holds its iterators
 /// @param separator copied
 template <typename Container>
 auto join(const Container& container, const std::string& separator)
@@ -347,8 +355,9 @@ auto join(const Container& container, const std::string& separator)
     return join(begin(container), end(container), separator);
 }
 
-/// @return what a value prints onto a fresh stream, with numbers in the classic locale, so that a program's own locale
-/// does not change the library's texts
+/// @return what a value prints onto a fresh stream in the classic locale, so that the global locale of the program does
+/// not change the library's texts
+/// @throws std::bad_alloc  no memory
 template <typename T>
 std::string toString(const T& value)
 {

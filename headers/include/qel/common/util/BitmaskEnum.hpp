@@ -3,25 +3,26 @@
 #include <type_traits>
 
 /// @file
-/// Bitwise operators for enumerations whose values are bits. Mark the enumeration, and `|`, `&`, `^`, `~` and the
-/// compound forms work on it and give the same type:
+/// Bitwise operators for enumerations whose values are bits. Specialise is_bitmask_enum for the enumeration; `|`, `&`,
+/// `^`, `~`, `|=`, `&=` and `^=` then take it and return the same type:
 /// @code
 /// enum class Option : int { Default = 0, Blocking = 1, LowPriority = 2 };
 /// template <> struct is_bitmask_enum<Option> : std::true_type {};
 /// if ((options & Option::Blocking) != Option::Default) ...
 /// @endcode
-/// The enumeration needs a fixed underlying type (an `enum class` always has one): only then is every combination a
-/// value of it. The operators live in namespace qel and are found by themselves for enumerations of that namespace and
-/// of classes in it; code in another namespace names them, as in `using qel::operator|;`.
+/// The enumeration needs a fixed underlying type (an `enum class` always has one): only then is every combination of
+/// bits a value of it. Argument-dependent lookup finds the operators for enumerations in namespace qel and in its
+/// classes; for an enumeration of another namespace write `using qel::operator|;`.
+/// Thread safety: the operators are functions of their arguments; the compound ones write to their left one.
 
 namespace qel {
 
-/// Whether an enumeration is a set of bits. Specialise as std::true_type, in namespace qel.
+/// Whether the values of an enumeration are sets of bits. Specialise as std::true_type, in namespace qel.
 template <typename E>
 struct is_bitmask_enum : std::false_type {};
 
-/// The type E, for enumerations that are marked; for all other types there is none and the operators do not take part
-/// in overload resolution.
+/// E, if is_bitmask_enum<E> is true. There is no such type otherwise, which removes the operators from overload
+/// resolution.
 template <typename E>
 using bitmask_enum_t = std::enable_if_t<std::is_enum<E>::value && is_bitmask_enum<E>::value, E>;
 

@@ -8,24 +8,26 @@
 #include <string>
 
 /// @file
-/// How failed system calls are reported.
+/// The error codes and exceptions of failed system calls.
 
 namespace qel {
 
-/// An error number of the C library, as errno holds it. A value: copied freely, compared by number.
-/// Thread safety: that of a plain integer.
+/// An error number of the C library, as in errno. A value, compared by number. An int converts to it, so
+/// `code == EINTR` and `code != EINTR` compile.
+/// Thread safety: that of an int.
 class QEL_EXPORT PosixErrorCode {
 public:
-    /// The code 0. Does not look at errno: whoever reports a failed call passes it on.
+    /// The code 0. Does not read errno: pass errno to report a failed call.
     PosixErrorCode() noexcept : mCode(0) {}
 
-    /// @param code an error number; a negative one, as some calls return it, means the same as the positive one
+    /// @param code an error number; some calls return it negated, so its sign is ignored
     PosixErrorCode(int code) noexcept;
 
     /// @return the error number, never negative
     int getCode() const noexcept { return mCode; }
 
     /// @return what the stream operator writes, for example "5 (Input/output error)"
+    /// @throws std::bad_alloc  no memory
     std::string message() const;
 
     bool operator==(const PosixErrorCode& other) const noexcept { return mCode == other.mCode; }
@@ -35,21 +37,25 @@ private:
     std::int32_t mCode; // never negative
 };
 
-/// Writes the number in decimal and, where the C library has one, its description in parentheses:
+/// Writes the number in decimal and, if the C library has one, its description in parentheses:
 /// "5 (Input/output error)". Leaves the stream in decimal. See strerror_r(3).
+/// Thread safety: any thread, each with a stream of its own.
 QEL_EXPORT std::ostream& operator<<(std::ostream& os, const PosixErrorCode& code);
 
-/// A system call failed. The text is composed at construction and never changes.
+/// A failed system call. The text is composed at construction and does not change.
+/// Thread safety: that of std::runtime_error: copies may be used by different threads.
 class QEL_EXPORT PosixError : public std::runtime_error {
 public:
-    /// The text is that of the code alone: "24 (Too many open files)".
+    /// The text is that of the code: "24 (Too many open files)".
+    /// @throws std::bad_alloc  no memory
     explicit PosixError(PosixErrorCode code);
 
-    /// The text is the context, ": " and that of the code: "Failed to open socket: 24 (Too many open files)".
-    /// Save errno in a variable on the line after the failed call: building the context may change it.
+    /// The text is the context, ": " and the text of the code: "Failed to open socket: 24 (Too many open files)".
+    /// Save errno on the line after the failed call: composing the context may change it.
+    /// @throws std::bad_alloc  no memory
     PosixError(PosixErrorCode code, const std::string& context);
 
-    /// Copies share the text and the code; moving copies, so that the source stays whole.
+    /// Copies share the text; a move is a copy, so the source stays valid.
     PosixError(const PosixError&) noexcept = default;
     PosixError& operator=(const PosixError&) noexcept = default;
     ~PosixError() override;
@@ -61,7 +67,8 @@ private:
     PosixErrorCode mErrorCode;
 };
 
-/// Reading or writing a file failed. A kind of its own, so that callers can tell it from an error of a socket.
+/// A failure to read or write a file: a class of its own, so that callers can catch it apart from socket errors.
+/// Thread safety: as PosixError.
 class QEL_EXPORT FileIOError : public PosixError {
 public:
     using PosixError::PosixError;
@@ -72,13 +79,13 @@ public:
 
 namespace detail {
 
-// strerror_r comes in two forms under one name, and the compilation options of the program decide which one it gets.
-// These two overloads take the result of either and give the text, or null when there is none.
+// strerror_r has two forms; the compilation options decide which one a program gets. One overload takes the result of
+// each and returns the text, or null if there is none.
 
-/// The GNU form returns the text, which need not stand in the caller's buffer.
+/// The GNU form returns the text, which may be outside the caller's buffer.
 inline const char* errorDescription(const char* result, const char* /*buffer*/) noexcept { return result; }
 
-/// The POSIX form returns 0 when it has written the text to the caller's buffer, otherwise an error number.
+/// The POSIX form returns 0 if it has written the text to the caller's buffer, and an error number otherwise.
 inline const char* errorDescription(int result, const char* buffer) noexcept { return result == 0 ? buffer : nullptr; }
 
 } // namespace detail

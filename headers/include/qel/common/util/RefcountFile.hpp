@@ -8,13 +8,13 @@
 
 namespace qel {
 
-/// A file descriptor that several threads use and one of them may close at any time. The descriptor is closed exactly
-/// once, by whichever comes last of the closer and its users, so that no user ever works on a number that has been
-/// closed and given to another file.
+/// A file descriptor that several threads use and that one of them may close at any time. It is closed exactly once, by
+/// the last of its closer and its users, so that a user never works on a number that has been closed and reused for
+/// another file.
 ///
-/// Ownership: owns the descriptor; copies share it. It is closed by close(), or when the last copy is destroyed.
-/// Thread safety: lock-free; any number of threads may make guards and close at the same time. The object itself
-/// (copying it, assigning to it) belongs to one thread at a time.
+/// Ownership: owns the descriptor; copies share it. close() closes it, or the destruction of the last copy.
+/// Thread safety: lock-free; any number of threads may make guards and call close() at the same time. One thread at a
+/// time may copy an object or assign to it.
 /// @code
 /// RefcountFile::Guard guard(file);
 /// if (guard.isValid()) use(guard.getFd());
@@ -24,16 +24,16 @@ public:
     class ControlBlock;
     class Guard;
 
-    /// @param fd a descriptor, owned from here on; with a negative one the object starts closed
-    /// @throws std::bad_alloc the descriptor is then still the caller's
+    /// @param fd a descriptor, which this object owns from now on; if it is negative, the object starts closed
+    /// @throws std::bad_alloc  no memory; the caller still owns the descriptor
     explicit RefcountFile(int fd);
 
-    /// Copies share one descriptor; moving copies, so that the source stays usable.
+    /// Copies share one descriptor; a move is a copy, so the source stays usable.
     RefcountFile(const RefcountFile&) = default;
     RefcountFile& operator=(const RefcountFile&) = default;
 
-    /// Closes the descriptor for all copies: at once when no guard holds it, otherwise when the last of those guards
-    /// ends. Guards made from now on get nothing. Closing again does nothing.
+    /// Closes the descriptor for all copies: at once if no guard holds it, otherwise with the last of those guards.
+    /// Later guards are not valid. A second call does nothing.
     void close() noexcept;
 
 private:
@@ -41,10 +41,10 @@ private:
 };
 
 /// The descriptor and the count of its users. Shared by the copies of one RefcountFile.
-/// Thread safety: every operation but the destructor may be called from any thread.
+/// Thread safety: any thread may call every operation except the destructor.
 class QEL_EXPORT RefcountFile::ControlBlock {
 public:
-    /// @param fd a descriptor, owned from here on; with a negative one the block starts closed
+    /// @param fd a descriptor, which this block owns from now on; if it is negative, the block starts closed
     explicit ControlBlock(int fd) noexcept;
 
     /// Calls close().
@@ -54,21 +54,21 @@ public:
     ControlBlock& operator=(const ControlBlock&) = delete;
 
     /// Begins a use of the descriptor.
-    /// @return the descriptor, which stays open until the matching putFd(); -1 after close(), to be given back never
+    /// @return the descriptor, which stays open until the matching putFd(); -1 after close(), which needs no putFd()
     int getFd() noexcept;
 
-    /// Ends a use that getFd() began with a descriptor. Closes the descriptor when it was the last use after close().
+    /// Ends a use for which getFd() returned a descriptor. Closes it if this was the last use after close().
     void putFd() noexcept;
 
-    /// Refuses further uses and closes the descriptor, at once when nobody uses it, otherwise with the last use.
-    /// Does nothing when it was called before.
+    /// Refuses further uses and closes the descriptor: at once if it is not in use, otherwise with the last use. A
+    /// second call does nothing.
     void close() noexcept;
 
 private:
     static constexpr std::uint64_t kOpen = 0x8000000000000000U;
 
-    // The top bit is set while open, the other 63 bits count the users. Word and flag change together: the one who
-    // brings the whole word to 0 is the one who closes.
+    // The top bit is set while open, the other 63 bits count the users. Flag and count change as one word: the thread
+    // that makes the word 0 closes.
     std::atomic<std::uint64_t> mRefcount;
     const std::int32_t mFd;
 };
@@ -78,16 +78,17 @@ private:
 /// Thread safety: a guard belongs to one thread at a time.
 class QEL_EXPORT RefcountFile::Guard {
 public:
+    /// @param file borrowed for the call
     explicit Guard(RefcountFile& file) noexcept;
     ~Guard();
 
     Guard(const Guard&) = delete;
     Guard& operator=(const Guard&) = delete;
 
-    /// @return whether the guard got a descriptor; false when the file was closed before
+    /// @return whether the guard has a descriptor; false if the file was closed before
     bool isValid() const noexcept { return mFd >= 0; }
 
-    /// @return the descriptor, open and of the same file as long as the guard lives, or -1; never close it
+    /// @return the descriptor, which stays open as long as the guard lives, or -1; do not close it
     int getFd() const noexcept { return mFd; }
 
 private:

@@ -8,18 +8,18 @@
 
 namespace qel {
 
-/// A history of the last N elements: a new element takes the place of the oldest one when all places are taken. Walking
-/// it from begin() to end() goes from the newest element to the oldest.
+/// A history of the last N elements: when it is full, a new element replaces the oldest one. Iteration goes from the
+/// newest element to the oldest.
 ///
-/// Ownership: owns its elements, in place; an element is destroyed when a newer one takes its place. Copies copy them.
+/// Ownership: owns its elements, in place, and destroys an element when a newer one replaces it. A copy copies them.
 /// T needs no default constructor.
-/// Thread safety: that of a standard container.
+/// Thread safety: that of a standard container: several threads may read, or one may write.
 template <typename T, std::size_t N>
 class RingBuffer {
-    static_assert(N > 0, "a history without a place for its newest element");
+    static_assert(N > 0, "a history holds at least one element");
 
 public:
-    /// Walks from the newest element to the oldest. Valid until the next push() and as long as the ring lives.
+    /// Goes from the newest element to the oldest. Valid until the next push() and as long as the ring lives.
     class ConstIterator {
     public:
         using iterator_category = std::forward_iterator_tag;
@@ -28,7 +28,7 @@ public:
         using pointer = const T*;
         using reference = const T&;
 
-        /// Belongs to no ring; may only be assigned to and compared with others of its kind.
+        /// Does not belong to a ring; may only be assigned to and compared with its like.
         ConstIterator() noexcept : mBuffer(nullptr), mOffset(0) {}
 
         reference operator*() const { return mBuffer->pAt(mOffset); }
@@ -65,24 +65,24 @@ public:
         std::size_t mOffset;       // 0 is the newest element
     };
 
-    /// Constructs a new newest element in place, in the place of the oldest one when the ring is full.
-    /// @param arguments for the constructor of T; they must not refer to the element whose place is taken, which is
+    /// Constructs a new newest element in place; in a full ring it replaces the oldest one.
+    /// @param arguments for the constructor of T; they must not refer to the element that is replaced, which is
     ///                  destroyed first
-    /// @return the new element
-    /// @throws what the constructor of T throws; the ring then holds what it held, less the oldest element if it was
-    /// full
+    /// @return the new element, valid until it is replaced
+    /// @throws what the constructor of T throws; the ring then holds the elements it held, without the oldest if it was
+    ///         full
     template <typename... Arguments>
     T& push(Arguments&&... arguments)
     {
         const std::size_t next = (mHead + 1) % N;
-        if (mLength == N) --mLength; // counted out before it is destroyed, in case the constructor throws
+        if (mLength == N) --mLength; // before the element is destroyed, in case the constructor throws
         T& newest = mEntries[next].emplace(std::forward<Arguments>(arguments)...);
         mHead = next;
         ++mLength;
         return newest;
     }
 
-    /// @return the newest element; the ring must not be empty
+    /// @return the newest element, valid until it is replaced; the ring must not be empty
     T& head() { return *mEntries[mHead]; }
     const T& head() const { return *mEntries[mHead]; }
 
@@ -95,10 +95,10 @@ public:
     ConstIterator end() const noexcept { return ConstIterator(this, mLength); }
 
 private:
-    /// @param offset how many elements lie between the newest one and the one asked for; below mLength
+    /// @param offset the distance of the element from the newest one; below mLength
     const T& pAt(std::size_t offset) const { return *mEntries[(mHead + N - offset) % N]; }
 
-    std::size_t mHead = 0;   // place of the newest element, when there is one
+    std::size_t mHead = 0;   // index of the newest element, if there is one
     std::size_t mLength = 0; // number of elements
     std::array<std::optional<T>, N> mEntries;
 };

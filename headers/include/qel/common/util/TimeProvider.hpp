@@ -6,23 +6,28 @@
 
 namespace qel {
 
-/// The clocks of the library. All its readings of the time go through system() and steady(), so that a test or a
-/// simulation can put its own time in their place: derive from this class and call pRegister().
+/// The clocks of the library. A test or a simulation can substitute its own time: derive from this class and call
+/// pRegister(). Log lines, statistics and deadlines read the time through system() and steady(). Two readings do not:
+/// QelMessageQueue::waitForMsg() sleeps in real time and computes the end of its sleep from the standard steady clock,
+/// and the validity periods of certificates come from time(2), as do OpenSSL's own checks.
 ///
-/// There is one current provider for the process: the standard clocks, unless another one has registered. Both
-/// functions work from the first static initialiser to the last static destructor of the process.
+/// A process has one current provider: the standard clocks, unless another one has registered. Both functions work from
+/// the first static initialiser to the last static destructor of the process.
 ///
-/// Thread safety: system() and steady() may be called from any thread. Registering and unregistering take no lock and
-/// belong where no other thread reads the time: to the set-up and tear-down of a test.
+/// Lifetime: the current provider is borrowed; its destructor unregisters it.
+/// Thread safety: any thread may call system() and steady(). Registering and unregistering take no lock: do both, in
+/// the set-up and tear-down of a test for example, while no other thread reads the time.
 class QEL_EXPORT TimeProvider {
 public:
     /// @return the wall-clock time of the current provider
+    /// @throws what the pSystem() of a substitute throws; the standard clock does not throw
     static std::chrono::system_clock::time_point system();
 
     /// @return the time of the current provider that never runs backwards; for durations and deadlines
+    /// @throws what the pSteady() of a substitute throws; the standard clock does not throw
     static std::chrono::steady_clock::time_point steady();
 
-    /// Unregisters this provider, so that a substitute clock that goes out of scope is never left in force.
+    /// Unregisters this provider, so that a substitute that goes out of scope does not stay current.
     virtual ~TimeProvider();
 
     TimeProvider(const TimeProvider&) = delete;
@@ -31,21 +36,22 @@ public:
 protected:
     constexpr TimeProvider() noexcept = default;
 
-    /// Answers system() while this provider is the current one. Not const: a substitute may count or advance.
+    /// What system() returns while this provider is current. Not const: a substitute may count or advance.
     virtual std::chrono::system_clock::time_point pSystem() = 0;
 
-    /// Answers steady() while this provider is the current one. Not const: a substitute may count or advance.
+    /// What steady() returns while this provider is current. Not const: a substitute may count or advance.
     virtual std::chrono::steady_clock::time_point pSteady() = 0;
 
-    /// Makes this provider the current one, in place of whichever was. Call it at the end of the constructor.
+    /// Makes this provider the current one. Call it at the end of the constructor.
     void pRegister() noexcept;
 
-    /// Puts the standard clocks back in force when this provider is the current one; otherwise does nothing. Providers
-    /// do not stack: the one that was current before does not come back.
+    /// Makes the standard clocks current again if this provider is current; does nothing otherwise. Providers do not
+    /// stack: the one that was current before this one does not become current again.
     void pUnregister() noexcept;
 };
 
 /// The standard system and steady clocks. The library holds one of these and never destroys it.
+/// Thread safety: any thread.
 class QEL_EXPORT DefaultTimeProvider : public TimeProvider {
 public:
     constexpr DefaultTimeProvider() noexcept = default;
