@@ -6,7 +6,7 @@ namespace qel {
 
 namespace {
 
-// Room for most log lines, so that they cost one allocation each instead of one for every doubling.
+// Enough for most log lines, so that a line costs one allocation instead of one for every doubling.
 constexpr std::size_t kFirstCapacity = 255;
 
 } // namespace
@@ -35,8 +35,8 @@ CappedStringStreambuf::int_type CappedStringStreambuf::overflow(int_type charact
     return traits_type::not_eof(character);
 }
 
-// The base is built before the buffer, so it gets the buffer afterwards; that also clears the badbit which a stream
-// without a buffer starts with.
+// The base is constructed before the buffer, so it gets the buffer afterwards. rdbuf() also clears the badbit of a
+// stream without a buffer.
 CappedStringStream::CappedStringStream(std::size_t maxSize) : std::ostream(nullptr), mBuffer(maxSize)
 {
     rdbuf(&mBuffer);

@@ -8,7 +8,7 @@ LogBackendStdout::~LogBackendStdout() = default;
 
 void LogBackendStdout::pLog(const std::string& line)
 {
-    std::puts(line.c_str()); // nobody to tell when it fails
+    std::puts(line.c_str()); // output errors are ignored
 }
 
 } // namespace qel

@@ -12,7 +12,7 @@ namespace LogLevel {
 
 namespace {
 
-// By level + 1. Constant data, so that other static objects may log while they are built.
+// Indexed by level + 1. Constant data, so that constructors of static objects may log.
 constexpr const char* kNames[] = {"INHERIT", "DEBUG", "INFO", "WARN", "ERROR", "CRITICAL"};
 static_assert(sizeof(kNames) / sizeof(kNames[0]) == Max - Min + 1, "one name for each level");
 

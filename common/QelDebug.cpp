@@ -14,7 +14,7 @@ QelDebug& QelDebug::globals()
 
 QelDebug::QelDebug() : mRootLogger(QelLogger::CtorPasskey(), *this) {}
 
-// The back-ends go first, while the loggers are still whole: the destructor of one may log.
+// Back-ends are destroyed before the loggers, since the destructor of a back-end may log.
 QelDebug::~QelDebug() { resetLoggers(); }
 
 QelLogger& QelDebug::getLogger(const std::string& name)
@@ -41,8 +41,7 @@ QelLogger* QelDebug::tryGetLogger(const std::string& name)
 
 void QelDebug::resetLoggers()
 {
-    // Declared before the lock, hence destroyed after its release: the destructor of a back-end may take its time over
-    // a file, or log.
+    // Declared before the lock, so destroyed after its release: the destructor of a back-end may be slow, or log.
     std::vector<std::vector<std::shared_ptr<LogBackend>>> released;
     const MutexLock lock(mLock);
     released.reserve(mLoggers.size() + 1);

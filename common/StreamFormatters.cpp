@@ -11,20 +11,20 @@ namespace {
 
 constexpr std::uint64_t kDumpBytesPerLine = 16;
 
-/// @return the C library's description of a signal, null when it has none
+/// @return the C library's description of a signal, or null
 const char* signalDescription(int number) noexcept
 {
     constexpr int kSignals = 65; // the table covers the signals 0 to 64
     if (number < 0 || number >= kSignals) return nullptr;
-// Two lines, not one condition: other C libraries have no macro __GLIBC_PREREQ, and its call would not even parse.
+// Two conditions, not one: without the macro __GLIBC_PREREQ, which other C libraries lack, its call does not parse.
 #if defined(__GLIBC__)
 #if __GLIBC_PREREQ(2, 32)
-    return ::sigdescr_np(number); // reads the table that was called sys_siglist before
+    return ::sigdescr_np(number); // reads the table that was sys_siglist
 #else
     return ::sys_siglist[number];
 #endif
 #else
-    // strsignal makes up a text for numbers that have no description; these have one everywhere.
+    // strsignal invents a text for numbers without a description; 1 to 31 have one everywhere.
     return number >= 1 && number <= 31 ? ::strsignal(number) : nullptr;
 #endif
 }
@@ -38,7 +38,7 @@ std::ostream& operator<<(std::ostream& os, const HexStringFormatter& formatter)
     for (std::uint64_t i = 0; i < formatter.mLength; ++i) {
         os << std::setw(2) << static_cast<unsigned int>(bytes[i]);
     }
-    os.width(0); // with no byte to use it up, the width would pad whatever is printed next
+    os.width(0); // without a byte, the width would pad the next output
     return os;
 }
 
@@ -88,7 +88,7 @@ std::ostream& operator<<(std::ostream& os, const DHMSDurationFormatter& formatte
 {
     using Days = std::chrono::duration<std::int32_t, std::ratio<86400>>;
 
-    // Remainders, not differences: those would overflow for durations whose days do not fit their count.
+    // Remainders, not differences: a difference would overflow if the days do not fit their count.
     const std::chrono::milliseconds total = formatter.mDuration;
     const auto days = std::chrono::duration_cast<Days>(total).count();
     const auto hours = std::chrono::duration_cast<std::chrono::hours>(total % Days(1)).count();

@@ -25,7 +25,7 @@ constexpr char kPathSeparators[] = "/";
 std::string lowercase(const std::string& text)
 {
     std::string result(text);
-    // As unsigned char: the C functions are undefined for negative characters.
+    // As unsigned char: tolower is undefined for negative characters.
     std::transform(result.begin(), result.end(), result.begin(),
                    [](unsigned char c) { return static_cast<char>(std::tolower(c)); });
     return result;

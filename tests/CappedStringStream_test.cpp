@@ -15,7 +15,7 @@ namespace {
 
 using Traits = std::streambuf::traits_type;
 
-TEST(CappedStringStreambuf, TakesWhatFitsAndSaysHowMuch)
+TEST(CappedStringStreambuf, TakesWhatFitsAndReturnsTheCount)
 {
     CappedStringStreambuf buffer(5);
     EXPECT_EQ(buffer.sputn("abc", 3), 3);
@@ -25,7 +25,7 @@ TEST(CappedStringStreambuf, TakesWhatFitsAndSaysHowMuch)
     EXPECT_EQ(buffer.str(), "abcde");
 }
 
-TEST(CappedStringStreambuf, TakesNothingOfNothing)
+TEST(CappedStringStreambuf, TakesNothingFromAnEmptyText)
 {
     CappedStringStreambuf buffer(5);
     EXPECT_EQ(buffer.sputn("abc", 0), 0);
@@ -42,7 +42,7 @@ TEST(CappedStringStreambuf, TakesSingleCharactersUpToTheLimit)
     EXPECT_EQ(buffer.str(), "ab");
 }
 
-TEST(CappedStringStreambuf, TakesTheByteThatLooksLikeEndOfFile)
+TEST(CappedStringStreambuf, TakesTheByte0xFF)
 {
     CappedStringStreambuf buffer(5);
     EXPECT_EQ(buffer.sputc('\xFF'), 0xFF);
@@ -55,7 +55,7 @@ public:
     using CappedStringStreambuf::overflow;
 };
 
-TEST(CappedStringStreambuf, TakesNoEndOfFile)
+TEST(CappedStringStreambuf, RefusesEndOfFile)
 {
     OpenStreambuf buffer(5);
     EXPECT_EQ(buffer.overflow(Traits::eof()), Traits::eof());
@@ -64,7 +64,7 @@ TEST(CappedStringStreambuf, TakesNoEndOfFile)
     EXPECT_EQ(buffer.str(), "x");
 }
 
-TEST(CappedStringStreambuf, WithALimitOfZeroTakesNothing)
+TEST(CappedStringStreambuf, TakesNothingWithALimitOfZero)
 {
     OpenStreambuf buffer(0);
     EXPECT_EQ(buffer.sputn("a", 1), 0);
@@ -81,7 +81,7 @@ TEST(CappedStringStream, IsUsableFromTheFirstInsertion)
     EXPECT_EQ(stream.str(), "text 42 0x001F\n");
 }
 
-TEST(CappedStringStream, TextThatExactlyFitsIsNoFailure)
+TEST(CappedStringStream, StaysGoodWhenTheTextFitsExactly)
 {
     CappedStringStream stream(5);
     stream << "abc"
@@ -90,7 +90,7 @@ TEST(CappedStringStream, TextThatExactlyFitsIsNoFailure)
     EXPECT_EQ(stream.str(), "abcde");
 }
 
-TEST(CappedStringStream, OneCharacterMoreIsCutAndPutsTheStreamIntoItsBadState)
+TEST(CappedStringStream, CutsTheCharacterBeyondTheLimitAndSetsBadbit)
 {
     CappedStringStream stream(5);
     stream << "abcdef";
@@ -98,7 +98,7 @@ TEST(CappedStringStream, OneCharacterMoreIsCutAndPutsTheStreamIntoItsBadState)
     EXPECT_EQ(stream.str(), "abcde");
 }
 
-TEST(CappedStringStream, AfterAFullTextTheNextCharacterFails)
+TEST(CappedStringStream, RefusesACharacterAfterAFullText)
 {
     CappedStringStream stream(5);
     stream << "abcde" << 'f';
@@ -106,7 +106,7 @@ TEST(CappedStringStream, AfterAFullTextTheNextCharacterFails)
     EXPECT_EQ(stream.str(), "abcde");
 }
 
-TEST(CappedStringStream, NumbersAreCutInTheMiddle)
+TEST(CappedStringStream, CutsANumberInTheMiddle)
 {
     CappedStringStream stream(5);
     stream << "abc" << 4711;
@@ -114,7 +114,7 @@ TEST(CappedStringStream, NumbersAreCutInTheMiddle)
     EXPECT_EQ(stream.str(), "abc47");
 }
 
-TEST(CappedStringStream, WhatFollowsTheCutIsDroppedThoughItWouldFit)
+TEST(CappedStringStream, DropsEverythingAfterTheCut)
 {
     CappedStringStream stream(5);
     stream << "abcdefgh";
@@ -123,7 +123,7 @@ TEST(CappedStringStream, WhatFollowsTheCutIsDroppedThoughItWouldFit)
     EXPECT_EQ(stream.str(), "abcde");
 }
 
-TEST(CappedStringStream, PaddingCountsToo)
+TEST(CappedStringStream, CountsPadding)
 {
     CappedStringStream stream(5);
     stream << std::setw(8) << std::setfill('.') << 42;
@@ -143,7 +143,7 @@ TEST(CappedStringStream, KeepsEveryByteValue)
     EXPECT_EQ(stream.str(), all + all);
 }
 
-TEST(CappedStringStream, HoldsTextFarBeyondItsFirstRoom)
+TEST(CappedStringStream, GrowsBeyondItsFirstCapacity)
 {
     CappedStringStream stream(100000);
     std::string expected;
@@ -155,7 +155,7 @@ TEST(CappedStringStream, HoldsTextFarBeyondItsFirstRoom)
     EXPECT_EQ(stream.str(), expected);
 }
 
-TEST(CappedStringStream, StrIsACopy)
+TEST(CappedStringStream, StrReturnsACopy)
 {
     CappedStringStream stream(100);
     stream << "one";
@@ -165,7 +165,7 @@ TEST(CappedStringStream, StrIsACopy)
     EXPECT_EQ(stream.str(), "one two");
 }
 
-TEST(CappedStringStream, RunningOutOfMemoryPutsItIntoItsBadState)
+TEST(CappedStringStream, SetsBadbitWithoutMemory)
 {
     QEL_TEST_NEEDS_ALLOCATIONS();
     CappedStringStream stream(100);

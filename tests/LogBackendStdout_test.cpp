@@ -16,7 +16,7 @@
 namespace qel::test {
 namespace {
 
-/// Sends the standard output of the process to a file for its lifetime.
+/// Redirects the standard output of the process to a file for its lifetime.
 class StdoutInFile {
 public:
     explicit StdoutInFile(const std::string& path)
@@ -54,7 +54,7 @@ TEST(LogBackendStdout, WritesTheLineAndALineEnd)
     EXPECT_EQ(Utilities::readFile(path), "first\n\ntwo\nlines\n");
 }
 
-TEST(LogBackendStdout, EndsALineAtANullByte)
+TEST(LogBackendStdout, CutsALineAtItsFirstNullByte)
 {
     const TemporaryDirectory directory;
     const std::string path = directory.file("output");
@@ -82,7 +82,7 @@ TEST(LogBackendStdout, FiltersByItsThreshold)
     EXPECT_EQ(Utilities::readFile(path), "warn\ndebug\n");
 }
 
-TEST(LogBackendStdout, GetsTheLinesOfTheLogger)
+TEST(LogBackendStdout, ReceivesTheLinesOfTheLogger)
 {
     const TemporaryDirectory directory;
     const std::string path = directory.file("output");
@@ -95,7 +95,7 @@ TEST(LogBackendStdout, GetsTheLinesOfTheLogger)
     EXPECT_EQ(Utilities::readFile(path), "through the logger\n");
 }
 
-// The buffer of a stream can be chosen before its first use only, so these two run in a process of their own.
+// The buffer of a stream can only be chosen before its first use, so these two tests run in a process of their own.
 
 TEST(LogBackendStdout, DoesNotFlush)
 {

@@ -33,7 +33,7 @@ constexpr LevelNames kLevels[] = {
     {LogLevel::Error, 3, "ERROR", 'E'},      {LogLevel::Critical, 4, "CRITICAL", 'C'},
 };
 
-TEST(LogLevel, IsASigned32BitNumber)
+TEST(LogLevel, IsASigned32BitInteger)
 {
     EXPECT_TRUE((std::is_same_v<std::underlying_type_t<LogLevel::Level>, std::int32_t>));
 }
@@ -80,7 +80,7 @@ TEST(LogLevel, ParsesNamesLettersAndNumbers)
         {"D", LogLevel::Debug},
         {"0", LogLevel::Debug},
         {"Info", LogLevel::Info},
-        {"i", LogLevel::Info}, // not Inherit, though that begins with the same letter
+        {"i", LogLevel::Info}, // not Inherit, which begins with the same letter
         {"I", LogLevel::Info},
         {"1", LogLevel::Info},
         {"warn", LogLevel::Warn},
@@ -95,7 +95,7 @@ TEST(LogLevel, ParsesNamesLettersAndNumbers)
         {"critical", LogLevel::Critical},
         {"C", LogLevel::Critical},
         {"4", LogLevel::Critical},
-        // what std::stoi takes for a number in decimal
+        // what std::stoi parses as a decimal number
         {"4x", LogLevel::Critical},
         {" 3", LogLevel::Error},
         {"+2", LogLevel::Warn},
@@ -108,7 +108,7 @@ TEST(LogLevel, ParsesNamesLettersAndNumbers)
     }
 }
 
-TEST(LogLevel, ParsingANumberThatIsNoLevelThrows)
+TEST(LogLevel, RefusesANumberOutsideTheRange)
 {
     for (const char* text : {"5", "-2", "2147483647", "-2147483648"}) {
         SCOPED_TRACE(text);
@@ -116,7 +116,7 @@ TEST(LogLevel, ParsingANumberThatIsNoLevelThrows)
     }
 }
 
-TEST(LogLevel, ParsingWhatIsNeitherNameNorNumberLetsTheConversionsExceptionPass)
+TEST(LogLevel, ParsingNeitherNameNorNumberThrowsTheExceptionOfStoi)
 {
     for (const char* text : {"loud", "", " ", "^^", "warning", "warn ", " warn", "?", "-"}) {
         SCOPED_TRACE(text);
@@ -143,10 +143,10 @@ TEST(LogLevel, IsReadAsOneWord)
     is >> level;
     EXPECT_EQ(level, LogLevel::Debug);
     EXPECT_THAT([&] { is >> level; }, ThrowsMessage<std::invalid_argument>(StrEq("stoi"))) << "\"^rest\" is one word";
-    EXPECT_EQ(level, LogLevel::Debug) << "kept when the word is no level";
+    EXPECT_EQ(level, LogLevel::Debug) << "kept after an invalid word";
 }
 
-TEST(LogLevel, KeepsItsValueWhenThereIsNoWordToRead)
+TEST(LogLevel, KeepsItsValueWithoutAWordToRead)
 {
     std::istringstream is("   ");
     LogLevel::Level level = LogLevel::Error;
@@ -155,7 +155,7 @@ TEST(LogLevel, KeepsItsValueWhenThereIsNoWordToRead)
     EXPECT_EQ(level, LogLevel::Error);
 }
 
-TEST(LogLevel, ReadingLetsTheExceptionsOfParsePass)
+TEST(LogLevel, ReadingThrowsTheExceptionsOfParse)
 {
     std::istringstream is("5 99999999999");
     LogLevel::Level level = LogLevel::Error;

@@ -25,7 +25,7 @@ namespace {
 using ::testing::ElementsAre;
 using ::testing::IsEmpty;
 
-/// Does something when it is destroyed.
+/// Calls a function when it is destroyed.
 class FarewellBackend : public LogBackend {
 public:
     explicit FarewellBackend(std::function<void()> farewell) : mFarewell(std::move(farewell)) {}
@@ -36,7 +36,7 @@ private:
     const std::function<void()> mFarewell;
 };
 
-/// Loggers are never removed, so each test uses names of its own wherever it matters whether they exist.
+/// Loggers are never removed, so a test uses names of its own if it matters whether they exist.
 class QelDebugTest : public ::testing::Test {
 protected:
     QelDebugTest() { mDebug.resetLoggers(); }
@@ -45,13 +45,13 @@ protected:
     QelDebug& mDebug = QelDebug::globals();
 };
 
-TEST_F(QelDebugTest, ThereIsOneForTheProcess)
+TEST_F(QelDebugTest, AProcessHasOne)
 {
     EXPECT_EQ(&QelDebug::globals(), &QelDebug::globals());
     EXPECT_FALSE(std::is_default_constructible_v<QelDebug>);
     EXPECT_FALSE(std::is_copy_constructible_v<QelDebug>);
     EXPECT_FALSE(std::is_copy_assignable_v<QelDebug>);
-    EXPECT_FALSE(std::is_destructible_v<QelDebug>) << "nobody but the process's exit destroys it";
+    EXPECT_FALSE(std::is_destructible_v<QelDebug>) << "only process exit destroys it";
 }
 
 TEST_F(QelDebugTest, ALoadedModuleFindsTheSameLoggers)
@@ -72,7 +72,7 @@ TEST_F(QelDebugTest, ALoadedModuleFindsTheSameLoggers)
     EXPECT_EQ(mDebug.tryGetLogger("of.module"), ofModule) << "it outlives the module";
 }
 
-TEST_F(QelDebugTest, CreatesANameWithAllItsAncestors)
+TEST_F(QelDebugTest, CreatesALoggerWithItsAncestors)
 {
     QelLogger& logger = mDebug.getLogger("create.b.c");
     EXPECT_EQ(mDebug.tryGetLogger("create.b.c"), &logger);
@@ -85,7 +85,7 @@ TEST_F(QelDebugTest, CreatesANameWithAllItsAncestors)
     EXPECT_EQ(mDebug.tryGetLogger("b.c"), nullptr);
 }
 
-TEST_F(QelDebugTest, ParentsAreTheNextNamesUp)
+TEST_F(QelDebugTest, TheParentIsTheNameBeforeTheLastDot)
 {
     QelLogger& logger = mDebug.getLogger("parents.b.c");
     const auto backend = std::make_shared<RecordingLogBackend>();
@@ -102,7 +102,7 @@ TEST_F(QelDebugTest, ParentsAreTheNextNamesUp)
     EXPECT_EQ(backend->lines().size(), 6U);
 }
 
-TEST_F(QelDebugTest, ANameIsCreatedOnce)
+TEST_F(QelDebugTest, CreatesALoggerOnce)
 {
     QelLogger& logger = mDebug.getLogger("once.b");
     EXPECT_EQ(&mDebug.getLogger("once.b"), &logger);
@@ -111,10 +111,10 @@ TEST_F(QelDebugTest, ANameIsCreatedOnce)
     EXPECT_EQ(mDebug.tryGetLogger("once"), &parent);
     for (int i = 0; i < 100; ++i)
         mDebug.getLogger("once.n" + std::to_string(i));
-    EXPECT_EQ(mDebug.tryGetLogger("once.b"), &logger) << "addresses stay";
+    EXPECT_EQ(mDebug.tryGetLogger("once.b"), &logger) << "addresses do not change";
 }
 
-TEST_F(QelDebugTest, LookingForANameThatWasNeverCreatedCreatesNothing)
+TEST_F(QelDebugTest, TryGetLoggerCreatesNothing)
 {
     EXPECT_EQ(mDebug.tryGetLogger("never.b"), nullptr);
     EXPECT_EQ(mDebug.tryGetLogger("never.b"), nullptr);
@@ -133,7 +133,7 @@ TEST_F(QelDebugTest, TheEmptyNameIsALoggerBelowTheRoot)
     EXPECT_THAT(log.lines(), ElementsAre("E: [] text"));
 }
 
-TEST_F(QelDebugTest, EveryDotSeparatesWhereverItStands)
+TEST_F(QelDebugTest, EveryDotSeparates)
 {
     struct {
         const char* name;
@@ -185,7 +185,7 @@ TEST_F(QelDebugTest, ResetDestroysBackendsOutsideTheLock)
 {
     std::vector<std::string> farewells;
     const auto farewell = [&farewells](const char* text) {
-        QelLogger::get("farewell.new").send(LogLevel::Error, "nobody listens any more");
+        QelLogger::get("farewell.new").send(LogLevel::Error, "dropped");
         QelDebugContext(QelLogger::get(), LogLevel::Error) << "nor here";
         farewells.emplace_back(text);
     };
@@ -196,7 +196,7 @@ TEST_F(QelDebugTest, ResetDestroysBackendsOutsideTheLock)
     EXPECT_NE(mDebug.tryGetLogger("farewell.new"), nullptr);
 }
 
-TEST_F(QelDebugTest, ABackendThatSomebodyElseOwnsSurvivesTheReset)
+TEST_F(QelDebugTest, ABackendWithAnotherOwnerSurvivesTheReset)
 {
     bool gone = false;
     auto backend = std::make_shared<FarewellBackend>([&gone] { gone = true; });
@@ -207,7 +207,7 @@ TEST_F(QelDebugTest, ABackendThatSomebodyElseOwnsSurvivesTheReset)
     EXPECT_TRUE(gone);
 }
 
-TEST_F(QelDebugTest, ManyThreadsCreateEachNameOnce)
+TEST_F(QelDebugTest, ManyThreadsCreateEachLoggerOnce)
 {
     constexpr int kThreads = 4;
     constexpr int kNames = 50;
@@ -225,13 +225,13 @@ TEST_F(QelDebugTest, ManyThreadsCreateEachNameOnce)
         EXPECT_EQ(loggers, found[0]);
 }
 
-// The life of the registry shows only in a process of its own.
+// Creation and destruction of the registry can only be observed in a process of its own.
 
 using QelDebugDeathTest = QelDebugTest;
 
-TEST_F(QelDebugDeathTest, TheFirstUseMayComeFromManyThreadsAtOnce)
+TEST_F(QelDebugDeathTest, ManyThreadsMayMakeTheFirstUse)
 {
-    GTEST_FLAG_SET(death_test_style, "threadsafe"); // a fresh process, in which nobody has asked for a logger yet
+    GTEST_FLAG_SET(death_test_style, "threadsafe"); // a fresh process, in which no logger exists yet
     const auto race = [] {
         constexpr int kThreads = 8;
         std::vector<QelLogger*> roots(kThreads);
@@ -248,12 +248,12 @@ TEST_F(QelDebugDeathTest, TheFirstUseMayComeFromManyThreadsAtOnce)
     EXPECT_EXIT(race(), ::testing::ExitedWithCode(0), "");
 }
 
-TEST_F(QelDebugDeathTest, ExitDestroysTheBackendsWhileTheLoggersAreStillWhole)
+TEST_F(QelDebugDeathTest, ExitDestroysTheBackendsBeforeTheLoggers)
 {
     const auto exitWithBackend = [] {
-        QelLogger::get("exit"); // is found again below, which the address sanitizer checks
+        QelLogger::get("exit"); // found again below; the address sanitizer checks
         QelLogger::get().addBackend(std::make_shared<FarewellBackend>([] {
-            QelLogger::get("exit.new").send(LogLevel::Error, "nobody listens any more");
+            QelLogger::get("exit.new").send(LogLevel::Error, "dropped");
             QelDebugContext(QelLogger::get("exit"), LogLevel::Error) << "nor here";
             std::fputs("farewell\n", stderr);
         }));

@@ -53,13 +53,13 @@ protected:
     std::vector<std::string> mOrder;
 };
 
-TEST_F(QelLoggerTest, TheRootIsOneAndTheSame)
+TEST_F(QelLoggerTest, TheRootIsAlwaysTheSame)
 {
     EXPECT_EQ(&QelLogger::get(), &QelDebug::globals().getLogger());
     EXPECT_EQ(&QelLogger::get(), &QelLogger::get());
 }
 
-TEST_F(QelLoggerTest, ANamedLoggerIsTheRegistrys)
+TEST_F(QelLoggerTest, ANamedLoggerIsThatOfTheRegistry)
 {
     EXPECT_EQ(&QelLogger::get("named"), &QelDebug::globals().getLogger("named"));
     EXPECT_NE(&QelLogger::get("named"), &QelLogger::get());
@@ -73,10 +73,10 @@ TEST_F(QelLoggerTest, KnowsItsNameAndWhetherItIsTheRoot)
     EXPECT_FALSE(QelLogger::get("a.b.c").isRoot());
 }
 
-TEST_F(QelLoggerTest, OnlyTheRegistryBuildsLoggers)
+TEST_F(QelLoggerTest, OnlyTheRegistryConstructsLoggers)
 {
     EXPECT_FALSE(std::is_default_constructible_v<QelLogger::CtorPasskey>);
-    EXPECT_FALSE(std::is_aggregate_v<QelLogger::CtorPasskey>) << "else anybody could write {}";
+    EXPECT_FALSE(std::is_aggregate_v<QelLogger::CtorPasskey>) << "{} would initialise an aggregate";
     EXPECT_FALSE(std::is_copy_constructible_v<QelLogger>);
     EXPECT_FALSE(std::is_move_constructible_v<QelLogger>);
     EXPECT_FALSE(std::is_copy_assignable_v<QelLogger>);
@@ -93,7 +93,7 @@ TEST_F(QelLoggerTest, TheRootStartsAtWarn)
     EXPECT_TRUE(root.isLevelEnabled(LogLevel::Critical));
 }
 
-TEST_F(QelLoggerTest, EachLevelEnablesItselfAndWhatIsGraver)
+TEST_F(QelLoggerTest, EachLevelEnablesItselfAndHigherOnes)
 {
     QelLogger& root = QelLogger::get();
     for (int threshold = LogLevel::Debug; threshold <= LogLevel::Max; ++threshold) {
@@ -165,7 +165,7 @@ TEST_F(QelLoggerTest, ADisabledCallAllocatesNothing)
     EXPECT_EQ(allocations.count(), 0U);
 }
 
-TEST_F(QelLoggerTest, BackendsAreListedInTheirOrder)
+TEST_F(QelLoggerTest, ListsBackendsInTheOrderOfRegistration)
 {
     QelLogger& logger = QelLogger::get("x");
     EXPECT_THAT(logger.getBackends(), IsEmpty());
@@ -187,13 +187,13 @@ TEST_F(QelLoggerTest, TheListOfBackendsIsACopy)
     EXPECT_EQ(before.size(), 1U);
 }
 
-TEST_F(QelLoggerTest, ANullBackendIsRefused)
+TEST_F(QelLoggerTest, RefusesANullBackend)
 {
     EXPECT_THAT([] { QelLogger::get().addBackend(nullptr); }, ThrowsMessage<std::invalid_argument>(StrEq("backend")));
     EXPECT_THAT(QelLogger::get().getBackends(), IsEmpty());
 }
 
-TEST_F(QelLoggerTest, ALineReachesTheBackendsInTheirOrderAndAsOftenAsTheyAreListed)
+TEST_F(QelLoggerTest, ALineReachesTheBackendsInOrderOncePerRegistration)
 {
     QelLogger& root = QelLogger::get();
     const auto first = order("first");
@@ -204,7 +204,7 @@ TEST_F(QelLoggerTest, ALineReachesTheBackendsInTheirOrderAndAsOftenAsTheyAreList
     EXPECT_THAT(mOrder, ElementsAre("first:line", "second:line", "first:line"));
 }
 
-TEST_F(QelLoggerTest, BackendsGetTheLevelWithTheLine)
+TEST_F(QelLoggerTest, BackendsReceiveTheLevelOfTheLine)
 {
     const auto backend = std::make_shared<RecordingLogBackend>();
     QelLogger::get().addBackend(backend);
@@ -218,7 +218,7 @@ TEST_F(QelLoggerTest, BackendsGetTheLevelWithTheLine)
     EXPECT_EQ(entries[1].line, "light");
 }
 
-TEST_F(QelLoggerTest, ALineClimbsToTheRoot)
+TEST_F(QelLoggerTest, ALinePropagatesToTheRoot)
 {
     QelLogger::get().addBackend(order("root"));
     QelLogger::get("x").addBackend(order("x"));
@@ -228,7 +228,7 @@ TEST_F(QelLoggerTest, ALineClimbsToTheRoot)
     EXPECT_THAT(mOrder, ElementsAre("x.y:line", "x:line", "root:line"));
 }
 
-TEST_F(QelLoggerTest, ALineStopsWhereItDoesNotPropagate)
+TEST_F(QelLoggerTest, ALineStopsAtALoggerWithoutPropagation)
 {
     QelLogger::get().addBackend(order("root"));
     QelLogger::get("x").addBackend(order("x"));
@@ -255,7 +255,7 @@ TEST_F(QelLoggerTest, PropagationOfTheRootIsIgnored)
     EXPECT_THAT(mOrder, ElementsAre("root:line"));
 }
 
-TEST_F(QelLoggerTest, SendingLooksAtNoThreshold)
+TEST_F(QelLoggerTest, SendIgnoresTheThresholdsOfLoggers)
 {
     QelLogger::get().setLevel(LogLevel::Critical).addBackend(order("root"));
     QelLogger::get("x").setLevel(LogLevel::Critical).addBackend(order("x"));
@@ -263,13 +263,13 @@ TEST_F(QelLoggerTest, SendingLooksAtNoThreshold)
     EXPECT_THAT(mOrder, ElementsAre("x:line", "root:line"));
 }
 
-TEST_F(QelLoggerTest, WithoutBackendsALineGoesNowhere)
+TEST_F(QelLoggerTest, WithoutBackendsALineIsDropped)
 {
     QelLogger::get("x.y").send(LogLevel::Critical, "line");
     SUCCEED();
 }
 
-TEST_F(QelLoggerTest, AnExceptionOfABackendPassesAndTheLoggersStayUsable)
+TEST_F(QelLoggerTest, AnExceptionOfABackendPassesThroughSendAndLeavesTheLoggersUsable)
 {
     QelLogger::get().addBackend(std::make_shared<ThrowingLogBackend>());
     QelLogger::get().addBackend(order("after"));
@@ -282,7 +282,7 @@ TEST_F(QelLoggerTest, AnExceptionOfABackendPassesAndTheLoggersStayUsable)
     EXPECT_THAT(mOrder, ElementsAre("next:line")) << "the lock is free again";
 }
 
-TEST_F(QelLoggerTest, LinesOfAllThreadsReachEveryBackendWholeAndInOneOrder)
+TEST_F(QelLoggerTest, LinesOfAllThreadsReachEveryBackendWholeAndInTheSameOrder)
 {
     const auto first = std::make_shared<RecordingLogBackend>();
     const auto second = std::make_shared<RecordingLogBackend>();
@@ -319,13 +319,13 @@ TEST_F(QelLoggerTest, LinesOfAllThreadsReachEveryBackendWholeAndInOneOrder)
     }
 }
 
-/// Notices when it is entered by a second thread while the first is still inside.
+/// Detects a second thread that enters while the first is still inside.
 class ExclusiveBackend : public LogBackend {
 public:
     void log(LogLevel::Level, const std::string&) override
     {
         if (mInside.exchange(true)) mOverlapped = true;
-        std::this_thread::yield(); // let the others try
+        std::this_thread::yield(); // lets other threads run
         mInside = false;
     }
     bool overlapped() const { return mOverlapped; }
@@ -335,7 +335,7 @@ private:
     std::atomic<bool> mOverlapped{false};
 };
 
-TEST_F(QelLoggerTest, ABackendIsEnteredByOneThreadAtATime)
+TEST_F(QelLoggerTest, OneThreadAtATimeEntersABackend)
 {
     const auto backend = std::make_shared<ExclusiveBackend>();
     QelLogger::get("exclusive").addBackend(backend);
@@ -353,7 +353,7 @@ TEST_F(QelLoggerTest, ABackendIsEnteredByOneThreadAtATime)
     EXPECT_FALSE(backend->overlapped());
 }
 
-/// Looks at the levels and changes them while it is given a line, hence with the lock of the registry held.
+/// Tests and sets levels while it receives a line, that is with the lock of the registry held.
 class LevelChangingBackend : public LogBackend {
 public:
     void log(LogLevel::Level, const std::string&) override
@@ -367,16 +367,16 @@ public:
     bool mIsEnabled = false;
 };
 
-TEST_F(QelLoggerTest, LevelsAreTestedAndChangedWithoutTheLock)
+TEST_F(QelLoggerTest, TestsAndSetsLevelsWithoutTheLock)
 {
     const auto backend = std::make_shared<LevelChangingBackend>();
     QelLogger::get().addBackend(backend);
-    QelLogger::get().send(LogLevel::Error, "line"); // comes back: nobody waits for a lock that this thread holds
+    QelLogger::get().send(LogLevel::Error, "line"); // returns: no deadlock
     EXPECT_FALSE(backend->mWasEnabled);
     EXPECT_TRUE(backend->mIsEnabled);
 }
 
-TEST_F(QelLoggerTest, EverythingMayBeChangedWhileOthersLog)
+TEST_F(QelLoggerTest, EverythingMayChangeWhileOtherThreadsLog)
 {
     std::atomic<bool> stop{false};
     std::atomic<int> running{0};

@@ -6,13 +6,13 @@
 namespace qel {
 namespace {
 
-TEST(QelVersion, IsMadeOfItsThreeNumbers)
+TEST(QelVersion, ConsistsOfItsThreeNumbers)
 {
     EXPECT_EQ(QEL_VERSION_STRING, std::to_string(QEL_VERSION_MAJOR) + "." + std::to_string(QEL_VERSION_MINOR) + "." +
                                       std::to_string(QEL_VERSION_PATCH));
 }
 
-TEST(QelVersion, OfTheLibraryIsThatOfTheHeadersItWasBuiltWith) { EXPECT_STREQ(version(), QEL_VERSION_STRING); }
+TEST(QelVersion, OfTheLibraryIsThatOfItsHeaders) { EXPECT_STREQ(version(), QEL_VERSION_STRING); }
 
 } // namespace
 } // namespace qel

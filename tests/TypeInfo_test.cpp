@@ -31,7 +31,7 @@ TEST(TypeInfo, DemanglesFunctionSymbols)
               "qel::TypeInfo::getTypeName(std::type_info const&)");
 }
 
-TEST(TypeInfo, LeavesWhatIsNoSymbolAsItIs)
+TEST(TypeInfo, ReturnsATextThatIsNotASymbolUnchanged)
 {
     EXPECT_EQ(TypeInfo::demangleSymbol("no symbol at all"), "no symbol at all");
     EXPECT_EQ(TypeInfo::demangleSymbol("_Znonsense!"), "_Znonsense!");
@@ -43,7 +43,7 @@ TEST(TypeInfo, RefusesANullSymbol)
     EXPECT_THAT([] { TypeInfo::demangleSymbol(nullptr); }, ThrowsMessage<std::invalid_argument>(StrEq("symbol")));
 }
 
-TEST(TypeInfo, NamesATypeByItsDescription)
+TEST(TypeInfo, NamesATypeByItsTypeInfo)
 {
     EXPECT_EQ(TypeInfo::getTypeName(typeid(PosixError)), "qel::PosixError");
     EXPECT_EQ(TypeInfo::getTypeName(typeid(TypeInfoTemplate<int>)), "qel::TypeInfoTemplate<int>");

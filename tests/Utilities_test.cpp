@@ -28,7 +28,7 @@ using testing::StrEq;
 using testing::Throws;
 using testing::ThrowsMessage;
 
-/// What a failed file function throws: type, text and code.
+/// Matches what a failed file function throws: type, text and code.
 auto failsWith(const std::string& text, int code)
 {
     return Throws<FileIOError>(
@@ -45,7 +45,7 @@ TEST(UtilitiesCase, ChangesLettersOnly)
     EXPECT_EQ(Utilities::uppercase(""), "");
 }
 
-TEST(UtilitiesCase, LeavesBytesOutsideTheCLocaleAlone)
+TEST(UtilitiesCase, LeavesBytesAbove0x7FAlone)
 {
     std::string every;
     for (int value = 0x80; value <= 0xFF; ++value) {
@@ -55,7 +55,7 @@ TEST(UtilitiesCase, LeavesBytesOutsideTheCLocaleAlone)
     EXPECT_EQ(Utilities::uppercase(every), every);
 }
 
-TEST(UtilitiesCase, KeepsEmbeddedZeros)
+TEST(UtilitiesCase, KeepsNullBytes)
 {
     EXPECT_EQ(Utilities::lowercase(std::string("A\0B", 3)), std::string("a\0b", 3));
     EXPECT_EQ(Utilities::uppercase(std::string("a\0b", 3)), std::string("A\0B", 3));
@@ -126,14 +126,14 @@ TEST(UtilitiesSplit, TheLimitCountsSplits)
     EXPECT_THAT(Utilities::split("a,b,,c", ',', -7), ElementsAre("a", "b", "", "c"));
 }
 
-TEST(UtilitiesSplit, TheSeparatorMayBeZero)
+TEST(UtilitiesSplit, TheSeparatorMayBeANullByte)
 {
     EXPECT_THAT(Utilities::split(std::string("a\0b", 3), '\0'), ElementsAre("a", "b"));
 }
 
 // ------------------------------------------------------------------------------------------------------- paths
 
-TEST(UtilitiesPath, BasenameIsTheLastComponentAndDirnameWhatIsBeforeIt)
+TEST(UtilitiesPath, BasenameIsTheLastComponentAndDirnameTheRest)
 {
     struct Row {
         const char* path;
@@ -189,7 +189,7 @@ TEST(UtilitiesPath, NormalizeOfAMissingPathThrowsPosixError)
     }
 }
 
-TEST(UtilitiesPath, NormalizeReportsTheNumberOfItsOwnFailureHoweverLongThePath)
+TEST(UtilitiesPath, NormalizeReportsItsErrorForLongPaths)
 {
     const TemporaryDirectory directory;
     std::string missing = directory.path();
@@ -207,12 +207,12 @@ TEST(UtilitiesPath, NormalizeReportsTheNumberOfItsOwnFailureHoweverLongThePath)
                 ThrowsMessage<PosixError>(StrEq("Failed to normalize path : 2 (No such file or directory)")));
 }
 
-/// @return the number that a failed function reports when composing the text of the error changes errno
+/// @return the number that a failed function reports although composing the text of the error changes errno
 template <typename Function>
 int numberReportedBy(Function function)
 {
     try {
-        const test::Allocations allocations; // the text is longer than what fits into a string without one
+        const test::Allocations allocations; // the text is too long for a string without an allocation
         function();
     } catch (const PosixError& error) {
         return error.getErrorCode().getCode();
@@ -220,7 +220,7 @@ int numberReportedBy(Function function)
     return -1;
 }
 
-TEST(UtilitiesPath, NormalizeReportsTheNumberOfItsOwnFailureThoughErrnoHasChangedSince)
+TEST(UtilitiesPath, NormalizeReportsItsErrorAfterErrnoHasChanged)
 {
     QEL_TEST_NEEDS_ALLOCATIONS();
     EXPECT_EQ(numberReportedBy([] { Utilities::normalizePath("/missing"); }), ENOENT);
@@ -237,7 +237,7 @@ TEST(UtilitiesPath, NormalizeOfALinkLoopThrows)
 
 // ------------------------------------------------------------------------------------------------------- files
 
-TEST(UtilitiesFile, WritesAndReadsEveryByteAsItIs)
+TEST(UtilitiesFile, WritesAndReadsEveryByteUnchanged)
 {
     const TemporaryDirectory directory;
     std::string content;
@@ -279,13 +279,13 @@ TEST(UtilitiesFile, WritingAnEmptyContentCreatesTheFile)
     EXPECT_EQ(status.st_size, 0);
 }
 
-TEST(UtilitiesFile, ReadingADirectoryGivesNothing)
+TEST(UtilitiesFile, ReadingADirectoryGivesTheEmptyText)
 {
     const TemporaryDirectory directory;
     EXPECT_EQ(Utilities::readFile(directory.path()), "");
 }
 
-TEST(UtilitiesFile, ReadingAnEmptyFileGivesNothing)
+TEST(UtilitiesFile, ReadingAnEmptyFileGivesTheEmptyText)
 {
     const TemporaryDirectory directory;
     Utilities::writeFile(directory.file("f"), "");
@@ -293,7 +293,7 @@ TEST(UtilitiesFile, ReadingAnEmptyFileGivesNothing)
     EXPECT_EQ(Utilities::readFile("/dev/null"), "");
 }
 
-TEST(UtilitiesFile, AFailedReadThrowsHoweverManySucceededBefore)
+TEST(UtilitiesFile, AFailedReadThrowsAfterAnyNumberOfGoodOnes)
 {
     const TemporaryDirectory directory;
     const std::string path = directory.file("f");
@@ -308,7 +308,7 @@ TEST(UtilitiesFile, AFailedReadThrowsHoweverManySucceededBefore)
     EXPECT_EQ(Utilities::readFile(path).size(), 100000U);
 }
 
-TEST(UtilitiesFile, AnErrorOfADirectoryInTheMidstOfAFileThrows)
+TEST(UtilitiesFile, EisdirInTheMiddleOfAFileThrows)
 {
     const TemporaryDirectory directory;
     const std::string path = directory.file("f");
@@ -334,7 +334,7 @@ TEST(UtilitiesFile, ReadingAMissingFileThrows)
                 failsWith("Failed to read contents of file " + path + ": 2 (No such file or directory)", ENOENT));
 }
 
-TEST(UtilitiesFile, ReadingReportsTheNumberOfItsOwnFailure)
+TEST(UtilitiesFile, ReadingReportsItsError)
 {
     const TemporaryDirectory directory;
     Utilities::writeFile(directory.file("f"), "");
@@ -346,7 +346,7 @@ TEST(UtilitiesFile, ReadingReportsTheNumberOfItsOwnFailure)
                 failsWith("Failed to read contents of file " + tooLong + ": 36 (File name too long)", ENAMETOOLONG));
 }
 
-TEST(UtilitiesFile, ReadingAndWritingReportTheNumberOfTheirOwnFailureThoughErrnoHasChangedSince)
+TEST(UtilitiesFile, ReadingAndWritingReportTheirErrorAfterErrnoHasChanged)
 {
     QEL_TEST_NEEDS_ALLOCATIONS();
     EXPECT_EQ(numberReportedBy([] { Utilities::readFile("/missing"); }), ENOENT);
@@ -369,18 +369,18 @@ TEST(UtilitiesFile, WritingToADirectoryThrows)
                 failsWith("Failed to write contents of file " + directory.path() + ": 21 (Is a directory)", EISDIR));
 }
 
-TEST(UtilitiesFile, WritingToAFullDeviceThrowsHoweverLittleIsWritten)
+TEST(UtilitiesFile, WritingToAFullDeviceThrowsForShortAndLongContent)
 {
     const std::string text = "Failed to write contents of file /dev/full: 28 (No space left on device)";
     EXPECT_THAT([] { Utilities::writeFile("/dev/full", "x"); }, failsWith(text, ENOSPC));
     EXPECT_THAT([] { Utilities::writeFile("/dev/full", std::string(300000, 'x')); }, failsWith(text, ENOSPC));
 }
 
-TEST(UtilitiesFile, WritingNothingToAFullDeviceIsNoError) { EXPECT_NO_THROW(Utilities::writeFile("/dev/full", "")); }
+TEST(UtilitiesFile, WritingNothingToAFullDeviceSucceeds) { EXPECT_NO_THROW(Utilities::writeFile("/dev/full", "")); }
 
 // ------------------------------------------------------------------------------------------------ truth values
 
-TEST(UtilitiesParseBool, KnowsItsWordsInAnyCase)
+TEST(UtilitiesParseBool, AcceptsItsWordsInAnyCase)
 {
     for (const char* text : {"y", "yes", "true", "1", "Y", "YES", "TRUE", "Yes", "tRuE"}) {
         SCOPED_TRACE(text);
@@ -392,7 +392,7 @@ TEST(UtilitiesParseBool, KnowsItsWordsInAnyCase)
     }
 }
 
-TEST(UtilitiesParseBool, RefusesEverythingElseWithTheTextAsGiven)
+TEST(UtilitiesParseBool, RefusesOtherTextsAndQuotesThemUnchanged)
 {
     for (const char* text : {"maybe", "MAYBE", "", " true", "true ", "yess", "10", "01", "t", "f", "on", "off"}) {
         SCOPED_TRACE(text);
@@ -406,7 +406,7 @@ TEST(UtilitiesParseBool, RefusesEverythingElseWithTheTextAsGiven)
 TEST(UtilitiesRef, LetsATemporaryStreamBeWrittenTo)
 {
     std::ostream& written = (Utilities::ref(std::ostringstream()) << "text " << 5);
-    static_cast<void>(written); // the stream itself is gone by now
+    static_cast<void>(written); // the stream itself no longer exists
     EXPECT_EQ(static_cast<std::ostringstream&>(Utilities::ref(std::ostringstream()) << "text " << 5).str(), "text 5");
 }
 

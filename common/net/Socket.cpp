@@ -64,7 +64,7 @@ void Socket::connect(const IPEndpoint& endpoint, std::chrono::milliseconds timeo
     const sockaddr_storage address = endpoint.getSockaddr();
     if (::connect(mFd, asSockaddr(address), sizeof(address)) != 0) {
         const PosixErrorCode code(errno);
-        if (code != PosixErrorCode(EINPROGRESS)) throwLogged(code, "socket connect failed");
+        if (code != EINPROGRESS) throwLogged(code, "socket connect failed");
         pAwaitConnection(timeout);
     }
     setFlags(flags);

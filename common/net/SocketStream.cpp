@@ -86,7 +86,7 @@ ssize_t SocketStream::pReceive(char* buffer, std::size_t length)
         const ssize_t count = mSocket.read(buffer, length);
         if (count >= 0) return count;
         const PosixErrorCode code(errno);
-        if (code != PosixErrorCode(EINTR)) throwLogged(code, "socket stream failed to receive");
+        if (code != EINTR) throwLogged(code, "socket stream failed to receive");
         logLine(LogLevel::Warn, "socket stream read interrupted by signal, retrying I/O");
     }
 }
@@ -102,7 +102,7 @@ void SocketStream::pSendAll(const char* buffer, std::size_t length)
             continue;
         }
         const PosixErrorCode code(errno);
-        if (code != PosixErrorCode(EINTR)) throwLogged(code, "socket stream send failure");
+        if (code != EINTR) throwLogged(code, "socket stream send failure");
         logLine(LogLevel::Warn, "socket stream write interrupted by signal, retrying I/O");
     }
 }

@@ -67,7 +67,7 @@ PollResult PollSet::wait(std::chrono::milliseconds timeout) const
                              static_cast<int>(timeout.count()));
     if (ready < 0) {
         const PosixErrorCode code(errno);
-        if (code == PosixErrorCode(EINTR)) {
+        if (code == EINTR) {
             logLine(LogLevel::Debug, "Poll wait for events ", *this, " interrupted");
             return PollResult();
         }

@@ -10,7 +10,7 @@ namespace {
 
 std::int32_t absoluteValue(int code) noexcept
 {
-    // The smallest integer has no positive counterpart; negating it is undefined.
+    // Negating the smallest integer is undefined.
     if (code == std::numeric_limits<int>::min()) return std::numeric_limits<int>::max();
     return code < 0 ? -code : code;
 }

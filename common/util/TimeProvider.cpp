@@ -4,9 +4,8 @@ namespace qel {
 
 namespace {
 
-// Log lines may be written by static initialisers and static destructors anywhere in the process. So the default
-// provider is there before the first of them runs (both objects are initialised by constants) and is never destroyed
-// (the destructor of a union leaves its member alone).
+// Static initialisers and static destructors may write log lines. So the default provider exists before the first of
+// them runs (both objects are constant-initialised) and is never destroyed (a union does not destroy its member).
 union DefaultProviderStorage {
     constexpr DefaultProviderStorage() noexcept : provider() {}
     ~DefaultProviderStorage() {}

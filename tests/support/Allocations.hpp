@@ -16,15 +16,15 @@
 #define QEL_TEST_OWN_OPERATOR_NEW 1
 #endif
 
-/// To be said first in each test that makes an Allocations: skips it in builds that cannot count.
+/// Put this first in each test that makes an Allocations: it skips the test in builds that cannot count.
 #define QEL_TEST_NEEDS_ALLOCATIONS()                                                                                   \
     if (!QEL_TEST_OWN_OPERATOR_NEW) GTEST_SKIP() << "this build cannot count allocations"
 
 namespace qel::test {
 
-/// Counts the calls of operator new on the thread that made this object, from its construction on. Each of them leaves
-/// kErrno in errno, as a call that succeeds may: whoever looks for the error of an earlier call by then finds it gone.
-/// Thread safety: used by that thread alone; allocations of other threads do not count, never fail and keep errno.
+/// Counts the calls of operator new on the thread that made this object, from its construction on. Each call sets errno
+/// to kErrno, as a successful call may, so code that reads errno too late reports a wrong error. Thread safety: belongs
+/// to that thread; allocations of other threads do not count, never fail and keep errno.
 class Allocations {
 public:
     static constexpr int kErrno = 4711; // no error has this number
@@ -37,13 +37,14 @@ public:
     /// @return the allocations so far
     std::size_t count() const;
 
-    /// Lets so many more allocations succeed and makes every one after them fail with std::bad_alloc, until this object
-    /// goes or succeedAgain is called.
+    /// Lets `count` more allocations succeed and makes every later one fail with std::bad_alloc, until this object is
+    /// destroyed or succeedAgain is called.
     void failAfter(std::size_t count);
     void failAll() { failAfter(0); }
     void succeedAgain();
 
-    /// What a fake allocates in the middle of the code under test neither counts nor fails while it holds one of these.
+    /// Allocations that a fake makes within the code under test do not count and do not fail while it holds one of
+    /// these.
     class Exempt {
     public:
         Exempt();

@@ -33,7 +33,7 @@ void record(int priority, const char* format, va_list arguments)
     if (sCapturing) {
         sMessages.push_back({priority, text});
     } else {
-        ADD_FAILURE() << "nobody expects a message to the system log: " << text;
+        ADD_FAILURE() << "an unexpected message to the system log: " << text;
     }
 }
 
@@ -67,7 +67,7 @@ std::vector<SystemLogMessage> CapturedSystemLog::take()
 
 } // namespace qel::test
 
-// The C library's entry points: the plain one, and the one that fortified code calls instead.
+// The C library's entry points: the plain one, and the one that fortified code calls.
 extern "C" {
 
 void syslog(int priority, const char* format, ...)

@@ -5,9 +5,8 @@
 #include <vector>
 
 /// @file
-/// The system log, caught before it leaves the process. A program that links CapturedSystemLog.cpp replaces the C
-/// library's syslog by one that keeps the messages: a function of the executable wins over that of a shared library,
-/// for the calls of other shared libraries too.
+/// Messages to the system log, captured within the process. A program that links CapturedSystemLog.cpp replaces the C
+/// library's syslog by one that keeps the messages, for the calls of shared libraries too.
 
 namespace qel::test {
 
@@ -21,9 +20,8 @@ struct SystemLogMessage {
 
 std::ostream& operator<<(std::ostream& os, const SystemLogMessage& message);
 
-/// Keeps what goes to the system log from its construction to its destruction. A message while there is none of these
-/// fails the test. One at a time.
-/// Thread safety: any thread may write to the system log meanwhile.
+/// Captures the messages to the system log from construction to destruction. A message that no object captures fails
+/// the test. One at a time. Thread safety: any thread may write to the system log.
 class CapturedSystemLog {
 public:
     CapturedSystemLog();
@@ -31,7 +29,7 @@ public:
     CapturedSystemLog(const CapturedSystemLog&) = delete;
     CapturedSystemLog& operator=(const CapturedSystemLog&) = delete;
 
-    /// @return the messages so far, which are forgotten
+    /// @return the messages so far, and forgets them
     std::vector<SystemLogMessage> take();
 };
 

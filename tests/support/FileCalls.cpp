@@ -104,7 +104,7 @@ int open(const char* path, int flags, ...)
     const Allocations::Exempt exempt;
     va_list arguments;
     va_start(arguments, flags);
-    // Without O_CREAT or O_TMPFILE there is no third argument, and the system does not look at the mode then.
+    // Without O_CREAT or O_TMPFILE there is no third argument, and the system ignores the mode.
     const mode_t mode = (flags & (O_CREAT | O_TMPFILE)) != 0 ? va_arg(arguments, mode_t) : 0;
     va_end(arguments);
     record(openCall(path, flags, mode));

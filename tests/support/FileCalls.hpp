@@ -5,13 +5,13 @@
 #include <vector>
 
 /// @file
-/// The file calls of the code under test, seen and broken on purpose. A program that links FileCalls.cpp replaces the C
-/// library's functions by ones that pass on to them, for the calls of shared libraries too.
+/// Observes the file calls of the code under test and makes them fail. A program that links FileCalls.cpp replaces the
+/// C library's functions by ones that call them, for the calls of shared libraries too.
 
 namespace qel::test {
 
-/// Records file calls, and makes some fail, from its construction to its destruction. One at a time; without one the
-/// calls pass through unchanged.
+/// Records file calls, and makes some fail, from construction to destruction. One at a time; without one the calls are
+/// not changed.
 /// Thread safety: one thread.
 class FileCalls {
 public:
@@ -22,14 +22,15 @@ public:
     FileCalls(const FileCalls&) = delete;
     FileCalls& operator=(const FileCalls&) = delete;
 
-    /// Makes calls fail with an error number instead of being carried out: first `after` calls of that kind succeed,
-    /// then `count` fail.
+    /// Makes calls fail with an error number: the next `after` calls of that kind are carried out, then `count` calls
+    /// fail and do nothing.
     void fail(Call call, int error, unsigned count = 1, unsigned after = 0);
 
     /// Makes the next writev write that many bytes at most and return how many. Called twice, it shortens the next two.
     void shortenNextWrite(std::size_t bytes);
 
-    /// @return the calls so far, which are forgotten: the name of the function, the file names without their
+    /// Forgets the calls so far.
+    /// @return those calls: the name of the function, the file names without their
     /// directories, and what else matters: "rename log.3 log.4", "open log 2102 644" (flags in hexadecimal, mode in
     /// octal), "writev 6+1" (bytes of each piece), "ftruncate 7" (the new size). Failed ones are among them; reads are
     /// not.

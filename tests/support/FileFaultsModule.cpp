@@ -1,15 +1,15 @@
-// A module to be loaded in front of a program (LD_PRELOAD, see ld.so(8)): one of its file calls fails, or its end comes
-// in the middle of it. What shall happen is in the environment:
+// A module to preload into a program (LD_PRELOAD, see ld.so(8)). It makes file calls of the program fail, or ends the
+// program during one. Environment variables say how:
 //
 //   QEL_FAULT_CALL    write, fsync, openat, renameat, renameat2 or linkat
-//   QEL_FAULT_AFTER   so many calls of that function succeed first; 0 unless given
-//   QEL_FAULT_COUNT   so many calls fail then; all unless given
-//   QEL_FAULT_ERROR   the error number that they fail with
-//   QEL_FAULT_SIGNAL  or the signal that the process gets instead, after which the call is carried out
-//   QEL_FAULT_MAKE    a file that another program seems to make right before such a call
-//   QEL_FAULT_BYTES   or, for write, how many bytes are written at most
+//   QEL_FAULT_AFTER   the number of calls of that function that succeed first; default 0
+//   QEL_FAULT_COUNT   the number of calls that fail then; default all
+//   QEL_FAULT_ERROR   the error number with which they fail
+//   QEL_FAULT_SIGNAL  instead: the signal that the process gets; the call is then carried out
+//   QEL_FAULT_MAKE    a file to create before such a call, as if by another program
+//   QEL_FAULT_BYTES   instead, for write: the maximum number of bytes written
 //
-// Calls from within the C library, such as those of a stream, are not seen.
+// Calls within the C library, such as those of its streams, are not intercepted.
 
 #include <algorithm>
 #include <cerrno>
@@ -31,12 +31,13 @@ int setting(const char* name, int otherwise)
     return text != nullptr ? std::atoi(text) : otherwise;
 }
 
-/// Counts the call. @return whether it is one of those that do not go well
-bool isMeant(const char* call)
+/// Counts the call.
+/// @return whether the fault applies to it
+bool faultApplies(const char* call)
 {
     static int sCalls = 0;
-    const char* const meant = std::getenv("QEL_FAULT_CALL");
-    if (meant == nullptr || std::strcmp(meant, call) != 0) return false;
+    const char* const faulty = std::getenv("QEL_FAULT_CALL");
+    if (faulty == nullptr || std::strcmp(faulty, call) != 0) return false;
     const int number = sCalls++ - setting("QEL_FAULT_AFTER", 0);
     return number >= 0 && number < setting("QEL_FAULT_COUNT", INT_MAX);
 }
@@ -44,11 +45,11 @@ bool isMeant(const char* call)
 /// @return true, with errno set, when the call is to fail
 bool fails(const char* call)
 {
-    if (!isMeant(call)) return false;
+    if (!faultApplies(call)) return false;
     const char* const made = std::getenv("QEL_FAULT_MAKE");
     if (made != nullptr) ::close(::open(made, O_WRONLY | O_CREAT | O_CLOEXEC, 0600));
     const int number = setting("QEL_FAULT_SIGNAL", 0);
-    if (number != 0) ::kill(::getpid(), number); // has been taken, unless it is blocked, when this returns
+    if (number != 0) ::kill(::getpid(), number); // delivered when this returns, unless it is blocked
     errno = setting("QEL_FAULT_ERROR", 0);
     return errno != 0;
 }

@@ -5,8 +5,8 @@
 
 namespace qel::test {
 
-/// Makes the process print numbers as some countries write them, 4711 as 4.711 and 0.5 as 0,5: the global locale, for
-/// the length of a test. Streams that exist already keep theirs.
+/// Sets a global locale that prints 4711 as 4.711 and 0.5 as 0,5, for the length of a test. Existing streams keep their
+/// locale.
 class GroupingLocale {
 public:
     GroupingLocale() : mPrevious(std::locale::global(std::locale(std::locale::classic(), new Numbers))) {}

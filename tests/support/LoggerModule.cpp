@@ -1,4 +1,4 @@
-// A module that the tests load at run time, to see that every part of a process finds the same loggers.
+// A module that the tests load at run time, to check that every part of a process finds the same loggers.
 
 #include <qel/common/QelDebug.hpp>
 #include <qel/common/QelLogger.hpp>

@@ -1,12 +1,12 @@
 #pragma once
 
 /// @file
-/// Whether code asks the system for the id of the process, or shows one that it has kept. A program that links
-/// ProcessIdCalls.cpp replaces the C library's getpid by one that counts, for the calls of shared libraries too.
+/// Counts the calls of getpid, to tell whether code asks for the process id or reuses one. A program that links
+/// ProcessIdCalls.cpp replaces the C library's getpid, for the calls of shared libraries too.
 
 namespace qel::test {
 
-/// @return how often anybody in this process has called getpid(2)
+/// @return the number of calls of getpid(2) in this process
 /// Thread safety: any thread.
 unsigned processIdCalls();
 

@@ -10,8 +10,8 @@
 
 namespace qel::test {
 
-/// A back-end without a filter that keeps every line it is given, with the level beside it.
-/// Thread safety: lines may be read while others are logged.
+/// A back-end without a filter that keeps every line and its level.
+/// Thread safety: lines may be read while threads log.
 class RecordingLogBackend : public LogBackend {
 public:
     struct Entry {

@@ -7,10 +7,10 @@
 
 namespace qel::test {
 
-/// Time that moves only when told. In force from its construction to its destruction.
+/// A clock that a test moves. In force from construction to destruction.
 /// Starts at 2024-01-02 03:04:05 UTC on the system clock and 1000 s after the epoch of the steady clock.
-/// Thread safety: time may be set and read by several threads; make and destroy the clock while no other thread reads
-/// the time.
+/// Thread safety: several threads may set and read the time; make and destroy the clock while no other thread reads the
+/// time.
 class SettableClock : public TimeProvider {
 public:
     SettableClock();
@@ -22,7 +22,7 @@ public:
     /// Moves both clocks, forwards or, with a negative duration, backwards.
     void advance(std::chrono::nanoseconds duration);
 
-    /// @return how often each clock has been read; who sees a reading counted may move the clock without changing it
+    /// @return how often each clock has been read; moving the clock does not change a reading that is already counted
     unsigned systemReads() const;
     unsigned steadyReads() const;
 

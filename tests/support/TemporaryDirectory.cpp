@@ -13,7 +13,7 @@ namespace qel::test {
 
 namespace {
 
-constexpr int kOpenDirectories = 16; // how many nftw may hold open at a time
+constexpr int kOpenDirectories = 16; // the maximum that nftw holds open
 
 int makeAccessible(const char* path, const struct stat*, int type, struct FTW*)
 {

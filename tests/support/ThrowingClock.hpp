@@ -9,18 +9,19 @@
 
 namespace qel::test {
 
-/// A clock that stands still and breaks down when told. In force from its construction to its destruction.
+/// A clock that stands still, at the epoch, and can be made to throw. In force from construction to destruction.
 /// Thread safety: as SettableClock.
 class ThrowingClock : public TimeProvider {
 public:
     ThrowingClock() { pRegister(); }
 
-    /// Lets that many readings succeed, and all after them fail with std::runtime_error "clock".
+    /// Lets that many readings succeed and makes all later ones throw std::runtime_error "clock".
     void failAfter(int readings) { pSet(readings, false, false); }
-    /// Lets that many readings succeed, and then one fail.
+    /// Lets that many readings succeed, makes the next one throw, and works again after it.
     void failOnceAfter(int readings) { pSet(readings, true, false); }
-    /// The same, counting and failing readings of the steady clock alone. Log lines read the other one.
+    /// The same, but counts and fails readings of the steady clock only. Log lines read the system clock.
     void failSteadyOnceAfter(int readings) { pSet(readings, true, true); }
+    /// Lets all readings succeed.
     void work() { pSet(std::numeric_limits<int>::max(), false, false); }
 
 private:

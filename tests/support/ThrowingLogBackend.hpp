@@ -8,7 +8,7 @@
 
 namespace qel::test {
 
-/// A back-end that breaks the rule that back-ends do not throw: every line ends in std::runtime_error("back-end").
+/// A back-end that breaks the rule not to throw: every line throws std::runtime_error("back-end").
 class ThrowingLogBackend : public LogBackend {
 public:
     void log(LogLevel::Level, const std::string&) override { throw std::runtime_error("back-end"); }

@@ -10,7 +10,7 @@ namespace qel::test {
 /// Sets the local time zone of the process for the length of a test.
 class TimeZoneScope {
 public:
-    /// @param zone  as the environment variable TZ has it; see tzset(3)
+    /// @param zone  in the form of the environment variable TZ; see tzset(3)
     explicit TimeZoneScope(const char* zone)
     {
         if (const char* const previous = std::getenv("TZ")) mPrevious = previous;

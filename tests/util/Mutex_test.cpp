@@ -10,7 +10,7 @@
 namespace qel {
 namespace {
 
-/// @return whether another thread could take the mutex just now; it is free again afterwards
+/// @return whether another thread can lock the mutex now; it is unlocked again afterwards
 bool anotherThreadCanTake(Mutex& mutex)
 {
     bool taken = false;
@@ -29,7 +29,7 @@ struct Counter {
     long value QEL_GUARDED_BY(mutex) = 0;
 };
 
-TEST(Mutex, KeepsOtherThreadsOutWhileHeld)
+TEST(Mutex, ExcludesOtherThreadsWhileHeld)
 {
     Mutex mutex;
     EXPECT_TRUE(anotherThreadCanTake(mutex));
@@ -39,14 +39,14 @@ TEST(Mutex, KeepsOtherThreadsOutWhileHeld)
     EXPECT_TRUE(anotherThreadCanTake(mutex));
 }
 
-TEST(Mutex, TryLockHoldsTheMutexWhenItSucceeds)
+TEST(Mutex, TryLockHoldsTheMutexOnSuccess)
 {
     Mutex mutex;
     if (mutex.try_lock()) {
         EXPECT_FALSE(anotherThreadCanTake(mutex));
         mutex.unlock();
     } else {
-        ADD_FAILURE() << "nobody holds it";
+        ADD_FAILURE() << "the mutex is free";
     }
     EXPECT_TRUE(anotherThreadCanTake(mutex));
 }
@@ -61,7 +61,7 @@ TEST(MutexLock, HoldsTheMutexForTheLengthOfABlock)
     EXPECT_TRUE(anotherThreadCanTake(mutex));
 }
 
-TEST(MutexLock, GivesTheMutexBackWhenAnExceptionLeavesTheBlock)
+TEST(MutexLock, ReleasesTheMutexWhenAnExceptionLeavesTheBlock)
 {
     Mutex mutex;
     EXPECT_THROW(
@@ -105,7 +105,7 @@ TEST(UniqueMutexLock, HoldsTheMutexForTheLengthOfABlock)
     EXPECT_TRUE(anotherThreadCanTake(mutex));
 }
 
-TEST(UniqueMutexLock, GivesTheMutexBackMeanwhileAndTakesItAgain)
+TEST(UniqueMutexLock, ReleasesTheMutexAndAcquiresItAgain)
 {
     Mutex mutex;
     {
@@ -120,7 +120,7 @@ TEST(UniqueMutexLock, GivesTheMutexBackMeanwhileAndTakesItAgain)
     EXPECT_TRUE(anotherThreadCanTake(mutex));
 }
 
-TEST(UniqueMutexLock, LeavesTheBlockWithoutTheMutexToo)
+TEST(UniqueMutexLock, MayEndWithoutTheMutex)
 {
     Mutex mutex;
     {
@@ -130,8 +130,8 @@ TEST(UniqueMutexLock, LeavesTheBlockWithoutTheMutexToo)
     EXPECT_TRUE(anotherThreadCanTake(mutex));
 }
 
-#if !defined(__clang__) // the analysis refuses both already when they are compiled
-TEST(UniqueMutexLock, RefusesToTakeWhatItHoldsAndToGiveBackWhatItDoesNotHold)
+#if !defined(__clang__) // clang's analysis refuses to compile both
+TEST(UniqueMutexLock, RefusesToLockTwiceAndToUnlockTwice)
 {
     Mutex mutex;
     UniqueMutexLock lock(mutex);
@@ -141,7 +141,7 @@ TEST(UniqueMutexLock, RefusesToTakeWhatItHoldsAndToGiveBackWhatItDoesNotHold)
 }
 #endif
 
-TEST(Mutex, NoneOfThemIsCopied)
+TEST(Mutex, NoClassIsCopyable)
 {
     EXPECT_FALSE(std::is_copy_constructible<Mutex>::value);
     EXPECT_FALSE(std::is_copy_assignable<Mutex>::value);

@@ -39,7 +39,7 @@ TEST(PosixErrorCode, MessageIsWhatItPrints)
     EXPECT_EQ(PosixErrorCode(13).message(), "13 (Permission denied)");
 }
 
-TEST(PosixErrorCode, DefaultIsZeroWhateverErrnoSays)
+TEST(PosixErrorCode, DefaultIsZeroForAnyErrno)
 {
     errno = ENOENT;
     const PosixErrorCode code;
@@ -55,7 +55,7 @@ TEST(PosixErrorCode, ANegativeNumberMeansTheSameAsThePositiveOne)
     EXPECT_EQ(PosixErrorCode(-13).getCode(), 13);
 }
 
-TEST(PosixErrorCode, TheSmallestIntegerBecomesTheLargest)
+TEST(PosixErrorCode, TheSmallestIntegerBecomesTheLargestOne)
 {
     EXPECT_EQ(PosixErrorCode(INT_MIN).getCode(), INT_MAX);
     EXPECT_EQ(PosixErrorCode(INT_MIN + 1).getCode(), INT_MAX);
@@ -68,10 +68,20 @@ TEST(PosixErrorCode, ComparesByNumber)
     EXPECT_FALSE(PosixErrorCode(1) == PosixErrorCode(2));
     EXPECT_FALSE(PosixErrorCode(1) != PosixErrorCode(1));
     EXPECT_TRUE(PosixErrorCode(1) != PosixErrorCode(2));
+}
+
+TEST(PosixErrorCode, ComparesWithAnErrorNumber)
+{
+    const PosixErrorCode code(EINTR);
+    EXPECT_TRUE(code == EINTR);
+    EXPECT_FALSE(code != EINTR);
+    EXPECT_TRUE(code != EAGAIN);
+    EXPECT_FALSE(code == EAGAIN);
+    EXPECT_TRUE(code == -EINTR);
     EXPECT_TRUE(PosixErrorCode() == 0);
 }
 
-TEST(PosixErrorCode, IsMadeFromAnIntegerByItself)
+TEST(PosixErrorCode, AnIntegerConverts)
 {
     const PosixErrorCode code = 24;
     EXPECT_EQ(code.getCode(), 24);
@@ -119,7 +129,7 @@ TEST(PosixError, WithoutContextIsTheTextOfTheCode)
     EXPECT_EQ(error.getErrorCode(), PosixErrorCode(24));
 }
 
-TEST(PosixError, PutsTheContextInFront)
+TEST(PosixError, PutsTheContextBeforeTheText)
 {
     const PosixError error(PosixErrorCode(24), "Failed to open socket");
     EXPECT_STREQ(error.what(), "Failed to open socket: 24 (Too many open files)");
@@ -138,7 +148,7 @@ TEST(PosixError, CopyingAndMovingKeepTextAndCode)
     const PosixError moved(std::move(original));
     EXPECT_STREQ(moved.what(), "context: 5 (Input/output error)");
     EXPECT_EQ(moved.getErrorCode(), PosixErrorCode(5));
-    EXPECT_STREQ(original.what(), "context: 5 (Input/output error)"); // moving copies
+    EXPECT_STREQ(original.what(), "context: 5 (Input/output error)"); // a move is a copy
 
     PosixError assigned(PosixErrorCode(1));
     assigned = copy;
@@ -152,7 +162,7 @@ TEST(PosixError, CopyingDoesNotThrow)
     EXPECT_TRUE(std::is_nothrow_copy_constructible<FileIOError>::value);
 }
 
-TEST(PosixError, OnlyTheCodeConvertsByItself)
+TEST(PosixError, ConvertsOnlyFromACode)
 {
     EXPECT_TRUE((std::is_convertible<int, PosixErrorCode>::value));
     EXPECT_FALSE((std::is_convertible<PosixErrorCode, PosixError>::value));
@@ -175,12 +185,12 @@ TEST(FileIOError, IsCaughtAsEachOfItsBases)
     EXPECT_THAT(fail, ThrowsMessage<std::exception>(StrEq(text)));
 }
 
-TEST(FileIOError, IsNotWhatAPlainPosixErrorIsCaughtAs)
+TEST(FileIOError, DoesNotCatchAPlainPosixError)
 {
     try {
         throw PosixError(PosixErrorCode(5));
     } catch (const FileIOError&) {
-        FAIL() << "a socket's error looks like a file's";
+        FAIL() << "a socket error was caught as a file error";
     } catch (const PosixError& error) {
         EXPECT_STREQ(error.what(), "5 (Input/output error)");
     }

@@ -19,7 +19,7 @@
 namespace qel {
 namespace {
 
-/// A pipe whose writing end is given away: its reading end tells whether the writing end is still open somewhere.
+/// A pipe whose writing end the test gives away: the reading end shows whether the writing end is still open.
 class WatchedPipe {
 public:
     WatchedPipe()
@@ -34,7 +34,7 @@ public:
     WatchedPipe(const WatchedPipe&) = delete;
     WatchedPipe& operator=(const WatchedPipe&) = delete;
 
-    /// @return the writing end, to be closed by the caller from here on
+    /// @return the writing end, which the caller owns from now on
     int giveAway()
     {
         mGivenAway = true;
@@ -64,7 +64,7 @@ private:
     bool mGivenAway = false;
 };
 
-TEST(RefcountFile, AGuardGetsTheDescriptor)
+TEST(RefcountFile, AGuardHasTheDescriptor)
 {
     WatchedPipe pipe;
     const int fd = pipe.giveAway();
@@ -75,7 +75,7 @@ TEST(RefcountFile, AGuardGetsTheDescriptor)
     EXPECT_EQ(::write(guard.getFd(), "x", 1), 1);
 }
 
-TEST(RefcountFile, TheEndOfAGuardLeavesTheDescriptorOpen)
+TEST(RefcountFile, DestroyingAGuardLeavesTheDescriptorOpen)
 {
     WatchedPipe pipe;
     RefcountFile file(pipe.giveAway());
@@ -123,7 +123,7 @@ TEST(RefcountFile, TheLastOfSeveralGuardsCloses)
     EXPECT_FALSE(pipe.writerIsOpen());
 }
 
-TEST(RefcountFile, AGuardMadeAfterCloseGetsNothing)
+TEST(RefcountFile, AGuardMadeAfterCloseIsNotValid)
 {
     WatchedPipe pipe;
     RefcountFile file(pipe.giveAway());
@@ -135,7 +135,7 @@ TEST(RefcountFile, AGuardMadeAfterCloseGetsNothing)
             EXPECT_FALSE(after.isValid());
             EXPECT_EQ(after.getFd(), -1);
         }
-        // The one that got nothing must not have given back what it never had.
+        // The guard without a descriptor must not have ended a use.
         EXPECT_TRUE(pipe.writerIsOpen());
         EXPECT_EQ(::write(before.getFd(), "x", 1), 1);
     }
@@ -150,7 +150,7 @@ TEST(RefcountFile, ClosingTwiceIsHarmless)
     const int fd = pipe.giveAway();
     RefcountFile file(fd);
     file.close();
-    WatchedPipe other; // takes the number that has become free
+    WatchedPipe other; // takes the free number
     EXPECT_TRUE(other.owns(fd));
     file.close();
     EXPECT_TRUE(other.owns(fd));
@@ -194,7 +194,7 @@ TEST(RefcountFile, ANegativeDescriptorStartsClosedAndIsNeverClosed)
     EXPECT_EQ(errno, 0);
 }
 
-/// Frees the number 0 for the length of a test, whatever the process has there.
+/// Frees descriptor 0 for the length of a test.
 class DescriptorZero {
 public:
     DescriptorZero() : mSaved(::fcntl(0, F_DUPFD_CLOEXEC, 3)) { ::close(0); }
@@ -211,7 +211,7 @@ private:
     const int mSaved;
 };
 
-TEST(RefcountFile, ZeroIsADescriptorLikeAnyOther)
+TEST(RefcountFile, DescriptorZeroIsADescriptor)
 {
     WatchedPipe pipe;
     const DescriptorZero zero;
@@ -241,7 +241,7 @@ TEST(RefcountFile, CopiesShareOneDescriptor)
     EXPECT_FALSE(other.isValid());
 }
 
-TEST(RefcountFile, TheEndOfTheLastCopyCloses)
+TEST(RefcountFile, DestroyingTheLastCopyCloses)
 {
     WatchedPipe pipe;
     auto file = std::make_unique<RefcountFile>(pipe.giveAway());
@@ -252,7 +252,7 @@ TEST(RefcountFile, TheEndOfTheLastCopyCloses)
     EXPECT_FALSE(pipe.writerIsOpen());
 }
 
-TEST(RefcountFile, AssignmentGivesTheOldDescriptorUp)
+TEST(RefcountFile, AssignmentReleasesTheOldDescriptor)
 {
     WatchedPipe first;
     WatchedPipe second;
@@ -274,7 +274,7 @@ TEST(RefcountFile, AMovedFromFileStaysUsable)
     EXPECT_TRUE(pipe.writerIsOpen());
 }
 
-TEST(RefcountFile, GuardAndBlockAreNotCopied)
+TEST(RefcountFile, GuardAndBlockAreNotCopyable)
 {
     EXPECT_FALSE(std::is_copy_constructible<RefcountFile::Guard>::value);
     EXPECT_FALSE(std::is_copy_assignable<RefcountFile::Guard>::value);
@@ -297,7 +297,7 @@ TEST(RefcountFileControlBlock, CountsUsesUntilTheLastOneAfterClose)
     EXPECT_FALSE(pipe.writerIsOpen());
 }
 
-TEST(RefcountFileControlBlock, ItsDestructorCloses)
+TEST(RefcountFileControlBlock, TheDestructorCloses)
 {
     WatchedPipe pipe;
     {
@@ -340,16 +340,16 @@ TEST(RefcountFileThreads, CloseDefersToTheGuardsOfOtherThreads)
     EXPECT_EQ(::read(pipe.reader(), written, sizeof(written)), static_cast<ssize_t>(kThreads));
 }
 
-// One thread begins a use at the moment at which another one closes. Whichever comes first, a use that got the
-// descriptor finds it open, and it is closed once: a second close would leave EBADF behind in the thread that made it.
-TEST(RefcountFileThreads, AUseThatBeginsWhileTheFileIsClosedGetsAnOpenDescriptorOrNone)
+// One thread begins a use while another one closes. In either order, a use that got the descriptor finds it open, and
+// it is closed once: a second close would leave EBADF in errno of its thread.
+TEST(RefcountFileThreads, AUseThatBeginsDuringCloseGetsAnOpenDescriptorOrNone)
 {
     constexpr int kRounds = 50000;
     const int device = ::open("/dev/null", O_RDONLY | O_CLOEXEC);
     ASSERT_GE(device, 0);
     std::unique_ptr<RefcountFile::ControlBlock> block;
-    std::atomic<int> started{0};  // the rounds that both threads may play
-    std::atomic<int> finished{0}; // the rounds that the user has played
+    std::atomic<int> started{0};  // rounds that both threads may run
+    std::atomic<int> finished{0}; // rounds that the user has finished
     std::atomic<int> faults{0};
     std::thread user([&] {
         for (int round = 1; round <= kRounds; ++round) {
@@ -377,15 +377,15 @@ TEST(RefcountFileThreads, AUseThatBeginsWhileTheFileIsClosedGetsAnOpenDescriptor
         while (finished < round) {
             std::this_thread::yield();
         }
-        if (::fcntl(fd, F_GETFD) >= 0) ++faults; // closed by now, by whichever came last
+        if (::fcntl(fd, F_GETFD) >= 0) ++faults; // must be closed now
     }
     user.join();
     EXPECT_EQ(faults, 0);
     EXPECT_EQ(::close(device), 0);
 }
 
-// Users take and drop guards while one thread closes and another one keeps opening files, which get the number of the
-// descriptor as soon as it is free. No user may ever see the number with another file behind it.
+// Users make and destroy guards while one thread closes and another one keeps opening files, which get the number of
+// the descriptor as soon as it is free. No user may ever see that number for another file.
 TEST(RefcountFileThreads, NoUserSeesANumberThatBelongsToAnotherFile)
 {
     constexpr int kUsers = 3;

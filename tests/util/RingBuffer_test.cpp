@@ -20,7 +20,7 @@ std::vector<T> contents(const RingBuffer<T, N>& ring)
     return std::vector<T>(ring.begin(), ring.end());
 }
 
-/// Counts its living objects and can refuse to be made; neither copied nor moved nor made without arguments.
+/// Counts its living objects and can throw when constructed; not copyable, not movable, without a default constructor.
 class Tracked {
 public:
     Tracked(int& living, int number) : mLiving(living), mNumber(number)
@@ -56,7 +56,7 @@ TEST(RingBuffer, IsEmptyAtFirst)
     EXPECT_TRUE(ring.begin() == ring.end());
 }
 
-TEST(RingBuffer, RunsFromTheNewestElementToTheOldest)
+TEST(RingBuffer, IteratesFromTheNewestElementToTheOldest)
 {
     RingBuffer<int, 3> ring;
     ring.push(1);
@@ -114,7 +114,7 @@ TEST(RingBuffer, PushReturnsTheNewElementAndHeadCanBeChanged)
     EXPECT_EQ(&constant.head(), &ring.head());
 }
 
-TEST(RingBuffer, ConstructsInPlaceAndDestroysTheElementThatGivesWay)
+TEST(RingBuffer, ConstructsInPlaceAndDestroysTheReplacedElement)
 {
     int living = 0;
     {
@@ -145,7 +145,7 @@ TEST(RingBuffer, AFailedConstructionKeepsTheOtherElements)
 
         ring.push(living, 3);
         EXPECT_THROW(ring.push(living, -1), std::runtime_error);
-        EXPECT_THAT(numbers(ring), ElementsAre(3, 2)); // the oldest had to give way first
+        EXPECT_THAT(numbers(ring), ElementsAre(3, 2)); // the oldest was replaced first
         EXPECT_EQ(living, 2);
 
         ring.push(living, 4);

@@ -70,7 +70,7 @@ void expectStandardClocks()
 // Read while the static objects of this program are made.
 const steady_clock::time_point sReadAtStart = TimeProvider::steady();
 
-TEST(TimeProvider, ReadsTheStandardClocksAtFirst) { expectStandardClocks(); }
+TEST(TimeProvider, ReadsTheStandardClocksByDefault) { expectStandardClocks(); }
 
 TEST(TimeProvider, WorksDuringStaticInitialisation)
 {
@@ -127,7 +127,7 @@ TEST(TimeProvider, UnregisteringPutsTheStandardClocksBack)
     EXPECT_EQ(numberInForce(), 7);
 }
 
-TEST(TimeProvider, TheLastOneRegisteredIsInForce)
+TEST(TimeProvider, TheLastRegisteredProviderIsCurrent)
 {
     FixedClock first(1);
     FixedClock second(2);

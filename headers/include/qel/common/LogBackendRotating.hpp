@@ -43,7 +43,7 @@ public:
     ///        cut to rotateSize - 1 bytes and its line end. Do not pass 0: every line then rotates, and none is cut.
     /// @throws std::bad_alloc  no memory for the path; file errors do not throw
     LogBackendRotating(const std::string& directory, const std::string& name, std::size_t rotateSize);
-    /// The same with a threshold; a value that is no level leaves it at Warn.
+    /// The same with a threshold; an invalid level leaves it at Warn.
     LogBackendRotating(LogLevel::Level level, const std::string& directory, const std::string& name,
                        std::size_t rotateSize);
     /// Flushes the file to its disk (fsync) and closes it.
