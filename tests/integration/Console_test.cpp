@@ -542,65 +542,13 @@ TEST(Console, WhereNobodyListensThereIsNoConsole)
 
 // The command line.
 
-TEST(Console, HelpTellsHowToLeave)
+TEST(Console, HelpShowsHowToLeave)
 {
     const auto help = runQel({"console", "--help"});
     EXPECT_EQ(help.exitStatus, 0);
     EXPECT_THAT(help.output, HasSubstr("Usage: qel console [OPTIONS] partition\n"));
     EXPECT_THAT(help.output, HasSubstr("\"~.\" at the start of a line leaves"));
     EXPECT_THAT(runQel({"--help"}).output, HasSubstr("\n  console "));
-}
-
-TEST(Console, WhatCannotBeTheEscapeCharacterIsToldWhy)
-{
-    const Arguments good{"console", "--connect", "127.0.0.1:1", "--plain", "1", "--escape"};
-    const auto said = [&](const std::string& escape) {
-        Arguments arguments = good;
-        arguments.push_back(escape);
-        const auto result = runQel(arguments);
-        EXPECT_EQ(result.exitStatus, 2);
-        return result.errors;
-    };
-    const std::string forms = "one character, ^ and another from @ to _ for a control character, none\n";
-    for (const char* text : {"ab", " ", "^?", "^`"}) {
-        EXPECT_THAT(said(text), HasSubstr("'" + std::string(text) + "' is none of these: " + forms));
-    }
-    EXPECT_THAT(said("^Z"), HasSubstr("'^Z' has a meaning behind the escape\n"));
-}
-
-TEST(Console, AnythingThatCannotBeCarriedOutIsUsage)
-{
-    const Arguments good{"console", "--connect", "127.0.0.1:1", "--plain"};
-    const std::vector<Arguments> bad{
-        {},
-        {"one"},
-        {"-1"},
-        {"65536"},
-        {"1", "2"},
-        {"1", "--connection", "65536"},
-        {"1", "--escape", ""},
-        {"1", "--escape", "ab"},
-        {"1", "--escape", " "},
-        {"1", "--escape", "."},
-        {"1", "--escape", "?"},
-        {"1", "--escape", "^Z"},
-        {"1", "--escape", "^M"},
-        {"1", "--escape", "^a"},
-        {"1", "--escape", "\x7F"},
-        {"1", "--linger", "-1"},
-        {"1", "--linger", "86401"},
-        {"1", "--timeout", "0"},
-        {"1", "--tool-id", std::string(33, 'x')},
-    };
-    for (const Arguments& more : bad) {
-        Arguments arguments = good;
-        arguments.insert(arguments.end(), more.begin(), more.end());
-        SCOPED_TRACE(commandLine(more));
-        EXPECT_EQ(runQel(arguments).exitStatus, 2);
-    }
-    EXPECT_EQ(runQel({"console", "--connect", "127.0.0.1:1", "1"}).exitStatus, 2) << "not said to go unprotected";
-    EXPECT_EQ(runQel({"console", "--connect", "192.0.2.1:1", "--plain", "1"}).exitStatus, 2) << "no loopback address";
-    EXPECT_EQ(runQel({"console", "--plain", "1"}).exitStatus, 2) << "connect where";
 }
 
 } // namespace

@@ -125,7 +125,7 @@ TEST(Failures, TheComplaintSaysWhatThePhraseOfTheLibraryMeans)
             row.fail();
             ADD_FAILURE() << "nothing was thrown";
         } catch (const std::exception& error) {
-            EXPECT_EQ(tool::complain(error), row.text);
+            EXPECT_EQ(tool::userMessage(error), row.text);
         }
     }
 }

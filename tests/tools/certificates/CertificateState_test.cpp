@@ -67,6 +67,7 @@ TEST(ParsePeriod, IsANumberAndAUnit)
     EXPECT_EQ(parsePeriod("30d"), hours(30 * 24));
     EXPECT_EQ(parsePeriod("2w"), hours(14 * 24));
     EXPECT_EQ(parsePeriod("007d"), hours(7 * 24));
+    EXPECT_EQ(parsePeriod("00000000000000000000000007d"), hours(7 * 24));
 }
 
 TEST(ParsePeriod, IsAtMostAHundredYears)

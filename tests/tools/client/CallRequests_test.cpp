@@ -187,11 +187,11 @@ TEST(CallRequests, ABroadcastIsAddressed)
     EXPECT_EQ(std::string(message.getDaxPacket(), message.getBroadcastMsgLen()), "hello");
 }
 
-TEST(CallRequests, TheLongestTextsJustFitAFrame)
+TEST(CallRequests, TheFrameLimitsJustFitAFrame)
 {
-    EXPECT_EQ(tool::setModeRequest(0, std::string(tool::kLongestMtms, 'x')).message->msgLength(), 16384U);
-    EXPECT_EQ(tool::setMetadataRequest(std::string(tool::kLongestMetadata, 'x')).message->msgLength(), 16384U);
-    EXPECT_EQ(tool::broadcastRequest({}, std::string(tool::kLongestBroadcast, 'x')).message->msgLength(), 16384U);
+    EXPECT_EQ(tool::setModeRequest(0, std::string(tool::kMaxMtms, 'x')).message->msgLength(), 16384U);
+    EXPECT_EQ(tool::setMetadataRequest(std::string(tool::kMaxMetadata, 'x')).message->msgLength(), 16384U);
+    EXPECT_EQ(tool::broadcastRequest({}, std::string(tool::kMaxBroadcast, 'x')).message->msgLength(), 16384U);
 }
 
 TEST(CallRequests, AResponseThatDidNotParseIsABrokenProtocol)

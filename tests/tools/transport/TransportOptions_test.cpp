@@ -121,8 +121,8 @@ TEST(TransportOptions, AWayMustBeChosen)
 {
     EXPECT_THAT(
         [] { tool::checkTransport(TransportOptions(), "127.0.0.1:80"); },
-        ThrowsMessage<CLI::ValidationError>(StrEq("--credentials DIR --name NAME: is required, or --cert, --key "
-                                                  "and --root, or --plain for a loopback address")));
+        ThrowsMessage<CLI::ValidationError>(StrEq("credentials are missing: give --credentials DIR --name NAME, or "
+                                                  "--cert, --key and --root, or --plain for a loopback address")));
     TransportOptions empty;
     empty.name = "n";
     EXPECT_THROW(tool::checkTransport(empty, "127.0.0.1:80"), CLI::ValidationError);
@@ -134,9 +134,9 @@ TEST(TransportOptions, PlainIsForLoopbackAloneAndTlsForEveryAddress)
     plain.plain = true;
     EXPECT_NO_THROW(tool::checkTransport(plain, "127.0.0.1:80"));
     EXPECT_NO_THROW(tool::checkTransport(plain, "[::1]:80"));
-    EXPECT_THAT([&] { tool::checkTransport(plain, "10.0.0.1:80"); },
-                ThrowsMessage<CLI::ValidationError>(
-                    StrEq("--plain: is refused for 10.0.0.1:80, which is no loopback address")));
+    EXPECT_THAT(
+        [&] { tool::checkTransport(plain, "10.0.0.1:80"); },
+        ThrowsMessage<CLI::ValidationError>(StrEq("--plain is refused for 10.0.0.1:80: it is not a loopback address")));
     for (const Parsed& parsed :
          {parse({"--credentials", "d", "--name", "n"}), parse({"--cert", "a", "--key", "b", "--root", "c"})}) {
         EXPECT_NO_THROW(tool::checkTransport(parsed.options, "10.0.0.1:80"));

@@ -68,7 +68,7 @@ std::string explain(const std::exception& error)
     return text;
 }
 
-std::string complain(const std::exception& error)
+std::string userMessage(const std::exception& error)
 {
     if (dynamic_cast<const CommandFailure*>(&error) != nullptr) return explain(error);
     switch (exitStatusOf(error)) {

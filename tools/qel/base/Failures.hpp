@@ -50,6 +50,6 @@ std::string explain(const std::exception& error);
 
 /// The line for whoever typed the command: explain(), and in front of what the library says of a connection, which is a
 /// short phrase such as "EOF", what that means for the command. A CommandFailure says so itself.
-std::string complain(const std::exception& error);
+std::string userMessage(const std::exception& error);
 
 } // namespace qel::tool

@@ -7,6 +7,7 @@
 
 #include "base/OptionChecks.hpp"
 #include "base/TerminalMode.hpp"
+#include "base/Text.hpp"
 #include "base/UniqueFd.hpp"
 
 #include <cctype>
@@ -14,8 +15,10 @@
 #include <cstdio>
 #include <exception>
 #include <fcntl.h>
+#include <filesystem>
 #include <memory>
 #include <sstream>
+#include <system_error>
 #include <unistd.h>
 
 namespace qel::tool {
@@ -50,7 +53,14 @@ bool isLevel(const std::string& text)
 
 std::string checkLevel(std::string& text)
 {
-    return isLevel(text) ? std::string() : "'" + text + "' is no log level: debug, info, warn, error or critical";
+    return isLevel(text) ? std::string()
+                         : tool::quoted(text) + " is not a log level: debug, info, warn, error or critical";
+}
+
+std::string checkDirectory(std::string& name)
+{
+    std::error_code error; // ignored: what cannot be examined is not a directory to write to
+    return std::filesystem::is_directory(name, error) ? std::string() : tool::quoted(name) + " is not a directory";
 }
 
 std::string describeLevels(const LogOptions& options)
@@ -76,13 +86,13 @@ void addLogOptions(CLI::App& app, LogOptions& options)
     app.add_option("--log-dir", options.directory,
                    "Write the log to files in this directory, five of them at most; without it, to standard error")
         ->type_name("DIR")
-        ->check(CLI::Validator(CLI::ExistingDirectory).description(""));
+        ->check(CLI::Validator(checkDirectory, ""));
     app.add_option("--log-level", options.level, describeLevels(options))
         ->type_name("LEVEL")
         ->check(CLI::Validator(checkLevel, ""));
     app.add_option("--log-size", options.fileBytes, "Bytes that one log file may hold")
         ->type_name("BYTES")
-        ->transform(wholeNumberBetween(4096, std::uint64_t{1} << 40))
+        ->transform(integerIn(4096, std::uint64_t{1} << 40))
         ->capture_default_str();
 }
 

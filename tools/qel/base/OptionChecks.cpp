@@ -3,10 +3,14 @@
 #include <qel/common/QelCapabilities.hpp>
 #include <qel/common/net/IPEndpoint.hpp>
 
+#include "base/Text.hpp"
+
 #include <charconv>
-#include <cmath>
 #include <exception>
 #include <filesystem>
+#include <iomanip>
+#include <limits>
+#include <sstream>
 #include <string>
 #include <system_error>
 
@@ -24,88 +28,108 @@ bool isEndpoint(const std::string& text)
     }
 }
 
-/// Why a text is no endpoint. What the library says is for those who know its parser: it takes any host that is no IPv4
-/// address for an IPv6 address, and for a missing port it has no text of its own.
-std::string reasonAgainst(const std::string& endpoint)
+/// Why a text is not an endpoint. The library's own message does not help here: it takes any host that is not an IPv4
+/// address for an IPv6 address, and has no text for a missing port.
+std::string endpointProblem(const std::string& endpoint)
 {
     const std::size_t colon = endpoint.rfind(':');
     const bool endsWithHost = colon == std::string::npos || endpoint.back() == ']';
     if (endsWithHost) return "the port is missing";
-    if (colon + 1 == endpoint.size()) return "the port behind the last ':' is missing";
+    if (colon + 1 == endpoint.size()) return "the port after the last ':' is missing";
     const std::string port = endpoint.substr(colon + 1);
-    if (!isEndpoint("0.0.0.0:" + port)) return "'" + port + "' is no port from 0 to 65535";
+    if (!isEndpoint("0.0.0.0:" + port)) return tool::quoted(port) + " is not a port in [0, 65535]";
     const std::string host = endpoint.substr(0, colon);
-    if (isEndpoint("[" + host + "]:0")) return "an IPv6 address stands in brackets";
-    return "'" + host + "' is no IP address; names are not looked up";
+    if (isEndpoint("[" + host + "]:0")) return "write an IPv6 address in brackets";
+    return tool::quoted(host) + " is not an IP address (names are not looked up)";
 }
 
 std::string checkEndpoint(std::string& text)
 {
     if (isEndpoint(text)) return {};
-    return "'" + text + "' is no endpoint, such as 127.0.0.1:4711 or [::1]:4711: " + reasonAgainst(text);
+    return tool::quoted(text) + " is not an endpoint such as 127.0.0.1:4711 or [::1]:4711: " + endpointProblem(text);
 }
 
 std::string checkCapabilities(std::string& text)
 {
-    if (text.size() > QelCapabilities::size()) return "more than 32 capability bits";
-    if (text.find_first_not_of("01") != std::string::npos) return "capability bits are written as 0 and 1";
+    if (text.find_first_not_of("01") != std::string::npos) {
+        return tool::quoted(text) + " is not a capability set: write each bit as 0 or 1";
+    }
+    if (text.size() > QelCapabilities::size()) return "longer than 32 bits";
     return {};
 }
 
 std::string checkFile(std::string& name)
 {
-    std::error_code error; // not looked at: whatever else is wrong with the file shows when it is opened
+    std::error_code error; // ignored: opening the file reports everything but its absence
     const bool isMissing = std::filesystem::status(name, error).type() == std::filesystem::file_type::not_found;
-    return isMissing ? "'" + name + "' does not exist" : std::string();
+    return isMissing ? tool::quoted(name) + " does not exist" : std::string();
 }
 
-/// @return false: it is none, or has more digits than any number here
-bool parseWholeNumber(const std::string& text, std::uint64_t& number)
+/// A number as a person writes it: 0.5, 86400, 1000000.
+std::string plainNumber(double number)
+{
+    std::ostringstream text;
+    text << std::setprecision(std::numeric_limits<double>::digits10) << number;
+    return text.str();
+}
+
+} // namespace
+
+std::optional<std::uint64_t> parseInteger(const std::string& text)
 {
     const bool isHexadecimal = text.size() > 2 && text[0] == '0' && (text[1] == 'x' || text[1] == 'X');
     const char* const begin = text.data() + (isHexadecimal ? 2 : 0);
     const char* const end = text.data() + text.size();
+    std::uint64_t number = 0;
     const auto result = std::from_chars(begin, end, number, isHexadecimal ? 16 : 10);
-    return result.ec == std::errc() && result.ptr == end;
+    if (result.ec != std::errc() || result.ptr != end) return std::nullopt;
+    return number;
 }
 
-} // namespace
+CLI::Validator integerIn(std::uint64_t min, std::uint64_t max)
+{
+    return CLI::Validator(
+        [min, max](std::string& text) {
+            const auto number = parseInteger(text);
+            if (!number || *number < min || *number > max) return notAnIntegerIn(text, min, max);
+            text = std::to_string(*number);
+            return std::string();
+        },
+        "INT in [" + std::to_string(min) + ", " + std::to_string(max) + "]");
+}
+
+std::string notAnIntegerIn(const std::string& text, std::uint64_t min, std::uint64_t max)
+{
+    return tool::quoted(text) + " is not an integer in [" + std::to_string(min) + ", " + std::to_string(max) + "]";
+}
+
+CLI::Validator numberIn(double min, double max)
+{
+    const std::string range = "[" + plainNumber(min) + ", " + plainNumber(max) + "]";
+    return CLI::Validator(
+        [min, max, range](std::string& text) {
+            double number = 0;
+            // NaN compares false with both limits, so it is refused too.
+            const bool isInRange = CLI::detail::lexical_cast(text, number) && number >= min && number <= max;
+            return isInRange ? std::string() : tool::quoted(text) + " is not a number in " + range;
+        },
+        "FLOAT in " + range);
+}
+
+CLI::Validator textUpTo(std::size_t bytes)
+{
+    return CLI::Validator(
+        [bytes](std::string& text) {
+            return text.size() <= bytes ? std::string() : "longer than " + std::to_string(bytes) + " bytes";
+        },
+        "");
+}
 
 CLI::Validator endpointValidator() { return CLI::Validator(checkEndpoint, ""); }
 
 CLI::Validator capabilityValidator() { return CLI::Validator(checkCapabilities, ""); }
 
 CLI::Validator fileValidator() { return CLI::Validator(checkFile, ""); }
-
-CLI::Validator numberBetween(double least, double most)
-{
-    const CLI::Range range(least, most);
-    return CLI::Validator(
-        [range](std::string& text) {
-            const std::string failure = range(text);
-            double number = 0;
-            // A NaN is neither below the one nor above the other, and passes for a number between them.
-            const bool isNumber = CLI::detail::lexical_cast(text, number) && !std::isnan(number);
-            return failure.empty() && !isNumber ? "'" + text + "' is no number" : failure;
-        },
-        range.get_description());
-}
-
-CLI::Validator wholeNumberBetween(std::uint64_t least, std::uint64_t most)
-{
-    const std::string from = std::to_string(least);
-    const std::string to = std::to_string(most);
-    return CLI::Validator(
-        [least, most, from, to](std::string& text) {
-            std::uint64_t number = 0;
-            if (!parseWholeNumber(text, number) || number < least || number > most) {
-                return "'" + text + "' is no whole number from " + from + " to " + to;
-            }
-            text = std::to_string(number);
-            return std::string();
-        },
-        "INT in [" + from + " - " + to + "]");
-}
 
 bool isLoopback(const IPAddress& address)
 {

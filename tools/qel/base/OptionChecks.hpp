@@ -4,31 +4,43 @@
 
 #include <CLI/CLI.hpp>
 #include <cstdint>
+#include <optional>
+#include <string>
 
 /// @file
-/// What the values of options have to be, said in the same words by every command.
+/// Checks of option values. Every command uses these, so the same mistake gets the same message everywhere.
 
 namespace qel::tool {
 
-/// Accepts the text of an endpoint: "127.0.0.1:4711", "[::1]:4711".
+/// Reads an integer. This is the one rule for all integers on a command line: decimal digits, or hexadecimal digits
+/// after "0x"; leading zeros mean nothing, so 010 is ten.
+/// @return none when the text is not such an integer or the value does not fit 64 bits
+std::optional<std::uint64_t> parseInteger(const std::string& text);
+
+/// Accepts an integer in [min, max], as parseInteger() reads it, and leaves it in decimal.
+/// Use it with transform(): CLI11 by itself would read 010 as octal.
+CLI::Validator integerIn(std::uint64_t min, std::uint64_t max);
+
+/// The message of integerIn(): `"x" is not an integer in [1, 255]`.
+std::string notAnIntegerIn(const std::string& text, std::uint64_t min, std::uint64_t max);
+
+/// Accepts a number in [min, max]; NaN is refused.
+CLI::Validator numberIn(double min, double max);
+
+/// Accepts at most `bytes` bytes of text.
+CLI::Validator textUpTo(std::size_t bytes);
+
+/// Accepts an IP address and port: "127.0.0.1:4711", "[::1]:4711".
 CLI::Validator endpointValidator();
 
-/// Accepts the text of a capability set, as QelCapabilities takes it: up to 32 characters 0 and 1.
+/// Accepts a capability set as QelCapabilities does: up to 32 characters, each 0 or 1.
 CLI::Validator capabilityValidator();
 
-/// Accepts the name of a file that is to be read, unless there is none of that name. A file that cannot be reached or
-/// read is no wrong command line: that shows when it is opened.
+/// Accepts the name of an existing file. A file that exists but cannot be read is not a usage error: opening it fails
+/// later, with the reason.
 CLI::Validator fileValidator();
 
-/// Accepts a number from one to the other, both included, and nothing that is no number, such as "nan".
-CLI::Validator numberBetween(double least, double most);
-
-/// For options that take whole numbers: a number from one to the other, both included, in decimal or, behind "0x", in
-/// hexadecimal digits. Zeros in front mean nothing, so that 010 is ten here as it is everywhere else on a command line.
-/// To be used with transform(): the parser itself would take 010 for an octal number.
-CLI::Validator wholeNumberBetween(std::uint64_t least, std::uint64_t most);
-
-/// 127.0.0.0/8, ::1, and the former as an IPv4-mapped IPv6 address.
+/// True for 127.0.0.0/8, ::1, and 127.0.0.0/8 as IPv4-mapped IPv6 addresses.
 bool isLoopback(const IPAddress& address);
 
 } // namespace qel::tool

@@ -1,6 +1,7 @@
 #include "base/Program.hpp"
 
 #include "base/Failures.hpp"
+#include "base/UsageErrors.hpp"
 
 #include <cerrno>
 #include <cstdio>
@@ -18,7 +19,7 @@ constexpr const char* kVersionText = "qel " QEL_PROGRAM_VERSION;
 
 ExitStatus report(const std::exception& error)
 {
-    std::cerr << "qel: " << complain(error) << std::endl;
+    std::cerr << "qel: " << userMessage(error) << std::endl;
     return exitStatusOf(error);
 }
 
@@ -27,9 +28,12 @@ ExitStatus parseAndRun(CLI::App& app, Action& action, int argc, const char* cons
     try {
         app.parse(argc, argv);
     } catch (const CLI::ParseError& error) {
-        // The parser knows many ways to be wrong and the text for each; all of them are one exit status.
-        if (app.exit(error) != 0) return ExitStatus::Usage;
-        flushOutput(); // the help or the version
+        if (error.get_exit_code() != 0) {
+            std::cerr << "qel: " << usageMessage(app, error) << std::endl;
+            return ExitStatus::Usage;
+        }
+        app.exit(error); // prints the help or the version
+        flushOutput();
         return ExitStatus::Done;
     }
     const ExitStatus status = action ? action() : ExitStatus::Usage;

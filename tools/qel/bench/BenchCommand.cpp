@@ -5,6 +5,7 @@
 #include "base/Logging.hpp"
 #include "base/OptionChecks.hpp"
 #include "base/SignalWatch.hpp"
+#include "base/Text.hpp"
 #include "bench/BenchReport.hpp"
 #include "bench/BenchRun.hpp"
 #include "bench/ProgressBar.hpp"
@@ -147,27 +148,27 @@ ExitStatus runBench(const BenchOptions& options, const BenchLoad& load)
 
 std::string checkEven(std::string& text)
 {
-    unsigned int number = 0;
-    const bool even = CLI::detail::lexical_cast(text, number) && number % 2 == 0;
-    return even ? std::string() : "'" + text + "' is no even number: a console at each end of a message";
+    const auto number = parseInteger(text);
+    const bool isEven = number && *number % 2 == 0;
+    return isEven ? std::string() : tool::quoted(text) + " is not even: a message needs two consoles";
 }
 
 void addLoadOptions(CLI::App& command, BenchOptions& options)
 {
     command.add_option("--connections", options.connections, "Consoles, of which every two send each other messages")
-        ->transform(wholeNumberBetween(2, kMostConnections))
+        ->transform(integerIn(2, kMostConnections))
         ->check(CLI::Validator(checkEven, ""))
         ->capture_default_str();
     command.add_option("--size", options.bytes, "Bytes of payload in a message")
         ->type_name("BYTES")
-        ->transform(wholeNumberBetween(1, kLongestBroadcast))
+        ->transform(integerIn(1, kMaxBroadcast))
         ->capture_default_str();
     command.add_option("--rate", options.rate, "Messages a second, all connections together; flat out unless given")
-        ->check(numberBetween(0.001, kHighestRate));
+        ->check(numberIn(0.001, kHighestRate));
     CLI::Option* const count = command.add_option("--count", options.count, "Messages, all connections together")
-                                   ->transform(wholeNumberBetween(1, kMostMessages));
+                                   ->transform(integerIn(1, kMostMessages));
     command.add_option("--seconds", options.seconds, "How long to go on; 10 unless this or --count is given")
-        ->check(numberBetween(0.001, kLongestSeconds))
+        ->check(numberIn(0.001, kLongestSeconds))
         ->excludes(count);
 }
 

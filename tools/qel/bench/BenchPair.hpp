@@ -23,7 +23,7 @@ struct BenchConsole {
 /// nothing at the hypervisor and bothers no other console. Thread safety: one thread; cut() from any.
 class BenchPair {
 public:
-    /// @param bytes  of payload, 1 to kLongestBroadcast
+    /// @param bytes  of payload, 1 to kMaxBroadcast
     /// @param timeout  for each message
     BenchPair(BenchConsole first, BenchConsole second, std::size_t bytes, std::chrono::milliseconds timeout);
 

@@ -371,7 +371,7 @@ void addDays(CLI::App& subcommand, unsigned long& days)
 {
     subcommand.add_option("--days", days, "Days until the certificate expires")
         ->type_name("DAYS")
-        ->transform(wholeNumberBetween(1, kMostDays))
+        ->transform(integerIn(1, kMostDays))
         ->capture_default_str();
 }
 

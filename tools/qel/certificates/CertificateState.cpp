@@ -1,9 +1,11 @@
 #include "certificates/CertificateState.hpp"
 
+#include "base/OptionChecks.hpp"
 #include "base/Text.hpp"
 
 #include <array>
 #include <ctime>
+#include <optional>
 #include <stdexcept>
 
 namespace qel::tool {
@@ -13,7 +15,6 @@ namespace {
 using std::chrono::seconds;
 using Clock = SSLValidityPeriod::Clock;
 
-constexpr std::size_t kMostDigits = 10; // so that the longest number of weeks is far from the end of the type
 constexpr seconds kLongest = std::chrono::hours(24) * 36525;
 
 /// @return 0 for what is no unit
@@ -35,9 +36,11 @@ seconds unitOf(char c)
     }
 }
 
-bool isNumber(const std::string& text)
+/// Hexadecimal digits are left out: the "d" of "0x1d" could be a digit as well as the unit.
+std::optional<std::uint64_t> parseDecimal(const std::string& text)
 {
-    return !text.empty() && text.size() <= kMostDigits && text.find_first_not_of("0123456789") == std::string::npos;
+    if (text.find_first_not_of("0123456789") != std::string::npos) return std::nullopt;
+    return parseInteger(text);
 }
 
 } // namespace
@@ -66,11 +69,9 @@ const char* stateName(CertificateState state)
 
 seconds parsePeriod(const std::string& text)
 {
-    const std::string number = text.substr(0, text.empty() ? 0 : text.size() - 1);
     const seconds unit = text.empty() ? seconds(0) : unitOf(text.back());
-    const bool isPeriod = unit.count() != 0 && isNumber(number);
-    const seconds period = isPeriod ? seconds(std::stoll(number) * unit) : seconds::max();
-    if (period <= kLongest) return period;
+    const auto number = unit.count() == 0 ? std::nullopt : parseDecimal(text.substr(0, text.size() - 1));
+    if (number && *number <= static_cast<std::uint64_t>(kLongest / unit)) return *number * unit;
     throw std::invalid_argument(quoted(text) + " is no length of time: a number with s, m, h, d or w, as in 30d, and " +
                                 "at most 100 years");
 }

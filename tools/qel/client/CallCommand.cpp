@@ -102,15 +102,6 @@ CLI::App& addRequest(CLI::App& command, Action& action, const std::shared_ptr<Ca
     return request;
 }
 
-CLI::Validator longest(std::size_t bytes)
-{
-    return CLI::Validator(
-        [bytes](std::string& text) {
-            return text.size() <= bytes ? std::string() : "longer than " + std::to_string(bytes) + " bytes";
-        },
-        "");
-}
-
 void addPlainRequests(CLI::App& command, Action& action, const std::shared_ptr<Call>& call)
 {
     const auto add = [&](const char* name, const char* description, CallRequest (*make)()) {
@@ -140,8 +131,8 @@ void addSetMode(CLI::App& command, Action& action, const std::shared_ptr<Call>& 
                                    [](const RequestArguments& arguments) {
                                        return setModeRequest(static_cast<std::uint8_t>(arguments.mode), arguments.mtms);
                                    });
-    request.add_option("mode", call->arguments.mode, "0 to 255")->required()->transform(wholeNumberBetween(0, 255));
-    request.add_option("mtms", call->arguments.mtms, "Machine type, model and serial")->check(longest(kLongestMtms));
+    request.add_option("mode", call->arguments.mode, "0 to 255")->required()->transform(integerIn(0, 255));
+    request.add_option("mtms", call->arguments.mtms, "Machine type, model and serial")->check(textUpTo(kMaxMtms));
 }
 
 void addSetMetadata(CLI::App& command, Action& action, const std::shared_ptr<Call>& call)
@@ -149,7 +140,7 @@ void addSetMetadata(CLI::App& command, Action& action, const std::shared_ptr<Cal
     CLI::App& request =
         addRequest(command, action, call, "set-metadata", "Set the metadata of the global save area",
                    [](const RequestArguments& arguments) { return setMetadataRequest(arguments.metadata); });
-    request.add_option("metadata", call->arguments.metadata, "Any text")->required()->check(longest(kLongestMetadata));
+    request.add_option("metadata", call->arguments.metadata, "Any text")->required()->check(textUpTo(kMaxMetadata));
 }
 
 CallRequest makeBroadcast(const RequestArguments& arguments)
@@ -164,21 +155,21 @@ void addBroadcast(CLI::App& command, Action& action, const std::shared_ptr<Call>
     RequestArguments& arguments = call->arguments;
     CLI::App& request =
         addRequest(command, action, call, "broadcast", "Send a text to the other consoles", makeBroadcast);
-    request.add_option("text", arguments.broadcast, "What to send")->required()->check(longest(kLongestBroadcast));
+    request.add_option("text", arguments.broadcast, "What to send")->required()->check(textUpTo(kMaxBroadcast));
     CLI::Option* const type =
         request.add_option("--type", arguments.broadcastType, "Broadcast type; 1 goes to one console alone")
-            ->transform(wholeNumberBetween(0, 255))
+            ->transform(integerIn(0, 255))
             ->capture_default_str();
     request.add_option("--to-type", arguments.address.toolType, "Tool type of the console it goes to")
-        ->transform(wholeNumberBetween(0, std::numeric_limits<std::uint32_t>::max()))
+        ->transform(integerIn(0, std::numeric_limits<std::uint32_t>::max()))
         ->needs(type);
     request.add_option("--to-id", arguments.address.toolId, "Tool id of the console it goes to")
         ->needs(type)
-        ->check(longest(32));
+        ->check(textUpTo(32));
     // The library refuses to build a broadcast to one tool that is not named; on a command line that is bad usage.
     request.parse_complete_callback([&arguments] {
         if (arguments.broadcastType == 1 && arguments.address.toolId.empty()) {
-            throw CLI::ValidationError("--type 1", "needs --to-id");
+            throw CLI::ValidationError("--type 1 needs --to-id");
         }
     });
 }

@@ -4,7 +4,7 @@
 #include <qel/common/QelMessage.hpp>
 
 #include "base/Answer.hpp"
-#include "base/LongestTexts.hpp"
+#include "base/FrameLimits.hpp"
 
 #include <cstdint>
 #include <functional>
@@ -44,7 +44,7 @@ CallRequest getModeRequest();
 CallRequest setModeRequest(std::uint8_t mode, const std::string& mtms);
 CallRequest getMetadataRequest();
 CallRequest setMetadataRequest(const std::string& metadata);
-/// @param text  at most kLongestBroadcast bytes
+/// @param text  at most kMaxBroadcast bytes
 /// @throws QelMessageValidationException  the address is one that no broadcast can be built for
 CallRequest broadcastRequest(const BroadcastAddress& address, const std::string& text);
 

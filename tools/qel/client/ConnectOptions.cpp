@@ -14,11 +14,6 @@ constexpr std::size_t kToolIdBytes = 32;
 constexpr double kShortestTimeout = 0.001;
 constexpr double kLongestTimeout = 24 * 60 * 60;
 
-std::string checkToolId(std::string& text)
-{
-    return text.size() <= kToolIdBytes ? std::string() : "the tool id is longer than 32 bytes";
-}
-
 } // namespace
 
 std::chrono::milliseconds ConnectOptions::timeout() const
@@ -35,14 +30,14 @@ void addConnectOptions(CLI::App& app, ConnectOptions& options)
     addTransportOptions(app, options.transport);
     app.add_option("--timeout", options.timeoutSeconds, "Seconds for connecting and all answers together")
         ->type_name("SECONDS")
-        ->check(numberBetween(kShortestTimeout, kLongestTimeout))
+        ->check(numberIn(kShortestTimeout, kLongestTimeout))
         ->capture_default_str();
     app.add_option("--tool-type", options.identity.toolType, "Type that this console introduces itself with")
-        ->transform(wholeNumberBetween(0, std::numeric_limits<std::uint32_t>::max()))
+        ->transform(integerIn(0, std::numeric_limits<std::uint32_t>::max()))
         ->capture_default_str();
     app.add_option("--tool-id", options.identity.toolId,
                    "Id that this console introduces itself with, at most 32 bytes; qel-<process id> unless given")
-        ->check(CLI::Validator(checkToolId, ""));
+        ->check(textUpTo(kToolIdBytes));
 }
 
 IdentityOptions completeIdentity(const IdentityOptions& options)

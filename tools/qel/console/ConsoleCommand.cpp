@@ -7,6 +7,7 @@
 #include "base/OptionChecks.hpp"
 #include "base/SignalWatch.hpp"
 #include "base/TerminalMode.hpp"
+#include "base/Text.hpp"
 #include "client/ClientConnection.hpp"
 #include "client/ConnectOptions.hpp"
 #include "console/ConsoleLoop.hpp"
@@ -73,10 +74,10 @@ std::string checkEscape(std::string& text)
     if (text == "none") return {};
     const bool isPrintable = text.size() == 1 && text[0] > ' ' && text[0] < '\x7F';
     if (!isPrintable && !isControlText(text)) {
-        return "'" + text +
-               "' is none of these: one character, ^ and another from @ to _ for a control character, none";
+        return tool::quoted(text) + " is not one printable character, ^ and a character from @ to _, or none";
     }
-    if (EscapeFilter::isCommandCharacter(*parseEscape(text))) return "'" + text + "' has a meaning behind the escape";
+    if (EscapeFilter::isCommandCharacter(*parseEscape(text)))
+        return tool::quoted(text) + " is a command after the escape character";
     return {};
 }
 
@@ -182,7 +183,7 @@ void addInputOptions(CLI::App& command, ConsoleOptions& options)
                     "Leave when the partition has been silent for so long after the end of the input, which it is then "
                     "told only once; wait for its command to end unless given")
         ->type_name("SECONDS")
-        ->check(numberBetween(0.0, kLongestLinger));
+        ->check(numberIn(0.0, kLongestLinger));
 }
 
 } // namespace
@@ -194,14 +195,14 @@ CLI::App& addConsoleCommand(CLI::App& parent, Action& action)
     command.add_option("partition", options->address.partition, "The partition's id")
         ->required()
         ->type_name("PARTITION")
-        ->transform(wholeNumberBetween(0, 65535));
+        ->transform(integerIn(0, 65535));
     addConnectOptions(command, options->connect);
     command.get_option("--timeout")
         ->description("Seconds for connecting and opening the session together, and then for each answer and for each "
                       "message that has begun");
     command.add_option("--connection", options->address.connection, "Number of the serial connection")
         ->type_name("N")
-        ->transform(wholeNumberBetween(0, 65535))
+        ->transform(integerIn(0, 65535))
         ->capture_default_str();
     command.add_flag("--force", options->force, "Take the session from the console that holds it");
     addEscape(command, *options);

@@ -5,8 +5,8 @@
 #include <qel/common/QelMessageGeneric.hpp>
 #include <qel/common/util/TimeProvider.hpp>
 
+#include "base/FrameLimits.hpp"
 #include "base/Logging.hpp"
-#include "base/LongestTexts.hpp"
 
 #include <algorithm>
 #include <chrono>
@@ -295,7 +295,7 @@ Hypervisor::Reply Hypervisor::pLimits(Console&, const QelMessageGetInterfaceLimi
 
 Hypervisor::Reply Hypervisor::pBroadcast(Console& console, const QelMessageDaxBroadcastReq& request)
 {
-    if (request.getBroadcastMsgLen() > kLongestBroadcast) return bareResponse(request, QelMessageStatusInvalidData);
+    if (request.getBroadcastMsgLen() > kMaxBroadcast) return bareResponse(request, QelMessageStatusInvalidData);
     if (request.getBroadcastMode() == kUnicast) {
         Console* const addressee = pFindIdentified(request.getToolType(), request.getToolId());
         if (addressee == nullptr || addressee == &console) {
@@ -322,7 +322,7 @@ Hypervisor::Reply Hypervisor::pTime(Console&, const QelMessageGetQelTodReq& requ
 Hypervisor::Reply Hypervisor::pSetMode(Console&, const QelMessageSetGlobalModeAttributeReq& request)
 {
     // What cannot be told to whoever asks for it later would break that console's connection.
-    if (request.getMTMSLen() > kLongestMtms) return bareResponse(request, QelMessageStatusInvalidData);
+    if (request.getMTMSLen() > kMaxMtms) return bareResponse(request, QelMessageStatusInvalidData);
     mMode = request.getMode();
     mMtms = request.getMTMS();
     return bareResponse(request, QelMessageStatusNoError); // the one request that has no response class
@@ -335,7 +335,7 @@ Hypervisor::Reply Hypervisor::pGetMode(Console&, const QelMessageGetGlobalModeAt
 
 Hypervisor::Reply Hypervisor::pSetMetadata(Console&, const QelMessageSetGlobalSaveAreaMetadataReq& request)
 {
-    if (request.getMetadataLen() > kLongestMetadata) return bareResponse(request, QelMessageStatusInvalidData);
+    if (request.getMetadataLen() > kMaxMetadata) return bareResponse(request, QelMessageStatusInvalidData);
     mMetadata = request.getMetadata();
     return std::make_unique<QelMessageSetGlobalSaveAreaMetadataRsp>(request.getCallerId());
 }

@@ -55,21 +55,13 @@ struct ServeOptions {
     throw CLI::ValidationError(option, reason);
 }
 
-bool isNumber(const std::string& text, std::size_t mostDigits)
-{
-    return !text.empty() && text.size() <= mostDigits && text.find_first_not_of("0123456789") == std::string::npos;
-}
-
 /// @throws CLI::ValidationError
-std::uint16_t parseNumber(const std::string& text, unsigned long least, const std::string& option)
+std::uint16_t parseNumber(const std::string& text, std::uint64_t min, const std::string& option)
 {
-    constexpr std::size_t kDigits = 5;
-    constexpr unsigned long kLargest = 65535;
-    const unsigned long number = isNumber(text, kDigits) ? std::stoul(text) : kLargest + 1;
-    if (number < least || number > kLargest) {
-        refuse(option, "'" + text + "' is no number from " + std::to_string(least) + " to 65535");
-    }
-    return static_cast<std::uint16_t>(number);
+    constexpr std::uint64_t kMax = 65535;
+    const auto number = parseInteger(text);
+    if (!number || *number < min || *number > kMax) refuse(option, notAnIntegerIn(text, min, kMax));
+    return static_cast<std::uint16_t>(*number);
 }
 
 std::map<std::uint16_t, std::string> parsePartitions(const std::vector<std::string>& texts)
@@ -98,7 +90,7 @@ void parseVersion(const std::string& text, HypervisorSettings& settings)
 HypervisorSettings parseSettings(const ServeOptions& options)
 {
     HypervisorSettings settings = options.settings;
-    if (options.family.size() > 1) refuse("--interface-family", "is one character");
+    if (options.family.size() > 1) refuse("--interface-family", "takes one character");
     if (!options.family.empty()) settings.interfaceFamily = options.family.front();
     if (!options.version.empty()) parseVersion(options.version, settings);
     settings.capabilities = QelCapabilities(options.capabilities);
@@ -217,8 +209,7 @@ ExitStatus runServe(const ServePlan& plan)
 
 void addIdentityOptions(CLI::App& command, ServeOptions& options)
 {
-    const auto shortName = CLI::Validator(
-        [](std::string& text) { return text.size() <= kLongestName ? std::string() : "longer than 16 bytes"; }, "");
+    const CLI::Validator shortName = textUpTo(kLongestName);
     command.add_option("--system-type", options.settings.machineType, "Machine type to report, at most 16 bytes")
         ->check(shortName)
         ->capture_default_str();
@@ -255,13 +246,13 @@ CLI::App& addServeCommand(CLI::App& parent, Action& action)
         ->type_name("ID=COMMAND")
         ->allow_extra_args(false);
     command.add_option("--max-consoles", options->maxConsoles, "Consoles served at a time")
-        ->transform(wholeNumberBetween(1, 255))
+        ->transform(integerIn(1, 255))
         ->capture_default_str();
     command
         .add_option("--queue-limit", options->queueBytes,
                     "Bytes that may be queued for a console before it has to wait; half of it for serial data")
         ->type_name("BYTES")
-        ->transform(wholeNumberBetween(1, kLargestQueue))
+        ->transform(integerIn(1, kLargestQueue))
         ->capture_default_str();
     addIdentityOptions(command, *options);
     addLogOptions(command, options->log);

@@ -113,7 +113,7 @@ void addTransportOptions(CLI::App& app, TransportOptions& options)
     app.add_option("--handshake-timeout", options.handshakeSeconds,
                    "Seconds from the connection until the console is let in")
         ->type_name("SECONDS")
-        ->check(numberBetween(kShortestHandshake, kLongestHandshake))
+        ->check(numberIn(kShortestHandshake, kLongestHandshake))
         ->capture_default_str();
 }
 
@@ -121,11 +121,11 @@ void checkTransport(const TransportOptions& options, const std::string& endpoint
 {
     const bool hasCredentials = !options.directory.empty() || !options.files.certificate.empty();
     if (!options.plain && !hasCredentials) {
-        throw CLI::ValidationError("--credentials DIR --name NAME",
-                                   "is required, or --cert, --key and --root, or --plain for a loopback address");
+        throw CLI::ValidationError("credentials are missing: give --credentials DIR --name NAME, or --cert, --key and "
+                                   "--root, or --plain for a loopback address");
     }
     if (options.plain && !isLoopback(IPEndpoint(endpoint).getAddress())) {
-        throw CLI::ValidationError("--plain", "is refused for " + endpoint + ", which is no loopback address");
+        throw CLI::ValidationError("--plain is refused for " + endpoint + ": it is not a loopback address");
     }
 }
 
