@@ -92,7 +92,7 @@ public:
 
     /// Ends the work of this queue for good: producers and consumers that wait return now, later ones at once, and
     /// messages still in it stay there until it is destroyed. Further calls do nothing.
-    /// @throws std::bad_alloc and what a substitute clock throws, for the log line; the queue is shut down all the same
+    /// Does not throw.
     void shutdown();
 
     /// @return whether shutdown() has been called. Takes no lock.
