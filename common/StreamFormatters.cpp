@@ -45,7 +45,7 @@ std::ostream& operator<<(std::ostream& os, const HexStringFormatter& formatter)
 std::ostream& operator<<(std::ostream& os, const HexDumpFormatter& formatter)
 {
     const auto* bytes = static_cast<const unsigned char*>(formatter.mPtr);
-    const auto address = static_cast<std::uint64_t>(reinterpret_cast<std::uintptr_t>(formatter.mPtr));
+    const std::uint64_t address = reinterpret_cast<std::uintptr_t>(formatter.mPtr);
 
     os << std::hex << std::setfill('0');
     for (std::uint64_t i = 0; i < formatter.mLength; ++i) {
