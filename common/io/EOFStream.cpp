@@ -5,8 +5,8 @@
 
 namespace qel {
 
-// Made on first use in storage of its own and never destroyed: a class with a virtual base cannot be initialised at
-// compile time, and a plain static object could be asked for before its constructor or after its destructor has run.
+// Constructed on first use and never destroyed. A class with a virtual base cannot be initialised at compile time, and
+// a plain static object could be used before its constructor or after its destructor has run.
 EOFStream& EOFStream::get() noexcept
 {
     alignas(EOFStream) static unsigned char sStorage[sizeof(EOFStream)];

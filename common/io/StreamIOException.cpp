@@ -2,7 +2,7 @@
 
 namespace qel {
 
-// Out of line, so that there is one type information of this class in the whole program and catching by type works.
+// Out of line, so that the whole program shares one type information and catches by type work across libraries.
 StreamIOException::~StreamIOException() = default;
 
 } // namespace qel

@@ -16,7 +16,7 @@ std::uint16_t parsePort(const std::string& text)
     const bool digitsOnly = std::all_of(text.begin(), text.end(), [](char c) { return c >= '0' && c <= '9'; });
     if (!digitsOnly) throw std::invalid_argument("Invalid character in port");
 
-    constexpr unsigned long kLargestPort = 65535;
+    constexpr unsigned long kMaxPort = 65535;
     constexpr const char* kTooLarge = "Port value is too large";
     unsigned long port = 0;
     try {
@@ -24,7 +24,7 @@ std::uint16_t parsePort(const std::string& text)
     } catch (const std::out_of_range&) {
         throw std::out_of_range(kTooLarge);
     }
-    if (port > kLargestPort) throw std::out_of_range(kTooLarge);
+    if (port > kMaxPort) throw std::out_of_range(kTooLarge);
     return static_cast<std::uint16_t>(port);
 }
 
@@ -53,8 +53,8 @@ IPEndpoint::IPEndpoint(const std::string& text) : mPort(0)
     mAddress = parseHost(text.substr(0, delimiter));
 }
 
-// The bytes of a sockaddr_storage are those of the address of its family; they are copied out and in, because
-// reading them through a pointer of another type is undefined.
+// The address is copied out of and into the sockaddr_storage, because access through a pointer of another type is
+// undefined.
 IPEndpoint::IPEndpoint(const sockaddr_storage& address) : mPort(0)
 {
     switch (address.ss_family) {
@@ -96,7 +96,7 @@ sockaddr_storage IPEndpoint::getSockaddr() const noexcept
     return address;
 }
 
-// Composed without a stream: a program-wide locale may group the digits of numbers, and 127.0.0.1:8,080 is no endpoint.
+// Composed without a stream, whose locale may group digits: 127.0.0.1:8,080 is not an endpoint.
 std::string IPEndpoint::str() const
 {
     const std::string address = mAddress.str();

@@ -1,19 +1,14 @@
 #include <qel/common/net/IPv4Address.hpp>
 
+#include "net/AddressBytes.hpp"
+
 #include <arpa/inet.h>
-#include <cstring>
 
 namespace qel {
 
 IPv4Address IPv4Address::parse(const std::string& text)
 {
-    IPv4Address address;
-    // inet_pton stops at a NUL byte: whatever follows one would pass unseen.
-    const bool hasNul = text.find('\0') != std::string::npos;
-    if (hasNul || ::inet_pton(AF_INET, text.c_str(), address.mAddress.data()) != 1) {
-        throw std::invalid_argument("'" + text + "' is not a valid IPv4 address");
-    }
-    return address;
+    return IPv4Address(parseAddress<kNumBytes>(AF_INET, "IPv4", text));
 }
 
 std::string IPv4Address::str() const
@@ -35,17 +30,13 @@ unsigned IPv4Address::subnetPrefix() const
     unsigned prefix = 0;
     while (prefix < kBits && (mask & (0x80000000U >> prefix)) != 0)
         ++prefix;
-    // A shift by all 32 bits is undefined, and behind 32 leading ones there is nothing left to look at.
+    // A shift by all 32 bits is undefined; a mask of 32 ones has no bits left to check.
     if (prefix < kBits && (mask << prefix) != 0) {
         throw std::invalid_argument("IP address is not a subnet mask");
     }
     return prefix;
 }
 
-int IPv4Address::compare(const IPv4Address& other) const noexcept
-{
-    const int order = std::memcmp(mAddress.data(), other.mAddress.data(), kNumBytes);
-    return (order > 0) - (order < 0);
-}
+int IPv4Address::compare(const IPv4Address& other) const noexcept { return compareBytes(mAddress, other.mAddress); }
 
 } // namespace qel

@@ -1,6 +1,8 @@
 #include <qel/common/net/IPv6Address.hpp>
 #include <qel/common/net/MACAddress.hpp>
 
+#include "net/AddressBytes.hpp"
+
 #include <algorithm>
 #include <arpa/inet.h>
 #include <cstring>
@@ -9,13 +11,7 @@ namespace qel {
 
 IPv6Address IPv6Address::parse(const std::string& text)
 {
-    IPv6Address address;
-    // inet_pton stops at a NUL byte: whatever follows one would pass unseen.
-    const bool hasNul = text.find('\0') != std::string::npos;
-    if (hasNul || ::inet_pton(AF_INET6, text.c_str(), address.mAddress.data()) != 1) {
-        throw std::invalid_argument("'" + text + "' is not a valid IPv6 address");
-    }
-    return address;
+    return IPv6Address(parseAddress<kNumBytes>(AF_INET6, "IPv6", text));
 }
 
 std::string IPv6Address::str() const
@@ -81,10 +77,6 @@ IPv6Address& IPv6Address::operator|=(const IPv6Address& other) noexcept
     return *this;
 }
 
-int IPv6Address::compare(const IPv6Address& other) const noexcept
-{
-    const int order = std::memcmp(mAddress.data(), other.mAddress.data(), kNumBytes);
-    return (order > 0) - (order < 0);
-}
+int IPv6Address::compare(const IPv6Address& other) const noexcept { return compareBytes(mAddress, other.mAddress); }
 
 } // namespace qel

@@ -5,6 +5,7 @@
 
 #include "LogLine.hpp"
 #include "LoggedError.hpp"
+#include "util/Timeout.hpp"
 
 #include <algorithm>
 #include <cerrno>
@@ -15,19 +16,6 @@
 namespace qel {
 
 namespace {
-
-/// now + timeout, kept within what a PollDeadline can hold: a point before the epoch would mean no deadline at all, and
-/// one beyond the last would wrap around. A negative timeout is over at once, as is one of zero.
-PollDeadline::time_point deadlineAfter(PollDeadline::time_point now, std::chrono::milliseconds timeout)
-{
-    using time_point = PollDeadline::time_point;
-    using std::chrono::milliseconds;
-
-    constexpr milliseconds kLongest = std::chrono::duration_cast<milliseconds>(time_point::duration::max());
-    const time_point::duration wait = std::clamp(timeout, milliseconds(0), kLongest);
-    if (now > time_point::max() - wait) return time_point::max();
-    return std::max(now + wait, time_point());
-}
 
 const sockaddr* asSockaddr(const sockaddr_storage& address) { return reinterpret_cast<const sockaddr*>(&address); }
 
@@ -70,14 +58,16 @@ void Socket::connect(const IPEndpoint& endpoint, std::chrono::milliseconds timeo
     setFlags(flags);
 }
 
-/// Waits for the outcome of a connect that is on its way.
+/// Waits until a connect in progress has succeeded or failed.
 void Socket::pAwaitConnection(std::chrono::milliseconds timeout) const
 {
     const PollFd writable = getPollFd(PollEvents::Write);
     const PollSet set(writable);
-    const PollDeadline deadline(deadlineAfter(TimeProvider::steady(), timeout));
+    // Not before the epoch of the clock, where a PollDeadline would be disabled.
+    using time_point = PollDeadline::time_point;
+    const PollDeadline deadline(std::max(deadlineAfter(TimeProvider::steady(), timeout), time_point()));
 
-    // A signal gives an empty result, so the loop goes on with the time that is left.
+    // A signal gives an empty result; the loop then waits again for the time left.
     while (!set.wait(deadline.getTimeout(TimeProvider::steady())).contains(writable)) {
         if (deadline.isExpired(TimeProvider::steady())) throwLogged(ETIMEDOUT, "socket connect timed out");
     }
@@ -105,7 +95,7 @@ void Socket::listen(int backlog)
 Socket Socket::accept(int flags)
 {
     const int fd = ::accept4(mFd, nullptr, nullptr, flags | SOCK_CLOEXEC);
-    if (fd < 0) throw PosixError(PosixErrorCode(errno));
+    if (fd < 0) throw PosixError(errno);
     return Socket(fd);
 }
 

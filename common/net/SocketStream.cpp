@@ -40,7 +40,7 @@ SocketStream::SocketStream(Socket socket)
     mSocket.setSocketOption(IPPROTO_TCP, TCP_KEEPIDLE, kKeepAliveIdleSeconds);
     mSocket.setSocketOption(IPPROTO_TCP, TCP_KEEPINTVL, kKeepAliveIntervalSeconds);
     mSocket.setSocketOption(IPPROTO_TCP, TCP_USER_TIMEOUT, kUserTimeoutMilliseconds);
-    // An adopted socket may come with time-outs of its own.
+    // An adopted socket may have timeouts already.
     pSetTimeout(SO_RCVTIMEO, StreamDeadline::Infinite);
     pSetTimeout(SO_SNDTIMEO, StreamDeadline::Infinite);
 }
@@ -107,7 +107,7 @@ void SocketStream::pSendAll(const char* buffer, std::size_t length)
     }
 }
 
-/// Gives the kernel the time that a deadline leaves, unless it has it already.
+/// Sets the kernel timeout to the time that the deadline leaves, unless it has that value already.
 void SocketStream::pApplyDeadline(StreamDeadline& deadline, std::chrono::milliseconds& cachedTimeout, int optionName)
 {
     const std::chrono::milliseconds timeout = deadline.getEffectiveTimeout();
@@ -122,14 +122,13 @@ void SocketStream::pSetTimeout(int optionName, std::chrono::milliseconds timeout
     using std::chrono::milliseconds;
 
     constexpr microseconds::rep kMicrosecondsPerSecond = 1000000;
-    constexpr milliseconds kLongest = std::chrono::duration_cast<milliseconds>(microseconds::max());
+    constexpr milliseconds kMax = std::chrono::duration_cast<milliseconds>(microseconds::max());
 
-    // To the kernel a zero time-out means none at all: that is what no limit becomes, and a time-out of zero becomes
-    // the shortest there is.
+    // The kernel takes zero for "no timeout": so an infinite timeout becomes zero, and a zero timeout the shortest one.
     microseconds wait(0);
     if (timeout == milliseconds(0)) {
         wait = microseconds(1);
-    } else if (timeout > kLongest) {
+    } else if (timeout > kMax) {
         wait = microseconds::max();
     } else if (timeout > milliseconds(0)) {
         wait = timeout;

@@ -4,6 +4,7 @@
 
 #include "LogLine.hpp"
 #include "LoggedError.hpp"
+#include "util/Timeout.hpp"
 
 #include <cerrno>
 #include <ostream>
@@ -14,14 +15,9 @@ namespace qel {
 
 std::chrono::milliseconds PollDeadline::getTimeout(time_point now) const noexcept
 {
-    using std::chrono::duration_cast;
-    using std::chrono::milliseconds;
-
     if (isDisabled()) return PollSet::TIMEOUT_INFINITE;
-    if (isExpired(now)) return milliseconds(0);
-    // An enabled deadline is never before the epoch; only a "now" before it could make the difference too large.
-    const bool tooFar = now < time_point() && mDeadline > time_point::max() + now.time_since_epoch();
-    return duration_cast<milliseconds>(tooFar ? time_point::duration::max() : mDeadline - now);
+    if (isExpired(now)) return std::chrono::milliseconds(0);
+    return timeLeft(now, mDeadline);
 }
 
 int PollDeadline::compare(const PollDeadline& other) const noexcept
@@ -44,9 +40,8 @@ PollSet& PollSet::operator+=(const PollFd& fd)
 
 PollSet& PollSet::operator+=(const PollSet& other)
 {
-    // The other set may be this one: its length is taken first, and the room made so that no entry moves meanwhile.
-    const std::size_t count = other.mFds.size();
-    mFds.reserve(mFds.size() + count);
+    const std::size_t count = other.mFds.size(); // the other set may be this one, which grows
+    mFds.reserve(mFds.size() + count);           // so that push_back does not move the entry that it copies
     for (std::size_t i = 0; i < count; ++i)
         mFds.push_back(other.mFds[i]);
     return *this;
@@ -112,8 +107,7 @@ bool PollResult::anyReady() const noexcept
 
 PollInterrupt::PollInterrupt() : mEventFd(::eventfd(0, EFD_NONBLOCK | EFD_CLOEXEC))
 {
-    // Below -1, not below 0: running out of descriptors while an interrupt is made must not stop the program. It shows
-    // when the interrupt is used.
+    // Deliberately below -1: the -1 of a failed eventfd is kept, and interrupt() and eoi() report it.
     if (mEventFd < -1) throwLogged(errno, "Failed to open eventfd");
 }
 
@@ -121,7 +115,7 @@ PollInterrupt::~PollInterrupt() { ::close(mEventFd); }
 
 void PollInterrupt::interrupt()
 {
-    // EAGAIN: the counter is full, so the waiter is being woken already.
+    // EAGAIN: the counter is full, so an interrupt is pending already.
     if (::eventfd_write(mEventFd, 1) != 0 && errno != EAGAIN) throwLogged(errno, "eventfd write failed");
 }
 

@@ -8,13 +8,13 @@
 
 namespace qel {
 
-/// The stream that has already ended: what stands in where there is no peer.
+/// A stream that has already ended: a placeholder where there is no peer.
 ///
-/// There is one for the whole process. It has no state, so any number of threads may share it, and it is usable before
-/// main() begins and after it ends.
+/// Lifetime: there is one in the process. It is usable before main() begins and after it ends.
+/// Thread safety: any number of threads may use it; it has no state.
 class QEL_EXPORT EOFStream final : public Stream {
 public:
-    /// @return the one instance, always the same object; never destroyed
+    /// @return the instance, always the same object; never destroyed
     static EOFStream& get() noexcept;
 
     ~EOFStream() override;
@@ -22,16 +22,16 @@ public:
     /// Does nothing.
     void close() override;
 
-    /// Accepted and ignored: nothing here ever waits.
+    /// Does nothing: no operation of this stream waits.
     void setReadDeadline(std::chrono::milliseconds timeout) override;
 
-    /// @return 0: the end of the stream; `buffer` is not touched
+    /// @return 0: end of stream; `buffer` is not written to
     std::size_t read(char* buffer, std::size_t length) override;
 
-    /// Accepted and ignored: nothing here ever waits.
+    /// Does nothing: no operation of this stream waits.
     void setWriteDeadline(std::chrono::milliseconds timeout) override;
 
-    /// @throws StreamIOException  "EOF", always, also for no bytes at all
+    /// @throws StreamIOException  "EOF", always, even if `length` is 0
     void write(const char* buffer, std::size_t length) override;
 
 private:

@@ -12,40 +12,41 @@ namespace qel {
 
 /// Reads and writes whole frames over any byte stream.
 ///
-/// Frames stand on the stream back to back; the total length in a frame's own header is the only framing.
+/// Frames follow each other without a separator; the total length in the header of each is the only framing.
 ///
-/// Lifetime: borrows `stream` and `registry`; both must outlive this object.
-/// Thread safety: one reader thread and one writer thread at a time, as the stream below; takes no lock.
+/// Lifetime: borrows the stream and the registry, which must outlive this object.
+/// Thread safety: no locks; one reader thread and one writer thread at a time, as for the stream.
 class QEL_EXPORT QelMessageStream {
 public:
-    /// What is read first of each frame: enough to know how much more there is.
+    /// The part of each frame that is read first; it gives the length of the rest.
     struct MessageHeader {      // offsets from the first byte of the frame
-        char mReserved[4];      //  0  eyecatcher and header version, looked at only when the whole frame is checked
+        char mReserved[4];      //  0  eyecatcher and header version, checked with the whole frame
         be_uint32_t mMsgLength; //  4  bytes of the whole frame, this header included
     };
 
+    /// @param stream    carries the frames; borrowed
+    /// @param registry  builds the messages that are read; borrowed
     QelMessageStream(Stream& stream, QelMessageRegistry& registry) noexcept;
 
     /// Blocks until one frame has arrived and been checked.
     ///
-    /// Nothing is retried and no part of a frame is kept for the next call. A peer that closes the connection between
-    /// two frames and one that cuts a frame short both give "EOF"; a program that must tell them apart wraps its Stream
-    /// and counts the bytes.
+    /// Nothing is retried, and no part of a frame is kept for the next call. End of stream between two frames and
+    /// inside a frame both give "EOF"; a program that must tell them apart wraps its Stream and counts the bytes.
     /// @return the message, typed if the registry knows and accepts it, otherwise a plain QelMessage; never null
-    /// @throws StreamIOException  the stream failed, ended ("EOF"), or its read deadline passed: "I/O deadline" when it
-    ///         had passed before a call of the stream began, else what the stream says of it (see SocketStream)
-    /// @throws QelMessageValidationException  "Invalid length": the frame says it has less than 9 or more than
-    ///         QelMessage::MtuMax (16384) bytes; only its first 8 bytes were read, so the stream is out of step with
-    ///         the frames and the connection is to be dropped. Any other text is the registry's: the frame was read
-    ///         whole and is malformed
+    /// @throws StreamIOException  the stream failed, ended ("EOF"), or its read deadline passed: "I/O deadline" if it
+    ///         passed before a read began, else the text of the stream (see SocketStream)
+    /// @throws QelMessageValidationException  "Invalid length": the length field is below 9 or above
+    ///         QelMessage::MtuMax (16384); only the first 8 bytes of the frame were read, so drop the connection, which
+    ///         is out of step with the frames. Any other text is the registry's: the frame was read completely and is
+    ///         malformed
     std::unique_ptr<QelMessage> read();
 
-    /// Sends the frame of `message` as it stands, with one OutputStream::write() of msgLength() bytes.
+    /// Sends the frame of `message` unchanged, with one OutputStream::write() of msgLength() bytes.
     ///
-    /// The length is not limited here: a frame of more than QelMessage::MtuMax bytes goes out and is refused by the
-    /// stream that receives it.
-    /// @throws StreamIOException  the stream failed, or its write deadline passed; part of the frame may have gone out
-    ///         then, so that the connection is of no further use
+    /// The length is not checked: a frame of more than QelMessage::MtuMax bytes is sent, and the receiving stream
+    /// refuses it.
+    /// @throws StreamIOException  the stream failed, or its write deadline passed; part of the frame may have been
+    ///         sent, so drop the connection
     void write(const QelMessage& message);
 
 private:

@@ -7,19 +7,18 @@
 
 namespace qel {
 
-/// What both directions of a byte stream share: it can be closed and destroyed.
+/// The common base of both directions of a byte stream: it can be closed and destroyed.
 ///
-/// A Stream has exactly one StreamBase, inherited virtually; going from a StreamBase back to the stream takes a
-/// dynamic_cast. Streams have an identity and are not copied.
+/// A Stream has one StreamBase, inherited virtually; use dynamic_cast to get from a StreamBase to the stream. Streams
+/// are not copied.
 ///
-/// Thread safety of every stream, unless a class says otherwise: no locks; one reader thread and one writer thread at a
-/// time, each with its own deadline.
+/// Thread safety of every stream, unless its class says otherwise: no locks; one reader thread and one writer thread at
+/// a time, each with a deadline of its own.
 class QEL_EXPORT StreamBase {
 public:
     virtual ~StreamBase();
 
-    /// Ends both directions. What a later call does, and what close() itself may throw, is the concrete stream's to
-    /// say.
+    /// Ends both directions. The concrete stream documents what later calls do and what close() throws.
     virtual void close() = 0;
 
     StreamBase(const StreamBase&) = delete;
@@ -29,35 +28,34 @@ protected:
     StreamBase() noexcept = default;
 };
 
-/// The side of a stream that bytes come from.
+/// The reading side of a byte stream.
+/// Thread safety: one reader thread at a time; see StreamBase.
 class QEL_EXPORT InputStream : public virtual StreamBase {
 public:
     ~InputStream() override;
 
-    /// Limits the time that reading may take.
+    /// Limits the time of all following reads together.
     ///
-    /// The time starts to run at the first read after this call, not at this call, and covers all reads that follow
-    /// until it is set anew or cleared (see StreamDeadline). Zero polls: the next read does not wait.
-    /// @param timeout  relative, in milliseconds; negative (StreamDeadline::Infinite) waits without limit
-    /// @throws std::invalid_argument  "Not supported": this stream has no deadlines, which is what the base class says
+    /// The time starts at the first read after this call, not at this call, and runs until a timeout is set again or
+    /// cleared (see StreamDeadline). Zero polls: the next read does not wait.
+    /// @param timeout  negative (StreamDeadline::Infinite): no limit
+    /// @throws std::invalid_argument  "Not supported": this stream has no deadlines, as in this base class
     virtual void setReadDeadline(std::chrono::milliseconds timeout);
 
-    /// Reads what is there, at least one byte, waiting for it if need be.
-    /// @param buffer  takes at most `length` bytes; borrowed for the call
-    /// @param length  the room in `buffer`, in bytes
-    /// @return the number of bytes read, 1 to `length`; 0 is the end of the stream
+    /// Waits until at least one byte has arrived, and reads what has.
+    /// @param buffer  room for `length` bytes; borrowed for the call
+    /// @return the number of bytes read, in [1, length]; 0 at end of stream
     /// @throws StreamIOException  the stream failed, or the read deadline passed
     virtual std::size_t read(char* buffer, std::size_t length) = 0;
 
-    /// Reads exactly `length` bytes, by as many calls of read() as it takes.
+    /// Reads exactly `length` bytes, with as many calls of read() as necessary; none for a `length` of 0.
     ///
-    /// After an exception the first bytes may have arrived in `buffer` and are gone from the stream. No read() at all
-    /// is made for a `length` of 0.
-    /// @param buffer  has room for `length` bytes; borrowed for the call
-    /// @throws StreamIOException  "EOF": the stream ended first; and whatever read() throws
+    /// After an exception `buffer` may hold the first bytes, which the stream does not deliver again.
+    /// @param buffer  room for `length` bytes; borrowed for the call
+    /// @throws StreamIOException  "EOF": the stream ended first; and what read() throws
     virtual void fill(char* buffer, std::size_t length);
 
-    /// Lets reads wait without limit again: setReadDeadline(StreamDeadline::Infinite).
+    /// Removes the limit: setReadDeadline(StreamDeadline::Infinite).
     /// @throws std::invalid_argument  as setReadDeadline()
     void clearReadDeadline();
 
@@ -65,22 +63,23 @@ protected:
     InputStream() noexcept = default;
 };
 
-/// The side of a stream that bytes go to.
+/// The writing side of a byte stream.
+/// Thread safety: one writer thread at a time; see StreamBase.
 class QEL_EXPORT OutputStream : public virtual StreamBase {
 public:
     ~OutputStream() override;
 
-    /// Limits the time that writing may take; the rules are those of InputStream::setReadDeadline().
-    /// @param timeout  relative, in milliseconds; negative (StreamDeadline::Infinite) waits without limit
-    /// @throws std::invalid_argument  "Not supported": this stream has no deadlines, which is what the base class says
+    /// Limits the time of all following writes together, by the rules of InputStream::setReadDeadline().
+    /// @param timeout  negative (StreamDeadline::Infinite): no limit
+    /// @throws std::invalid_argument  "Not supported": this stream has no deadlines, as in this base class
     virtual void setWriteDeadline(std::chrono::milliseconds timeout);
 
-    /// Writes all of `length` bytes, or throws; after an exception nobody can say how many of them went out.
-    /// @param buffer  borrowed for the call
-    /// @throws StreamIOException  the stream failed, takes no more bytes ("EOF"), or the write deadline passed
+    /// Writes all bytes. After an exception it is unknown how many of them were sent.
+    /// @param buffer  `length` bytes; borrowed for the call
+    /// @throws StreamIOException  the stream failed, accepts no more bytes ("EOF"), or the write deadline passed
     virtual void write(const char* buffer, std::size_t length) = 0;
 
-    /// Lets writes wait without limit again: setWriteDeadline(StreamDeadline::Infinite).
+    /// Removes the limit: setWriteDeadline(StreamDeadline::Infinite).
     /// @throws std::invalid_argument  as setWriteDeadline()
     void clearWriteDeadline();
 
@@ -89,6 +88,7 @@ protected:
 };
 
 /// A byte stream in both directions.
+/// Thread safety: see StreamBase.
 class QEL_EXPORT Stream : public InputStream, public OutputStream {
 public:
     ~Stream() override;

@@ -6,11 +6,12 @@
 
 namespace qel {
 
-/// A stream could not do what it was asked to.
+/// An operation of a stream failed.
 ///
-/// The texts of the stream layer itself are "EOF" (the stream ended before everything had arrived, or nothing can be
-/// written to it any more) and "I/O deadline" (the deadline had passed before the call began). Concrete streams add
-/// their own; where a system call failed, the PosixError is nested inside (std::rethrow_if_nested brings it out).
+/// The texts of the stream layer are "EOF" (the stream ended too early, or accepts no more bytes) and "I/O deadline"
+/// (the deadline had passed before the call began). Concrete streams add their own; if a system call failed, its
+/// PosixError is nested (std::rethrow_if_nested).
+/// Thread safety: that of std::runtime_error.
 class QEL_EXPORT StreamIOException : public std::runtime_error {
 public:
     using std::runtime_error::runtime_error;

@@ -4,6 +4,7 @@
 #include <qel/common/net/IPFamily.hpp>
 #include <qel/common/net/IPv4Address.hpp>
 #include <qel/common/net/IPv6Address.hpp>
+#include <qel/common/util/Comparable.hpp>
 
 #include <cstddef>
 #include <iosfwd>
@@ -11,16 +12,16 @@
 
 namespace qel {
 
-/// An IP address of either family.
+/// An IP address of either family. Compares by family first (IPv4 before IPv6), then by address.
 /// Thread safety: a plain value.
-class QEL_EXPORT IPAddress {
+class QEL_EXPORT IPAddress : public Comparable<IPAddress> {
 public:
     /// 0.0.0.0
     IPAddress() noexcept;
 
-    /// @param family  says how many of the bytes are taken: the first 4 or the first 16
-    /// @param bytes   the address in network order, copied; may be at any memory address
-    /// @param length  the bytes there are, at least as many as are taken
+    /// @param family  decides how many bytes are read: 4 or 16
+    /// @param bytes   the address in network order; copied, of any alignment
+    /// @param length  the size of bytes: at least as many as are read
     /// @throws std::invalid_argument  "family": neither IPv4 nor IPv6; "length": too few bytes; "bytes": a null pointer
     IPAddress(IPFamily family, const void* bytes, unsigned length);
 
@@ -29,9 +30,11 @@ public:
 
     IPFamily getFamily() const noexcept { return mFamily; }
 
-    /// @return the address; the reference lives as long as this object and its family stays the same
+    /// @return the address, owned by this object; the reference is valid until an address of the other family is
+    ///         assigned
     /// @throws std::invalid_argument  "family": the address is of the other family
     const IPv4Address& getIPv4() const;
+    /// The same for IPv6.
     const IPv6Address& getIPv6() const;
 
     /// @return size() bytes in network order, owned by this object
@@ -39,19 +42,11 @@ public:
     /// @return 4 or 16
     std::size_t size() const noexcept;
 
-    /// @return the text form of the address of its family; no brackets
+    /// @return the text form of the address, without brackets
     std::string str() const;
 
-    /// Compares by family first (IPv4 before IPv6), then by the bytes.
-    /// @return -1, 0 or 1: this address is before, equal to or behind the other
+    /// @return -1, 0 or 1: this address is less than, equal to or greater than the other
     int compare(const IPAddress& other) const noexcept;
-
-    friend bool operator==(const IPAddress& a, const IPAddress& b) noexcept { return a.compare(b) == 0; }
-    friend bool operator!=(const IPAddress& a, const IPAddress& b) noexcept { return a.compare(b) != 0; }
-    friend bool operator<(const IPAddress& a, const IPAddress& b) noexcept { return a.compare(b) < 0; }
-    friend bool operator>(const IPAddress& a, const IPAddress& b) noexcept { return a.compare(b) > 0; }
-    friend bool operator<=(const IPAddress& a, const IPAddress& b) noexcept { return a.compare(b) <= 0; }
-    friend bool operator>=(const IPAddress& a, const IPAddress& b) noexcept { return a.compare(b) >= 0; }
 
 private:
     union IPAddressUnion {

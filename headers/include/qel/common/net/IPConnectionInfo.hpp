@@ -7,15 +7,17 @@
 
 namespace qel {
 
-/// The two ends of one connection.
+/// The two endpoints of a connection.
 /// Thread safety: a plain value.
 class QEL_EXPORT IPConnectionInfo {
 public:
-    /// @param client  the end that connected
-    /// @param server  the end that accepted
+    /// @param client  of the side that connected
+    /// @param server  of the side that accepted
     IPConnectionInfo(const IPEndpoint& client, const IPEndpoint& server) noexcept;
 
+    /// @return the endpoint, owned by this object
     const IPEndpoint& getClient() const noexcept { return mClient; }
+    /// @return the endpoint, owned by this object
     const IPEndpoint& getServer() const noexcept { return mServer; }
 
 private:
@@ -23,7 +25,7 @@ private:
     IPEndpoint mServer;
 };
 
-/// Prints both ends, as in [10.0.0.2:40000 -> 10.0.0.1:80].
+/// Prints both endpoints, as in [10.0.0.2:40000 -> 10.0.0.1:80].
 QEL_EXPORT std::ostream& operator<<(std::ostream& os, const IPConnectionInfo& connection);
 
 } // namespace qel

@@ -18,26 +18,27 @@ public:
     /// 0.0.0.0:0
     IPEndpoint() noexcept;
 
-    /// @param port  in the byte order of this machine
+    /// @param port  in host byte order
     IPEndpoint(const IPAddress& address, std::uint16_t port) noexcept;
 
-    /// Reads the text form. The port is judged before the host; leading zeros of the port are allowed.
+    /// Reads the text form. The port is checked before the host and may have leading zeros.
     /// @throws std::invalid_argument  "No port delimiter": there is no ':'
-    /// @throws std::invalid_argument  "Invalid character in port": something other than a digit behind the last ':'
-    /// @throws std::invalid_argument  nothing behind the last ':' (the text is that of std::stoul)
+    /// @throws std::invalid_argument  "Invalid character in port": a character other than a digit after the last ':'
+    /// @throws std::invalid_argument  the text of std::stoul: nothing follows the last ':'
     /// @throws std::out_of_range      "Port value is too large": 65536 or more
     /// @throws std::invalid_argument  "IPv6 address is not contained in brackets": the host is neither an IPv4 address
     ///                                nor in brackets
-    /// @throws std::invalid_argument  "'HOST' is not a valid IPv6 address": what is in the brackets is none
+    /// @throws std::invalid_argument  "'HOST' is not a valid IPv6 address": the text in the brackets is malformed
     explicit IPEndpoint(const std::string& text);
 
-    /// @param address  an AF_INET or AF_INET6 socket address (ip(7), ipv6(7)); the flow and the scope are not kept
+    /// @param address  an AF_INET or AF_INET6 socket address (ip(7), ipv6(7)); its flow and scope are dropped
     /// @throws std::invalid_argument  "Not an IP address family": another family
     explicit IPEndpoint(const sockaddr_storage& address);
 
+    /// @return the address, owned by this object
     const IPAddress& getAddress() const noexcept { return mAddress; }
     IPFamily getFamily() const noexcept { return mAddress.getFamily(); }
-    /// @return the port in the byte order of this machine
+    /// @return the port in host byte order
     std::uint16_t getPort() const noexcept { return mPort; }
 
     /// @return the socket address for bind(2) and connect(2); everything but family, address and port is zero
@@ -51,7 +52,7 @@ public:
         return a.mAddress == b.mAddress && a.mPort == b.mPort;
     }
     friend bool operator!=(const IPEndpoint& a, const IPEndpoint& b) noexcept { return !(a == b); }
-    /// By address, then by port.
+    /// Orders by address, then by port.
     friend bool operator<(const IPEndpoint& a, const IPEndpoint& b) noexcept
     {
         const int order = a.mAddress.compare(b.mAddress);
@@ -60,10 +61,10 @@ public:
 
 private:
     IPAddress mAddress;
-    std::uint16_t mPort; // in the byte order of this machine
+    std::uint16_t mPort; // in host byte order
 };
 
-/// Prints the text form, the port always in decimal.
+/// Prints the text form, with the port in decimal.
 QEL_EXPORT std::ostream& operator<<(std::ostream& os, const IPEndpoint& endpoint);
 
 } // namespace qel

@@ -2,6 +2,7 @@
 
 #include <qel/common/QelExport.hpp>
 #include <qel/common/net/IPFamily.hpp>
+#include <qel/common/util/Comparable.hpp>
 
 #include <array>
 #include <cstddef>
@@ -12,9 +13,9 @@
 
 namespace qel {
 
-/// An IPv4 address: four bytes in network order, so that the order of the bytes is the order of the numbers.
+/// An IPv4 address: four bytes in network order. Addresses compare in numeric order.
 /// Thread safety: a plain value.
-class QEL_EXPORT IPv4Address {
+class QEL_EXPORT IPv4Address : public Comparable<IPv4Address> {
 public:
     /// 0.0.0.0
     static const IPv4Address ZERO;
@@ -38,25 +39,26 @@ public:
     /// @param bytes  all four bytes in network order
     explicit constexpr IPv4Address(const std::array<unsigned char, kNumBytes>& bytes) noexcept : mAddress(bytes) {}
 
-    /// @param hostOrder  the address as a number of this machine: 0x7F000001 is 127.0.0.1.
+    /// @param hostOrder  the address as an integer in host byte order: 0x7F000001 is 127.0.0.1.
     ///                   Mind the brackets: IPv4Address(1u) is 0.0.0.1, IPv4Address{1} is the byte list 1.0.0.0.
     explicit constexpr IPv4Address(std::uint32_t hostOrder) noexcept
         : mAddress{static_cast<unsigned char>(hostOrder >> 24), static_cast<unsigned char>(hostOrder >> 16),
                    static_cast<unsigned char>(hostOrder >> 8), static_cast<unsigned char>(hostOrder)}
     {}
 
-    /// Reads the dotted form of inet_pton(3): four decimal numbers, no leading zeros, no blanks, nothing behind them.
+    /// Reads the dotted form of inet_pton(3): four decimal numbers without leading zeros, and no other
+    /// characters.
     /// @throws std::invalid_argument  "'TEXT' is not a valid IPv4 address"
     static IPv4Address parse(const std::string& text);
 
     /// @return the dotted form, as in "10.0.0.1"
     std::string str() const;
 
-    /// The four bytes in network order.
+    /// @return the four bytes in network order, owned by this object
     const std::array<unsigned char, kNumBytes>& bytes() const noexcept { return mAddress; }
     explicit operator std::array<unsigned char, kNumBytes>() const noexcept { return mAddress; }
 
-    /// @return the address as a number of this machine: 127.0.0.1 is 0x7F000001
+    /// @return the address as an integer in host byte order: 0x7F000001 for 127.0.0.1
     std::uint32_t toUint32() const noexcept;
 
     /// Takes the address as a netmask.
@@ -64,15 +66,8 @@ public:
     /// @throws std::invalid_argument  "IP address is not a subnet mask": a 1 bit follows a 0 bit
     unsigned subnetPrefix() const;
 
-    /// Compares the bytes from the first on. @return -1, 0 or 1: this address is before, equal to or behind the other
+    /// @return -1, 0 or 1: this address is less than, equal to or greater than the other
     int compare(const IPv4Address& other) const noexcept;
-
-    friend bool operator==(const IPv4Address& a, const IPv4Address& b) noexcept { return a.compare(b) == 0; }
-    friend bool operator!=(const IPv4Address& a, const IPv4Address& b) noexcept { return a.compare(b) != 0; }
-    friend bool operator<(const IPv4Address& a, const IPv4Address& b) noexcept { return a.compare(b) < 0; }
-    friend bool operator>(const IPv4Address& a, const IPv4Address& b) noexcept { return a.compare(b) > 0; }
-    friend bool operator<=(const IPv4Address& a, const IPv4Address& b) noexcept { return a.compare(b) <= 0; }
-    friend bool operator>=(const IPv4Address& a, const IPv4Address& b) noexcept { return a.compare(b) >= 0; }
 
 private:
     std::array<unsigned char, kNumBytes> mAddress;

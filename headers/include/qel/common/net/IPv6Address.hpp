@@ -2,6 +2,7 @@
 
 #include <qel/common/QelExport.hpp>
 #include <qel/common/net/IPFamily.hpp>
+#include <qel/common/util/Comparable.hpp>
 
 #include <array>
 #include <cstddef>
@@ -13,12 +14,12 @@ namespace qel {
 
 class MACAddress;
 
-/// An IPv6 address: sixteen bytes in network order, so that the order of the bytes is the order of the numbers.
+/// An IPv6 address: sixteen bytes in network order. Addresses compare in numeric order.
 /// It has no scope (the "%eth0" of a text form): a link-local address can be built, compared and printed, but the
-/// system cannot connect to one without its scope. A program that must do so connects a descriptor itself and hands
-/// it to Socket(int).
+/// system cannot connect to it without its scope. To connect to one, connect a descriptor of your own and pass it to
+/// Socket(int).
 /// Thread safety: a plain value.
-class QEL_EXPORT IPv6Address {
+class QEL_EXPORT IPv6Address : public Comparable<IPv6Address> {
 public:
     /// ::
     static const IPv6Address ZERO;
@@ -53,11 +54,11 @@ public:
     /// @return the shortest text form, as inet_ntop(3) writes it
     std::string str() const;
 
-    /// The interface address that a network card with this MAC address gives itself: the first eight bytes of the
-    /// prefix, then the modified EUI-64 identifier (RFC 4291, appendix A): the MAC address with its universal/local
-    /// bit inverted and FF FE in the middle.
+    /// @return the interface address that a network card with this MAC address gives itself: the first eight bytes of
+    ///         the prefix, then the modified EUI-64 identifier (RFC 4291, appendix A), which is the MAC address with
+    ///         its universal/local bit inverted and FF FE in the middle
     static IPv6Address eui64(const IPv6Address& prefix, const MACAddress& mac);
-    /// eui64() with LINK_LOCAL_PREFIX.
+    /// @return eui64(LINK_LOCAL_PREFIX, mac)
     static IPv6Address linkLocal(const MACAddress& mac);
 
     /// @return true for fe80::/10: the first ten bits are those of LINK_LOCAL_PREFIX
@@ -65,7 +66,7 @@ public:
     /// @return true for ::ffff:0:0/96: the first twelve bytes are those of IPV4_MAPPED_PREFIX
     bool isIPv4Mapped() const noexcept;
 
-    /// The sixteen bytes in network order.
+    /// @return the sixteen bytes in network order, owned by this object
     const std::array<unsigned char, kNumBytes>& bytes() const noexcept { return mAddress; }
     explicit operator std::array<unsigned char, kNumBytes>() const noexcept { return mAddress; }
 
@@ -76,15 +77,8 @@ public:
     IPv6Address& operator&=(const IPv6Address& other) noexcept;
     IPv6Address& operator|=(const IPv6Address& other) noexcept;
 
-    /// Compares the bytes from the first on. @return -1, 0 or 1: this address is before, equal to or behind the other
+    /// @return -1, 0 or 1: this address is less than, equal to or greater than the other
     int compare(const IPv6Address& other) const noexcept;
-
-    friend bool operator==(const IPv6Address& a, const IPv6Address& b) noexcept { return a.compare(b) == 0; }
-    friend bool operator!=(const IPv6Address& a, const IPv6Address& b) noexcept { return a.compare(b) != 0; }
-    friend bool operator<(const IPv6Address& a, const IPv6Address& b) noexcept { return a.compare(b) < 0; }
-    friend bool operator>(const IPv6Address& a, const IPv6Address& b) noexcept { return a.compare(b) > 0; }
-    friend bool operator<=(const IPv6Address& a, const IPv6Address& b) noexcept { return a.compare(b) <= 0; }
-    friend bool operator>=(const IPv6Address& a, const IPv6Address& b) noexcept { return a.compare(b) >= 0; }
 
 private:
     std::array<unsigned char, kNumBytes> mAddress;

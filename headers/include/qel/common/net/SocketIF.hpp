@@ -8,25 +8,27 @@
 
 namespace qel {
 
-/// What a stream needs of a socket: readiness, shutting down, and the two transfers with the results of the system.
-/// Thread safety: one reader and one writer at a time.
+/// The operations of a socket that a stream uses. Socket implements them; a substitute may stand in for it.
+/// Implementations report errors as read(2) and send(2) do and throw nothing.
+/// Thread safety: one reader and one writer at a time; shutdown() may be called from any thread while they wait.
 class QEL_EXPORT SocketIF {
 public:
     virtual ~SocketIF();
 
-    /// @return the entry for a PollSet; borrows the descriptor of this object
+    /// @return the entry for a PollSet; it borrows the descriptor and must not be used after this object is destroyed
     virtual PollFd getPollFd(PollEvents events) const = 0;
 
-    /// Ends both directions of the connection: a blocked read returns 0, a later write fails. The descriptor stays
-    /// open. Never fails.
+    /// Ends both directions of the connection: a blocked read returns 0, and later writes fail. The descriptor stays
+    /// open. An error of the system, such as that of a socket without a connection, is ignored.
     virtual void shutdown() = 0;
 
-    /// @param buffer  takes up to length bytes
-    /// @return the bytes read, at least 1; 0 at the end of the stream (or for length 0); negative with errno set
+    /// @param buffer  room for length bytes; borrowed for the call
+    /// @return the number of bytes read; 0 at end of stream and for length 0; negative on an error, with errno set
     virtual ssize_t read(char* buffer, std::size_t length) = 0;
 
+    /// Raises no SIGPIPE: writing to a connection that the peer has closed fails with EPIPE.
     /// @param buffer  length bytes; borrowed for the call
-    /// @return the bytes written, which may be fewer than length; negative with errno set. Never raises SIGPIPE.
+    /// @return the number of bytes written, which may be fewer than length; negative on an error, with errno set
     virtual ssize_t write(const char* buffer, std::size_t length) = 0;
 
 protected:
