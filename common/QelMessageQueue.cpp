@@ -3,27 +3,26 @@
 #include <qel/common/util/TimeProvider.hpp>
 
 #include "LogLine.hpp"
+#include "util/Timeout.hpp"
 
 #include <stdexcept>
 #include <utility>
 
-// How threads are woken. Each call decides under the lock whom it has to wake, releases the lock, and wakes them then:
-// a thread that is woken while the lock is held has to go back to sleep at once to wait for it, which doubles the time
-// of a hand-over (measured). Deciding under the lock loses nobody, because a thread counts itself among the waiting
-// before it releases the lock. The thread that is woken may destroy the queue before the one that woke it is done with
-// it; mWakings holds the destructor back for that long.
+// How threads are woken. Each call decides with the lock held which threads to wake, releases the lock, and then wakes
+// them: a thread that is woken while the lock is held goes back to sleep at once to wait for it, which doubles the time
+// of a hand-over (measured). No wake-up is lost, because a thread counts itself as waiting before it releases the lock.
 //
-// How threads wait: asleep, from the first moment. To yield the core once before would make a hand-over between two
-// threads that have a core to themselves nearly twice as fast, and one between threads that share it with others
-// hundreds of times slower (measured: milliseconds), because the scheduler prefers a thread that wakes to one that has
-// yielded.
+// How threads wait: they sleep at once. Yielding the core first makes a hand-over nearly twice as fast between two
+// threads that have a core to themselves, and hundreds of times slower between threads that share it with others
+// (measured: milliseconds), because the scheduler prefers a thread that wakes to one that has yielded.
 
 namespace qel {
 
 namespace {
 
-/// Longer waits are without end. Far below the range of the clocks, to which the wait's deadline has to be added.
-constexpr std::chrono::hours kForEver{24 * 365 * 100};
+/// A longer wait has no limit. Some condition variables convert the deadline to another clock, so it stays far from the
+/// end of the clock's range.
+constexpr std::chrono::hours kMaxWait{24 * 365 * 100};
 
 } // namespace
 
@@ -31,17 +30,11 @@ QelMessageQueue::QelMessageQueue(std::size_t sizeLimit)
     : mNormalPriorityLimiter(sizeLimit), mLowPriorityLimiter(pGetLowPrioritySize(sizeLimit))
 {}
 
-QelMessageQueue::~QelMessageQueue()
-{
-    {
-        const MutexLock lock(mLock); // lets go of it whoever holds it yet: a shutdown() whose flag this thread has seen
-    }
-    mWakings.wait();
-}
+QelMessageQueue::~QelMessageQueue() = default;
 
 std::uint64_t QelMessageQueue::pGetLowPrioritySize(std::size_t size) noexcept
 {
-    return size / 2 + size % 2; // (size + 1) / 2 would be 0, no limit at all, for the largest size
+    return size / 2 + size % 2; // (size + 1) / 2 is 0, which means no limit, for the largest size
 }
 
 QelMessageQueue::RateLimiter& QelMessageQueue::pGetRateLimiter(MessageQueuingOptions options) noexcept
@@ -70,16 +63,14 @@ QelMessageQueue::ReturnCode QelMessageQueue::enqueue(std::unique_ptr<QelMessage>
     try {
         result = pEnqueueLocked(lock, limiter, message, blocking, startTime);
     } catch (...) {
-        // This thread may have been woken to fill room that is still there.
+        // This thread may have been woken for room that another one can use.
         if (limiter.claimOne(mStats.getPending().mBytes)) limiter.notifyOne();
         throw;
     }
-    if (result != OK || !mDequeueWaiter.claimOne()) return result;
-
-    mWakings.enter();
-    lock.unlock();
-    pWakeConsumer();
-    mWakings.leave();
+    if (result == OK && mDequeueWaiter.claimOne()) {
+        lock.unlock();
+        pWakeConsumer();
+    }
     return result;
 }
 
@@ -97,7 +88,7 @@ QelMessageQueue::ReturnCode QelMessageQueue::pEnqueueLocked(UniqueMutexLock& loc
         limiter.wait(lock);
     }
 
-    // Memory first, and the clocks before any figure: if one of them fails, nothing has changed.
+    // What can fail comes first: if the clock or the allocation throws, nothing has changed.
     const auto now = TimeProvider::steady();
     QueueEntry& entry = mQueue.emplace();
     try {
@@ -121,7 +112,7 @@ std::unique_ptr<QelMessage> QelMessageQueue::waitForMsg(const std::chrono::milli
     try {
         message = pDequeueLocked();
     } catch (...) {
-        // This thread may have been woken for the message that is still there.
+        // This thread may have been woken for the message, which another one can take.
         if (mDequeueWaiter.claimOne()) pWakeConsumer();
         throw;
     }
@@ -129,27 +120,26 @@ std::unique_ptr<QelMessage> QelMessageQueue::waitForMsg(const std::chrono::milli
     const std::uint64_t pendingBytes = mStats.getPending().mBytes;
     const bool wakeNormal = mNormalPriorityLimiter.claimOne(pendingBytes);
     const bool wakeLow = mLowPriorityLimiter.claimOne(pendingBytes);
-    if (!wakeNormal && !wakeLow) return message;
-    mWakings.enter();
-    lock.unlock();
-    pWakeProducers(wakeNormal, wakeLow);
-    mWakings.leave();
+    if (wakeNormal || wakeLow) {
+        lock.unlock();
+        pWakeProducers(wakeNormal, wakeLow);
+    }
     return message;
 }
 
 void QelMessageQueue::pWaitForMsgLocked(UniqueMutexLock& lock, const std::chrono::milliseconds& timeout)
 {
     if (pHasEndedWaitLocked() || timeout <= std::chrono::milliseconds::zero()) return;
-    if (timeout > kForEver) {
+    if (timeout > kMaxWait) {
         while (!pHasEndedWaitLocked())
             mDequeueWaiter.wait(lock);
         return;
     }
-    // The one clock here that is not read through TimeProvider: the thread sleeps in real time, so its deadline must be
-    // of real time as well. By a substitute that stands still, or runs elsewhere, it would wake at once or never.
-    const auto deadline = std::chrono::steady_clock::now() + timeout;
+    // Not read through TimeProvider: the thread sleeps in real time, and a substituted clock would wake it at once or
+    // never.
+    const auto deadline = deadlineAfter(std::chrono::steady_clock::now(), timeout);
     while (!pHasEndedWaitLocked()) {
-        if (!mDequeueWaiter.waitUntil(lock, deadline)) return; // a message may have come at the last moment
+        if (!mDequeueWaiter.waitUntil(lock, deadline)) return; // the caller checks for a message once more
     }
 }
 
@@ -169,10 +159,8 @@ void QelMessageQueue::shutdown()
     mShutdown = true;
     logLine(LogLevel::Debug, "MQ: Shutdown!");
 
-    mWakings.enter();
     lock.unlock();
-    pWakeEverybody();
-    mWakings.leave();
+    pWakeAll();
 }
 
 void QelMessageQueue::dumpStatistics(std::ostream& os, const Indent& indent) const

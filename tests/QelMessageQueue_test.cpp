@@ -1,85 +1,51 @@
-// The queue as one thread sees it. What goes on between threads: QelMessageQueueThreads_test.cpp, and every order in
-// which it can go on: QelMessageQueueModel_test.cpp.
+// The queue in one thread. Between threads: QelMessageQueueThreads_test.cpp; in every order of its threads:
+// QelMessageQueueModel_test.cpp.
 
 #include <qel/common/QelMessageQueue.hpp>
-#include <qel/common/StreamFormatters.hpp>
-#include <qel/common/util/TimeProvider.hpp>
 
-#include "support/Allocations.hpp"
+#include "QueueKit.hpp"
 #include "support/CapturedLog.hpp"
 #include "support/CountedMessage.hpp"
 #include "support/SettableClock.hpp"
 #include "support/SizedMessage.hpp"
-#include "support/ThrowingClock.hpp"
 
 #include <chrono>
-#include <cstdint>
+#include <cstddef>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <limits>
 #include <memory>
-#include <new>
-#include <ostream>
-#include <sstream>
 #include <stdexcept>
-#include <streambuf>
 #include <string>
 #include <type_traits>
 #include <utility>
-#include <vector>
 
 namespace qel {
 namespace {
 
 using namespace std::chrono_literals;
 using std::chrono::milliseconds;
-using test::Allocations;
 using test::CapturedLog;
 using test::CountedMessage;
+using test::dumpOf;
+using test::figure;
+using test::kBestEffort;
+using test::kBlocking;
+using test::kDefault;
+using test::kLow;
 using test::MessageCensus;
 using test::SettableClock;
 using test::sized;
-using test::ThrowingClock;
+using test::take;
 using testing::ElementsAre;
-using testing::HasSubstr;
 using testing::IsEmpty;
 using testing::StartsWith;
 using testing::StrEq;
 using testing::ThrowsMessage;
 
-constexpr MessageQueuingOptions kDefault = MessageQueuingOptions::DEFAULT;
-constexpr MessageQueuingOptions kBlocking = MessageQueuingOptions::BLOCKING;
-constexpr MessageQueuingOptions kLow = MessageQueuingOptions::LOW_PRIORITY;
-constexpr MessageQueuingOptions kBestEffort = MessageQueuingOptions::BEST_EFFORT;
+// The interface.
 
-std::string dumpOf(const QelMessageQueue& queue, const Indent& indent = Indent(0, ' '))
-{
-    std::ostringstream os;
-    queue.dumpStatistics(os, indent);
-    return os.str();
-}
-
-/// The dump's line that begins with the label, without it: "1 (32 B)" for "Pending".
-std::string figure(const QelMessageQueue& queue, const std::string& label)
-{
-    std::istringstream lines(dumpOf(queue));
-    for (std::string line; std::getline(lines, line);) {
-        if (line.compare(0, label.size(), label) != 0) continue;
-        return line.substr(line.find_first_not_of(' ', line.find(':') + 1));
-    }
-    return "no line " + label;
-}
-
-/// The caller id of the message at the head, which is taken; 0 when there is none.
-unsigned int take(QelMessageQueue& queue)
-{
-    const std::unique_ptr<QelMessage> message = queue.waitForMsg(0ms);
-    return message == nullptr ? 0 : message->getCallerId();
-}
-
-// What programs write.
-
-TEST(MessageQueuingOptions, HaveTheValuesThatProgramsStore)
+TEST(MessageQueuingOptions, HaveFixedValues)
 {
     EXPECT_EQ(static_cast<int>(kDefault), 0);
     EXPECT_EQ(static_cast<int>(kBlocking), 1);
@@ -99,14 +65,14 @@ TEST(MessageQueuingOptions, CombineAsBits)
     EXPECT_EQ(options, kBestEffort);
 }
 
-TEST(QelMessageQueue, ReturnCodesHaveTheirValuesAndBothSpellings)
+TEST(QelMessageQueue, ReturnCodesHaveFixedValuesAndTwoSpellings)
 {
     EXPECT_EQ(static_cast<int>(QelMessageQueue::OK), 0);
     EXPECT_EQ(static_cast<int>(QelMessageQueue::ReturnCode::SHUTDOWN), 1);
     EXPECT_EQ(static_cast<int>(QelMessageQueue::DROPPED), 2);
 }
 
-TEST(QelMessageQueue, IsNeitherCopiedNorMadeFromANumberByAccident)
+TEST(QelMessageQueue, IsNotCopiedAndNotConvertedFromAnInteger)
 {
     EXPECT_FALSE(std::is_copy_constructible<QelMessageQueue>::value);
     EXPECT_FALSE(std::is_copy_assignable<QelMessageQueue>::value);
@@ -138,7 +104,7 @@ INSTANTIATE_TEST_SUITE_P(Sizes, QelMessageQueueLimits,
                                                 "9223372036854775808/18446744073709551615"}),
                          [](const auto& test) { return test.param.name; });
 
-/// Whether a message that does not wait is admitted with that many bytes in the queue.
+/// Whether a message without BLOCKING is admitted while that many bytes are pending.
 bool admits(std::size_t sizeLimit, unsigned int pendingBytes, MessageQueuingOptions options, unsigned int length = 1000)
 {
     QelMessageQueue queue(sizeLimit);
@@ -158,16 +124,16 @@ bool admits(std::size_t sizeLimit, unsigned int pendingBytes, MessageQueuingOpti
     return false;
 }
 
-TEST(QelMessageQueue, NormalPriorityIsAdmittedWhileLessThanTheLimitWaits)
+TEST(QelMessageQueue, NormalPriorityIsAdmittedBelowTheLimit)
 {
     EXPECT_TRUE(admits(100, 0, kDefault));
-    EXPECT_TRUE(admits(100, 99, kDefault)); // only what waits already counts
+    EXPECT_TRUE(admits(100, 99, kDefault)); // only pending bytes count
     EXPECT_FALSE(admits(100, 100, kDefault));
     EXPECT_FALSE(admits(100, 101, kDefault));
     EXPECT_FALSE(admits(100, 100, kDefault, 32));
 }
 
-TEST(QelMessageQueue, LowPriorityIsAdmittedWhileLessThanHalfTheLimitWaits)
+TEST(QelMessageQueue, LowPriorityIsAdmittedBelowHalfOfTheLimit)
 {
     EXPECT_TRUE(admits(100, 0, kLow));
     EXPECT_TRUE(admits(100, 49, kLow));
@@ -176,7 +142,7 @@ TEST(QelMessageQueue, LowPriorityIsAdmittedWhileLessThanHalfTheLimitWaits)
     EXPECT_FALSE(admits(101, 51, kLow));
 }
 
-TEST(QelMessageQueue, NormalPriorityPassesLowPriorityThatIsOverItsLimit)
+TEST(QelMessageQueue, NormalPriorityIsAdmittedWhereLowPriorityIsDropped)
 {
     QelMessageQueue queue(100);
     EXPECT_EQ(queue.enqueue(sized(60, 1), kLow), QelMessageQueue::OK);
@@ -186,7 +152,7 @@ TEST(QelMessageQueue, NormalPriorityPassesLowPriorityThatIsOverItsLimit)
     EXPECT_EQ(figure(queue, "Dropped"), "1 (32 B)");
 }
 
-TEST(QelMessageQueue, BestEffortIsNotLookedAt)
+TEST(QelMessageQueue, BestEffortIsIgnored)
 {
     EXPECT_TRUE(admits(100, 99, kBestEffort));
     EXPECT_FALSE(admits(100, 100, kBestEffort));
@@ -194,7 +160,7 @@ TEST(QelMessageQueue, BestEffortIsNotLookedAt)
     EXPECT_FALSE(admits(100, 50, kBestEffort | kLow));
 }
 
-TEST(QelMessageQueue, BitsWithoutAMeaningAreNotLookedAt)
+TEST(QelMessageQueue, UnknownBitsAreIgnored)
 {
     constexpr auto kOthers = static_cast<MessageQueuingOptions>(~7);
     EXPECT_TRUE(admits(100, 99, kOthers));
@@ -216,7 +182,7 @@ TEST(QelMessageQueue, ABlockingProducerDoesNotWaitWhileThereIsRoom)
     EXPECT_TRUE(admits(100, 49, kBlocking | kLow));
 }
 
-TEST(QelMessageQueue, RoomComesBackWithEachMessageTaken)
+TEST(QelMessageQueue, TakingAMessageMakesRoom)
 {
     QelMessageQueue queue(64);
     EXPECT_EQ(queue.enqueue(sized(32, 1)), QelMessageQueue::OK);
@@ -230,7 +196,7 @@ TEST(QelMessageQueue, RoomComesBackWithEachMessageTaken)
 
 // Messages.
 
-TEST(QelMessageQueue, MessagesOfBothPrioritiesComeOutInTheOrderTheyWentIn)
+TEST(QelMessageQueue, MessagesOfBothPrioritiesKeepTheirOrder)
 {
     QelMessageQueue queue(0);
     queue.enqueue(sized(100, 1), kLow);
@@ -241,7 +207,7 @@ TEST(QelMessageQueue, MessagesOfBothPrioritiesComeOutInTheOrderTheyWentIn)
         EXPECT_EQ(take(queue), callerId);
 }
 
-TEST(QelMessageQueue, HandsOutTheVeryMessageThatWasPutIn)
+TEST(QelMessageQueue, ReturnsTheSameObject)
 {
     QelMessageQueue queue(0);
     std::unique_ptr<QelMessage> message = sized(100, 1);
@@ -263,8 +229,8 @@ TEST(QelMessageQueue, ARefusedMessageIsDestroyedWhenTheCallReturns)
     EXPECT_EQ(census.living(), 1);
 }
 
-// The message goes after the lock: its destructor may do what it likes.
-TEST(QelMessageQueue, ARefusedMessageMayUseTheQueueAsItGoes)
+// The message is destroyed after the lock is released.
+TEST(QelMessageQueue, TheDestructorOfARefusedMessageMayUseTheQueue)
 {
     MessageCensus census;
     QelMessageQueue queue(32);
@@ -281,7 +247,7 @@ TEST(QelMessageQueue, ARefusedMessageMayUseTheQueueAsItGoes)
     EXPECT_EQ(called, 2);
 }
 
-TEST(QelMessageQueue, DestroysWhatWasNotTaken)
+TEST(QelMessageQueue, DestroysMessagesThatWereNotTaken)
 {
     MessageCensus census;
     {
@@ -295,7 +261,7 @@ TEST(QelMessageQueue, DestroysWhatWasNotTaken)
     EXPECT_EQ(census.living(), 0);
 }
 
-TEST(QelMessageQueue, ANullMessageIsRefusedBeforeAnythingHappens)
+TEST(QelMessageQueue, RefusesANullMessageWithoutEffect)
 {
     SettableClock clock;
     QelMessageQueue queue(32);
@@ -310,22 +276,22 @@ TEST(QelMessageQueue, ANullMessageIsRefusedBeforeAnythingHappens)
     EXPECT_THAT([&] { queue.enqueue(nullptr); }, ThrowsMessage<std::invalid_argument>(StrEq("message")));
 }
 
-// Waiting for a message, as far as one thread can.
+// Waiting for a message, in one thread.
 
-TEST(QelMessageQueue, NoTimeMeansNoWait)
+TEST(QelMessageQueue, ATimeoutOfZeroOrLessDoesNotWait)
 {
     QelMessageQueue queue(0);
     for (const milliseconds timeout : {0ms, -1ms, milliseconds::min()}) {
         SCOPED_TRACE(timeout.count());
         EXPECT_EQ(queue.waitForMsg(timeout), nullptr);
         queue.enqueue(sized(32, 5));
-        const auto message = queue.waitForMsg(timeout); // what is there is taken
+        const auto message = queue.waitForMsg(timeout); // a pending message is taken
         ASSERT_NE(message, nullptr);
         EXPECT_EQ(message->getCallerId(), 5U);
     }
 }
 
-TEST(QelMessageQueue, AnyTimeoutTakesWhatIsThere)
+TEST(QelMessageQueue, AnyTimeoutTakesAPendingMessage)
 {
     QelMessageQueue queue(0);
     for (const milliseconds timeout :
@@ -336,9 +302,9 @@ TEST(QelMessageQueue, AnyTimeoutTakesWhatIsThere)
     }
 }
 
-TEST(QelMessageQueue, ATimeoutPassesOnTheRealClockWhateverASubstituteSays)
+TEST(QelMessageQueue, ATimeoutIsMeasuredOnTheRealClock)
 {
-    SettableClock clock; // stands still
+    SettableClock clock; // does not advance
     QelMessageQueue queue(0);
     const auto begin = std::chrono::steady_clock::now();
     EXPECT_EQ(queue.waitForMsg(20ms), nullptr);
@@ -356,7 +322,7 @@ TEST(QelMessageQueue, IsNotShutDownAtFirst)
     EXPECT_TRUE(queue.isShutdown());
 }
 
-TEST(QelMessageQueue, AfterShutdownNothingIsHandedOutThoughThereAreMessages)
+TEST(QelMessageQueue, AfterShutdownPendingMessagesAreNotHandedOut)
 {
     MessageCensus census;
     {
@@ -374,7 +340,7 @@ TEST(QelMessageQueue, AfterShutdownNothingIsHandedOutThoughThereAreMessages)
     EXPECT_EQ(census.living(), 0);
 }
 
-TEST(QelMessageQueue, AfterShutdownAFullQueueRefusesWithoutCountingADrop)
+TEST(QelMessageQueue, AfterShutdownAFullQueueCountsNoDrop)
 {
     QelMessageQueue queue(32);
     queue.enqueue(sized(32));
@@ -386,7 +352,7 @@ TEST(QelMessageQueue, AfterShutdownAFullQueueRefusesWithoutCountingADrop)
     EXPECT_EQ(figure(queue, "Pending"), "1 (32 B)");
 }
 
-TEST(QelMessageQueue, AfterShutdownAnEmptyQueueRefusesToo)
+TEST(QelMessageQueue, AfterShutdownAnEmptyQueueAcceptsNoMessage)
 {
     QelMessageQueue queue(0);
     queue.shutdown();
@@ -403,7 +369,7 @@ TEST(QelMessageQueue, LogsItsShutdownOnce)
     EXPECT_THAT(log.lines(), ElementsAre("D: MQ: Shutdown!"));
 }
 
-TEST(QelMessageQueue, LogsNothingAboveDebugAndNothingOfItsDailyWork)
+TEST(QelMessageQueue, LogsOnlyAtDebugAndNotForEachMessage)
 {
     {
         const CapturedLog log(LogLevel::Info);
@@ -418,271 +384,6 @@ TEST(QelMessageQueue, LogsNothingAboveDebugAndNothingOfItsDailyWork)
     take(queue);
     take(queue);
     EXPECT_THAT(log.lines(), IsEmpty());
-}
-
-// Statistics.
-
-TEST(QelMessageQueue, PrintsItsLimitsAndThenItsStatistics)
-{
-    SettableClock clock;
-    QelMessageQueue queue(1000);
-    queue.enqueue(sized(100, 1));
-    clock.advance(300ms);
-    queue.enqueue(sized(1200, 2), kLow);
-    queue.enqueue(sized(50, 3), kLow); // dropped
-    take(queue);
-    clock.advance(1234567ns);
-
-    EXPECT_EQ(dumpOf(queue, Indent(2, ' ')), "  Limits:         500/1000\n"
-                                             "  Max Size (HWM): 1300 B\n"
-                                             "  Pending:        1 (1200 B)\n"
-                                             "  Dropped:        1 (50 B)\n"
-                                             "  Completed:      1 (100 B)\n"
-                                             "  Throughput:     3 m/s (333 B/s)\n"
-                                             "  Head Wait:      1234 us\n"
-                                             "  Latency Buckets:\n"
-                                             "                Enqueue      Dequeue      E2E         \n"
-                                             "    0-1ms:      2            0            0           \n"
-                                             "    1-10ms:     0            0            0           \n"
-                                             "    10-100ms:   0            0            0           \n"
-                                             "    100-1000ms: 0            1            1           \n"
-                                             "    1-10s:      0            0            0           \n"
-                                             "    10+s:       0            0            0           \n"
-                                             "  Maximum Latency:\n"
-                                             "    [CID=0x00000001 FN=0x6003 OP=0x8001 T=300000us]\n"
-                                             "  Latency Events:\n"
-                                             "    (A) [2024-01-02 03:04:05 - 2024-01-02 03:04:05 UTC]\n"
-                                             "        Duration:       000d:00h:00m:00.000s\n"
-                                             "        First:          [CID=0x00000001 FN=0x6003 OP=0x8001 T=300000us]\n"
-                                             "        Last:           [CID=0x00000001 FN=0x6003 OP=0x8001 T=300000us]\n"
-                                             "        Completed:      1 (100 B)\n"
-                                             "        Max Latency:    300000 us\n"
-                                             "        Avg Latency:    300000 us\n");
-}
-
-TEST(QelMessageQueue, ADumpRepeatsWhileTheClockStandsStill)
-{
-    SettableClock clock;
-    QelMessageQueue queue(0);
-    queue.enqueue(sized(100, 1));
-    const std::string once = dumpOf(queue);
-    EXPECT_EQ(dumpOf(queue), once);
-    std::ostringstream os;
-    os << hexFormat(1U);
-    os.str("");
-    queue.dumpStatistics(os, Indent(0, ' ')); // and behind a hexadecimal value
-    EXPECT_EQ(os.str(), once);
-}
-
-TEST(QelMessageQueue, EndToEndLatencyCountsFromTheCall)
-{
-    SettableClock clock;
-    QelMessageQueue queue(0);
-    queue.enqueue(sized(100, 1));
-    clock.advance(5s);
-    queue.enqueue(sized(100, 2));
-    clock.advance(5s);
-    take(queue); // 10 s in all and at the head
-    take(queue); // 5 s in all, none at the head
-    const std::string text = dumpOf(queue);
-    EXPECT_THAT(text, HasSubstr("0-1ms:      2            1            0           \n"));
-    EXPECT_THAT(text, HasSubstr("1-10s:      0            1            2           \n"));
-}
-
-/// Time that goes on by one second with each reading of either clock, so that every duration tells which readings it
-/// lies between.
-class TickingClock : public TimeProvider {
-public:
-    TickingClock() { pRegister(); }
-
-private:
-    std::chrono::system_clock::time_point pSystem() override { return std::chrono::system_clock::time_point(pTick()); }
-    std::chrono::steady_clock::time_point pSteady() override { return std::chrono::steady_clock::time_point(pTick()); }
-    std::chrono::seconds pTick() { return std::chrono::seconds(mReadings++); }
-
-    int mReadings = 0;
-};
-
-TEST(QelMessageQueue, TheClocksAreReadInTheOrderOfWhatTheyTell)
-{
-    TickingClock clock;
-    QelMessageQueue queue(0);
-    queue.enqueue(sized(100, 1)); // 0 its call, 1 its admission, 2 it is at the head
-    take(queue);                  // 3 its latency, 4 it leaves the head, 5 the event's begin, 6 its time-out
-    queue.enqueue(sized(200, 2)); // 7, 8, 9
-    EXPECT_EQ(figure(queue, "Head Wait"), "1000000 us"); // 10
-    take(queue); // 11 its latency, 12 it leaves the head, 13 the event's time-out, 14 its end
-
-    EXPECT_EQ(dumpOf(queue), "Limits:         0/0\n"
-                             "Max Size (HWM): 200 B\n"
-                             "Pending:        0 (0 B)\n"
-                             "Dropped:        0 (0 B)\n"
-                             "Completed:      2 (300 B)\n"
-                             "Throughput:     0 m/s (60 B/s)\n" // 2 s and 3 s at the head
-                             "Latency Buckets:\n"
-                             "              Enqueue      Dequeue      E2E         \n"
-                             "  0-1ms:      0            0            0           \n"
-                             "  1-10ms:     0            0            0           \n"
-                             "  10-100ms:   0            0            0           \n"
-                             "  100-1000ms: 2            0            0           \n" // 1 s each
-                             "  1-10s:      0            2            2           \n"
-                             "  10+s:       0            0            0           \n"
-                             "Maximum Latency:\n"
-                             "  [CID=0x00000002 FN=0x6003 OP=0x8001 T=4000000us]\n"
-                             "Latency Events:\n"
-                             "  (A) [1970-01-01 00:00:05 - 1970-01-01 00:00:14 UTC]\n"
-                             "      Duration:       000d:00h:00m:09.000s\n"
-                             "      First:          [CID=0x00000001 FN=0x6003 OP=0x8001 T=3000000us]\n"
-                             "      Last:           [CID=0x00000002 FN=0x6003 OP=0x8001 T=4000000us]\n"
-                             "      Completed:      2 (300 B)\n"
-                             "      Max Latency:    4000000 us\n"
-                             "      Avg Latency:    3500000 us\n");
-}
-
-TEST(QelMessageQueue, TheClockIsReadNoMoreThanNeeded)
-{
-    SettableClock clock;
-    QelMessageQueue queue(64);
-    EXPECT_EQ(clock.steadyReads(), 0U);
-
-    queue.enqueue(sized(32)); // its call, its admission, and it comes to the head
-    EXPECT_EQ(clock.steadyReads(), 3U);
-    queue.enqueue(sized(32)); // its call and its admission
-    EXPECT_EQ(clock.steadyReads(), 5U);
-    queue.enqueue(sized(32)); // its call; dropped
-    EXPECT_EQ(clock.steadyReads(), 6U);
-    take(queue); // its latency, and the wait at the head
-    EXPECT_EQ(clock.steadyReads(), 8U);
-    take(queue);
-    EXPECT_EQ(clock.steadyReads(), 10U);
-    take(queue); // there is none
-    EXPECT_EQ(clock.steadyReads(), 10U);
-    dumpOf(queue);
-    EXPECT_EQ(clock.steadyReads(), 10U);
-    EXPECT_EQ(queue.waitForMsg(1ms), nullptr);
-    EXPECT_EQ(clock.steadyReads(), 10U);
-    queue.shutdown();
-    EXPECT_EQ(clock.steadyReads(), 10U);
-    queue.enqueue(sized(32)); // its call; refused
-    EXPECT_EQ(clock.steadyReads(), 11U);
-    take(queue);
-    EXPECT_EQ(clock.steadyReads(), 11U);
-    EXPECT_EQ(clock.systemReads(), 0U);
-}
-
-TEST(QelMessageQueue, AMessageThatPassesThroughCostsNoMemory)
-{
-    QEL_TEST_NEEDS_ALLOCATIONS();
-    QelMessageQueue queue(1000);
-    std::unique_ptr<QelMessage> message = sized(32);
-    std::size_t most = 0;
-    std::size_t all = 0;
-    for (int i = 0; i < 1000; ++i) {
-        const Allocations allocations;
-        queue.enqueue(std::move(message));
-        message = queue.waitForMsg(0ms);
-        most = std::max(most, allocations.count());
-        all += allocations.count();
-    }
-    EXPECT_LE(most, 1U); // a new piece of the double-ended queue, now and then
-    EXPECT_LE(all, 1000U / 16);
-}
-
-// Failures. Nothing has happened then.
-
-TEST(QelMessageQueue, AFailingClockLeavesTheQueueAsItWasWhenAMessageComes)
-{
-    ThrowingClock clock;
-    MessageCensus census;
-    QelMessageQueue queue(0);
-    const std::string before = dumpOf(queue);
-    for (int readings = 0; readings < 3; ++readings) { // of the call, of the admission, of the head
-        SCOPED_TRACE(readings);
-        clock.failAfter(readings);
-        EXPECT_THROW(queue.enqueue(std::make_unique<CountedMessage>(census, 32)), std::runtime_error);
-        clock.work();
-        EXPECT_EQ(census.living(), 0);
-        EXPECT_EQ(dumpOf(queue), before);
-        EXPECT_EQ(queue.waitForMsg(0ms), nullptr);
-    }
-    EXPECT_EQ(queue.enqueue(sized(32, 7)), QelMessageQueue::OK);
-    EXPECT_EQ(take(queue), 7U);
-}
-
-TEST(QelMessageQueue, AFailingClockLeavesTheMessageInTheQueue)
-{
-    ThrowingClock clock;
-    QelMessageQueue queue(0);
-    queue.enqueue(sized(32, 7));
-    const std::string before = dumpOf(queue);
-    for (int readings = 0; readings < 2; ++readings) { // of the latency, of the head
-        SCOPED_TRACE(readings);
-        clock.failAfter(readings);
-        EXPECT_THROW(queue.waitForMsg(0ms), std::runtime_error);
-        clock.work();
-        EXPECT_EQ(dumpOf(queue), before);
-    }
-    EXPECT_EQ(take(queue), 7U);
-}
-
-TEST(QelMessageQueue, WithoutMemoryTheQueueIsAsItWas)
-{
-    QEL_TEST_NEEDS_ALLOCATIONS();
-    SettableClock clock;
-    MessageCensus census;
-    QelMessageQueue queue(0);
-    int failed = 0;
-    int queued = 0;
-    while (failed < 3) { // memory is asked for once in many messages
-        ASSERT_LT(queued, 1000);
-        auto message = std::make_unique<CountedMessage>(census, 32);
-        const std::string before = dumpOf(queue);
-        bool thrown = false;
-        {
-            Allocations allocations;
-            allocations.failAll();
-            try {
-                queue.enqueue(std::move(message));
-            } catch (const std::bad_alloc&) {
-                thrown = true;
-            }
-        }
-        if (thrown) {
-            ++failed;
-            EXPECT_EQ(dumpOf(queue), before);
-            EXPECT_EQ(queue.enqueue(std::make_unique<CountedMessage>(census, 32)), QelMessageQueue::OK);
-        }
-        ++queued;
-        EXPECT_EQ(census.living(), queued);
-    }
-    while (queued > 0) {
-        EXPECT_NE(queue.waitForMsg(0ms), nullptr);
-        --queued;
-    }
-    EXPECT_EQ(queue.waitForMsg(0ms), nullptr);
-    EXPECT_EQ(census.living(), 0);
-}
-
-TEST(QelMessageQueue, TheLockIsFreeAfterAFailure)
-{
-    ThrowingClock clock;
-    QelMessageQueue queue(0);
-    clock.failAfter(1);
-    EXPECT_THROW(queue.enqueue(sized(32)), std::runtime_error);
-    clock.work();
-    EXPECT_THAT(dumpOf(queue), HasSubstr("Pending:        0 (0 B)\n")); // takes the lock
-}
-
-TEST(QelMessageQueue, TheLockIsFreeAfterADumpToAStreamThatFails)
-{
-    struct FullDisk : std::streambuf {}; // takes nothing
-    FullDisk disk;
-    std::ostream os(&disk);
-    os.exceptions(std::ios_base::badbit);
-    QelMessageQueue queue(0);
-    queue.enqueue(sized(32, 7));
-    EXPECT_THROW(queue.dumpStatistics(os, Indent(0, ' ')), std::ios_base::failure);
-    EXPECT_EQ(take(queue), 7U);
 }
 
 } // namespace

@@ -14,45 +14,43 @@ namespace {
 using Operation = Interleavings::Operation;
 using Fault = Interleavings::Fault;
 
-constexpr std::size_t kNobody = static_cast<std::size_t>(-1);
+constexpr std::size_t kNone = static_cast<std::size_t>(-1);
 
-const char* const kOperations[] = {"goes on",      "locks",  "unlocks", "sleeps",        "notifies one",
-                                   "notifies all", "enters", "leaves",  "waits for zero"};
+const char* const kOperations[] = {"goes on", "locks", "unlocks", "sleeps", "notifies one", "notifies all"};
 
 struct Object {
-    std::size_t number = 0; // in the order in which they were made
+    std::size_t number = 0; // in the order of construction
     const char* kind = "";
-    std::size_t owner = kNobody; // of a mutex
-    std::size_t inFlight = 0;    // of a count of calls
+    std::size_t owner = kNone; // of a mutex
 };
 
 struct Thread {
     Operation next = Operation::Step;
     const void* object = nullptr; // of the next operation
-    const void* mutex = nullptr;  // that a sleeper takes again
+    const void* mutex = nullptr;  // that a sleeping thread takes again
     bool ended = false;
     bool timed = false;
     bool woken = false;
     bool timedOut = false;
-    std::uint64_t past = 0x9E3779B97F4A7C15U; // everything that decides what it does, since here(); it has not begun
+    std::uint64_t past = 0x9E3779B97F4A7C15U; // hash of what determines its steps, since here()
     std::uint64_t place = 0;                  // of the last here()
     std::vector<const void*> notified;
     std::vector<const void*> notifiedAll;
 };
 
-/// One way to go on: which thread, and which alternative of its operation.
-struct Turn {
+/// A possible next step: a thread, and an alternative of its operation.
+struct Step {
     std::size_t thread;
     std::size_t alternative;
 };
 
-// The alternatives of a sleeper.
+// The alternatives of a sleeping thread.
 constexpr std::size_t kWake = 0;
 constexpr std::size_t kTimeOut = 1;
-constexpr std::size_t kNoCause = 2;
+constexpr std::size_t kSpurious = 2;
 
-/// A turn that was taken.
-struct Scene {
+/// A step that was taken.
+struct PastStep {
     std::size_t thread;
     Operation operation;
     std::size_t object; // its number
@@ -71,7 +69,7 @@ std::uint64_t mix(std::uint64_t hash, std::uint64_t value)
     return hash ^ hash >> 33;
 }
 
-/// One run of a program, and what all runs have in common.
+/// The current run of a program, and what all runs share.
 class Explorer {
 public:
     explicit Explorer(const Interleavings::Options& options) : mOptions(options) {}
@@ -79,7 +77,7 @@ public:
     Interleavings::Result explore(const std::function<std::unique_ptr<Interleavings::Program>()>& make)
     {
         do {
-            if (++mResult.runs > mOptions.mostRuns) {
+            if (++mResult.runs > mOptions.maxRuns) {
                 mResult.failure = "more runs than were allowed";
                 break;
             }
@@ -89,7 +87,7 @@ public:
         return mResult;
     }
 
-    // What running threads ask for.
+    // Called by running threads.
 
     void perform(Operation operation, const void* object)
     {
@@ -97,7 +95,7 @@ public:
         Thread& self = pSelf();
         self.next = operation;
         self.object = object;
-        mFibers[mCurrent]->suspend(); // a place where the turn may change
+        mFibers[mCurrent]->suspend(); // another thread may run next
     }
 
     bool sleep(const void* condition, const void* mutex, bool timed)
@@ -128,8 +126,7 @@ public:
         if (found == mObjects.end()) return;
         const std::string what = pName(object);
         if (mRunning) {
-            if (found->second.owner != kNobody) fail(what + " is destroyed while it is held");
-            if (found->second.inFlight != 0) fail(what + " is destroyed while calls are in flight");
+            if (found->second.owner != kNone) fail(what + " is destroyed while it is held");
             for (const Thread& thread : mThreads) {
                 if (thread.ended || &thread == &mThreads[mCurrent]) continue;
                 if (thread.object == object || thread.mutex == object) {
@@ -153,12 +150,11 @@ public:
     {
         if (mGivingUp || !mResult.failure.empty()) return;
         mResult.failure = what;
-        for (const Scene& scene : mStory) {
+        for (const PastStep& past : mSteps) {
             mResult.story.push_back(
-                "thread " + std::to_string(scene.thread) + " " +
-                kOperations[static_cast<std::size_t>(scene.operation)] +
-                (scene.object == kNobody ? "" : std::string(" ") + scene.kind + " " + std::to_string(scene.object)) +
-                " (" + std::to_string(scene.alternative) + ")");
+                "thread " + std::to_string(past.thread) + " " + kOperations[static_cast<std::size_t>(past.operation)] +
+                (past.object == kNone ? "" : std::string(" ") + past.kind + " " + std::to_string(past.object)) + " (" +
+                std::to_string(past.alternative) + ")");
         }
     }
 
@@ -172,7 +168,7 @@ private:
     {
         const auto found = mObjects.find(object);
         if (found != mObjects.end()) return &found->second;
-        fail("something is used after its end");
+        fail("an object is used after its destruction");
         return nullptr;
     }
 
@@ -193,13 +189,13 @@ private:
             mThreads[thread].mutex = nullptr;
             mThreads[thread].next = Operation::Step;
         }
-        mCurrent = kNobody;
+        mCurrent = kNone;
     }
 
     void pRun(const std::function<std::unique_ptr<Interleavings::Program>()>& make)
     {
         mObjects.clear();
-        mStory.clear();
+        mSteps.clear();
         mCreated = 0;
         mSpuriousLeft = mOptions.spuriousWakeups;
         mGivingUp = false;
@@ -213,13 +209,13 @@ private:
             mFibers[i]->assign(program->threads[i]);
 
         mRunning = true;
-        while (mResult.failure.empty() && pTurn(*program)) {
+        while (mResult.failure.empty() && pStep(*program)) {
         }
         mRunning = false;
         pGiveUp(*program);
     }
 
-    /// Runs every thread that has not ended to its end, one after the other.
+    /// Runs every thread that has not ended to its end, one by one.
     void pGiveUp(Interleavings::Program& program)
     {
         mGivingUp = true;
@@ -228,15 +224,15 @@ private:
             if (mThreads[i].ended) continue;
             mThreads[i].timedOut = false;
             pResume(i);
-            if (!mThreads[i].ended) throw std::logic_error("a thread stops where nothing stops it");
+            if (!mThreads[i].ended) throw std::logic_error("a thread suspends although no operation waits");
         }
     }
 
-    /// One thread goes on to its next operation. @return false when the run is over
-    bool pTurn(Interleavings::Program& program)
+    /// One thread continues to its next operation. @return false when the run is over
+    bool pStep(Interleavings::Program& program)
     {
-        const std::vector<Turn> turns = pPossibleTurns();
-        if (turns.empty()) {
+        const std::vector<Step> steps = pPossibleSteps();
+        if (steps.empty()) {
             ++mResult.rests;
             pCheckRest();
             program.atRest();
@@ -246,66 +242,59 @@ private:
             std::string state;
             program.describe(state);
             if (!mVisited.insert(pStateHash(state)).second && mOptions.merge) return false;
-            mDecisions.push_back({0, turns.size()});
+            mDecisions.push_back({0, steps.size()});
         }
         const Decision& decision = mDecisions[mDepth++];
-        if (decision.alternatives != turns.size()) throw std::logic_error("the program does not repeat itself");
-        pTake(program, turns[decision.chosen]);
+        if (decision.alternatives != steps.size()) throw std::logic_error("the program is not deterministic");
+        pTake(program, steps[decision.chosen]);
         return true;
     }
 
-    std::vector<Turn> pPossibleTurns() const
+    std::vector<Step> pPossibleSteps() const
     {
-        std::vector<Turn> turns;
+        std::vector<Step> steps;
         for (std::size_t i = 0; i < mThreads.size(); ++i) {
             const Thread& thread = mThreads[i];
             if (thread.ended) continue;
             const auto found = mObjects.find(thread.object);
-            const bool exists = found != mObjects.end(); // if not, going on shows it
+            const bool exists = found != mObjects.end(); // if not, pCarryOut() reports it
             switch (thread.next) {
             case Operation::Lock:
-                if (!exists || found->second.owner == kNobody) turns.push_back({i, 0});
-                break;
-            case Operation::WaitZero:
-                if (!exists || found->second.inFlight == 0 || mOptions.fault == Fault::WaitZeroDoesNotWait) {
-                    turns.push_back({i, 0});
-                }
+                if (!exists || found->second.owner == kNone) steps.push_back({i, 0});
                 break;
             case Operation::Sleep:
-                pAddTurnsOfSleeper(i, turns);
+                pAddStepsOfSleeper(i, steps);
                 break;
             case Operation::NotifyOne:
-                pAddTurnsOfNotifier(i, turns);
+                pAddStepsOfNotifier(i, steps);
                 break;
             case Operation::Step:
             case Operation::Unlock:
             case Operation::NotifyAll:
-            case Operation::Enter:
-            case Operation::Leave:
-                turns.push_back({i, 0});
+                steps.push_back({i, 0});
                 break;
             }
         }
-        return turns;
+        return steps;
     }
 
-    void pAddTurnsOfSleeper(std::size_t number, std::vector<Turn>& turns) const
+    void pAddStepsOfSleeper(std::size_t number, std::vector<Step>& steps) const
     {
         const Thread& thread = mThreads[number];
         if (!thread.woken && !thread.timedOut) {
-            if (thread.timed) turns.push_back({number, kTimeOut});
-            if (mSpuriousLeft != 0) turns.push_back({number, kNoCause});
+            if (thread.timed) steps.push_back({number, kTimeOut});
+            if (mSpuriousLeft != 0) steps.push_back({number, kSpurious});
             return;
         }
         const auto mutex = mObjects.find(thread.mutex);
-        if (mutex == mObjects.end() || mutex->second.owner == kNobody) turns.push_back({number, kWake});
+        if (mutex == mObjects.end() || mutex->second.owner == kNone) steps.push_back({number, kWake});
     }
 
-    void pAddTurnsOfNotifier(std::size_t number, std::vector<Turn>& turns) const
+    void pAddStepsOfNotifier(std::size_t number, std::vector<Step>& steps) const
     {
         const std::size_t sleepers = pSleepers(mThreads[number].object).size();
         for (std::size_t i = 0; i < std::max<std::size_t>(sleepers, 1); ++i)
-            turns.push_back({number, i});
+            steps.push_back({number, i});
     }
 
     /// The threads that a notification can wake.
@@ -321,53 +310,53 @@ private:
         return sleepers;
     }
 
-    void pTake(Interleavings::Program& program, const Turn& turn)
+    void pTake(Interleavings::Program& program, const Step& step)
     {
-        Thread& thread = mThreads[turn.thread];
+        Thread& thread = mThreads[step.thread];
         const auto object = mObjects.find(thread.object);
         const bool exists = object != mObjects.end();
-        mStory.push_back({turn.thread, thread.next, exists ? object->second.number : kNobody,
-                          exists ? object->second.kind : "", turn.alternative});
+        mSteps.push_back({step.thread, thread.next, exists ? object->second.number : kNone,
+                          exists ? object->second.kind : "", step.alternative});
 
-        if (thread.next == Operation::Sleep && turn.alternative != kWake) {
-            // It is awake, and has yet to take the mutex again.
-            (turn.alternative == kTimeOut ? thread.timedOut : thread.woken) = true;
-            if (turn.alternative == kNoCause) --mSpuriousLeft;
+        if (thread.next == Operation::Sleep && step.alternative != kWake) {
+            // It is awake, but does not hold the mutex yet.
+            (step.alternative == kTimeOut ? thread.timedOut : thread.woken) = true;
+            if (step.alternative == kSpurious) --mSpuriousLeft;
             return;
         }
-        if (thread.object != nullptr && !pCarryOut(turn)) return;
-        pRemember(program, thread, turn);
+        if (thread.object != nullptr && !pCarryOut(step)) return;
+        pRemember(program, thread, step);
         thread.next = Operation::Step;
         thread.object = nullptr;
         thread.mutex = nullptr;
-        pResume(turn.thread);
+        pResume(step.thread);
     }
 
     void pRelease(Object& mutex, std::size_t thread)
     {
-        if (mutex.owner != thread) return fail("a mutex is given back by a thread that does not hold it");
-        mutex.owner = kNobody;
+        if (mutex.owner != thread) return fail("a mutex is released by a thread that does not hold it");
+        mutex.owner = kNone;
     }
 
-    /// @return false when that is not possible any more
-    bool pCarryOut(const Turn& turn)
+    /// @return false when an object does not exist any more
+    bool pCarryOut(const Step& step)
     {
-        Thread& thread = mThreads[turn.thread];
+        Thread& thread = mThreads[step.thread];
         Object* const object = pObject(thread.next == Operation::Sleep ? thread.mutex : thread.object);
         if (object == nullptr || pObject(thread.object) == nullptr) return false;
         switch (thread.next) {
         case Operation::Lock:
         case Operation::Sleep:
-            object->owner = turn.thread;
+            object->owner = step.thread;
             break;
         case Operation::Unlock:
-            pRelease(*object, turn.thread);
+            pRelease(*object, step.thread);
             break;
         case Operation::NotifyOne: {
             thread.notified.push_back(thread.object);
             const std::vector<std::size_t> sleepers = pSleepers(thread.object);
             if (mOptions.fault == Fault::NotifyOneDoesNothing || sleepers.empty()) break;
-            mThreads[sleepers[turn.alternative]].woken = true;
+            mThreads[sleepers[step.alternative]].woken = true;
             break;
         }
         case Operation::NotifyAll:
@@ -376,29 +365,21 @@ private:
             for (const std::size_t sleeper : pSleepers(thread.object))
                 mThreads[sleeper].woken = true;
             break;
-        case Operation::Enter:
-            ++object->inFlight;
-            break;
-        case Operation::Leave:
-            if (object->inFlight == 0) fail("more calls leave than have entered");
-            --object->inFlight;
-            break;
         case Operation::Step:
-        case Operation::WaitZero:
             break;
         }
         return true;
     }
 
-    /// A thread that goes on remembers what it does and what it sees then.
-    void pRemember(Interleavings::Program& program, Thread& thread, const Turn& turn)
+    /// Adds what the thread does, and the shared data that it sees, to its past.
+    void pRemember(Interleavings::Program& program, Thread& thread, const Step& step)
     {
         thread.past = mix(thread.past, static_cast<std::uint64_t>(thread.next));
-        thread.past = mix(thread.past, turn.alternative);
+        thread.past = mix(thread.past, step.alternative);
         thread.past = mix(thread.past, thread.timedOut ? 1 : 0);
-        const bool looks = thread.next == Operation::Lock || thread.next == Operation::Sleep ||
-                           thread.next == Operation::Step || thread.next == Operation::WaitZero;
-        if (!looks) return;
+        const bool seesSharedData =
+            thread.next == Operation::Lock || thread.next == Operation::Sleep || thread.next == Operation::Step;
+        if (!seesSharedData) return;
         std::string state;
         program.describeWhatThreadsSee(state);
         thread.past = mix(thread.past, std::hash<std::string>()(state));
@@ -411,7 +392,6 @@ private:
             if (thread.next == Operation::Lock || (thread.next == Operation::Sleep && thread.woken)) {
                 fail("a thread waits for a mutex for ever");
             }
-            if (thread.next == Operation::WaitZero) fail("a thread waits for calls in flight for ever");
         }
     }
 
@@ -427,23 +407,21 @@ private:
                                  (thread.timedOut ? 1U : 0U));
             hash = mix(hash, thread.past);
         }
-        std::vector<std::uint64_t> objects(mCreated * 2, kNobody - 1);
-        for (const auto& [address, object] : mObjects) {
-            objects[object.number * 2] = object.owner;
-            objects[object.number * 2 + 1] = object.inFlight;
-        }
-        for (const std::uint64_t value : objects)
-            hash = mix(hash, value);
+        std::vector<std::uint64_t> owners(mCreated, kNone - 1);
+        for (const auto& [address, object] : mObjects)
+            owners[object.number] = object.owner;
+        for (const std::uint64_t owner : owners)
+            hash = mix(hash, owner);
         return hash;
     }
 
     std::uint64_t pNumber(const void* object) const
     {
         const auto found = mObjects.find(object);
-        return found == mObjects.end() ? kNobody : found->second.number;
+        return found == mObjects.end() ? kNone : found->second.number;
     }
 
-    /// To the next run. @return false when there is none
+    /// Prepares the next run. @return false when there is none
     bool pNextDecisions()
     {
         while (!mDecisions.empty() && mDecisions.back().chosen + 1 == mDecisions.back().alternatives) {
@@ -465,13 +443,13 @@ private:
     std::unordered_set<std::uint64_t> mVisited;
     std::vector<std::unique_ptr<Fiber>> mFibers;
 
-    // This run.
+    // The current run.
     std::map<const void*, Object> mObjects;
     std::vector<Thread> mThreads;
-    std::vector<Scene> mStory;
+    std::vector<PastStep> mSteps;
     std::size_t mCreated = 0;
     std::size_t mDepth = 0;
-    std::size_t mCurrent = kNobody;
+    std::size_t mCurrent = kNone;
     unsigned int mSpuriousLeft = 0;
     bool mRunning = false;
     bool mGivingUp = false;

@@ -9,78 +9,69 @@
 #include <vector>
 
 /// @file
-/// Runs a small program of several threads in every order in which they can run, to find the one in which it goes
-/// wrong. The threads are not those of the system: they take turns, and the turn changes only where threads can see
-/// each other, which is at the operations of ModelledSync.hpp. Code that is compiled against those instead of the real
-/// mutexes and condition variables runs here unchanged.
+/// Runs a small program of several threads in every order in which they can run, to find an order in which it fails.
+/// The threads are fibers: one runs at a time, and the next step may go to another one only at the operations of
+/// ModelledSync.hpp. Code that is compiled against those instead of the real mutexes and condition variables runs here
+/// unchanged.
 ///
-/// How it is done: a run is a list of decisions, one for each turn. After a run the last decision that has another
-/// alternative left is changed and the program runs anew, until there is none left. A run is cut short where it comes
-/// to a state that was met before: same threads at the same places with the same past, same shared data. What follows
-/// from there is known.
+/// A run is a list of decisions, one for each step. After a run the last decision that has an untried alternative is
+/// changed and the program runs again, until all are tried. A run is cut short when it reaches a state that was visited
+/// before: the same threads at the same places with the same past, and the same shared data.
 ///
-/// What it relies on: data that threads share is touched with a modelled mutex held, or right after step(); what a
-/// thread does next depends on nothing but its past since its last call of here() and on what it then sees.
+/// It relies on two rules. Threads touch shared data with a modelled mutex held, or right after step(). What a thread
+/// does next depends only on its past since its last call of here() and on the shared data.
 
 namespace qel::test {
 
 class Interleavings {
 public:
-    /// What a thread is about to do at a place where the turn may change.
+    /// What a thread is about to do at a place where another thread may run next.
     enum class Operation {
-        Step,      ///< something that touches no modelled object
-        Lock,      ///< take a mutex; can go on while nobody holds it
-        Unlock,    ///< give it back
-        Sleep,     ///< wait at a condition variable; can go on when woken, or, if the wait is timed, at any time
+        Step,      ///< uses no modelled object
+        Lock,      ///< take a mutex; possible while it is free
+        Unlock,    ///< release it
+        Sleep,     ///< wait at a condition variable; ends when woken, and, if the wait is timed, at any time
         NotifyOne, ///< wake one thread that sleeps at a condition variable, any of them
-        NotifyAll, ///< wake all of them
-        Enter,     ///< count up
-        Leave,     ///< count down
-        WaitZero   ///< can go on when the count is zero
+        NotifyAll  ///< wake all of them
     };
 
-    /// What is deliberately broken, to show that a program's mistakes are found.
-    enum class Fault {
-        None,
-        NotifyOneDoesNothing,
-        NotifyAllDoesNothing,
-        WaitZeroDoesNotWait ///< CallsInFlight::wait() returns at once
-    };
+    /// What is deliberately broken, to show that failures are detected.
+    enum class Fault { None, NotifyOneDoesNothing, NotifyAllDoesNothing };
 
-    /// A program. A new one is made for every run.
+    /// A program. Every run constructs a new one.
     class Program {
     public:
         virtual ~Program();
 
-        /// What the threads do. All begin when the run begins.
+        /// What the threads do. All start with the run.
         std::vector<std::function<void()>> threads;
 
         /// Appends the data that the threads share, and what atRest() looks at.
         virtual void describe(std::string& state) const = 0;
-        /// Appends the part of it by which threads decide what they do; all of it, unless overridden.
+        /// Appends the part of it on which the decisions of threads depend; all of it, unless overridden.
         virtual void describeWhatThreadsSee(std::string& state) const { describe(state); }
-        /// Called when no thread can go on: all have ended, or some sleep for ever. Calls fail() if that is wrong.
+        /// Called when no thread can continue: each has ended or sleeps for ever. Calls fail() if that is wrong.
         virtual void atRest() = 0;
-        /// Called after a run that was cut short, before its threads are run to their ends one by one: from now on no
-        /// operation waits for anything. Makes sure that no thread goes round for ever.
+        /// Called after a run that was cut short, before its threads are run to their ends one by one. From now on no
+        /// operation waits. Makes sure that no thread loops for ever.
         virtual void giveUp() = 0;
     };
 
     struct Options {
         Fault fault = Fault::None;
-        unsigned int spuriousWakeups = 0; ///< how many sleeps may end without cause in one run
-        bool merge = true;                ///< false: go on although a state was met before
-        bool sleepersForget = false;      ///< true: a thread that has slept knows nothing of what it saw before that,
-                                          ///< since here(); so do those that look at everything again
-        std::size_t mostRuns = 5000000;   ///< more than this is a failure: the program is too large
+        unsigned int spuriousWakeups = 0; ///< the limit of spurious wake-ups in one run
+        bool merge = true;                ///< false: continue from states visited before
+        bool sleepersForget = false;   ///< true: after a sleep a thread does not depend on what it saw between here()
+                                       ///< and the sleep, because it checks everything again
+        std::size_t maxRuns = 5000000; ///< more are a failure: the program is too large
     };
 
     struct Result {
         std::string failure;            ///< the first one found; empty: there is none
-        std::vector<std::string> story; ///< what led there, one line for each turn
+        std::vector<std::string> story; ///< the steps to the failure, a line for each
         std::size_t runs = 0;
-        std::size_t states = 0; ///< different ones
-        std::size_t rests = 0;  ///< runs that came to rest
+        std::size_t states = 0; ///< distinct
+        std::size_t rests = 0;  ///< runs that ended with atRest()
     };
 
     /// Runs the program in every order. Stops at the first failure.
@@ -93,31 +84,31 @@ public:
 
     // For programs, while they run.
 
-    /// A place where other threads may have their turn.
+    /// A place where another thread may run next.
     static void step();
-    /// Tells that what the calling thread does next depends on nothing of its past but this number.
+    /// Of its past, only this number determines what the calling thread does next.
     static void here(std::uint64_t place);
-    /// The program is wrong.
+    /// Reports a failure of the program.
     static void fail(const std::string& what);
     /// The number of the calling thread, from 0.
     static std::size_t thread();
     static bool hasEnded(std::size_t thread);
-    /// Whether that thread sleeps at a condition variable and was not woken.
+    /// Whether that thread sleeps at a condition variable and has not been woken.
     static bool sleeps(std::size_t thread);
-    /// Whether the calling thread's latest sleep since its last here() has ended because its time has passed.
+    /// Whether the last sleep of the calling thread since its last here() has ended by its timeout.
     static bool timedOut();
-    /// On which objects the calling thread has called notifyOne() since its last here(), in order.
+    /// The objects whose notifyOne() the calling thread has called since its last here(), in order.
     static const std::vector<const void*>& notified();
     /// The same for notifyAll().
     static const std::vector<const void*>& notifiedAll();
 
-    // For ModelledSync.hpp. Objects are known by their address from create() to destroy(). Where no thread of the
-    // program runs, as in its constructor, nothing waits for anything.
+    // For ModelledSync.hpp. Objects are identified by their address from create() to destroy(). Outside of the threads
+    // of the program, as in its constructor, no operation waits.
 
     static void create(const void* object, const char* kind);
     static void destroy(const void* object);
     static void perform(Operation operation, const void* object);
-    /// Gives the mutex back and sleeps. @return false when the time of a timed wait has passed
+    /// Releases the mutex and sleeps. @return false when the time of a timed wait has passed
     static bool sleep(const void* condition, const void* mutex, bool timed);
 };
 

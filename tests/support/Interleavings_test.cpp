@@ -1,4 +1,4 @@
-// The explorer tries every order, and finds what is wrong in small programs that are known to be wrong.
+// Interleavings runs every order, and finds the failures of small programs that are known to fail.
 
 #include "support/Interleavings.hpp"
 #include "support/ModelledSync.hpp"
@@ -20,9 +20,9 @@ using testing::HasSubstr;
 using testing::IsEmpty;
 using testing::Not;
 
-using Lock = ModelledUniqueMutexLock;
+using Lock = modelled::UniqueMutexLock;
 
-/// Threads that each write their number several times.
+/// Threads that each append their letter several times.
 class Writers : public Interleavings::Program {
 public:
     explicit Writers(std::set<std::string>& texts, std::size_t count, std::size_t letters) : mTexts(texts)
@@ -45,7 +45,7 @@ private:
     std::string mText;
 };
 
-TEST(Interleavings, AreAllTried)
+TEST(Interleavings, RunsEveryOrder)
 {
     std::set<std::string> texts;
     Interleavings::Options options;
@@ -63,7 +63,7 @@ TEST(Interleavings, AreAllTried)
     EXPECT_EQ(texts.size(), 1680U); // 9! / (3! * 3! * 3!)
 }
 
-/// Threads that each add to a sum.
+/// Threads that each increment a sum.
 class Adders : public Interleavings::Program {
 public:
     explicit Adders(std::size_t count)
@@ -90,12 +90,12 @@ private:
     std::size_t mSum = 0;
 };
 
-TEST(Interleavings, GoOnOnceOnlyFromStatesThatAreTheSame)
+TEST(Interleavings, ContinuesOnceFromEqualStates)
 {
     Interleavings::Options options;
     const auto merged = Interleavings::explore<Adders>(options, 3U);
     EXPECT_THAT(merged.failure, IsEmpty());
-    EXPECT_EQ(merged.states, 5U * 5U * 5U - 1U); // five places each, but for the last state, from which nobody goes on
+    EXPECT_EQ(merged.states, 5U * 5U * 5U - 1U); // five places each, without the last state, in which all have ended
     options.merge = false;
     const auto all = Interleavings::explore<Adders>(options, 3U);
     EXPECT_EQ(all.states, merged.states);
@@ -103,7 +103,7 @@ TEST(Interleavings, GoOnOnceOnlyFromStatesThatAreTheSame)
     EXPECT_LT(merged.runs, 1000U);
 }
 
-/// Two threads add one to a number, reading it first and writing it later.
+/// Two threads increment a number in two steps: read, then write.
 class TornIncrement : public Interleavings::Program {
 public:
     explicit TornIncrement(bool locked)
@@ -126,11 +126,11 @@ public:
     void giveUp() override {}
 
 private:
-    ModelledMutex mMutex;
+    modelled::Mutex mMutex;
     int mNumber = 0;
 };
 
-TEST(Interleavings, FindALostUpdateAndTellItsStory)
+TEST(Interleavings, FindsALostUpdateAndReportsItsSteps)
 {
     const auto result = Interleavings::explore<TornIncrement>({}, false);
     EXPECT_EQ(result.failure, "an increment is lost");
@@ -138,14 +138,14 @@ TEST(Interleavings, FindALostUpdateAndTellItsStory)
                                                    "thread 0 goes on (0)", "thread 1 goes on (0)"));
 }
 
-TEST(Interleavings, AMutexKeepsThreadsApart)
+TEST(Interleavings, AMutexExcludesOtherThreads)
 {
     const auto result = Interleavings::explore<TornIncrement>({}, true);
     EXPECT_THAT(result.failure, IsEmpty());
     EXPECT_GE(result.rests, 1U);
 }
 
-/// Two threads take two mutexes.
+/// Two threads take two mutexes, in one order or in opposite orders.
 class TwoMutexes : public Interleavings::Program {
 public:
     explicit TwoMutexes(bool inOneOrder)
@@ -164,17 +164,17 @@ public:
     void giveUp() override {}
 
 private:
-    ModelledMutex mFirst;
-    ModelledMutex mSecond;
+    modelled::Mutex mFirst;
+    modelled::Mutex mSecond;
 };
 
-TEST(Interleavings, FindADeadlock)
+TEST(Interleavings, FindsADeadlock)
 {
     EXPECT_EQ(Interleavings::explore<TwoMutexes>({}, false).failure, "a thread waits for a mutex for ever");
     EXPECT_THAT(Interleavings::explore<TwoMutexes>({}, true).failure, IsEmpty());
 }
 
-/// One thread waits for what another one tells it.
+/// One thread waits until another one opens a gate.
 class Gate : public Interleavings::Program {
 public:
     enum Style { Right, LooksWithoutTheMutex, WaitsWithoutALoop, Timed };
@@ -215,32 +215,32 @@ public:
     void atRest() override
     {
         if (Interleavings::sleeps(0)) Interleavings::fail("sleeps for ever");
-        if (!Interleavings::hasEnded(1)) Interleavings::fail("the other one has not ended");
+        if (!Interleavings::hasEnded(1)) Interleavings::fail("the other thread has not ended");
     }
     void giveUp() override { mOpen = true; }
 
 private:
-    ModelledMutex mMutex;
-    ModelledConditionVariable mCondition;
+    modelled::Mutex mMutex;
+    modelled::ConditionVariable mCondition;
     bool mOpen = false;
     bool mPassed = false;
 };
 
-TEST(Interleavings, FindALostWakeup)
+TEST(Interleavings, FindsALostWakeup)
 {
     EXPECT_THAT(Interleavings::explore<Gate>({}, Gate::Right).failure, IsEmpty());
     EXPECT_EQ(Interleavings::explore<Gate>({}, Gate::LooksWithoutTheMutex).failure, "sleeps for ever");
 }
 
-TEST(Interleavings, FindALostWakeupThatIsDeliberate)
+TEST(Interleavings, FindsADeliberateFault)
 {
     Interleavings::Options options;
     options.fault = Interleavings::Fault::NotifyOneDoesNothing;
     EXPECT_EQ(Interleavings::explore<Gate>(options, Gate::Right).failure, "sleeps for ever");
-    EXPECT_THAT(Interleavings::explore<Gate>(options, Gate::Timed).failure, IsEmpty()); // its time ends it
+    EXPECT_THAT(Interleavings::explore<Gate>(options, Gate::Timed).failure, IsEmpty()); // its timeout ends the wait
 }
 
-TEST(Interleavings, FindAWaitWithoutALoopWhenSleepsEndWithoutCause)
+TEST(Interleavings, FindsAWaitWithoutALoopByASpuriousWakeup)
 {
     EXPECT_THAT(Interleavings::explore<Gate>({}, Gate::WaitsWithoutALoop).failure, IsEmpty());
     Interleavings::Options options;
@@ -284,44 +284,42 @@ public:
 
 private:
     std::set<std::string>& mOutcomes;
-    ModelledMutex mMutex;
-    ModelledConditionVariable mCondition;
+    modelled::Mutex mMutex;
+    modelled::ConditionVariable mCondition;
     int mAsleep = 0;
 };
 
-TEST(Interleavings, ANotificationWakesAnyOneOrAll)
+TEST(Interleavings, ANotificationWakesAnyThreadOrAll)
 {
     std::set<std::string> outcomes;
     EXPECT_THAT(Interleavings::explore<Sleepers>({}, std::ref(outcomes), false).failure, IsEmpty());
-    EXPECT_THAT(outcomes, testing::ElementsAre("es", "se", "ss")); // "ss": the third thread came too early
+    EXPECT_THAT(outcomes, testing::ElementsAre("es", "se", "ss")); // "ss": the third thread ran first
     outcomes.clear();
     EXPECT_THAT(Interleavings::explore<Sleepers>({}, std::ref(outcomes), true).failure, IsEmpty());
     EXPECT_THAT(outcomes, testing::ElementsAre("ee", "ss"));
 }
 
-/// An object that is destroyed by the thread that is woken.
+/// An object that the woken thread destroys.
 class Destruction : public Interleavings::Program {
 public:
-    explicit Destruction(bool waits)
+    explicit Destruction(bool notifiesWithTheMutex)
     {
         new (&mStorage) Shared;
-        threads.push_back([this] {
+        threads.push_back([this, notifiesWithTheMutex] {
             Shared& shared = pShared();
             Lock lock(shared.mutex);
             shared.open = true;
-            shared.calls.enter();
+            if (notifiesWithTheMutex) return shared.condition.notifyOne();
             lock.unlock();
             shared.condition.notifyOne();
-            shared.calls.leave();
         });
-        threads.push_back([this, waits] {
+        threads.push_back([this] {
             Shared& shared = pShared();
             {
                 Lock lock(shared.mutex);
                 while (!shared.open)
                     shared.condition.wait(lock);
             }
-            if (waits) shared.calls.wait();
             pDestroy();
         });
     }
@@ -341,9 +339,8 @@ public:
 
 private:
     struct Shared {
-        ModelledMutex mutex;
-        ModelledConditionVariable condition;
-        ModelledCallsInFlight calls;
+        modelled::Mutex mutex;
+        modelled::ConditionVariable condition;
         bool open = false;
     };
     Shared& pShared() { return *std::launder(reinterpret_cast<Shared*>(&mStorage)); }
@@ -353,20 +350,17 @@ private:
         pShared().~Shared();
     }
 
-    std::aligned_storage_t<sizeof(Shared), alignof(Shared)> mStorage; // stays when the object goes
+    std::aligned_storage_t<sizeof(Shared), alignof(Shared)> mStorage; // outlives the object
     bool mAlive = true;
 };
 
-TEST(Interleavings, FindAnObjectThatIsDestroyedTooEarly)
+TEST(Interleavings, FindsAnObjectThatIsDestroyedTooEarly)
 {
     EXPECT_THAT(Interleavings::explore<Destruction>({}, true).failure, IsEmpty());
     EXPECT_THAT(Interleavings::explore<Destruction>({}, false).failure, HasSubstr("is destroyed while"));
-    Interleavings::Options options;
-    options.fault = Interleavings::Fault::WaitZeroDoesNotWait;
-    EXPECT_THAT(Interleavings::explore<Destruction>(options, true).failure, HasSubstr("is destroyed while"));
 }
 
-/// A thread handles an exception while another one does, and both throw theirs on.
+/// Two threads handle an exception at the same time and rethrow it.
 class Exceptions : public Interleavings::Program {
 public:
     Exceptions()
@@ -381,7 +375,7 @@ public:
                         throw;
                     }
                 } catch (const std::runtime_error& error) {
-                    if (std::string(error.what()) != text) Interleavings::fail("somebody else's exception");
+                    if (std::string(error.what()) != text) Interleavings::fail("the exception of another thread");
                 }
             });
         }
@@ -391,18 +385,18 @@ public:
     void giveUp() override {}
 };
 
-TEST(Interleavings, ExceptionsStayWithTheirThreads)
+TEST(Interleavings, AnExceptionBelongsToItsThread)
 {
     const auto result = Interleavings::explore<Exceptions>({});
     EXPECT_THAT(result.failure, IsEmpty());
     EXPECT_GE(result.rests, 1U);
 }
 
-TEST(Interleavings, AProgramThatIsTooLargeIsAFailure)
+TEST(Interleavings, MoreRunsThanAllowedAreAFailure)
 {
     std::set<std::string> texts;
     Interleavings::Options options;
-    options.mostRuns = 10;
+    options.maxRuns = 10;
     EXPECT_EQ(Interleavings::explore<Writers>(options, std::ref(texts), 2U, 4U).failure, "more runs than were allowed");
 }
 

@@ -7,17 +7,17 @@
 #include <chrono>
 
 /// @file
-/// Stand-ins for the library's mutex, its locks, its condition variable and its count of calls, with the same
-/// operations, for code that is run by Interleavings.
+/// Replacements for the library's mutex, locks and condition variable, under the same names and with the same
+/// operations, for code that Interleavings runs. See tests/ModelledQueue.hpp for how code comes to use them.
 
-namespace qel {
+namespace qel::modelled {
 
-class QEL_CAPABILITY("mutex") ModelledMutex {
+class QEL_CAPABILITY("mutex") Mutex {
 public:
-    ModelledMutex() { test::Interleavings::create(this, "mutex"); }
-    ~ModelledMutex() { test::Interleavings::destroy(this); }
-    ModelledMutex(const ModelledMutex&) = delete;
-    ModelledMutex& operator=(const ModelledMutex&) = delete;
+    Mutex() { test::Interleavings::create(this, "mutex"); }
+    ~Mutex() { test::Interleavings::destroy(this); }
+    Mutex(const Mutex&) = delete;
+    Mutex& operator=(const Mutex&) = delete;
 
     void lock() QEL_ACQUIRE() QEL_NO_THREAD_SAFETY_ANALYSIS
     {
@@ -29,30 +29,26 @@ public:
     }
 };
 
-class QEL_SCOPED_CAPABILITY ModelledMutexLock {
+class QEL_SCOPED_CAPABILITY MutexLock {
 public:
-    explicit ModelledMutexLock(ModelledMutex& mutex) QEL_ACQUIRE(mutex) : mMutex(mutex) { mMutex.lock(); }
-    ~ModelledMutexLock() QEL_RELEASE() { mMutex.unlock(); }
-    ModelledMutexLock(const ModelledMutexLock&) = delete;
-    ModelledMutexLock& operator=(const ModelledMutexLock&) = delete;
+    explicit MutexLock(Mutex& mutex) QEL_ACQUIRE(mutex) : mMutex(mutex) { mMutex.lock(); }
+    ~MutexLock() QEL_RELEASE() { mMutex.unlock(); }
+    MutexLock(const MutexLock&) = delete;
+    MutexLock& operator=(const MutexLock&) = delete;
 
 private:
-    ModelledMutex& mMutex;
+    Mutex& mMutex;
 };
 
-class QEL_SCOPED_CAPABILITY ModelledUniqueMutexLock {
+class QEL_SCOPED_CAPABILITY UniqueMutexLock {
 public:
-    explicit ModelledUniqueMutexLock(ModelledMutex& mutex) QEL_ACQUIRE(mutex) QEL_NO_THREAD_SAFETY_ANALYSIS
-        : mMutex(mutex)
-    {
-        lock();
-    }
-    ~ModelledUniqueMutexLock() QEL_RELEASE() QEL_NO_THREAD_SAFETY_ANALYSIS
+    explicit UniqueMutexLock(Mutex& mutex) QEL_ACQUIRE(mutex) QEL_NO_THREAD_SAFETY_ANALYSIS : mMutex(mutex) { lock(); }
+    ~UniqueMutexLock() QEL_RELEASE() QEL_NO_THREAD_SAFETY_ANALYSIS
     {
         if (mOwns) unlock();
     }
-    ModelledUniqueMutexLock(const ModelledUniqueMutexLock&) = delete;
-    ModelledUniqueMutexLock& operator=(const ModelledUniqueMutexLock&) = delete;
+    UniqueMutexLock(const UniqueMutexLock&) = delete;
+    UniqueMutexLock& operator=(const UniqueMutexLock&) = delete;
 
     void lock() QEL_ACQUIRE() QEL_NO_THREAD_SAFETY_ANALYSIS
     {
@@ -67,23 +63,23 @@ public:
     bool ownsLock() const noexcept { return mOwns; }
 
 private:
-    friend class ModelledConditionVariable;
+    friend class ConditionVariable;
 
-    ModelledMutex& mMutex;
+    Mutex& mMutex;
     bool mOwns = false;
 };
 
-class ModelledConditionVariable {
+class ConditionVariable {
 public:
-    ModelledConditionVariable() { test::Interleavings::create(this, "condition variable"); }
-    ~ModelledConditionVariable() { test::Interleavings::destroy(this); }
-    ModelledConditionVariable(const ModelledConditionVariable&) = delete;
-    ModelledConditionVariable& operator=(const ModelledConditionVariable&) = delete;
+    ConditionVariable() { test::Interleavings::create(this, "condition variable"); }
+    ~ConditionVariable() { test::Interleavings::destroy(this); }
+    ConditionVariable(const ConditionVariable&) = delete;
+    ConditionVariable& operator=(const ConditionVariable&) = delete;
 
-    void wait(ModelledUniqueMutexLock& lock) { test::Interleavings::sleep(this, &lock.mMutex, false); }
+    void wait(UniqueMutexLock& lock) { test::Interleavings::sleep(this, &lock.mMutex, false); }
 
     template <typename Clock, typename Duration>
-    bool waitUntil(ModelledUniqueMutexLock& lock, const std::chrono::time_point<Clock, Duration>&)
+    bool waitUntil(UniqueMutexLock& lock, const std::chrono::time_point<Clock, Duration>&)
     {
         return test::Interleavings::sleep(this, &lock.mMutex, true);
     }
@@ -92,16 +88,4 @@ public:
     void notifyAll() { test::Interleavings::perform(test::Interleavings::Operation::NotifyAll, this); }
 };
 
-class ModelledCallsInFlight {
-public:
-    ModelledCallsInFlight() { test::Interleavings::create(this, "count of calls"); }
-    ~ModelledCallsInFlight() { test::Interleavings::destroy(this); }
-    ModelledCallsInFlight(const ModelledCallsInFlight&) = delete;
-    ModelledCallsInFlight& operator=(const ModelledCallsInFlight&) = delete;
-
-    void enter() { test::Interleavings::perform(test::Interleavings::Operation::Enter, this); }
-    void leave() { test::Interleavings::perform(test::Interleavings::Operation::Leave, this); }
-    void wait() const { test::Interleavings::perform(test::Interleavings::Operation::WaitZero, this); }
-};
-
-} // namespace qel
+} // namespace qel::modelled

@@ -12,12 +12,12 @@ namespace {
 
 using namespace std::chrono_literals;
 
-/// A gate that threads wait at, and what guards it.
+/// A gate at which threads wait.
 struct Gate {
     Mutex mutex;
     ConditionVariable condition;
     bool open QEL_GUARDED_BY(mutex) = false;
-    int arrived QEL_GUARDED_BY(mutex) = 0; // and asleep, once somebody else has the mutex
+    int arrived QEL_GUARDED_BY(mutex) = 0; // and asleep, once another thread has the mutex
     int passed QEL_GUARDED_BY(mutex) = 0;
 
     void pass()
@@ -86,13 +86,13 @@ TEST(ConditionVariable, MayBeNotifiedWithTheMutexHeld)
     waiter.join();
 }
 
-TEST(ConditionVariable, TellsThatATimeHasPassedAndHoldsTheMutexThen)
+TEST(ConditionVariable, ReportsATimeoutAndHoldsTheMutex)
 {
     Mutex mutex;
     ConditionVariable condition;
     UniqueMutexLock lock(mutex);
     const auto deadline = std::chrono::steady_clock::now() + 5ms;
-    while (condition.waitUntil(lock, deadline)) { // may wake without cause
+    while (condition.waitUntil(lock, deadline)) { // may wake spuriously
     }
     EXPECT_GE(std::chrono::steady_clock::now(), deadline);
     EXPECT_TRUE(lock.ownsLock());
@@ -101,7 +101,7 @@ TEST(ConditionVariable, TellsThatATimeHasPassedAndHoldsTheMutexThen)
     EXPECT_FALSE(taken);
 }
 
-TEST(ConditionVariable, IsWokenBeforeATimeHasPassed)
+TEST(ConditionVariable, IsWokenBeforeItsTimeout)
 {
     Gate gate;
     std::thread waiter([&] {
@@ -117,7 +117,7 @@ TEST(ConditionVariable, IsWokenBeforeATimeHasPassed)
     waiter.join();
 }
 
-TEST(ConditionVariable, WakingNobodyDoesNothing)
+TEST(ConditionVariable, NotifyingWithoutWaitingThreadsDoesNothing)
 {
     ConditionVariable condition;
     condition.notifyOne();

@@ -8,27 +8,27 @@
 
 namespace qel {
 
-/// Where threads wait for other threads to change what a Mutex guards: a std::condition_variable that works with
-/// UniqueMutexLock.
+/// A std::condition_variable that works with UniqueMutexLock.
 ///
-/// Waits may end without cause, as those of the standard do: wait in a loop that looks at the condition again.
+/// A wait may end spuriously: call it in a loop that checks the condition.
 /// Lifetime: must outlive every wait and every notify call.
-/// Thread safety: all waits of one time need one and the same mutex; the notify calls need none.
+/// Thread safety: any thread may call the notify functions, with or without the mutex; all threads that wait at the
+/// same time must use the same mutex.
 class ConditionVariable {
 public:
     ConditionVariable() = default;
     ConditionVariable(const ConditionVariable&) = delete;
     ConditionVariable& operator=(const ConditionVariable&) = delete;
 
-    /// Gives the mutex back, sleeps until woken, and takes the mutex again.
-    /// @param lock  holds its mutex
+    /// Releases the mutex, sleeps until woken, and takes the mutex again.
+    /// @param lock  holds its mutex, before and after
     void wait(UniqueMutexLock& lock)
     {
         const Loan loan(lock);
         mCondition.wait(*loan);
     }
 
-    /// As wait(), but no longer than until the given time.
+    /// As wait(), but not beyond the given time.
     /// @return false when the time has passed
     template <typename Clock, typename Duration>
     bool waitUntil(UniqueMutexLock& lock, const std::chrono::time_point<Clock, Duration>& deadline)
@@ -37,13 +37,13 @@ public:
         return mCondition.wait_until(*loan, deadline) == std::cv_status::no_timeout;
     }
 
-    /// Wakes one of the threads that wait, if there is one.
+    /// Wakes one of the waiting threads, if there is one.
     void notifyOne() noexcept { mCondition.notify_one(); }
-    /// Wakes all threads that wait.
+    /// Wakes all waiting threads.
     void notifyAll() noexcept { mCondition.notify_all(); }
 
 private:
-    /// Lends the mutex that a lock holds to the standard's condition variable, and takes it back still locked.
+    /// Presents the mutex that a lock holds as a std::unique_lock, and leaves it locked at the end.
     class Loan {
     public:
         explicit Loan(UniqueMutexLock& lock) : mLock(lock.mLock.mutex()->mMutex, std::adopt_lock) {}

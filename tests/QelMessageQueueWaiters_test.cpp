@@ -1,7 +1,7 @@
-// That nobody is forgotten whatever the order: QelMessageQueueModel_test.cpp.
+// The waiting threads of a queue. That no wake-up is lost in any order: QelMessageQueueModel_test.cpp.
 
+#include <qel/common/QelMessageQueue.hpp>
 #include <qel/common/util/Mutex.hpp>
-#include <qel/common/util/Waiters.hpp>
 
 #include <chrono>
 #include <gtest/gtest.h>
@@ -10,19 +10,28 @@
 #include <vector>
 
 namespace qel {
+
+/// Gives access to the private class.
+class QelMessageQueueInspector {
+public:
+    using Waiters = QelMessageQueue::Waiters;
+};
+
 namespace {
+
+using Waiters = QelMessageQueueInspector::Waiters;
 
 using namespace std::chrono_literals;
 
-class WaitersTest : public testing::Test {
+class QelMessageQueueWaiters : public testing::Test {
 protected:
-    ~WaitersTest() override
+    ~QelMessageQueueWaiters() override
     {
         for (std::thread& thread : mThreads)
             thread.join();
     }
 
-    /// Starts threads that wait for their tickets, and returns when all of them are asleep.
+    /// Starts threads that each wait for a ticket, and returns when all of them sleep.
     void startThreads(int count)
     {
         for (int i = 0; i < count; ++i) {
@@ -68,14 +77,14 @@ protected:
     std::vector<std::thread> mThreads;
 };
 
-TEST_F(WaitersTest, ThereIsNobodyToClaimAtFirst)
+TEST_F(QelMessageQueueWaiters, WithoutWaitingThreadsThereIsNothingToClaim)
 {
     EXPECT_FALSE(claimOne());
     mWaiters.wakeOne(); // does nothing
     mWaiters.wakeAll();
 }
 
-TEST_F(WaitersTest, EveryThreadIsClaimedOnce)
+TEST_F(QelMessageQueueWaiters, EachThreadIsClaimedOnce)
 {
     startThreads(2);
     EXPECT_TRUE(claimOne());
@@ -86,17 +95,17 @@ TEST_F(WaitersTest, EveryThreadIsClaimedOnce)
     mWaiters.wakeOne();
 }
 
-TEST_F(WaitersTest, AThreadThatGoesBackToSleepIsClaimedAgain)
+TEST_F(QelMessageQueueWaiters, AThreadThatGoesBackToSleepIsClaimedAgain)
 {
     startThreads(1);
     EXPECT_TRUE(claimOne());
-    mWaiters.wakeOne(); // for nothing: there is no ticket
+    mWaiters.wakeOne(); // there is no ticket
     waitUntil([this]() QEL_NO_THREAD_SAFETY_ANALYSIS { return mWaiters.claimOne(); });
     giveTickets(1);
     mWaiters.wakeOne();
 }
 
-TEST_F(WaitersTest, AllAreWokenClaimedOrNot)
+TEST_F(QelMessageQueueWaiters, WakeAllWakesClaimedAndUnclaimedThreads)
 {
     startThreads(3);
     EXPECT_TRUE(claimOne());
@@ -108,17 +117,17 @@ TEST_F(WaitersTest, AllAreWokenClaimedOrNot)
     EXPECT_FALSE(claimOne());
 }
 
-TEST_F(WaitersTest, AThreadWhoseTimeHasPassedIsNotThereAnyMore)
+TEST_F(QelMessageQueueWaiters, AThreadThatTimedOutIsNotClaimed)
 {
     UniqueMutexLock lock(mMutex);
     const auto deadline = std::chrono::steady_clock::now() + 5ms;
-    while (mWaiters.waitUntil(lock, deadline)) { // may wake without cause
+    while (mWaiters.waitUntil(lock, deadline)) { // may wake spuriously
     }
     EXPECT_GE(std::chrono::steady_clock::now(), deadline);
     EXPECT_FALSE(mWaiters.claimOne());
 }
 
-TEST_F(WaitersTest, ATimedWaitIsClaimedToo)
+TEST_F(QelMessageQueueWaiters, ATimedWaitIsClaimed)
 {
     mThreads.emplace_back([this] {
         UniqueMutexLock lock(mMutex);
@@ -135,7 +144,7 @@ TEST_F(WaitersTest, ATimedWaitIsClaimedToo)
     mWaiters.wakeOne();
 }
 
-TEST_F(WaitersTest, AreNotCopied)
+TEST_F(QelMessageQueueWaiters, AreNotCopied)
 {
     EXPECT_FALSE(std::is_copy_constructible<Waiters>::value);
     EXPECT_FALSE(std::is_copy_assignable<Waiters>::value);
