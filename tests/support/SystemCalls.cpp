@@ -11,8 +11,7 @@ namespace {
 
 thread_local SystemCalls* tCurrent = nullptr;
 
-/// @param interceptor  the sanitizer's own version of the function, when the program has one: it checks the arguments
-///                     and must not be left out
+/// @param interceptor  the version of a sanitizer, if the program has one: it checks the arguments and must be called
 template <typename Function>
 Function* realFunction(Function* interceptor, const char* name)
 {
@@ -22,15 +21,15 @@ Function* realFunction(Function* interceptor, const char* name)
     return reinterpret_cast<Function*>(symbol);
 }
 
-/// Calls the stand-in of the current thread, or else the real function.
+/// Calls the replacement of the current thread, or else the real function.
 template <typename Result, typename... Parameters>
-Result dispatch(std::function<Result(Parameters...)> SystemCalls::*standIn, Result (*real)(Parameters...),
+Result dispatch(std::function<Result(Parameters...)> SystemCalls::*replacement, Result (*real)(Parameters...),
                 Parameters... arguments)
 {
     SystemCalls* const current = tCurrent;
-    if (current == nullptr || !(current->*standIn)) return real(arguments...);
+    if (current == nullptr || !(current->*replacement)) return real(arguments...);
     tCurrent = nullptr;
-    const Result result = (current->*standIn)(arguments...);
+    const Result result = (current->*replacement)(arguments...);
     tCurrent = current;
     return result;
 }
@@ -43,8 +42,8 @@ SystemCalls::~SystemCalls() { tCurrent = mOuter; }
 
 } // namespace qel::test
 
-// The functions of the C library that this program defines itself. `__interceptor_NAME` is what the sanitizer runtimes
-// call theirs; in a program without sanitizers there is none.
+// The functions of the C library that this program defines. The sanitizer runtimes call theirs `__interceptor_NAME`; a
+// program without sanitizers has none.
 #define QEL_TEST_CALL(result, name, exceptions, parameters, ...)                                                       \
     extern "C" __attribute__((weak)) result __interceptor_##name parameters;                                           \
     extern "C" __attribute__((visibility("default"))) result name parameters exceptions                                \
@@ -60,6 +59,8 @@ QEL_TEST_CALL(int, socket, noexcept, (int family, int type, int protocol), famil
 QEL_TEST_CALL(int, connect, , (int fd, const sockaddr* address, socklen_t length), fd, address, length)
 QEL_TEST_CALL(int, bind, noexcept, (int fd, const sockaddr* address, socklen_t length), fd, address, length)
 QEL_TEST_CALL(int, accept4, , (int fd, sockaddr* address, socklen_t* length, int flags), fd, address, length, flags)
+QEL_TEST_CALL(int, getsockname, noexcept, (int fd, sockaddr* address, socklen_t* length), fd, address, length)
+QEL_TEST_CALL(int, getpeername, noexcept, (int fd, sockaddr* address, socklen_t* length), fd, address, length)
 QEL_TEST_CALL(int, getsockopt, noexcept, (int fd, int level, int name, void* value, socklen_t* length), fd, level, name,
               value, length)
 QEL_TEST_CALL(int, setsockopt, noexcept, (int fd, int level, int name, const void* value, socklen_t length), fd, level,

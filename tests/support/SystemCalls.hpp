@@ -8,14 +8,14 @@
 
 namespace qel::test {
 
-/// Stands in for system calls of the library, so that a test can make one fail, cut a transfer short, deliver a signal
-/// at an exact moment, or look at the arguments. A test program that links SystemCalls.cpp defines these functions of
-/// the C library itself; the library then calls the test program's.
+/// Replaces system calls of the library, so that a test can make one fail, shorten a transfer, deliver a signal at an
+/// exact moment, or check the arguments. A test program that links SystemCalls.cpp defines these functions of the C
+/// library, and the library then calls those.
 ///
-/// A call goes to the member of its name when that is set, otherwise to the system. A stand-in sets errno itself. While
-/// it runs it is switched off, so it may make the real call.
+/// A call goes to the member of its name if that is set, otherwise to the system. A replacement sets errno itself. It
+/// is disabled while it runs, so it may make the real call.
 ///
-/// In force for the thread that makes it, from construction to destruction; they nest.
+/// In force for the thread that constructs it, from construction to destruction. Objects nest.
 class SystemCalls {
 public:
     SystemCalls();
@@ -30,6 +30,8 @@ public:
     std::function<int(int fd, const sockaddr* address, socklen_t length)> connect;
     std::function<int(int fd, const sockaddr* address, socklen_t length)> bind;
     std::function<int(int fd, sockaddr* address, socklen_t* length, int flags)> accept4;
+    std::function<int(int fd, sockaddr* address, socklen_t* length)> getsockname;
+    std::function<int(int fd, sockaddr* address, socklen_t* length)> getpeername;
     std::function<int(int fd, int level, int name, void* value, socklen_t* length)> getsockopt;
     std::function<int(int fd, int level, int name, const void* value, socklen_t length)> setsockopt;
     std::function<int(unsigned int count, int flags)> eventfd;
