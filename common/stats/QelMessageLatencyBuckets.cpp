@@ -26,7 +26,7 @@ void QelMessageLatencyBuckets::Table::addColumn(const std::pair<std::string, con
 
 void QelMessageLatencyBuckets::Table::dump(std::ostream& os, const Indent& indent) const
 {
-    // Left alignment that leaked out would turn the 0x0000002A of a later line into 0x2A000000.
+    // Restored at the end: left alignment would turn the 0x0000002A of a later line into 0x2A000000.
     const std::ios_base::fmtflags flags = os.flags();
     os << std::left << std::setfill(' ');
 

@@ -9,7 +9,7 @@ namespace qel {
 
 namespace {
 
-/// Prints a time of day in UTC, cut to whole seconds: "2026-03-01 17:04:09".
+/// Prints a time in UTC, rounded down to seconds: "2026-03-01 17:04:09". A time that gmtime refuses prints as nothing.
 void printTime(std::ostream& os, const std::chrono::system_clock::time_point& time)
 {
     const std::time_t second = std::chrono::system_clock::to_time_t(time);
@@ -37,7 +37,7 @@ void QelMessageLatencyEvents::trace(const QelMessage& message, const std::chrono
 
 void QelMessageLatencyEvents::pBegin(const QelMessage& message, const std::chrono::nanoseconds& latency)
 {
-    // Both clocks before any change: a substitute for them may throw.
+    // Both clocks before any change: a substituted clock may throw.
     const auto systemNow = TimeProvider::system();
     const auto timeout = TimeProvider::steady() + ESCAPE_INTERVAL;
     mEntries.push(message, latency, systemNow);

@@ -14,7 +14,7 @@ void QelMessageMaxLatencyStatistics::trace(const QelMessage& message, const std:
     };
     auto entry = std::find_if(mEntries.begin(), mEntries.end(), sameKind);
     if (entry == mEntries.end()) {
-        --entry; // the list is full of other kinds: the least slow one gives way
+        --entry; // replace the least slow kind
     } else if (latency < entry->mLatency) {
         return;
     }

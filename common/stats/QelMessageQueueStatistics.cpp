@@ -18,7 +18,7 @@ void QelMessageQueueStatistics::dropped(const QelMessage& message) { mDropped +=
 void QelMessageQueueStatistics::dequeued(const QelMessage& message, const std::chrono::nanoseconds& latency)
 {
     const auto now = TimeProvider::steady();
-    mLatencyEvents.trace(message, latency); // reads clocks, so before anything is changed
+    mLatencyEvents.trace(message, latency); // reads clocks, which may throw: before any change
     mMaxLatency.trace(message, latency);
     mE2ELatencyBuckets.increment(latency, 1);
     mCompleted += message;
@@ -27,7 +27,7 @@ void QelMessageQueueStatistics::dequeued(const QelMessage& message, const std::c
     const std::chrono::nanoseconds headWait = now - mHeadReadyTime;
     mDequeueLatencyBuckets.increment(headWait, 1);
     mTotalHeadLatency += headWait;
-    mHeadReadyTime = now; // whatever comes next is at the head from now on
+    mHeadReadyTime = now; // the next message becomes the first one now
 }
 
 QelMessageThroughput QelMessageQueueStatistics::getThroughput() const noexcept

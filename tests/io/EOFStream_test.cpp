@@ -16,7 +16,7 @@ using testing::ThrowsMessage;
 
 namespace {
 
-// Asked for while the static objects of the program are still being made.
+// Called while the static objects of the program are constructed.
 EOFStream& streamBeforeMain = EOFStream::get();
 const std::size_t readBeforeMain = EOFStream::get().read(nullptr, 0);
 
@@ -38,7 +38,7 @@ TEST(EOFStream, IsTheSameObjectInEveryThread)
     EXPECT_THAT(seen, testing::Each(&EOFStream::get()));
 }
 
-TEST(EOFStream, NobodyElseMakesOrCopiesOne)
+TEST(EOFStream, CannotBeConstructedOrCopied)
 {
     EXPECT_FALSE(std::is_default_constructible<EOFStream>::value);
     EXPECT_FALSE(std::is_copy_constructible<EOFStream>::value);
@@ -47,7 +47,7 @@ TEST(EOFStream, NobodyElseMakesOrCopiesOne)
     EXPECT_TRUE((std::is_base_of<qel::Stream, EOFStream>::value));
 }
 
-TEST(EOFStream, ReadsZeroBytesWhateverTheRoomAndLeavesTheBufferAlone)
+TEST(EOFStream, ReadsZeroBytesAndLeavesTheBufferUnchanged)
 {
     char buffer[4] = {'a', 'b', 'c', 'd'};
     EXPECT_EQ(EOFStream::get().read(buffer, sizeof(buffer)), 0U);
@@ -58,7 +58,7 @@ TEST(EOFStream, ReadsZeroBytesWhateverTheRoomAndLeavesTheBufferAlone)
 
 TEST(EOFStream, ReadsZeroBytesBeforeMainBegins) { EXPECT_EQ(readBeforeMain, 0U); }
 
-TEST(EOFStream, FillingEndsAtOnce)
+TEST(EOFStream, FillThrowsAtOnce)
 {
     char buffer[1];
     EXPECT_THAT([&] { EOFStream::get().fill(buffer, 1); }, ThrowsMessage<StreamIOException>(StrEq("EOF")));
@@ -85,7 +85,7 @@ TEST(EOFStream, IgnoresDeadlines)
     EXPECT_NO_THROW(stream.clearWriteDeadline());
 }
 
-TEST(EOFStream, ClosingChangesNothing)
+TEST(EOFStream, CloseHasNoEffect)
 {
     EOFStream::get().close();
     EOFStream::get().close();

@@ -61,7 +61,7 @@ void putLength(Bytes& frame, std::uint32_t length)
         frame[4 + i] = static_cast<char>(length >> (24 - 8 * i));
 }
 
-// The first 8 bytes of a frame that says it has `length` bytes.
+// The first 8 bytes of a frame whose length field is `length`.
 Bytes prefixOf(std::uint32_t length)
 {
     Bytes prefix = bytes({0xDE, 0xCA, 0xFF, 0x20, 0, 0, 0, 0});
@@ -69,7 +69,8 @@ Bytes prefixOf(std::uint32_t length)
     return prefix;
 }
 
-// A correct frame with a 32-byte header, of a function that nobody registers; the payload counts 0, 1, 2 ... 255, 0 ...
+// A correct frame with a 32-byte header, of a function without a registration; the payload counts 0, 1, 2 ... 255, 0
+// ...
 Bytes frameOf(std::size_t length)
 {
     Bytes frame = bytes({0xDE, 0xCA, 0xFF, 0x20, 0, 0, 0, 0, 0x11, 0x22, 0x33, 0x44, 0x7F, 0x01, 0x80, 0,
@@ -112,7 +113,7 @@ protected:
 using QelMessageStreamRead = QelMessageStreamTest;
 using QelMessageStreamWrite = QelMessageStreamTest;
 
-TEST_F(QelMessageStreamRead, ReturnsTheFrameThatIsThere)
+TEST_F(QelMessageStreamRead, ReturnsAFrame)
 {
     mStream.deliver(frameOf(100));
     const std::unique_ptr<QelMessage> message = mMessages.read();
@@ -135,7 +136,7 @@ TEST_F(QelMessageStreamRead, AsksTheRegistryForTheType)
     EXPECT_EQ(hexOf(*plain), hex(upgradeFrame()));
 }
 
-TEST_F(QelMessageStreamRead, HandsTheWholeFrameToTheFactoryOnce)
+TEST_F(QelMessageStreamRead, PassesTheWholeFrameToTheFactoryOnce)
 {
     std::vector<std::string> seen;
     QelMessageRegistry registry{
@@ -156,7 +157,7 @@ TEST_F(QelMessageStreamRead, FillsTheFirstEightBytesThenTheRest)
     EXPECT_THAT(mStream.reads(), ElementsAre(8U, 92U));
 }
 
-TEST_F(QelMessageStreamRead, TakesAFrameWithAnOldHeaderInAFillOf8AndOneOf32)
+TEST_F(QelMessageStreamRead, ReadsAFrameWithAnOldHeaderInAFillOf8AndOneOf32)
 {
     mStream.deliver(oldFrame());
     const std::unique_ptr<QelMessage> message = mMessages.read();
@@ -166,7 +167,7 @@ TEST_F(QelMessageStreamRead, TakesAFrameWithAnOldHeaderInAFillOf8AndOneOf32)
     EXPECT_EQ(mStream.bytesRead(), 40U);
 }
 
-TEST_F(QelMessageStreamRead, TakesNoByteOfTheNextFrame)
+TEST_F(QelMessageStreamRead, ReadsNoByteOfTheNextFrame)
 {
     Bytes both = frameOf(50);
     const Bytes second = frameOf(33);
@@ -179,7 +180,7 @@ TEST_F(QelMessageStreamRead, TakesNoByteOfTheNextFrame)
     EXPECT_EQ(mStream.bytesLeft(), 0U);
 }
 
-TEST_F(QelMessageStreamRead, TakesBytesAsTheyComeOneByOne)
+TEST_F(QelMessageStreamRead, ReadsAFrameThatArrivesByteByByte)
 {
     mStream.deliverOneByOne(frameOf(100)).deliverOneByOne(oldFrame()).deliverOneByOne(frameOf(32));
     EXPECT_EQ(hexOf(*mMessages.read()), hex(frameOf(100)));
@@ -189,7 +190,7 @@ TEST_F(QelMessageStreamRead, TakesBytesAsTheyComeOneByOne)
     EXPECT_EQ(hexOf(*mMessages.read()), hex(frameOf(32)));
 }
 
-TEST_F(QelMessageStreamRead, TakesAFrameCutIntoTwoAtEveryPlace)
+TEST_F(QelMessageStreamRead, ReadsAFrameSplitInTwoAtEveryByte)
 {
     const Bytes frame = frameOf(64);
     for (std::size_t cut = 1; cut < frame.size(); ++cut) {
@@ -203,7 +204,7 @@ TEST_F(QelMessageStreamRead, TakesAFrameCutIntoTwoAtEveryPlace)
 TEST_F(QelMessageStreamRead, EndOfStreamAtEveryByteIsEOF)
 {
     const Bytes frame = frameOf(64);
-    for (std::size_t there = 0; there < frame.size(); ++there) { // 0: a clean end, told by the same text
+    for (std::size_t there = 0; there < frame.size(); ++there) { // 0: end between two frames, with the same text
         SCOPED_TRACE(there);
         ScriptedStream stream;
         if (there > 0) stream.deliver({frame.begin(), frame.begin() + static_cast<Bytes::difference_type>(there)});
@@ -215,7 +216,7 @@ TEST_F(QelMessageStreamRead, EndOfStreamAtEveryByteIsEOF)
     EXPECT_THAT(mLog.lines(), IsEmpty());
 }
 
-TEST_F(QelMessageStreamRead, FailureAtEveryBytePassesUnchangedAndNothingIsKept)
+TEST_F(QelMessageStreamRead, FailureAtEveryBytePassesUnchangedAndNoPartIsKept)
 {
     const Bytes frame = frameOf(64);
     for (const char* text : {"the cable is out", "I/O deadline"}) {
@@ -225,7 +226,7 @@ TEST_F(QelMessageStreamRead, FailureAtEveryBytePassesUnchangedAndNothingIsKept)
             mStream.fail(text);
             const std::size_t readsBefore = mStream.reads().size();
             EXPECT_THAT([&] { mMessages.read(); }, ThrowsMessage<StreamIOException>(StrEq(text)));
-            EXPECT_LE(mStream.reads().size() - readsBefore, 3U); // not tried again
+            EXPECT_LE(mStream.reads().size() - readsBefore, 3U); // not retried
 
             // The next call starts with a new frame.
             mStream.deliver(frameOf(40));
@@ -263,7 +264,7 @@ TEST_F(QelMessageStreamRead, NestedCauseOfTheStreamReachesTheCaller)
     EXPECT_TRUE(caught);
 }
 
-TEST_F(QelMessageStreamRead, LongestFrameIsTaken)
+TEST_F(QelMessageStreamRead, ReadsTheLongestFrame)
 {
     mStream.deliver(frameOf(16384));
     const std::unique_ptr<QelMessage> message = mMessages.read();
@@ -308,7 +309,7 @@ TEST_F(QelMessageStreamRead, LengthsOutsideTheLimitsAreRefusedAfterEightBytes)
     }
 }
 
-TEST_F(QelMessageStreamRead, TheFirstFourBytesAreNotLookedAtBeforeTheLength)
+TEST_F(QelMessageStreamRead, ChecksTheLengthBeforeTheFirstFourBytes)
 {
     Bytes prefix(4, 'x');
     prefix.resize(8, '\0');
@@ -318,7 +319,7 @@ TEST_F(QelMessageStreamRead, TheFirstFourBytesAreNotLookedAtBeforeTheLength)
                 ElementsAre("E: QEL message stream cannot deserialize message: invalid message length 0"));
 }
 
-TEST_F(QelMessageStreamRead, BadEyecatcherIsFoundWhenTheFrameIsThereAndTheStreamStaysInStep)
+TEST_F(QelMessageStreamRead, RefusesABadEyecatcherAfterTheWholeFrameAndStaysInStep)
 {
     Bytes bad = frameOf(40);
     bad[0] = 'x';
@@ -367,7 +368,7 @@ TEST_F(QelMessageStreamRead, OtherExceptionsOfAFactoryPassUnchanged)
     EXPECT_THROW(messages.read(), std::bad_alloc);
 }
 
-// A stream over one block of bytes that takes nothing from the heap.
+// A stream over one block of bytes that does not allocate.
 class BlockStream : public Stream {
 public:
     explicit BlockStream(const Bytes& block) : mBlock(block) {}
@@ -387,7 +388,7 @@ private:
     std::size_t mOffset = 0;
 };
 
-TEST_F(QelMessageStreamRead, AFrameTakesOneBlockForTheObjectAndOneForItsBytes)
+TEST_F(QelMessageStreamRead, AllocatesTheObjectAndItsBytesOnly)
 {
     QEL_TEST_NEEDS_ALLOCATIONS();
     const Bytes plainFrame = frameOf(16384);
@@ -437,7 +438,7 @@ TEST_F(QelMessageStreamWrite, FramesFollowEachOtherBackToBack)
     EXPECT_EQ(hex(mStream.written()), hexOf(first) + hexOf(second));
 }
 
-TEST_F(QelMessageStreamWrite, TakesNothingFromTheHeap)
+TEST_F(QelMessageStreamWrite, DoesNotAllocate)
 {
     QEL_TEST_NEEDS_ALLOCATIONS();
     const Bytes nothing;
@@ -450,16 +451,16 @@ TEST_F(QelMessageStreamWrite, TakesNothingFromTheHeap)
     EXPECT_EQ(stream.mWritten, 32U);
 }
 
-TEST_F(QelMessageStreamWrite, FailureAtEveryBytePassesUnchangedAndIsNotTriedAgain)
+TEST_F(QelMessageStreamWrite, FailureAtEveryBytePassesUnchangedAndIsNotRetried)
 {
     const Bytes frame = upgradeFrame();
     const QelMessage message(frame.data(), static_cast<unsigned int>(frame.size()));
     for (std::size_t position = 0; position < frame.size(); ++position) {
         SCOPED_TRACE(position);
         ScriptedStream stream;
-        stream.failWriteAt(position, "nobody listens");
+        stream.failWriteAt(position, "the peer is gone");
         QelMessageStream messages(stream, mRegistry);
-        EXPECT_THAT([&] { messages.write(message); }, ThrowsMessage<StreamIOException>(StrEq("nobody listens")));
+        EXPECT_THAT([&] { messages.write(message); }, ThrowsMessage<StreamIOException>(StrEq("the peer is gone")));
         EXPECT_THAT(stream.writes(), SizeIs(1));
         EXPECT_EQ(hex(stream.written()), hex(frame.data(), position));
     }
@@ -491,7 +492,7 @@ TEST_F(QelMessageStreamTest, WhatWasWrittenIsReadBack)
     EXPECT_EQ(hexOf(*mMessages.read()), hexOf(message));
 }
 
-TEST_F(QelMessageStreamTest, LeavesTheStreamOpenAndItsDeadlinesAlone)
+TEST_F(QelMessageStreamTest, LeavesTheStreamOpenAndItsDeadlinesUnchanged)
 {
     mStream.deliver(frameOf(40));
     {
@@ -538,7 +539,7 @@ private:
     int mFd;
 };
 
-TEST(QelMessageStreamThreads, OneReaderAndOneWriterWorkAtOnceOnEachEnd)
+TEST(QelMessageStreamThreads, AReaderAndAWriterWorkAtOnceOnEachSide)
 {
     int fds[2];
     ASSERT_EQ(::socketpair(AF_UNIX, SOCK_STREAM, 0, fds), 0);

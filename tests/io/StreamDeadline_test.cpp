@@ -45,7 +45,7 @@ TEST_F(StreamDeadlineTest, ConstantsHaveTheirValues)
     EXPECT_EQ(StreamDeadline::NoDeadline, steady_point::max());
 }
 
-TEST_F(StreamDeadlineTest, IsAValueThatMillisecondsAreAssignedToButNotConvertedInto)
+TEST_F(StreamDeadlineTest, IsAssignedFromMillisecondsButNotConverted)
 {
     EXPECT_TRUE(std::is_copy_constructible<StreamDeadline>::value);
     EXPECT_TRUE(std::is_copy_assignable<StreamDeadline>::value);
@@ -55,7 +55,7 @@ TEST_F(StreamDeadlineTest, IsAValueThatMillisecondsAreAssignedToButNotConvertedI
     EXPECT_FALSE((std::is_convertible<milliseconds, StreamDeadline>::value));
 }
 
-TEST_F(StreamDeadlineTest, WithoutTimeoutWaitsForEverAndNeverLooksAtTheClock)
+TEST_F(StreamDeadlineTest, WithoutTimeoutWaitsWithoutLimitAndDoesNotReadTheClock)
 {
     StreamDeadline deadline;
     EXPECT_EQ(timeout(deadline), -1);
@@ -73,7 +73,7 @@ TEST_F(StreamDeadlineTest, ConstructedWithATimeoutHasItPending)
     EXPECT_EQ(timeout(deadline), 70);
 }
 
-TEST_F(StreamDeadlineTest, TimeStartsToRunAtTheFirstCallNotWhenItWasSet)
+TEST_F(StreamDeadlineTest, TimeStartsAtTheFirstCallNotWhenItWasSet)
 {
     StreamDeadline deadline;
     deadline.setDeadline(100ms);
@@ -81,7 +81,7 @@ TEST_F(StreamDeadlineTest, TimeStartsToRunAtTheFirstCallNotWhenItWasSet)
     EXPECT_EQ(timeout(deadline), 100);
 }
 
-TEST_F(StreamDeadlineTest, LaterCallsGetTheRemainderUntilTheDeadlineHasPassed)
+TEST_F(StreamDeadlineTest, LaterCallsReturnTheTimeLeftUntilTheDeadlineHasPassed)
 {
     StreamDeadline deadline;
     deadline.setDeadline(100ms);
@@ -90,7 +90,7 @@ TEST_F(StreamDeadlineTest, LaterCallsGetTheRemainderUntilTheDeadlineHasPassed)
     EXPECT_EQ(timeout(deadline), 80);
     mClock.advance(30ms);
     EXPECT_EQ(timeout(deadline), 50);
-    mClock.advance(50ms); // exactly now is not yet over
+    mClock.advance(50ms); // exactly at the deadline it has not passed
     EXPECT_EQ(timeout(deadline), 0);
     EXPECT_EQ(timeout(deadline), 0);
     mClock.advance(1ns);
@@ -110,7 +110,7 @@ TEST_F(StreamDeadlineTest, EachCallThatHasATimeoutReadsTheClockOnce)
     EXPECT_EQ(mClock.steadyReads(), 2U);
 }
 
-TEST_F(StreamDeadlineTest, RemainderIsCutToWholeMilliseconds)
+TEST_F(StreamDeadlineTest, TimeLeftIsRoundedDownToMilliseconds)
 {
     struct Row {
         nanoseconds passed;
@@ -160,17 +160,17 @@ TEST_F(StreamDeadlineTest, NegativeTimeoutClearsADeadlineThatHasPassed)
     EXPECT_EQ(timeout(deadline), -1);
 }
 
-TEST_F(StreamDeadlineTest, ZeroPollsOnceAndFailsOnceTheClockHasMoved)
+TEST_F(StreamDeadlineTest, ZeroPollsOnceAndThrowsWhenTheClockHasAdvanced)
 {
     StreamDeadline deadline;
     deadline.setDeadline(0ms);
     EXPECT_EQ(timeout(deadline), 0);
-    EXPECT_EQ(timeout(deadline), 0); // the clock stands still
+    EXPECT_EQ(timeout(deadline), 0); // the clock does not advance
     mClock.advance(1ns);
     expectExpired(deadline);
 }
 
-TEST_F(StreamDeadlineTest, NewTimeoutTakesTheNextCallAlsoAfterTheOldDeadlineHasPassed)
+TEST_F(StreamDeadlineTest, ANewTimeoutAppliesAfterTheOldDeadlineHasPassed)
 {
     StreamDeadline deadline(100ms);
     deadline.getEffectiveTimeout();
@@ -192,7 +192,7 @@ TEST_F(StreamDeadlineTest, LastTimeoutSetIsTheOneThatStarts)
     expectExpired(deadline);
 }
 
-TEST_F(StreamDeadlineTest, AssigningMillisecondsIsSettingThem)
+TEST_F(StreamDeadlineTest, AssigningMillisecondsSetsTheDeadline)
 {
     StreamDeadline deadline;
     EXPECT_EQ(&(deadline = 100ms), &deadline);
@@ -202,11 +202,11 @@ TEST_F(StreamDeadlineTest, AssigningMillisecondsIsSettingThem)
     EXPECT_EQ(timeout(deadline), 0);
     mClock.advance(1ms);
     expectExpired(deadline);
-    deadline = -5ms; // cleared, not stored as it is
+    deadline = -5ms; // cleared, not stored
     EXPECT_EQ(timeout(deadline), -1);
 }
 
-TEST_F(StreamDeadlineTest, CopyTakesPendingTimeoutAndDeadlineAlong)
+TEST_F(StreamDeadlineTest, CopiesPendingTimeoutAndDeadline)
 {
     StreamDeadline original(100ms);
     StreamDeadline pendingCopy(original);
@@ -218,7 +218,7 @@ TEST_F(StreamDeadlineTest, CopyTakesPendingTimeoutAndDeadlineAlong)
     EXPECT_EQ(timeout(startedCopy), 40);
 }
 
-TEST_F(StreamDeadlineTest, ConstructorStoresANegativeTimeoutAsItIs)
+TEST_F(StreamDeadlineTest, ConstructorStoresANegativeTimeoutUnchanged)
 {
     StreamDeadline deadline(-5ms);
     EXPECT_EQ(timeout(deadline), -5);
@@ -226,14 +226,14 @@ TEST_F(StreamDeadlineTest, ConstructorStoresANegativeTimeoutAsItIs)
     expectExpired(deadline);
 }
 
-TEST_F(StreamDeadlineTest, ConstructedWithInfiniteWaitsForEver)
+TEST_F(StreamDeadlineTest, ConstructedWithInfiniteWaitsWithoutLimit)
 {
     StreamDeadline deadline(StreamDeadline::Infinite);
     EXPECT_EQ(timeout(deadline), -1);
     EXPECT_EQ(mClock.steadyReads(), 0U);
 }
 
-TEST_F(StreamDeadlineTest, TimeoutBeyondTheClockIsReturnedOnceAndThenThereIsNoDeadline)
+TEST_F(StreamDeadlineTest, TimeoutBeyondTheClockIsReturnedOnceAndSetsNoDeadline)
 {
     StreamDeadline deadline;
     deadline.setDeadline(milliseconds::max());
@@ -242,7 +242,7 @@ TEST_F(StreamDeadlineTest, TimeoutBeyondTheClockIsReturnedOnceAndThenThereIsNoDe
     EXPECT_EQ(timeout(deadline), -1);
 }
 
-TEST_F(StreamDeadlineTest, TimeoutThatReachesTheLastPointOfTheClockIsNoDeadline)
+TEST_F(StreamDeadlineTest, TimeoutThatEndsAtTheLastTimePointSetsNoDeadline)
 {
     mClock.setSteady(steady_point::max() - 1ms);
     StreamDeadline deadline(1ms);
@@ -250,7 +250,7 @@ TEST_F(StreamDeadlineTest, TimeoutThatReachesTheLastPointOfTheClockIsNoDeadline)
     EXPECT_EQ(timeout(deadline), -1);
 }
 
-TEST_F(StreamDeadlineTest, TimeoutThatEndsRightBeforeTheLastPointOfTheClockIsADeadline)
+TEST_F(StreamDeadlineTest, TimeoutThatEndsBeforeTheLastTimePointSetsADeadline)
 {
     mClock.setSteady(steady_point::max() - 1ms - 1ns);
     StreamDeadline deadline(1ms);
@@ -262,7 +262,7 @@ TEST_F(StreamDeadlineTest, TimeoutThatEndsRightBeforeTheLastPointOfTheClockIsADe
     expectExpired(deadline);
 }
 
-TEST_F(StreamDeadlineTest, TimeoutThatGoesRightBeyondTheLastPointOfTheClockIsNoDeadline)
+TEST_F(StreamDeadlineTest, TimeoutThatEndsAfterTheLastTimePointSetsNoDeadline)
 {
     mClock.setSteady(steady_point::max() - 1ms + 1ns);
     StreamDeadline deadline(1ms);
@@ -276,12 +276,11 @@ TEST_F(StreamDeadlineTest, LongestTimeoutUnderAClockBelowZeroDoesNotOverflow)
     StreamDeadline deadline;
     deadline.setDeadline(milliseconds::max());
     EXPECT_EQ(timeout(deadline), milliseconds::max().count());
-    // The longest timeout that fits the clock's unit is 9223372036854 ms; from the lowest point on that ends below
-    // zero.
+    // The longest timeout in nanoseconds is 9223372036854 ms; from the lowest time point it ends below zero.
     EXPECT_EQ(timeout(deadline), 9223372036854);
 }
 
-TEST_F(StreamDeadlineTest, RemainderAcrossTheWholeClockDoesNotOverflow)
+TEST_F(StreamDeadlineTest, TimeLeftAcrossTheWholeClockDoesNotOverflow)
 {
     mClock.setSteady(steady_point::max() - 2ms);
     StreamDeadline deadline(1ms);
@@ -299,7 +298,7 @@ TEST_F(StreamDeadlineTest, LowestConstructedTimeoutDoesNotOverflow)
     mClock.setSteady(steady_point::min());
     StreamDeadline atTheLowestPoint(-5ms);
     EXPECT_EQ(timeout(atTheLowestPoint), -5);
-    EXPECT_EQ(timeout(atTheLowestPoint), 0); // the deadline is the lowest point itself, which is now
+    EXPECT_EQ(timeout(atTheLowestPoint), 0); // the deadline is the lowest time point, which is now
     mClock.advance(1ns);
     expectExpired(atTheLowestPoint);
 }

@@ -34,7 +34,7 @@ namespace {
 
 std::vector<char> text(const std::string& characters) { return {characters.begin(), characters.end()}; }
 
-// A stream that implements what it must and nothing else.
+// A stream that implements only the pure virtual operations.
 class PlainStream : public Stream {
 public:
     explicit PlainStream(bool* destroyed = nullptr) : mDestroyed(destroyed) {}
@@ -52,7 +52,7 @@ private:
     bool* mDestroyed;
 };
 
-// A stream of one direction each: the interfaces can be had on their own.
+// Streams of one direction.
 class PlainInput : public InputStream {
 public:
     void close() override {}
@@ -83,8 +83,8 @@ template <typename Base, typename Derived>
 struct CanCastDown<Base, Derived, std::void_t<decltype(static_cast<Derived*>(std::declval<Base*>()))>>
     : std::true_type {};
 
-// The place of a virtual operation in its table, counted in pointers: under the C++ ABI of our platforms a pointer to a
-// virtual member function begins with the byte offset in the table (plus one on some of them).
+// The slot of a virtual operation. Under the C++ ABI of our platforms a pointer to a virtual member function begins
+// with the byte offset in the table (plus one on some platforms).
 template <typename Member>
 std::size_t slotOf(Member member)
 {
@@ -93,9 +93,9 @@ std::size_t slotOf(Member member)
     return static_cast<std::size_t>(offset) / sizeof(void*);
 }
 
-TEST(StreamInterfaces, OperationsKeepTheirOrder)
+TEST(StreamInterfaces, KeepTheOrderOfTheirVirtualOperations)
 {
-    // The destructor takes the first two places: one form destroys, the other one releases the memory as well.
+    // The destructor has the first two slots: one form destroys, the other also releases the memory.
     EXPECT_EQ(slotOf(&StreamBase::close), 2U);
     EXPECT_EQ(slotOf(&InputStream::setReadDeadline), 3U);
     EXPECT_EQ(slotOf(&InputStream::read), 4U);
@@ -133,7 +133,7 @@ TEST(StreamInterfaces, AStreamHasOneSharedBase)
     EXPECT_EQ(stream.mCloseCount, 1);
 }
 
-TEST(StreamInterfaces, TheWayDownFromTheSharedBaseIsADynamicCast)
+TEST(StreamInterfaces, ADynamicCastLeadsFromTheSharedBaseToTheStream)
 {
     EXPECT_FALSE((CanCastDown<StreamBase, InputStream>::value)); // inherited virtually
     EXPECT_FALSE((CanCastDown<StreamBase, OutputStream>::value));
@@ -182,14 +182,14 @@ TEST(StreamDefaults, DeadlinesAreNotSupported)
     }
 }
 
-TEST(StreamDefaults, ClearingADeadlineThatIsNotSupportedSaysSo)
+TEST(StreamDefaults, ClearingADeadlineThatIsNotSupportedThrows)
 {
     PlainStream stream;
     EXPECT_THAT([&] { stream.clearReadDeadline(); }, ThrowsMessage<std::invalid_argument>(StrEq("Not supported")));
     EXPECT_THAT([&] { stream.clearWriteDeadline(); }, ThrowsMessage<std::invalid_argument>(StrEq("Not supported")));
 }
 
-TEST(StreamDefaults, ClearingADeadlineSetsTheInfiniteOneOfThatDirection)
+TEST(StreamDefaults, ClearingADeadlineSetsInfiniteForItsDirection)
 {
     ScriptedStream stream;
     stream.clearReadDeadline();
@@ -200,7 +200,7 @@ TEST(StreamDefaults, ClearingADeadlineSetsTheInfiniteOneOfThatDirection)
     EXPECT_THAT(stream.writeDeadlines(), ElementsAre(StreamDeadline::Infinite));
 }
 
-TEST(StreamDefaults, ClearingADeadlineIsNotForStreamsToReplace)
+TEST(StreamDefaults, ClearingADeadlineIsNotVirtual)
 {
     class Replacing : public ScriptedStream {
     public:
@@ -216,7 +216,7 @@ TEST(StreamDefaults, ClearingADeadlineIsNotForStreamsToReplace)
     EXPECT_THAT(stream.writeDeadlines(), ElementsAre(StreamDeadline::Infinite));
 }
 
-TEST(StreamFill, TakesOneReadWhenEverythingIsThere)
+TEST(StreamFill, ReadsOnceWhenAllBytesHaveArrived)
 {
     ScriptedStream stream;
     stream.deliver(text("12345678"));
@@ -226,7 +226,7 @@ TEST(StreamFill, TakesOneReadWhenEverythingIsThere)
     EXPECT_THAT(stream.reads(), ElementsAre(8U));
 }
 
-TEST(StreamFill, ReadsTheRemainderUntilEverythingHasArrived)
+TEST(StreamFill, ReadsTheRestUntilAllBytesHaveArrived)
 {
     ScriptedStream stream;
     stream.deliver(text("123")).deliver(text("4")).deliver(text("5678"));
@@ -236,7 +236,7 @@ TEST(StreamFill, ReadsTheRemainderUntilEverythingHasArrived)
     EXPECT_THAT(stream.reads(), ElementsAre(8U, 5U, 4U));
 }
 
-TEST(StreamFill, TakesNoMoreThanWasAskedFor)
+TEST(StreamFill, ReadsNoMoreThanTheLength)
 {
     ScriptedStream stream;
     stream.deliver(text("12345678abc"));
@@ -261,7 +261,7 @@ TEST(StreamFill, EndOfStreamBeforeTheLastByteIsEOF)
     }
 }
 
-TEST(StreamFill, EndOfStreamRightBehindTheLastByteIsNotSeen)
+TEST(StreamFill, DoesNotReachAnEndOfStreamAfterTheLastByte)
 {
     ScriptedStream stream;
     stream.deliver(text("12345678")).end();
@@ -269,7 +269,7 @@ TEST(StreamFill, EndOfStreamRightBehindTheLastByteIsNotSeen)
     EXPECT_NO_THROW(stream.fill(buffer, sizeof(buffer)));
 }
 
-TEST(StreamFill, OfNothingReturnsWithoutAnyRead)
+TEST(StreamFill, LengthZeroReturnsWithoutARead)
 {
     CountingInput input;
     EXPECT_NO_THROW(input.fill(nullptr, 0));
@@ -285,7 +285,7 @@ TEST(StreamFill, PassesFailuresOfTheStreamUnchanged)
                 ThrowsMessage<StreamIOException>(StrEq("the cable is out")));
 }
 
-TEST(StreamIOExceptionTest, IsARuntimeErrorWithTheTextGiven)
+TEST(StreamIOExceptionTest, IsARuntimeErrorWithTheGivenText)
 {
     EXPECT_TRUE((std::is_base_of<std::runtime_error, StreamIOException>::value));
     EXPECT_STREQ(StreamIOException("EOF").what(), "EOF");

@@ -59,7 +59,7 @@ TEST(IPAddress, AssignmentChangesTheFamily)
     EXPECT_EQ(copy, address);
 }
 
-TEST(IPAddress, TheOtherFamilyIsNotGivenOut)
+TEST(IPAddress, RefusesToReturnTheOtherFamily)
 {
     EXPECT_THAT([] { IPAddress(kIPv4).getIPv6(); }, ThrowsMessage<std::invalid_argument>(StrEq("family")));
     EXPECT_THAT([] { IPAddress(kIPv6).getIPv4(); }, ThrowsMessage<std::invalid_argument>(StrEq("family")));
@@ -94,7 +94,7 @@ TEST(IPAddress, TooFewBytesAreRefusedAndNotRead)
                 ThrowsMessage<std::invalid_argument>(StrEq("length")));
 }
 
-TEST(IPAddress, OtherFamiliesAreRefusedBeforeTheLengthIsLookedAt)
+TEST(IPAddress, OtherFamiliesAreRefusedBeforeTheLengthIsChecked)
 {
     for (const int family : {-1, 0, 2, 5, 7, 10}) {
         SCOPED_TRACE(family);
@@ -103,13 +103,13 @@ TEST(IPAddress, OtherFamiliesAreRefusedBeforeTheLengthIsLookedAt)
     }
 }
 
-TEST(IPAddress, NoBytesAtAllAreRefused)
+TEST(IPAddress, ANullPointerIsRefused)
 {
     EXPECT_THAT([] { IPAddress(IPFamily::IPv4, nullptr, 4); }, ThrowsMessage<std::invalid_argument>(StrEq("bytes")));
     EXPECT_THAT([] { IPAddress(IPFamily::IPv6, nullptr, 16); }, ThrowsMessage<std::invalid_argument>(StrEq("bytes")));
 }
 
-TEST(IPAddress, OrderIsByFamilyThenByAddress)
+TEST(IPAddress, OrdersByFamilyThenByAddress)
 {
     const IPAddress addresses[] = {
         IPv4Address::ZERO, kIPv4, IPv4Address{255, 255, 255, 255}, IPv6Address::ZERO, IPv6Address{1, 0},
@@ -131,7 +131,7 @@ TEST(IPAddress, OrderIsByFamilyThenByAddress)
     }
 }
 
-TEST(IPAddress, ComparesWithAddressesOfOneFamily)
+TEST(IPAddress, ComparesWithAddressesOfAFixedFamily)
 {
     EXPECT_TRUE(IPAddress(kIPv4) == kIPv4);
     EXPECT_TRUE(IPAddress(kIPv6) != kIPv4);

@@ -6,7 +6,7 @@
 namespace qel {
 namespace {
 
-TEST(IPConnectionInfo, HoldsBothEnds)
+TEST(IPConnectionInfo, HoldsBothEndpoints)
 {
     const IPEndpoint client("10.0.0.2:40000");
     const IPEndpoint server("[::1]:443");
@@ -22,7 +22,7 @@ TEST(IPConnectionInfo, PrintsClientThenServer)
     EXPECT_EQ(os.str(), "[10.0.0.2:40000 -> 10.0.0.1:80]");
 }
 
-TEST(IPConnectionInfo, PrintsIPv6EndsInTheirBrackets)
+TEST(IPConnectionInfo, PrintsIPv6EndpointsInBrackets)
 {
     std::ostringstream os;
     os << IPConnectionInfo(IPEndpoint("[fe80::2]:40000"), IPEndpoint("[::1]:80"));

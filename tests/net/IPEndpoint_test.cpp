@@ -78,7 +78,7 @@ struct BadText {
     const char* message;
 };
 
-TEST(IPEndpoint, TextThatIsNoEndpointIsRefused)
+TEST(IPEndpoint, RefusesOtherText)
 {
     const BadText rows[] = {
         {"", "No port delimiter"},
@@ -92,7 +92,7 @@ TEST(IPEndpoint, TextThatIsNoEndpointIsRefused)
         {"1.2.3.4:0x50", "Invalid character in port"},
         {"1.2.3.4:\xB2", "Invalid character in port"},
         {"[::1]", "Invalid character in port"},  // the last colon is inside the brackets
-        {"foo:8o", "Invalid character in port"}, // the port is judged before the host
+        {"foo:8o", "Invalid character in port"}, // the port is checked before the host
         {"::1:80", "IPv6 address is not contained in brackets"},
         {"::1", "IPv6 address is not contained in brackets"},
         {"fe80::1", "IPv6 address is not contained in brackets"},
@@ -118,14 +118,14 @@ TEST(IPEndpoint, TextThatIsNoEndpointIsRefused)
     }
 }
 
-TEST(IPEndpoint, AnEmptyPortFailsInTheConversion)
+TEST(IPEndpoint, RefusesAnEmptyPort)
 {
     EXPECT_THROW(IPEndpoint("1.2.3.4:"), std::invalid_argument);
     EXPECT_THROW(IPEndpoint(":"), std::invalid_argument);
     EXPECT_THROW(IPEndpoint("[::1]:"), std::invalid_argument);
 }
 
-TEST(IPEndpoint, TooLargeAPortIsOutOfRange)
+TEST(IPEndpoint, RefusesAPortAbove65535)
 {
     for (const char* text : {"1.2.3.4:65536", "1.2.3.4:4294967296", "1.2.3.4:4294967376",
                              "1.2.3.4:18446744073709551616", "1.2.3.4:99999999999999999999999999", "foo:70000"}) {
@@ -135,14 +135,14 @@ TEST(IPEndpoint, TooLargeAPortIsOutOfRange)
     }
 }
 
-TEST(IPEndpoint, TextWithANulByteIsRefused)
+TEST(IPEndpoint, RefusesTextWithANulByte)
 {
     EXPECT_THROW(IPEndpoint(std::string("1.2.3.4\0:80", 11)), std::invalid_argument);
     EXPECT_THROW(IPEndpoint(std::string("1.2.3.4:80\0", 11)), std::invalid_argument);
     EXPECT_THROW(IPEndpoint(std::string("[::1\0]:80", 9)), std::invalid_argument);
 }
 
-TEST(IPEndpoint, PrintsInDecimalWhateverTheStreamIsSetTo)
+TEST(IPEndpoint, PrintsInDecimalInAnyStateOfTheStream)
 {
     std::ostringstream os;
     os << std::hex << std::showbase << IPEndpoint("1.2.3.4:8080") << ' ' << IPEndpoint("[::1]:8080");
@@ -161,7 +161,7 @@ TEST(IPEndpoint, PrintsWithoutTheDigitGroupsOfALocale)
     EXPECT_EQ(os.str(), "8,080 1.2.3.4:8080");
 }
 
-TEST(IPEndpoint, MakesAnIPv4SocketAddress)
+TEST(IPEndpoint, ReturnsAnIPv4SocketAddress)
 {
     const sockaddr_storage address = IPEndpoint("10.1.2.3:4660").getSockaddr();
     sockaddr_in expected{};
@@ -171,11 +171,11 @@ TEST(IPEndpoint, MakesAnIPv4SocketAddress)
     sockaddr_storage whole{};
     std::memcpy(&whole, &expected, sizeof(expected));
     EXPECT_EQ(test::hex(&address, sizeof(address)), test::hex(&whole, sizeof(whole)));
-    // The port goes out with its high byte first.
+    // The port is sent with its high byte first.
     EXPECT_EQ(test::hex(reinterpret_cast<const char*>(&address) + 2, 6), "12340A010203");
 }
 
-TEST(IPEndpoint, MakesAnIPv6SocketAddressWithoutFlowAndScope)
+TEST(IPEndpoint, ReturnsAnIPv6SocketAddressWithoutFlowAndScope)
 {
     const sockaddr_storage address = IPEndpoint("[fe80::1]:4660").getSockaddr();
     sockaddr_in6 expected{};
@@ -187,7 +187,7 @@ TEST(IPEndpoint, MakesAnIPv6SocketAddressWithoutFlowAndScope)
     EXPECT_EQ(test::hex(&address, sizeof(address)), test::hex(&whole, sizeof(whole)));
 }
 
-TEST(IPEndpoint, ComesBackFromItsSocketAddress)
+TEST(IPEndpoint, IsRestoredFromItsSocketAddress)
 {
     for (const char* text : {"0.0.0.0:0", "10.1.2.3:4660", "255.255.255.255:65535", "[::]:0", "[fe80::1]:4660",
                              "[::ffff:127.0.0.1]:255", "[ffff::ffff]:65535"}) {
@@ -197,7 +197,7 @@ TEST(IPEndpoint, ComesBackFromItsSocketAddress)
     }
 }
 
-TEST(IPEndpoint, FlowAndScopeOfASocketAddressAreNotKept)
+TEST(IPEndpoint, DropsFlowAndScopeOfASocketAddress)
 {
     sockaddr_in6 ipv6{};
     ipv6.sin6_family = AF_INET6;
@@ -210,7 +210,7 @@ TEST(IPEndpoint, FlowAndScopeOfASocketAddressAreNotKept)
     EXPECT_EQ(IPEndpoint(address), IPEndpoint("[::1]:80"));
 }
 
-TEST(IPEndpoint, SocketAddressesOfOtherFamiliesAreRefused)
+TEST(IPEndpoint, RefusesSocketAddressesOfOtherFamilies)
 {
     for (const int family : {AF_UNSPEC, AF_UNIX, AF_NETLINK, AF_PACKET}) {
         SCOPED_TRACE(family);
@@ -221,7 +221,7 @@ TEST(IPEndpoint, SocketAddressesOfOtherFamiliesAreRefused)
     }
 }
 
-TEST(IPEndpoint, OrderIsByAddressThenByPort)
+TEST(IPEndpoint, OrdersByAddressThenByPort)
 {
     const char* const texts[] = {"0.0.0.0:65535", "10.0.0.1:1", "10.0.0.1:2", "10.0.0.1:256",
                                  "10.0.0.2:0",    "[::]:0",     "[::1]:1",    "[::1]:65535"};

@@ -31,7 +31,7 @@ std::string print(IPFamily family)
     return os.str();
 }
 
-TEST(IPFamily, NumbersAreTheVersionsOfTheProtocol)
+TEST(IPFamily, ValuesAreProtocolVersions)
 {
     EXPECT_EQ(static_cast<int>(IPFamily::IPv4), 4);
     EXPECT_EQ(static_cast<int>(IPFamily::IPv6), 6);
@@ -43,7 +43,7 @@ TEST(IPFamily, ConvertsToTheFamilyOfTheSystem)
     EXPECT_EQ(IPFamilyUtils::toUNIXAddressFamily(IPFamily::IPv6), AF_INET6);
 }
 
-TEST(IPFamily, OtherValuesHaveNoFamilyOfTheSystem)
+TEST(IPFamily, RefusesToConvertOtherValues)
 {
     for (const int value : {-1, 0, 3, 5, 7, AF_INET, AF_INET6}) {
         SCOPED_TRACE(value);
@@ -52,7 +52,7 @@ TEST(IPFamily, OtherValuesHaveNoFamilyOfTheSystem)
     }
 }
 
-TEST(IPFamily, IsReadInAnyCase)
+TEST(IPFamily, ReadsAnyCase)
 {
     for (const char* text : {"ipv4", "IPV4", "IPv4", "iPv4", "  ipv4"}) {
         SCOPED_TRACE(text);
@@ -64,7 +64,7 @@ TEST(IPFamily, IsReadInAnyCase)
     }
 }
 
-TEST(IPFamily, OneWordIsReadAndTheRestLeft)
+TEST(IPFamily, ReadsOneWord)
 {
     std::istringstream is("ipv6 ipv4 rest");
     IPFamily first = kNoFamily;
@@ -76,7 +76,7 @@ TEST(IPFamily, OneWordIsReadAndTheRestLeft)
     EXPECT_EQ(rest, "rest");
 }
 
-TEST(IPFamily, AnyOtherWordIsRefused)
+TEST(IPFamily, RefusesOtherWords)
 {
     for (const char* text : {"", "   ", "ipv5", "ip4", "4", "6", "ipv", "ipv4x", "ipv44", "inet", "ipv4,"}) {
         SCOPED_TRACE(text);
@@ -84,7 +84,7 @@ TEST(IPFamily, AnyOtherWordIsRefused)
     }
 }
 
-TEST(IPFamily, ARefusedWordLeavesTheValueAsItWas)
+TEST(IPFamily, ARefusedWordLeavesTheValueUnchanged)
 {
     std::istringstream is("ipv5");
     IPFamily family = IPFamily::IPv6;
@@ -100,7 +100,7 @@ TEST(IPFamily, PrintsItsNameAndReadsItBack)
     EXPECT_EQ(readFamily(print(IPFamily::IPv6)), IPFamily::IPv6);
 }
 
-TEST(IPFamily, OtherValuesPrintAsADecimalNumberEvenOnAHexadecimalStream)
+TEST(IPFamily, PrintsOtherValuesInDecimalEvenOnAHexadecimalStream)
 {
     std::ostringstream os;
     os << std::hex << static_cast<IPFamily>(10);

@@ -14,7 +14,7 @@ using ::testing::ElementsAre;
 using ::testing::StrEq;
 using ::testing::ThrowsMessage;
 
-// Addresses that other globals use while the program starts must be ready before any code runs.
+// Other globals may use these addresses while they are constructed.
 constexpr IPv4Address kBuiltByTheCompiler{10, 1, 2, 3};
 static_assert(std::is_trivially_copyable<IPv4Address>::value && sizeof(IPv4Address) == 4, "four bytes, nothing else");
 static_assert(!std::is_convertible<std::uint32_t, IPv4Address>::value, "a number is an address only when asked");
@@ -26,7 +26,7 @@ TEST(IPv4Address, DefaultIsZero)
     EXPECT_EQ(IPv4Address::ZERO.str(), "0.0.0.0");
 }
 
-TEST(IPv4Address, KnowsItsFamily) { EXPECT_EQ(IPv4Address::Family, IPFamily::IPv4); }
+TEST(IPv4Address, ReturnsItsFamily) { EXPECT_EQ(IPv4Address::Family, IPFamily::IPv4); }
 
 TEST(IPv4Address, TakesBytesInNetworkOrder)
 {
@@ -43,12 +43,12 @@ TEST(IPv4Address, MissingTrailingBytesAreZero)
     EXPECT_EQ(IPv4Address(std::initializer_list<unsigned char>{}), IPv4Address::ZERO);
 }
 
-TEST(IPv4Address, MoreBytesThanItHasAreRefused)
+TEST(IPv4Address, RefusesTooManyBytes)
 {
     EXPECT_THAT([] { IPv4Address({1, 2, 3, 4, 5}); }, ThrowsMessage<std::invalid_argument>(StrEq("length")));
 }
 
-TEST(IPv4Address, TakesAndGivesANumberOfThisMachine)
+TEST(IPv4Address, ConvertsToAndFromAnIntegerInHostByteOrder)
 {
     EXPECT_EQ(IPv4Address(0x7F000001U).str(), "127.0.0.1");
     EXPECT_EQ(IPv4Address(1U).str(), "0.0.0.1");
@@ -75,7 +75,7 @@ TEST(IPv4Address, ParsesTheDottedForm)
     EXPECT_THAT(IPv4Address::parse("192.168.0.10").bytes(), ElementsAre(192, 168, 0, 10));
 }
 
-TEST(IPv4Address, EveryOtherTextIsRefused)
+TEST(IPv4Address, RefusesOtherText)
 {
     const char* const texts[] = {"",         " ",         "1",         "127.1",     "1.2.3",    "1.2.3.4.5",
                                  "1.2.3.",   ".1.2.3",    "256.1.1.1", "1.1.1.-1",  "01.2.3.4", "1.2.3.04",
@@ -88,13 +88,13 @@ TEST(IPv4Address, EveryOtherTextIsRefused)
     }
 }
 
-TEST(IPv4Address, ATextThatGoesOnBehindANulByteIsRefused)
+TEST(IPv4Address, RefusesTextWithANulByte)
 {
     const std::string text("1.2.3.4\0.evil", 13);
     EXPECT_THROW(IPv4Address::parse(text), std::invalid_argument);
 }
 
-TEST(IPv4Address, OrderIsThatOfTheNumbers)
+TEST(IPv4Address, OrdersNumerically)
 {
     const IPv4Address addresses[] = {IPv4Address::ZERO, {0, 0, 0, 1},   {0, 0, 1, 0},   {9, 255, 255, 255},
                                      {10, 0, 0, 0},     {127, 0, 0, 1}, {128, 0, 0, 0}, {255, 255, 255, 255}};
@@ -115,7 +115,7 @@ TEST(IPv4Address, OrderIsThatOfTheNumbers)
     }
 }
 
-TEST(IPv4Address, SubnetPrefixOfEveryMask)
+TEST(IPv4Address, ReturnsTheSubnetPrefixOfEveryMask)
 {
     for (unsigned prefix = 0; prefix <= 32; ++prefix) {
         SCOPED_TRACE(prefix);
@@ -127,7 +127,7 @@ TEST(IPv4Address, SubnetPrefixOfEveryMask)
     EXPECT_EQ(IPv4Address::parse("255.255.255.255").subnetPrefix(), 32U);
 }
 
-TEST(IPv4Address, AnAddressWithAOneBehindAZeroIsNoMask)
+TEST(IPv4Address, RefusesAMaskWithAOneAfterAZero)
 {
     for (const char* text : {"255.255.0.255", "0.0.0.1", "127.255.255.255", "255.255.255.253", "255.0.255.0", "1.0.0.0",
                              "10.0.0.1", "254.128.0.0"}) {

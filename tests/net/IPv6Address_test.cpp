@@ -16,7 +16,7 @@ using ::testing::ElementsAre;
 using ::testing::StrEq;
 using ::testing::ThrowsMessage;
 
-// Addresses that other globals use while the program starts must be ready before any code runs.
+// Other globals may use these addresses while they are constructed.
 constexpr IPv6Address kBuiltByTheCompiler{0x20, 0x01, 0x0D, 0xB8};
 static_assert(std::is_trivially_copyable<IPv6Address>::value && sizeof(IPv6Address) == 16, "16 bytes, nothing else");
 
@@ -27,7 +27,7 @@ TEST(IPv6Address, DefaultIsZero)
     EXPECT_EQ(IPv6Address::ZERO.str(), "::");
 }
 
-TEST(IPv6Address, KnowsItsFamily) { EXPECT_EQ(IPv6Address::Family, IPFamily::IPv6); }
+TEST(IPv6Address, ReturnsItsFamily) { EXPECT_EQ(IPv6Address::Family, IPFamily::IPv6); }
 
 TEST(IPv6Address, TakesBytesInNetworkOrder)
 {
@@ -44,7 +44,7 @@ TEST(IPv6Address, MissingTrailingBytesAreZero)
     EXPECT_EQ(IPv6Address(std::initializer_list<unsigned char>{}), IPv6Address::ZERO);
 }
 
-TEST(IPv6Address, MoreBytesThanItHasAreRefused)
+TEST(IPv6Address, RefusesTooManyBytes)
 {
     EXPECT_THAT(([] {
                     IPv6Address({1, 2, 3, 4, 5, 6, 7, 8, 9, 10, 11, 12, 13, 14, 15, 16, 17});
@@ -87,7 +87,7 @@ TEST(IPv6Address, ParsesTextAndPrintsItsShortestForm)
                 ElementsAre(0xFE, 0x80, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 0, 1));
 }
 
-TEST(IPv6Address, EveryOtherTextIsRefused)
+TEST(IPv6Address, RefusesOtherText)
 {
     for (const char* text :
          {"", " ", ":", ":::", "1", "1:2:3:4:5:6:7", "1:2:3:4:5:6:7:8:9", "1::2::3", "12345::", "g::", " ::1", "::1 ",
@@ -98,13 +98,13 @@ TEST(IPv6Address, EveryOtherTextIsRefused)
     }
 }
 
-TEST(IPv6Address, ATextThatGoesOnBehindANulByteIsRefused)
+TEST(IPv6Address, RefusesTextWithANulByte)
 {
     const std::string text("::1\0::", 6);
     EXPECT_THROW(IPv6Address::parse(text), std::invalid_argument);
 }
 
-TEST(IPv6Address, OrderIsThatOfTheNumbers)
+TEST(IPv6Address, OrdersNumerically)
 {
     const char* const texts[] = {
         "::", "::1", "::100", "::1:0", "1::", "7fff::", "8000::", "fe80::", "fe80::1", "ffff::"};
@@ -146,7 +146,7 @@ TEST(IPv6Address, MaskingInPlaceChangesTheLeftSideAndReturnsIt)
     EXPECT_EQ(address.str(), "2001:db8::f1");
 }
 
-TEST(IPv6Address, MaskingLeavesBothSidesOfTheBinaryFormsAlone)
+TEST(IPv6Address, MaskingDoesNotChangeItsOperands)
 {
     const IPv6Address a = IPv6Address::parse("2001::1");
     const IPv6Address b = IPv6Address::parse("::f");
@@ -177,14 +177,14 @@ TEST(IPv6Address, InterfaceAddressInvertsTheUniversalBit)
     EXPECT_THAT(address.bytes(), ElementsAre(0, 0, 0, 0, 0, 0, 0, 0, 0xFD, 0xEE, 0xDD, 0xFF, 0xFE, 0xCC, 0xBB, 0xAA));
 }
 
-TEST(IPv6Address, InterfaceAddressTakesOnlyTheFirstHalfOfThePrefix)
+TEST(IPv6Address, InterfaceAddressUsesOnlyTheFirstHalfOfThePrefix)
 {
     const IPv6Address prefix = IPv6Address::parse("2001:db8:1:2:aaaa:bbbb:cccc:dddd");
     const MACAddress mac{0x02, 0, 0, 0, 0, 0x01};
     EXPECT_EQ(IPv6Address::eui64(prefix, mac).str(), "2001:db8:1:2:0:ff:fe00:1");
 }
 
-TEST(IPv6Address, LinkLocalIsAMatterOfTheFirstTenBits)
+TEST(IPv6Address, LinkLocalDependsOnTheFirstTenBits)
 {
     for (const char* text : {"fe80::", "fe80::1", "fe81::", "febf:ffff::1"}) {
         SCOPED_TRACE(text);
@@ -196,7 +196,7 @@ TEST(IPv6Address, LinkLocalIsAMatterOfTheFirstTenBits)
     }
 }
 
-TEST(IPv6Address, IPv4MappedIsAMatterOfTheFirstTwelveBytes)
+TEST(IPv6Address, IPv4MappedDependsOnTheFirstTwelveBytes)
 {
     for (const char* text : {"::ffff:0:0", "::ffff:127.0.0.1", "::ffff:255.255.255.255"}) {
         SCOPED_TRACE(text);

@@ -47,7 +47,7 @@ TEST_P(ListenOn, AcceptsConnections)
     EXPECT_THAT(log.lines(), IsEmpty());
 }
 
-TEST_P(ListenOn, IsABlockingStreamThatDoesNotSurviveAnExec)
+TEST_P(ListenOn, IsABlockingCloseOnExecStream)
 {
     const Socket listener = listenOn(test::loopback(GetParam()), 4);
     EXPECT_EQ(intOption(listener, SOL_SOCKET, SO_TYPE), SOCK_STREAM);
@@ -63,9 +63,9 @@ TEST_P(ListenOn, PassesTheBacklogOn)
     EXPECT_EQ(test::backlogOf(listenOn(test::loopback(GetParam()), 8)), 8U);
 }
 
-TEST_P(ListenOn, TakesAPortOfWhichConnectionsStillLinger)
+TEST_P(ListenOn, BindsAPortWhoseConnectionsAreInTimeWait)
 {
-    // Keeps other programs from taking the port between the two listeners.
+    // Reserves the port between the two listeners.
     Socket holder(GetParam(), SOCK_STREAM | SOCK_CLOEXEC, 0);
     holder.setSocketOption(SOL_SOCKET, SO_REUSEADDR, 1);
     holder.bind(test::loopback(GetParam()));
@@ -83,7 +83,7 @@ TEST_P(ListenOn, TakesAPortOfWhichConnectionsStillLinger)
     EXPECT_EQ(listenOn(endpoint, 4).getSocketName(), endpoint);
 }
 
-TEST_P(ListenOn, CannotTakeAPortOnWhichAnotherListens)
+TEST_P(ListenOn, RefusesAPortOnWhichAnotherSocketListens)
 {
     CapturedLog log;
     const Socket first = listenOn(test::loopback(GetParam()), 4);
@@ -92,7 +92,7 @@ TEST_P(ListenOn, CannotTakeAPortOnWhichAnotherListens)
     EXPECT_THAT(log.lines(), ElementsAre("E: socket bind failed: 98 (Address already in use)"));
 }
 
-TEST(ListenOnIPv6, TakesOnlyIPv6ConnectionsWhateverTheSystemsDefault)
+TEST(ListenOnIPv6, AcceptsOnlyIPv6Connections)
 {
     const std::string reason = test::whyNoLoopback(IPFamily::IPv6);
     if (!reason.empty()) GTEST_SKIP() << reason;
@@ -121,7 +121,7 @@ TEST(ListenOnIPv4, SetsNoOptionOfIPv6)
     listenOn(test::loopback(), 4);
 }
 
-TEST(ListenOnAnything, CannotOpenWithoutADescriptor)
+TEST(ListenOnFailures, ThrowsWhenNoDescriptorIsLeft)
 {
     CapturedLog log;
     test::SystemCalls calls;
@@ -134,7 +134,7 @@ TEST(ListenOnAnything, CannotOpenWithoutADescriptor)
     EXPECT_THAT(log.lines(), ElementsAre("E: Cannot open socket: 24 (Too many open files)"));
 }
 
-TEST(ListenOnAnything, AnOptionThatFailsIsReported)
+TEST(ListenOnFailures, ThrowsWhenAnOptionFails)
 {
     CapturedLog log;
     test::SystemCalls calls;
@@ -147,7 +147,7 @@ TEST(ListenOnAnything, AnOptionThatFailsIsReported)
     EXPECT_THAT(log.lines(), ElementsAre("E: Failed to set socket option 1 2: 92 (Protocol not available)"));
 }
 
-TEST(ListenOnAnything, AFailedListenIsReported)
+TEST(ListenOnFailures, ThrowsWhenListenFails)
 {
     CapturedLog log(LogLevel::Info);
     // Two sockets may be bound to one port with SO_REUSEADDR, but only one of them may listen.

@@ -33,7 +33,7 @@ TEST(MACAddress, Constants)
 
 TEST(MACAddress, DefaultIsZero) { EXPECT_THAT(MACAddress().bytes(), Each(0)); }
 
-TEST(MACAddress, TheFirstByteIsInTheHighestBitsOfTheNumber)
+TEST(MACAddress, TheFirstByteIsInTheHighestBitsOfTheInteger)
 {
     EXPECT_THAT(MACAddress(0x001122334455U).bytes(), ElementsAre(0x00, 0x11, 0x22, 0x33, 0x44, 0x55));
     EXPECT_THAT(MACAddress(0xAABBCCDDEEFFU).bytes(), ElementsAre(0xAA, 0xBB, 0xCC, 0xDD, 0xEE, 0xFF));
@@ -45,7 +45,7 @@ TEST(MACAddress, BitsAboveTheLow48AreIgnored)
     EXPECT_EQ(MACAddress(0x0001000000000000U), MACAddress());
 }
 
-TEST(MACAddress, TakesExactlySixBytes)
+TEST(MACAddress, RequiresExactlySixBytes)
 {
     EXPECT_EQ((MACAddress{0xAA, 0xBB, 0xCC, 0xDD, 0xEE, 0xFF}), MACAddress(0xAABBCCDDEEFFU));
     EXPECT_THAT(([] { MACAddress({1, 2, 3, 4, 5}); }), ThrowsMessage<std::invalid_argument>(StrEq("length")));
@@ -77,7 +77,7 @@ TEST(MACAddress, LeavesTheStreamInUpperCaseHexadecimal)
     EXPECT_EQ(os.fill(), '0');
 }
 
-TEST(MACAddress, OrderIsThatOfTheBytes)
+TEST(MACAddress, OrdersByBytes)
 {
     const MACAddress small{0x00, 0xFF, 0xFF, 0xFF, 0xFF, 0xFF};
     const MACAddress large{0x01, 0x00, 0x00, 0x00, 0x00, 0x00};

@@ -42,7 +42,7 @@ TEST(QelMessageLatencyBuckets, LimitsArePowersOfTenFromOneMillisecondToTenSecond
                                              nanoseconds(1000000000), nanoseconds(10000000000)));
 }
 
-TEST(QelMessageLatencyBuckets, LabelsAreAllOfOneWidth)
+TEST(QelMessageLatencyBuckets, LabelsHaveTheSameWidth)
 {
     EXPECT_EQ(Buckets::LABEL_WIDTH, 11U);
     EXPECT_EQ(std::size(Buckets::BUCKET_LABELS), 6U);
@@ -50,7 +50,7 @@ TEST(QelMessageLatencyBuckets, LabelsAreAllOfOneWidth)
         EXPECT_EQ(std::strlen(label), Buckets::LABEL_WIDTH) << label;
 }
 
-TEST(QelMessageLatencyBuckets, BeginAtZero) { EXPECT_THAT(countsOf(Buckets()), ElementsAre(0, 0, 0, 0, 0, 0)); }
+TEST(QelMessageLatencyBuckets, StartAtZero) { EXPECT_THAT(countsOf(Buckets()), ElementsAre(0, 0, 0, 0, 0, 0)); }
 
 struct Choice {
     const char* name;
@@ -60,7 +60,7 @@ struct Choice {
 
 class QelMessageLatencyBucketChoice : public testing::TestWithParam<Choice> {};
 
-TEST_P(QelMessageLatencyBucketChoice, CountsInTheFirstBucketWhoseLimitIsNotBelow)
+TEST_P(QelMessageLatencyBucketChoice, CountsInTheFirstBucketWhoseLimitIsNotExceeded)
 {
     Buckets buckets;
     buckets.increment(GetParam().latency, 1);
@@ -131,7 +131,7 @@ TEST(QelMessageLatencyBucketsTable, WithoutColumnsPrintsLabelsOnly)
                         "\t10+s:      \n");
 }
 
-TEST(QelMessageLatencyBucketsTable, FollowsItsHistograms)
+TEST(QelMessageLatencyBucketsTable, ShowsLaterChangesOfItsHistograms)
 {
     Buckets buckets;
     Buckets::Table table;
@@ -142,8 +142,8 @@ TEST(QelMessageLatencyBucketsTable, FollowsItsHistograms)
     EXPECT_THAT(os.str(), testing::HasSubstr("\n0-1ms:      9           \n"));
 }
 
-// Formatters for hexadecimal numbers leave '0' as the fill character, upper case and the base.
-TEST(QelMessageLatencyBucketsTable, IsPaddedWithBlanksBehindAHexadecimalValue)
+// Hexadecimal formatters leave the fill character '0', upper case and the base.
+TEST(QelMessageLatencyBucketsTable, IsPaddedWithBlanksAfterAHexadecimalValue)
 {
     Buckets buckets;
     buckets.increment(nanoseconds(1), 31);

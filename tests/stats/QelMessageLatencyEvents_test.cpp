@@ -59,7 +59,7 @@ protected:
     QelMessageLatencyEvents mEvents;
 };
 
-TEST_F(QelMessageLatencyEventsTest, ThereAreNoneAtFirst)
+TEST_F(QelMessageLatencyEventsTest, IsEmptyAtFirst)
 {
     EXPECT_TRUE(mEvents.empty());
     EXPECT_EQ(printed(), "");
@@ -81,7 +81,7 @@ TEST_F(QelMessageLatencyEventsTest, FastMessagesOpenNoEvent)
     EXPECT_EQ(mClock.systemReads(), 0U);
 }
 
-TEST_F(QelMessageLatencyEventsTest, AMessageAtTheThresholdOpensOne)
+TEST_F(QelMessageLatencyEventsTest, AMessageAtTheThresholdOpensAnEvent)
 {
     trace(42, 250000000ns);
     EXPECT_FALSE(mEvents.empty());
@@ -122,7 +122,7 @@ TEST_F(QelMessageLatencyEventsTest, AnotherSlowMessageExtendsTheEvent)
                          "    Avg Latency:    317000 us\n");
 }
 
-TEST_F(QelMessageLatencyEventsTest, AMessageAtTheThresholdExtendsOneAndAnyBelowWaitsForIt)
+TEST_F(QelMessageLatencyEventsTest, AMessageAtTheThresholdExtendsAnEventAndOneBelowIsPending)
 {
     trace(1, 300ms);
     trace(2, 249999999ns);
@@ -137,7 +137,7 @@ TEST_F(QelMessageLatencyEventsTest, AMessageAtTheThresholdExtendsOneAndAnyBelowW
     EXPECT_EQ(shortForm(), "C1-4x4");
 }
 
-TEST_F(QelMessageLatencyEventsTest, FastMessagesJoinWhenASlowOneShowsThatItWentOn)
+TEST_F(QelMessageLatencyEventsTest, FastMessagesCountWhenASlowOneFollows)
 {
     trace(1, 300ms);
     trace(2, 100ms);
@@ -148,10 +148,10 @@ TEST_F(QelMessageLatencyEventsTest, FastMessagesJoinWhenASlowOneShowsThatItWentO
     EXPECT_THAT(printed(), HasSubstr("Completed:      4 (400 B)\n    Max Latency:    350000 us\n"
                                      "    Avg Latency:    250000 us\n")); // (300 + 100 + 250 + 350) / 4
     trace(5, 260ms);
-    EXPECT_EQ(shortForm(), "A1-5x5"); // they have joined once
+    EXPECT_EQ(shortForm(), "A1-5x5"); // they are counted once
 }
 
-TEST_F(QelMessageLatencyEventsTest, ClosesAtTheFirstFastMessageOfTenSecondsLater)
+TEST_F(QelMessageLatencyEventsTest, TheFirstFastMessageAfterTenSecondsClosesTheEvent)
 {
     trace(1, 300ms);
     mClock.advance(10s - 1ns);
@@ -163,7 +163,7 @@ TEST_F(QelMessageLatencyEventsTest, ClosesAtTheFirstFastMessageOfTenSecondsLater
     EXPECT_THAT(printed(), StartsWith("(C) [2024-01-02 03:04:05 - 2024-01-02 03:04:05 UTC]\n")); // nor moves its end
 }
 
-TEST_F(QelMessageLatencyEventsTest, EverySlowMessageBeginsTheTenSecondsAnew)
+TEST_F(QelMessageLatencyEventsTest, EverySlowMessageRestartsTheTenSeconds)
 {
     trace(1, 300ms);
     mClock.advance(9s);
@@ -177,7 +177,7 @@ TEST_F(QelMessageLatencyEventsTest, EverySlowMessageBeginsTheTenSecondsAnew)
     EXPECT_THAT(printed(), StartsWith("(C) [2024-01-02 03:04:05 - 2024-01-02 03:04:14 UTC]\n"));
 }
 
-TEST_F(QelMessageLatencyEventsTest, ASlowMessageAfterTenSecondsStillExtendsAnEventThatNobodyClosed)
+TEST_F(QelMessageLatencyEventsTest, ASlowMessageAfterTenSecondsExtendsAnOpenEvent)
 {
     trace(1, 300ms);
     mClock.advance(1h);
@@ -185,7 +185,7 @@ TEST_F(QelMessageLatencyEventsTest, ASlowMessageAfterTenSecondsStillExtendsAnEve
     EXPECT_EQ(shortForm(), "A1-2x2");
 }
 
-TEST_F(QelMessageLatencyEventsTest, FastMessagesAfterTheLatestSlowOneAreDroppedWhenItCloses)
+TEST_F(QelMessageLatencyEventsTest, FastMessagesAfterTheLastSlowOneAreDropped)
 {
     trace(1, 300ms);
     trace(2, 200ms);
@@ -198,7 +198,7 @@ TEST_F(QelMessageLatencyEventsTest, FastMessagesAfterTheLatestSlowOneAreDroppedW
     EXPECT_EQ(shortForm(), "A5-6x2 C1-1x1");
 }
 
-TEST_F(QelMessageLatencyEventsTest, FastMessagesOutsideAnEventBelongToNone)
+TEST_F(QelMessageLatencyEventsTest, FastMessagesOutsideAnEventAreNotCounted)
 {
     trace(1, 300ms);
     mClock.advance(10s);
@@ -221,7 +221,7 @@ TEST_F(QelMessageLatencyEventsTest, TheLastFiveArePrintedNewestFirst)
     EXPECT_EQ(shortForm(), "A7-7x1 C6-6x1 C5-5x1 C4-4x1 C3-3x1");
 }
 
-TEST_F(QelMessageLatencyEventsTest, TimesAreCutToSecondsAndTheDurationIsNot)
+TEST_F(QelMessageLatencyEventsTest, TimesAreRoundedDownToSecondsButNotTheDuration)
 {
     mClock.setSystem(system_clock::time_point(std::chrono::duration_cast<system_clock::duration>(999999999ns)));
     trace(1, 300ms);
@@ -231,7 +231,7 @@ TEST_F(QelMessageLatencyEventsTest, TimesAreCutToSecondsAndTheDurationIsNot)
                                       "    Duration:       000d:00h:00m:00.001s\n"));
 }
 
-TEST_F(QelMessageLatencyEventsTest, ADurationIsCutToMilliseconds)
+TEST_F(QelMessageLatencyEventsTest, TheDurationIsTruncatedToMilliseconds)
 {
     trace(1, 300ms);
     mClock.advance(1999999ns);
@@ -239,15 +239,15 @@ TEST_F(QelMessageLatencyEventsTest, ADurationIsCutToMilliseconds)
     EXPECT_THAT(printed(), HasSubstr("Duration:       000d:00h:00m:00.001s\n"));
 }
 
-TEST_F(QelMessageLatencyEventsTest, LatenciesAreCutToMicroseconds)
+TEST_F(QelMessageLatencyEventsTest, LatenciesAreTruncatedToMicroseconds)
 {
     trace(1, 300000999ns);
     trace(2, 300001000ns);
-    const std::string text = printed(); // the average of 300000.9995 us is cut to nanoseconds first
+    const std::string text = printed(); // the average of 300000.9995 us is truncated to nanoseconds first
     EXPECT_THAT(text, HasSubstr("Max Latency:    300001 us\n    Avg Latency:    300000 us\n"));
 }
 
-TEST_F(QelMessageLatencyEventsTest, NegativeLatenciesCountAsTheyAre)
+TEST_F(QelMessageLatencyEventsTest, NegativeLatenciesAreAdded)
 {
     trace(1, 300ms);
     trace(2, -900ms);
@@ -255,22 +255,22 @@ TEST_F(QelMessageLatencyEventsTest, NegativeLatenciesCountAsTheyAre)
     EXPECT_THAT(printed(), HasSubstr("Max Latency:    300000 us\n    Avg Latency:    -100000 us\n"));
 }
 
-TEST_F(QelMessageLatencyEventsTest, TheClocksAreReadNoMoreThanNeeded)
+TEST_F(QelMessageLatencyEventsTest, ReadsTheClocksNoMoreThanNeeded)
 {
     trace(1, 300ms); // opens: one reading of each
     EXPECT_EQ(mClock.steadyReads(), 1U);
     EXPECT_EQ(mClock.systemReads(), 1U);
-    trace(2, 1ms); // fast: may it close?
+    trace(2, 1ms); // fast: checks the timeout
     EXPECT_EQ(mClock.steadyReads(), 2U);
     EXPECT_EQ(mClock.systemReads(), 1U);
-    trace(3, 300ms); // goes on
+    trace(3, 300ms); // extends
     EXPECT_EQ(mClock.steadyReads(), 3U);
     EXPECT_EQ(mClock.systemReads(), 2U);
     mClock.advance(10s);
     trace(4, 1ms); // closes
     EXPECT_EQ(mClock.steadyReads(), 4U);
     EXPECT_EQ(mClock.systemReads(), 2U);
-    trace(5, 1ms); // there is none open
+    trace(5, 1ms); // no event is open
     EXPECT_EQ(mClock.steadyReads(), 4U);
     printed();
     EXPECT_EQ(mClock.steadyReads(), 4U);
@@ -287,11 +287,11 @@ TEST_F(QelMessageLatencyEventsTest, PrintsTheSameTwiceOnOneStream)
     EXPECT_EQ(os.str(), once + once);
 }
 
-// One event by itself.
+// A single event.
 
 using Entry = QelMessageLatencyEvents::Entry;
 
-TEST(QelMessageLatencyEventsEntry, ExtendingTakesThePendingMessagesOver)
+TEST(QelMessageLatencyEventsEntry, ExtendingAddsThePendingMessages)
 {
     const system_clock::time_point begin(0s);
     Entry entry(SizedMessage(40, 1), 300ms, begin);
@@ -330,7 +330,7 @@ TEST(QelMessageLatencyEventsEntry, TheAverageOfNoMessagesIsZero)
 {
     Entry entry(SizedMessage(40, 1), 300ms, system_clock::time_point());
     QelMessageLatencyEvents::PendingData pending;
-    pending.mCompleted.mCount = std::numeric_limits<std::uint64_t>::max() - 1; // with two more it goes round to zero
+    pending.mCompleted.mCount = std::numeric_limits<std::uint64_t>::max() - 1; // with two more it wraps to zero
     entry.extendEvent(SizedMessage(40, 1), 300ms, pending, system_clock::time_point());
     std::ostringstream os;
     entry.dump(os, Indent(0, ' '));

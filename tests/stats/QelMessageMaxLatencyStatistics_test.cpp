@@ -91,7 +91,7 @@ TEST_F(QelMessageMaxLatencyStatisticsTest, ExactlyTheThresholdEnters)
     EXPECT_EQ(shortForm(), "F1#1=250");
 }
 
-TEST_F(QelMessageMaxLatencyStatisticsTest, PrintsOneLineForEachEntryBehindTheIndent)
+TEST_F(QelMessageMaxLatencyStatisticsTest, PrintsALineForEachEntryAfterTheIndent)
 {
     mList.trace(SizedMessage(32, 42, 0x6003, 0x8001), nanoseconds(312004000));
     mList.trace(SizedMessage(32, 43, 0x6002, 0x0405), nanoseconds(312005999));
@@ -99,7 +99,7 @@ TEST_F(QelMessageMaxLatencyStatisticsTest, PrintsOneLineForEachEntryBehindTheInd
                                        "...[CID=0x0000002A FN=0x6003 OP=0x8001 T=312004us]\n");
 }
 
-TEST_F(QelMessageMaxLatencyStatisticsTest, OfNineRisingKindsTheEightWorstStayWorstFirst)
+TEST_F(QelMessageMaxLatencyStatisticsTest, KeepsTheEightWorstOfNineRisingKindsWorstFirst)
 {
     for (unsigned short function = 1; function <= 9; ++function) {
         trace(function, function, milliseconds(200 + 100 * function));
@@ -107,7 +107,7 @@ TEST_F(QelMessageMaxLatencyStatisticsTest, OfNineRisingKindsTheEightWorstStayWor
     EXPECT_EQ(shortForm(), "F9#9=1100 F8#8=1000 F7#7=900 F6#6=800 F5#5=700 F4#4=600 F3#3=500 F2#2=400");
 }
 
-TEST_F(QelMessageMaxLatencyStatisticsTest, OfNineFallingKindsTheNinthDoesNotEnter)
+TEST_F(QelMessageMaxLatencyStatisticsTest, DropsTheNinthOfNineFallingKinds)
 {
     for (unsigned short function = 1; function <= 9; ++function) {
         trace(function, function, milliseconds(2000 - 100 * function));
@@ -115,7 +115,7 @@ TEST_F(QelMessageMaxLatencyStatisticsTest, OfNineFallingKindsTheNinthDoesNotEnte
     EXPECT_EQ(shortForm(), "F1#1=1900 F2#2=1800 F3#3=1700 F4#4=1600 F5#5=1500 F6#6=1400 F7#7=1300 F8#8=1200");
 }
 
-TEST_F(QelMessageMaxLatencyStatisticsTest, AFullListTakesANewKindOnlyAboveItsLastEntry)
+TEST_F(QelMessageMaxLatencyStatisticsTest, AFullListAcceptsANewKindOnlyAboveItsLastEntry)
 {
     fill();
     trace(9, 9, milliseconds(300));
@@ -124,7 +124,7 @@ TEST_F(QelMessageMaxLatencyStatisticsTest, AFullListTakesANewKindOnlyAboveItsLas
     EXPECT_EQ(shortForm(), "F8#8=1000 F7#7=900 F6#6=800 F5#5=700 F4#4=600 F3#3=500 F2#2=400 F9#9=301");
 }
 
-TEST_F(QelMessageMaxLatencyStatisticsTest, ANewKindTakesTheLastPlaceAndMovesUpFromThere)
+TEST_F(QelMessageMaxLatencyStatisticsTest, ANewKindReplacesTheLastEntryAndMovesUp)
 {
     fill();
     trace(9, 9, milliseconds(750));
@@ -138,14 +138,14 @@ TEST_F(QelMessageMaxLatencyStatisticsTest, ASmallerLatencyOfAListedKindChangesNo
     EXPECT_EQ(shortForm(), kFull);
 }
 
-TEST_F(QelMessageMaxLatencyStatisticsTest, AnEqualLatencyOfAListedKindBringsItsCallerId)
+TEST_F(QelMessageMaxLatencyStatisticsTest, AnEqualLatencyOfAListedKindUpdatesTheCallerId)
 {
     fill();
     trace(99, 5, milliseconds(700));
     EXPECT_EQ(shortForm(), "F8#8=1000 F7#7=900 F6#6=800 F5#99=700 F4#4=600 F3#3=500 F2#2=400 F1#1=300");
 }
 
-TEST_F(QelMessageMaxLatencyStatisticsTest, AnEqualLatencyOfTheLastEntryOfAFullListBringsNothing)
+TEST_F(QelMessageMaxLatencyStatisticsTest, AnEqualLatencyOfTheLastEntryOfAFullListChangesNothing)
 {
     fill();
     trace(99, 1, milliseconds(300)); // not above the last entry, so it is not looked up
@@ -161,7 +161,7 @@ TEST_F(QelMessageMaxLatencyStatisticsTest, ALargerLatencyOfAListedKindMovesItUp)
     EXPECT_EQ(shortForm(), "F1#100=5000 F8#8=1000 F7#7=900 F2#99=850 F6#6=800 F5#5=700 F4#4=600 F3#3=500");
 }
 
-TEST_F(QelMessageMaxLatencyStatisticsTest, OfEqualLatenciesTheOlderStaysInFront)
+TEST_F(QelMessageMaxLatencyStatisticsTest, OfEqualLatenciesTheOlderComesFirst)
 {
     trace(1, 1, milliseconds(500));
     trace(2, 2, milliseconds(500));
@@ -170,7 +170,7 @@ TEST_F(QelMessageMaxLatencyStatisticsTest, OfEqualLatenciesTheOlderStaysInFront)
     EXPECT_EQ(shortForm(), "F3#3=600 F1#1=500 F2#2=500 F4#4=500");
 }
 
-TEST_F(QelMessageMaxLatencyStatisticsTest, AKindThatMovesUpGoesBehindTheEqualOnes)
+TEST_F(QelMessageMaxLatencyStatisticsTest, AKindThatMovesUpComesAfterEqualOnes)
 {
     trace(1, 1, milliseconds(500));
     trace(2, 2, milliseconds(500));
@@ -198,9 +198,9 @@ TEST_F(QelMessageMaxLatencyStatisticsTest, ARequestAndItsResponseAreOfOneKind)
     EXPECT_EQ(printed(), "[CID=0x00000002 FN=0x0005 OP=0x0006 T=501000us]\n");
 }
 
-// Deliberate oddities: an entry that is not valid ends what is printed.
+// Deliberate: printing stops at an entry that is not valid.
 
-TEST_F(QelMessageMaxLatencyStatisticsTest, AnEntryWithoutOperationInFrontHidesTheWholeList)
+TEST_F(QelMessageMaxLatencyStatisticsTest, AFirstEntryWithoutOperationHidesTheWholeList)
 {
     trace(1, 1, milliseconds(500));
     mList.trace(SizedMessage(32, 2, 7, 0), milliseconds(1000));
@@ -211,7 +211,7 @@ TEST_F(QelMessageMaxLatencyStatisticsTest, AnEntryWithoutOperationInFrontHidesTh
     EXPECT_EQ(shortForm(), "F3#3=2000");
 }
 
-TEST_F(QelMessageMaxLatencyStatisticsTest, AnEntryWithoutFunctionHidesThoseBehindIt)
+TEST_F(QelMessageMaxLatencyStatisticsTest, AnEntryWithoutFunctionHidesTheEntriesAfterIt)
 {
     trace(1, 1, milliseconds(500));
     trace(2, 2, milliseconds(300));
@@ -219,13 +219,13 @@ TEST_F(QelMessageMaxLatencyStatisticsTest, AnEntryWithoutFunctionHidesThoseBehin
     EXPECT_EQ(shortForm(), "F1#1=500");
 }
 
-TEST_F(QelMessageMaxLatencyStatisticsTest, AKindWithoutFunctionAndOperationTakesTheFirstUnusedPlace)
+TEST_F(QelMessageMaxLatencyStatisticsTest, AKindWithoutFunctionAndOperationUsesTheFirstFreeSlot)
 {
     trace(1, 1, milliseconds(500));
     mList.trace(SizedMessage(32, 2, 0, 0), milliseconds(400));
     trace(3, 3, milliseconds(300));
     EXPECT_EQ(shortForm(), "F1#1=500");
-    mList.trace(SizedMessage(32, 2, 0, 0), milliseconds(600)); // it is found again and moves up
+    mList.trace(SizedMessage(32, 2, 0, 0), milliseconds(600)); // the entry is found and moves up
     EXPECT_TRUE(mList.empty());
     trace(4, 3, milliseconds(700));
     trace(5, 1, milliseconds(650));

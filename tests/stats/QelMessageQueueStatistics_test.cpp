@@ -58,7 +58,7 @@ constexpr const char* kNothingYet = "Max Size (HWM): 0 B\n"
 
 TEST_F(QelMessageQueueStatisticsTest, AreAllZeroAtFirst) { EXPECT_EQ(dump(), kNothingYet); }
 
-TEST_F(QelMessageQueueStatisticsTest, EveryLineStandsBehindTheIndentAndNestedPartsBehindTwoMore)
+TEST_F(QelMessageQueueStatisticsTest, EveryLineIsIndentedAndNestedPartsByTwoMore)
 {
     mStatistics.enqueued(SizedMessage(32, 1), 0ns);
     mStatistics.dequeued(SizedMessage(32, 1), 300ms);
@@ -89,8 +89,8 @@ TEST_F(QelMessageQueueStatisticsTest, EveryLineStandsBehindTheIndentAndNestedPar
                                     "........Avg Latency:    300000 us\n");
 }
 
-// A working day of a queue, told to the last byte.
-TEST_F(QelMessageQueueStatisticsTest, TellTheWholeStory)
+// The complete output of a queue.
+TEST_F(QelMessageQueueStatisticsTest, PrintEverything)
 {
     const SizedMessage first(100, 1, 0x6001, 0x0001);
     const SizedMessage second(200, 2, 0x6002, 0x8405);
@@ -135,7 +135,7 @@ TEST_F(QelMessageQueueStatisticsTest, TellTheWholeStory)
                       "      Avg Latency:    997500 us\n");
 }
 
-TEST_F(QelMessageQueueStatisticsTest, PendingFollowsWhatComesAndGoes)
+TEST_F(QelMessageQueueStatisticsTest, PendingCountsMessagesInTheQueue)
 {
     EXPECT_EQ(mStatistics.getPending().mCount, 0U);
     EXPECT_EQ(mStatistics.getPending().mBytes, 0U);
@@ -148,7 +148,7 @@ TEST_F(QelMessageQueueStatisticsTest, PendingFollowsWhatComesAndGoes)
     EXPECT_EQ(mStatistics.getPending().mBytes, 50U);
 }
 
-TEST_F(QelMessageQueueStatisticsTest, TheHighWaterMarkStays)
+TEST_F(QelMessageQueueStatisticsTest, TheHighWaterMarkDoesNotFall)
 {
     mStatistics.enqueued(SizedMessage(100), 0ns);
     mStatistics.enqueued(SizedMessage(50), 0ns);
@@ -169,7 +169,7 @@ TEST_F(QelMessageQueueStatisticsTest, ADropChangesNothingElse)
     EXPECT_EQ(mClock.steadyReads(), 0U);
 }
 
-TEST_F(QelMessageQueueStatisticsTest, TheWaitAtTheHeadBeginsWhenTheOneBeforeLeaves)
+TEST_F(QelMessageQueueStatisticsTest, TheHeadWaitStartsWhenThePreviousMessageLeaves)
 {
     mStatistics.enqueued(SizedMessage(32), 0ns);
     mStatistics.enqueued(SizedMessage(32), 0ns);
@@ -181,7 +181,7 @@ TEST_F(QelMessageQueueStatisticsTest, TheWaitAtTheHeadBeginsWhenTheOneBeforeLeav
     EXPECT_THAT(dump(), HasSubstr("  10+s:       0            1            2           \n"));
 }
 
-TEST_F(QelMessageQueueStatisticsTest, TheWaitAtTheHeadBeginsAnewAfterAnEmptyTime)
+TEST_F(QelMessageQueueStatisticsTest, TheHeadWaitRestartsAfterTheQueueWasEmpty)
 {
     mStatistics.enqueued(SizedMessage(32), 0ns);
     mStatistics.dequeued(SizedMessage(32), 0ns);
@@ -202,7 +202,7 @@ TEST_F(QelMessageQueueStatisticsTest, ALaterMessageDoesNotBecomeTheHead)
     EXPECT_THAT(dump(), HasSubstr("\nHead Wait:      7 us\n"));
 }
 
-TEST_F(QelMessageQueueStatisticsTest, TheHeadWaitIsOmittedWhileNothingWaits)
+TEST_F(QelMessageQueueStatisticsTest, TheHeadWaitIsOmittedForAnEmptyQueue)
 {
     EXPECT_THAT(dump(), Not(HasSubstr("Head Wait")));
     mStatistics.enqueued(SizedMessage(32), 0ns);
@@ -211,7 +211,7 @@ TEST_F(QelMessageQueueStatisticsTest, TheHeadWaitIsOmittedWhileNothingWaits)
     EXPECT_THAT(dump(), Not(HasSubstr("Head Wait")));
 }
 
-TEST_F(QelMessageQueueStatisticsTest, TheHeadWaitIsThatOfTheMomentOfTheDump)
+TEST_F(QelMessageQueueStatisticsTest, TheHeadWaitIsMeasuredAtTheDump)
 {
     mStatistics.enqueued(SizedMessage(32), 0ns);
     mClock.advance(1234567ns);
@@ -220,17 +220,17 @@ TEST_F(QelMessageQueueStatisticsTest, TheHeadWaitIsThatOfTheMomentOfTheDump)
     EXPECT_THAT(dump(), HasSubstr("\nHead Wait:      2234 us\n"));
 }
 
-TEST_F(QelMessageQueueStatisticsTest, ThroughputIsThatOfTheTimeInWhichSomethingWaited)
+TEST_F(QelMessageQueueStatisticsTest, ThroughputIsPerSecondOfANonEmptyQueue)
 {
     mStatistics.enqueued(SizedMessage(100), 0ns);
     mClock.advance(2ms);
     mStatistics.dequeued(SizedMessage(100), 2ms);
-    mClock.advance(1h); // nothing waits
+    mClock.advance(1h); // the queue is empty
     mStatistics.enqueued(SizedMessage(50), 0ns);
     mClock.advance(1ms);
     mStatistics.dequeued(SizedMessage(50), 1ms);
     const QelMessageThroughput throughput = mStatistics.getThroughput();
-    EXPECT_EQ(throughput.mPerSecond.mCount, 666U); // 2 in 3 ms, cut
+    EXPECT_EQ(throughput.mPerSecond.mCount, 666U); // 2 in 3 ms, rounded down
     EXPECT_EQ(throughput.mPerSecond.mBytes, 50000U);
     EXPECT_THAT(dump(), HasSubstr("\nThroughput:     666 m/s (50000 B/s)\n"));
 }
@@ -242,8 +242,8 @@ TEST_F(QelMessageQueueStatisticsTest, ThroughputIsZeroBeforeAnyTimeHasPassed)
     EXPECT_EQ(toString(mStatistics.getThroughput()), "0 m/s (0 B/s)");
 }
 
-// 2^64 nanobytes are passed at 18446744073 bytes. A hundred frames that say they are 200 MB long get there.
-TEST_F(QelMessageQueueStatisticsTest, TheProductOfBytesAndNanosecondsGoesRoundOnPurpose)
+// The product exceeds 2^64 from 18446744073 bytes on. A hundred frames with a length field of 200 MB reach that.
+TEST_F(QelMessageQueueStatisticsTest, TheProductOfBytesAndNanosecondsWraps)
 {
     class Huge : public QelMessage {
     public:
@@ -273,7 +273,7 @@ TEST_F(QelMessageQueueStatisticsTest, AFullHistoryOfKindsAndEventsIsPrinted)
     EXPECT_THAT(text, HasSubstr("T=500000us]\nLatency Events:\n  (C) [2024-01-02 03:05:25 - "));
 }
 
-// Deliberate: the entry in front is not valid, so the whole block is left out, while the event is there.
+// Deliberate: the first entry is not valid, so the list is omitted; the event is printed.
 TEST_F(QelMessageQueueStatisticsTest, ASlowMessageWithoutOperationHidesTheListOfTheSlowest)
 {
     mStatistics.enqueued(SizedMessage(32, 1, 0x6003, 0), 0ns);
@@ -282,7 +282,7 @@ TEST_F(QelMessageQueueStatisticsTest, ASlowMessageWithoutOperationHidesTheListOf
     EXPECT_THAT(dump(), HasSubstr("\nLatency Events:\n  (A) "));
 }
 
-TEST_F(QelMessageQueueStatisticsTest, PrintTheSameTwiceOnOneStreamAndBehindAHexadecimalValue)
+TEST_F(QelMessageQueueStatisticsTest, PrintTheSameTwiceOnOneStreamAndAfterAHexadecimalValue)
 {
     mStatistics.enqueued(SizedMessage(100, 0xABC), 0ns);
     mStatistics.dequeued(SizedMessage(100, 0xABC), 300ms);
@@ -298,7 +298,7 @@ TEST_F(QelMessageQueueStatisticsTest, PrintTheSameTwiceOnOneStreamAndBehindAHexa
     EXPECT_EQ(os.str(), "0x0000002A");
 }
 
-TEST_F(QelMessageQueueStatisticsTest, TheClocksAreReadNoMoreThanNeeded)
+TEST_F(QelMessageQueueStatisticsTest, ReadTheClocksNoMoreThanNeeded)
 {
     mStatistics.enqueued(SizedMessage(32), 0ns); // becomes the head
     EXPECT_EQ(mClock.steadyReads(), 1U);
@@ -310,7 +310,7 @@ TEST_F(QelMessageQueueStatisticsTest, TheClocksAreReadNoMoreThanNeeded)
     mStatistics.dequeued(SizedMessage(32), 300ms); // begins an event
     EXPECT_EQ(mClock.steadyReads(), 4U);
     EXPECT_EQ(mClock.systemReads(), 1U);
-    dump(); // nothing waits
+    dump(); // the queue is empty
     EXPECT_EQ(mClock.steadyReads(), 4U);
     mStatistics.enqueued(SizedMessage(32), 0ns);
     dump();
@@ -318,7 +318,7 @@ TEST_F(QelMessageQueueStatisticsTest, TheClocksAreReadNoMoreThanNeeded)
     EXPECT_EQ(mClock.systemReads(), 1U);
 }
 
-TEST_F(QelMessageQueueStatisticsTest, UpdatesAllocateNothing)
+TEST_F(QelMessageQueueStatisticsTest, UpdatesDoNotAllocate)
 {
     QEL_TEST_NEEDS_ALLOCATIONS();
     const SizedMessage message(100, 1);
@@ -326,7 +326,7 @@ TEST_F(QelMessageQueueStatisticsTest, UpdatesAllocateNothing)
     std::size_t count = std::numeric_limits<std::size_t>::max();
     {
         const Allocations allocations;
-        for (int i = 0; i < 12; ++i) { // more events than there are places for
+        for (int i = 0; i < 12; ++i) { // more events than are kept
             mStatistics.enqueued(message, 1ms * i);
             mStatistics.enqueued(other, 1s * i);
             mStatistics.dropped(message);
@@ -342,9 +342,9 @@ TEST_F(QelMessageQueueStatisticsTest, UpdatesAllocateNothing)
     EXPECT_THAT(dump(), HasSubstr("Completed:      36 (3600 B)"));
 }
 
-// Whichever reading of the clocks fails, nothing has been counted.
+// Whichever reading of the clocks fails, nothing is counted.
 
-TEST(QelMessageQueueStatisticsFailure, AFailingClockLeavesEverythingAsItWasWhenAMessageComes)
+TEST(QelMessageQueueStatisticsFailure, AClockThatFailsInEnqueuedChangesNothing)
 {
     ThrowingClock clock;
     QelMessageQueueStatistics statistics;
@@ -353,7 +353,7 @@ TEST(QelMessageQueueStatisticsFailure, AFailingClockLeavesEverythingAsItWasWhenA
     EXPECT_EQ(dumpOf(statistics), kNothingYet);
 }
 
-TEST(QelMessageQueueStatisticsFailure, AFailingClockLeavesEverythingAsItWasWhenAMessageGoes)
+TEST(QelMessageQueueStatisticsFailure, AClockThatFailsInDequeuedChangesNothing)
 {
     ThrowingClock clock;
     QelMessageQueueStatistics statistics;

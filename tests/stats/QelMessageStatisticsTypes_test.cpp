@@ -23,14 +23,14 @@ QelMessageCount count(std::uint64_t messages, std::uint64_t bytes)
     return result;
 }
 
-TEST(QelMessageCount, BeginsAtZero)
+TEST(QelMessageCount, StartsAtZero)
 {
     const QelMessageCount counted;
     EXPECT_EQ(counted.mCount, 0U);
     EXPECT_EQ(counted.mBytes, 0U);
 }
 
-TEST(QelMessageCount, AMessageCountsAsOneAndWithItsWholeFrame)
+TEST(QelMessageCount, AddingAMessageAddsOneAndItsLength)
 {
     QelMessageCount counted;
     EXPECT_EQ(&(counted += SizedMessage(32)), &counted);
@@ -41,7 +41,7 @@ TEST(QelMessageCount, AMessageCountsAsOneAndWithItsWholeFrame)
     EXPECT_EQ(counted.mBytes, 1032U);
 }
 
-TEST(QelMessageCount, AMessageIsTakenOffAgain)
+TEST(QelMessageCount, SubtractingAMessageUndoesAddingIt)
 {
     QelMessageCount counted = count(3, 1032);
     EXPECT_EQ(&(counted -= SizedMessage(1000)), &counted);
@@ -49,7 +49,7 @@ TEST(QelMessageCount, AMessageIsTakenOffAgain)
     EXPECT_EQ(counted.mBytes, 32U);
 }
 
-TEST(QelMessageCount, GoesRoundBelowZero)
+TEST(QelMessageCount, WrapsBelowZero)
 {
     QelMessageCount counted;
     counted -= SizedMessage(32);
@@ -73,14 +73,14 @@ TEST(QelMessageCount, PrintsAll64Bits)
     EXPECT_EQ(toString(count(kMost, kMost)), "18446744073709551615 (18446744073709551615 B)");
 }
 
-TEST(QelMessageCount, PrintsInDecimalBehindAHexadecimalValue)
+TEST(QelMessageCount, PrintsInDecimalAfterAHexadecimalValue)
 {
     std::ostringstream os;
     os << hexFormat(std::uint8_t(0x1F)) << ' ' << count(31, 255);
     EXPECT_EQ(os.str(), "0x1F 31 (255 B)");
 }
 
-TEST(QelMessageThroughput, BeginsAtZero) { EXPECT_EQ(toString(QelMessageThroughput()), "0 m/s (0 B/s)"); }
+TEST(QelMessageThroughput, StartsAtZero) { EXPECT_EQ(toString(QelMessageThroughput()), "0 m/s (0 B/s)"); }
 
 TEST(QelMessageThroughput, PrintsBothRates)
 {
@@ -89,7 +89,7 @@ TEST(QelMessageThroughput, PrintsBothRates)
     EXPECT_EQ(toString(throughput), "12 m/s (3456 B/s)");
 }
 
-TEST(QelMessageLatency, BeginsAtZeroAndIsNotValid)
+TEST(QelMessageLatency, StartsAtZeroAndIsNotValid)
 {
     const QelMessageLatency latency;
     EXPECT_EQ(latency.mCallerID, 0U);
@@ -122,7 +122,7 @@ TEST(QelMessageLatency, PrintsIdentityAndMicroseconds)
     EXPECT_EQ(toString(latency), "[CID=0x0000002A FN=0x6003 OP=0x8001 T=312004us]");
 }
 
-TEST(QelMessageLatency, CutsMicrosecondsTowardsZero)
+TEST(QelMessageLatency, TruncatesToMicroseconds)
 {
     EXPECT_EQ(toString(QelMessageLatency(SizedMessage(32, 1, 2, 3), nanoseconds(999))),
               "[CID=0x00000001 FN=0x0002 OP=0x0003 T=0us]");

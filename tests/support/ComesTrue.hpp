@@ -7,8 +7,8 @@
 
 namespace qel::test {
 
-/// Waits for a condition that another process brings about, as long as anything may take.
-/// @return false: it has not come true; to be asserted
+/// Waits for a condition that another process brings about, at most for Process::kDeadline.
+/// @return whether it has come true; assert it
 template <typename F>
 [[nodiscard]] bool comesTrue(F condition)
 {

@@ -35,7 +35,7 @@ Fiber::Fiber() : mStack(new char[kStackBytes])
     ::getcontext(&mInside);
     mInside.uc_stack.ss_sp = mStack.get();
     mInside.uc_stack.ss_size = kStackBytes;
-    mInside.uc_link = nullptr; // it never ends
+    mInside.uc_link = nullptr; // the context never ends
     const auto self = reinterpret_cast<std::uintptr_t>(this);
     ::makecontext(&mInside, reinterpret_cast<void (*)()>(&Fiber::sMain), 2, static_cast<unsigned int>(self >> 32),
                   static_cast<unsigned int>(self));
@@ -63,7 +63,7 @@ void Fiber::suspend() { pSwitch(false); }
 
 void Fiber::pSwitch(bool in)
 {
-    static_assert(sizeof(Handled) == 16, "as the C++ runtime has it on this platform");
+    static_assert(sizeof(Handled) == 16, "as in the C++ runtime of this platform");
     Handled handled;
     std::memcpy(&handled, abi::__cxa_get_globals(), sizeof(handled));
     std::memcpy(abi::__cxa_get_globals(), &mHandled, sizeof(mHandled));
@@ -84,7 +84,7 @@ void Fiber::pSwitch(bool in)
         ::swapcontext(&mInside, &mOutside);
     }
 #if defined(QEL_TEST_ADDRESS_SANITIZER)
-    // Here again, from the other side, whose stack is told to us.
+    // Resumed: the sanitizer returns the stack of the other side.
     if (in) {
         __sanitizer_finish_switch_fiber(fakeStack, nullptr, nullptr);
     } else {

@@ -7,21 +7,21 @@
 
 namespace qel::test {
 
-/// A thread of control that runs only when told and stops where it chooses to; see makecontext(3). It does one job
-/// after the other. Knows the sanitizers' ways of being told about such things.
-/// Thread safety: all fibers and whoever resumes them belong to one thread.
+/// A thread of control that runs when it is resumed, until it suspends itself; see makecontext(3). Runs one job after
+/// another. Tells the sanitizers about each switch.
+/// Thread safety: all fibers and their callers belong to one thread.
 class Fiber {
 public:
     Fiber();
-    ~Fiber(); // its job must have ended
+    ~Fiber(); // the job must have ended
     Fiber(const Fiber&) = delete;
     Fiber& operator=(const Fiber&) = delete;
 
-    /// Gives it a job, which begins with the next resume().
+    /// Sets the job, which starts with the next resume().
     void assign(std::function<void()> job);
-    /// Lets the job go on until it suspends itself or ends.
+    /// Runs the job until it suspends itself or ends.
     void resume();
-    /// To be called by the job: back to whoever resumed it.
+    /// Called by the job: returns to the caller of resume().
     void suspend();
     bool hasJob() const { return static_cast<bool>(mJob); }
 
@@ -36,13 +36,13 @@ private:
     std::function<void()> mJob;
     ucontext_t mInside = {};
     ucontext_t mOutside = {};
-    // Exceptions that are being handled are kept by the C++ runtime for each thread of the system: two words.
+    // What the C++ runtime keeps for each system thread about exceptions being handled: two words.
     struct Handled {
         void* caught;
         std::size_t uncaught;
     };
     Handled mHandled = {};
-    // What the sanitizers want to know.
+    // For the sanitizers.
     [[maybe_unused]] void* mSanitizerFiber = nullptr;
     [[maybe_unused]] void* mSanitizerOutside = nullptr;
     [[maybe_unused]] const void* mOutsideStack = nullptr;

@@ -10,9 +10,8 @@
 
 namespace qel::test {
 
-/// Another stream, with moments at which a test may do something: a function runs on the thread that reads or writes,
-/// right before the call goes on to the other stream or right after it has come back from there.
-/// Thread safety: that of the stream inside; the hooks are set while nobody reads or writes.
+/// Wraps a stream and calls functions of the test right before and right after each call of it, on the calling thread.
+/// Thread safety: that of the wrapped stream; set the hooks while no thread reads or writes.
 class HookedStream : public Stream {
 public:
     struct Hooks {

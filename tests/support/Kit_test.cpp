@@ -1,4 +1,4 @@
-// The fakes of the kit keep their own contracts: a fake that lies makes every test that trusts it worthless.
+// The fakes of the kit keep their own contracts: a wrong fake makes every test that uses it worthless.
 
 #include <qel/common/LogLevel.hpp>
 #include <qel/common/QelDebugContext.hpp>
@@ -63,7 +63,7 @@ TEST(ScriptedStreamTest, OneReadNeverGoesBeyondOneChunk)
     EXPECT_THAT(stream.reads(), ElementsAre(10U, 10U));
 }
 
-TEST(ScriptedStreamTest, WhatAReadLeavesIsThereForTheNext)
+TEST(ScriptedStreamTest, KeepsTheRestOfAChunkForTheNextRead)
 {
     ScriptedStream stream;
     stream.deliver(text("abc")).deliver(text("de"));
@@ -85,7 +85,7 @@ TEST(ScriptedStreamTest, DeliversOneByOne)
     EXPECT_EQ(readUpTo(stream, 10), "c");
 }
 
-TEST(ScriptedStreamTest, EndStaysTheEnd)
+TEST(ScriptedStreamTest, EveryReadAfterTheEndReturnsZero)
 {
     ScriptedStream stream;
     stream.deliver(text("a")).end();
@@ -94,7 +94,7 @@ TEST(ScriptedStreamTest, EndStaysTheEnd)
     EXPECT_EQ(readUpTo(stream, 10), "");
 }
 
-TEST(ScriptedStreamTest, FailureComesOnceAndTheScriptGoesOn)
+TEST(ScriptedStreamTest, FailsOnceAndContinuesTheScript)
 {
     ScriptedStream stream;
     stream.deliver(text("a")).fail("first").fail("second").deliver(text("b"));
@@ -104,7 +104,7 @@ TEST(ScriptedStreamTest, FailureComesOnceAndTheScriptGoesOn)
     EXPECT_EQ(readUpTo(stream, 10), "b");
 }
 
-TEST(ScriptedStreamTest, ReadingBeyondTheScriptIsAMistakeNotAnEnd)
+TEST(ScriptedStreamTest, ReadingBeyondTheScriptIsALogicError)
 {
     ScriptedStream stream;
     char buffer[1];
@@ -118,7 +118,7 @@ TEST(ScriptedStreamTest, EmptyChunkIsRefused)
     EXPECT_THROW(stream.deliver({}), std::logic_error);
 }
 
-TEST(ScriptedStreamTest, RecordsFillsAndPlaysThemByReads)
+TEST(ScriptedStreamTest, RecordsFillsAndPerformsThemByReads)
 {
     ScriptedStream stream;
     stream.deliver(text("ab")).deliver(text("cd"));
@@ -140,7 +140,7 @@ TEST(ScriptedStreamTest, RecordsEachWrite)
     EXPECT_EQ(stream.written(), text("abcde"));
 }
 
-TEST(ScriptedStreamTest, WriteBreaksAtTheByteThatWasNamed)
+TEST(ScriptedStreamTest, WriteFailsAtTheGivenByte)
 {
     ScriptedStream stream;
     stream.failWriteAt(5, "broken");
@@ -151,7 +151,7 @@ TEST(ScriptedStreamTest, WriteBreaksAtTheByteThatWasNamed)
     EXPECT_EQ(stream.written(), text("abcde"));
 }
 
-TEST(ScriptedStreamTest, WriteThatBreaksLeavesItsFirstPart)
+TEST(ScriptedStreamTest, AFailedWriteRecordsItsFirstPart)
 {
     ScriptedStream stream;
     stream.failWriteAt(2, "broken");
@@ -182,7 +182,7 @@ TEST(ScriptedStreamTest, ClosedStreamNeitherReadsNorWrites)
     EXPECT_THAT(stream.writes(), IsEmpty());
 }
 
-TEST(BytesTest, NumbersBecomeBytesAndBytesBecomeDigits)
+TEST(BytesTest, ConvertsNumbersToBytesAndBytesToDigits)
 {
     EXPECT_THAT(bytes({0, 0x7F, 0x80, 0xFF}), ElementsAre('\0', '\x7F', '\x80', '\xFF'));
     EXPECT_THROW(bytes({256}), std::invalid_argument);
@@ -209,7 +209,7 @@ TEST(CapturedLogTest, ShowsLevelAndTextOfEachLine)
     EXPECT_EQ(log.rawLines()[0].front(), '[');
 }
 
-TEST(CapturedLogTest, ForgetsWhenToldTo)
+TEST(CapturedLogTest, ForgetsLinesWhenCleared)
 {
     CapturedLog log;
     qel::QelDebugContext(qel::QelLogger::get(), qel::LogLevel::Error) << "went wrong";
@@ -217,7 +217,7 @@ TEST(CapturedLogTest, ForgetsWhenToldTo)
     EXPECT_THAT(log.lines(), IsEmpty());
 }
 
-TEST(CapturedLogTest, SetsTheLevelAndResetsItAtTheEnd)
+TEST(CapturedLogTest, SetsTheLevelUntilItsDestruction)
 {
     {
         const CapturedLog log(qel::LogLevel::Error);
@@ -252,7 +252,7 @@ TEST(ThrowingLogBackendTest, ThrowsOnEveryLine)
                 ThrowsMessage<std::runtime_error>(StrEq("back-end")));
 }
 
-TEST(SettableClockTest, MovesOnlyWhenTold)
+TEST(SettableClockTest, AdvancesOnlyWhenTold)
 {
     SettableClock clock;
     const auto system = qel::TimeProvider::system();
@@ -279,7 +279,7 @@ TEST(SettableClockTest, CountsReadsOfTheSteadyClock)
     EXPECT_EQ(clock.steadyReads(), 2U);
 }
 
-TEST(SettableClockTest, RealTimeIsBackAtTheEnd)
+TEST(SettableClockTest, RestoresRealTimeAtTheEnd)
 {
     {
         SettableClock clock;
@@ -328,7 +328,7 @@ TEST(AllocationsTest, CountsEachBlockFromItsConstructionOn)
     EXPECT_EQ(allocations.count(), 2U);
 }
 
-TEST(AllocationsTest, LeavesOtherThreadsAlone)
+TEST(AllocationsTest, DoesNotAffectOtherThreads)
 {
     QEL_TEST_NEEDS_ALLOCATIONS();
     std::atomic<bool> start{false};
@@ -357,11 +357,11 @@ TEST(AllocationsTest, LeavesOtherThreadsAlone)
     EXPECT_FALSE(failed);
 }
 
-TEST(AllocationsTest, ExemptOnesNeitherCountNorFail)
+TEST(AllocationsTest, ExemptAllocationsNeitherCountNorFail)
 {
     QEL_TEST_NEEDS_ALLOCATIONS();
     bool failed = false;
-    bool failedBehind = false;
+    bool failedAfterwards = false;
     std::size_t count = 0;
     {
         Allocations allocations;
@@ -376,12 +376,12 @@ TEST(AllocationsTest, ExemptOnesNeitherCountNorFail)
         try {
             allocateAndRelease();
         } catch (const std::bad_alloc&) {
-            failedBehind = true;
+            failedAfterwards = true;
         }
     }
     EXPECT_FALSE(failed);
     EXPECT_EQ(count, 0U);
-    EXPECT_TRUE(failedBehind);
+    EXPECT_TRUE(failedAfterwards);
 }
 
 TEST(AllocationsTest, LetsSomeSucceedBeforeItFails)

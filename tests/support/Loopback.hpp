@@ -23,7 +23,7 @@ namespace qel::test {
 /// @return port 0 of the address of this machine itself: 127.0.0.1 or ::1
 IPEndpoint loopback(IPFamily family = IPFamily::IPv4);
 
-/// @return a listener on a free port; getSocketName() tells which
+/// @return a listener on a free port, which getSocketName() returns
 Socket makeListener(IPFamily family = IPFamily::IPv4, int backlog = 8);
 
 /// Both ends of a TCP connection, blocking.
@@ -33,25 +33,25 @@ struct TcpPair {
 };
 TcpPair makeTcpPair(IPFamily family = IPFamily::IPv4);
 
-/// An endpoint of this machine that never answers: a listener whose queue is full, so that the system drops whatever
-/// else tries to connect.
+/// An endpoint of this machine that never answers: a listener whose queue is full, so that the system drops further
+/// connection requests.
 class SilentEndpoint {
 public:
     explicit SilentEndpoint(IPFamily family = IPFamily::IPv4);
 
     const IPEndpoint& endpoint() const { return mEndpoint; }
-    /// Ends the listener: the next attempt of a connection that is on its way is refused.
+    /// Closes the listener: the next attempt of a pending connection is refused.
     void closeListener() { mListener = Socket(-1); }
 
 private:
-    Socket mHolder; // keeps the port from others when the listener has gone
+    Socket mHolder; // reserves the port after the listener is closed
     Socket mListener;
     IPEndpoint mEndpoint;
     std::vector<Socket> mWaiting; // fill the queue
 };
 
 /// @return a TCP socket that is bound to a free port and does not listen: while it is open, connections to its
-///         getSocketName() are refused, and nobody else can take the port
+///         getSocketName() are refused
 Socket makeRefusingSocket(IPFamily family = IPFamily::IPv4);
 
 /// @return the backlog that a listening TCP socket was given, as the kernel keeps it (tcp(7), TCP_INFO)
@@ -73,8 +73,8 @@ protected:
     INSTANTIATE_TEST_SUITE_P(Over, suite, ::testing::Values(qel::IPFamily::IPv4, qel::IPFamily::IPv6),                 \
                              ::testing::PrintToStringParamName())
 
-/// Leaves the process no room for further descriptors until it ends. To be held only around the system call that shall
-/// fail, in a stand-in of SystemCalls: the sanitizers need descriptors of their own for their checks. Keeps errno.
+/// The process can open no descriptors while this object exists. Use it only around the system call that is to fail, in
+/// a replacement of SystemCalls: the sanitizers open descriptors for their checks. Preserves errno.
 class NoMoreDescriptors {
 public:
     /// @param limit  descriptors from this number on cannot be opened
@@ -113,7 +113,8 @@ MATCHER_P2(NestsPosixError, code, text, "")
     return false;
 }
 
-/// A back-end whose every line changes errno, as writing to a file may: what is reported must have been saved before.
+/// A back-end that changes errno with each line, as writing to a file may: errno must be saved before a line is
+/// written.
 class ErrnoSpoilingLogBackend : public LogBackend {
 public:
     void log(LogLevel::Level, const std::string&) override { errno = ENOTTY; }

@@ -1,5 +1,5 @@
-// A module to be loaded in front of a program (LD_PRELOAD, see ld.so(8)) that would listen to the whole network and
-// cannot be told otherwise: whatever it binds to all addresses is bound to that of this machine itself instead.
+// A module to preload into a program (LD_PRELOAD, see ld.so(8)) that binds its sockets to all addresses and has no
+// option for another one: it binds them to the loopback address instead.
 
 #include <arpa/inet.h>
 #include <cstring>
@@ -9,7 +9,7 @@
 
 namespace {
 
-/// @return whether the address is one that was passed as what it seems to be
+/// @return whether the address is of the family and complete
 template <typename Address>
 bool isA(sa_family_t family, const sockaddr* address, socklen_t length)
 {

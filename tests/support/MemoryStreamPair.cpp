@@ -24,11 +24,11 @@ struct Failure {
     std::exception_ptr exception;
 };
 
-/// One end: its script, its books and what has arrived for it. Guarded by the mutex of the connection.
+/// One side: its script, its records and the bytes that have arrived. Guarded by the mutex of the connection.
 struct EndState {
     explicit EndState(std::size_t capacity) : arrived(capacity) {}
 
-    // The bytes on their way to this end: a ring, so that a transfer allocates nothing.
+    // The bytes that have arrived: a ring, so that a transfer does not allocate.
     std::vector<char> arrived;
     std::size_t first = 0;
     std::size_t count = 0;
@@ -207,7 +207,7 @@ std::unique_ptr<Stream> takeStream(const std::shared_ptr<MemoryConnection>& conn
     return std::make_unique<MemoryStream>(connection, index);
 }
 
-/// The state of an end, locked for one statement or block.
+/// The state of one side, locked for a statement or block.
 class Locked {
 public:
     Locked(MemoryConnection& connection, std::size_t index)
@@ -282,13 +282,13 @@ void MemoryStreamEnd::deliver(const std::string& bytes)
 void MemoryStreamEnd::awaitReader()
 {
     Locked end(*mConnection, mIndex);
-    end.await("nobody waits in read()", [&end] { return end->readersWaiting > 0; });
+    end.await("no thread waits in read()", [&end] { return end->readersWaiting > 0; });
 }
 
 void MemoryStreamEnd::awaitWriter()
 {
     Locked end(*mConnection, mIndex);
-    end.await("nobody waits in write()", [&end] { return end->writersWaiting > 0; });
+    end.await("no thread waits in write()", [&end] { return end->writersWaiting > 0; });
 }
 
 std::size_t MemoryStreamEnd::bytesRead() const { return Locked(*mConnection, mIndex)->bytesRead; }

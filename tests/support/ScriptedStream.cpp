@@ -39,7 +39,7 @@ ScriptedStream& ScriptedStream::fail(std::string text)
 
 ScriptedStream& ScriptedStream::failWriteAt(std::size_t position, std::string text)
 {
-    if (position < mBytesWritten) throw std::logic_error("ScriptedStream: that byte has gone out already");
+    if (position < mBytesWritten) throw std::logic_error("ScriptedStream: that byte was already written");
     mWriteLimit = position;
     mWriteFailure = std::move(text);
     return *this;

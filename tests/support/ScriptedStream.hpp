@@ -11,10 +11,10 @@
 
 namespace qel::test {
 
-/// A stream that does what the test wrote into its script, and remembers what was asked of it.
+/// A stream that follows a script of the test and records its calls.
 ///
-/// Input: read() plays the steps in the order in which they were added. One read() never goes beyond one delivered
-/// chunk, so a chunk is a short read; what a read() leaves of a chunk is there for the next one.
+/// Input: read() performs the steps in the order in which they were added. One read() returns bytes of one chunk only,
+/// so a chunk is a short read; the next read() continues with the rest of the chunk.
 ///
 ///     ScriptedStream stream;
 ///     stream.deliver(first3Bytes).deliver(theRest).end();
@@ -22,9 +22,9 @@ namespace qel::test {
 /// A read() beyond the script is a mistake of the test or of the code under test and throws std::logic_error: a real
 /// stream would hang there.
 ///
-/// Output: write() records whole calls; failWriteAt() makes it break after a number of bytes.
+/// Output: write() records each call; failWriteAt() makes it fail after a number of bytes.
 ///
-/// Not for several threads at once.
+/// Thread safety: one thread at a time.
 class ScriptedStream : public Stream {
 public:
     using Bytes = std::vector<char>;
@@ -34,39 +34,39 @@ public:
 
     // The script of the input side. Each returns *this.
 
-    /// Adds one chunk; an empty one would read as the end of the stream and is refused with std::logic_error.
+    /// Adds a chunk. @throws std::logic_error  it is empty, which would read as end of stream
     ScriptedStream& deliver(Bytes chunk);
     /// Adds the bytes as chunks of one byte each.
     ScriptedStream& deliverOneByOne(const Bytes& bytes);
     /// From here on every read() returns 0.
     ScriptedStream& end();
-    /// One read() throws StreamIOException(text); the script goes on behind it.
+    /// One read() throws StreamIOException(text); the script continues after it.
     ScriptedStream& fail(std::string text);
 
     // The output side.
 
-    /// The write() that would carry byte number `position` (from 0, over all writes) records the bytes before it and
-    /// throws StreamIOException(text), and so does every later one; an empty write() carries no byte and goes through.
-    /// A position that has been passed already is refused with std::logic_error.
+    /// The write() that contains byte number `position` (from 0, over all writes) records the bytes before it and
+    /// throws StreamIOException(text); every later write() throws, unless it is empty.
+    /// @throws std::logic_error  that byte was already written
     ScriptedStream& failWriteAt(std::size_t position, std::string text);
 
-    // What was asked.
+    // The record.
 
-    /// The lengths that the calls of read() asked for, in order.
+    /// The lengths of the calls of read(), in order.
     const std::vector<std::size_t>& reads() const { return mReads; }
-    /// The lengths that the calls of fill() asked for, in order.
+    /// The lengths of the calls of fill(), in order.
     const std::vector<std::size_t>& fills() const { return mFills; }
-    /// The bytes that read() has handed out so far.
+    /// The number of bytes that read() has returned.
     std::size_t bytesRead() const { return mBytesRead; }
-    /// The delivered bytes that nobody has read yet.
+    /// The number of bytes of the script not read yet.
     std::size_t bytesLeft() const;
-    /// What each call of write() brought through, in order; a call that failed stands with the part that went out.
+    /// The bytes that each call of write() wrote, in order; of a call that failed, those before the failure.
     const std::vector<Bytes>& writes() const { return mWrites; }
-    /// All bytes that were written, in one piece.
+    /// All bytes written.
     Bytes written() const;
     const std::vector<std::chrono::milliseconds>& readDeadlines() const { return mReadDeadlines; }
     const std::vector<std::chrono::milliseconds>& writeDeadlines() const { return mWriteDeadlines; }
-    /// How often close() was called.
+    /// The number of calls of close().
     unsigned closeCount() const { return mCloseCount; }
 
     // The stream itself. After close() reading and writing throw StreamIOException("closed").

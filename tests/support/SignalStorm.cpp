@@ -33,14 +33,14 @@ int callUnderSignals(int flags, const std::function<void()>& call, const std::fu
         while (!returned && until()) {
             const int handled = sHandled;
             EXPECT_EQ(::pthread_kill(receiver, SIGUSR1), 0);
-            // Usually the next one comes after this one was handled, so that the receiver gets on between them. Not
-            // always: the thread sanitizer keeps a signal back that comes just before a call that blocks, and only the
-            // next one brings it out.
+            // Usually waits until the signal is handled, so that the receiver makes progress between two of them. Not
+            // for ever: the thread sanitizer holds back a signal that comes just before a call that blocks, until the
+            // next one comes.
             for (int i = 0; i < 10000 && !returned && sHandled == handled; ++i)
                 std::this_thread::yield();
         }
     });
-    // A call with a short deadline must not be over before the sender has come to run at all.
+    // The sender must run before a call with a short deadline returns.
     ready.get_future().wait();
     try {
         call();

@@ -11,22 +11,22 @@
 
 namespace qel {
 
-/// A short history of the times when messages were slow. An event begins with a slow message and ends when no slow one
-/// has come for ten seconds; what is kept are the last five.
+/// The last five latency events: periods in which messages were slow. An event begins with a slow message and ends when
+/// no slow message has come for ten seconds.
 ///
-/// Fast messages inside an event belong to it only once another slow one shows that it went on. So an event stretches
-/// from its first slow message to its latest one, and the fast ones after that are dropped when it closes. It is closed
-/// by the first fast message after those ten seconds, which is not counted; without any message it stays open.
-/// Thread safety: one thread at a time; the queue that owns it serialises all calls.
+/// An event extends from its first slow message to its last one. Fast messages count only if a slow message follows
+/// them in the same event; those after the last slow message are not counted. The first fast message after the ten
+/// seconds closes the event and is not counted; without any message the event stays open. Thread safety: one thread at
+/// a time; a queue calls it with its lock held.
 class QEL_EXPORT QelMessageLatencyEvents {
 public:
     /// A message is slow when its latency is this or more.
     static constexpr std::chrono::nanoseconds THRESHOLD = std::chrono::milliseconds(250);
 
-    /// How long after the latest slow message an event may close.
+    /// The time without slow messages after which an event closes.
     static constexpr std::chrono::nanoseconds ESCAPE_INTERVAL = std::chrono::seconds(10);
 
-    /// The fast messages since the latest slow one of an open event.
+    /// The fast messages since the last slow one of an open event.
     struct PendingData {
         QelMessageCount mCompleted;
         std::chrono::nanoseconds mTotalLatency = {};
@@ -34,36 +34,39 @@ public:
 
     class Entry;
 
-    /// Tells of one message. Allocates nothing. Reads the steady clock while an event is open or begins, and the system
-    /// clock when the message is slow.
+    /// Records a message. Does not allocate. Reads the steady clock if an event is open or begins, and the system clock
+    /// if the message is slow.
+    /// @throws what a substituted clock throws; nothing is recorded then
     void trace(const QelMessage& message, const std::chrono::nanoseconds& latency);
 
-    /// @return whether there has never been an event
+    /// @return whether there has been no event yet
     bool empty() const noexcept { return mEntries.empty(); }
 
-    /// Prints the events from the newest to the oldest.
+    /// Prints the events, newest first.
+    /// @param os  borrowed for the call
+    /// @throws what the stream throws if its exceptions() are set
     void dump(std::ostream& os, Indent indent) const;
 
     /// One event.
     class QEL_EXPORT Entry {
     public:
-        /// A new event, open, with its first slow message.
+        /// Opens an event with its first slow message.
         Entry(const QelMessage& message, const std::chrono::nanoseconds& latency,
               const std::chrono::system_clock::time_point& systemNow);
 
-        /// Another slow message: the event goes on, and the fast messages before this one belong to it.
-        /// @param pending  those fast messages; set to zero
+        /// Adds another slow message, and the fast messages before it.
+        /// @param pending  those fast messages; reset to zero
         void extendEvent(const QelMessage& message, const std::chrono::nanoseconds& latency, PendingData& pending,
                          const std::chrono::system_clock::time_point& systemNow);
 
-        /// Closes the event. Its end stays the time of its latest slow message.
+        /// Closes the event. Its end remains the time of its last slow message.
         void endEvent() noexcept { mActive = false; }
 
         /// @return whether the event is open
         bool isActive() const noexcept { return mActive; }
 
-        /// Prints one line with 'A' for an open or 'C' for a closed event and its two times in UTC, cut to whole
-        /// seconds, and six lines of figures, which are indented by four more.
+        /// Prints a line with 'A' for an open or 'C' for a closed event and with its start and end in UTC, rounded down
+        /// to seconds; then six lines of figures, indented by four more.
         void dump(std::ostream& os, Indent indent) const;
 
     private:
@@ -73,7 +76,7 @@ public:
         std::chrono::system_clock::time_point mStartTime;
         std::chrono::system_clock::time_point mEndTime;
         QelMessageLatency mStartMessage; // the first slow message
-        QelMessageLatency mEndMessage;   // the latest slow message
+        QelMessageLatency mEndMessage;   // the last slow message
         QelMessageCount mCompleted;      // all messages of the event, slow and fast
         std::chrono::nanoseconds mMaxLatency;
         std::chrono::nanoseconds mTotalLatency;

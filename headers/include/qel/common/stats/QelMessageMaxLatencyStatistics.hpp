@@ -12,29 +12,31 @@
 
 namespace qel {
 
-/// The slowest kinds of message: up to eight, the slowest first, each with the worst latency seen for it. A kind is a
-/// pair of function code and operation type, so a request and its response are of one kind.
+/// The eight slowest kinds of message, slowest first, each with its highest latency. A kind is a pair of function code
+/// and operation type, so a request and its response are of one kind.
 ///
-/// A kind whose function code or operation type is zero is kept like any other, but an entry of it ends what is
-/// printed, and one in front hides the whole list.
-/// Thread safety: one thread at a time; the queue that owns it serialises all calls.
+/// A kind whose function code or operation type is zero is listed like any other, but is not valid: printing stops at
+/// its entry, and if it is the first one, nothing is printed.
+/// Thread safety: one thread at a time; a queue calls it with its lock held.
 class QEL_EXPORT QelMessageMaxLatencyStatistics {
 public:
-    /// A latency below this is not slow and never enters the list.
+    /// A lower latency is not slow and does not enter the list.
     static constexpr std::chrono::nanoseconds THRESHOLD = std::chrono::milliseconds(250);
 
-    /// Enters one message, if it is slow enough for the list. Of equal latencies of different kinds the older stays in
-    /// front; of equal latencies of one kind the caller id of the younger is kept. Allocates nothing.
+    /// Records a message, if it is slow enough for the list. Of equal latencies of different kinds the older entry
+    /// comes first; of equal latencies of one kind the newer caller id is kept. Does not allocate.
     void trace(const QelMessage& message, const std::chrono::nanoseconds& latency);
 
     /// @return whether there is nothing to print: the first entry is unused, or not valid
     bool empty() const noexcept { return !mEntries.front().isValid(); }
 
-    /// Prints one line for each entry from the first to the last valid one in front of any that is not.
+    /// Prints a line for each entry before the first that is not valid.
+    /// @param os  borrowed for the call
+    /// @throws what the stream throws if its exceptions() are set
     void dump(std::ostream& os, const Indent& indent) const;
 
 private:
-    /// Moves an entry whose latency has grown up to its place, behind those that are equal.
+    /// Moves an entry whose latency has grown up the list, to its place after equal ones.
     void pAdjust(std::size_t position);
 
     std::array<QelMessageLatency, 8> mEntries; // by descending latency; unused ones, all zero, at the end

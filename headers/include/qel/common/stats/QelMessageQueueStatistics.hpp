@@ -14,50 +14,52 @@
 
 namespace qel {
 
-/// What a message queue knows about itself: how much waits and has passed, how long messages wait, which kinds were the
-/// slowest, and when there were times of high latency.
+/// The statistics of a message queue: how much is pending and has passed, how long messages wait, which kinds were the
+/// slowest, and when latency was high.
 ///
-/// Durations are measured on the steady clock, times of day read from the system clock, both through TimeProvider.
-/// Updates allocate nothing and format nothing. Should a substitute clock throw, an update has changed nothing.
-/// Thread safety: one thread at a time; the queue that owns it serialises all calls, dumps included.
+/// Durations are measured on the steady clock, times of day on the system clock, both through TimeProvider. Updates
+/// neither allocate nor format. An update that throws, because a substituted clock does, has changed nothing.
+/// Thread safety: one thread at a time; a queue calls it with its lock held.
 class QEL_EXPORT QelMessageQueueStatistics {
 public:
-    /// A message has entered the queue. Reads the steady clock once if the queue was empty.
-    /// @param enqueueLatency  how long its producer was held up before that
+    /// Records that a message has entered the queue. Reads the steady clock once if the queue was empty.
+    /// @param enqueueLatency  how long its producer was blocked
+    /// @throws what a substituted clock throws
     void enqueued(const QelMessage& message, const std::chrono::nanoseconds& enqueueLatency);
 
-    /// A message was refused.
+    /// Records that a message was refused.
     void dropped(const QelMessage& message);
 
-    /// The message at the head has left the queue. Reads the steady clock once, and both clocks again as
-    /// QelMessageLatencyEvents::trace() says.
-    /// @param latency  how long it took from the call that brought it
+    /// Records that the first message has left the queue. Reads the steady clock once, and both clocks again as
+    /// QelMessageLatencyEvents::trace() describes.
+    /// @param latency  the time since the call that enqueued it
+    /// @throws what a substituted clock throws
     void dequeued(const QelMessage& message, const std::chrono::nanoseconds& latency);
 
-    /// @return what is in the queue now
+    /// @return the messages in the queue; owned by this object
     const QelMessageCount& getPending() const noexcept { return mPending; }
 
-    /// @return messages and bytes that left the queue per second in which it was not empty; whole numbers, rounded
-    /// down, and zero before any such time has passed. The product of bytes and nanoseconds wraps at 2^64, that is at
-    /// 18 GB.
+    /// @return the messages and bytes that left the queue, per second during which it was not empty: integers, rounded
+    ///         down; zero while that time is zero. The product of bytes and 10^9 wraps at 2^64, that is at 18 GB.
     QelMessageThroughput getThroughput() const noexcept;
 
-    /// Prints everything, each line behind the indent. Reads the steady clock once if the queue is not empty. The
-    /// stream is left as the formatters leave it: upper-case digits, fill character '0' or a blank.
-    /// @throws std::bad_alloc, what a substitute clock throws, and what the stream throws if it was told to; part of
-    /// the text may have been printed then
+    /// Prints everything, each line after the indent. Reads the steady clock once if the queue is not empty. Leaves the
+    /// stream as the formatters do: upper-case digits, fill character '0' or a blank.
+    /// @param os  borrowed for the call
+    /// @throws std::bad_alloc, what a substituted clock throws, and what the stream throws if its exceptions() are set;
+    /// part of the text may have been printed
     void dump(std::ostream& os, const Indent& indent) const;
 
 private:
-    std::uint64_t mMaxPendingBytes = 0; // the most bytes that ever waited
+    std::uint64_t mMaxPendingBytes = 0; // the highest number of pending bytes
     QelMessageCount mPending;
     QelMessageCount mDropped;
     QelMessageCount mCompleted;
-    std::chrono::steady_clock::time_point mHeadReadyTime; // when the message at the head came there
-    std::chrono::nanoseconds mTotalHeadLatency = {};      // what all heads waited there, together
-    QelMessageLatencyBuckets mEnqueueLatencyBuckets;      // producers held up
-    QelMessageLatencyBuckets mDequeueLatencyBuckets;      // waiting at the head
-    QelMessageLatencyBuckets mE2ELatencyBuckets;          // from the producer's call to leaving the queue
+    std::chrono::steady_clock::time_point mHeadReadyTime; // when the first message became the first
+    std::chrono::nanoseconds mTotalHeadLatency = {};      // the sum of those waits
+    QelMessageLatencyBuckets mEnqueueLatencyBuckets;      // time that producers were blocked
+    QelMessageLatencyBuckets mDequeueLatencyBuckets;      // time as the first message
+    QelMessageLatencyBuckets mE2ELatencyBuckets;          // from the call of the producer to the end
     QelMessageMaxLatencyStatistics mMaxLatency;
     QelMessageLatencyEvents mLatencyEvents;
 };

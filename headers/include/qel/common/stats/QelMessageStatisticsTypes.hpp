@@ -8,20 +8,20 @@
 #include <iosfwd>
 
 /// @file
-/// The values that the statistics of a message queue consist of. They are plain values: copy and compare them as you
-/// like; one thread at a time.
+/// The values that the statistics of a message queue consist of.
 ///
-/// All numbers print in decimal or with hexFormat(), whatever base the stream was left in. They expect a stream without
-/// left alignment, as every fresh stream is.
+/// Thread safety: plain values.
+/// Numbers print in decimal or with hexFormat(), whatever the base of the stream. The stream must not be left-aligned;
+/// by default it is not.
 
 namespace qel {
 
-/// How many messages, and how many bytes they have together: whole frames, as msgLength() counts them.
+/// A number of messages, and the sum of their lengths as msgLength() returns them.
 struct QelMessageCount {
     std::uint64_t mCount = 0; ///< messages
     std::uint64_t mBytes = 0; ///< bytes
 
-    /// One message more.
+    /// Adds a message.
     QelMessageCount& operator+=(const QelMessage& message)
     {
         ++mCount;
@@ -29,7 +29,7 @@ struct QelMessageCount {
         return *this;
     }
 
-    /// One message less. It must have been added before: the numbers go round below zero.
+    /// Subtracts a message, which must have been added before: the numbers wrap below zero.
     QelMessageCount& operator-=(const QelMessage& message)
     {
         --mCount;
@@ -37,6 +37,7 @@ struct QelMessageCount {
         return *this;
     }
 
+    /// Adds field by field.
     QelMessageCount& operator+=(const QelMessageCount& other) noexcept
     {
         mCount += other.mCount;
@@ -56,14 +57,14 @@ struct QelMessageThroughput {
 /// Prints both rates: "12 m/s (3456 B/s)".
 QEL_EXPORT std::ostream& operator<<(std::ostream& os, const QelMessageThroughput& throughput);
 
-/// How long one message took, and which message it was.
+/// The latency of one message, and the message.
 struct QelMessageLatency {
     unsigned int mCallerID = 0;
     unsigned short mFunction = 0;  ///< function code
     unsigned short mOperation = 0; ///< operation type
     std::chrono::nanoseconds mLatency = {};
 
-    /// No message: all zero, and not valid.
+    /// No message: all zero, not valid.
     QelMessageLatency() = default;
 
     QelMessageLatency(const QelMessage& message, const std::chrono::nanoseconds& latency)
@@ -71,11 +72,11 @@ struct QelMessageLatency {
           mLatency(latency)
     {}
 
-    /// @return whether both function code and operation type are other than zero
+    /// @return whether neither function code nor operation type is zero
     bool isValid() const noexcept { return mFunction != 0 && mOperation != 0; }
 };
 
-/// Prints caller id, function, operation and the latency in whole microseconds:
+/// Prints caller id, function, operation and the latency in microseconds, rounded down:
 /// "[CID=0x0000002A FN=0x6003 OP=0x8001 T=312004us]".
 QEL_EXPORT std::ostream& operator<<(std::ostream& os, const QelMessageLatency& latency);
 
