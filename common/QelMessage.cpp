@@ -17,7 +17,7 @@ constexpr unsigned int kOldFrameMinimum = 40;
 
 constexpr std::uint64_t kFrameLengthMaximum = std::numeric_limits<unsigned int>::max();
 
-/// The values go to the log for whoever reads it, the fixed phrase to the caller.
+/// Logs the values at Error and throws the fixed phrase.
 template <typename... Parts>
 [[noreturn]] void reject(const char* phrase, const Parts&... logged)
 {
@@ -27,7 +27,7 @@ template <typename... Parts>
 
 } // namespace
 
-// Constant-initialised, in this one place: whoever loads the library counts on with the same counter.
+// Constant-initialised in one source file: the program and every module that it loads share this counter.
 std::atomic<unsigned int> QelMessage::sCallerIdCounter{1};
 
 const std::map<unsigned char, unsigned int> QelMessage::CommonHeader::QelHeaderVersionToLength = {
@@ -51,7 +51,7 @@ void QelMessage::CommonHeader::pValidate(unsigned int i_length) const
     if (std::memcmp(mDesc, DaxCmdDesc, sizeof(DaxCmdDesc)) != 0) {
         reject("i_buffer bad eyecatcher", "bad eyecatcher = ", HexStringFormatter(mDesc, sizeof(mDesc)));
     }
-    // Whatever is not the old form is taken for the new one until its length is known to be there.
+    // The version is checked later: until then, every version but the old one needs a header of the new form.
     if (i_length < kNewHeaderLength && mHeaderVersion != MessageVersion24) {
         reject("i_length shorter than new header", "bad length = ", hexFormat(i_length));
     }
@@ -68,7 +68,7 @@ void QelMessage::CommonHeader::pValidate(unsigned int i_length) const
                    " < expected ", hexFormat(expected));
         }
     }
-    // In 64 bits, so that a payload length near 2^32 cannot wrap into a frame length that looks right.
+    // In 64 bits, so that a payload length near 2^32 cannot wrap to a matching frame length.
     if (mMsgLength.value() != std::uint64_t{getHeaderLength()} + mDataLength.value() + mPadLength) {
         reject("i_buffer bad MsgLength in header", "bad header MsgLength = ", hexFormat(mMsgLength));
     }
@@ -120,7 +120,7 @@ QelMessage::QelMessage(unsigned int i_callerId, unsigned short i_function, unsig
     if (i_payloadLength.bytes() > kFrameLengthMaximum - headerLength) throw std::invalid_argument("length");
     const unsigned int dataLength = static_cast<unsigned int>(i_payloadLength.bytes());
 
-    mMessage.reset(new char[headerLength + dataLength]()); // all zeros: what is not set below is sent as zero
+    mMessage.reset(new char[headerLength + dataLength]()); // zeros: fields that are not set below are sent as zero
     CommonHeader* const header = pGetHeader();
     std::memcpy(header->mDesc, CommonHeader::DaxCmdDesc, sizeof(header->mDesc));
     header->mHeaderVersion = CommonHeader::MessageVersion32;
@@ -146,11 +146,10 @@ QelMessage::QelMessage(const QelMessage& i_message) : mMessage(new char[i_messag
 
 QelMessage& QelMessage::operator=(const QelMessage& i_message)
 {
-    // The length is read and the buffer cleared before the buffer is installed, so that self-assignment, after which
-    // the other message's frame is this new buffer, stays within it and reads nothing that was never written.
-    const unsigned int length = i_message.msgLength();
-    mMessage.reset(new char[length]());
-    std::memmove(mMessage.get(), i_message.mMessage.get(), length);
+    // Self-assignment releases the source here. The new buffer is therefore a valid frame before it is installed: its
+    // lengths match its size, and its payload of zeros holds no length or offset that points outside.
+    mMessage = i_message.pMakeBlankFrame();
+    std::memmove(mMessage.get(), i_message.mMessage.get(), msgLength());
     return *this;
 }
 
@@ -178,11 +177,11 @@ void QelMessage::pSetData(const char* i_data, unsigned int i_length)
     if (i_length != 0 && i_data == nullptr) throw std::invalid_argument("data");
     std::unique_ptr<char[]> previous = pMakeFrame(i_length);
     previous.swap(mMessage);
-    // The bytes may lie in the frame that was replaced just now, so it is let go only after they are copied.
+    // The bytes may lie in the previous frame, so it is released after the copy.
     if (i_length != 0) std::memcpy(pGetData(), i_data, i_length);
 }
 
-/// A new frame buffer with this header, its lengths adjusted, and a payload of zeros.
+/// A new frame with this header, the lengths updated, and a payload of zeros.
 std::unique_ptr<char[]> QelMessage::pMakeFrame(unsigned int i_dataLength) const
 {
     char headerBytes[MaxHeaderSize];
@@ -193,6 +192,20 @@ std::unique_ptr<char[]> QelMessage::pMakeFrame(unsigned int i_dataLength) const
 
     std::unique_ptr<char[]> frame(new char[header->mMsgLength]());
     std::memcpy(frame.get(), headerBytes, headerLength);
+    return frame;
+}
+
+/// A new frame of the same form and the same lengths; everything else is zero.
+std::unique_ptr<char[]> QelMessage::pMakeBlankFrame() const
+{
+    const CommonHeader* const header = pGetHeader();
+    std::unique_ptr<char[]> frame(new char[header->mMsgLength]());
+    CommonHeader* const blank = reinterpret_cast<CommonHeader*>(frame.get());
+    std::memcpy(blank->mDesc, header->mDesc, sizeof(blank->mDesc));
+    blank->mHeaderVersion = header->mHeaderVersion;
+    blank->mMsgLength = header->mMsgLength;
+    blank->mPadLength = header->mPadLength;
+    blank->mDataLength = header->mDataLength;
     return frame;
 }
 

@@ -9,12 +9,12 @@
 #include <vector>
 
 /// @file
-/// Bytes in tests: written as numbers, shown as hexadecimal digits, copied to blocks of exactly their size.
+/// Bytes in tests: written as numbers, printed as hexadecimal digits, copied to heap blocks of exactly their size.
 
 namespace qel::test {
 
 /// @param values each from 0 to 255: bytes({0xDE, 0xCA, 0xFF})
-/// @throws std::invalid_argument "value" when one is not
+/// @throws std::invalid_argument "value": one is above 255
 inline std::vector<char> bytes(std::initializer_list<unsigned int> values)
 {
     std::vector<char> result;
@@ -26,7 +26,16 @@ inline std::vector<char> bytes(std::initializer_list<unsigned int> values)
     return result;
 }
 
-/// @return two upper-case digits for each byte, nothing between them: "DECAFF20"
+/// @return `count` letters: "abc...z", repeated
+inline std::vector<char> letters(std::size_t count)
+{
+    std::vector<char> text;
+    for (std::size_t i = 0; i < count; ++i)
+        text.push_back(static_cast<char>('a' + i % 26));
+    return text;
+}
+
+/// @return two upper-case digits for each byte, without separators: "DECAFF20"
 inline std::string hex(const void* data, std::size_t length)
 {
     static constexpr char kDigits[] = "0123456789ABCDEF";
@@ -43,8 +52,7 @@ inline std::string hex(const void* data, std::size_t length)
 inline std::string hex(const std::vector<char>& data) { return hex(data.data(), data.size()); }
 inline std::string hex(const std::string& data) { return hex(data.data(), data.size()); }
 
-/// @return a copy in a heap block of exactly `length` bytes, so that the address sanitizer sees the first byte that is
-/// read beyond it
+/// @return a copy in a heap block of exactly `length` bytes, so that the address sanitizer reports a read past the end
 inline std::unique_ptr<char[]> heapCopy(const void* data, std::size_t length)
 {
     std::unique_ptr<char[]> copy(new char[length]);

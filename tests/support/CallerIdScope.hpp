@@ -4,17 +4,17 @@
 
 namespace qel::test {
 
-/// Sets the process-wide caller-id counter for the length of a test.
-class CallerIdScope {
+/// Sets the process-wide caller-id counter for the duration of a test. The counter is protected, hence the base class.
+class CallerIdScope : private QelMessage {
 public:
-    /// @param last taken for the id that was handed out last; the next one is one more
-    explicit CallerIdScope(unsigned int last) : mPrevious(QelMessage::sCallerIdCounter.exchange(last)) {}
-    ~CallerIdScope() { QelMessage::sCallerIdCounter = mPrevious; }
+    /// @param last the id that counts as drawn last; the next one is one more
+    explicit CallerIdScope(unsigned int last) : mPrevious(sCallerIdCounter.exchange(last)) {}
+    ~CallerIdScope() override { sCallerIdCounter = mPrevious; }
     CallerIdScope(const CallerIdScope&) = delete;
     CallerIdScope& operator=(const CallerIdScope&) = delete;
 
-    /// @return the id that was handed out last
-    unsigned int last() const { return QelMessage::sCallerIdCounter; }
+    /// @return the id that was drawn last
+    unsigned int last() const { return sCallerIdCounter; }
 
 private:
     unsigned int mPrevious;

@@ -10,16 +10,16 @@
 
 namespace qel::test {
 
-/// A message class that shows what QelMessage gives to its derived classes.
+/// A message class that publishes the protected operations of QelMessage.
 class MessageProbe : public QelMessage {
 public:
     using QelMessage::QelMessage;
 
-    /// Built with a payload of zeros of its final size.
+    /// Builds a message with a payload of zeros.
     explicit MessageProbe(std::uint64_t payloadLength)
         : QelMessage(0x01020304, 0x6003, 0x0101, MsgResponseExpected, PayloadLength(payloadLength))
     {}
-    /// Received.
+    /// Parses a frame.
     explicit MessageProbe(const std::vector<char>& frame)
         : QelMessage(heapCopy(frame).get(), static_cast<unsigned int>(frame.size()))
     {}
@@ -36,5 +36,8 @@ public:
 
 /// The frame of a message as hexadecimal digits.
 inline std::string frameOf(const QelMessage& message) { return hex(message.serialize(), message.msgLength()); }
+
+/// A copy of the payload of a message, as text.
+inline std::string payloadText(const QelMessage& message) { return {message.getData(), message.dataLength()}; }
 
 } // namespace qel::test
