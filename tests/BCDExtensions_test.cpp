@@ -40,7 +40,7 @@ TEST(BcdUint, StoresTheMostSignificantDigitFirst)
     EXPECT_EQ(stored(bcd_uint16_t(9999)), "9999");
 }
 
-TEST(BcdUint, EveryRepresentableNumberSurvives)
+TEST(BcdUint, RoundTripsEveryRepresentableNumber)
 {
     for (unsigned int value = 0; value <= 99; ++value) {
         ASSERT_EQ(bcd_uint8_t(value).value(), value);
@@ -57,11 +57,13 @@ TEST(BcdUint, RefusesANumberWithTooManyDigits)
     EXPECT_THAT([] { bcd_uint16_t(UINT_MAX); }, ThrowsMessage<std::range_error>(StrEq(kTooLarge)));
 }
 
-TEST(BcdUint, DoesNotCutANumberDownToItsWidthFirst)
+TEST(BcdUint, RefusesANumberThatWouldFitIfItWereTruncated)
 {
-    // 300 is 44 in eight bits, 65536 + 24 is 24 in sixteen
+    // 300 is 44 in 8 bits, 65560 is 24 in 16 bits, 2^32 + 5 is 5 in 32 bits
     EXPECT_THAT([] { bcd_uint8_t(300); }, ThrowsMessage<std::range_error>(StrEq(kTooLarge)));
     EXPECT_THAT([] { bcd_uint16_t(65560); }, ThrowsMessage<std::range_error>(StrEq(kTooLarge)));
+    EXPECT_THAT([] { bcd_uint8_t(0x100000005ULL); }, ThrowsMessage<std::range_error>(StrEq(kTooLarge)));
+    EXPECT_THAT([] { bcd_uint16_t::bcd(0x100000005ULL); }, ThrowsMessage<std::range_error>(StrEq(kTooLarge)));
 }
 
 TEST(BcdUint, RefusesANegativeNumber)
@@ -80,7 +82,7 @@ TEST(BcdUint, AssignsAndReadsLikeAPlainInteger)
     EXPECT_EQ(stored(year), "2024");
 }
 
-TEST(BcdUint, ARefusedNumberLeavesTheFieldAsItWas)
+TEST(BcdUint, KeepsTheFieldWhenANumberIsRefused)
 {
     bcd_uint8_t field(42);
     EXPECT_THROW(field = 100, std::range_error);
@@ -96,7 +98,7 @@ TEST(BcdUint, EncodesAndDecodesInHostOrder)
     EXPECT_THAT([] { bcd_uint8_t::bcd(100); }, ThrowsMessage<std::range_error>(StrEq(kTooLarge)));
 }
 
-TEST(BcdUint, AHalfByteAboveNineContributesItsValue)
+TEST(BcdUint, DecodesAHalfByteAbove9AsItsValue)
 {
     EXPECT_EQ(bcd_uint8_t::debcd(0xA0), 100);
     EXPECT_EQ(bcd_uint8_t::debcd(0x0A), 10);

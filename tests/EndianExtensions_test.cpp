@@ -11,7 +11,7 @@ namespace {
 
 typedef endian_uint<unsigned char, 4321> be_uint8_t;
 
-// With naturally aligned members this would have six bytes.
+// Naturally aligned members would make this six bytes.
 struct OddRecord {
     be_uint16_t first;
     be_uint16_t second;
@@ -26,7 +26,7 @@ struct MixedRecord {
 };
 static_assert(sizeof(MixedRecord) == 7 && alignof(MixedRecord) == 1, "overlays the frame buffer");
 
-TEST(EndianUint, HasTheSizeOfItsTypeAndNoAlignment)
+TEST(EndianUint, HasTheSizeOfItsTypeAndAlignment1)
 {
     EXPECT_EQ(sizeof(be_uint8_t), 1U);
     EXPECT_EQ(sizeof(be_uint16_t), 2U);
@@ -38,7 +38,7 @@ TEST(EndianUint, HasTheSizeOfItsTypeAndNoAlignment)
     EXPECT_EQ(offsetof(MixedRecord, operation), 5U);
 }
 
-TEST(EndianUint, IsTrivialSoThatItCanLieOverBytes)
+TEST(EndianUint, IsTrivial)
 {
     EXPECT_TRUE(std::is_trivial<be_uint8_t>::value);
     EXPECT_TRUE(std::is_trivial<be_uint16_t>::value);
@@ -65,14 +65,14 @@ TEST(EndianUint, ReadsBackInHostOrder)
     EXPECT_EQ(be_uint32_t(0xFFFFFFFF).value(), 0xFFFFFFFF);
 }
 
-TEST(EndianUint, EverySixteenBitValueSurvives)
+TEST(EndianUint, RoundTripsEvery16BitValue)
 {
     for (unsigned int value = 0; value <= 0xFFFF; ++value) {
         ASSERT_EQ(be_uint16_t(static_cast<unsigned short>(value)).value(), value);
     }
 }
 
-TEST(EndianUint, ConvertsToAndFromPlainIntegersByItself)
+TEST(EndianUint, ConvertsImplicitlyToAndFromPlainIntegers)
 {
     be_uint16_t field = 0x0102;
     const unsigned short read = field;
@@ -108,7 +108,7 @@ TEST(EndianUint, WritesOnlyItsOwnBytes)
     EXPECT_EQ(test::hex(buffer.get(), 7), "61010203046667");
 }
 
-TEST(EndianUint, ConvertTurnsHostOrderIntoWireOrderAndBack)
+TEST(EndianUint, ConvertSwapsHostOrderAndWireOrder)
 {
     const unsigned short host16 = 0x1234;
     const unsigned short wire16 = be_uint16_t::convert(host16);
@@ -120,7 +120,7 @@ TEST(EndianUint, ConvertTurnsHostOrderIntoWireOrderAndBack)
     EXPECT_EQ(be_uint32_t::convert(wire32), host32);
 }
 
-TEST(EndianUint, ConvertLeavesASingleByteAlone)
+TEST(EndianUint, ConvertKeepsASingleByte)
 {
     for (unsigned int value = 0; value <= 0xFF; ++value) {
         ASSERT_EQ(be_uint8_t::convert(static_cast<unsigned char>(value)), value);

@@ -10,25 +10,25 @@
 
 namespace qel {
 
-/// A packed binary-coded decimal number: one decimal digit in each half byte, the most significant digit first, so that
-/// 2024 is stored as the bytes 20 24. T is unsigned char (two digits) or unsigned short (four digits).
+/// A packed binary-coded decimal number: one decimal digit in each half byte, most significant digit first. 2024 is
+/// stored as the bytes 20 24. T is unsigned char (two digits) or unsigned short (four digits).
 ///
 /// Shape: exactly sizeof(T) bytes, alignment 1. A default-constructed object is uninitialised, like a plain integer.
-/// Thread safety: that of a plain integer.
+/// Thread safety: as a plain integer.
 template <typename T>
 class bcd_uint {
     static_assert(std::is_same<T, unsigned char>::value || std::is_same<T, unsigned short>::value,
-                  "only numbers of two and of four digits occur on the wire");
+                  "only numbers of two and four digits occur on the wire");
 
 public:
     bcd_uint() noexcept = default;
 
-    /// Encodes a number. The parameter is wider than T on purpose: a number that does not fit is refused, never
-    /// silently cut down to the width of T. Implicit, so that a field is assigned like a plain integer.
-    /// @throws std::range_error "type cannot be represented in BCD" when the number has more than digits() digits
-    bcd_uint(unsigned int hostValue) : mValue(bcd(hostValue)) {}
+    /// Encodes a number. The parameter is the widest integer type, so that a number that does not fit is refused and
+    /// never truncated. Implicit, so that a field is assigned like a plain integer.
+    /// @throws std::range_error "type cannot be represented in BCD": the number has more than digits() digits
+    bcd_uint(unsigned long long hostValue) : mValue(bcd(hostValue)) {}
 
-    /// @return how many decimal digits the type holds: 2 for unsigned char, 4 for unsigned short
+    /// @return the number of decimal digits that the type holds: 2 for unsigned char, 4 for unsigned short
     static constexpr unsigned int digits() noexcept { return 2 * sizeof(T); }
 
     /// @return the decoded number; see debcd()
@@ -39,20 +39,20 @@ public:
 
     /// Encodes a number: the lowest decimal digit goes to the lowest half byte.
     /// @return the code in host byte order, for example 0x2024 for 2024
-    /// @throws std::range_error "type cannot be represented in BCD" when the number has more than digits() digits
-    static T bcd(unsigned int value)
+    /// @throws std::range_error "type cannot be represented in BCD": the number has more than digits() digits
+    static T bcd(unsigned long long value)
     {
         unsigned int code = 0;
         for (unsigned int digit = 0; digit < digits(); ++digit) {
-            code |= (value % 10) << (4 * digit);
+            code |= static_cast<unsigned int>(value % 10) << (4 * digit);
             value /= 10;
         }
         if (value != 0) throw std::range_error("type cannot be represented in BCD");
         return static_cast<T>(code);
     }
 
-    /// Decodes a code given in host byte order. A half byte above 9 is not refused: it contributes its value, so that
-    /// an A in the tens adds 100. Whoever receives such a field is lenient towards the sender on purpose.
+    /// Decodes a code given in host byte order. A half byte above 9 is not refused but contributes its value: an A in
+    /// the tens adds 100. This is deliberate; a receiver that accepts only digits checks the bytes itself.
     static T debcd(T raw) noexcept
     {
         unsigned int value = 0;

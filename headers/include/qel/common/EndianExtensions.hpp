@@ -18,7 +18,7 @@ class endian_uint;
 /// Shape: exactly sizeof(T) bytes, alignment 1, no padding. A structure of such members can therefore be laid over
 /// received bytes at any address, odd ones included.
 /// A default-constructed object is uninitialised, like a plain integer, so that overlays cost nothing.
-/// Thread safety: that of a plain integer. Nothing here throws.
+/// Thread safety: as a plain integer. Nothing here throws.
 template <typename T>
 class endian_uint<T, 4321> {
     static_assert(std::is_unsigned<T>::value && sizeof(T) <= 4, "wire integers are unsigned and have 8, 16 or 32 bits");
@@ -44,8 +44,8 @@ public:
     /// The same as value(); implicit, so that a field is read like a plain integer.
     operator T() const noexcept { return value(); }
 
-    /// Turns host byte order into network byte order and back: swaps the bytes on a little-endian host and returns the
-    /// value unchanged on a big-endian one. A single byte is never changed.
+    /// Converts between host byte order and network byte order: swaps the bytes on a little-endian host and returns the
+    /// value unchanged on a big-endian host. A single byte never changes.
     static constexpr T convert(T value) noexcept
     {
 #if defined(__BYTE_ORDER__) && __BYTE_ORDER__ == __ORDER_BIG_ENDIAN__
