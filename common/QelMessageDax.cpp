@@ -14,9 +14,10 @@ namespace {
 
 using OutboundData = QelMessageDaxBroadcastOutboundAsync::Data;
 
-// The checks of the arguments give the payload length: they run before there is a frame, and before a caller id is
-// taken.
-std::uint64_t outboundLength(std::uint16_t broadcastMsgLen, const std::string& senderToolId, const char* broadcastMsg)
+// Checks the arguments of the builder and returns the payload length. Evaluated as a constructor argument, so that
+// arguments that are refused allocate no frame and draw no caller id.
+std::uint64_t checkedOutboundLength(std::uint16_t broadcastMsgLen, const std::string& senderToolId,
+                                    const char* broadcastMsg)
 {
     require(wireLength(senderToolId) <= sizeof(OutboundData::mSenderToolId),
             "toolIdLen greater than maximum acceptable size");
@@ -30,7 +31,7 @@ QelMessageDaxBroadcastOutboundAsync::QelMessageDaxBroadcastOutboundAsync(std::ui
                                                                          std::uint32_t senderToolType,
                                                                          const std::string& senderToolId,
                                                                          const char* broadcastMsg)
-    : QelMessageMetadata(PayloadLength(outboundLength(broadcastMsgLen, senderToolId, broadcastMsg)))
+    : QelMessageMetadata(PayloadLength(checkedOutboundLength(broadcastMsgLen, senderToolId, broadcastMsg)))
 {
     Data& data = pPayload<Data>();
     data.mOffset = sizeof(Data);

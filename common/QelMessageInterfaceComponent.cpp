@@ -16,17 +16,19 @@ constexpr const char* kPayloadTooShort = "dataLength smaller than minimum accept
 
 void copyText(char* field, const std::string& text) { std::memcpy(field, text.data(), text.size()); }
 
-// The checks of a builder's arguments stand in functions that give the payload length: they run before there is a
-// frame, and before a caller id is taken.
+// The checked...Length() functions check the arguments of a builder and return its payload length. They are evaluated
+// as constructor arguments, so that arguments that are refused allocate no frame and draw no caller id. The other
+// checks come later: a frame length above 32 bits is refused after the caller id is drawn, a time that the payload
+// cannot hold also after the frame is allocated.
 
-std::uint64_t versionRequestLength(const std::string& toolId)
+std::uint64_t checkedVersionRequestLength(const std::string& toolId)
 {
     using Data = QelMessageGetEnclTypeAndInterfaceVersionReq::Data;
     require(wireLength(toolId) <= sizeof(Data::mToolId), "Tool ID is too long");
     return sizeof(Data);
 }
 
-std::uint64_t versionResponseLength(const std::string& machineType, const std::string& serialNum)
+std::uint64_t checkedVersionResponseLength(const std::string& machineType, const std::string& serialNum)
 {
     using Data = QelMessageGetEnclTypeAndInterfaceVersionRsp::Data;
     require(serialNum.size() <= sizeof(Data::mSerialNum), "System serial size is too large");
@@ -34,8 +36,8 @@ std::uint64_t versionResponseLength(const std::string& machineType, const std::s
     return sizeof(Data);
 }
 
-std::uint64_t broadcastLength(std::uint8_t broadcastType, std::uint16_t broadcastMsgLen, const std::string& toolId,
-                              const char* broadcastMsg)
+std::uint64_t checkedBroadcastLength(std::uint8_t broadcastType, std::uint16_t broadcastMsgLen,
+                                     const std::string& toolId, const char* broadcastMsg)
 {
     using Data = QelMessageDaxBroadcastReq::Data;
     require(broadcastType != QelMessageDaxBroadcastReq::kUnicast || !toolId.empty(),
@@ -50,13 +52,13 @@ void requireCapabilityLength(std::uint32_t capabilityLen)
     require(capabilityLen % 4 == 0, "Given capability length is invalid (length % 4 wasn't 0)");
 }
 
-std::uint64_t capabilityMessageLength(std::size_t fixedLength, std::uint32_t capabilityLen)
+std::uint64_t checkedCapabilityMessageLength(std::size_t fixedLength, std::uint32_t capabilityLen)
 {
     requireCapabilityLength(capabilityLen);
     return std::uint64_t{fixedLength} + capabilityLen;
 }
 
-// How many of the bytes that a message carries hold bits of a QelCapabilities.
+// The number of capability bytes of a message that hold bits of a QelCapabilities.
 std::size_t knownCapabilityBytes(std::uint32_t capabilityLen)
 {
     return std::min<std::size_t>(QelCapabilities::size() / 8, capabilityLen);
@@ -74,7 +76,7 @@ QelMessageGetEnclTypeAndInterfaceVersionReq::QelMessageGetEnclTypeAndInterfaceVe
                                                                                          std::uint16_t majorVersion,
                                                                                          std::uint16_t minorVersion,
                                                                                          const std::string& toolId)
-    : QelMessageMetadata(PayloadLength(versionRequestLength(toolId)))
+    : QelMessageMetadata(PayloadLength(checkedVersionRequestLength(toolId)))
 {
     Data& data = pPayload<Data>();
     data.mInterfaceVersion = interfaceVersion;
@@ -109,7 +111,7 @@ void QelMessageGetEnclTypeAndInterfaceVersionReq::pDerivedDebug(std::ostream& os
 QelMessageGetEnclTypeAndInterfaceVersionRsp::QelMessageGetEnclTypeAndInterfaceVersionRsp(
     std::uint32_t callerId, char interfaceVersionFamily, std::uint16_t majorVersion, std::uint16_t minorVersion,
     const std::string& machineType, const std::string& serialNum)
-    : QelMessageMetadata(callerId, PayloadLength(versionResponseLength(machineType, serialNum)))
+    : QelMessageMetadata(callerId, PayloadLength(checkedVersionResponseLength(machineType, serialNum)))
 {
     Data& data = pPayload<Data>();
     data.mInterfaceVersionFamily = interfaceVersionFamily;
@@ -158,7 +160,7 @@ QelMessageInterfaceCmpCloseKrogSessionRsp::~QelMessageInterfaceCmpCloseKrogSessi
 template <typename Derived, QelMessageClassification::Value Classification>
 QelMessageExchIntCapabilitiesBase<Derived, Classification>::QelMessageExchIntCapabilitiesBase(
     std::uint32_t capabilityLen, const QelCapabilities& capabilities)
-    : Metadata(QelMessage::PayloadLength(capabilityMessageLength(sizeof(Data), capabilityLen)))
+    : Metadata(QelMessage::PayloadLength(checkedCapabilityMessageLength(sizeof(Data), capabilityLen)))
 {
     pStore(capabilityLen, capabilities);
 }
@@ -166,7 +168,7 @@ QelMessageExchIntCapabilitiesBase<Derived, Classification>::QelMessageExchIntCap
 template <typename Derived, QelMessageClassification::Value Classification>
 QelMessageExchIntCapabilitiesBase<Derived, Classification>::QelMessageExchIntCapabilitiesBase(
     std::uint32_t callerId, std::uint32_t capabilityLen, const QelCapabilities& capabilities)
-    : Metadata(callerId, QelMessage::PayloadLength(capabilityMessageLength(sizeof(Data), capabilityLen)))
+    : Metadata(callerId, QelMessage::PayloadLength(checkedCapabilityMessageLength(sizeof(Data), capabilityLen)))
 {
     pStore(capabilityLen, capabilities);
 }
@@ -260,9 +262,9 @@ QelMessageGetInterfaceLimitsRsp::QelMessageGetInterfaceLimitsRsp()
 QelMessageGetInterfaceLimitsRsp::QelMessageGetInterfaceLimitsRsp(std::uint32_t callerId)
     : QelMessageMetadata(callerId, PayloadLength(sizeof(Data)))
 {
-    // The longest frame less the header and the fixed part of the broadcast that carries the message.
+    // The longest frame minus the header and the fixed part of the broadcast that carries the message.
     constexpr std::uint16_t kBroadcastMsgPacketSize = MtuMax - MaxHeaderSize - sizeof(QelMessageDaxBroadcastReq::Data);
-    static_assert(kBroadcastMsgPacketSize == 16306, "what the protocol promises");
+    static_assert(kBroadcastMsgPacketSize == 16306, "the protocol fixes this number");
 
     Data& data = pPayload<Data>();
     data.mMaxCommandSize = MtuMax;
@@ -280,7 +282,7 @@ QelMessageGetInterfaceLimitsRsp::~QelMessageGetInterfaceLimitsRsp() = default;
 QelMessageDaxBroadcastReq::QelMessageDaxBroadcastReq(std::uint8_t broadcastType, std::uint16_t broadcastMsgLen,
                                                      std::uint32_t toolType, const std::string& toolId,
                                                      const char* broadcastMsg)
-    : QelMessageMetadata(PayloadLength(broadcastLength(broadcastType, broadcastMsgLen, toolId, broadcastMsg)))
+    : QelMessageMetadata(PayloadLength(checkedBroadcastLength(broadcastType, broadcastMsgLen, toolId, broadcastMsg)))
 {
     Data& data = pPayload<Data>();
     data.mOffset = sizeof(Data);
@@ -331,8 +333,8 @@ QelMessageGetQelTodRsp::QelMessageGetQelTodRsp(std::uint32_t callerId, const std
     std::tm parts{};
     if (::gmtime_r(&time, &parts) == nullptr) throw std::range_error("type cannot be represented in BCD");
 
-    // Unsigned throughout: a year before 0 becomes a number that the decimal form refuses like one after 9999, and the
-    // sums cannot overflow at the ends of what the C library can break down.
+    // Unsigned arithmetic: the sums cannot overflow, and a year before 0 becomes a large number, which is refused like
+    // a year after 9999.
     const auto number = [](int part) { return static_cast<unsigned int>(part); };
     Data& data = pPayload<Data>();
     data.mYear = number(parts.tm_year) + 1900U;

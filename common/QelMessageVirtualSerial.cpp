@@ -13,15 +13,15 @@ namespace {
 
 constexpr const char* kPayloadTooShort = "dataLength shorter than actual data size";
 
-// The check of a data message's arguments gives the payload length: it runs before there is a frame, and before a
-// caller id is taken.
-std::uint64_t dataMessageLength(std::size_t fixedLength, std::uint16_t dataLength, const char* data)
+// Checks the arguments of a data message and returns its payload length. Evaluated as a constructor argument, so that
+// arguments that are refused allocate no frame and draw no caller id.
+std::uint64_t checkedDataMessageLength(std::size_t fixedLength, std::uint16_t dataLength, const char* data)
 {
     if (data == nullptr && dataLength != 0) throw std::invalid_argument("data");
     return std::uint64_t{fixedLength} + dataLength;
 }
 
-// Every payload with a session address begins its lines with it.
+// The first lines of every payload with a session address.
 template <typename Message>
 void printAddress(std::ostream& os, const Message& message)
 {
@@ -38,16 +38,13 @@ const char* toText(bool value) { return value ? "True" : "False"; }
 
 QelMessageVirtualSerialOpenReq::QelMessageVirtualSerialOpenReq(std::uint16_t lpId, std::uint16_t vssConnectionNumber,
                                                                bool forceOpen)
-    : QelMessageMetadata(PayloadLength(sizeof(Data)))
+    : QelMessageVirtualSerialAddressed(lpId, vssConnectionNumber, PayloadLength(sizeof(Data)))
 {
-    Data& data = pPayload<Data>();
-    data.mLparId = lpId;
-    data.mVssConnectionNumber = vssConnectionNumber;
-    if (forceOpen) data.mFlags = kForceOpen;
+    if (forceOpen) pPayload<Data>().mFlags = kForceOpen;
 }
 
 QelMessageVirtualSerialOpenReq::QelMessageVirtualSerialOpenReq(const char* i_buffer, unsigned int i_length)
-    : QelMessageMetadata(i_buffer, i_length)
+    : QelMessageVirtualSerialAddressed(i_buffer, i_length)
 {
     require(dataLength() >= sizeof(Data), kPayloadTooShort);
 }
@@ -62,15 +59,11 @@ void QelMessageVirtualSerialOpenReq::pDerivedDebug(std::ostream& os) const
 
 QelMessageVirtualSerialOpenRsp::QelMessageVirtualSerialOpenRsp(std::uint32_t callerId, std::uint16_t lpId,
                                                                std::uint16_t vssConnectionNumber)
-    : QelMessageMetadata(callerId, PayloadLength(sizeof(Data)))
-{
-    Data& data = pPayload<Data>();
-    data.mLparId = lpId;
-    data.mVssConnectionNumber = vssConnectionNumber;
-}
+    : QelMessageVirtualSerialAddressed(callerId, lpId, vssConnectionNumber, PayloadLength(sizeof(Data)))
+{}
 
 QelMessageVirtualSerialOpenRsp::QelMessageVirtualSerialOpenRsp(const char* i_buffer, unsigned int i_length)
-    : QelMessageMetadata(i_buffer, i_length)
+    : QelMessageVirtualSerialAddressed(i_buffer, i_length)
 {
     require(dataLength() >= sizeof(Data), kPayloadTooShort);
 }
@@ -83,16 +76,13 @@ void QelMessageVirtualSerialOpenRsp::pDerivedDebug(std::ostream& os) const { pri
 
 QelMessageVirtualSerialCloseReq::QelMessageVirtualSerialCloseReq(std::uint16_t lpId, std::uint16_t vssConnectionNumber,
                                                                  bool forceClose)
-    : QelMessageMetadata(PayloadLength(sizeof(Data)))
+    : QelMessageVirtualSerialAddressed(lpId, vssConnectionNumber, PayloadLength(sizeof(Data)))
 {
-    Data& data = pPayload<Data>();
-    data.mLparId = lpId;
-    data.mVssConnectionNumber = vssConnectionNumber;
-    if (forceClose) data.mForceClose = kForceClose;
+    if (forceClose) pPayload<Data>().mForceClose = kForceClose;
 }
 
 QelMessageVirtualSerialCloseReq::QelMessageVirtualSerialCloseReq(const char* i_buffer, unsigned int i_length)
-    : QelMessageMetadata(i_buffer, i_length)
+    : QelMessageVirtualSerialAddressed(i_buffer, i_length)
 {
     require(dataLength() >= sizeof(Data), kPayloadTooShort);
 }
@@ -142,19 +132,17 @@ void QelMessageVirtualSerialGetMaxSessionsRsp::pDerivedDebug(std::ostream& os) c
 template <typename Derived, QelMessageFunctionCodes FunctionCode, QelMessageOpTypes OpType>
 QelMessageVirtualSerialDataAsync<Derived, FunctionCode, OpType>::QelMessageVirtualSerialDataAsync(
     std::uint16_t lpId, std::uint16_t vssConnectionNumber, std::uint16_t dataLength, const char* data)
-    : Metadata(QelMessage::PayloadLength(dataMessageLength(sizeof(Data), dataLength, data)))
+    : Addressed(lpId, vssConnectionNumber,
+                QelMessage::PayloadLength(checkedDataMessageLength(sizeof(Data), dataLength, data)))
 {
-    Data& payload = this->template pPayload<Data>();
-    payload.mLparId = lpId;
-    payload.mVssConnectionNumber = vssConnectionNumber;
-    payload.mDataLength = dataLength;
+    this->template pPayload<Data>().mDataLength = dataLength;
     if (dataLength != 0) std::memcpy(this->pGetData() + sizeof(Data), data, dataLength);
 }
 
 template <typename Derived, QelMessageFunctionCodes FunctionCode, QelMessageOpTypes OpType>
 QelMessageVirtualSerialDataAsync<Derived, FunctionCode, OpType>::QelMessageVirtualSerialDataAsync(const char* i_buffer,
                                                                                                   unsigned int i_length)
-    : Metadata(i_buffer, i_length)
+    : Addressed(i_buffer, i_length)
 {
     require(this->dataLength() >= sizeof(Data), kPayloadTooShort);
     require(getSerialDataLength() <= this->dataLength() - sizeof(Data), kPayloadTooShort);
@@ -204,16 +192,12 @@ template class QelMessageVirtualSerialDataAsync<QelMessageVirtualSerialDataToDax
 
 QelMessageVirtualSerialSetupSessionReq::QelMessageVirtualSerialSetupSessionReq(std::uint16_t lpId,
                                                                                std::uint16_t vssConnectionNumber)
-    : QelMessageMetadata(PayloadLength(sizeof(Data)))
-{
-    Data& data = pPayload<Data>();
-    data.mLparId = lpId;
-    data.mVssConnectionNumber = vssConnectionNumber;
-}
+    : QelMessageVirtualSerialAddressed(lpId, vssConnectionNumber, PayloadLength(sizeof(Data)))
+{}
 
 QelMessageVirtualSerialSetupSessionReq::QelMessageVirtualSerialSetupSessionReq(const char* i_buffer,
                                                                                unsigned int i_length)
-    : QelMessageMetadata(i_buffer, i_length)
+    : QelMessageVirtualSerialAddressed(i_buffer, i_length)
 {
     require(dataLength() >= sizeof(Data), kPayloadTooShort);
 }
@@ -229,17 +213,14 @@ QelMessageVirtualSerialSetupSessionRsp::~QelMessageVirtualSerialSetupSessionRsp(
 QelMessageVirtualSerialSessionClosedAsync::QelMessageVirtualSerialSessionClosedAsync(std::uint16_t lpId,
                                                                                      std::uint16_t vssConnectionNumber,
                                                                                      CloseReason reason)
-    : QelMessageMetadata(PayloadLength(sizeof(Data)))
+    : QelMessageVirtualSerialAddressed(lpId, vssConnectionNumber, PayloadLength(sizeof(Data)))
 {
-    Data& data = pPayload<Data>();
-    data.mLparId = lpId;
-    data.mVssConnectionNumber = vssConnectionNumber;
-    data.mCloseReason = static_cast<std::uint32_t>(reason);
+    pPayload<Data>().mCloseReason = static_cast<std::uint32_t>(reason);
 }
 
 QelMessageVirtualSerialSessionClosedAsync::QelMessageVirtualSerialSessionClosedAsync(const char* i_buffer,
                                                                                      unsigned int i_length)
-    : QelMessageMetadata(i_buffer, i_length)
+    : QelMessageVirtualSerialAddressed(i_buffer, i_length)
 {
     require(dataLength() >= sizeof(Data), kPayloadTooShort);
 }
@@ -249,7 +230,7 @@ QelMessageVirtualSerialSessionClosedAsync::~QelMessageVirtualSerialSessionClosed
 void QelMessageVirtualSerialSessionClosedAsync::pDerivedDebug(std::ostream& os) const
 {
     printAddress(os, *this);
-    // As it came, not as getCloseReason() reads it: the dump is where a peer's odd number should be seen.
+    // The stored number, not getCloseReason(): a dump must show an undefined number that a peer sent.
     os << "      Close reason:       " << decFormat(pPayload<Data>().mCloseReason) << "\n";
 }
 

@@ -7,16 +7,16 @@
 
 namespace qel {
 
-/// Refuses a frame, or the arguments of a message to be built.
-/// @param phrase  what is wrong, a fixed phrase
-/// @throws QelMessageValidationException  with the phrase, unless the condition holds
+/// Refuses a frame, or the arguments of a builder, if a condition does not hold.
+/// @param phrase  the text of the exception
+/// @throws QelMessageValidationException  the condition is false
 inline void require(bool condition, const char* phrase)
 {
     if (!condition) throw QelMessageValidationException(phrase);
 }
 
-/// The length fields of texts are 16 bits wide, and a text of 65536 bytes or more wraps in them. The peer sees the
-/// wrapped number only, so whatever is checked or copied by that number must use it too.
+/// The length of a text as its 16-bit length field holds it: it wraps from 65536 bytes on. The peer sees only the
+/// wrapped number, so checks and copies that depend on it must use it too.
 inline std::uint16_t wireLength(const std::string& text) noexcept { return static_cast<std::uint16_t>(text.size()); }
 
 } // namespace qel

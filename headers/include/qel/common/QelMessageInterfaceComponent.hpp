@@ -13,27 +13,25 @@
 #include <string>
 
 /// @file
-/// The messages of the interface component, function code 0x6003: both ends say who they are, open and close the
-/// session with the hypervisor, exchange capabilities, learn the limits, relay a broadcast, read the time of day, and
-/// set or read two global attributes.
+/// The messages of the interface component, function code 0x6003: identification of both peers, the session with the
+/// hypervisor, capabilities, limits, broadcasts, the time of day and two global attributes.
 ///
-/// What holds for all of them:
+/// For all of them:
 /// - A builder makes a frame of the new header form. Reserved fields and the unused tails of character fields are sent
-///   as zero. A request takes a new caller id; a response is given the one of its request, either because the builder
-///   asks for it or through the overload that does.
-/// - The constructor from bytes takes any frame of the class's identity. It checks the frame, then the identity, then
-///   the payload, and keeps a copy. Reserved fields are not checked, and a payload longer than needed is accepted. A
-///   payload is refused with QelMessageValidationException and the phrase given at the class.
+///   as zero. A request draws a new caller id. A response carries the caller id of its request: pass it to the builder.
+/// - The constructor from bytes parses a received frame of `i_length` bytes. It checks the frame, then the identity,
+///   then the payload, and keeps a copy. Reserved fields are not checked, and a payload longer than needed is accepted.
+///   It throws QelMessageValidationException: what QelMessageMetadata throws, then the texts named at the class.
 /// - The nested `Data` is the fixed part of the payload as it lies in the frame: offsets from the first payload byte,
 ///   integers big-endian, characters without a terminating NUL.
-/// - Texts are raw bytes of any value. They are taken and returned as std::string, embedded NULs included.
-/// - Lengths from 16-bit fields allow frames longer than QelMessage::MtuMax to be built, which no stream will accept.
-/// - Ownership: a message owns its frame; pointers into it live as long as the message. Thread safety: none, as in
-///   QelMessage.
+/// - Texts are raw bytes of any value, passed and returned as std::string, embedded NULs included.
+/// - Lengths from 16-bit fields allow frames longer than QelMessage::MtuMax, which can be built but not sent.
+/// - Ownership: a message owns its frame; pointers into it live as long as the message. Thread safety: as QelMessage,
+///   one thread at a time.
 
 namespace qel {
 
-/// The console says who it is and which interface version it speaks; the first message on a connection.
+/// The console identifies itself and names its interface version; the first message on a connection.
 class QEL_EXPORT QelMessageGetEnclTypeAndInterfaceVersionReq
     : public QelMessageMetadata<QelMessageGetEnclTypeAndInterfaceVersionReq, QelMessageFunctionQelInterfaceCmp,
                                 QelMessageOpGetEnclTypeAndInterfaceVersion, QelMessageClassification::Request> {
@@ -45,7 +43,7 @@ public:
         be_uint16_t mMajorVersion;     // 10
         be_uint16_t mMinorVersion;     // 12
         unsigned char mReserved[2];    // 14
-        char mToolId[32];              // 16  a received payload may end with the id's last meaningful byte
+        char mToolId[32];              // 16  a received payload may end after the last meaningful byte
     };
     static_assert(sizeof(Data) == 48 && alignof(Data) == 1, "overlays the frame buffer");
     static_assert(offsetof(Data, mToolType) == 4 && offsetof(Data, mToolIdLength) == 8 &&
@@ -60,11 +58,10 @@ public:
                                                 std::uint16_t majorVersion, std::uint16_t minorVersion,
                                                 const std::string& toolId);
 
-    /// Takes a received frame of `i_length` bytes.
+    /// Parses a received frame.
     /// @throws QelMessageValidationException as QelMessageMetadata does; then "dataLength smaller than minimum
     ///         acceptable size" (below 16 bytes), "Tool ID length is invalid" (above 32, or more than there is)
     QelMessageGetEnclTypeAndInterfaceVersionReq(const char* i_buffer, unsigned int i_length);
-
     ~QelMessageGetEnclTypeAndInterfaceVersionReq() override;
 
     std::uint32_t getInterfaceVersion() const { return pPayload<Data>().mInterfaceVersion; }
@@ -94,7 +91,7 @@ public:
         be_uint16_t mSysMachineTypeLen; // 12  meaningful bytes of mSysMachineType, at most 16
         be_uint16_t mSysSerialNumLen;   // 14  meaningful bytes of mSerialNum, at most 16
         char mSysMachineType[16];       // 16
-        char mSerialNum[16];            // 32  a received payload may end with its last meaningful byte
+        char mSerialNum[16];            // 32  a received payload may end after the last meaningful byte
     };
     static_assert(sizeof(Data) == 48 && alignof(Data) == 1, "overlays the frame buffer");
     static_assert(offsetof(Data, mEnclosureType) == 1 && offsetof(Data, mMajorVersion) == 2 &&
@@ -103,24 +100,24 @@ public:
                       offsetof(Data, mSysMachineType) == 16 && offsetof(Data, mSerialNum) == 32,
                   "overlays the frame buffer");
 
-    /// The enclosure type of every response that is built here.
+    /// The enclosure type of every response that this class builds.
     static constexpr std::uint8_t kEnclosureType = 2;
 
     /// Builds a payload of the full 48 bytes.
     /// @param callerId that of the request
-    /// @param machineType,serialNum at most 16 bytes each
+    /// @param machineType at most 16 bytes
+    /// @param serialNum at most 16 bytes
     /// @throws QelMessageValidationException "System serial size is too large"; after it "System machine type is too
     ///         large"
     QelMessageGetEnclTypeAndInterfaceVersionRsp(std::uint32_t callerId, char interfaceVersionFamily,
                                                 std::uint16_t majorVersion, std::uint16_t minorVersion,
                                                 const std::string& machineType, const std::string& serialNum);
 
-    /// Takes a received frame of `i_length` bytes.
+    /// Parses a received frame.
     /// @throws QelMessageValidationException as QelMessageMetadata does; then "dataLength smaller than minimum
     ///         acceptable size" (below 32 bytes), "Invalid machine type length", "Invalid system serial length" (above
     ///         16), "dataLength not long enough to encapsulate final string field"
     QelMessageGetEnclTypeAndInterfaceVersionRsp(const char* i_buffer, unsigned int i_length);
-
     ~QelMessageGetEnclTypeAndInterfaceVersionRsp() override;
 
     char getInterfaceVersionFamily() const { return pPayload<Data>().mInterfaceVersionFamily; }
@@ -144,7 +141,7 @@ private:
     std::uint16_t pGetSystemSerialNumLen() const { return pPayload<Data>().mSysSerialNumLen; }
 };
 
-/// Asks for the session with the hypervisor. No payload.
+/// Opens the session with the hypervisor. No payload.
 class QEL_EXPORT QelMessageInterfaceCmpOpenKrogSessionReq
     : public QelMessageMetadata<QelMessageInterfaceCmpOpenKrogSessionReq, QelMessageFunctionQelInterfaceCmp,
                                 QelMessageOpOpenKrogSession, QelMessageClassification::Request> {
@@ -153,7 +150,7 @@ public:
     ~QelMessageInterfaceCmpOpenKrogSessionReq() override;
 };
 
-/// Answers the request for the session with the hypervisor. No payload.
+/// Response to QelMessageInterfaceCmpOpenKrogSessionReq. No payload.
 class QEL_EXPORT QelMessageInterfaceCmpOpenKrogSessionRsp
     : public QelMessageMetadata<QelMessageInterfaceCmpOpenKrogSessionRsp, QelMessageFunctionQelInterfaceCmp,
                                 QelMessageOpOpenKrogSession, QelMessageClassification::Response> {
@@ -162,7 +159,7 @@ public:
     ~QelMessageInterfaceCmpOpenKrogSessionRsp() override;
 };
 
-/// Gives the session with the hypervisor up. No payload.
+/// Closes the session with the hypervisor. No payload.
 class QEL_EXPORT QelMessageInterfaceCmpCloseKrogSessionReq
     : public QelMessageMetadata<QelMessageInterfaceCmpCloseKrogSessionReq, QelMessageFunctionQelInterfaceCmp,
                                 QelMessageOpCloseKrogSession, QelMessageClassification::Request> {
@@ -171,7 +168,7 @@ public:
     ~QelMessageInterfaceCmpCloseKrogSessionReq() override;
 };
 
-/// Answers that the session with the hypervisor is closed. No payload.
+/// Response to QelMessageInterfaceCmpCloseKrogSessionReq. No payload.
 class QEL_EXPORT QelMessageInterfaceCmpCloseKrogSessionRsp
     : public QelMessageMetadata<QelMessageInterfaceCmpCloseKrogSessionRsp, QelMessageFunctionQelInterfaceCmp,
                                 QelMessageOpCloseKrogSession, QelMessageClassification::Response> {
@@ -182,9 +179,8 @@ public:
 
 /// The payload of both capability messages: a length and that many bytes of capability bits.
 ///
-/// Bit n of a QelCapabilities is the bit 0x80 >> (n % 8) of byte n / 8. Bytes past the fourth belong to capabilities
-/// that this class does not know; they are sent as zero and ignored when received. Not built by itself: users take the
-/// two concrete classes.
+/// Bit n of a QelCapabilities is the bit 0x80 >> (n % 8) of byte n / 8. Bytes after the fourth are sent as zero and
+/// ignored when received. Use the two concrete classes.
 /// @tparam Derived the concrete class
 /// @tparam Classification request or response
 template <typename Derived, QelMessageClassification::Value Classification>
@@ -200,14 +196,13 @@ public:
 
     ~QelMessageExchIntCapabilitiesBase() override;
 
-    /// Bytes of capability bits that the message carries, known ones or not.
+    /// Bytes of capability bits that the message carries, including those that are ignored.
     std::uint32_t getCapabilityLen() const { return this->template pPayload<Data>().mCapabilityLen; }
-
-    /// The first 32 capability bits; those that the message does not carry are clear.
+    /// The first 32 capability bits; bits that the message does not carry are clear.
     QelCapabilities getCapabilities() const;
 
 protected:
-    /// Builds with a caller id of its own, or with a given one.
+    /// Builds with a new caller id, or with the given one.
     QelMessageExchIntCapabilitiesBase(std::uint32_t capabilityLen, const QelCapabilities& capabilities);
     QelMessageExchIntCapabilitiesBase(std::uint32_t callerId, std::uint32_t capabilityLen,
                                       const QelCapabilities& capabilities);
@@ -224,45 +219,41 @@ private:
     void pStore(std::uint32_t capabilityLen, const QelCapabilities& capabilities);
 };
 
-/// One end tells which capabilities it supports.
+/// A peer sends the capabilities that it supports.
 class QEL_EXPORT QelMessageExchIntCapabilitiesReq
     : public QelMessageExchIntCapabilitiesBase<QelMessageExchIntCapabilitiesReq, QelMessageClassification::Request> {
 public:
     /// Builds 4 bytes of capability bits.
     explicit QelMessageExchIntCapabilitiesReq(const QelCapabilities& capabilities);
 
-    /// Takes a received frame of `i_length` bytes.
+    /// Parses a received frame.
     /// @throws QelMessageValidationException as QelMessageMetadata does; then "dataLength smaller than minimum
     ///         acceptable size" (below 4 bytes), "Given capability length is invalid (length % 4 wasn't 0)",
     ///         "capabilityLen larger than acceptable" (more than there is)
     QelMessageExchIntCapabilitiesReq(const char* i_buffer, unsigned int i_length);
-
     ~QelMessageExchIntCapabilitiesReq() override;
 };
 
-/// The other end answers with its own, or with those that both support.
+/// The other peer responds with its own capabilities, or with those that both support.
 class QEL_EXPORT QelMessageExchIntCapabilitiesRsp
     : public QelMessageExchIntCapabilitiesBase<QelMessageExchIntCapabilitiesRsp, QelMessageClassification::Response> {
 public:
-    /// Builds with a new caller id. To answer a request, give its caller id.
-    /// @param capabilityLen bytes of capability bits, a multiple of 4. Below 4 the bits that do not fit are left out;
-    ///        bytes past the fourth are zero.
+    /// Builds with a new caller id, or with the caller id of the request.
+    /// @param capabilityLen bytes of capability bits, a multiple of 4; 0 carries no bits, and bytes after the fourth
+    ///        are zero
     /// @throws QelMessageValidationException "Given capability length is invalid (length % 4 wasn't 0)"
     /// @throws std::invalid_argument "length": the frame length would not fit its 32-bit field
     QelMessageExchIntCapabilitiesRsp(std::uint32_t capabilityLen, const QelCapabilities& capabilities);
-
-    /// The same with the caller id of the request that this answers.
     QelMessageExchIntCapabilitiesRsp(std::uint32_t callerId, std::uint32_t capabilityLen,
                                      const QelCapabilities& capabilities);
 
-    /// Takes a received frame of `i_length` bytes.
+    /// Parses a received frame.
     /// @throws QelMessageValidationException as QelMessageExchIntCapabilitiesReq does
     QelMessageExchIntCapabilitiesRsp(const char* i_buffer, unsigned int i_length);
-
     ~QelMessageExchIntCapabilitiesRsp() override;
 };
 
-/// Asks what the hypervisor side can take. No payload.
+/// Asks for the limits of the hypervisor side. No payload.
 class QEL_EXPORT QelMessageGetInterfaceLimitsReq
     : public QelMessageMetadata<QelMessageGetInterfaceLimitsReq, QelMessageFunctionQelInterfaceCmp,
                                 QelMessageOpGetInterfaceImplementationLimits, QelMessageClassification::Request> {
@@ -271,10 +262,10 @@ public:
     ~QelMessageGetInterfaceLimitsReq() override;
 };
 
-/// Answers what this library can take; the values are always the same.
+/// Responds with the limits of this library; the values never change.
 ///
-/// Only ever built, never made from bytes: whoever receives one gets a plain QelMessage and views its payload as `Data`
-/// after comparing dataLength() with sizeof(Data). It prints no payload fields in debug().
+/// This class is only built, never parsed: a received response is a plain QelMessage. Compare its dataLength() with
+/// sizeof(Data), then view its payload as `Data`. debug() prints no payload fields.
 class QEL_EXPORT QelMessageGetInterfaceLimitsRsp
     : public QelMessageMetadata<QelMessageGetInterfaceLimitsRsp, QelMessageFunctionQelInterfaceCmp,
                                 QelMessageOpGetInterfaceImplementationLimits, QelMessageClassification::Response> {
@@ -284,7 +275,7 @@ public:
         be_uint16_t mMaxKrogCommandSize;          //  2  bytes of the longest frame for the hypervisor: 4096
         be_uint16_t mBroadcastMsgPacketSize;      //  4  bytes of the longest broadcast message: 16306
         unsigned char mReserved1[2];              //  6
-        unsigned char mDaxsSupported;             //  8  consoles that may be connected at a time
+        unsigned char mDaxsSupported;             //  8  consoles that may be connected at one time
         unsigned char mReserved2[3];              //  9
         be_uint16_t mNonpersistentLocksSupported; // 12
         be_uint16_t mPersistentLocksSupported;    // 14
@@ -300,23 +291,21 @@ public:
     static constexpr unsigned int NON_PERSISTENT_LOCKS_SUPPORTED = 0;
     static constexpr unsigned int PERSISTENT_LOCKS_SUPPORTED = 0;
 
-    /// Builds with a new caller id. To answer a request, give its caller id.
+    /// Builds with a new caller id, or with the caller id of the request.
     QelMessageGetInterfaceLimitsRsp();
-
-    /// The same with the caller id of the request that this answers.
     explicit QelMessageGetInterfaceLimitsRsp(std::uint32_t callerId);
 
     ~QelMessageGetInterfaceLimitsRsp() override;
 };
 
-/// A console sends a message to the other consoles. The message is carried as it is; the hypervisor side passes it on
-/// as a QelMessageDaxBroadcastOutboundAsync.
+/// A console broadcasts a message to the other consoles. The hypervisor side relays the bytes, unchanged, as a
+/// QelMessageDaxBroadcastOutboundAsync.
 class QEL_EXPORT QelMessageDaxBroadcastReq
     : public QelMessageMetadata<QelMessageDaxBroadcastReq, QelMessageFunctionQelInterfaceCmp, QelMessageOpDaxBroadcast,
                                 QelMessageClassification::Request> {
 public:
     struct Data {
-        be_uint16_t mOffset;          //  0  where the message begins in the payload: 46 when built, or more
+        be_uint16_t mOffset;          //  0  offset of the message in the payload: 46 when built, or more
         unsigned char mBroadcastType; //  2
         unsigned char mReserved0;     //  3
         be_uint16_t mBroadcastMsgLen; //  4  bytes of the message
@@ -333,10 +322,10 @@ public:
                       offsetof(Data, mToolId) == 14,
                   "overlays the frame buffer");
 
-    /// The broadcast type that addresses one tool; it needs a tool id. What other types mean is up to the programs.
+    /// The broadcast type that addresses one tool; it needs a tool id. The programs define the other types.
     static constexpr std::uint8_t kUnicast = 1;
 
-    /// Builds a message; the checks come in the order of the phrases.
+    /// Builds a message; the checks run in the order of the texts.
     /// @param toolId of the addressee, at most 32 bytes; may be empty unless the type is kUnicast
     /// @param broadcastMsg `broadcastMsgLen` bytes, copied; may be null when that is 0
     /// @throws QelMessageValidationException "Unicast message has no valid toolID"; "toolIdLen greater than maximum
@@ -345,13 +334,12 @@ public:
     QelMessageDaxBroadcastReq(std::uint8_t broadcastType, std::uint16_t broadcastMsgLen, std::uint32_t toolType,
                               const std::string& toolId, const char* broadcastMsg);
 
-    /// Takes a received frame of `i_length` bytes.
+    /// Parses a received frame.
     /// @throws QelMessageValidationException as QelMessageMetadata does; then "dataLength smaller than minimum
     ///         acceptable size" (below 46 bytes), "message offset less than minimum acceptable size" (below 46),
     ///         "message greater than maximum acceptable size" (ends past the payload), "Unicast message has no valid
     ///         toolID", "toolIdLen greater than maximum acceptable size" (above 32)
     QelMessageDaxBroadcastReq(const char* i_buffer, unsigned int i_length);
-
     ~QelMessageDaxBroadcastReq() override;
 
     /// The broadcast type.
@@ -359,8 +347,7 @@ public:
     std::uint32_t getToolType() const { return pPayload<Data>().mToolType; }
     std::uint16_t getBroadcastMsgLen() const { return pPayload<Data>().mBroadcastMsgLen; }
     std::string getToolId() const { return std::string(pPayload<Data>().mToolId, pPayload<Data>().mToolIdLen); }
-
-    /// The message, getBroadcastMsgLen() bytes, in place; never null, but not to be read when that is 0.
+    /// The message, getBroadcastMsgLen() bytes, in place. Never null, but not to be read when the length is 0.
     const char* getDaxPacket() const { return getData() + pGetDataOffset(); }
 
 protected:
@@ -370,7 +357,7 @@ private:
     std::uint16_t pGetDataOffset() const { return pPayload<Data>().mOffset; }
 };
 
-/// Answers that a broadcast was taken. No payload.
+/// Response to QelMessageDaxBroadcastReq. No payload.
 class QEL_EXPORT QelMessageDaxBroadcastRsp
     : public QelMessageMetadata<QelMessageDaxBroadcastRsp, QelMessageFunctionQelInterfaceCmp, QelMessageOpDaxBroadcast,
                                 QelMessageClassification::Response> {
@@ -388,10 +375,10 @@ public:
     ~QelMessageGetQelTodReq() override;
 };
 
-/// Answers with the time of day, in UTC.
+/// Responds with the time of day, in UTC.
 ///
-/// Only ever built, never made from bytes: whoever receives one gets a plain QelMessage and views its payload as `Data`
-/// after comparing dataLength() with sizeof(Data).
+/// This class is only built, never parsed: a received response is a plain QelMessage. Compare its dataLength() with
+/// sizeof(Data), then view its payload as `Data`.
 class QEL_EXPORT QelMessageGetQelTodRsp
     : public QelMessageMetadata<QelMessageGetQelTodRsp, QelMessageFunctionQelInterfaceCmp, QelMessageOpGetQelTod,
                                 QelMessageClassification::Response> {
@@ -410,13 +397,11 @@ public:
                       offsetof(Data, mMinute) == 5 && offsetof(Data, mSecond) == 6 && offsetof(Data, mRsvd) == 7,
                   "overlays the frame buffer");
 
-    /// Builds with a new caller id. To answer a request, give its caller id.
-    /// @param time seconds since the epoch, 1970-01-01 00:00:00 UTC; the local time zone has no influence
-    /// @throws std::range_error "type cannot be represented in BCD": the year is before 0 or after 9999, or the C
-    ///         library cannot break the time down
+    /// Builds with a new caller id, or with the caller id of the request.
+    /// @param time seconds since the epoch, 1970-01-01 00:00:00 UTC; the local time zone has no effect
+    /// @throws std::range_error "type cannot be represented in BCD": the year is not in [0, 9999], or the C library
+    ///         cannot convert the time
     explicit QelMessageGetQelTodRsp(const std::time_t& time);
-
-    /// The same with the caller id of the request that this answers.
     QelMessageGetQelTodRsp(std::uint32_t callerId, const std::time_t& time);
 
     ~QelMessageGetQelTodRsp() override;
@@ -427,10 +412,9 @@ protected:
 
 /// The payload of the global mode attribute: a mode and the text that names a machine (type, model and serial number).
 ///
-/// The length field holds the text's length modulo 65536 while the payload holds the whole text: builders do not limit
-/// it, only receivers check it. Not built by itself: users take the two concrete classes.
-/// @tparam Derived the concrete class
-/// @tparam OpType,Classification its identity
+/// Builders do not limit the text: the payload holds all of it, the length field its length modulo 65536. Use the two
+/// concrete classes.
+/// @tparam Derived the concrete class, with the identity that the other arguments give
 template <typename Derived, QelMessageOpTypes OpType, QelMessageClassification::Value Classification>
 class QEL_EXPORT QelMessageGlobalModeAttributeBase
     : public QelMessageMetadata<Derived, QelMessageFunctionQelInterfaceCmp, OpType, Classification> {
@@ -446,13 +430,13 @@ public:
 
     ~QelMessageGlobalModeAttributeBase() override;
 
-    /// What a mode means is up to the programs.
+    /// The programs define what a mode means.
     std::uint8_t getMode() const { return this->template pPayload<Data>().mMode; }
     std::uint16_t getMTMSLen() const { return this->template pPayload<Data>().mMTMSLen; }
     std::string getMTMS() const { return std::string(this->getData() + sizeof(Data), getMTMSLen()); }
 
 protected:
-    /// Builds with a caller id of its own, or with a given one.
+    /// Builds with a new caller id, or with the given one.
     QelMessageGlobalModeAttributeBase(std::uint8_t mode, const std::string& mtms);
     QelMessageGlobalModeAttributeBase(std::uint32_t callerId, std::uint8_t mode, const std::string& mtms);
     QelMessageGlobalModeAttributeBase(const char* i_buffer, unsigned int i_length);
@@ -467,20 +451,19 @@ private:
     void pStore(std::uint8_t mode, const std::string& mtms);
 };
 
-/// Sets the global mode attribute. There is no class for the answer: it has no payload and no identity of its own.
+/// Sets the global mode attribute. This library has no class for the response: a received one is a plain QelMessage.
 class QEL_EXPORT QelMessageSetGlobalModeAttributeReq
     : public QelMessageGlobalModeAttributeBase<QelMessageSetGlobalModeAttributeReq, QelMessageOpSetGlobalModeAttribute,
                                                QelMessageClassification::Request> {
 public:
-    /// @param mtms any length. From 65536 bytes on the length field wraps: such a message reads back a shorter text.
+    /// @param mtms any length. From 65536 bytes on the length field wraps, and the receiver reads a shorter text.
     /// @throws std::invalid_argument "length": the frame length would not fit its 32-bit field
     QelMessageSetGlobalModeAttributeReq(std::uint8_t mode, const std::string& mtms);
 
-    /// Takes a received frame of `i_length` bytes.
+    /// Parses a received frame.
     /// @throws QelMessageValidationException as QelMessageMetadata does; then "dataLength smaller than minimum
     ///         acceptable size" (below 4 bytes), "mtmsLen larger than acceptable" (more than there is)
     QelMessageSetGlobalModeAttributeReq(const char* i_buffer, unsigned int i_length);
-
     ~QelMessageSetGlobalModeAttributeReq() override;
 };
 
@@ -493,32 +476,28 @@ public:
     ~QelMessageGetGlobalModeAttributeReq() override;
 };
 
-/// Answers with the global mode attribute.
+/// Responds with the global mode attribute.
 class QEL_EXPORT QelMessageGetGlobalModeAttributeRsp
     : public QelMessageGlobalModeAttributeBase<QelMessageGetGlobalModeAttributeRsp, QelMessageOpGetGlobalModeAttribute,
                                                QelMessageClassification::Response> {
 public:
-    /// Builds with a new caller id. To answer a request, give its caller id.
+    /// Builds with a new caller id, or with the caller id of the request.
     /// @param mtms as in QelMessageSetGlobalModeAttributeReq
     /// @throws std::invalid_argument "length": the frame length would not fit its 32-bit field
     QelMessageGetGlobalModeAttributeRsp(std::uint8_t mode, const std::string& mtms);
-
-    /// The same with the caller id of the request that this answers.
     QelMessageGetGlobalModeAttributeRsp(std::uint32_t callerId, std::uint8_t mode, const std::string& mtms);
 
-    /// Takes a received frame of `i_length` bytes.
+    /// Parses a received frame.
     /// @throws QelMessageValidationException as QelMessageSetGlobalModeAttributeReq does
     QelMessageGetGlobalModeAttributeRsp(const char* i_buffer, unsigned int i_length);
-
     ~QelMessageGetGlobalModeAttributeRsp() override;
 };
 
-/// The payload of the global save-area metadata: a length and that many bytes, which only the programs understand.
+/// The payload of the global save-area metadata: a length and that many opaque bytes.
 ///
-/// The length field holds the length modulo 65536 while the payload holds all bytes: builders do not limit them, only
-/// receivers check. Not built by itself: users take the two concrete classes.
-/// @tparam Derived the concrete class
-/// @tparam OpType,Classification its identity
+/// Builders do not limit the metadata: the payload holds all bytes, the length field their number modulo 65536. Use the
+/// two concrete classes.
+/// @tparam Derived the concrete class, with the identity that the other arguments give
 template <typename Derived, QelMessageOpTypes OpType, QelMessageClassification::Value Classification>
 class QEL_EXPORT QelMessageGlobalSaveAreaMetadataBase
     : public QelMessageMetadata<Derived, QelMessageFunctionQelInterfaceCmp, OpType, Classification> {
@@ -535,7 +514,7 @@ public:
     std::string getMetadata() const { return std::string(this->getData() + sizeof(Data), getMetadataLen()); }
 
 protected:
-    /// Builds with a caller id of its own, or with a given one.
+    /// Builds with a new caller id, or with the given one.
     explicit QelMessageGlobalSaveAreaMetadataBase(const std::string& metadata);
     QelMessageGlobalSaveAreaMetadataBase(std::uint32_t callerId, const std::string& metadata);
     QelMessageGlobalSaveAreaMetadataBase(const char* i_buffer, unsigned int i_length);
@@ -556,19 +535,18 @@ class QEL_EXPORT QelMessageSetGlobalSaveAreaMetadataReq
                                                   QelMessageOpSetGlobalSaveAreaMetadata,
                                                   QelMessageClassification::Request> {
 public:
-    /// @param metadata any length. From 65536 bytes on the length field wraps: such a message reads back fewer bytes.
+    /// @param metadata any length. From 65536 bytes on the length field wraps, and the receiver reads fewer bytes.
     /// @throws std::invalid_argument "length": the frame length would not fit its 32-bit field
     explicit QelMessageSetGlobalSaveAreaMetadataReq(const std::string& metadata);
 
-    /// Takes a received frame of `i_length` bytes.
+    /// Parses a received frame.
     /// @throws QelMessageValidationException as QelMessageMetadata does; then "dataLength smaller than minimum
     ///         acceptable size" (below 2 bytes), "metadataLen larger than acceptable" (more than there is)
     QelMessageSetGlobalSaveAreaMetadataReq(const char* i_buffer, unsigned int i_length);
-
     ~QelMessageSetGlobalSaveAreaMetadataReq() override;
 };
 
-/// Answers that the global save-area metadata is set. No payload.
+/// Response to QelMessageSetGlobalSaveAreaMetadataReq. No payload.
 class QEL_EXPORT QelMessageSetGlobalSaveAreaMetadataRsp
     : public QelMessageMetadata<QelMessageSetGlobalSaveAreaMetadataRsp, QelMessageFunctionQelInterfaceCmp,
                                 QelMessageOpSetGlobalSaveAreaMetadata, QelMessageClassification::Response> {
@@ -586,28 +564,25 @@ public:
     ~QelMessageGetGlobalSaveAreaMetadataReq() override;
 };
 
-/// Answers with the global save-area metadata.
+/// Responds with the global save-area metadata.
 class QEL_EXPORT QelMessageGetGlobalSaveAreaMetadataRsp
     : public QelMessageGlobalSaveAreaMetadataBase<QelMessageGetGlobalSaveAreaMetadataRsp,
                                                   QelMessageOpGetGlobalSaveAreaMetadata,
                                                   QelMessageClassification::Response> {
 public:
-    /// Builds with a new caller id. To answer a request, give its caller id.
+    /// Builds with a new caller id, or with the caller id of the request.
     /// @param metadata as in QelMessageSetGlobalSaveAreaMetadataReq
     /// @throws std::invalid_argument "length": the frame length would not fit its 32-bit field
     explicit QelMessageGetGlobalSaveAreaMetadataRsp(const std::string& metadata);
-
-    /// The same with the caller id of the request that this answers.
     QelMessageGetGlobalSaveAreaMetadataRsp(std::uint32_t callerId, const std::string& metadata);
 
-    /// Takes a received frame of `i_length` bytes.
+    /// Parses a received frame.
     /// @throws QelMessageValidationException as QelMessageSetGlobalSaveAreaMetadataReq does
     QelMessageGetGlobalSaveAreaMetadataRsp(const char* i_buffer, unsigned int i_length);
-
     ~QelMessageGetGlobalSaveAreaMetadataRsp() override;
 };
 
-// The templates are made for these six classes only, in the library.
+// The library instantiates the templates, for these six classes only.
 extern template class QelMessageExchIntCapabilitiesBase<QelMessageExchIntCapabilitiesReq,
                                                         QelMessageClassification::Request>;
 extern template class QelMessageExchIntCapabilitiesBase<QelMessageExchIntCapabilitiesRsp,

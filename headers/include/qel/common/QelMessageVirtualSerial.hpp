@@ -10,50 +10,102 @@
 
 /// @file
 /// The messages of virtual serial sessions, the serial consoles of partitions: function code 0x6002, and 0x7000 for
-/// what goes to the console unasked. A session is addressed by the id of a logical partition and a connection number;
-/// what both mean is up to the programs.
+/// asynchronous messages to the console. The id of a logical partition and a connection number address a session; the
+/// programs define both.
 ///
-/// What holds for all of them:
-/// - A builder makes a frame of the new header form; reserved fields are sent as zero. It checks nothing but what is
-///   said at the class. Responses are given the caller id of their request; all others take a new one.
-/// - The constructor from bytes takes any frame of the class's identity. It checks the frame, then the identity, then
-///   the payload, and keeps a copy. Reserved fields are not checked, and a payload longer than needed is accepted; a
-///   payload shorter than `Data`, or than `Data` and the serial data together, is refused with
-///   QelMessageValidationException "dataLength shorter than actual data size".
+/// For all of them:
+/// - A builder makes a frame of the new header form; reserved fields are sent as zero. It checks its arguments only
+///   where the class says so. A response carries the caller id of its request; all others draw a new one.
+/// - The constructor from bytes parses a received frame of `i_length` bytes. It checks the frame, then the identity,
+///   then the payload, and keeps a copy. Reserved fields are not checked, and a payload longer than needed is accepted.
+///   A payload shorter than `Data`, or than `Data` and the serial data, is refused.
 /// - The nested `Data` is the fixed part of the payload as it lies in the frame: offsets from the first payload byte,
 ///   integers big-endian.
-/// - Ownership: a message owns its frame; pointers into it live as long as the message. Thread safety: none, as in
-///   QelMessage.
+/// - Ownership: a message owns its frame; pointers into it live as long as the message. Thread safety: as QelMessage,
+///   one thread at a time.
 
 namespace qel {
 
-/// Asks for a session with the serial console of a partition.
+/// The session address, at the start of every payload of this file except that of the maximum-sessions response.
+struct QelVirtualSerialAddress {
+    be_uint16_t mLparId;              //  0  logical partition id
+    be_uint16_t mVssConnectionNumber; //  2  connection number of the session
+};
+static_assert(sizeof(QelVirtualSerialAddress) == 4 && alignof(QelVirtualSerialAddress) == 1 &&
+                  offsetof(QelVirtualSerialAddress, mVssConnectionNumber) == 2,
+              "overlays the frame buffer");
+
+/// Base of the messages whose payload begins with a session address. Use the concrete classes.
+/// @tparam Derived the concrete class, with the identity that the other arguments give
+template <typename Derived, QelMessageFunctionCodes FunctionCode, QelMessageOpTypes OpType,
+          QelMessageClassification::Value Classification>
+class QEL_EXPORT QelMessageVirtualSerialAddressed
+    : public QelMessageMetadata<Derived, FunctionCode, OpType, Classification> {
+public:
+    std::uint16_t getLpId() const { return this->template pPayload<QelVirtualSerialAddress>().mLparId; }
+    std::uint16_t getVssConnectionNumber() const
+    {
+        return this->template pPayload<QelVirtualSerialAddress>().mVssConnectionNumber;
+    }
+
+protected:
+    /// Builds with a new caller id. The rest of the payload, which has the given length in all, is zero.
+    QelMessageVirtualSerialAddressed(std::uint16_t lpId, std::uint16_t vssConnectionNumber,
+                                     QelMessage::PayloadLength payloadLength)
+        : Metadata(payloadLength)
+    {
+        pStoreAddress(lpId, vssConnectionNumber);
+    }
+
+    /// The same with the given caller id.
+    QelMessageVirtualSerialAddressed(std::uint32_t callerId, std::uint16_t lpId, std::uint16_t vssConnectionNumber,
+                                     QelMessage::PayloadLength payloadLength)
+        : Metadata(callerId, payloadLength)
+    {
+        pStoreAddress(lpId, vssConnectionNumber);
+    }
+
+    /// Parses a received frame. The concrete class checks that the payload is long enough.
+    /// @throws QelMessageValidationException as QelMessageMetadata does
+    QelMessageVirtualSerialAddressed(const char* i_buffer, unsigned int i_length) : Metadata(i_buffer, i_length) {}
+
+    QelMessageVirtualSerialAddressed(const QelMessageVirtualSerialAddressed&) = default;
+    QelMessageVirtualSerialAddressed& operator=(const QelMessageVirtualSerialAddressed&) = default;
+    ~QelMessageVirtualSerialAddressed() override = default;
+
+private:
+    using Metadata = QelMessageMetadata<Derived, FunctionCode, OpType, Classification>;
+
+    void pStoreAddress(std::uint16_t lpId, std::uint16_t vssConnectionNumber)
+    {
+        QelVirtualSerialAddress& address = this->template pPayload<QelVirtualSerialAddress>();
+        address.mLparId = lpId;
+        address.mVssConnectionNumber = vssConnectionNumber;
+    }
+};
+
+/// Opens a session with the serial console of a partition.
 class QEL_EXPORT QelMessageVirtualSerialOpenReq
-    : public QelMessageMetadata<QelMessageVirtualSerialOpenReq, QelMessageFunctionVirtualSerial,
-                                QelMessageOpOpenVirtualSerialSession, QelMessageClassification::Request> {
+    : public QelMessageVirtualSerialAddressed<QelMessageVirtualSerialOpenReq, QelMessageFunctionVirtualSerial,
+                                              QelMessageOpOpenVirtualSerialSession, QelMessageClassification::Request> {
 public:
     struct Data {
-        be_uint16_t mLparId;              //  0  logical partition id
-        be_uint16_t mVssConnectionNumber; //  2  connection number of the session
+        QelVirtualSerialAddress mAddress; //  0
         be_uint16_t mFlags;               //  4  bit 15: force open; the others are sent as zero
         be_uint16_t mReserved;            //  6
     };
     static_assert(sizeof(Data) == 8 && alignof(Data) == 1, "overlays the frame buffer");
-    static_assert(offsetof(Data, mVssConnectionNumber) == 2 && offsetof(Data, mFlags) == 4 &&
-                      offsetof(Data, mReserved) == 6,
-                  "overlays the frame buffer");
+    static_assert(offsetof(Data, mFlags) == 4 && offsetof(Data, mReserved) == 6, "overlays the frame buffer");
 
-    /// @param forceOpen take the session away from whoever holds it
+    /// @param forceOpen take the session even if another console holds it
     QelMessageVirtualSerialOpenReq(std::uint16_t lpId, std::uint16_t vssConnectionNumber, bool forceOpen);
 
-    /// Takes a received frame of `i_length` bytes.
-    /// @throws QelMessageValidationException as QelMessageMetadata does, then as the top of this file says
+    /// Parses a received frame.
+    /// @throws QelMessageValidationException as QelMessageMetadata does; then "dataLength shorter than actual data
+    /// size"
     QelMessageVirtualSerialOpenReq(const char* i_buffer, unsigned int i_length);
-
     ~QelMessageVirtualSerialOpenReq() override;
 
-    std::uint16_t getLpId() const { return pPayload<Data>().mLparId; }
-    std::uint16_t getVssConnectionNumber() const { return pPayload<Data>().mVssConnectionNumber; }
     bool isForceOpen() const { return (pPayload<Data>().mFlags & kForceOpen) != 0; }
 
 protected:
@@ -63,61 +115,54 @@ private:
     static constexpr std::uint16_t kForceOpen = 0x8000;
 };
 
-/// Answers that the session is open.
+/// Response to QelMessageVirtualSerialOpenReq.
 class QEL_EXPORT QelMessageVirtualSerialOpenRsp
-    : public QelMessageMetadata<QelMessageVirtualSerialOpenRsp, QelMessageFunctionVirtualSerial,
-                                QelMessageOpOpenVirtualSerialSession, QelMessageClassification::Response> {
+    : public QelMessageVirtualSerialAddressed<QelMessageVirtualSerialOpenRsp, QelMessageFunctionVirtualSerial,
+                                              QelMessageOpOpenVirtualSerialSession,
+                                              QelMessageClassification::Response> {
 public:
     struct Data {
-        be_uint16_t mLparId;              //  0  logical partition id
-        be_uint16_t mVssConnectionNumber; //  2  connection number of the session
+        QelVirtualSerialAddress mAddress; //  0
         be_uint32_t mReserved;            //  4
     };
     static_assert(sizeof(Data) == 8 && alignof(Data) == 1, "overlays the frame buffer");
-    static_assert(offsetof(Data, mVssConnectionNumber) == 2 && offsetof(Data, mReserved) == 4,
-                  "overlays the frame buffer");
+    static_assert(offsetof(Data, mReserved) == 4, "overlays the frame buffer");
 
     /// @param callerId that of the request
     QelMessageVirtualSerialOpenRsp(std::uint32_t callerId, std::uint16_t lpId, std::uint16_t vssConnectionNumber);
 
-    /// Takes a received frame of `i_length` bytes.
-    /// @throws QelMessageValidationException as QelMessageMetadata does, then as the top of this file says
+    /// Parses a received frame.
+    /// @throws QelMessageValidationException as QelMessageMetadata does; then "dataLength shorter than actual data
+    /// size"
     QelMessageVirtualSerialOpenRsp(const char* i_buffer, unsigned int i_length);
-
     ~QelMessageVirtualSerialOpenRsp() override;
-
-    std::uint16_t getLpId() const { return pPayload<Data>().mLparId; }
-    std::uint16_t getVssConnectionNumber() const { return pPayload<Data>().mVssConnectionNumber; }
 
 protected:
     void pDerivedDebug(std::ostream& os) const override;
 };
 
-/// Asks to close a session.
+/// Closes a session.
 class QEL_EXPORT QelMessageVirtualSerialCloseReq
-    : public QelMessageMetadata<QelMessageVirtualSerialCloseReq, QelMessageFunctionVirtualSerial,
-                                QelMessageOpCloseVirtualSerialSession, QelMessageClassification::Request> {
+    : public QelMessageVirtualSerialAddressed<QelMessageVirtualSerialCloseReq, QelMessageFunctionVirtualSerial,
+                                              QelMessageOpCloseVirtualSerialSession,
+                                              QelMessageClassification::Request> {
 public:
     struct Data {
-        be_uint16_t mLparId;              //  0  logical partition id
-        be_uint16_t mVssConnectionNumber; //  2  connection number of the session
+        QelVirtualSerialAddress mAddress; //  0
         unsigned char mForceClose;        //  4  0xFF: force close, 0x00: normal close
     };
     static_assert(sizeof(Data) == 5 && alignof(Data) == 1, "overlays the frame buffer");
-    static_assert(offsetof(Data, mVssConnectionNumber) == 2 && offsetof(Data, mForceClose) == 4,
-                  "overlays the frame buffer");
+    static_assert(offsetof(Data, mForceClose) == 4, "overlays the frame buffer");
 
-    /// @param forceClose close the session whoever holds it
+    /// @param forceClose close the session even if another console holds it
     QelMessageVirtualSerialCloseReq(std::uint16_t lpId, std::uint16_t vssConnectionNumber, bool forceClose);
 
-    /// Takes a received frame of `i_length` bytes.
-    /// @throws QelMessageValidationException as QelMessageMetadata does, then as the top of this file says
+    /// Parses a received frame.
+    /// @throws QelMessageValidationException as QelMessageMetadata does; then "dataLength shorter than actual data
+    /// size"
     QelMessageVirtualSerialCloseReq(const char* i_buffer, unsigned int i_length);
-
     ~QelMessageVirtualSerialCloseReq() override;
 
-    std::uint16_t getLpId() const { return pPayload<Data>().mLparId; }
-    std::uint16_t getVssConnectionNumber() const { return pPayload<Data>().mVssConnectionNumber; }
     /// True for 0xFF only; any other byte means a normal close.
     bool isForceClose() const { return pPayload<Data>().mForceClose == kForceClose; }
 
@@ -128,7 +173,7 @@ private:
     static constexpr unsigned char kForceClose = 0xFF;
 };
 
-/// Answers that the session is closed. No payload.
+/// Response to QelMessageVirtualSerialCloseReq. No payload.
 class QEL_EXPORT QelMessageVirtualSerialCloseRsp
     : public QelMessageMetadata<QelMessageVirtualSerialCloseRsp, QelMessageFunctionVirtualSerial,
                                 QelMessageOpCloseVirtualSerialSession, QelMessageClassification::Response> {
@@ -137,7 +182,7 @@ public:
     ~QelMessageVirtualSerialCloseRsp() override;
 };
 
-/// Asks how many sessions there can be. No payload.
+/// Asks for the maximum number of sessions. No payload.
 class QEL_EXPORT QelMessageVirtualSerialGetMaxSessionsReq
     : public QelMessageMetadata<QelMessageVirtualSerialGetMaxSessionsReq, QelMessageFunctionVirtualSerial,
                                 QelMessageOpGetMaxVirtualSerialSessions, QelMessageClassification::Request> {
@@ -146,7 +191,7 @@ public:
     ~QelMessageVirtualSerialGetMaxSessionsReq() override;
 };
 
-/// Answers how many sessions there can be.
+/// Responds with the maximum number of sessions.
 class QEL_EXPORT QelMessageVirtualSerialGetMaxSessionsRsp
     : public QelMessageMetadata<QelMessageVirtualSerialGetMaxSessionsRsp, QelMessageFunctionVirtualSerial,
                                 QelMessageOpGetMaxVirtualSerialSessions, QelMessageClassification::Response> {
@@ -161,10 +206,10 @@ public:
     /// @param callerId that of the request
     QelMessageVirtualSerialGetMaxSessionsRsp(std::uint32_t callerId, std::uint16_t maxCec, std::uint8_t maxLpar);
 
-    /// Takes a received frame of `i_length` bytes.
-    /// @throws QelMessageValidationException as QelMessageMetadata does, then as the top of this file says
+    /// Parses a received frame.
+    /// @throws QelMessageValidationException as QelMessageMetadata does; then "dataLength shorter than actual data
+    /// size"
     QelMessageVirtualSerialGetMaxSessionsRsp(const char* i_buffer, unsigned int i_length);
-
     ~QelMessageVirtualSerialGetMaxSessionsRsp() override;
 
     std::uint16_t getMaxCec() const { return pPayload<Data>().mMaxCec; }
@@ -174,30 +219,23 @@ protected:
     void pDerivedDebug(std::ostream& os) const override;
 };
 
-/// Serial data on its way; one direction is one class.
+/// Serial data. Each direction has its own class: use the two concrete classes.
 ///
-/// With 65535 bytes of data the frame is longer than QelMessage::MtuMax: it can be built, but no stream will accept it.
-/// Not built by itself: users take the two concrete classes.
-/// @tparam Derived the concrete class
-/// @tparam FunctionCode,OpType its identity; the classification is always asynchronous
+/// Up to 65535 bytes of data can be built, but a frame longer than QelMessage::MtuMax cannot be sent.
+/// @tparam Derived the concrete class, with the identity that the other arguments give
 template <typename Derived, QelMessageFunctionCodes FunctionCode, QelMessageOpTypes OpType>
 class QEL_EXPORT QelMessageVirtualSerialDataAsync
-    : public QelMessageMetadata<Derived, FunctionCode, OpType, QelMessageClassification::Async> {
+    : public QelMessageVirtualSerialAddressed<Derived, FunctionCode, OpType, QelMessageClassification::Async> {
 public:
     struct Data {
-        be_uint16_t mLparId;              //  0  logical partition id
-        be_uint16_t mVssConnectionNumber; //  2  connection number of the session
+        QelVirtualSerialAddress mAddress; //  0
         be_uint16_t mDataLength;          //  4  bytes of serial data
         /* the serial data                    6  mDataLength raw bytes */
     };
     static_assert(sizeof(Data) == 6 && alignof(Data) == 1, "overlays the frame buffer");
-    static_assert(offsetof(Data, mVssConnectionNumber) == 2 && offsetof(Data, mDataLength) == 4,
-                  "overlays the frame buffer");
+    static_assert(offsetof(Data, mDataLength) == 4, "overlays the frame buffer");
 
     ~QelMessageVirtualSerialDataAsync() override;
-
-    std::uint16_t getLpId() const { return this->template pPayload<Data>().mLparId; }
-    std::uint16_t getVssConnectionNumber() const { return this->template pPayload<Data>().mVssConnectionNumber; }
 
     /// Bytes of serial data.
     std::uint16_t getSerialDataLength() const { return this->template pPayload<Data>().mDataLength; }
@@ -215,10 +253,10 @@ protected:
     void pDerivedDebug(std::ostream& os) const override;
 
 private:
-    using Metadata = QelMessageMetadata<Derived, FunctionCode, OpType, QelMessageClassification::Async>;
+    using Addressed = QelMessageVirtualSerialAddressed<Derived, FunctionCode, OpType, QelMessageClassification::Async>;
 };
 
-/// Serial data for the operating system of the partition: what was typed.
+/// Serial data to the operating system of the partition: keyboard input.
 class QEL_EXPORT QelMessageVirtualSerialDataToOsAsync
     : public QelMessageVirtualSerialDataAsync<QelMessageVirtualSerialDataToOsAsync, QelMessageFunctionVirtualSerial,
                                               QelMessageOpSendVirtualSerialDataToOs> {
@@ -228,14 +266,14 @@ public:
     QelMessageVirtualSerialDataToOsAsync(std::uint16_t lpId, std::uint16_t vssConnectionNumber,
                                          std::uint16_t dataLength, const char* data);
 
-    /// Takes a received frame of `i_length` bytes.
-    /// @throws QelMessageValidationException as QelMessageMetadata does, then as the top of this file says
+    /// Parses a received frame.
+    /// @throws QelMessageValidationException as QelMessageMetadata does; then "dataLength shorter than actual data
+    /// size"
     QelMessageVirtualSerialDataToOsAsync(const char* i_buffer, unsigned int i_length);
-
     ~QelMessageVirtualSerialDataToOsAsync() override;
 };
 
-/// Serial data for the console: what the partition printed.
+/// Serial data to the console: output of the partition.
 class QEL_EXPORT QelMessageVirtualSerialDataToDaxAsync
     : public QelMessageVirtualSerialDataAsync<QelMessageVirtualSerialDataToDaxAsync, QelMessageFunctionDax,
                                               QelMessageOpSendVirtualSerialDataToMc> {
@@ -245,41 +283,37 @@ public:
     QelMessageVirtualSerialDataToDaxAsync(std::uint16_t lpId, std::uint16_t vssConnectionNumber,
                                           std::uint16_t dataLength, const char* data);
 
-    /// Takes a received frame of `i_length` bytes.
-    /// @throws QelMessageValidationException as QelMessageMetadata does, then as the top of this file says
+    /// Parses a received frame.
+    /// @throws QelMessageValidationException as QelMessageMetadata does; then "dataLength shorter than actual data
+    /// size"
     QelMessageVirtualSerialDataToDaxAsync(const char* i_buffer, unsigned int i_length);
-
     ~QelMessageVirtualSerialDataToDaxAsync() override;
 };
 
-/// Asks to make an open session ready for data.
+/// Sets up an open session for data.
 class QEL_EXPORT QelMessageVirtualSerialSetupSessionReq
-    : public QelMessageMetadata<QelMessageVirtualSerialSetupSessionReq, QelMessageFunctionVirtualSerial,
-                                QelMessageOpSetupVirtualSerialSession, QelMessageClassification::Request> {
+    : public QelMessageVirtualSerialAddressed<QelMessageVirtualSerialSetupSessionReq, QelMessageFunctionVirtualSerial,
+                                              QelMessageOpSetupVirtualSerialSession,
+                                              QelMessageClassification::Request> {
 public:
     struct Data {
-        be_uint16_t mLparId;              //  0  logical partition id
-        be_uint16_t mVssConnectionNumber; //  2  connection number of the session
+        QelVirtualSerialAddress mAddress; //  0
     };
     static_assert(sizeof(Data) == 4 && alignof(Data) == 1, "overlays the frame buffer");
-    static_assert(offsetof(Data, mVssConnectionNumber) == 2, "overlays the frame buffer");
 
     QelMessageVirtualSerialSetupSessionReq(std::uint16_t lpId, std::uint16_t vssConnectionNumber);
 
-    /// Takes a received frame of `i_length` bytes.
-    /// @throws QelMessageValidationException as QelMessageMetadata does, then as the top of this file says
+    /// Parses a received frame.
+    /// @throws QelMessageValidationException as QelMessageMetadata does; then "dataLength shorter than actual data
+    /// size"
     QelMessageVirtualSerialSetupSessionReq(const char* i_buffer, unsigned int i_length);
-
     ~QelMessageVirtualSerialSetupSessionReq() override;
-
-    std::uint16_t getLpId() const { return pPayload<Data>().mLparId; }
-    std::uint16_t getVssConnectionNumber() const { return pPayload<Data>().mVssConnectionNumber; }
 
 protected:
     void pDerivedDebug(std::ostream& os) const override;
 };
 
-/// Answers that the session is ready for data. No payload.
+/// Response to QelMessageVirtualSerialSetupSessionReq. No payload.
 class QEL_EXPORT QelMessageVirtualSerialSetupSessionRsp
     : public QelMessageMetadata<QelMessageVirtualSerialSetupSessionRsp, QelMessageFunctionVirtualSerial,
                                 QelMessageOpSetupVirtualSerialSession, QelMessageClassification::Response> {
@@ -288,44 +322,40 @@ public:
     ~QelMessageVirtualSerialSetupSessionRsp() override;
 };
 
-/// Tells the console that its session was closed, and why.
+/// Notifies the console that its session was closed, and why.
 class QEL_EXPORT QelMessageVirtualSerialSessionClosedAsync
-    : public QelMessageMetadata<QelMessageVirtualSerialSessionClosedAsync, QelMessageFunctionDax,
-                                QelMessageOpSendVirtualSerialSessionClosed, QelMessageClassification::Async> {
+    : public QelMessageVirtualSerialAddressed<QelMessageVirtualSerialSessionClosedAsync, QelMessageFunctionDax,
+                                              QelMessageOpSendVirtualSerialSessionClosed,
+                                              QelMessageClassification::Async> {
 public:
     enum CloseReason : unsigned int {
         CloseReasonMin = 1,
         CloseReasonUnknown = 1,
         CloseReasonForceClose = 2,   ///< another console took the session
-        CloseReasonQelShutdown = 3,  ///< the hypervisor side goes down
-        CloseReasonReadFailure = 4,  ///< nothing can be read from the partition any more
-        CloseReasonWriteFailure = 5, ///< nothing can be written to the partition any more
+        CloseReasonQelShutdown = 3,  ///< the hypervisor side shuts down
+        CloseReasonReadFailure = 4,  ///< reading from the partition failed
+        CloseReasonWriteFailure = 5, ///< writing to the partition failed
         CloseReasonMax = 5
     };
 
     struct Data {
-        be_uint16_t mLparId;              //  0  logical partition id
-        be_uint16_t mVssConnectionNumber; //  2  connection number of the session
+        QelVirtualSerialAddress mAddress; //  0
         be_uint32_t mCloseReason;         //  4  a CloseReason
     };
     static_assert(sizeof(Data) == 8 && alignof(Data) == 1, "overlays the frame buffer");
-    static_assert(offsetof(Data, mVssConnectionNumber) == 2 && offsetof(Data, mCloseReason) == 4,
-                  "overlays the frame buffer");
+    static_assert(offsetof(Data, mCloseReason) == 4, "overlays the frame buffer");
 
-    /// @param reason is sent as it is
+    /// @param reason sent without a check
     QelMessageVirtualSerialSessionClosedAsync(std::uint16_t lpId, std::uint16_t vssConnectionNumber,
                                               CloseReason reason);
 
-    /// Takes a received frame of `i_length` bytes.
-    /// @throws QelMessageValidationException as QelMessageMetadata does, then as the top of this file says
+    /// Parses a received frame.
+    /// @throws QelMessageValidationException as QelMessageMetadata does; then "dataLength shorter than actual data
+    /// size"
     QelMessageVirtualSerialSessionClosedAsync(const char* i_buffer, unsigned int i_length);
-
     ~QelMessageVirtualSerialSessionClosedAsync() override;
 
-    std::uint16_t getLpId() const { return pPayload<Data>().mLparId; }
-    std::uint16_t getVssConnectionNumber() const { return pPayload<Data>().mVssConnectionNumber; }
-
-    /// A number outside CloseReasonMin to CloseReasonMax reads as CloseReasonUnknown; debug() prints it as it is.
+    /// A number outside [CloseReasonMin, CloseReasonMax] reads as CloseReasonUnknown; debug() prints the number.
     CloseReason getCloseReason() const
     {
         const std::uint32_t reason = pPayload<Data>().mCloseReason;
@@ -337,7 +367,7 @@ protected:
     void pDerivedDebug(std::ostream& os) const override;
 };
 
-// The template is made for these two classes only, in the library.
+// The library instantiates the template, for these two classes only.
 extern template class QelMessageVirtualSerialDataAsync<
     QelMessageVirtualSerialDataToOsAsync, QelMessageFunctionVirtualSerial, QelMessageOpSendVirtualSerialDataToOs>;
 extern template class QelMessageVirtualSerialDataAsync<QelMessageVirtualSerialDataToDaxAsync, QelMessageFunctionDax,
