@@ -8,7 +8,7 @@ namespace qel {
 
 namespace {
 
-// The name of an enumerator is also the text that is printed for it.
+// The printed text is the name of the enumerator.
 #define QEL_NAMED(enumerator)                                                                                          \
     {                                                                                                                  \
         enumerator, #enumerator                                                                                        \
@@ -18,7 +18,7 @@ namespace {
         {function, enumerator}, #enumerator                                                                            \
     }
 
-/// The name for a value, or null when it has none.
+/// @return the name of a value; null when it has none
 template <typename Key>
 const char* findName(const std::map<Key, const char*>& names, const Key& key)
 {

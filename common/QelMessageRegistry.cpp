@@ -57,7 +57,7 @@ QelMessageRegistry::~QelMessageRegistry() = default;
 
 std::unique_ptr<QelMessage> QelMessageRegistry::deserialize(const char* buffer, unsigned int length) const
 {
-    // Before the overlay is read: a shorter buffer does not cover it.
+    // A shorter buffer does not cover the overlay.
     if (length < sizeof(FastHeader)) {
         logLine(LogLevel::Error, "Encountered message with invalid length");
         throw QelMessageValidationException("length");

@@ -6,7 +6,7 @@
 
 namespace qel {
 
-/// Part of the connection handshake: go over to the protected connection. No payload.
+/// Connection handshake: asks the peer to switch to the protected connection. No payload.
 class QEL_EXPORT QelMessageUpgradeConnectionAsync
     : public QelMessageMetadata<QelMessageUpgradeConnectionAsync, QelMessageFunctionQel, QelMessageOpUpgradeConnection,
                                 QelMessageClassification::Async> {
@@ -15,7 +15,7 @@ public:
     ~QelMessageUpgradeConnectionAsync() override;
 };
 
-/// Part of the connection handshake: give it up. No payload.
+/// Connection handshake: aborts the handshake. No payload.
 class QEL_EXPORT QelMessageAbortHandshakeAsync
     : public QelMessageMetadata<QelMessageAbortHandshakeAsync, QelMessageFunctionQel, QelMessageOpAbortHandshake,
                                 QelMessageClassification::Async> {
@@ -24,15 +24,15 @@ public:
     ~QelMessageAbortHandshakeAsync() override;
 };
 
-/// A registry that knows only the two messages of the connection handshake; everything else becomes a plain QelMessage.
-/// Thread safety: as QelMessageRegistry.
+/// A registry of the two messages of the connection handshake; every other frame becomes a plain QelMessage.
+/// Ownership and thread safety: as QelMessageRegistry.
 class QEL_EXPORT QelInternalMessageRegistry : public QelMessageRegistry {
 public:
     QelInternalMessageRegistry();
     ~QelInternalMessageRegistry() override;
 
-    /// The one instance that the whole process shares, built on first use; lives until the process ends.
-    /// Thread safety: may be called from any thread.
+    /// @return the one instance of the process; built on first use, destroyed when the process exits
+    /// Thread safety: any thread.
     static QelInternalMessageRegistry& getInstance();
 };
 

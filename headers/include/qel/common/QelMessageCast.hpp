@@ -9,17 +9,18 @@
 #include <typeinfo>
 
 /// @file
-/// From a message as a registry or a stream returns it to the class it is of. The casts go by the class of the object,
-/// not by the identity in its header: a frame that its own class refused is a plain QelMessage whatever it claims to
-/// be.
+/// Casts from a message, as a registry or a stream returns it, to its class. The class of the object decides, not the
+/// identity in its header: a frame that its class refused is a plain QelMessage.
+///
+/// Thread safety: as the message, which belongs to one thread at a time.
 
 namespace qel {
 
-/// Hands a message over as the class it is of.
-/// @param message the owner; null after success, untouched after a failure, so that the message can still be handled
+/// Moves a message into a pointer to its class.
+/// @param message the owner; null after success, unchanged after a failure, so that the message can still be handled
 /// @return the same message; never null
-/// @throws QelMessageCastException the message is not a T; names T
-/// @throws std::invalid_argument "message": there is no message
+/// @throws QelMessageCastException the message is not a T; the text names T
+/// @throws std::invalid_argument "message": the pointer is null
 template <typename T>
 std::unique_ptr<T> qelMessageCast(std::unique_ptr<QelMessage>& message)
 {
@@ -30,9 +31,9 @@ std::unique_ptr<T> qelMessageCast(std::unique_ptr<QelMessage>& message)
     return std::unique_ptr<T>(typed);
 }
 
-/// Views a message as the class it is of.
-/// @return the same object
-/// @throws QelMessageCastException the message is not a T; names T
+/// Views a message as its class.
+/// @return the same object; valid as long as `message`
+/// @throws QelMessageCastException the message is not a T; the text names T
 template <typename T>
 const T& qelMessageCast(const QelMessage& message)
 {

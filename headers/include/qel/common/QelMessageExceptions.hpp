@@ -9,8 +9,10 @@ namespace qel {
 
 class QelMessage;
 
-/// Bytes are no valid frame, a frame is not the message it was taken for, or its payload breaks the rules of its type.
-/// what() is a short fixed phrase such as "i_buffer bad eyecatcher"; the values behind it are in the log.
+/// A malformed frame, a frame whose identity is not that of the class, or a payload or argument that breaks the rules
+/// of the class. what() is a short fixed phrase such as "i_buffer bad eyecatcher". For a malformed frame the values are
+/// in the log. Lifetime and thread safety: as std::runtime_error; no exception of this file keeps a reference to a
+/// message.
 class QEL_EXPORT QelMessageValidationException : public std::runtime_error {
 public:
     explicit QelMessageValidationException(const char* what);
@@ -19,18 +21,21 @@ public:
 };
 
 /// A message carries a status other than zero; thrown by QelMessage::checkStatus().
-/// what() reads "QEL message [CID: ...] contains a bad status code", with the whole ID line in the middle.
+/// what() reads "QEL message [CID: ...] contains a bad status code", with the whole ID line in the brackets.
 class QEL_EXPORT QelMessageStatusException : public QelMessageValidationException {
 public:
+    /// @param message read now and not kept
     explicit QelMessageStatusException(const QelMessage& message);
     ~QelMessageStatusException() override;
 };
 
 /// A message is not of the class it was cast to; thrown by qelMessageCast().
-/// what() reads "Failed to cast message [CID: ...] to type <class>", with the whole ID line in the middle.
+/// what() reads "Failed to cast message [CID: ...] to type" and the name of the class, with the whole ID line in the
+/// brackets.
 class QEL_EXPORT QelMessageCastException : public QelMessageValidationException {
 public:
-    /// @param typeName readable name of the class that was wanted
+    /// @param message read now and not kept
+    /// @param typeName readable name of the target class
     QelMessageCastException(const QelMessage& message, const std::string& typeName);
     ~QelMessageCastException() override;
 };

@@ -12,9 +12,14 @@ class QelMessage;
 /// @code
 /// [CID: 0x00000002, FN: 0x6003, OP: 0x0101, FL: 0x80, DL: 48, ST: 0x00000000:0000]
 /// @endcode
-/// Caller id, function, operation, flags, payload length in bytes (decimal, all else is hexadecimal), status and, from
-/// the colon on, the status detail, which a 24-byte header does not have.
-/// Lifetime: borrows the message, which must be alive while this is printed; stream it at once, do not keep it.
+/// The fields are caller id, function, operation, flags, payload length in bytes, status and, after the colon, status
+/// detail. The payload length is decimal, all others are hexadecimal. A 24-byte header has no status detail: colon and
+/// detail are left out.
+///
+/// State of the stream: printing leaves it in upper-case hexadecimal with fill character '0', so a plain integer that
+/// is printed next appears in hexadecimal. On a stream whose locale groups digits the numbers are grouped: 0x6.0.0.3.
+/// Lifetime: borrows the message, which must be alive while this is printed; print it at once, do not keep it.
+/// Thread safety: as the message, which belongs to one thread at a time.
 class QEL_EXPORT QelMessageIDFormatter {
 public:
     explicit QelMessageIDFormatter(const QelMessage* message) noexcept : mMessage(message) {}
@@ -25,9 +30,11 @@ private:
     const QelMessage* mMessage;
 };
 
-/// Prints everything about a message on many lines: each header field with its name, what the message's own type says
-/// about the payload, and a hex dump of the whole frame.
-/// Lifetime: borrows the message, which must be alive while this is printed; stream it at once, do not keep it.
+/// Prints all of a message on many lines: each header field with its name, the payload fields that the message's type
+/// prints, and a hex dump of the whole frame.
+///
+/// State of the stream: as QelMessageIDFormatter.
+/// Lifetime and thread safety: as QelMessageIDFormatter.
 class QEL_EXPORT QelMessageDebugFormatter {
 public:
     explicit QelMessageDebugFormatter(const QelMessage* message) noexcept : mMessage(message) {}
@@ -38,10 +45,13 @@ private:
     const QelMessage* mMessage;
 };
 
-/// Leaves the stream in upper-case hexadecimal with fill character '0', as all printing of numbers here does.
+/// Prints the line without a newline. Leaves the stream in hexadecimal, see QelMessageIDFormatter.
+/// @throws std::out_of_range the header version of the message was changed to an invalid one
 QEL_EXPORT std::ostream& operator<<(std::ostream& os, const QelMessageIDFormatter& formatter);
 
-/// Begins with a newline and ends with the two line ends of the hex dump.
+/// Prints the lines. The output begins with a newline and ends with the two newlines of the hex dump. Leaves the stream
+/// in hexadecimal, see QelMessageIDFormatter.
+/// @throws std::out_of_range the header version of the message was changed to an invalid one
 QEL_EXPORT std::ostream& operator<<(std::ostream& os, const QelMessageDebugFormatter& formatter);
 
 } // namespace qel

@@ -1,7 +1,7 @@
 #pragma once
 
+#include <qel/common/HexWidth.hpp>
 #include <qel/common/QelExport.hpp>
-#include <qel/common/StreamFormatters.hpp>
 #include <qel/common/util/BitmaskEnum.hpp>
 
 #include <cstddef>
@@ -10,9 +10,13 @@
 #include <utility>
 
 /// @file
-/// The vocabulary of the message header: function codes, operations, flags, status codes and the classification that
-/// the flags stand for, with the text each of them prints. The enumerations are unscoped and have the width of their
+/// The identifiers of the message header: function codes, operations, flags, status codes and the classification that
+/// the flags give, and the text that each of them prints. The enumerations are unscoped and have the width of their
 /// header field, so that any number a peer sends can be held, compared and printed.
+///
+/// Thread safety: the values are plain integers. Any thread may print them; the stream belongs to one thread at a time.
+/// State of the stream: every operator here prints its number through hexFormat() and leaves the stream in upper-case
+/// hexadecimal with fill character '0'. On a stream whose locale groups digits the numbers are grouped too: 0x6.0.0.3.
 
 namespace qel {
 
@@ -22,7 +26,7 @@ enum QEL_EXPORT QelMessageFunctionCodes : unsigned short {
     QelMessageFunctionQel = 0x6001, ///< internal connection handshake
     QelMessageFunctionVirtualSerial = 0x6002,
     QelMessageFunctionQelInterfaceCmp = 0x6003,
-    QelMessageFunctionDax = 0x7000,      ///< asynchronous traffic bound for the console
+    QelMessageFunctionDax = 0x7000,      ///< asynchronous messages to the console
     QelMessageFunctionKrogBase = 0x8000, ///< first function of the hypervisor; prints as the command router
     QelMessageFunctionKrogCmdRouter = 0x8000,
     QelMessageFunctionKrogLparConfig = 0x8001,
@@ -37,8 +41,8 @@ enum QEL_EXPORT QelMessageFunctionCodes : unsigned short {
     QelMessageFunctionQelKrog = 0x800A
 };
 
-/// What is asked of a function. Header field `mOperation`, 16 bits. A value means something only together with its
-/// function code: 0x0001 stands for three different operations under three functions.
+/// The operation within a function. Header field `mOperation`, 16 bits. A value is meaningful only together with its
+/// function code: 0x0001 is three different operations under three functions.
 enum QEL_EXPORT QelMessageOpTypes : unsigned short {
     QelMessageOpUnspecified = 0x0000, ///< has no printed name
 
@@ -66,7 +70,7 @@ enum QEL_EXPORT QelMessageOpTypes : unsigned short {
     QelMessageOpSendVirtualSerialDataToOs = 0x0405,
     QelMessageOpSetupVirtualSerialSession = 0x0406,
 
-    // QelMessageFunctionDax: what goes to the console, the console's side of virtual serial sessions included
+    // QelMessageFunctionDax: messages to the console, those of virtual serial sessions included
     QelMessageOpSendVirtualSerialDataToMc = 0x0401,
     QelMessageOpSendVirtualSerialSessionClosed = 0xA005,
     QelMessageOpSendKrogConnectionClosed = 0xA009,
@@ -97,7 +101,7 @@ enum QEL_EXPORT QelMessageOpTypes : unsigned short {
     QelMessageOpSendErrorLog = 0x810A
 };
 
-/// How a request went. Header field `mStatus`, 16 bits; the numbers between the named ones are not in use.
+/// The result of a request. Header field `mStatus`, 16 bits; the numbers between the named ones are undefined.
 enum QEL_EXPORT QelMessageStatusCodes : unsigned short {
     QelMessageStatusNoError = 0,
     QelMessageStatusInvalidOperation = 1,
@@ -123,36 +127,36 @@ enum QEL_EXPORT QelMessageStatusCodes : unsigned short {
 template <>
 struct HexWidth<QelMessageStatusCodes> : std::integral_constant<std::size_t, 8> {};
 
-/// The flag bits of a message. Header field `mFlags`, 8 bits; the other six bits have no meaning and are ignored.
+/// The flag bits of a message. Header field `mFlags`, 8 bits; the other six bits are meaningless and ignored.
 enum QEL_EXPORT QelMessageFlags : unsigned char {
     NoFlagSet = 0x00,
     MsgResponse = 0x40,        ///< the message answers a request
     MsgResponseExpected = 0x80 ///< the message is a request
 };
 
-/// Flags combine with `|`, `&` and the like and stay flags, so that what is combined still prints by name.
+/// Flags combined with `|` and `&` stay flags, so that a combination still prints by name.
 template <>
 struct is_bitmask_enum<QelMessageFlags> : std::true_type {};
 
-/// Whether a message asks, answers or merely tells. A scope for the enumeration and its two conversions; it has no
-/// objects.
+/// The kind of a message: request, response or asynchronous. A scope for the enumeration and its two conversions; it
+/// has no objects.
 struct QEL_EXPORT QelMessageClassification {
     enum Value : unsigned int {
-        Unknown = 0, ///< both flags are set; no message of the protocol looks like this
+        Unknown = 0, ///< both flags are set; no message of the protocol has this kind
         Request = 1,
         Response = 2,
-        Async = 3 ///< a notice that expects no answer
+        Async = 3 ///< a message that expects no response
     };
 
     QelMessageClassification() = delete;
 
-    /// The flags that a message of this classification carries. `Unknown` gives NoFlagSet, like `Async`.
+    /// @return the flags of a message of this classification; NoFlagSet for `Async` and `Unknown`
     static constexpr QelMessageFlags toFlags(Value value) noexcept
     {
         return value == Request ? MsgResponseExpected : value == Response ? MsgResponse : NoFlagSet;
     }
 
-    /// The classification that the two known flags stand for; the other six bits never influence it.
+    /// @return the classification that the two known flags give; the other six bits never change it
     static constexpr Value fromFlags(QelMessageFlags flags) noexcept
     {
         switch (flags & (MsgResponse | MsgResponseExpected)) {
@@ -169,7 +173,6 @@ struct QEL_EXPORT QelMessageClassification {
 };
 
 /// Prints "0x6003 (QelMessageFunctionQelInterfaceCmp)", or "unknown function" in place of the name.
-/// Like all printing of numbers here it leaves the stream in upper-case hexadecimal with fill character '0'.
 QEL_EXPORT std::ostream& operator<<(std::ostream& os, QelMessageFunctionCodes function);
 
 /// Prints an operation of a function: "0x0101 (QelMessageOpGetEnclTypeAndInterfaceVersion)", or "unknown operation for
@@ -178,7 +181,7 @@ QEL_EXPORT std::ostream& operator<<(std::ostream& os,
                                     const std::pair<QelMessageFunctionCodes, QelMessageOpTypes>& operation);
 
 /// Prints "0x00000004 (QelMessageStatusInvalidCmdSequence)", or "unknown status code" in place of the name. Status
-/// codes always print eight digits.
+/// codes print eight digits.
 QEL_EXPORT std::ostream& operator<<(std::ostream& os, QelMessageStatusCodes status);
 
 /// Prints "0xC0 (MsgResponse, MsgResponseExpected)", or "no flags set" in place of the names when neither is set.

@@ -15,24 +15,25 @@
 
 namespace qel {
 
-/// Turns received frames into objects of their message classes. It knows a factory for each identity and falls back to
-/// a plain QelMessage for frames it does not know or that their own class refuses.
-/// Thread safety: filled when built and never changed afterwards; any number of threads may deserialize at once.
+/// Turns received frames into objects of their message classes. It has a factory for each identity and falls back to a
+/// plain QelMessage for frames of an unknown identity and for frames that their class refuses.
+/// Ownership: owns its factories; a message that it returns belongs to the caller and does not refer to it.
+/// Thread safety: immutable after construction; any number of threads may deserialize at once.
 class QEL_EXPORT QelMessageRegistry {
 public:
-    /// What a message is: function code, operation, classification. The same as QelMessageMetadata::getMessageID().
+    /// The identity of a message: function code, operation, classification. As QelMessageMetadata::getMessageID().
     using Identifier = std::tuple<unsigned short, unsigned short, QelMessageClassification::Value>;
 
-    /// Builds a message from a frame (bytes, length), never null; throws QelMessageValidationException when it refuses
-    /// the frame. Called by every thread that deserializes, without a lock.
+    /// Builds a message from a frame (bytes, length). Must not return null; throws QelMessageValidationException to
+    /// refuse the frame. Every thread that deserializes calls it, without a lock.
     using Factory = std::function<std::unique_ptr<QelMessage>(const char*, unsigned int)>;
 
-    /// The first 22 bytes of a frame, of which only the identity is read; nothing is checked.
+    /// The first 22 bytes of a frame. Only the identity is read; nothing is checked.
     struct QEL_EXPORT FastHeader {
-        char mReserved1[12];    //  0  not looked at
+        char mReserved1[12];    //  0  ignored
         be_uint16_t mFunction;  // 12  QelMessageFunctionCodes
         unsigned char mFlags;   // 14  QelMessageFlags
-        char mReserved2[5];     // 15  not looked at
+        char mReserved2[5];     // 15  ignored
         be_uint16_t mOperation; // 20  QelMessageOpTypes
 
         Identifier getIdentifier() const
@@ -42,21 +43,21 @@ public:
         }
     };
 
-    /// The public registry: the 32 messages that consoles and hypervisors exchange. Not among them are the two
-    /// responses that this library only builds (interface limits and time of day) and the two messages of the
-    /// connection handshake, which QelInternalMessageRegistry knows.
+    /// The public registry: the 32 messages that consoles and hypervisors exchange. It leaves out the two responses
+    /// that this library only builds (interface limits and time of day) and the two messages of the connection
+    /// handshake, which are in QelInternalMessageRegistry.
     QelMessageRegistry();
 
-    /// A registry with exactly these entries; of several with the same identity the first one stands.
+    /// A registry with exactly these entries. Of several entries with the same identity the first one is used.
     QelMessageRegistry(std::initializer_list<std::pair<const Identifier, Factory>> entries);
 
-    /// A copy has the same entries. There is no assignment: others may be reading the entries.
+    /// A copy has the same entries. There is no assignment: other threads may be reading the entries.
     QelMessageRegistry(const QelMessageRegistry&) = default;
     QelMessageRegistry& operator=(const QelMessageRegistry&) = delete;
 
     virtual ~QelMessageRegistry();
 
-    /// The entry for a message class, for the list of the constructor above.
+    /// @return the entry of a message class, for the list constructor
     /// @tparam T a class with a static getMessageID() and a constructor from (const char*, unsigned int)
     template <typename T>
     static std::pair<const Identifier, Factory> Entry()
@@ -66,19 +67,20 @@ public:
                 }};
     }
 
-    /// Builds the message that the bytes are a frame of.
-    /// A frame of an unknown identity, or one that its own class refuses (which writes a line at Debug), becomes a
-    /// plain QelMessage: be prepared for the base class, and tell what it is by its header.
+    /// Builds the message that a frame holds.
+    /// A frame of an unknown identity becomes a plain QelMessage; so does one that its class refuses, which logs a line
+    /// at Debug. Callers must be prepared for the base class and read the identity from the header.
     /// @param buffer at least `length` readable bytes, of any alignment; not kept
+    /// @param length bytes
     /// @return the message; never null
     /// @throws QelMessageValidationException "length" (fewer than 22 bytes), "i_buffer" (null pointer), or what
-    ///         CommonHeader::validate() throws for bytes that are no frame; all but the null pointer write a line at
-    ///         Error. Whatever else a factory throws passes unchanged.
+    ///         CommonHeader::validate() throws for a malformed frame; all but the null pointer log a line at Error.
+    ///         Other exceptions of a factory pass unchanged.
     std::unique_ptr<QelMessage> deserialize(const char* buffer, unsigned int length) const;
 
-    /// Looks up the factory of an identity. Calling it tells by its exception what deserialize() tells only the log:
-    /// why a class refuses a frame.
-    /// @return null for an identity that is not known; otherwise lives as long as the registry
+    /// Looks up the factory of an identity. A caller that needs to know why a class refuses a frame calls the factory:
+    /// its exception holds the reason, which deserialize() only logs.
+    /// @return null for an unknown identity; otherwise valid as long as the registry
     const Factory* findFactory(const Identifier& identifier) const;
 
 private:
@@ -91,7 +93,7 @@ static_assert(offsetof(QelMessageRegistry::FastHeader, mFunction) == 12, "overla
 static_assert(offsetof(QelMessageRegistry::FastHeader, mFlags) == 14, "overlays the frame buffer");
 static_assert(offsetof(QelMessageRegistry::FastHeader, mOperation) == 20, "overlays the frame buffer");
 
-/// Prints "[FN=0x6003 OP=0x0101 FL=0x80]".
+/// Prints "[FN=0x6003 OP=0x0101 FL=0x80]". Leaves the stream in upper-case hexadecimal with fill character '0'.
 QEL_EXPORT std::ostream& operator<<(std::ostream& os, const QelMessageRegistry::FastHeader& header);
 
 } // namespace qel
