@@ -35,7 +35,7 @@ TEST(QelCapabilities, AreAllClearWhenDefaultConstructed)
 
 TEST(QelCapabilities, Are32Bits)
 {
-    static_assert(QelCapabilities::size() == 32, "known when compiling");
+    static_assert(QelCapabilities::size() == 32, "a constant expression");
     EXPECT_EQ(printed(QelCapabilities()).size(), 32U);
 }
 
@@ -117,7 +117,7 @@ TEST(QelCapabilities, ShortTextLeavesTheRestClear)
 
 TEST(QelCapabilities, EmptyTextGivesAnEmptySet) { EXPECT_EQ(QelCapabilities(""), QelCapabilities()); }
 
-TEST(QelCapabilities, CharactersAfterThe32ndAreNotLookedAt)
+TEST(QelCapabilities, CharactersAfterThe32ndAreIgnored)
 {
     EXPECT_EQ(QelCapabilities(kAllClear + "x"), QelCapabilities());
     EXPECT_EQ(QelCapabilities(kAllClear + "1"), QelCapabilities());
@@ -134,10 +134,10 @@ TEST(QelCapabilities, OtherCharactersAreRefused)
         "1 ",
         "-1",
         "/",                   // the character before '0'
-        std::string(1, '\0'),  // a NUL is a character like any other
+        std::string(1, '\0'),  // a NUL is not special
         std::string("1\0", 2), //
         std::string(1, '\xFF'),
-        std::string(31, '1') + "x", // the 32nd still counts
+        std::string(31, '1') + "x", // the 32nd is still checked
     };
     for (const std::string& text : texts) {
         SCOPED_TRACE(test::hex(text));
@@ -189,7 +189,7 @@ TEST(QelCapabilities, AreAValue)
     const QelCapabilities copy = one;
     one.set(5);
     EXPECT_EQ(copy, QelCapabilities("1"));
-    static_assert(!std::is_convertible<std::string, QelCapabilities>::value, "a text is taken on purpose only");
+    static_assert(!std::is_convertible<std::string, QelCapabilities>::value, "a text must not convert implicitly");
     static_assert(sizeof(QelCapabilities) <= sizeof(unsigned long), "a small value");
 }
 

@@ -29,7 +29,7 @@ std::unique_ptr<QelMessage> deserialize(const QelMessageRegistry& registry, cons
     return registry.deserialize(heapCopy(frame).get(), static_cast<unsigned int>(frame.size()));
 }
 
-TEST(QelInternalMessageRegistry, KnowsTheTwoMessagesOfTheHandshake)
+TEST(QelInternalMessageRegistry, ParsesTheTwoHandshakeMessages)
 {
     const QelInternalMessageRegistry registry;
     const std::vector<char> upgrade = RawFrame::newForm().callerId(3).function(0x6001).operation(0x0001).bytes();
@@ -43,7 +43,7 @@ TEST(QelInternalMessageRegistry, KnowsTheTwoMessagesOfTheHandshake)
     EXPECT_EQ(frameOf(*second), hex(abort));
 }
 
-TEST(QelInternalMessageRegistry, KnowsNothingElse)
+TEST(QelInternalMessageRegistry, ParsesOtherFramesToPlainMessages)
 {
     const std::vector<char> frames[] = {
         RawFrame::newForm().function(0x6003).operation(0x0102).flags(0x80).bytes(),
@@ -85,14 +85,14 @@ TEST(QelInternalMessages, AreBuiltWithoutPayload)
               hex(RawFrame::newForm().callerId(0x0A0B0C0D).function(0x6001).operation(0x0002).bytes()));
 }
 
-TEST(QelInternalMessages, TakeNewCallerIds)
+TEST(QelInternalMessages, DrawNewCallerIds)
 {
     const QelMessageUpgradeConnectionAsync first;
     const QelMessageAbortHandshakeAsync second;
     EXPECT_EQ(second.getCallerId(), first.getCallerId() + 1);
 }
 
-TEST(QelInternalMessages, DoNotLookAtAPayload)
+TEST(QelInternalMessages, IgnoreAPayload)
 {
     const std::vector<char> frame =
         RawFrame::newForm().function(0x6001).operation(0x0002).payload(bytes({1, 2, 3})).bytes();

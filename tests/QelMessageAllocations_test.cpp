@@ -1,5 +1,5 @@
-// How many blocks of memory the ways of a message take. Each block costs more than the rest of the work on a short
-// message, so a block more is a defect.
+// How many heap blocks each operation on a message allocates. A block costs more than the rest of the work on a short
+// message, so one more is a defect.
 
 #include <qel/common/QelInternalMessageRegistry.hpp>
 #include <qel/common/QelMessageInterfaceComponent.hpp>
@@ -55,7 +55,7 @@ TEST(QelMessageAllocations, ReceivedFrameIsOneBlockForTheObjectAndOneForItsBytes
     EXPECT_EQ(frameOf(*message), hex(frame));
 }
 
-TEST(QelMessageAllocations, UnknownFrameIsAsCheap)
+TEST(QelMessageAllocations, UnknownFrameIsOneBlockForTheObjectAndOneForItsBytes)
 {
     QEL_TEST_NEEDS_ALLOCATIONS();
     const QelInternalMessageRegistry registry;
@@ -127,7 +127,7 @@ TEST(QelMessageAllocations, CopyIsOneBlockAndCloneIsTwo)
     EXPECT_EQ(cloned, 2U);
 }
 
-TEST(QelMessageAllocations, ReadingTakesNone)
+TEST(QelMessageAllocations, ReadingAllocatesNothing)
 {
     QEL_TEST_NEEDS_ALLOCATIONS();
     const MessageProbe message(dataFrame());
@@ -145,7 +145,7 @@ TEST(QelMessageAllocations, ReadingTakesNone)
     EXPECT_EQ(sum, 0x6002U + 0x0405U + 100U + 68U + QelMessageClassification::Async);
 }
 
-// --- no memory: nothing changes
+// --- out of memory
 
 TEST(QelMessageAllocations, FailedAssignmentChangesNothing)
 {
@@ -190,7 +190,7 @@ TEST(QelMessageAllocations, FailedChangeOfThePayloadChangesNothing)
     EXPECT_EQ(frameOf(message), hex(dataFrame()));
 }
 
-TEST(QelMessageAllocations, FailedDeserialisationPasses)
+TEST(QelMessageAllocations, FailedAllocationPassesThroughDeserialize)
 {
     QEL_TEST_NEEDS_ALLOCATIONS();
     const QelMessageRegistry registry;
@@ -205,7 +205,7 @@ TEST(QelMessageAllocations, FailedDeserialisationPasses)
             failed = true;
         }
     }
-    EXPECT_TRUE(failed) << "lack of memory is no fault of the frame";
+    EXPECT_TRUE(failed) << "running out of memory must not look like a malformed frame";
 }
 
 } // namespace

@@ -20,7 +20,7 @@ const char* const kFailure =
     "Failed to cast message [CID: 0x00000007, FN: 0x6001, OP: 0x0001, FL: 0x00, DL: 0, ST: 0x00000000:0000] to type "
     "qel::QelMessageAbortHandshakeAsync";
 
-TEST(QelMessageCast, HandsTheMessageOverAsItsClass)
+TEST(QelMessageCast, MovesTheMessageToAPointerToItsClass)
 {
     std::unique_ptr<QelMessage> message = std::make_unique<QelMessageUpgradeConnectionAsync>(7U);
     const QelMessage* const object = message.get();
@@ -30,7 +30,7 @@ TEST(QelMessageCast, HandsTheMessageOverAsItsClass)
     EXPECT_EQ(message, nullptr);
 }
 
-TEST(QelMessageCast, LeavesTheMessageWhereItIsWhenItIsOfAnotherClass)
+TEST(QelMessageCast, KeepsTheOwnerWhenTheMessageIsOfAnotherClass)
 {
     std::unique_ptr<QelMessage> message = std::make_unique<QelMessageUpgradeConnectionAsync>(7U);
     const QelMessage* const object = message.get();
@@ -40,21 +40,21 @@ TEST(QelMessageCast, LeavesTheMessageWhereItIsWhenItIsOfAnotherClass)
     EXPECT_EQ(message->getCallerId(), 7U);
 }
 
-TEST(QelMessageCast, HandsAMessageOverAsItsBase)
+TEST(QelMessageCast, MovesTheMessageToAPointerToItsBase)
 {
     std::unique_ptr<QelMessage> message = std::make_unique<QelMessageGeneric>();
     EXPECT_NE(qelMessageCast<QelMessage>(message), nullptr);
     EXPECT_EQ(message, nullptr);
 }
 
-TEST(QelMessageCast, RefusesAPointerToNothing)
+TEST(QelMessageCast, RefusesANullPointer)
 {
     std::unique_ptr<QelMessage> message;
     EXPECT_THAT([&] { qelMessageCast<QelMessageGeneric>(message); },
                 ThrowsMessage<std::invalid_argument>(StrEq("message")));
 }
 
-TEST(QelMessageCast, GoesByTheClassAndNotByTheIdentityInTheHeader)
+TEST(QelMessageCast, IgnoresTheIdentityInTheHeader)
 {
     std::unique_ptr<QelMessage> plain = std::make_unique<QelMessage>(QelMessageUpgradeConnectionAsync(7U));
     EXPECT_THROW(qelMessageCast<QelMessageUpgradeConnectionAsync>(plain), QelMessageCastException);

@@ -1,5 +1,5 @@
-// What holds for every message class alike: identity, the frames they refuse, copies, caller ids, and which of them can
-// be made from what.
+// What all message classes have in common: identity, the frames they refuse, copies, caller ids, and from what they can
+// be constructed.
 
 #include <qel/common/QelInternalMessageRegistry.hpp>
 #include <qel/common/QelMessageDax.hpp>
@@ -45,7 +45,7 @@ const std::type_info& typeOf(const QelMessage& message) { return typeid(message)
 
 struct MessageClass {
     std::string name;
-    std::tuple<unsigned short, unsigned short, QelMessageClassification::Value> id; // as the class says
+    std::tuple<unsigned short, unsigned short, QelMessageClassification::Value> id; // as the class returns it
     unsigned int function;
     unsigned int operation;
     unsigned int flags;
@@ -74,7 +74,7 @@ constexpr unsigned int kAsync = 0x00;
 
 #define MESSAGE_CLASS(name, ...) messageClass<QelMessage##name>(#name, __VA_ARGS__)
 
-/// All classes that can be made from bytes.
+/// All classes that can be constructed from bytes.
 const std::vector<MessageClass>& receivedClasses()
 {
     static const std::vector<MessageClass> kClasses = {
@@ -176,7 +176,7 @@ TEST_P(ReceivedClass, AcceptsALongerPayload)
     EXPECT_EQ(refusal(frame().payload(longer)), "accepted");
 }
 
-TEST_P(ReceivedClass, IgnoresBytesBehindTheFrame)
+TEST_P(ReceivedClass, IgnoresBytesAfterTheFrame)
 {
     std::vector<char> bytes = frame().bytes();
     const std::string whole = hex(bytes);
@@ -207,7 +207,7 @@ TEST_P(ReceivedClass, RefusesAnotherIdentity)
     }
 }
 
-TEST_P(ReceivedClass, IgnoresFlagBitsWithoutAMeaning)
+TEST_P(ReceivedClass, IgnoresMeaninglessFlagBits)
 {
     EXPECT_EQ(refusal(frame().flags(GetParam().flags | 0x3FU)), "accepted");
 }
@@ -224,7 +224,7 @@ TEST_P(ReceivedClass, ChecksTheIdentityBeforeThePayload)
     EXPECT_EQ(refusal(frame().function(0x1234).payload({})), "bad operation");
 }
 
-TEST_P(ReceivedClass, WritesNothingToTheLogWhenItRefusesIdentityOrPayload)
+TEST_P(ReceivedClass, LogsNothingWhenItRefusesIdentityOrPayload)
 {
     const CapturedLog log;
     EXPECT_EQ(refusal(frame().function(0x1234)), "bad operation");
@@ -250,7 +250,7 @@ TEST_P(ReceivedClass, ClonesToItsOwnClass)
     EXPECT_EQ(typeOf(*clone->clone()), *GetParam().type);
 }
 
-TEST_P(ReceivedClass, TakesNoCallerIdToReceiveAndToCopy)
+TEST_P(ReceivedClass, DrawsNoCallerIdToParseAndToCopy)
 {
     const CallerIdScope ids(100);
     receive(frame())->clone();
@@ -297,7 +297,7 @@ using BareMessages = testing::Types<
     QelMessageKrogConnectionClosedAsync, QelMessageUpgradeConnectionAsync, QelMessageAbortHandshakeAsync>;
 TYPED_TEST_SUITE(BareMessage, BareMessages, test::ClassNames);
 
-TYPED_TEST(BareMessage, IsAHeaderAloneWithANewCallerId)
+TYPED_TEST(BareMessage, IsBuiltAsAHeaderWithANewCallerId)
 {
     const CallerIdScope ids(0x01020303);
     const TypeParam message;
@@ -307,7 +307,7 @@ TYPED_TEST(BareMessage, IsAHeaderAloneWithANewCallerId)
     EXPECT_EQ(ids.last(), 0x01020304U);
 }
 
-TYPED_TEST(BareMessage, TakesTheCallerIdOfARequest)
+TYPED_TEST(BareMessage, CarriesTheCallerIdOfARequest)
 {
     const CallerIdScope ids(100);
     const TypeParam message(0xAABBCCDD);
@@ -322,11 +322,11 @@ TYPED_TEST(BareMessage, PrintsNoPayloadFields)
     EXPECT_EQ(test::detailsOf(test::received<TypeParam>(Payload().text("payload"))), "    <no additional details>");
 }
 
-TYPED_TEST(BareMessage, CanBeMadeFromAnIdAndFromBytesOnly)
+TYPED_TEST(BareMessage, IsConstructibleFromACallerIdAndFromBytesOnly)
 {
     static_assert(std::is_default_constructible<TypeParam>::value, "");
     static_assert(std::is_constructible<TypeParam, unsigned int>::value, "");
-    static_assert(!std::is_convertible<unsigned int, TypeParam>::value, "a number is no message");
+    static_assert(!std::is_convertible<unsigned int, TypeParam>::value, "a number must not convert to a message");
     static_assert(std::is_constructible<TypeParam, const char*, unsigned int>::value, "");
     static_assert(!std::is_constructible<TypeParam, const QelMessage&>::value, "a message of any type is not one");
     static_assert(!std::is_constructible<TypeParam, unsigned int, unsigned int>::value, "");
@@ -348,7 +348,7 @@ using PayloadMessages =
                    QelMessageVirtualSerialSessionClosedAsync, QelMessageDaxBroadcastOutboundAsync>;
 TYPED_TEST_SUITE(PayloadMessage, PayloadMessages, test::ClassNames);
 
-TYPED_TEST(PayloadMessage, CannotBeMadeWithoutItsPayload)
+TYPED_TEST(PayloadMessage, IsNotConstructibleWithoutItsPayload)
 {
     static_assert(!std::is_default_constructible<TypeParam>::value, "its accessors need a payload");
     static_assert(!std::is_constructible<TypeParam, unsigned int>::value, "its accessors need a payload");
@@ -358,7 +358,7 @@ TYPED_TEST(PayloadMessage, CannotBeMadeWithoutItsPayload)
     static_assert(std::has_virtual_destructor<TypeParam>::value, "");
 }
 
-TEST(CatalogConstruction, LocalResponsesCannotBeMadeFromBytes)
+TEST(CatalogConstruction, LocalResponsesAreNotConstructibleFromBytes)
 {
     static_assert(!std::is_constructible<QelMessageGetInterfaceLimitsRsp, const char*, unsigned int>::value, "");
     static_assert(!std::is_constructible<QelMessageGetInterfaceLimitsRsp, char*, unsigned int>::value, "");
@@ -369,7 +369,7 @@ TEST(CatalogConstruction, LocalResponsesCannotBeMadeFromBytes)
     static_assert(std::has_virtual_destructor<QelMessageGetQelTodRsp>::value, "");
 }
 
-TEST(CatalogConstruction, OneArgumentNeverConvertsByItself)
+TEST(CatalogConstruction, OneArgumentNeverConvertsImplicitly)
 {
     static_assert(!std::is_convertible<unsigned int, QelMessageGetInterfaceLimitsRsp>::value, "");
     static_assert(!std::is_convertible<std::time_t, QelMessageGetQelTodRsp>::value, "");
@@ -378,7 +378,7 @@ TEST(CatalogConstruction, OneArgumentNeverConvertsByItself)
     static_assert(!std::is_convertible<std::string, QelMessageGetGlobalSaveAreaMetadataRsp>::value, "");
 }
 
-TEST(CatalogConstruction, SharedPayloadBasesCannotBeMadeByThemselves)
+TEST(CatalogConstruction, SharedPayloadBasesAreNotConstructible)
 {
     using Capabilities =
         QelMessageExchIntCapabilitiesBase<QelMessageExchIntCapabilitiesReq, QelMessageClassification::Request>;
@@ -409,7 +409,7 @@ TEST(CatalogConstruction, SharedPayloadBasesCannotBeMadeByThemselves)
 
 struct Builder {
     std::string name;
-    std::function<unsigned int()> callerIdOfNew; // builds one and says which caller id it carries
+    std::function<unsigned int()> callerIdOfNew; // builds one and returns its caller id
 };
 
 const std::string kText = "text";
@@ -421,7 +421,7 @@ Builder builder(const char* name, const Arguments&... arguments)
     return {name, [=] { return T(arguments...).getCallerId(); }};
 }
 
-/// The builders that take a caller id of their own.
+/// The builders that draw a new caller id.
 const std::vector<Builder>& buildersWithNewId()
 {
     static const QelMessageDaxBroadcastReq kRequestToForward(0, 4, 0, kText, kText.data());
@@ -453,7 +453,7 @@ const std::vector<Builder>& buildersWithNewId()
     return kBuilders;
 }
 
-/// The builders that are given the caller id of a request, here always 0xAABBCCDD.
+/// The builders with the caller id of a request, always 0xAABBCCDD here.
 const std::vector<Builder>& buildersWithGivenId()
 {
     constexpr unsigned int kId = 0xAABBCCDD;
@@ -471,9 +471,9 @@ const std::vector<Builder>& buildersWithGivenId()
     return kBuilders;
 }
 
-TEST(CatalogBuilders, TakeExactlyOneCallerIdWhenNoneIsGiven)
+TEST(CatalogBuilders, DrawExactlyOneCallerIdUnlessOneIsGiven)
 {
-    const std::vector<Builder>& builders = buildersWithNewId(); // made first: one of them holds a message of its own
+    const std::vector<Builder>& builders = buildersWithNewId(); // constructed first: one of them builds a message
     const CallerIdScope ids(100);
     unsigned int expected = 100;
     for (const Builder& row : builders) {
@@ -483,7 +483,7 @@ TEST(CatalogBuilders, TakeExactlyOneCallerIdWhenNoneIsGiven)
     }
 }
 
-TEST(CatalogBuilders, TakeNoCallerIdWhenOneIsGiven)
+TEST(CatalogBuilders, DrawNoCallerIdWhenOneIsGiven)
 {
     const CallerIdScope ids(100);
     for (const Builder& row : buildersWithGivenId()) {
@@ -493,7 +493,7 @@ TEST(CatalogBuilders, TakeNoCallerIdWhenOneIsGiven)
     }
 }
 
-TEST(CatalogBuilders, TakeOneBlockOfTheFinalSize)
+TEST(CatalogBuilders, AllocateOneBlockOfTheFinalSize)
 {
     QEL_TEST_NEEDS_ALLOCATIONS();
     for (const auto* builders : {&buildersWithNewId(), &buildersWithGivenId()}) {
@@ -510,7 +510,7 @@ TEST(CatalogBuilders, TakeOneBlockOfTheFinalSize)
     }
 }
 
-TEST_P(ReceivedClass, TakesOneBlockForTheObjectAndOneForTheFrame)
+TEST_P(ReceivedClass, AllocatesOneBlockForTheObjectAndOneForTheFrame)
 {
     QEL_TEST_NEEDS_ALLOCATIONS();
     const OddBytes bytes(frame().bytes());
@@ -523,7 +523,7 @@ TEST_P(ReceivedClass, TakesOneBlockForTheObjectAndOneForTheFrame)
     EXPECT_EQ(blocks, 2U);
 }
 
-TEST(CatalogBuilders, RefuseNullDataWithALengthBeforeAnythingChanges)
+TEST(CatalogBuilders, RefuseNullDataWithALengthAndDrawNoCallerId)
 {
     const CallerIdScope ids(100);
     const auto refused = ThrowsMessage<std::invalid_argument>(StrEq("data"));

@@ -111,7 +111,7 @@ TEST(Outbound, IsNotBuiltWithAToolIdOf33Bytes)
     EXPECT_THAT([] { Outbound(0, 0, std::string(65535, 'x'), nullptr); }, refused(kToolIdTooLong));
 }
 
-TEST(Outbound, TakesTheLengthOfTheToolIdModulo65536)
+TEST(Outbound, UsesTheLengthOfTheToolIdModulo65536)
 {
     EXPECT_EQ(payloadOf(Outbound(2, 1, std::string(65536, 'x'), "hi")), payloadOf(Outbound(2, 1, "", "hi")));
     EXPECT_EQ(payloadOf(Outbound(2, 1, "abcdefghijk" + std::string(65530, 'x'), "hi")),
@@ -128,7 +128,7 @@ TEST(Outbound, ChecksTheToolIdBeforeTheMessagePointer)
 
 // --- passed on -------------------------------------------------------------------------------------------------------
 
-TEST(Outbound, PassesTheMessageOnWithTheSendersIdentity)
+TEST(Outbound, RelaysTheMessageWithTheSendersIdentity)
 {
     const BroadcastReq request(1, 5, 0x11111111, "addressee", "hello");
     const CallerIdScope ids(6);
@@ -145,7 +145,7 @@ TEST(Outbound, PassesTheMessageOnWithTheSendersIdentity)
     EXPECT_EQ(std::string(message.getDaxPacket(), message.getBroadcastMsgLen()), "hello");
 }
 
-TEST(Outbound, PassesTheMessageOnFromWhereTheRequestHasIt)
+TEST(Outbound, RelaysTheMessageFromTheOffsetOfTheRequest)
 {
     const Payload payload =
         Payload().u16(48).u8(0).u8(0).u16(4).u16(0).u32(1).u16(0).zeros(32).text("??data").text("tail");
@@ -161,13 +161,13 @@ TEST(Outbound, PassesTheMessageOnFromWhereTheRequestHasIt)
     }
 }
 
-TEST(Outbound, PassesABroadcastWithoutAMessageOn)
+TEST(Outbound, RelaysAnEmptyMessage)
 {
     const BroadcastReq request(0, 0, 1, "addressee", nullptr);
     EXPECT_EQ(payloadOf(Outbound(request, "s", 2)), payloadOf(Outbound(0, 2, "s", nullptr)));
 }
 
-TEST(Outbound, IsNotPassedOnWithAToolIdOf33Bytes)
+TEST(Outbound, IsNotRelayedWithAToolIdOf33Bytes)
 {
     const BroadcastReq request(0, 2, 1, "", "hi");
     EXPECT_THAT([&] { Outbound(request, std::string(33, 'x'), 2); }, refused(kToolIdTooLong));
@@ -199,7 +199,7 @@ TEST(Outbound, NeedsTheWholeMessage)
     EXPECT_EQ(outboundVerdict(with(&OutboundFields::messageLength, 6)), kMessageTooLong);
     EXPECT_EQ(outboundVerdict(with(&OutboundFields::messageLength, 5)), "accepted");
     EXPECT_EQ(outboundVerdict(with(&OutboundFields::messageLength, 4)), "accepted");
-    // FFFF + FFFF does not fit 16 bits, and FFFF + 002D wraps to less than the payload's length there.
+    // In 16 bits both sums would wrap: FFFF + FFFF, and FFFF + 002D to less than the payload length.
     EXPECT_EQ(outboundVerdict(with(&OutboundFields::offset, 0xFFFF, with(&OutboundFields::messageLength, 0xFFFF))),
               kMessageTooLong);
     EXPECT_EQ(outboundVerdict(with(&OutboundFields::offset, 0xFFFF, with(&OutboundFields::messageLength, 0x2D))),
@@ -219,7 +219,7 @@ TEST(Outbound, ToolIdHasAtMost32Bytes)
 
 TEST(Outbound, ChecksInAFixedOrder)
 {
-    OutboundFields fields; // everything is wrong, and is put right one after the other
+    OutboundFields fields; // every check fails; the fields are corrected one by one
     fields.payloadLength = 41;
     fields.offset = 41;
     fields.messageLength = 0xFFFF;
@@ -235,7 +235,7 @@ TEST(Outbound, ChecksInAFixedOrder)
     EXPECT_EQ(outboundVerdict(fields), "accepted");
 }
 
-TEST(Outbound, SkipsWhatALaterProtocolLevelPutsBeforeTheMessage)
+TEST(Outbound, SkipsBytesBetweenTheFixedPartAndTheMessage)
 {
     OutboundFields fields;
     fields.offset = 44;
@@ -245,7 +245,7 @@ TEST(Outbound, SkipsWhatALaterProtocolLevelPutsBeforeTheMessage)
     EXPECT_EQ(std::string(message.getDaxPacket(), message.getBroadcastMsgLen()), "234");
 }
 
-TEST(Outbound, PacketOfNoBytesMayLieAtTheEnd)
+TEST(Outbound, AcceptsAnEmptyPacketAtTheEnd)
 {
     OutboundFields fields;
     fields.messageLength = 0;
@@ -271,7 +271,7 @@ TEST(Outbound, ReadsItsFieldsFromEitherForm)
     }
 }
 
-TEST(Outbound, PrintsTheOffsetAsItCame)
+TEST(Outbound, PrintsTheReceivedOffset)
 {
     OutboundFields fields;
     fields.offset = 44;
@@ -283,7 +283,7 @@ TEST(Outbound, PrintsTheOffsetAsItCame)
                                                                       " mSenderToolId:        \n");
 }
 
-TEST(Outbound, LeavesUpperCaseForTheRawBytes)
+TEST(Outbound, PrintsTheRawBytesInUpperCase)
 {
     const test::OddBytes frame(
         newFrame<Outbound>(Payload().u16(42).u16(1).u32(0xABCDEF01).u16(1).text("z", 32).u8(0xFE))
@@ -322,7 +322,7 @@ TEST(Outbound, LeavesUpperCaseForTheRawBytes)
 
 // --- connection closed -----------------------------------------------------------------------------------------------
 
-TEST(KrogConnectionClosed, IsAHeaderAlone)
+TEST(KrogConnectionClosed, IsBuiltWithoutPayload)
 {
     const CallerIdScope ids(6);
     EXPECT_EQ(frameOf(QelMessageKrogConnectionClosedAsync()), "DECAFF20"

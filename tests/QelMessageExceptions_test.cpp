@@ -65,15 +65,15 @@ TEST(QelMessageExceptions, KeepTheirTextWhenCopied)
     EXPECT_STREQ(copy.what(), original.what());
 }
 
-// The library throws, this program catches: by the very class, by its base, and by the standard one.
+// The library throws, this program catches: by the class itself, by its base, and by the standard base.
 
-TEST(QelMessageExceptions, AreCaughtByClassAcrossTheBorderOfTheLibrary)
+TEST(QelMessageExceptions, AreCaughtByClassWhenTheLibraryThrows)
 {
     EXPECT_THAT([] { failedResponse().checkStatus(); }, Throws<QelMessageStatusException>());
     EXPECT_THAT([] { QelMessage message(nullptr, 0); }, Throws<QelMessageValidationException>());
 }
 
-TEST(QelMessageExceptions, AreCaughtByBaseAcrossTheBorderOfTheLibrary)
+TEST(QelMessageExceptions, AreCaughtByBaseWhenTheLibraryThrows)
 {
     EXPECT_THAT([] { failedResponse().checkStatus(); }, ThrowsMessage<QelMessageValidationException>(
                                                             StrEq(QelMessageStatusException(failedResponse()).what())));

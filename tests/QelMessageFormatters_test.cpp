@@ -17,7 +17,7 @@ using test::bytes;
 using test::MessageProbe;
 using test::RawFrame;
 
-/// A message class with two lines to say about its payload.
+/// A message class that prints two payload lines.
 class TalkativeMessage : public MessageProbe {
 public:
     using MessageProbe::MessageProbe;
@@ -73,7 +73,7 @@ TEST(QelMessageIDFormatter, PrintsTheLengthInDecimalOnAStreamLeftInHexadecimal)
     EXPECT_EQ(os.str(), "0x00000001[CID: 0xABCDEF01, FN: 0x6003, OP: 0x010A, FL: 0x80, DL: 200, ST: 0x00000009:00FE]");
 }
 
-TEST(QelMessageIDFormatter, SeesTheMessageAsItIsWhenPrinted)
+TEST(QelMessageIDFormatter, ReadsTheMessageWhenItIsPrinted)
 {
     MessageProbe message;
     const QelMessageIDFormatter formatter = message.getLogID();
@@ -156,7 +156,7 @@ TEST(QelMessageDebugFormatter, PrintsAnOldHeaderWithoutDetail)
                                          "\n");
 }
 
-TEST(QelMessageDebugFormatter, LetsTheTypeSpeakAboutItsPayload)
+TEST(QelMessageDebugFormatter, PrintsThePayloadFieldsOfTheType)
 {
     const TalkativeMessage message(RawFrame::newForm().payload(bytes({0x41, 0x42})).bytes());
     EXPECT_EQ(toString(QelMessageDebugFormatter(&message)),
@@ -191,7 +191,7 @@ TEST(QelMessageDebugFormatter, PrintsTheSameTwice)
     os << message.debug();
     const std::string once = os.str();
     os << message.debug();
-    EXPECT_EQ(os.str(), once + once) << "no state of the stream and no address shows in it";
+    EXPECT_EQ(os.str(), once + once) << "the text must not depend on stream state or addresses";
 }
 
 } // namespace

@@ -37,7 +37,7 @@ QelMessageGeneric received(const std::vector<char>& frame)
     return QelMessageGeneric(heapCopy(frame).get(), static_cast<unsigned int>(frame.size()));
 }
 
-TEST(QelMessageGeneric, BuiltByDefaultIsTheDefaultFrameAndTakesNoCallerId)
+TEST(QelMessageGeneric, BuiltByDefaultIsTheDefaultFrameAndDrawsNoCallerId)
 {
     CallerIdScope scope(50);
     const QelMessageGeneric message;
@@ -51,7 +51,7 @@ TEST(QelMessageGeneric, BuiltFromArgumentsCarriesThem)
     EXPECT_EQ(frameOf(message), frameOf(QelMessage(0x01020304, 0x6003, 0x0108, MsgResponse)));
 }
 
-TEST(QelMessageGeneric, TakesAReceivedFrameOfAnyIdentity)
+TEST(QelMessageGeneric, ParsesAFrameOfAnyIdentity)
 {
     EXPECT_EQ(frameOf(received(anyFrame().bytes())), hex(anyFrame().bytes()));
 }
@@ -76,7 +76,7 @@ TEST(QelMessageGeneric, CopiesAnyMessage)
     EXPECT_NE(copied.serialize(), converted.serialize());
 }
 
-TEST(QelMessageGeneric, TakesOverTheFrameOfAnyMessage)
+TEST(QelMessageGeneric, AssignsTheFrameOfAnyMessage)
 {
     const MessageProbe probe(anyFrame().bytes());
     QelMessageGeneric target;
@@ -135,7 +135,7 @@ TEST(QelMessageGeneric, PayloadIsReplaced)
     EXPECT_EQ(frameOf(message), hex(anyFrame().payload({}).bytes()));
 }
 
-TEST(QelMessageGeneric, PayloadThatCannotBeTakenChangesNothing)
+TEST(QelMessageGeneric, KeepsItsFrameWhenThePayloadIsRefused)
 {
     QelMessageGeneric message = received(anyFrame().bytes());
     EXPECT_THAT([&] { message.setData(nullptr, 1); }, ThrowsMessage<std::invalid_argument>(StrEq("data")));
@@ -143,7 +143,7 @@ TEST(QelMessageGeneric, PayloadThatCannotBeTakenChangesNothing)
     EXPECT_EQ(frameOf(message), hex(anyFrame().bytes()));
 }
 
-TEST(QelMessageGeneric, GivesATypedResponseAStatus)
+TEST(QelMessageGeneric, AddsAStatusToATypedResponse)
 {
     const MessageProbe response(anyFrame().status(0).statusDetail(0).bytes());
     QelMessageGeneric refused(response);

@@ -37,7 +37,7 @@ TEST(QelMessageIdentifiers, HaveTheWidthOfTheirHeaderField)
     static_assert(std::is_same<std::underlying_type_t<QelMessageStatusCodes>, unsigned short>::value, "");
     static_assert(std::is_same<std::underlying_type_t<QelMessageFlags>, unsigned char>::value, "");
     static_assert(std::is_same<std::underlying_type_t<QelMessageClassification::Value>, unsigned int>::value, "");
-    static_assert(!std::is_default_constructible<QelMessageClassification>::value, "a scope, not a type of objects");
+    static_assert(!std::is_default_constructible<QelMessageClassification>::value, "a scope without objects");
 }
 
 // --- functions
@@ -105,7 +105,7 @@ TEST(QelMessageFunctionCodes, HaveTheirValues)
     EXPECT_EQ(QelMessageFunctionQelKrog, 0x800A);
 }
 
-TEST(QelMessageFunctionCodes, BasePrintsAsTheFunctionItIsAnotherNameFor)
+TEST(QelMessageFunctionCodes, BasePrintsAsTheCommandRouter)
 {
     EXPECT_EQ(printed(QelMessageFunctionKrogBase), "0x8000 (QelMessageFunctionKrogCmdRouter)");
 }
@@ -204,7 +204,7 @@ TEST(QelMessageOpTypes, UnspecifiedHasNoName)
     EXPECT_EQ(printed(operationOf(0x0000, 0x0000)), "0x0000 (unknown operation for function 0x0000)");
 }
 
-TEST(QelMessageOpTypes, OfTheConsoleBelongToTheConsolesFunction)
+TEST(QelMessageOpTypes, ToTheConsoleBelongToTheConsoleFunction)
 {
     EXPECT_EQ(printed(operationOf(0x6002, 0x0401)), "0x0401 (unknown operation for function 0x6002)");
     EXPECT_EQ(printed(operationOf(0x6002, 0xA005)), "0xA005 (unknown operation for function 0x6002)");
@@ -332,7 +332,7 @@ TEST(QelMessageClassification, HasItsValues)
     EXPECT_EQ(QelMessageClassification::Async, 3U);
 }
 
-TEST(QelMessageClassification, GivesFlags)
+TEST(QelMessageClassification, ConvertsToFlags)
 {
     EXPECT_EQ(QelMessageClassification::toFlags(QelMessageClassification::Request), 0x80);
     EXPECT_EQ(QelMessageClassification::toFlags(QelMessageClassification::Response), 0x40);
@@ -360,7 +360,7 @@ TEST(QelMessageClassification, ComesFromTheTwoTopBitsOfEveryFlagByte)
 
 // --- the stream
 
-TEST(QelMessageIdentifiers, PrintTheSameWhateverBaseCaseAndFillTheStreamWasLeftIn)
+TEST(QelMessageIdentifiers, PrintTheSameForAnyBaseCaseAndFillOfTheStream)
 {
     std::ostringstream os;
     os << std::oct << std::nouppercase << std::setfill('*') << QelMessageFunctionDax << ' ' << std::dec

@@ -32,7 +32,7 @@ using testing::IsEmpty;
 using testing::StrEq;
 using testing::ThrowsMessage;
 
-// Three classes as the catalog has them: with a payload, without one, and on a template in between.
+// Three kinds of classes as in the catalog: with a payload, without one, and with a template in between.
 
 class NumberReq : public QelMessageMetadata<NumberReq, QelMessageFunctionVirtualSerial,
                                             QelMessageOpOpenVirtualSerialSession, QelMessageClassification::Request> {
@@ -120,7 +120,7 @@ TEST(QelMessageMetadata, AddsNothingToTheFrame)
 
 // --- building
 
-TEST(QelMessageMetadata, BuiltByDefaultTakesTheNextCallerIds)
+TEST(QelMessageMetadata, BuiltByDefaultDrawsTheNextCallerIds)
 {
     CallerIdScope scope(40);
     const EmptyRsp first;
@@ -131,7 +131,7 @@ TEST(QelMessageMetadata, BuiltByDefaultTakesTheNextCallerIds)
     EXPECT_EQ(scope.last(), 42U);
 }
 
-TEST(QelMessageMetadata, BuiltWithACallerIdTakesNone)
+TEST(QelMessageMetadata, BuiltWithACallerIdDrawsNone)
 {
     CallerIdScope scope(40);
     const EmptyRsp response(0xFEDCBA98);
@@ -158,7 +158,7 @@ TEST(QelMessageMetadata, BuiltWithAPayloadAndACallerId)
     EXPECT_EQ(scope.last(), 40U);
 }
 
-TEST(QelMessageMetadata, IsNotBuiltWithAPayloadThatItsLengthFieldCannotTell)
+TEST(QelMessageMetadata, IsNotBuiltLongerThanTheLengthFieldHolds)
 {
     EXPECT_THAT([] { SizedAsync::ofLength(4 + std::uint64_t{0xFFFFFFFC}); },
                 ThrowsMessage<std::invalid_argument>(StrEq("length")));
@@ -167,7 +167,7 @@ TEST(QelMessageMetadata, IsNotBuiltWithAPayloadThatItsLengthFieldCannotTell)
 
 // --- receiving
 
-TEST(QelMessageMetadata, TakesAFrameOfItsIdentityAndNoCallerId)
+TEST(QelMessageMetadata, ParsesAFrameOfItsIdentityAndDrawsNoCallerId)
 {
     CallerIdScope scope(40);
     const NumberReq request = received<NumberReq>(numberFrame().bytes());
@@ -176,14 +176,14 @@ TEST(QelMessageMetadata, TakesAFrameOfItsIdentityAndNoCallerId)
     EXPECT_EQ(scope.last(), 40U);
 }
 
-TEST(QelMessageMetadata, FindsThePayloadInTheOldFormToo)
+TEST(QelMessageMetadata, ReadsThePayloadOfAnOldHeader)
 {
     RawFrame frame = RawFrame::oldForm();
     frame.function(0x6002).operation(0x0402).flags(0x80).payload(bytes({0, 0, 0x01, 0x02, 0x03, 0x04}));
     EXPECT_EQ(received<NumberReq>(frame.bytes()).getNumber(), 0x01020304U);
 }
 
-TEST(QelMessageMetadata, TakesAStatusForWhatItIs)
+TEST(QelMessageMetadata, AcceptsAFrameWithAStatus)
 {
     RawFrame frame = RawFrame::newForm();
     frame.function(0x6002).operation(0x0403).flags(0x40).status(20);
@@ -192,7 +192,7 @@ TEST(QelMessageMetadata, TakesAStatusForWhatItIs)
     EXPECT_THROW(response.checkStatus(), QelMessageStatusException);
 }
 
-TEST(QelMessageMetadata, RefusesEveryOtherIdentityWithOneTextAndNoLine)
+TEST(QelMessageMetadata, RefusesEveryOtherIdentityWithOneTextAndLogsNothing)
 {
     const std::pair<const char*, RawFrame> frames[] = {
         {"function", numberFrame().function(0x6003)},
@@ -213,7 +213,7 @@ TEST(QelMessageMetadata, RefusesEveryOtherIdentityWithOneTextAndNoLine)
     EXPECT_THAT(log.lines(), IsEmpty());
 }
 
-TEST(QelMessageMetadata, FlagBitsWithoutMeaningDoNotCount)
+TEST(QelMessageMetadata, IgnoresMeaninglessFlagBits)
 {
     for (unsigned int flags = 0; flags <= 0xFF; ++flags) {
         SCOPED_TRACE(flags);
@@ -290,7 +290,7 @@ TEST(QelMessageMetadata, CloneOfAGenericCopyIsGeneric)
     EXPECT_EQ(typeid(copied), typeid(QelMessageGeneric));
 }
 
-TEST(QelMessageMetadata, CloneTakesNoCallerId)
+TEST(QelMessageMetadata, CloneDrawsNoCallerId)
 {
     const NumberReq request(5);
     CallerIdScope scope(40);

@@ -1,5 +1,5 @@
-// One process, several parts that were built by themselves: what the library keeps for the whole process must be the
-// same for all of them, and its classes must be recognised from one part to the other.
+// A process with several modules that were built separately: they must share the process-wide state of the library and
+// recognise each other's objects and exceptions.
 
 #include <qel/common/QelInternalMessageRegistry.hpp>
 #include <qel/common/QelMessage.hpp>
@@ -22,7 +22,7 @@ using test::CallerIdScope;
 using testing::StrEq;
 using testing::ThrowsMessage;
 
-/// A loaded module. It stays loaded: messages of its making may outlive the test's use of it.
+/// A loaded module. It is never unloaded: messages that it built may outlive this object.
 class Module {
 public:
     explicit Module(const char* path) : mHandle(::dlopen(path, RTLD_NOW | RTLD_LOCAL))
@@ -76,7 +76,7 @@ TEST_F(QelMessageModules, ShareTheInternalRegistryWithTheProgram)
     EXPECT_EQ(mTwo.find<decltype(internalRegistry)>("internalRegistry")(), own);
 }
 
-TEST_F(QelMessageModules, MakeMessagesThatTheProgramRecognises)
+TEST_F(QelMessageModules, BuildMessagesThatTheProgramRecognises)
 {
     for (const Module* module : {&mOne, &mTwo}) {
         const std::unique_ptr<QelMessage> message(module->find<decltype(newMessage)>("newMessage")());

@@ -63,7 +63,7 @@ struct ClassRow {
     Classification::Value classification;
     unsigned int payload; // bytes of zeros that its class accepts
     const std::type_info* type;
-    Identifier identity; // as the class gives it
+    Identifier identity; // as the class returns it
 };
 
 template <typename T>
@@ -116,7 +116,7 @@ std::vector<ClassRow> registeredClasses()
     };
 }
 
-/// The classes that the public registry does not make.
+/// The classes that are not in the public registry.
 std::vector<ClassRow> otherClasses()
 {
     return {
@@ -129,7 +129,7 @@ std::vector<ClassRow> otherClasses()
 
 #undef QEL_ROW
 
-/// A frame that the class of the row accepts: all zeros but the offset that a broadcast must have.
+/// A frame that the class of the row accepts: the payload is zero except for the offset of a broadcast.
 std::vector<char> acceptedFrame(const ClassRow& row)
 {
     std::vector<char> payload(row.payload, '\0');
@@ -146,7 +146,7 @@ TEST_P(RegisteredClass, HasItsIdentity)
     EXPECT_EQ(GetParam().identity, Identifier(GetParam().function, GetParam().operation, GetParam().classification));
 }
 
-TEST_P(RegisteredClass, IsMadeOfItsFrames)
+TEST_P(RegisteredClass, IsParsedFromItsFrames)
 {
     const QelMessageRegistry registry;
     const std::vector<char> frame = acceptedFrame(GetParam());
@@ -157,7 +157,7 @@ TEST_P(RegisteredClass, IsMadeOfItsFrames)
     EXPECT_THAT(log.lines(), IsEmpty());
 }
 
-TEST_P(RegisteredClass, SurvivesCloning)
+TEST_P(RegisteredClass, KeepsItsClassWhenCloned)
 {
     const QelMessageRegistry registry;
     const std::unique_ptr<QelMessage> message = deserialize(registry, acceptedFrame(GetParam()));
@@ -166,7 +166,7 @@ TEST_P(RegisteredClass, SurvivesCloning)
     EXPECT_EQ(frameOf(*copy), frameOf(*message));
 }
 
-TEST_P(RegisteredClass, IsNotMadeWithBothFlags)
+TEST_P(RegisteredClass, IsNotParsedWithBothFlags)
 {
     const QelMessageRegistry registry;
     const std::unique_ptr<QelMessage> message =
@@ -183,7 +183,7 @@ TEST_P(OtherClass, HasItsIdentity)
     EXPECT_EQ(GetParam().identity, Identifier(GetParam().function, GetParam().operation, GetParam().classification));
 }
 
-TEST_P(OtherClass, IsLeftPlainByThePublicRegistry)
+TEST_P(OtherClass, IsPlainInThePublicRegistry)
 {
     const QelMessageRegistry registry;
     const std::vector<char> frame = acceptedFrame(GetParam());
@@ -196,7 +196,7 @@ TEST_P(OtherClass, IsLeftPlainByThePublicRegistry)
 
 INSTANTIATE_TEST_SUITE_P(, OtherClass, testing::ValuesIn(otherClasses()), rowName);
 
-TEST(QelMessageRegistry, KnowsThirtyTwoIdentitiesAndNoOther)
+TEST(QelMessageRegistry, HasExactly32Identities)
 {
     std::set<Identifier> known;
     for (const ClassRow& row : registeredClasses())
@@ -226,13 +226,13 @@ TEST(QelMessageRegistry, KnowsThirtyTwoIdentitiesAndNoOther)
 
 // --- the overlay
 
-TEST(QelMessageRegistryFastHeader, IsTwentyTwoBytesWithoutAlignment)
+TEST(QelMessageRegistryFastHeader, Has22BytesAndAlignment1)
 {
     EXPECT_EQ(sizeof(QelMessageRegistry::FastHeader), 22U);
     EXPECT_EQ(alignof(QelMessageRegistry::FastHeader), 1U);
 }
 
-TEST(QelMessageRegistryFastHeader, ReadsTheIdentityAtAnyAddressAndNothingElse)
+TEST(QelMessageRegistryFastHeader, ReadsOnlyTheIdentityAtAnyAddress)
 {
     const std::vector<char> header =
         bytes({0x11, 0x22, 0x33, 0x44, 0x55, 0x66, 0x77, 0x88, 0x99, 0xAA, 0xBB, 0xCC, // ignored
@@ -280,9 +280,9 @@ TEST(QelMessageRegistry, ReadsFramesAtAnyAddress)
 
 // --- deserialising, step by step
 
-TEST(QelMessageRegistry, RefusesWhatIsTooShortToHaveAnIdentity)
+TEST(QelMessageRegistry, RefusesABufferBelow22Bytes)
 {
-    // Whatever is in the map: this factory would be called for a buffer of zeros.
+    // The length is checked before the look-up: this factory would be called for a buffer of zeros.
     unsigned int calls = 0;
     const QelMessageRegistry registry({{Identifier(0, 0, Classification::Async), [&calls](const char*, unsigned int) {
                                             ++calls;
@@ -312,7 +312,7 @@ TEST(QelMessageRegistry, RefusesANullBuffer)
                 ThrowsMessage<QelMessageValidationException>(StrEq("length")));
 }
 
-TEST(QelMessageRegistry, TriesAShortFrameOfAKnownIdentityTwice)
+TEST(QelMessageRegistry, LogsBothAttemptsForAShortFrameOfAKnownIdentity)
 {
     const QelMessageRegistry registry;
     std::vector<char> frame = RawFrame::newForm().function(0x6003).operation(0x0102).flags(0x80).bytes();
@@ -339,7 +339,7 @@ TEST(QelMessageRegistry, WritesNoDebugLineUnlessThatLevelIsEnabled)
     EXPECT_THAT(log.lines(), IsEmpty());
 }
 
-TEST(QelMessageRegistry, LeavesAFramePlainThatItsClassRefuses)
+TEST(QelMessageRegistry, ReturnsAPlainMessageWhenTheClassRefusesTheFrame)
 {
     const QelMessageRegistry registry;
     const std::vector<char> frame =
@@ -352,7 +352,7 @@ TEST(QelMessageRegistry, LeavesAFramePlainThatItsClassRefuses)
                                          "shorter than actual data size"));
 }
 
-TEST(QelMessageRegistry, LeavesAnUnknownFramePlainWithoutALine)
+TEST(QelMessageRegistry, ReturnsAPlainMessageForAnUnknownIdentityAndLogsNothing)
 {
     const QelMessageRegistry registry;
     const std::vector<char> frame =
@@ -364,7 +364,7 @@ TEST(QelMessageRegistry, LeavesAnUnknownFramePlainWithoutALine)
     EXPECT_THAT(log.lines(), IsEmpty());
 }
 
-TEST(QelMessageRegistry, LeavesTheAnswerToTheTimeOfDayRequestPlain)
+TEST(QelMessageRegistry, ReturnsAPlainMessageForATimeOfDayResponse)
 {
     const QelMessageRegistry registry;
     const std::vector<char> frame = RawFrame::newForm()
@@ -378,7 +378,7 @@ TEST(QelMessageRegistry, LeavesTheAnswerToTheTimeOfDayRequestPlain)
     EXPECT_EQ(frameOf(*message), hex(frame));
 }
 
-TEST(QelMessageRegistry, RefusesAnUnknownFrameThatIsNoFrame)
+TEST(QelMessageRegistry, RefusesAMalformedFrameOfAnUnknownIdentity)
 {
     const QelMessageRegistry registry;
     CapturedLog log;
@@ -415,21 +415,21 @@ QelMessageRegistry registryWith(QelMessageRegistry::Factory factory)
     return QelMessageRegistry({{Example::getMessageID(), std::move(factory)}});
 }
 
-TEST(QelMessageRegistry, OfAListKnowsExactlyItsEntries)
+TEST(QelMessageRegistry, OfAListHasExactlyItsEntries)
 {
     const QelMessageRegistry registry({QelMessageRegistry::Entry<Example>()});
     EXPECT_EQ(classOf(*deserialize(registry, exampleFrame().bytes())), typeid(Example));
     EXPECT_EQ(classOf(*deserialize(registry, acceptedFrame(registeredClasses().front()))), typeid(QelMessage));
 }
 
-TEST(QelMessageRegistry, OfAnEmptyListKnowsNothing)
+TEST(QelMessageRegistry, OfAnEmptyListHasNoEntries)
 {
     const QelMessageRegistry registry(
         std::initializer_list<std::pair<const Identifier, QelMessageRegistry::Factory>>{});
     EXPECT_EQ(classOf(*deserialize(registry, exampleFrame().bytes())), typeid(QelMessage));
 }
 
-TEST(QelMessageRegistry, OfSeveralEntriesForOneIdentityTheFirstStands)
+TEST(QelMessageRegistry, UsesTheFirstOfSeveralEntriesForOneIdentity)
 {
     const auto second = [](const char*, unsigned int) -> std::unique_ptr<QelMessage> {
         throw std::logic_error("the second entry was used");
@@ -447,7 +447,7 @@ TEST(QelMessageRegistry, EntryIsTheIdentityAndAFactory)
     EXPECT_EQ(classOf(*message), typeid(Example));
 }
 
-TEST(QelMessageRegistry, GivesTheFactoryOfAnIdentity)
+TEST(QelMessageRegistry, FindsTheFactoryOfAnIdentity)
 {
     const QelMessageRegistry registry({QelMessageRegistry::Entry<Example>()});
     const QelMessageRegistry::Factory* const factory = registry.findFactory(Example::getMessageID());
@@ -465,7 +465,7 @@ TEST(QelMessageRegistry, HasNoFactoryForAnUnknownIdentity)
     EXPECT_EQ(registry.findFactory(Identifier(0x800B, 0x0005, Classification::Request)), nullptr);
 }
 
-TEST(QelMessageRegistry, TheFactoryTellsWhyAFrameIsRefused)
+TEST(QelMessageRegistry, FactoryThrowsTheReasonOfARefusal)
 {
     const QelMessageRegistry registry;
     const auto* const factory = registry.findFactory(Identifier(0x6002, 0x0402, Classification::Request));
@@ -476,7 +476,7 @@ TEST(QelMessageRegistry, TheFactoryTellsWhyAFrameIsRefused)
     EXPECT_EQ(classOf(*deserialize(registry, frame)), typeid(QelMessage));
 }
 
-TEST(QelMessageRegistry, HandsTheBytesToTheFactoryInPlace)
+TEST(QelMessageRegistry, PassesTheBytesToTheFactoryInPlace)
 {
     const char* seenBuffer = nullptr;
     unsigned int seenLength = 0;
@@ -499,7 +499,7 @@ TEST(QelMessageRegistry, FallsBackOnEveryValidationException)
     EXPECT_EQ(classOf(*deserialize(registry, exampleFrame().bytes())), typeid(QelMessage));
 }
 
-TEST(QelMessageRegistry, LetsOtherExceptionsPassWithoutALine)
+TEST(QelMessageRegistry, PassesOtherExceptionsAndLogsNothing)
 {
     CapturedLog log;
     const std::vector<char> frame = exampleFrame().bytes();
@@ -529,18 +529,18 @@ TEST(QelMessageRegistry, LetsOtherExceptionsPassWithoutALine)
     EXPECT_THAT(log.lines(), IsEmpty());
 }
 
-TEST(QelMessageRegistry, NeverChangesOnceItIsBuilt)
+TEST(QelMessageRegistry, IsImmutableOnceBuilt)
 {
     static_assert(!std::is_copy_assignable<QelMessageRegistry>::value, "threads read it without a lock");
     static_assert(!std::is_move_assignable<QelMessageRegistry>::value, "threads read it without a lock");
-    static_assert(!std::is_copy_assignable<QelInternalMessageRegistry>::value, "all of the process read it");
+    static_assert(!std::is_copy_assignable<QelInternalMessageRegistry>::value, "all threads of the process read it");
 
     const QelMessageRegistry original({QelMessageRegistry::Entry<Example>()});
     const QelMessageRegistry copy(original);
     EXPECT_EQ(classOf(*deserialize(copy, exampleFrame().bytes())), typeid(Example));
 }
 
-TEST(QelMessageRegistry, IsReadByAnyNumberOfThreads)
+TEST(QelMessageRegistry, DeserializesInManyThreadsAtOnce)
 {
     const QelMessageRegistry registry;
     const std::vector<ClassRow> rows = registeredClasses();
@@ -560,7 +560,7 @@ TEST(QelMessageRegistry, IsReadByAnyNumberOfThreads)
 
 // --- across the border of the library
 
-TEST(QelMessageRegistry, GivesObjectsThatThisProgramRecognises)
+TEST(QelMessageRegistry, ReturnsObjectsThatThisProgramRecognises)
 {
     const QelMessageRegistry registry;
     const std::unique_ptr<QelMessage> request =
@@ -575,7 +575,7 @@ TEST(QelMessageRegistry, GivesObjectsThatThisProgramRecognises)
     EXPECT_EQ(dynamic_cast<const QelMessageVirtualSerialOpenRsp*>(request.get()), nullptr);
 }
 
-TEST(QelMessageRegistry, LocalResponsesCannotBeMadeFromBytes)
+TEST(QelMessageRegistry, LocalResponsesAreNotConstructibleFromBytes)
 {
     static_assert(!std::is_constructible<QelMessageGetInterfaceLimitsRsp, const char*, unsigned int>::value, "");
     static_assert(!std::is_constructible<QelMessageGetQelTodRsp, const char*, unsigned int>::value, "");

@@ -103,7 +103,7 @@ TEST(OpenReq, NeedsEightBytes)
     EXPECT_EQ(verdict<OpenReq>(address().zeros(5)), "accepted");
 }
 
-TEST(OpenReq, IsForcedByBit15Alone)
+TEST(OpenReq, IsForcedOnlyByBit15)
 {
     struct Row {
         unsigned int flags;
@@ -122,7 +122,7 @@ TEST(OpenReq, IsForcedByBit15Alone)
     }
 }
 
-TEST(OpenReq, LeavesUpperCaseForTheRawBytes)
+TEST(OpenReq, PrintsTheRawBytesInUpperCase)
 {
     const CallerIdScope ids(6);
     EXPECT_EQ(test::dumpOf(OpenReq(0x00AB, 0xCDEF, true)),
@@ -178,7 +178,7 @@ TEST(OpenRsp, NeedsEightBytes)
     EXPECT_EQ(verdict<OpenRsp>(address().zeros(5)), "accepted");
 }
 
-TEST(OpenRsp, PrintsTheAddressAlone)
+TEST(OpenRsp, PrintsOnlyTheAddress)
 {
     EXPECT_EQ(detailsOf(OpenRsp(1, 0x1234, 17)), kAddressText);
     EXPECT_EQ(detailsOf(received<OpenRsp>(oldFrame<OpenRsp>(address().u32(0xEEEEEEEE)))), kAddressText);
@@ -216,7 +216,7 @@ TEST(CloseReq, NeedsFiveBytes)
     EXPECT_EQ(verdict<CloseReq>(address().zeros(2)), "accepted");
 }
 
-TEST(CloseReq, IsForcedByFFAlone)
+TEST(CloseReq, IsForcedOnlyByFF)
 {
     for (const unsigned int value : {0x00U, 0x01U, 0x7FU, 0x80U, 0xFEU, 0xFFU}) {
         SCOPED_TRACE(value);
@@ -327,7 +327,7 @@ TYPED_TEST(SerialData, NeedsAllItsBytes)
     EXPECT_EQ(verdict<TypeParam>(address().u16(0xFFFA)), kTooShort);
 }
 
-TYPED_TEST(SerialData, IsNullWithoutALengthWhateverFollows)
+TYPED_TEST(SerialData, IsNullWhenTheLengthIs0EvenIfBytesFollow)
 {
     const auto message = received<TypeParam>(address().u16(0).text("abc"));
     EXPECT_EQ(message.dataLength(), 9U);
@@ -412,7 +412,7 @@ TEST(SetupReq, NeedsFourBytes)
     EXPECT_EQ(verdict<SetupReq>(Payload().zeros(5)), "accepted");
 }
 
-TEST(SetupReq, PrintsTheAddressAlone)
+TEST(SetupReq, PrintsOnlyTheAddress)
 {
     EXPECT_EQ(detailsOf(SetupReq(0x1234, 17)), kAddressText);
     EXPECT_EQ(detailsOf(received<SetupReq>(oldFrame<SetupReq>(address()))), kAddressText);
@@ -465,7 +465,7 @@ TEST(SessionClosed, NeedsEightBytes)
     EXPECT_EQ(verdict<SessionClosed>(address().zeros(5)), "accepted");
 }
 
-TEST(SessionClosed, ReadsOtherReasonsAsUnknownAndPrintsThemAsTheyAre)
+TEST(SessionClosed, ReadsUndefinedReasonsAsUnknownAndPrintsTheNumber)
 {
     struct Row {
         unsigned int stored;

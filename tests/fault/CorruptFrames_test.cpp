@@ -1,14 +1,13 @@
-#include <qel/common/QelInternalMessageRegistry.hpp>
 #include <qel/common/QelMessage.hpp>
 #include <qel/common/QelMessageCast.hpp>
 #include <qel/common/QelMessageDax.hpp>
 #include <qel/common/QelMessageGeneric.hpp>
 #include <qel/common/QelMessageInterfaceComponent.hpp>
 #include <qel/common/QelMessageRegistry.hpp>
-#include <qel/common/QelMessageVirtualSerial.hpp>
 #include <qel/common/StreamFormatters.hpp>
 #include <qel/common/TypeInfo.hpp>
 
+#include "fault/FrameModel.hpp"
 #include "support/Bytes.hpp"
 #include "support/CapturedLog.hpp"
 #include "support/GoldenFrame.hpp"
@@ -17,514 +16,25 @@
 #include <algorithm>
 #include <cstddef>
 #include <cstdint>
-#include <cstdio>
 #include <exception>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
-#include <map>
 #include <memory>
 #include <set>
-#include <stdexcept>
 #include <string>
-#include <tuple>
 #include <vector>
 
-/// Broken frames of every kind, each judged twice: by the library, and by a second reading of the wire format that is
-/// written down here without any of the library's code. For each of them the two must agree on whether it is a
-/// message, of which class, with which values, and otherwise on the reason and on the lines in the log. The bytes lie
-/// in heap blocks that end with the last of them, so that the address sanitizer sees every byte read beyond.
+/// Broken frames of every kind. The library and an independent model of the wire format (FrameModel.hpp) judge each of
+/// them. The two must agree on whether it is a message, of which class and with which values, and otherwise on the
+/// reason and on the lines in the log. The bytes lie in heap blocks of exactly their size, so that the address
+/// sanitizer reports every read past the end.
 
 namespace qel::test {
 namespace {
 
 using testing::StartsWith;
 
-// ------------------------------------------------------------------------------------------ the second reading: frame
-
-std::uint64_t numberAt(const std::string& bytes, std::size_t offset, std::size_t length)
-{
-    std::uint64_t number = 0;
-    for (std::size_t i = offset; i < offset + length; ++i) {
-        number = number << 8 | static_cast<unsigned char>(bytes.at(i));
-    }
-    return number;
-}
-
-void setNumberAt(std::string& bytes, std::size_t offset, std::size_t length, std::uint64_t number)
-{
-    for (std::size_t i = 0; i < length; ++i) {
-        bytes.at(offset + length - 1 - i) = static_cast<char>(static_cast<unsigned char>(number >> (8 * i)));
-    }
-}
-
-std::string hexNumber(std::uint64_t number, int digits)
-{
-    char text[32];
-    std::snprintf(text, sizeof(text), "0x%0*llX", digits, static_cast<unsigned long long>(number));
-    return text;
-}
-
-std::size_t headerLength(const std::string& bytes) { return numberAt(bytes, 3, 1) == 0 ? 24 : 32; }
-
-/// Why some bytes are no frame, and how the line in the log begins; nothing when they are one.
-struct Fault {
-    std::string phrase;
-    std::string logLine;
-};
-
-Fault judgeFrame(const std::string& bytes)
-{
-    const std::size_t length = bytes.size();
-    if (length < 24) return {"i_length shorter than old header", "bad length = " + hexNumber(length, 8)};
-    if (bytes.compare(0, 3, "\xDE\xCA\xFF") != 0) {
-        return {"i_buffer bad eyecatcher", "bad eyecatcher = 0x" + hex(bytes.substr(0, 3))};
-    }
-    const std::uint64_t version = numberAt(bytes, 3, 1);
-    if (length < 32 && version != 0) {
-        return {"i_length shorter than new header", "bad length = " + hexNumber(length, 8)};
-    }
-    const std::uint64_t msgLength = numberAt(bytes, 4, 4);
-    if (msgLength > length) {
-        return {"i_length shorter than total message length", "i_length shorter than message length field in header"};
-    }
-    if (version != 0x00 && version != 0x20) {
-        return {"i_buffer bad header version", "bad header version = " + hexNumber(version, 2)};
-    }
-    const std::uint64_t dataLength = numberAt(bytes, 16, 4);
-    const std::uint64_t pad = numberAt(bytes, 15, 1);
-    const std::uint64_t leastPad = version == 0 && dataLength < 16 ? 16 - dataLength : 0;
-    if (pad < leastPad) {
-        return {"i_buffer bad header pad length",
-                "bad header pad length (old) = " + hexNumber(pad, 2) + " < expected 0x"};
-    }
-    if (msgLength != headerLength(bytes) + dataLength + pad) {
-        return {"i_buffer bad MsgLength in header", "bad header MsgLength = " + hexNumber(msgLength, 8)};
-    }
-    return {};
-}
-
-// --------------------------------------------------------------------------------------- the second reading: payloads
-
-/// What accessors give, in the order in which both sides ask.
-class Reading {
-public:
-    Reading& number(std::uint64_t value)
-    {
-        mText += std::to_string(value) + ' ';
-        return *this;
-    }
-    Reading& bytes(const std::string& value)
-    {
-        mText += hex(value) + ' ';
-        return *this;
-    }
-    Reading& text(const std::string& value)
-    {
-        mText += value + ' ';
-        return *this;
-    }
-    const std::string& str() const { return mText; }
-
-private:
-    std::string mText;
-};
-
-/// How a class treats its payload.
-struct PayloadRules {
-    std::string (*judge)(
-        const std::string& payload);                 ///< the phrase it refuses the payload with; nothing if it takes it
-    Reading (*expected)(const std::string& payload); ///< the values, from the bytes
-    Reading (*actual)(const QelMessage& message);    ///< the values, from the accessors
-};
-
-std::uint64_t u8(const std::string& payload, std::size_t offset) { return numberAt(payload, offset, 1); }
-std::uint64_t u16(const std::string& payload, std::size_t offset) { return numberAt(payload, offset, 2); }
-std::uint64_t u32(const std::string& payload, std::size_t offset) { return numberAt(payload, offset, 4); }
-
-/// @throws std::out_of_range the payload has not so many bytes
-std::string part(const std::string& payload, std::uint64_t offset, std::uint64_t length)
-{
-    if (offset + length > payload.size()) throw std::out_of_range("part");
-    return payload.substr(offset, length);
-}
-
-std::string takeAll(const std::string&) { return ""; }
-Reading readNothing(const std::string&) { return {}; }
-Reading readNothing(const QelMessage&) { return {}; }
-
-constexpr char kTooSmall[] = "dataLength smaller than minimum acceptable size";
-
-template <std::size_t Length>
-std::string atLeast(const std::string& payload)
-{
-    return payload.size() < Length ? "dataLength shorter than actual data size" : "";
-}
-
-std::string judgeVersionRequest(const std::string& payload)
-{
-    if (payload.size() < 16) return kTooSmall;
-    if (u16(payload, 8) > 32 || payload.size() < 16 + u16(payload, 8)) return "Tool ID length is invalid";
-    return "";
-}
-
-Reading readVersionRequest(const std::string& payload)
-{
-    return Reading()
-        .number(u32(payload, 0))
-        .number(u32(payload, 4))
-        .number(u16(payload, 10))
-        .number(u16(payload, 12))
-        .bytes(part(payload, 16, u16(payload, 8)));
-}
-
-Reading askVersionRequest(const QelMessage& message)
-{
-    const auto& typed = qelMessageCast<QelMessageGetEnclTypeAndInterfaceVersionReq>(message);
-    return Reading()
-        .number(typed.getInterfaceVersion())
-        .number(typed.getToolType())
-        .number(typed.getMajorVersion())
-        .number(typed.getMinorVersion())
-        .bytes(typed.getToolId());
-}
-
-std::string judgeVersionResponse(const std::string& payload)
-{
-    if (payload.size() < 32) return kTooSmall;
-    if (u16(payload, 12) > 16) return "Invalid machine type length";
-    if (u16(payload, 14) > 16) return "Invalid system serial length";
-    if (payload.size() < 32 + u16(payload, 14)) return "dataLength not long enough to encapsulate final string field";
-    return "";
-}
-
-Reading readVersionResponse(const std::string& payload)
-{
-    return Reading()
-        .number(u8(payload, 0))
-        .number(u8(payload, 1))
-        .number(u16(payload, 2))
-        .number(u16(payload, 4))
-        .bytes(part(payload, 16, u16(payload, 12)))
-        .bytes(part(payload, 32, u16(payload, 14)));
-}
-
-Reading askVersionResponse(const QelMessage& message)
-{
-    const auto& typed = qelMessageCast<QelMessageGetEnclTypeAndInterfaceVersionRsp>(message);
-    return Reading()
-        .number(static_cast<unsigned char>(typed.getInterfaceVersionFamily()))
-        .number(typed.getEnclosureType())
-        .number(typed.getMajorVersion())
-        .number(typed.getMinorVersion())
-        .bytes(typed.getSystemMachineType())
-        .bytes(typed.getSystemSerialNum());
-}
-
-std::string judgeCapabilities(const std::string& payload)
-{
-    if (payload.size() < 4) return kTooSmall;
-    if (u32(payload, 0) % 4 != 0) return "Given capability length is invalid (length % 4 wasn't 0)";
-    if (payload.size() < 4 + u32(payload, 0)) return "capabilityLen larger than acceptable";
-    return "";
-}
-
-Reading readCapabilities(const std::string& payload)
-{
-    std::string bits;
-    for (std::size_t i = 0; i < 32; ++i) {
-        const bool isCarried = i / 8 < u32(payload, 0);
-        bits += isCarried && (u8(payload, 4 + i / 8) & 0x80U >> i % 8) != 0 ? '1' : '0';
-    }
-    return Reading().number(u32(payload, 0)).text(bits);
-}
-
-template <typename T>
-Reading askCapabilities(const QelMessage& message)
-{
-    const auto& typed = qelMessageCast<T>(message);
-    return Reading().number(typed.getCapabilityLen()).text(typed.getCapabilities().to_string());
-}
-
-std::string judgeBroadcastRequest(const std::string& payload)
-{
-    if (payload.size() < 46) return kTooSmall;
-    if (u16(payload, 0) < 46) return "message offset less than minimum acceptable size";
-    if (u16(payload, 0) + u16(payload, 4) > payload.size()) return "message greater than maximum acceptable size";
-    if (u8(payload, 2) == 1 && u16(payload, 12) == 0) return "Unicast message has no valid toolID";
-    if (u16(payload, 12) > 32) return "toolIdLen greater than maximum acceptable size";
-    return "";
-}
-
-Reading readBroadcastRequest(const std::string& payload)
-{
-    return Reading()
-        .number(u16(payload, 0))
-        .number(u8(payload, 2))
-        .number(u32(payload, 8))
-        .number(u16(payload, 4))
-        .bytes(part(payload, 14, u16(payload, 12)))
-        .bytes(part(payload, u16(payload, 0), u16(payload, 4)));
-}
-
-Reading askBroadcastRequest(const QelMessage& message)
-{
-    const auto& typed = qelMessageCast<QelMessageDaxBroadcastReq>(message);
-    return Reading()
-        .number(static_cast<std::uint64_t>(typed.getDaxPacket() - typed.getData()))
-        .number(typed.getBroadcastMode())
-        .number(typed.getToolType())
-        .number(typed.getBroadcastMsgLen())
-        .bytes(typed.getToolId())
-        .bytes(std::string(typed.getDaxPacket(), typed.getBroadcastMsgLen()));
-}
-
-std::string judgeOutboundBroadcast(const std::string& payload)
-{
-    if (payload.size() < 42) return kTooSmall;
-    if (u16(payload, 0) < 42) return "message offset less than minimum acceptable size";
-    if (u16(payload, 0) + u16(payload, 2) > payload.size()) return "message greater than maximum acceptable size";
-    if (u16(payload, 8) > 32) return "toolIdLen greater than maximum acceptable size";
-    return "";
-}
-
-Reading readOutboundBroadcast(const std::string& payload)
-{
-    return Reading()
-        .number(u16(payload, 0))
-        .number(u32(payload, 4))
-        .number(u16(payload, 2))
-        .bytes(part(payload, 10, u16(payload, 8)))
-        .bytes(part(payload, u16(payload, 0), u16(payload, 2)));
-}
-
-Reading askOutboundBroadcast(const QelMessage& message)
-{
-    const auto& typed = qelMessageCast<QelMessageDaxBroadcastOutboundAsync>(message);
-    return Reading()
-        .number(static_cast<std::uint64_t>(typed.getDaxPacket() - typed.getData()))
-        .number(typed.getSenderToolType())
-        .number(typed.getBroadcastMsgLen())
-        .bytes(typed.getSenderToolId())
-        .bytes(std::string(typed.getDaxPacket(), typed.getBroadcastMsgLen()));
-}
-
-std::string judgeMode(const std::string& payload)
-{
-    if (payload.size() < 4) return kTooSmall;
-    return payload.size() < 4 + u16(payload, 2) ? "mtmsLen larger than acceptable" : "";
-}
-
-Reading readMode(const std::string& payload)
-{
-    return Reading().number(u8(payload, 0)).number(u16(payload, 2)).bytes(part(payload, 4, u16(payload, 2)));
-}
-
-template <typename T>
-Reading askMode(const QelMessage& message)
-{
-    const auto& typed = qelMessageCast<T>(message);
-    return Reading().number(typed.getMode()).number(typed.getMTMSLen()).bytes(typed.getMTMS());
-}
-
-std::string judgeMetadata(const std::string& payload)
-{
-    if (payload.size() < 2) return kTooSmall;
-    return payload.size() < 2 + u16(payload, 0) ? "metadataLen larger than acceptable" : "";
-}
-
-Reading readMetadata(const std::string& payload)
-{
-    return Reading().number(u16(payload, 0)).bytes(part(payload, 2, u16(payload, 0)));
-}
-
-template <typename T>
-Reading askMetadata(const QelMessage& message)
-{
-    const auto& typed = qelMessageCast<T>(message);
-    return Reading().number(typed.getMetadataLen()).bytes(typed.getMetadata());
-}
-
-/// Partition and connection number.
-Reading readAddress(const std::string& payload) { return Reading().number(u16(payload, 0)).number(u16(payload, 2)); }
-
-template <typename T>
-Reading askAddress(const QelMessage& message)
-{
-    const auto& typed = qelMessageCast<T>(message);
-    return Reading().number(typed.getLpId()).number(typed.getVssConnectionNumber());
-}
-
-Reading readOpen(const std::string& payload) { return readAddress(payload).number(u16(payload, 4) >> 15); }
-
-Reading askOpen(const QelMessage& message)
-{
-    using T = QelMessageVirtualSerialOpenReq;
-    return askAddress<T>(message).number(qelMessageCast<T>(message).isForceOpen() ? 1 : 0);
-}
-
-Reading readClose(const std::string& payload) { return readAddress(payload).number(u8(payload, 4) == 0xFF ? 1 : 0); }
-
-Reading askClose(const QelMessage& message)
-{
-    using T = QelMessageVirtualSerialCloseReq;
-    return askAddress<T>(message).number(qelMessageCast<T>(message).isForceClose() ? 1 : 0);
-}
-
-Reading readMaxSessions(const std::string& payload) { return Reading().number(u16(payload, 0)).number(u8(payload, 2)); }
-
-Reading askMaxSessions(const QelMessage& message)
-{
-    const auto& typed = qelMessageCast<QelMessageVirtualSerialGetMaxSessionsRsp>(message);
-    return Reading().number(typed.getMaxCec()).number(typed.getMaxLpar());
-}
-
-Reading readSessionClosed(const std::string& payload)
-{
-    const std::uint64_t reason = u32(payload, 4);
-    return readAddress(payload).number(reason >= 1 && reason <= 5 ? reason : 1);
-}
-
-Reading askSessionClosed(const QelMessage& message)
-{
-    using T = QelMessageVirtualSerialSessionClosedAsync;
-    return askAddress<T>(message).number(qelMessageCast<T>(message).getCloseReason());
-}
-
-std::string judgeSerialData(const std::string& payload)
-{
-    if (payload.size() < 6 || payload.size() < 6 + u16(payload, 4)) return "dataLength shorter than actual data size";
-    return "";
-}
-
-Reading readSerialData(const std::string& payload)
-{
-    const Reading fixed = readAddress(payload).number(u16(payload, 4));
-    if (u16(payload, 4) == 0) return Reading(fixed).text("null");
-    return Reading(fixed).bytes(part(payload, 6, u16(payload, 4)));
-}
-
-template <typename T>
-Reading askSerialData(const QelMessage& message)
-{
-    const auto& typed = qelMessageCast<T>(message);
-    const Reading fixed = askAddress<T>(message).number(typed.getSerialDataLength());
-    if (typed.getSerialData() == nullptr) return Reading(fixed).text("null");
-    return Reading(fixed).bytes(std::string(typed.getSerialData(), typed.getSerialDataLength()));
-}
-
-/// The rules of a class; classes without an entry have no payload and take any.
-const PayloadRules& rulesOf(const std::string& className)
-{
-    static const PayloadRules kNone = {&takeAll, &readNothing, &readNothing};
-    static const std::map<std::string, PayloadRules> kRules = {
-        {"QelMessageGetEnclTypeAndInterfaceVersionReq",
-         {&judgeVersionRequest, &readVersionRequest, &askVersionRequest}},
-        {"QelMessageGetEnclTypeAndInterfaceVersionRsp",
-         {&judgeVersionResponse, &readVersionResponse, &askVersionResponse}},
-        {"QelMessageExchIntCapabilitiesReq",
-         {&judgeCapabilities, &readCapabilities, &askCapabilities<QelMessageExchIntCapabilitiesReq>}},
-        {"QelMessageExchIntCapabilitiesRsp",
-         {&judgeCapabilities, &readCapabilities, &askCapabilities<QelMessageExchIntCapabilitiesRsp>}},
-        {"QelMessageDaxBroadcastReq", {&judgeBroadcastRequest, &readBroadcastRequest, &askBroadcastRequest}},
-        {"QelMessageDaxBroadcastOutboundAsync",
-         {&judgeOutboundBroadcast, &readOutboundBroadcast, &askOutboundBroadcast}},
-        {"QelMessageSetGlobalModeAttributeReq", {&judgeMode, &readMode, &askMode<QelMessageSetGlobalModeAttributeReq>}},
-        {"QelMessageGetGlobalModeAttributeRsp", {&judgeMode, &readMode, &askMode<QelMessageGetGlobalModeAttributeRsp>}},
-        {"QelMessageSetGlobalSaveAreaMetadataReq",
-         {&judgeMetadata, &readMetadata, &askMetadata<QelMessageSetGlobalSaveAreaMetadataReq>}},
-        {"QelMessageGetGlobalSaveAreaMetadataRsp",
-         {&judgeMetadata, &readMetadata, &askMetadata<QelMessageGetGlobalSaveAreaMetadataRsp>}},
-        {"QelMessageVirtualSerialOpenReq", {&atLeast<8>, &readOpen, &askOpen}},
-        {"QelMessageVirtualSerialOpenRsp", {&atLeast<8>, &readAddress, &askAddress<QelMessageVirtualSerialOpenRsp>}},
-        {"QelMessageVirtualSerialCloseReq", {&atLeast<5>, &readClose, &askClose}},
-        {"QelMessageVirtualSerialGetMaxSessionsRsp", {&atLeast<3>, &readMaxSessions, &askMaxSessions}},
-        {"QelMessageVirtualSerialSetupSessionReq",
-         {&atLeast<4>, &readAddress, &askAddress<QelMessageVirtualSerialSetupSessionReq>}},
-        {"QelMessageVirtualSerialSessionClosedAsync", {&atLeast<8>, &readSessionClosed, &askSessionClosed}},
-        {"QelMessageVirtualSerialDataToOsAsync",
-         {&judgeSerialData, &readSerialData, &askSerialData<QelMessageVirtualSerialDataToOsAsync>}},
-        {"QelMessageVirtualSerialDataToDaxAsync",
-         {&judgeSerialData, &readSerialData, &askSerialData<QelMessageVirtualSerialDataToDaxAsync>}},
-    };
-    const auto found = kRules.find(className);
-    return found == kRules.end() ? kNone : found->second;
-}
-
-// ------------------------------------------------------------------------------------------------- the two registries
-
-using Identity = std::tuple<std::uint64_t, std::uint64_t, std::uint64_t>; // function, operation, upper two flag bits
-
-/// A registry, and the classes that it is expected to know.
-struct Receiver {
-    const QelMessageRegistry& registry;
-    std::map<Identity, std::string> classes;
-};
-
-Receiver receiver(const QelMessageRegistry& registry, bool isInternal)
-{
-    const std::set<std::string> neverParsed = {"QelMessageGetInterfaceLimitsRsp", "QelMessageGetQelTodRsp"};
-    Receiver result{registry, {}};
-    for (const std::string& name : GoldenFrame::allNames()) {
-        const GoldenFrame golden = GoldenFrame::load(name);
-        if (neverParsed.count(golden.className()) != 0 || (golden.function() == 0x6001) != isInternal) continue;
-        const std::uint64_t flags = golden.number<unsigned char>("header.mFlags");
-        result.classes[{golden.function(), golden.operation(), flags}] = golden.className();
-    }
-    return result;
-}
-
-const Receiver& publicReceiver()
-{
-    static const QelMessageRegistry kRegistry;
-    static const Receiver kReceiver = receiver(kRegistry, false);
-    return kReceiver;
-}
-
-const Receiver& internalReceiver()
-{
-    static const Receiver kReceiver = receiver(QelInternalMessageRegistry::getInstance(), true);
-    return kReceiver;
-}
-
-// ---------------------------------------------------------------------------------------------------- what must come
-// out
-
-/// What the second reading says about some bytes.
-struct Verdict {
-    std::string thrown;             ///< the phrase of the exception; nothing when a message comes out
-    std::string className;          ///< of the message
-    std::string payload;            ///< of the message
-    std::vector<std::string> lines; ///< how each line in the log begins
-};
-
-Verdict judge(const Receiver& receiver, const std::string& bytes)
-{
-    if (bytes.size() < 22) return {"length", "", "", {"E: Encountered message with invalid length"}};
-
-    const std::uint64_t flags = numberAt(bytes, 14, 1);
-    const std::string fastHeader = "[FN=" + hexNumber(numberAt(bytes, 12, 2), 4) +
-                                   " OP=" + hexNumber(numberAt(bytes, 20, 2), 4) + " FL=" + hexNumber(flags, 2) + "]";
-    const auto known = receiver.classes.find({numberAt(bytes, 12, 2), numberAt(bytes, 20, 2), flags & 0xC0});
-    const bool isKnown = known != receiver.classes.end();
-    const std::string refused = "D: Failed to deserialize message " + fastHeader + ": ";
-
-    const Fault fault = judgeFrame(bytes);
-    if (!fault.phrase.empty()) {
-        Verdict verdict{fault.phrase, "", "", {}};
-        if (isKnown) verdict.lines = {"E: " + fault.logLine, refused + fault.phrase};
-        verdict.lines.push_back("E: " + fault.logLine);
-        verdict.lines.push_back("E: Default message deserialization failed " + fastHeader + ": " + fault.phrase);
-        return verdict;
-    }
-
-    const std::string payload = bytes.substr(headerLength(bytes), numberAt(bytes, 16, 4));
-    if (!isKnown) return {"", "QelMessage", payload, {}};
-    const std::string phrase = rulesOf(known->second).judge(payload);
-    if (!phrase.empty()) return {"", "QelMessage", payload, {refused + phrase}};
-    return {"", known->second, payload, {}};
-}
-
-/// The last part of the dump: sixteen bytes to a line, a blank before every second one.
+/// The last part of the dump: 16 bytes to a line, a blank before every second byte.
 std::string rawContents(const std::string& frame)
 {
     std::string dump = "Current raw message contents:\n";
@@ -563,7 +73,7 @@ void expectHeader(const QelMessage& message, const std::string& frame)
     }
 }
 
-/// Asks a message for everything it has.
+/// Compares everything that a message returns with the model.
 void expectMessage(const QelMessage& message, const Verdict& verdict, const std::string& bytes)
 {
     const std::string frame = bytes.substr(0, numberAt(bytes, 4, 4));
@@ -606,8 +116,7 @@ void expectLines(const std::vector<std::string>& lines, const std::vector<std::s
 
 class CorruptFrames : public testing::Test {
 protected:
-    /// Hands the bytes to the receiver from an even address and from an odd one, and compares what comes out with the
-    /// second reading.
+    /// Passes the bytes to the receiver from an even and from an odd address, and compares the result with the model.
     void tryBytes(const Receiver& receiver, const std::string& bytes)
     {
         ++mTried;
@@ -617,7 +126,7 @@ protected:
             const std::unique_ptr<char[]> block = heapCopy(shifted);
             mLog.clear();
             pTryBlock(receiver, block.get() + shift, bytes, verdict);
-            EXPECT_EQ(hex(block.get(), shifted.size()), hex(shifted)) << "the input was written to";
+            EXPECT_EQ(hex(block.get(), shifted.size()), hex(shifted)) << "the input was modified";
             expectLines(mLog.lines(), verdict.lines);
             if (HasFailure()) {
                 ADD_FAILURE() << "the bytes, " << (shift == 0 ? "even" : "odd") << " address: " << hex(bytes);
@@ -666,10 +175,9 @@ std::string at(const GoldenFrame& golden, std::size_t offset)
     return golden.fileName() + " at offset " + std::to_string(offset);
 }
 
-// ------------------------------------------------------------------------------------------------------------ the
-// tests
+// --- tests
 
-TEST_F(CorruptFrames, WholeFramesAreTaken)
+TEST_F(CorruptFrames, ValidFramesAreAccepted)
 {
     for (const GoldenFrame& golden : goldenFrames()) {
         SCOPED_TRACE(golden.fileName());
@@ -692,7 +200,7 @@ TEST_F(CorruptFrames, EveryTruncationIsRefused)
     EXPECT_EQ(mRefused, mTried);
 }
 
-TEST_F(CorruptFrames, BytesBehindAFrameAreIgnored)
+TEST_F(CorruptFrames, BytesAfterAFrameAreIgnored)
 {
     for (const GoldenFrame& golden : goldenFrames()) {
         SCOPED_TRACE(golden.fileName());
@@ -713,7 +221,7 @@ std::set<char> replacements(char original)
     return values;
 }
 
-TEST_F(CorruptFrames, EverySingleByteIsReplaced)
+TEST_F(CorruptFrames, AnyReplacedByteIsJudgedAsTheModelDoes)
 {
     for (const GoldenFrame& golden : goldenFrames()) {
         for (std::size_t offset = 0; offset < golden.bytes().size(); ++offset) {
@@ -726,11 +234,11 @@ TEST_F(CorruptFrames, EverySingleByteIsReplaced)
             }
         }
     }
-    EXPECT_GT(mTaken, mRefused) << "most bytes are payload or ids, which a frame is not refused for";
+    EXPECT_GT(mTaken, mRefused) << "most bytes are payload or ids, and no value of those makes a frame invalid";
     EXPECT_GT(mRefused, 0U);
 }
 
-TEST_F(CorruptFrames, EverySingleByteOfTheHandshakeIsReplaced)
+TEST_F(CorruptFrames, AnyReplacedByteOfTheHandshakeIsJudgedAsTheModelDoes)
 {
     for (const char* const name : {"QelMessageUpgradeConnectionAsync", "QelMessageAbortHandshakeAsync"}) {
         const GoldenFrame golden = GoldenFrame::load(name);
@@ -753,7 +261,7 @@ bool isLength(const std::string& field)
     return endsWith(field, "Len") || endsWith(field, "Length") || endsWith(field, "mOffset");
 }
 
-/// The limits themselves and both neighbours of each, as far as a field of that many bytes holds them.
+/// Each limit and both its neighbours, if they fit a field of that many bytes.
 std::set<std::uint64_t> bothSidesOf(const std::vector<std::uint64_t>& limits, std::size_t fieldLength)
 {
     const std::uint64_t largest = (std::uint64_t{1} << 8 * fieldLength) - 1;
@@ -766,7 +274,7 @@ std::set<std::uint64_t> bothSidesOf(const std::vector<std::uint64_t>& limits, st
     return values;
 }
 
-/// Where a payload of this length ends for a length field: counted from each offset at which a variable part begins.
+/// The length field values that end exactly with a payload of this length, for each offset of a variable part.
 std::vector<std::uint64_t> endsOfPayload(std::uint64_t payload)
 {
     std::vector<std::uint64_t> ends;
@@ -776,7 +284,7 @@ std::vector<std::uint64_t> endsOfPayload(std::uint64_t payload)
     return ends;
 }
 
-/// Values at both sides of every limit that a length field of this frame can meet, and those at which sums wrap.
+/// Values at both sides of every limit of a length field of this frame, and those at which sums wrap.
 std::set<std::uint64_t> boundaries(const GoldenFrame& golden, const GoldenFrame::Place& field)
 {
     const std::uint64_t current = numberAt(golden.bytes(), field.offset, field.length);
@@ -793,7 +301,7 @@ std::set<std::uint64_t> boundaries(const GoldenFrame& golden, const GoldenFrame:
     return values;
 }
 
-TEST_F(CorruptFrames, EveryLengthFieldIsReplacedWithEveryBoundary)
+TEST_F(CorruptFrames, AnyBoundaryValueOfALengthFieldIsJudgedAsTheModelDoes)
 {
     std::set<std::string> fields;
     for (const GoldenFrame& golden : goldenFrames()) {
@@ -818,7 +326,7 @@ TEST_F(CorruptFrames, EveryLengthFieldIsReplacedWithEveryBoundary)
     EXPECT_GT(mRefused, 0U);
 }
 
-/// Payload length and pad that give the frame length only modulo 2^32.
+/// Payload length and pad that add up to the frame length only modulo 2^32.
 TEST_F(CorruptFrames, LengthsThatWrapTogetherAreRefused)
 {
     for (const GoldenFrame& golden : goldenFrames()) {
@@ -842,7 +350,7 @@ TEST_F(CorruptFrames, LengthsThatWrapTogetherAreRefused)
     EXPECT_EQ(mRefused, mTried);
 }
 
-/// The same header with another payload, and with lengths and pad that agree with it.
+/// The same header with another payload and consistent lengths and pad.
 std::string withPayload(const GoldenFrame& golden, const std::string& payload)
 {
     std::string bytes = golden.bytes().substr(0, headerLength(golden.bytes()));
@@ -855,7 +363,7 @@ std::string withPayload(const GoldenFrame& golden, const std::string& payload)
     return bytes + payload + std::string(pad, '\0');
 }
 
-TEST_F(CorruptFrames, EveryPayloadIsCutInAWholeFrame)
+TEST_F(CorruptFrames, AShorterPayloadIsNeverRefused)
 {
     for (const GoldenFrame& golden : goldenFrames()) {
         const std::string payload =
@@ -866,10 +374,10 @@ TEST_F(CorruptFrames, EveryPayloadIsCutInAWholeFrame)
             if (HasFailure()) return;
         }
     }
-    EXPECT_EQ(mTaken, mTried) << "a frame is not refused for its payload: it comes out as a plain message";
+    EXPECT_EQ(mTaken, mTried) << "a frame with a refused payload becomes a plain message";
 }
 
-TEST_F(CorruptFrames, EveryPayloadIsLongerThanNeeded)
+TEST_F(CorruptFrames, ALongerPayloadIsAccepted)
 {
     for (const GoldenFrame& golden : goldenFrames()) {
         const std::string payload =
@@ -887,14 +395,13 @@ TEST_F(CorruptFrames, EveryPayloadIsLongerThanNeeded)
     EXPECT_EQ(mTaken, mTried);
 }
 
-/// A payload length field next to its limit while the payload itself is cut: the fields that a cut alone leaves too
-/// long and a field alone leaves too short.
-TEST_F(CorruptFrames, EveryCutPayloadMeetsEveryLengthNextToItsEnd)
+/// Every payload length combined with every boundary value of every length field in it.
+TEST_F(CorruptFrames, AShorterPayloadWithAnyLengthFieldIsJudgedAsTheModelDoes)
 {
     for (const GoldenFrame& golden : goldenFrames()) {
         const std::size_t header = headerLength(golden.bytes());
         const std::string whole = golden.bytes().substr(header, numberAt(golden.bytes(), 16, 4));
-        if (whole.size() > 64) continue; // one long payload would be most of the work and has no more fields
+        if (whole.size() > 64) continue; // the one long payload would take most of the time and has no further fields
         for (const GoldenFrame::Place& field : golden.places()) {
             if (!isLength(field.field) || field.offset < header) continue;
             for (std::size_t length = field.offset - header + field.length; length <= whole.size(); ++length) {
@@ -914,7 +421,7 @@ TEST_F(CorruptFrames, EveryCutPayloadMeetsEveryLengthNextToItsEnd)
     EXPECT_EQ(mTaken, mTried);
 }
 
-TEST_F(CorruptFrames, NothingAtAllIsRefused)
+TEST_F(CorruptFrames, AnEmptyBufferIsRefused)
 {
     tryBytes(publicReceiver(), "");
     EXPECT_EQ(mRefused, 1U);

@@ -17,12 +17,12 @@
 #include <vector>
 
 /// @file
-/// What the tests of the message classes share: payloads put together field by field, frames of a class's identity,
-/// and the parts of a message that are compared.
+/// Shared by the tests of the message classes: payloads built field by field, frames with the identity of a class, and
+/// the parts of a message that are compared.
 
 namespace qel::test {
 
-/// The bytes of a payload, integers big-endian. Every call appends and returns the payload, so that calls chain.
+/// The bytes of a payload, integers big-endian. Every call appends and returns the payload, for chaining.
 class Payload {
 public:
     Payload& u8(unsigned int value) { return append(1, value); }
@@ -34,20 +34,20 @@ public:
         mBytes.insert(mBytes.end(), count, value);
         return *this;
     }
-    /// The characters and then zeros up to `width`; without a width the characters alone.
+    /// The characters, then zeros up to `width`.
     Payload& text(const std::string& characters, std::size_t width = 0)
     {
         mBytes.insert(mBytes.end(), characters.begin(), characters.end());
         return characters.size() < width ? zeros(width - characters.size()) : *this;
     }
-    /// Sets single bytes of what is there already.
+    /// Overwrites bytes.
     Payload& at(std::size_t offset, const std::vector<char>& values)
     {
         for (std::size_t i = 0; i < values.size(); ++i)
             mBytes.at(offset + i) = values[i];
         return *this;
     }
-    /// Cuts the payload, or extends it with zeros.
+    /// Truncates the payload, or extends it with zeros.
     Payload& resize(std::size_t length)
     {
         mBytes.resize(length);
@@ -68,7 +68,7 @@ private:
     std::vector<char> mBytes;
 };
 
-/// Names the tests of a list of classes after the classes.
+/// Names the tests of a class list after the classes.
 struct ClassNames {
     template <typename T>
     static std::string GetName(int)
@@ -104,8 +104,8 @@ RawFrame oldFrame(const Payload& payload)
     return identifyAs<T>(frame).payload(payload.bytes());
 }
 
-/// Bytes at an odd address that end with their heap block, as they may come out of the middle of a receive buffer: an
-/// aligned read and one past the end both show under the sanitizers.
+/// Bytes at an odd address at the end of a heap block, as in the middle of a receive buffer. The sanitizers report an
+/// aligned read and a read past the end.
 class OddBytes {
 public:
     explicit OddBytes(const std::vector<char>& bytes) : mBlock(new char[bytes.size() + 1]), mLength(bytes.size())
@@ -120,7 +120,7 @@ private:
     std::size_t mLength;
 };
 
-/// The message that a class makes of a frame.
+/// The message that a class parses from a frame.
 template <typename T>
 T received(const RawFrame& frame)
 {
@@ -135,7 +135,7 @@ T received(const Payload& payload)
     return received<T>(newFrame<T>(payload));
 }
 
-/// @return why a class refuses a frame, or "accepted"
+/// @return the text with which a class refuses a frame, or "accepted"
 template <typename T>
 std::string verdict(const RawFrame& frame)
 {

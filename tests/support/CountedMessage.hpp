@@ -10,8 +10,8 @@
 
 namespace qel::test {
 
-/// How many CountedMessages live, how many bytes they have together, and the most that these ever were.
-/// Thread safety: any thread. Must outlive its messages.
+/// The number of live CountedMessages, the sum of their frame lengths in bytes, and its maximum.
+/// Lifetime: must outlive its messages. Thread safety: any thread.
 class MessageCensus {
 public:
     int living() const { return mLiving; }
@@ -40,7 +40,7 @@ private:
     std::atomic<std::int64_t> mMostBytes{0};
 };
 
-/// A message that is counted as long as it lives.
+/// A message that is counted while it is alive.
 class CountedMessage : public SizedMessage {
 public:
     /// @param atTheEnd  called by the destructor

@@ -28,7 +28,7 @@ int digitValue(char c)
     return at == std::string::npos ? -1 : static_cast<int>(at);
 }
 
-/// Reads "DE CA FF". @return false when the text is anything else, or empty
+/// Parses "DE CA FF". @return false for any other text and for an empty one
 bool readBytes(const std::string& text, std::string& bytes)
 {
     if (text.size() % 3 != 2) return false;
@@ -42,7 +42,7 @@ bool readBytes(const std::string& text, std::string& bytes)
     return true;
 }
 
-/// Reads "123" or "0x7B". @return false when the text is anything else, or does not fit
+/// Parses "123" or "0x7B". @return false for any other text and for a number that does not fit
 bool readNumber(const std::string& text, std::uint64_t& number)
 {
     const bool isHex = startsWith(text, "0x");
@@ -60,7 +60,7 @@ bool readNumber(const std::string& text, std::uint64_t& number)
     return true;
 }
 
-/// Reads "a text\x00" with its quotes. @return false when the text is anything else
+/// Parses "a text\x00" with its quotes. @return false for any other text
 bool readText(const std::string& text, std::string& bytes)
 {
     if (text.size() < 2 || text.front() != '"' || text.back() != '"') return false;
@@ -98,7 +98,7 @@ bool isReserved(const std::string& field)
 
 } // namespace
 
-/// Reads one file line by line and checks it as a whole at the end.
+/// Parses one file line by line and checks the whole at the end.
 class GoldenFrame::Parser {
 public:
     Parser(GoldenFrame& frame, std::istream& in) : mFrame(frame), mIn(in) {}
@@ -143,7 +143,7 @@ private:
             pReadField(key, value);
             return;
         }
-        if (!mPlain.emplace(key, value).second) pFailLine("key \"" + key + "\" stands twice");
+        if (!mPlain.emplace(key, value).second) pFailLine("key \"" + key + "\" occurs twice");
         pReadPlain(key, value);
     }
 
@@ -160,7 +160,7 @@ private:
         } else if (key == "classification") {
             mFrame.mClassification = pReadClassification(value);
         } else if (key == "built") {
-            if (value != "no") pFailLine("\"built\" is either \"no\" or not there");
+            if (value != "no") pFailLine("\"built\" is \"no\" or absent");
             mFrame.mBuilt = false;
         } else if (key == "capabilities") {
             pReadCapabilities(value);
@@ -181,7 +181,7 @@ private:
         if (value == "Request") return QelMessageClassification::Request;
         if (value == "Response") return QelMessageClassification::Response;
         if (value == "Async") return QelMessageClassification::Async;
-        pFailLine("classification is none of Request, Response, Async");
+        pFailLine("classification is not Request, Response or Async");
     }
 
     void pReadCapabilities(const std::string& value)
@@ -212,7 +212,7 @@ private:
             if (isBytes) mByteValues.insert(key);
             return;
         }
-        if (!isBytes || mByteValues.count(key) == 0) pFailLine("key \"" + key + "\" stands twice");
+        if (!isBytes || mByteValues.count(key) == 0) pFailLine("key \"" + key + "\" occurs twice");
         added.first->second.bytes += value.bytes;
     }
 
@@ -237,7 +237,7 @@ private:
         mFrame.mFrameText += line + "\n";
     }
 
-    /// Joins a row to the field it belongs to. Which part of the frame it is in is not known before the header is.
+    /// Adds a row to its field. The part of the frame that it is in is known only after the header.
     void pAddRow(const std::string& field, const std::string& bytes)
     {
         const std::size_t offset = mFrame.mBytes.size();
@@ -257,7 +257,7 @@ private:
         return bigEndian(mFrame.mBytes.substr(offset, length));
     }
 
-    /// "header.", "payload.", or nothing for the pad. The rows of the first 24 bytes are header whatever they hold.
+    /// @return "header.", "payload.", or "" for the pad. The rows of the first 24 bytes are always header.
     std::string pPartAt(std::size_t offset) const
     {
         if (offset < kOldHeaderLength || offset < pHeaderLength()) return "header.";
@@ -335,7 +335,7 @@ private:
     std::istream& mIn;
     std::size_t mLine = 0;
     std::map<std::string, std::string> mPlain;
-    std::set<std::string> mByteValues; // the keys whose values may go on
+    std::set<std::string> mByteValues; // the keys whose values may continue
 };
 
 const std::vector<std::string>& GoldenFrame::allNames()

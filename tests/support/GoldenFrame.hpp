@@ -11,17 +11,16 @@
 
 namespace qel::test {
 
-/// One of the frames in vectors/: what it is, the values of its fields, and its bytes. The form of the files is told
-/// in vectors/README.md.
+/// A frame of vectors/: its description, the values of its fields, and its bytes. vectors/README.md describes the
+/// files.
 ///
-/// A file is taken only when it agrees with itself: the rows follow each other without a gap, every field with a value
-/// has rows and holds that value big-endian, and every other byte is what its place demands (eyecatcher, identity,
-/// zero for reserved fields, pad and unused tails). None of that uses the library.
-/// Keys are written as in the file: "header.mCallerId", "payload.mToolId".
-/// Immutable; may be read from any thread.
+/// A file must be consistent: the rows follow each other without a gap, every field with a value has rows and holds
+/// that value big-endian, and every other byte has its only valid value (eyecatcher, identity, zero for reserved
+/// fields, pad and unused tails). These checks do not use the library. Keys are written as in the file:
+/// "header.mCallerId", "payload.mToolId". Thread safety: immutable; any thread.
 class GoldenFrame {
 public:
-    /// Every file of vectors/ without ".txt", the plain cases first.
+    /// The names of all files of vectors/ without ".txt", plain cases first.
     static const std::vector<std::string>& allNames();
 
     /// Reads vectors/<name>.txt. @throws std::runtime_error as parse() does, or "<name>.txt: cannot be read"
@@ -33,23 +32,23 @@ public:
 
     /// The name of the file without ".txt".
     const std::string& fileName() const { return mFileName; }
-    /// What the frame is, in words.
+    /// The description of the frame.
     const std::string& name() const { return mName; }
     const std::string& className() const { return mClassName; }
     unsigned short function() const { return mFunction; }
     unsigned short operation() const { return mOperation; }
     QelMessageClassification::Value classification() const { return mClassification; }
 
-    /// False when the library accepts the frame but never builds it.
+    /// False if the library accepts the frame but never builds it.
     bool isBuilt() const { return mBuilt; }
 
     /// The whole frame.
     const std::string& bytes() const { return mBytes; }
 
-    /// The rows of the frame as they stand in the file, each with its line end.
+    /// The rows of the frame as in the file, each with its line end.
     const std::string& frameText() const { return mFrameText; }
 
-    /// @throws std::runtime_error there is no such key, or its value is no number or does not fit `T`
+    /// @throws std::runtime_error there is no such key, or its value is not a number or does not fit `T`
     template <typename T>
     T number(const std::string& key) const
     {
@@ -67,7 +66,7 @@ public:
     /// The numbers of the capability bits that are set; empty without such a line.
     const std::vector<unsigned int>& capabilities() const { return mCapabilities; }
 
-    /// Where a field lies in the frame.
+    /// The position of a field in the frame.
     struct Place {
         std::string field; ///< its key
         std::size_t offset;

@@ -1,6 +1,7 @@
 #include "support/Bytes.hpp"
 #include "support/GoldenFrame.hpp"
 
+#include <cstddef>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <sstream>
@@ -14,7 +15,7 @@ using testing::ElementsAreArray;
 using testing::StrEq;
 using testing::ThrowsMessage;
 
-/// The smallest file there can be: a response in an old header, with one value byte.
+/// A small valid file: a response with an old header.
 const char kGood[] = "name: Example\n"
                      "class: Example\n"
                      "function: 0x1234\n"
@@ -63,7 +64,7 @@ std::string replaced(const std::string& what, const std::string& with)
     return content.replace(at, what.size(), with);
 }
 
-TEST(GoldenFrameReader, GivesWhatTheFileSays)
+TEST(GoldenFrameReader, ReadsAllValuesOfAFile)
 {
     const GoldenFrame golden = read(kGood);
 
@@ -107,24 +108,36 @@ TEST(GoldenFrameReader, RefusesTheWrongKindOfValue)
                 ThrowsMessage<std::runtime_error>(StrEq("Example.txt: number too large: header.mCallerId")));
 }
 
-TEST(GoldenFrameReader, NamesAFileThatIsNotThere)
+TEST(GoldenFrameReader, NamesAMissingFile)
 {
     EXPECT_THAT([] { GoldenFrame::load("Missing"); },
                 ThrowsMessage<std::runtime_error>(StrEq("Missing.txt: cannot be read")));
 }
 
-TEST(GoldenFrameReader, TellsWhatIsWrongWithAFile)
+/// A change that makes the good file malformed, and the error that it causes.
+struct MalformedCase {
+    const char* what;
+    const char* with;
+    const char* message;
+};
+
+template <std::size_t Count>
+void expectErrors(const MalformedCase (&cases)[Count])
 {
-    struct Case {
-        const char* what;
-        const char* with;
-        const char* message;
-    };
-    const Case cases[] = {
+    for (const MalformedCase& wrong : cases) {
+        SCOPED_TRACE(std::string(wrong.what) + " -> " + wrong.with);
+        EXPECT_THAT([&] { read(replaced(wrong.what, wrong.with)); },
+                    ThrowsMessage<std::runtime_error>(StrEq(wrong.message)));
+    }
+}
+
+TEST(GoldenFrameReader, NamesTheErrorOfAMalformedKey)
+{
+    const MalformedCase cases[] = {
         {"name: Example", "name Example", "Example.txt:1: not \"key: value\""},
         {"name: Example", "name: ", "Example.txt:1: not \"key: value\""},
         {"name: Example", "", "Example.txt:1: not \"key: value\""},
-        {"name: Example\n", "name: Example\nname: Example\n", "Example.txt:2: key \"name\" stands twice"},
+        {"name: Example\n", "name: Example\nname: Example\n", "Example.txt:2: key \"name\" occurs twice"},
         {"name: Example\n", "", "Example.txt: no key \"name\""},
         {"class: Example\n", "", "Example.txt: no key \"class\""},
         {"class: Example\n", "class: Other\n", "Example.txt: the file is not named after its class"},
@@ -135,18 +148,18 @@ TEST(GoldenFrameReader, TellsWhatIsWrongWithAFile)
         {"operation: 22136\n", "", "Example.txt: no key \"operation\""},
         {"classification: Response\n", "", "Example.txt: no key \"classification\""},
         {"classification: Response", "classification: response",
-         "Example.txt:5: classification is none of Request, Response, Async"},
+         "Example.txt:5: classification is not Request, Response or Async"},
         {"classification: Response", "classification: Request",
          "Example.txt: the rows hold something else: header.mFlags"},
         {"classification: Response", "classification: Async",
          "Example.txt: the rows hold something else: header.mFlags"},
-        {"name: Example\n", "name: Example\nbuilt: yes\n", "Example.txt:2: \"built\" is either \"no\" or not there"},
+        {"name: Example\n", "name: Example\nbuilt: yes\n", "Example.txt:2: \"built\" is \"no\" or absent"},
         {"name: Example\n", "name: Example\ncolour: red\n", "Example.txt:2: unknown key \"colour\""},
         {"name: Example\n", "name: Example\ncapabilities: 0 32\n", "Example.txt:2: not a capability number: \"32\""},
         {"header.mStatus: 0\n", "header.mStatus: 0\nheader.mStatus: 0\n",
-         "Example.txt:13: key \"header.mStatus\" stands twice"},
+         "Example.txt:13: key \"header.mStatus\" occurs twice"},
         {"payload.mText: \"a\\x22\"\n", "payload.mText: \"a\\x22\"\npayload.mText: hex 00\n",
-         "Example.txt:15: key \"payload.mText\" stands twice"},
+         "Example.txt:15: key \"payload.mText\" occurs twice"},
         {"payload.mText: \"a\\x22\"", "payload.mText: \"a\\x22", "Example.txt:14: not a text in quotes"},
         {"payload.mText: \"a\\x22\"", "payload.mText: \"", "Example.txt:14: not a text in quotes"},
         {"payload.mText: \"a\\x22\"", "payload.mText: \"a\"\"", "Example.txt:14: not a text in quotes"},
@@ -170,6 +183,13 @@ TEST(GoldenFrameReader, TellsWhatIsWrongWithAFile)
          "Example.txt: the rows hold something else: payload.mText"},
         {"payload.mText: \"a\\x22\"", "payload.mText: \"a\\x22c\"",
          "Example.txt: the rows hold something else: payload.mText"},
+    };
+    expectErrors(cases);
+}
+
+TEST(GoldenFrameReader, NamesTheErrorOfAMalformedRow)
+{
+    const MalformedCase cases[] = {
         {"frame:\n", "", "Example.txt:17: not \"key: value\""},
         {"0000  DE CA FF                 # mDesc", "0000  DE CA FF",
          "Example.txt:18: not \"0000  DE CA FF                 # field\""},
@@ -211,11 +231,7 @@ TEST(GoldenFrameReader, TellsWhatIsWrongWithAFile)
         {"0003  00                       # mHeaderVersion", "0003  20                       # mHeaderVersion",
          "Example.txt: header, payload and pad are not mMsgLength bytes long"},
     };
-    for (const Case& wrong : cases) {
-        SCOPED_TRACE(std::string(wrong.what) + " -> " + wrong.with);
-        EXPECT_THAT([&] { read(replaced(wrong.what, wrong.with)); },
-                    ThrowsMessage<std::runtime_error>(StrEq(wrong.message)));
-    }
+    expectErrors(cases);
 }
 
 TEST(GoldenFrameReader, RefusesAFileThatEndsTooEarly)

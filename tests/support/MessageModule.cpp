@@ -1,5 +1,5 @@
-// A loadable module as a program may have it: built by itself, linked with the library. Two copies of it are loaded by
-// the tests, which look for what the process must have only once.
+// A loadable module, built separately and linked with the library. The tests load two copies and check the state that
+// the process must have only once.
 
 #include "support/MessageModule.hpp"
 

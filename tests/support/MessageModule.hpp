@@ -1,7 +1,7 @@
 #pragma once
 
 /// @file
-/// What the loadable modules of the tests offer. The names are looked up at run time.
+/// The functions of the loadable modules of the tests. The tests look the names up at run time.
 
 namespace qel {
 class QelMessage;
@@ -11,10 +11,10 @@ class QelMessage;
 
 extern "C" {
 
-/// Takes the next caller id. @return that id
+/// Draws the next caller id. @return that id
 QEL_TEST_MODULE_EXPORT unsigned int nextCallerId();
 
-/// Builds a typed message by default. @return the caller id it took
+/// Default-constructs a typed message. @return its caller id
 QEL_TEST_MODULE_EXPORT unsigned int callerIdOfNewMessage();
 
 /// @return the address of the one internal registry of the process

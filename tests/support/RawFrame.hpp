@@ -5,13 +5,12 @@
 #include <vector>
 
 /// @file
-/// Frames for tests, put together byte by byte and without any help from the library, so that they can be as wrong as
-/// a test wants them.
+/// Frames for tests, built byte by byte without the library, so that a test can break them in any way.
 
 namespace qel::test {
 
-/// The bytes of one frame. The lengths and the pad are made consistent unless a test sets them otherwise.
-/// Every field is sent big-endian; every setter returns the frame, so that calls chain.
+/// The bytes of one frame. Lengths and pad are consistent unless a test sets them.
+/// Every field is big-endian; every setter returns the frame, for chaining.
 class RawFrame {
 public:
     /// A frame with a 32-byte header: version byte 0x20, no pad.
@@ -34,7 +33,7 @@ public:
     RawFrame& flags(unsigned int value) { return set(mFlags, value); }
     RawFrame& operation(unsigned int value) { return set(mOperation, value); }
     RawFrame& status(unsigned int value) { return set(mStatus, value); }
-    /// Sent only when the header has 32 bytes.
+    /// Written only to a 32-byte header.
     RawFrame& statusDetail(unsigned int value) { return set(mStatusDetail, value); }
     RawFrame& reserved2(unsigned int value) { return set(mReserved2, value); }
     RawFrame& reserved3(unsigned int value) { return set(mReserved3, value); }
@@ -43,7 +42,7 @@ public:
         mPayload = std::move(value);
         return *this;
     }
-    /// The pad field and as many bytes behind the payload.
+    /// The pad field and as many bytes after the payload.
     RawFrame& pad(unsigned int value)
     {
         mPad = value;

@@ -9,7 +9,7 @@
 
 namespace qel::test {
 
-/// A message whose whole frame has the given length, for whoever counts bytes.
+/// A message whose whole frame has the given length, for tests that count bytes.
 class SizedMessage : public QelMessageGeneric {
 public:
     static constexpr unsigned int kSmallest = 32; // a header alone
