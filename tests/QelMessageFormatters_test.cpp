@@ -2,6 +2,7 @@
 #include <qel/common/StreamFormatters.hpp>
 
 #include "support/Bytes.hpp"
+#include "support/GroupingLocale.hpp"
 #include "support/MessageProbe.hpp"
 #include "support/RawFrame.hpp"
 
@@ -14,8 +15,10 @@ namespace qel {
 namespace {
 
 using test::bytes;
+using test::GroupingLocale;
 using test::MessageProbe;
 using test::RawFrame;
+using testing::EndsWith;
 
 /// A message class that prints two payload lines.
 class TalkativeMessage : public MessageProbe {
@@ -82,6 +85,21 @@ TEST(QelMessageIDFormatter, ReadsTheMessageWhenItIsPrinted)
 }
 
 // --- everything
+
+TEST(QelMessageIDFormatter, LeavesTheStreamInUpperCaseHexadecimal)
+{
+    std::ostringstream os;
+    os << QelMessage().getLogID() << ' ' << 0xABC;
+    EXPECT_THAT(os.str(), EndsWith("] ABC"));
+}
+
+TEST(QelMessageIDFormatter, GroupsDigitsOnAStreamWithAGroupingLocale)
+{
+    const GroupingLocale grouping;
+    std::ostringstream os;
+    os << QelMessage(0x12345678, 0x6003, 0x0101, MsgResponseExpected).getLogID();
+    EXPECT_EQ(os.str(), "[CID: 0x12.345.678, FN: 0x6.003, OP: 0x0101, FL: 0x80, DL: 0, ST: 0x00000000:0000]");
+}
 
 TEST(QelMessageDebugFormatter, PrintsADefaultMessage)
 {

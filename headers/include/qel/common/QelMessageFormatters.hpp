@@ -17,7 +17,7 @@ class QelMessage;
 /// detail are left out.
 ///
 /// State of the stream: printing leaves it in upper-case hexadecimal with fill character '0', so a plain integer that
-/// is printed next appears in hexadecimal. On a stream whose locale groups digits the numbers are grouped: 0x6.0.0.3.
+/// is printed next appears in hexadecimal. On a stream whose locale groups digits the numbers are grouped: 0x6.003.
 /// Lifetime: borrows the message, which must be alive while this is printed; print it at once, do not keep it.
 /// Thread safety: as the message, which belongs to one thread at a time.
 class QEL_EXPORT QelMessageIDFormatter {

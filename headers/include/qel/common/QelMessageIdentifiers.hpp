@@ -16,7 +16,7 @@
 ///
 /// Thread safety: the values are plain integers. Any thread may print them; the stream belongs to one thread at a time.
 /// State of the stream: every operator here prints its number through hexFormat() and leaves the stream in upper-case
-/// hexadecimal with fill character '0'. On a stream whose locale groups digits the numbers are grouped too: 0x6.0.0.3.
+/// hexadecimal with fill character '0'. On a stream whose locale groups digits the numbers are grouped too: 0x6.003.
 
 namespace qel {
 
