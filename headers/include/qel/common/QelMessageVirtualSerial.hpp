@@ -101,8 +101,7 @@ public:
     QelMessageVirtualSerialOpenReq(std::uint16_t lpId, std::uint16_t vssConnectionNumber, bool forceOpen);
 
     /// Parses a received frame.
-    /// @throws QelMessageValidationException as QelMessageMetadata does; then "dataLength shorter than actual data
-    /// size"
+    /// @throws QelMessageValidationException as QelMessageMetadata; then "dataLength shorter than actual data size"
     QelMessageVirtualSerialOpenReq(const char* i_buffer, unsigned int i_length);
     ~QelMessageVirtualSerialOpenReq() override;
 
@@ -132,8 +131,7 @@ public:
     QelMessageVirtualSerialOpenRsp(std::uint32_t callerId, std::uint16_t lpId, std::uint16_t vssConnectionNumber);
 
     /// Parses a received frame.
-    /// @throws QelMessageValidationException as QelMessageMetadata does; then "dataLength shorter than actual data
-    /// size"
+    /// @throws QelMessageValidationException as QelMessageMetadata; then "dataLength shorter than actual data size"
     QelMessageVirtualSerialOpenRsp(const char* i_buffer, unsigned int i_length);
     ~QelMessageVirtualSerialOpenRsp() override;
 
@@ -158,8 +156,7 @@ public:
     QelMessageVirtualSerialCloseReq(std::uint16_t lpId, std::uint16_t vssConnectionNumber, bool forceClose);
 
     /// Parses a received frame.
-    /// @throws QelMessageValidationException as QelMessageMetadata does; then "dataLength shorter than actual data
-    /// size"
+    /// @throws QelMessageValidationException as QelMessageMetadata; then "dataLength shorter than actual data size"
     QelMessageVirtualSerialCloseReq(const char* i_buffer, unsigned int i_length);
     ~QelMessageVirtualSerialCloseReq() override;
 
@@ -207,8 +204,7 @@ public:
     QelMessageVirtualSerialGetMaxSessionsRsp(std::uint32_t callerId, std::uint16_t maxCec, std::uint8_t maxLpar);
 
     /// Parses a received frame.
-    /// @throws QelMessageValidationException as QelMessageMetadata does; then "dataLength shorter than actual data
-    /// size"
+    /// @throws QelMessageValidationException as QelMessageMetadata; then "dataLength shorter than actual data size"
     QelMessageVirtualSerialGetMaxSessionsRsp(const char* i_buffer, unsigned int i_length);
     ~QelMessageVirtualSerialGetMaxSessionsRsp() override;
 
@@ -267,8 +263,7 @@ public:
                                          std::uint16_t dataLength, const char* data);
 
     /// Parses a received frame.
-    /// @throws QelMessageValidationException as QelMessageMetadata does; then "dataLength shorter than actual data
-    /// size"
+    /// @throws QelMessageValidationException as QelMessageMetadata; then "dataLength shorter than actual data size"
     QelMessageVirtualSerialDataToOsAsync(const char* i_buffer, unsigned int i_length);
     ~QelMessageVirtualSerialDataToOsAsync() override;
 };
@@ -284,8 +279,7 @@ public:
                                           std::uint16_t dataLength, const char* data);
 
     /// Parses a received frame.
-    /// @throws QelMessageValidationException as QelMessageMetadata does; then "dataLength shorter than actual data
-    /// size"
+    /// @throws QelMessageValidationException as QelMessageMetadata; then "dataLength shorter than actual data size"
     QelMessageVirtualSerialDataToDaxAsync(const char* i_buffer, unsigned int i_length);
     ~QelMessageVirtualSerialDataToDaxAsync() override;
 };
@@ -304,8 +298,7 @@ public:
     QelMessageVirtualSerialSetupSessionReq(std::uint16_t lpId, std::uint16_t vssConnectionNumber);
 
     /// Parses a received frame.
-    /// @throws QelMessageValidationException as QelMessageMetadata does; then "dataLength shorter than actual data
-    /// size"
+    /// @throws QelMessageValidationException as QelMessageMetadata; then "dataLength shorter than actual data size"
     QelMessageVirtualSerialSetupSessionReq(const char* i_buffer, unsigned int i_length);
     ~QelMessageVirtualSerialSetupSessionReq() override;
 
@@ -350,8 +343,7 @@ public:
                                               CloseReason reason);
 
     /// Parses a received frame.
-    /// @throws QelMessageValidationException as QelMessageMetadata does; then "dataLength shorter than actual data
-    /// size"
+    /// @throws QelMessageValidationException as QelMessageMetadata; then "dataLength shorter than actual data size"
     QelMessageVirtualSerialSessionClosedAsync(const char* i_buffer, unsigned int i_length);
     ~QelMessageVirtualSerialSessionClosedAsync() override;
 
