@@ -118,10 +118,10 @@ TEST(QelMessageQueue, ReadsTheClocksInAFixedOrder)
     TickingClock clock;
     QelMessageQueue queue(0);
     queue.enqueue(sized(100, 1)); // 0 its call, 1 its admission, 2 it is at the head
-    take(queue);                  // 3 its latency, 4 it leaves the head, 5 the event's begin, 6 its time-out
+    take(queue);                  // 3 its latency, 4 it leaves the head, 5 the start of the event, 6 its timeout
     queue.enqueue(sized(200, 2)); // 7, 8, 9
     EXPECT_EQ(figure(queue, "Head Wait"), "1000000 us"); // 10
-    take(queue); // 11 its latency, 12 it leaves the head, 13 the event's time-out, 14 its end
+    take(queue); // 11 its latency, 12 it leaves the head, 13 the timeout of the event, 14 its end
 
     EXPECT_EQ(dumpOf(queue), "Limits:         0/0\n"
                              "Max Size (HWM): 200 B\n"

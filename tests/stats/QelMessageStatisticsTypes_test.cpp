@@ -69,8 +69,8 @@ TEST(QelMessageCount, PrintsMessagesAndBytes) { EXPECT_EQ(toString(count(12, 345
 
 TEST(QelMessageCount, PrintsAll64Bits)
 {
-    constexpr auto kMost = std::numeric_limits<std::uint64_t>::max();
-    EXPECT_EQ(toString(count(kMost, kMost)), "18446744073709551615 (18446744073709551615 B)");
+    constexpr auto kMax = std::numeric_limits<std::uint64_t>::max();
+    EXPECT_EQ(toString(count(kMax, kMax)), "18446744073709551615 (18446744073709551615 B)");
 }
 
 TEST(QelMessageCount, PrintsInDecimalAfterAHexadecimalValue)

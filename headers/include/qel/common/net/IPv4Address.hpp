@@ -46,8 +46,7 @@ public:
                    static_cast<unsigned char>(hostOrder >> 8), static_cast<unsigned char>(hostOrder)}
     {}
 
-    /// Reads the dotted form of inet_pton(3): four decimal numbers without leading zeros, and no other
-    /// characters.
+    /// Reads the dotted form of inet_pton(3): four decimal numbers without leading zeros.
     /// @throws std::invalid_argument  "'TEXT' is not a valid IPv4 address"
     static IPv4Address parse(const std::string& text);
 

@@ -17,10 +17,12 @@ namespace qel {
 /// A system call that fails throws PosixError with the text "PHRASE: NUMBER (DESCRIPTION)"; the phrases are listed with
 /// each operation. A line about it goes to the log at Error first: the same text, or, from listen() and the options,
 /// one that also gives the descriptor or the option. accept() throws the code without a phrase and writes no line.
-/// read(), write() and shutdown() do not throw: they report as SocketIF says. Ownership: closes its descriptor when it
-/// is destroyed. Movable, not copyable. A moved-from socket holds no descriptor (-1); it may be assigned to or
-/// destroyed. Thread safety: no locks. One thread may read while another writes; shutdown() may be called from any
-/// thread while they wait. Everything else belongs to one thread at a time.
+/// read(), write() and shutdown() do not throw: they report as SocketIF says.
+///
+/// Ownership: closes its descriptor when it is destroyed. Movable, not copyable. A moved-from socket holds no
+/// descriptor (-1); it may be assigned to or destroyed.
+/// Thread safety: no locks. One thread may read while another writes; shutdown() may be called from any thread while
+/// they wait. Everything else belongs to one thread at a time.
 class QEL_EXPORT Socket : public SocketIF {
 public:
     /// Opens a socket.

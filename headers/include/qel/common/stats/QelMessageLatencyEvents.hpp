@@ -16,8 +16,9 @@ namespace qel {
 ///
 /// An event extends from its first slow message to its last one. Fast messages count only if a slow message follows
 /// them in the same event; those after the last slow message are not counted. The first fast message after the ten
-/// seconds closes the event and is not counted; without any message the event stays open. Thread safety: one thread at
-/// a time; a queue calls it with its lock held.
+/// seconds closes the event and is not counted; without any message the event stays open.
+///
+/// Thread safety: one thread at a time; a queue calls it with its lock held.
 class QEL_EXPORT QelMessageLatencyEvents {
 public:
     /// A message is slow when its latency is this or more.

@@ -157,8 +157,7 @@ public:
     PollResult() = default;
     explicit PollResult(const std::vector<PollFd>& results);
 
-    /// @return whether an entry for the same descriptor has seen one of the events in fd. Every mask includes errors,
-    /// so
+    /// @return whether an entry for the same descriptor has seen one of the events in fd. Every mask includes errors:
     ///         PollFd(s, PollEvents::Read) also matches an error or a hang-up on s.
     bool contains(const PollFd& fd) const noexcept;
     /// @return whether contains() is true for an entry of the set; true for the empty set: a wait on nothing counts as
