@@ -53,12 +53,12 @@ std::uint64_t messagesIn(const json& histogram)
     return sum;
 }
 
-TEST(Bench, ThePrintedFigures)
+TEST(Bench, PrintsTheResult)
 {
     const ServeProcess server;
     const auto result = bench(server, {"--count", "500", "--size", "100"});
     EXPECT_EQ(result.exitStatus, 0);
-    EXPECT_THAT(result.errors, IsEmpty()); // no bar where there is no terminal
+    EXPECT_THAT(result.errors, IsEmpty()); // a progress bar needs a terminal
     EXPECT_THAT(result.output,
                 MatchesRegex("Broadcasts of 100 bytes between 1 pair of consoles of 127\\.0\\.0\\.1:[0-9]+, flat out\n"
                              "Messages:    500\n"
@@ -74,7 +74,7 @@ TEST(Bench, ThePrintedFigures)
                              "(  to [0-9]+ [um]?s +[0-9]+(  #+)?\n)+"));
 }
 
-TEST(Bench, TheFiguresAddUp)
+TEST(Bench, HistogramAndCountsAddUp)
 {
     ServeProcess server({"--max-consoles", "6"});
     const json document = parse(bench(server, {"--json", "--connections", "6", "--count", "1000", "--size", "16306"}));
@@ -99,7 +99,7 @@ TEST(Bench, TheFiguresAddUp)
     server.stop();
 }
 
-TEST(Bench, TheTimeEndsIt)
+TEST(Bench, SecondsEndTheRun)
 {
     const ServeProcess server;
     const json document = parse(bench(server, {"--json", "--seconds", "0.2"}));
@@ -107,7 +107,7 @@ TEST(Bench, TheTimeEndsIt)
     EXPECT_GT(document["messages"], 0);
 }
 
-TEST(Bench, WithARateMessagesComeNoFaster)
+TEST(Bench, RateLimitsTheMessages)
 {
     const ServeProcess server;
     const json document = parse(bench(server, {"--json", "--rate", "100", "--count", "21"}));
@@ -116,7 +116,7 @@ TEST(Bench, WithARateMessagesComeNoFaster)
     EXPECT_GE(document["seconds"], 0.2); // the last one is due after 0.2 s
 }
 
-TEST(Bench, WhatAServerDoesNotManageIsUnsent)
+TEST(Bench, MessagesThatTheServerIsTooSlowForAreUnsent)
 {
     const ServeProcess server;
     const json document = parse(bench(server, {"--json", "--rate", "1000000", "--seconds", "0.1"}));
@@ -124,7 +124,7 @@ TEST(Bench, WhatAServerDoesNotManageIsUnsent)
     EXPECT_EQ(document["messages"].get<int>() + document["unsent"].get<int>(), 100000);
 }
 
-TEST(Bench, ItLeavesNothingBehind)
+TEST(Bench, LeavesNoConsoleBehind)
 {
     const ServeProcess server({"--max-consoles", "2"});
     for (int i = 0; i < 5; ++i) // all places are taken each time
@@ -132,7 +132,7 @@ TEST(Bench, ItLeavesNothingBehind)
     EXPECT_EQ(server.call({"get-metadata"}).output, "Metadata: \n");
 }
 
-TEST(Bench, OtherConsolesAreNotBothered)
+TEST(Bench, OtherConsolesReceiveNothing)
 {
     ServeProcess server({"--max-consoles", "3"});
     TestConsole other(server.endpoint());
@@ -175,7 +175,7 @@ protected:
     CredentialDirectory directory;
 };
 
-TEST_F(BenchTls, ItPutsLoadOnAProtectedServer)
+TEST_F(BenchTls, WorksOverTls)
 {
     ServeProcess server({"--max-consoles", "4"}, "127.0.0.1:0", directory.options("server"));
     const json document = parse(bench(server, {"--json", "--connections", "4", "--count", "200", "--size", "16306"}));
@@ -198,7 +198,7 @@ TEST_F(BenchTls, MoreConnectionsThanTheServerTakesAreRefused)
 
 class BenchStop : public ::testing::TestWithParam<int> {};
 
-TEST_P(BenchStop, ASignalEndsItWithTheFiguresSoFar)
+TEST_P(BenchStop, ASignalEndsTheRunWithTheResultSoFar)
 {
     ServeProcess server;
     Process process(benchCommand(server.endpoint(), {"--json", "--seconds", "600", "--log-level", "info"}));
@@ -213,7 +213,7 @@ TEST_P(BenchStop, ASignalEndsItWithTheFiguresSoFar)
 
 INSTANTIATE_TEST_SUITE_P(Signals, BenchStop, ::testing::Values(SIGINT, SIGTERM, SIGHUP));
 
-TEST(BenchEnd, ItNeedNotWaitForTheNextMessage)
+TEST(BenchEnd, ASignalDoesNotWaitForTheNextMessage)
 {
     ServeProcess server;
     Process process(
@@ -224,7 +224,7 @@ TEST(BenchEnd, ItNeedNotWaitForTheNextMessage)
     server.stop();
 }
 
-TEST(BenchEnd, AServerThatDoesNotAnswerDoesNotKeepItFromEnding)
+TEST(BenchEnd, ASignalEndsTheRunWithoutAResponse)
 {
     ServeProcess server;
     Process process(
@@ -239,7 +239,7 @@ TEST(BenchEnd, AServerThatDoesNotAnswerDoesNotKeepItFromEnding)
     server.stop();
 }
 
-TEST(BenchProgress, ATerminalShowsABar)
+TEST(BenchProgress, ATerminalShowsAProgressBar)
 {
     const ServeProcess server;
     PtyProcess process(benchCommand(server.endpoint(), {"--seconds", "1.5"}));
@@ -258,24 +258,26 @@ TEST(BenchFaults, MoreConnectionsThanTheServerTakesAreRefused)
     const auto result = bench(server, {"--connections", "4", "--count", "1"});
     EXPECT_EQ(result.exitStatus, 1);
     EXPECT_EQ(result.output, "");
-    EXPECT_EQ(result.errors,
-              "qel: connection 4 of 4: version request refused: 0x00000012 (QelMessageStatusTooManyConnections); the "
-              "server takes no more consoles (--max-consoles)\n");
+    EXPECT_EQ(
+        result.errors,
+        "qel: connection 4 of 4: the server takes no more consoles; wait until one leaves, or raise --max-consoles of "
+        "the server: 0x00000012 (QelMessageStatusTooManyConnections)\n");
 }
 
-TEST(BenchFaults, ANameThatIsTakenIsRefused)
+TEST(BenchFaults, AToolIdInUseIsRefused)
 {
     ServeProcess server;
     TestConsole other(server.endpoint());
     other.introduce("mine-2", 1);
     const auto result = bench(server, {"--tool-id", "mine", "--count", "1"});
     EXPECT_EQ(result.exitStatus, 1);
-    EXPECT_EQ(result.errors, "qel: connection 2 of 2: version request refused: 0x00000025 "
-                             "(QelMessageStatusDaxAlreadyConnected)\n");
+    EXPECT_EQ(result.errors,
+              "qel: connection 2 of 2: a console with this tool type and id is connected already; choose another "
+              "--tool-id: 0x00000025 (QelMessageStatusDaxAlreadyConnected)\n");
     server.stop();
 }
 
-TEST(BenchFaults, WhereNobodyListensIsExitStatusThree)
+TEST(BenchFaults, ARefusedConnectionIsExitStatusThree)
 {
     std::string endpoint;
     {
@@ -287,7 +289,7 @@ TEST(BenchFaults, WhereNobodyListensIsExitStatusThree)
     EXPECT_THAT(result.errors, StartsWith("qel: cannot connect to " + endpoint + ": "));
 }
 
-TEST(BenchFaults, AServerThatStopsIsExitStatusSeven)
+TEST(BenchFaults, AServerShutdownIsExitStatusSeven)
 {
     ServeProcess server;
     Process process(benchCommand(server.endpoint(), {"--seconds", "600", "--log-level", "info"}));

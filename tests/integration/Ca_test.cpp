@@ -411,7 +411,7 @@ TEST_F(Ca, AFileThatIsNotThereIsUsageAndOneThatCannotBeReadAFailure)
         SCOPED_TRACE(command);
         const auto missing = runCa({command, file("none")});
         EXPECT_EQ(missing.exitStatus, 2);
-        EXPECT_THAT(missing.errors, HasSubstr("'" + file("none") + "' does not exist"));
+        EXPECT_THAT(missing.errors, HasSubstr("\"" + file("none") + "\" does not exist"));
         const auto unreadable = runCa({command, file("loop")});
         EXPECT_EQ(unreadable.exitStatus, 4);
         EXPECT_EQ(unreadable.errors, "qel: cannot open " + file("loop") + ": 40 (Too many levels of symbolic links)\n");

@@ -60,8 +60,8 @@ TEST_F(Call, Version)
 
 TEST_F(Call, Capabilities)
 {
-    expectText({"capabilities"}, "Capabilities of both ends: 01110000000000000000000000000000\n");
-    expectText({"capabilities", "1100"}, "Capabilities of both ends: 01000000000000000000000000000000\n");
+    expectText({"capabilities"}, "Common capabilities: 01110000000000000000000000000000\n");
+    expectText({"capabilities", "1100"}, "Common capabilities: 01000000000000000000000000000000\n");
     EXPECT_EQ(parse(server.call({"--json", "capabilities", "001"}))["capabilities"],
               "00100000000000000000000000000000");
 }
@@ -137,15 +137,16 @@ TEST_F(Call, DoneInJsonIsTheStatusAlone)
                               "statusDetail": 0})"));
 }
 
-TEST_F(Call, ARefusalIsExitStatusOneAndNamed)
+TEST_F(Call, ARefusalIsExitStatusOneWithTheReason)
 {
     const auto result = server.call({"broadcast", "--type", "1", "--to-id", "nobody", "x"});
     EXPECT_EQ(result.exitStatus, 1);
     EXPECT_EQ(result.output, "");
-    EXPECT_EQ(result.errors, "qel: broadcast refused: 0x00000013 (QelMessageStatusConnectionNotAvailable)\n");
+    EXPECT_EQ(result.errors, "qel: no other console has this tool type and id: 0x00000013 "
+                             "(QelMessageStatusConnectionNotAvailable)\n");
 }
 
-TEST_F(Call, ARefusalInJsonIsADocumentToo)
+TEST_F(Call, ARefusalInJsonIsADocument)
 {
     const auto result = server.call({"--json", "broadcast", "--type", "1", "--to-id", "nobody", "x"});
     EXPECT_EQ(result.exitStatus, 1);
@@ -154,13 +155,15 @@ TEST_F(Call, ARefusalInJsonIsADocumentToo)
                               "refused": "broadcast"})"));
 }
 
-TEST_F(Call, ARefusedStepOnTheWayIsNamed)
+TEST_F(Call, ARefusedEarlierStepIsNamed)
 {
     TestConsole other(server.endpoint());
     other.introduce("taken", 1);
     const auto result = server.call({"--json", "--tool-id", "taken", "time"});
     EXPECT_EQ(result.exitStatus, 1);
-    EXPECT_EQ(result.errors, "qel: version request refused: 0x00000025 (QelMessageStatusDaxAlreadyConnected)\n");
+    EXPECT_EQ(result.errors,
+              "qel: a console with this tool type and id is connected already; choose another --tool-id: "
+              "0x00000025 (QelMessageStatusDaxAlreadyConnected)\n");
     const json document = json::parse(result.output);
     EXPECT_EQ(document["request"], "time");
     EXPECT_EQ(document["refused"], "version request");
@@ -175,14 +178,14 @@ TEST_F(Call, OutputThatCannotBeWrittenIsAFailure)
     EXPECT_EQ(result.errors, "qel: cannot write to standard output\n");
 }
 
-TEST_F(Call, ALogIsWrittenWhenAskedFor)
+TEST_F(Call, WritesALogOnRequest)
 {
     const auto result = server.call({"--log-level", "debug", "limits"});
     EXPECT_EQ(result.exitStatus, 0);
     EXPECT_THAT(result.errors, HasSubstr("(D): "));
 }
 
-TEST(CallInARow, CallsAreNotInEachOthersWay)
+TEST(CallInARow, CallsWithTheSameToolIdFollowEachOther)
 {
     const ServeProcess server({"--max-consoles", "1", "--log-level", "warn"});
     for (int i = 0; i < 30; ++i) {
@@ -205,7 +208,7 @@ QelMessageGeneric emptyResponse(const QelMessage& request)
     return QelMessageGeneric(request.getCallerId(), request.getFunction(), request.getOperation(), MsgResponse);
 }
 
-TEST(CallFaults, WhereNobodyListensIsExitStatusThree)
+TEST(CallFaults, ARefusedConnectionIsExitStatusThree)
 {
     std::string endpoint;
     {
@@ -227,10 +230,10 @@ TEST(CallFaults, GarbageIsExitStatusFive)
     });
     const auto result = server.call({"time"});
     EXPECT_EQ(result.exitStatus, 5);
-    EXPECT_EQ(result.errors, "qel: the other end broke the protocol: Invalid length\n");
+    EXPECT_EQ(result.errors, "qel: the peer broke the protocol: Invalid length\n");
 }
 
-TEST(CallFaults, AnAnswerToAnotherRequestIsExitStatusFive)
+TEST(CallFaults, AResponseToAnotherRequestIsExitStatusFive)
 {
     const WrongServer server([](LoopbackMessages& messages) {
         welcome(messages);
@@ -240,7 +243,7 @@ TEST(CallFaults, AnAnswerToAnotherRequestIsExitStatusFive)
     EXPECT_EQ(server.call({"time"}).exitStatus, 5);
 }
 
-TEST(CallFaults, AnAnswerThatIsTooShortIsExitStatusFive)
+TEST(CallFaults, AShortResponseIsExitStatusFive)
 {
     for (const char* request : {"version", "capabilities", "limits", "time", "get-mode", "get-metadata"}) {
         SCOPED_TRACE(request);
@@ -254,7 +257,25 @@ TEST(CallFaults, AnAnswerThatIsTooShortIsExitStatusFive)
     }
 }
 
-TEST(CallFaults, NoAnswerIsExitStatusSix)
+TEST(CallFaults, TimeWithDigitsAbove9IsExitStatusFive)
+{
+    for (const std::vector<std::string>& arguments : {std::vector<std::string>{"time"}, {"--json", "time"}}) {
+        SCOPED_TRACE(arguments.front());
+        const WrongServer server([](LoopbackMessages& messages) {
+            welcome(messages);
+            QelMessageGeneric answer = emptyResponse(*messages.receive());
+            answer.setData("\xFF\xFF\xFF\xFF\xFF\xFF\xFF\xFF", 8);
+            messages.send(answer);
+        });
+        const auto result = server.call(arguments);
+        EXPECT_EQ(result.exitStatus, 5);
+        EXPECT_EQ(result.output, "");
+        EXPECT_EQ(result.errors,
+                  "qel: the peer broke the protocol: the time of day has digits above 9: ffffffffffffff\n");
+    }
+}
+
+TEST(CallFaults, NoResponseIsExitStatusSix)
 {
     const WrongServer server([](LoopbackMessages& messages) {
         welcome(messages);
@@ -265,7 +286,7 @@ TEST(CallFaults, NoAnswerIsExitStatusSix)
     EXPECT_EQ(result.exitStatus, 6);
 }
 
-TEST(CallFaults, HalfAnAnswerIsExitStatusSix)
+TEST(CallFaults, AnIncompleteResponseIsExitStatusSix)
 {
     const WrongServer server([](LoopbackMessages& messages) {
         messages.receive();
@@ -275,7 +296,7 @@ TEST(CallFaults, HalfAnAnswerIsExitStatusSix)
     EXPECT_EQ(server.call({"--timeout", "0.1", "time"}).exitStatus, 6);
 }
 
-TEST(CallFaults, NoticesDoNotPutOffTheDeadline)
+TEST(CallFaults, NoticesDoNotExtendTheTimeout)
 {
     const WrongServer server([](LoopbackMessages& messages) {
         welcome(messages);
@@ -292,7 +313,7 @@ TEST(CallFaults, AClosedConnectionIsExitStatusSeven)
     EXPECT_EQ(result.exitStatus, 7);
 }
 
-TEST(CallFaults, AnAnswerThatIsCutShortIsExitStatusSeven)
+TEST(CallFaults, AConnectionClosedWithinAResponseIsExitStatusSeven)
 {
     const WrongServer server([](LoopbackMessages& messages) {
         messages.receive();
@@ -301,7 +322,7 @@ TEST(CallFaults, AnAnswerThatIsCutShortIsExitStatusSeven)
     EXPECT_EQ(server.call({"time"}).exitStatus, 7);
 }
 
-TEST(CallFaults, TheNoticeOfClosingIsExitStatusSeven)
+TEST(CallFaults, TheConnectionClosedNoticeIsExitStatusSeven)
 {
     const WrongServer server([](LoopbackMessages& messages) {
         welcome(messages);
@@ -310,10 +331,10 @@ TEST(CallFaults, TheNoticeOfClosingIsExitStatusSeven)
     });
     const auto result = server.call({"time"});
     EXPECT_EQ(result.exitStatus, 7);
-    EXPECT_EQ(result.errors, "qel: the hypervisor closed the connection\n");
+    EXPECT_EQ(result.errors, "qel: the server closed the connection\n");
 }
 
-TEST(CallFaults, NoticesBeforeTheAnswerDoNotDisturb)
+TEST(CallFaults, NoticesBeforeTheResponseAreSkipped)
 {
     const WrongServer server([](LoopbackMessages& messages) {
         messages.send(QelMessageDaxBroadcastOutboundAsync(1, 1, "x", "x"));

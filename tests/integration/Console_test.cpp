@@ -26,7 +26,7 @@ using ::testing::HasSubstr;
 using ::testing::Not;
 using ::testing::StartsWith;
 
-constexpr const char* kEndedLine = "qel: session closed: read failure, the command has ended\n";
+constexpr const char* kEndedLine = "qel: session closed: the command ended\n";
 
 using Arguments = std::vector<std::string>;
 
@@ -48,7 +48,7 @@ std::string commandLine(const Arguments& arguments)
 
 Arguments shell(const std::string& script, const std::string& option = "-c") { return {"/bin/sh", option, script}; }
 
-/// Partition 1 is a shell, 2 repeats what it is told, 3 says "ready" and repeats a million bytes as they are, 4 is
+/// Partition 1 is a shell, 2 repeats its input, 3 says "ready" and repeats a million bytes as they are, 4 is
 /// silent.
 class ConsoleTest : public ::testing::Test {
 protected:
@@ -63,9 +63,9 @@ protected:
                          "--max-consoles", "8"}};
 };
 
-// Input that is no terminal.
+// Input that is not a terminal.
 
-TEST_F(ConsoleTest, ACommandThatIsPipedInIsRun)
+TEST_F(ConsoleTest, RunsACommandFromAPipe)
 {
     const auto result = runConsole({"1"}, "echo $((6 * 7)) is it\n");
     EXPECT_EQ(result.exitStatus, 0);
@@ -74,7 +74,7 @@ TEST_F(ConsoleTest, ACommandThatIsPipedInIsRun)
     EXPECT_EQ(result.errors, kEndedLine);
 }
 
-TEST_F(ConsoleTest, AFileCanBeTheInput)
+TEST_F(ConsoleTest, ReadsInputFromAFile)
 {
     const TemporaryDirectory directory;
     std::ofstream(directory.file("script")) << "echo $((6 * 7))\n";
@@ -83,14 +83,14 @@ TEST_F(ConsoleTest, AFileCanBeTheInput)
     EXPECT_THAT(result.output, HasSubstr("42\r\n"));
 }
 
-TEST_F(ConsoleTest, OutputThatIsLongInComingArrives)
+TEST_F(ConsoleTest, WaitsForLateOutput)
 {
     const auto result = runConsole({"1"}, "sleep 1.2; echo late-$((6 * 7))\n");
     EXPECT_EQ(result.exitStatus, 0);
     EXPECT_THAT(result.output, HasSubstr("late-42\r\n"));
 }
 
-TEST_F(ConsoleTest, TheEndOfTheInputIsTheEndForEveryCommand)
+TEST_F(ConsoleTest, TheEndOfTheInputReachesEveryCommand)
 {
     // The first end-of-file character ends cat, the next one the shell.
     const auto result = runConsole({"1"}, "cat; echo $((6 * 7))\nhello\n");
@@ -99,14 +99,14 @@ TEST_F(ConsoleTest, TheEndOfTheInputIsTheEndForEveryCommand)
     EXPECT_EQ(result.errors, kEndedLine);
 }
 
-TEST_F(ConsoleTest, AnUnfinishedLineIsCarriedOutToo)
+TEST_F(ConsoleTest, AnUnfinishedLineIsExecuted)
 {
     const auto result = runConsole({"1"}, "echo $((6 * 7))");
     EXPECT_EQ(result.exitStatus, 0);
     EXPECT_THAT(result.output, HasSubstr("42\r\n"));
 }
 
-TEST_F(ConsoleTest, NoInputIsAnEndToo)
+TEST_F(ConsoleTest, EmptyInputEndsTheCommand)
 {
     const auto result = runConsole({"2"}, "");
     EXPECT_EQ(result.exitStatus, 0);
@@ -114,14 +114,14 @@ TEST_F(ConsoleTest, NoInputIsAnEndToo)
     EXPECT_EQ(result.errors, kEndedLine);
 }
 
-TEST_F(ConsoleTest, EscapesAreForTerminalsOnly)
+TEST_F(ConsoleTest, EscapeCharactersInAPipeAreInput)
 {
     const auto result = runConsole({"2"}, "~.\n~?\n~~\n");
     EXPECT_EQ(result.exitStatus, 0);
     EXPECT_THAT(result.output, AllOf(HasSubstr("~.\r\n"), HasSubstr("~?\r\n"), HasSubstr("~~\r\n")));
 }
 
-TEST_F(ConsoleTest, WithoutTellingTheEndAndWithALingerTimeTheShellGoesOn)
+TEST_F(ConsoleTest, TheShellSurvivesWithoutEndOfFileAndWithLinger)
 {
     const auto first = runConsole({"1", "--no-eof", "--linger", "0.1"}, "x=$((6 * 7))\n");
     EXPECT_EQ(first.exitStatus, 0);
@@ -131,7 +131,7 @@ TEST_F(ConsoleTest, WithoutTellingTheEndAndWithALingerTimeTheShellGoesOn)
     EXPECT_THAT(second.output, HasSubstr("x is 42\r\n"));
 }
 
-TEST_F(ConsoleTest, ACommandThatDoesNotEndIsLeftAfterTheLingerTime)
+TEST_F(ConsoleTest, LeavesAnEndlessCommandAfterTheLingerTime)
 {
     const auto result = runConsole({"4", "--linger", "0.1"}, "hello\n");
     EXPECT_EQ(result.exitStatus, 0);
@@ -139,7 +139,7 @@ TEST_F(ConsoleTest, ACommandThatDoesNotEndIsLeftAfterTheLingerTime)
     EXPECT_EQ(runConsole({"4", "--linger", "0"}, "").exitStatus, 0) << "the session was closed, and the name is free";
 }
 
-TEST_F(ConsoleTest, TheNextConsoleDoesNotMeetTheLast)
+TEST_F(ConsoleTest, ConsolesInARowDoNotCollide)
 {
     for (int i = 0; i < 20; ++i) {
         const auto result = runConsole({"4", "--linger", "0", "--tool-id", "me"}, "");
@@ -147,7 +147,7 @@ TEST_F(ConsoleTest, TheNextConsoleDoesNotMeetTheLast)
     }
 }
 
-TEST_F(ConsoleTest, MuchGoesThroughUnharmedInBothDirections)
+TEST_F(ConsoleTest, LargeDataArrivesUnchangedInBothDirections)
 {
     std::string data;
     for (unsigned int i = 0; data.size() < 1000000; ++i)
@@ -163,14 +163,14 @@ TEST_F(ConsoleTest, MuchGoesThroughUnharmedInBothDirections)
     EXPECT_EQ(result.errors, kEndedLine);
 }
 
-TEST_F(ConsoleTest, AllOutputIsThereEvenForASlowReader)
+TEST_F(ConsoleTest, ASlowReaderGetsAllOutput)
 {
     const std::string script = commandLine(console({"1"})) + "| (head -c 1000; sleep 0.3; cat) | tail -c 13";
     const auto result = run(shell(script), "seq -w 200000; echo $((6 * 7))\n");
     EXPECT_THAT(result.output, HasSubstr("00\r\n42\r\n$ "));
 }
 
-TEST_F(ConsoleTest, WhoeverReadsTheOutputMayGo)
+TEST_F(ConsoleTest, TheReaderOfTheOutputMayClose)
 {
     const std::string script = "{ " + commandLine(console({"1"})) + "; echo \"status $?\" >&2; } | head -n 1";
     const auto result = run(shell(script), "seq 200000\n");
@@ -178,7 +178,7 @@ TEST_F(ConsoleTest, WhoeverReadsTheOutputMayGo)
     EXPECT_THAT(result.errors, HasSubstr("qel: cannot write to standard output: 32 (Broken pipe)\nstatus 4\n"));
 }
 
-TEST_F(ConsoleTest, ClosedDescriptorsAreNotTakenForTheConnection)
+TEST_F(ConsoleTest, ClosedStandardDescriptorsAreNotReusedForTheConnection)
 {
     const auto noInput = run(shell(commandLine(console({"2"})) + "<&-"));
     EXPECT_EQ(noInput.exitStatus, 4);
@@ -221,11 +221,11 @@ TEST_F(ConsoleTest, TheEndOfTheCommandEndsTheConsole)
     person.type("exit\r");
     const auto result = person.wait();
     EXPECT_EQ(result.exitStatus, 0);
-    EXPECT_THAT(result.screen, EndsWith("\r\nqel: session closed: read failure, the command has ended\r\n"));
+    EXPECT_THAT(result.screen, EndsWith("\r\nqel: session closed: the command ended\r\n"));
     EXPECT_TRUE(person.isTerminalUntouched());
 }
 
-TEST_F(ConsoleTest, ControlCharactersAreForThePartition)
+TEST_F(ConsoleTest, ControlCharactersGoToThePartition)
 {
     PtyProcess person(console({"1"}));
     person.await("$ ");
@@ -239,7 +239,7 @@ TEST_F(ConsoleTest, ControlCharactersAreForThePartition)
     EXPECT_EQ(person.wait().exitStatus, 0);
 }
 
-TEST_F(ConsoleTest, TheCommandsAreListed)
+TEST_F(ConsoleTest, ListsTheEscapeCommands)
 {
     PtyProcess person(console({"2"}));
     person.await("connected");
@@ -251,7 +251,7 @@ TEST_F(ConsoleTest, TheCommandsAreListed)
     EXPECT_EQ(person.wait().exitStatus, 0);
 }
 
-TEST_F(ConsoleTest, LogLinesOnTheTerminalReturnTheCarriage)
+TEST_F(ConsoleTest, LogLinesInRawModeEndWithCarriageReturn)
 {
     PtyProcess person(console({"2", "--log-level", "debug"}));
     person.await("qel: connected");
@@ -271,7 +271,7 @@ TEST_F(ConsoleTest, TheEscapeCharacterCanBeChosen)
     EXPECT_EQ(person.wait().exitStatus, 0);
 }
 
-TEST_F(ConsoleTest, ThereNeedBeNoEscapeCharacter)
+TEST_F(ConsoleTest, TheEscapeCharacterCanBeDisabled)
 {
     PtyProcess person(console({"2", "--escape", "none"}));
     person.type("~.\r");
@@ -282,7 +282,7 @@ TEST_F(ConsoleTest, ThereNeedBeNoEscapeCharacter)
     EXPECT_THAT(result.screen, Not(HasSubstr("connected")));
 }
 
-TEST_F(ConsoleTest, ASignalEndsTheConsoleAndTheTerminalIsAsBefore)
+TEST_F(ConsoleTest, ASignalEndsTheConsoleAndRestoresTheTerminal)
 {
     for (const int signal : {SIGTERM, SIGINT, SIGHUP, SIGQUIT}) {
         SCOPED_TRACE(signal);
@@ -307,7 +307,7 @@ TEST_F(ConsoleTest, SignalsThatAreIgnoredStayIgnored)
     EXPECT_EQ(person.wait().signal, SIGTERM);
 }
 
-TEST_F(ConsoleTest, SuspendingPutsTheTerminalBackUntilItGoesOn)
+TEST_F(ConsoleTest, SuspendingRestoresTheTerminalUntilItContinues)
 {
     PtyProcess person(
         shell(commandLine(console({"2"})) + "; echo stopped $?; read line; echo got $line; fg; echo left $?", "-mc"));
@@ -326,7 +326,7 @@ TEST_F(ConsoleTest, SuspendingPutsTheTerminalBackUntilItGoesOn)
     EXPECT_TRUE(person.isTerminalUntouched());
 }
 
-TEST_F(ConsoleTest, ATerminalThatServesAnotherJobIsLeftAlone)
+TEST_F(ConsoleTest, TheTerminalOfAnotherJobIsNotChanged)
 {
     // A signal that cannot be caught stops the console in raw mode. The shell goes on with a mode of its own, and then
     // the console is told to end.
@@ -364,18 +364,18 @@ TEST_F(ConsoleTest, BroadcastsOfOtherConsolesAreShownOnALineOfTheirOwn)
 
 // Other consoles.
 
-TEST_F(ConsoleTest, APartitionThatIsHeldIsRefused)
+TEST_F(ConsoleTest, AHeldPartitionIsRefused)
 {
     PtyProcess holder(console({"1"}));
     holder.await("connected");
     const auto refused = runConsole({"1"}, "");
     EXPECT_EQ(refused.exitStatus, 1);
     EXPECT_EQ(refused.output, "");
-    EXPECT_EQ(refused.errors,
-              "qel: open serial session refused: 0x00000013 (QelMessageStatusConnectionNotAvailable)\n");
+    EXPECT_EQ(refused.errors, "qel: partition 1 is held by another console; --force takes it: 0x00000013 "
+                              "(QelMessageStatusConnectionNotAvailable)\n");
 }
 
-TEST_F(ConsoleTest, APartitionThatIsHeldCanBeTaken)
+TEST_F(ConsoleTest, AHeldPartitionCanBeTakenByForce)
 {
     PtyProcess holder(console({"1"}));
     holder.await("$ ");
@@ -384,45 +384,49 @@ TEST_F(ConsoleTest, APartitionThatIsHeldCanBeTaken)
     EXPECT_THAT(taken.output, HasSubstr("42\r\n"));
     const auto result = holder.wait();
     EXPECT_EQ(result.exitStatus, 1);
-    EXPECT_THAT(result.screen, EndsWith("$ \r\nqel: session closed: force close by another console\r\n"));
+    EXPECT_THAT(result.screen, EndsWith("$ \r\nqel: session closed: taken or closed by another console\r\n"));
     EXPECT_TRUE(holder.isTerminalUntouched());
 }
 
-TEST_F(ConsoleTest, WhatIsNotThereIsRefused)
+TEST_F(ConsoleTest, AnUnknownPartitionOrConnectionIsRefused)
 {
     const auto partition = runConsole({"9"}, "");
     EXPECT_EQ(partition.exitStatus, 1);
-    EXPECT_EQ(partition.errors, "qel: open serial session refused: 0x00000015 (QelMessageStatusInvalidLparId)\n");
+    EXPECT_EQ(partition.errors,
+              "qel: the server does not have partition 9: 0x00000015 (QelMessageStatusInvalidLparId)\n");
     EXPECT_EQ(runConsole({"09"}, "").errors, partition.errors); // no octal number, which would be none
     const auto connection = runConsole({"1", "--connection", "1"}, "");
     EXPECT_EQ(connection.exitStatus, 1);
     EXPECT_EQ(connection.errors,
-              "qel: open serial session refused: 0x00000010 (QelMessageStatusInvalidConnectionNumber)\n");
+              "qel: partition 1 does not have this serial connection; --connection 0 is the first: 0x00000010 "
+              "(QelMessageStatusInvalidConnectionNumber)\n");
 }
 
-TEST_F(ConsoleTest, ANameThatIsTakenIsRefused)
+TEST_F(ConsoleTest, AToolIdInUseIsRefused)
 {
     PtyProcess holder(console({"1", "--tool-id", "me"}));
     holder.await("connected");
     const auto refused = runConsole({"2", "--tool-id", "me"}, "");
     EXPECT_EQ(refused.exitStatus, 1);
-    EXPECT_EQ(refused.errors, "qel: version request refused: 0x00000025 (QelMessageStatusDaxAlreadyConnected)\n");
+    EXPECT_EQ(refused.errors,
+              "qel: a console with this tool type and id is connected already; choose another --tool-id: 0x00000025 "
+              "(QelMessageStatusDaxAlreadyConnected)\n");
 }
 
-// The hypervisor end goes.
+// The server shuts down or is killed.
 
-TEST_F(ConsoleTest, TheHypervisorEndGoesDown)
+TEST_F(ConsoleTest, AServerShutdownEndsTheConsole)
 {
     PtyProcess person(console({"1"}));
     person.await("$ ");
     server.stop();
     const auto result = person.wait();
     EXPECT_EQ(result.exitStatus, 7);
-    EXPECT_THAT(result.screen, EndsWith("$ \r\nqel: session closed: shutdown of the hypervisor end\r\n"));
+    EXPECT_THAT(result.screen, EndsWith("$ \r\nqel: session closed: the server shut down\r\n"));
     EXPECT_TRUE(person.isTerminalUntouched());
 }
 
-TEST_F(ConsoleTest, TheHypervisorEndIsKilled)
+TEST_F(ConsoleTest, AKilledServerEndsTheConsole)
 {
     PtyProcess person(console({"1"}));
     person.await("$ ");
@@ -433,9 +437,9 @@ TEST_F(ConsoleTest, TheHypervisorEndIsKilled)
     EXPECT_TRUE(person.isTerminalUntouched());
 }
 
-// A hypervisor end that does not do as it should.
+// A hypervisor that misbehaves.
 
-/// Accepts one connection and plays the hypervisor end of it on a thread of its own.
+/// Accepts one connection and plays its hypervisor on a thread.
 class BadHypervisor {
 public:
     /// @param afterSetUp  called once the session is open; the connection ends when it returns
@@ -476,7 +480,7 @@ void awaitEnd(LoopbackMessages& messages)
     }
 }
 
-TEST(Console, BytesThatAreNoFrameBreakTheProtocol)
+TEST(Console, GarbageBreaksTheProtocol)
 {
     BadHypervisor hypervisor([](LoopbackMessages& messages) {
         messages.sendBytes(std::string(100, 'x'));
@@ -485,11 +489,11 @@ TEST(Console, BytesThatAreNoFrameBreakTheProtocol)
     PtyProcess person(consoleTo(hypervisor.endpoint(), {"1"}));
     const auto result = person.wait();
     EXPECT_EQ(result.exitStatus, 5);
-    EXPECT_THAT(result.screen, EndsWith("qel: the other end broke the protocol: Invalid length\r\n"));
+    EXPECT_THAT(result.screen, EndsWith("qel: the peer broke the protocol: Invalid length\r\n"));
     EXPECT_TRUE(person.isTerminalUntouched());
 }
 
-TEST(Console, AFrameThatBeganMustEndInTime)
+TEST(Console, AnIncompleteFrameTimesOut)
 {
     BadHypervisor hypervisor([](LoopbackMessages& messages) {
         messages.sendBytes(std::string("\xDE\xCA\xFF\x20\0\0\0\x28half", 12));
@@ -497,10 +501,10 @@ TEST(Console, AFrameThatBeganMustEndInTime)
     });
     const auto result = run(consoleTo(hypervisor.endpoint(), {"1", "--no-eof", "--timeout", "0.5"}));
     EXPECT_EQ(result.exitStatus, 6);
-    EXPECT_THAT(result.errors, StartsWith("qel: connection lost: "));
+    EXPECT_THAT(result.errors, StartsWith("qel: timed out after 0.5 s (--timeout): "));
 }
 
-TEST(Console, AHypervisorEndThatDoesNotCloseInTimeIsLeft)
+TEST(Console, LeavesWhenTheServerDoesNotCloseInTime)
 {
     BadHypervisor hypervisor([](LoopbackMessages& messages) { awaitEnd(messages); });
     PtyProcess person(consoleTo(hypervisor.endpoint(), {"1", "--timeout", "0.5"}));
@@ -511,7 +515,7 @@ TEST(Console, AHypervisorEndThatDoesNotCloseInTimeIsLeft)
     EXPECT_TRUE(person.isTerminalUntouched());
 }
 
-TEST(Console, AHypervisorEndThatSaysNothingIsWaitedForToTheDeadline)
+TEST(Console, ASilentServerTimesOut)
 {
     const Socket listener = listenOn(IPEndpoint("127.0.0.1:0"), 1);
     const auto result = run(consoleTo(listener.getSocketName().str(), {"1", "--timeout", "0.2"}));
@@ -527,10 +531,10 @@ TEST(Console, OutputBeforeTheConnectionBreaksIsWritten)
     const auto result = process.wait();
     EXPECT_EQ(result.exitStatus, 7);
     EXPECT_EQ(result.output, "last words");
-    EXPECT_THAT(result.errors, StartsWith("qel: connection lost: "));
+    EXPECT_EQ(result.errors, "qel: connection lost: EOF\n");
 }
 
-TEST(Console, WhereNobodyListensThereIsNoConsole)
+TEST(Console, ARefusedConnectionIsReported)
 {
     const Socket unused(IPFamily::IPv4, SOCK_STREAM | SOCK_CLOEXEC, 0);
     Socket bound(IPFamily::IPv4, SOCK_STREAM | SOCK_CLOEXEC, 0);

@@ -324,7 +324,8 @@ TEST_F(Tls, APlainConsoleIsToldThatTheServerWantsTls)
     const auto server = serve();
     const auto result = server->call({"limits"});
     EXPECT_EQ(result.exitStatus, 1);
-    EXPECT_EQ(result.errors, "qel: the hypervisor end turned this console away: it wants to be asked for TLS\n");
+    EXPECT_EQ(result.errors,
+              "qel: the server refused the connection: it accepts only TLS; give credentials instead of --plain\n");
     EXPECT_THAT(server->stop().errors,
                 AllOf(HasSubstr(": not let in: the other end did not ask for TLS but sent something else: [CID: "),
                       Not(HasSubstr("console 1 connected"))));
@@ -612,9 +613,8 @@ TEST_F(Tls, ConsolesMayBePinnedToo)
     const auto result = call(*server, {}, "server");
     EXPECT_EQ(result.exitStatus, 7);
     EXPECT_EQ(result.output, "");
-    EXPECT_THAT(result.errors,
-                StartsWith("qel: the hypervisor end closed the connection right after the TLS handshake, "
-                           "perhaps because it does not know this end's certificate: "));
+    EXPECT_THAT(result.errors, StartsWith("qel: the server closed the connection right after the TLS handshake; "
+                                          "it may not accept this console's certificate: "));
     EXPECT_THAT(server->stop().errors, HasSubstr(": not let in: the other end is not who it should be: the name "
                                                  "\"server\" is not what --peer-name says\n"));
 }

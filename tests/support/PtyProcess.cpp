@@ -105,7 +105,7 @@ PtyProcess::Result PtyProcess::wait()
     std::unique_lock<std::mutex> lock(mMutex);
     const bool isDrained = mChanged.wait_until(lock, end, [this] { return mDrained; });
     lock.unlock();
-    if (!isDrained) fail("ended, but somebody holds its terminal");
+    if (!isDrained) fail("ended, but another process holds its terminal");
     mResult.exitStatus = WIFEXITED(status) ? WEXITSTATUS(status) : -1;
     mResult.signal = WIFSIGNALED(status) ? WTERMSIG(status) : 0;
     mResult.screen = screen();

@@ -43,7 +43,7 @@ public:
     void type(const std::string& text) const { mPty.type(text); }
     void signal(int number) const;
 
-    /// Waits until the text stands on the screen, behind what the last call waited for.
+    /// Waits until the text is on the screen, after what the last call waited for.
     void await(const std::string& text);
 
     /// All that has been on the screen.

@@ -8,12 +8,12 @@
 
 int main(int argc, char** argv)
 {
-    CLI::App app("Both ends of the QEL management protocol", "qel");
+    CLI::App app("Server and console of the QEL management protocol", "qel");
     qel::tool::Action action;
     qel::tool::addStandardFlags(app);
     app.require_subcommand(1);
 
-    // One line for each subcommand, in the order in which --help lists them.
+    // In the order in which --help lists them.
     qel::tool::addServeCommand(app, action);
     qel::tool::addCallCommand(app, action);
     qel::tool::addConsoleCommand(app, action);

@@ -74,7 +74,7 @@ TEST(DescriptorOutput, WritesWhatItWasGiven)
     EXPECT_EQ(pipe.read(100), "one two");
 }
 
-TEST(DescriptorOutput, NothingToWriteIsNoWork)
+TEST(DescriptorOutput, WithoutDataNothingIsWritten)
 {
     DescriptorOutput output(-1); // nothing can be written to it
     output.writeSome();
@@ -149,7 +149,7 @@ TEST(DescriptorOutput, KnowsWhetherALineHasEnded)
     EXPECT_TRUE(output.endsLine());
 }
 
-TEST(DescriptorOutput, AReaderThatIsGoneIsAnError)
+TEST(DescriptorOutput, ThrowsWhenTheReaderIsGone)
 {
     const auto before = std::signal(SIGPIPE, SIG_IGN);
     Pipe pipe;
@@ -163,7 +163,7 @@ TEST(DescriptorOutput, AReaderThatIsGoneIsAnError)
     static_cast<void>(std::signal(SIGPIPE, before));
 }
 
-TEST(DescriptorOutput, AFullDiskIsAnError)
+TEST(DescriptorOutput, ThrowsWhenTheDiskIsFull)
 {
     const UniqueFd full(::open("/dev/full", O_WRONLY | O_CLOEXEC));
     ASSERT_GE(full.get(), 0);
@@ -191,7 +191,7 @@ TEST(DescriptorOutput, AFileTakesEverything)
     EXPECT_EQ(read.str(), text);
 }
 
-TEST(DescriptorOutput, ATerminalThatTakesNothingIsNotWaitedFor)
+TEST(DescriptorOutput, DoesNotWaitForAHaltedTerminal)
 {
     const Pty pty;
     TerminalMode mode(pty.slave());
@@ -213,7 +213,7 @@ TEST(DescriptorOutput, ATerminalThatTakesNothingIsNotWaitedFor)
     EXPECT_TRUE(output.isEmpty());
 }
 
-TEST(DescriptorOutput, TheSideOfATestIsNotOpenedAnew)
+TEST(DescriptorOutput, TheMasterOfATerminalIsNotOpenedAgain)
 {
     const Pty pty; // of its master there is only one: opening that again makes a new terminal
     TerminalMode mode(pty.slave());

@@ -42,7 +42,7 @@ struct Case {
     ExitStatus expected;
 };
 
-TEST(Failures, EveryKindOfFailureHasItsExitStatus)
+TEST(Failures, EachKindOfFailureHasItsExitStatus)
 {
     const std::vector<Case> cases{
         {"own", [] { throw CommandFailure(ExitStatus::CannotConnect, "x"); }, ExitStatus::CannotConnect},
@@ -69,7 +69,7 @@ TEST(Failures, EveryKindOfFailureHasItsExitStatus)
     }
 }
 
-TEST(Failures, TheNumbersAreThoseThatScriptsRelyOn)
+TEST(Failures, ExitStatusesHaveTheDocumentedNumbers)
 {
     EXPECT_EQ(static_cast<int>(ExitStatus::Done), 0);
     EXPECT_EQ(static_cast<int>(ExitStatus::Refused), 1);
@@ -81,16 +81,17 @@ TEST(Failures, TheNumbersAreThoseThatScriptsRelyOn)
     EXPECT_EQ(static_cast<int>(ExitStatus::ClosedByPeer), 7);
 }
 
-TEST(Failures, ARefusalNamesTheStepAndTheStatus)
+TEST(Failures, RefusalWithoutATextNamesTheStepAndTheStatus)
 {
     const RequestRefused refused("open session", refusal());
-    EXPECT_STREQ(refused.what(), "open session refused: 0x00000012 (QelMessageStatusTooManyConnections)");
+    EXPECT_STREQ(refused.what(), "open session refused: 0x00000012 (QelMessageStatusTooManyConnections)")
+        << "only the version request has a text for this status";
     EXPECT_EQ(refused.getStep(), "open session");
     EXPECT_EQ(refused.getStatus(), QelMessageStatusTooManyConnections);
     EXPECT_EQ(refused.getStatusDetail(), 0xABU);
 }
 
-TEST(Failures, TheExplanationGoesDownToTheCause)
+TEST(Failures, ExplanationIncludesTheNestedCauses)
 {
     try {
         throwStreamFailure(ECONNRESET);
@@ -101,7 +102,7 @@ TEST(Failures, TheExplanationGoesDownToTheCause)
     EXPECT_EQ(tool::explain(StreamIOException("EOF")), "EOF");
 }
 
-TEST(Failures, TheComplaintSaysWhatThePhraseOfTheLibraryMeans)
+TEST(Failures, UserMessageExplainsTheLibrarysPhrase)
 {
     struct Row {
         std::function<void()> fail;
@@ -112,10 +113,10 @@ TEST(Failures, TheComplaintSaysWhatThePhraseOfTheLibraryMeans)
              Row{[] { throw RequestRefused("x", refusal()); },
                  "x refused: 0x00000012 (QelMessageStatusTooManyConnections)"},
              Row{[] { throw QelMessageValidationException("Invalid length"); },
-                 "the other end broke the protocol: Invalid length"},
-             Row{[] { throw StreamIOException("I/O deadline"); }, "the other end did not answer in time: I/O deadline"},
+                 "the peer broke the protocol: Invalid length"},
+             Row{[] { throw StreamIOException("I/O deadline"); }, "the peer did not answer in time: I/O deadline"},
              Row{[] { throwStreamFailure(EAGAIN); },
-                 "the other end did not answer in time: socket stream receive failure: socket stream failed to "
+                 "the peer did not answer in time: socket stream receive failure: socket stream failed to "
                  "receive: 11 (Resource temporarily unavailable)"},
              Row{[] { throw StreamIOException("EOF"); }, "connection lost: EOF"},
              Row{[] { throw PosixError(ENOSPC, "x"); }, "x: 28 (No space left on device)"},
@@ -130,7 +131,7 @@ TEST(Failures, TheComplaintSaysWhatThePhraseOfTheLibraryMeans)
     }
 }
 
-TEST(Failures, ACauseThatIsNoExceptionIsSaidToBeUnknown)
+TEST(Failures, CauseThatIsNotAnExceptionIsUnknown)
 {
     try {
         try {

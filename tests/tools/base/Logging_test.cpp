@@ -29,7 +29,7 @@ protected:
     const TemporaryDirectory directory;
 };
 
-TEST_F(LoggingTest, LinesOfTheProgramAreToldFromTheLibrarys)
+TEST_F(LoggingTest, LinesOfTheProgramHaveItsName)
 {
     CapturedLog log(LogLevel::Info);
     tool::logLine(LogLevel::Debug, "hidden");
@@ -37,7 +37,7 @@ TEST_F(LoggingTest, LinesOfTheProgramAreToldFromTheLibrarys)
     EXPECT_THAT(log.lines(), ElementsAre("I: [qel] shown 1"));
 }
 
-TEST_F(LoggingTest, AQuietCommandLogsNothingUnlessAsked)
+TEST_F(LoggingTest, AQuietCommandLogsOnRequest)
 {
     LogOptions options;
     options.quiet = true;
@@ -126,24 +126,25 @@ TEST_F(LoggingTest, TheOptionsAreChecked)
     }
 }
 
-TEST_F(LoggingTest, TheHelpSaysWhatIsLoggedWithoutTheOptions)
+TEST_F(LoggingTest, HelpStatesTheDefaultLevel)
 {
     LogOptions loud;
     CLI::App loudApp;
     tool::addLogOptions(loudApp, loud);
     EXPECT_EQ(loudApp.get_option("--log-level")->get_description(),
-              "Write lines of this level and above: debug, info, warn, error or critical; info unless given");
+              "Log lines of this level and above: debug, info, warn, error or critical (default: info)");
     LogOptions quiet;
     quiet.usual = LogLevel::Warn;
     quiet.quiet = true;
     CLI::App quietApp;
     tool::addLogOptions(quietApp, quiet);
-    EXPECT_EQ(quietApp.get_option("--log-level")->get_description(),
-              "Write lines of this level and above: debug, info, warn, error or critical; nothing is written unless "
-              "this or --log-dir is given, then warn");
+    EXPECT_EQ(
+        quietApp.get_option("--log-level")->get_description(),
+        "Log lines of this level and above: debug, info, warn, error or critical (default: no log; with --log-dir "
+        "warn)");
 }
 
-TEST_F(LoggingTest, WithADirectoryAQuietCommandLogsFromItsUsualLevelOn)
+TEST_F(LoggingTest, QuietCommandLogsFromItsUsualLevelWithADirectory)
 {
     LogOptions options;
     options.quiet = true;

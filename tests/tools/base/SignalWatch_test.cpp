@@ -17,7 +17,7 @@ bool isBlocked(int number)
     return ::sigismember(&set, number) == 1;
 }
 
-TEST(SignalWatch, ASignalBecomesSomethingToRead)
+TEST(SignalWatch, ASignalBecomesReadable)
 {
     SignalWatch watch({SIGUSR1, SIGUSR2});
     EXPECT_FALSE(PollSet(watch.getPollFd()).poll().anyReady());
@@ -28,7 +28,7 @@ TEST(SignalWatch, ASignalBecomesSomethingToRead)
     EXPECT_EQ(watch.take(), 0);
 }
 
-TEST(SignalWatch, TheSignalsAreBlockedOnlyWhileItLives)
+TEST(SignalWatch, SignalsAreBlockedUntilDestruction)
 {
     ASSERT_FALSE(isBlocked(SIGUSR1));
     {

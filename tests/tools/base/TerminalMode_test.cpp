@@ -16,7 +16,7 @@ using ::testing::StrEq;
 using ::testing::ThrowsMessage;
 using tool::TerminalMode;
 
-TEST(TerminalMode, NothingChangesUnlessItIsTold)
+TEST(TerminalMode, ConstructionChangesNothing)
 {
     const Pty pty;
     const termios before = pty.attributes();
@@ -29,7 +29,7 @@ TEST(TerminalMode, NothingChangesUnlessItIsTold)
     EXPECT_TRUE(pty.attributes() == before);
 }
 
-TEST(TerminalMode, InRawModeEveryKeyGoesThrough)
+TEST(TerminalMode, InRawModeEveryKeyIsDelivered)
 {
     const Pty pty;
     TerminalMode mode(pty.slave());
@@ -49,7 +49,7 @@ TEST(TerminalMode, InRawModeEveryKeyGoesThrough)
     EXPECT_EQ(pty.read(5), "a\nb\r\n"); // neither echo nor anything done to line ends
 }
 
-TEST(TerminalMode, RestoringPutsBackWhatWasFound)
+TEST(TerminalMode, RestoreSetsTheSavedMode)
 {
     const Pty pty;
     termios special = pty.attributes();
@@ -63,7 +63,7 @@ TEST(TerminalMode, RestoringPutsBackWhatWasFound)
     EXPECT_TRUE(pty.attributes() == special);
 }
 
-TEST(TerminalMode, TheEndOfTheObjectRestores)
+TEST(TerminalMode, DestructionRestores)
 {
     const Pty pty;
     const termios before = pty.attributes();
@@ -115,7 +115,7 @@ TEST(TerminalMode, RestoringTwiceChangesNothingMore)
     EXPECT_TRUE(pty.attributes() == other);
 }
 
-TEST(TerminalMode, WhatIsNoTerminalIsLeftAlone)
+TEST(TerminalMode, OtherDescriptorsAreNotChanged)
 {
     const int null = ::open("/dev/null", O_RDWR | O_CLOEXEC);
     for (const int descriptor : {null, -1}) {
@@ -128,7 +128,7 @@ TEST(TerminalMode, WhatIsNoTerminalIsLeftAlone)
     ::close(null);
 }
 
-TEST(TerminalMode, ATerminalThatIsGoneIsAnError)
+TEST(TerminalMode, ThrowsWhenTheTerminalHungUp)
 {
     Pty pty;
     TerminalMode mode(pty.slave());
@@ -138,7 +138,7 @@ TEST(TerminalMode, ATerminalThatIsGoneIsAnError)
     EXPECT_FALSE(mode.isRaw());
 }
 
-TEST(TerminalMode, ATerminalThatHasGoneNeedsNoRestoring)
+TEST(TerminalMode, RestoreIgnoresAHungUpTerminal)
 {
     Pty pty;
     TerminalMode mode(pty.slave());
@@ -150,7 +150,7 @@ TEST(TerminalMode, ATerminalThatHasGoneNeedsNoRestoring)
     EXPECT_FALSE(mode.isRaw());
 }
 
-TEST(LineEnd, ReturnsTheCarriageOnARawTerminalAlone)
+TEST(LineEnd, IsCarriageReturnAndLineFeedOnARawTerminal)
 {
     const Pty pty;
     EXPECT_STREQ(tool::lineEndOf(pty.slave()), "\n");
@@ -161,7 +161,7 @@ TEST(LineEnd, ReturnsTheCarriageOnARawTerminalAlone)
     EXPECT_STREQ(tool::lineEndOf(pty.slave()), "\n");
 }
 
-TEST(LineEnd, IsALineFeedWhereThereIsNoTerminal)
+TEST(LineEnd, IsALineFeedElsewhere)
 {
     int ends[2];
     ASSERT_EQ(::pipe2(ends, O_CLOEXEC), 0);

@@ -9,7 +9,7 @@ namespace {
 using tool::printableLines;
 using tool::quoted;
 
-TEST(TextQuoting, QuotedTextCannotSeemToEnd)
+TEST(TextQuoting, QuotesInsideQuotedTextAreEscaped)
 {
     EXPECT_EQ(quoted("console-101"), "\"console-101\"");
     EXPECT_EQ(quoted(""), "\"\"");

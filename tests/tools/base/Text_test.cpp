@@ -19,13 +19,13 @@ TEST(Text, PrintableAsciiStaysAsItIs)
     EXPECT_EQ(printable(""), "");
 }
 
-TEST(Text, WhatCouldChangeATerminalIsEscaped)
+TEST(Text, EverythingElseIsEscaped)
 {
     EXPECT_EQ(printable(std::string("\0\x1B[2J\n\x1F\x7F\x80\xFF", 10)), "\\x00\\x1b[2J\\x0a\\x1f\\x7f\\x80\\xff");
     EXPECT_EQ(printable("a\\x41"), "a\\\\x41");
 }
 
-TEST(Text, HexDigitsAreTwoAByte)
+TEST(Text, HexDigitsAreTwoForEachByte)
 {
     EXPECT_EQ(hexDigits(std::string("\0\x0F\xF0\xFF", 4)), "000ff0ff");
     EXPECT_EQ(hexDigits(""), "");

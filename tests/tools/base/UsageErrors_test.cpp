@@ -90,7 +90,7 @@ TEST_F(UsageErrors, NamesOptionsOfTheOuterAndTheInnerSubcommand)
     EXPECT_EQ(said({"call", "time", "--locla"}), "unknown option \"--locla\"; did you mean \"--local\"?");
 }
 
-TEST_F(UsageErrors, NamesAnOptionThatStandsBeforeItsSubcommand)
+TEST_F(UsageErrors, NamesAnOptionGivenBeforeItsSubcommand)
 {
     EXPECT_EQ(said({"--colour", "red", "paint", "north"}),
               "write --colour after \"paint\": it is an option of that subcommand");
@@ -106,7 +106,7 @@ TEST_F(UsageErrors, AnUnknownWordComesBeforeTheErrorsThatItCauses)
     EXPECT_EQ(said({"paint", "--color", "--columns"}), "unknown option \"--color\"; did you mean \"--colour\"?");
 }
 
-TEST_F(UsageErrors, NamesAnArgumentTooMany)
+TEST_F(UsageErrors, NamesAnUnexpectedArgument)
 {
     EXPECT_EQ(said({"paint", "north", "south"}), "unexpected argument \"south\"; see \"prog paint --help\"");
     EXPECT_EQ(said({"call", "time", "limits"}), "unexpected argument \"limits\"; see \"prog call time --help\"");

@@ -60,7 +60,7 @@ protected:
     std::atomic<std::uint64_t> done{0};
 };
 
-TEST_F(BenchShareTest, FlatOutOneMessageFollowsTheOther)
+TEST_F(BenchShareTest, WithoutARateMessagesFollowEachOther)
 {
     load.count = 3;
     takes = {milliseconds(5), milliseconds(1), milliseconds(2)};
@@ -74,7 +74,7 @@ TEST_F(BenchShareTest, FlatOutOneMessageFollowsTheOther)
     EXPECT_EQ(done, 3U);
 }
 
-TEST_F(BenchShareTest, WithARateEachMessageHasItsTime)
+TEST_F(BenchShareTest, WithARateEachMessageHasADueTime)
 {
     load.count = 3;
     load.rate = 100;
@@ -84,15 +84,14 @@ TEST_F(BenchShareTest, WithARateEachMessageHasItsTime)
     EXPECT_EQ(figures.latency.longest(), milliseconds(1));
 }
 
-TEST_F(BenchShareTest, ALatencyCountsFromTheTimeAtWhichTheMessageWasDue)
+TEST_F(BenchShareTest, LatencyCountsFromTheDueTime)
 {
     load.count = 4;
     load.rate = 100;
     takes = {milliseconds(25), milliseconds(1), milliseconds(1), milliseconds(1)};
     const BenchFigures figures = run();
     EXPECT_THAT(sentAt, ElementsAre(0, 25, 26, 30));
-    // 25, 16 (due at 10, done at 26), 7 (due at 20, done at 27) and 1: nobody sees but one slow message here, but three
-    // were.
+    // 25, 16 (due at 10, done at 26), 7 (due at 20, done at 27) and 1. Only one message took long; three were late.
     EXPECT_EQ(figures.latency.longest(), milliseconds(25));
     std::vector<long long> rows;
     for (const auto& row : figures.latency.rows())
@@ -100,7 +99,7 @@ TEST_F(BenchShareTest, ALatencyCountsFromTheTimeAtWhichTheMessageWasDue)
     EXPECT_THAT(rows, ElementsAre(1, 0, 0, 10, 20, 50));
 }
 
-TEST_F(BenchShareTest, MessagesAreSharedOutInTurn)
+TEST_F(BenchShareTest, MessagesAreDistributedRoundRobin)
 {
     load.pairs = 3;
     load.rate = 100;
@@ -126,7 +125,7 @@ TEST_F(BenchShareTest, WithFewerMessagesThanPairsSomePairsHaveNone)
     EXPECT_EQ(run(2).latency.count(), 0U);
 }
 
-TEST_F(BenchShareTest, FlatOutTheTimeEndsItWithTheMessageInHand)
+TEST_F(BenchShareTest, WithoutARateTheRunEndsAfterTheCurrentMessage)
 {
     load.time = milliseconds(10);
     takes = {milliseconds(9), milliseconds(9)};
@@ -135,7 +134,7 @@ TEST_F(BenchShareTest, FlatOutTheTimeEndsItWithTheMessageInHand)
     EXPECT_EQ(figures.elapsed, milliseconds(18));
 }
 
-TEST_F(BenchShareTest, AMessageThatIsDoneJustAtTheEndIsTheLast)
+TEST_F(BenchShareTest, AMessageThatCompletesAtTheEndIsTheLast)
 {
     load.time = milliseconds(10);
     takes = {milliseconds(5), milliseconds(5)};
@@ -163,7 +162,7 @@ TEST_F(BenchShareTest, MessagesThatWereDueAndNotSentAreCounted)
 }
 
 // One after the other they would take longer to count than anybody waits.
-TEST_F(BenchShareTest, HoweverManyAreUnsentTheyAreCounted)
+TEST_F(BenchShareTest, AnyNumberOfUnsentMessagesIsCounted)
 {
     constexpr std::chrono::hours kWeek(7 * 24);
     load.time = kWeek;
@@ -177,7 +176,7 @@ TEST_F(BenchShareTest, HoweverManyAreUnsentTheyAreCounted)
     EXPECT_EQ(run(126).unsent, 604800000000U / 127 - 1);
 }
 
-TEST_F(BenchShareTest, WithACountNoMoreThanThatCanBeUnsent)
+TEST_F(BenchShareTest, CountLimitsTheUnsentMessages)
 {
     load.time = milliseconds(100);
     load.count = 5;
@@ -186,7 +185,7 @@ TEST_F(BenchShareTest, WithACountNoMoreThanThatCanBeUnsent)
     EXPECT_EQ(run().unsent, 4U);
 }
 
-TEST_F(BenchShareTest, ToldToEndItEndsAndTellsWhatWasDueByThen)
+TEST_F(BenchShareTest, StoppingCountsTheMessagesDueByThen)
 {
     load.rate = 100;
     stopsAfter = 2;
@@ -197,7 +196,7 @@ TEST_F(BenchShareTest, ToldToEndItEndsAndTellsWhatWasDueByThen)
     EXPECT_EQ(figures.unsent, 3U); // due at 20, 30 and 40 of 45 milliseconds
 }
 
-TEST_F(BenchShareTest, AFailureLeavesTheFiguresOfWhatWasDone)
+TEST_F(BenchShareTest, AFailureKeepsTheFiguresSoFar)
 {
     load.count = 5;
     failsAt = 3;
@@ -208,7 +207,7 @@ TEST_F(BenchShareTest, AFailureLeavesTheFiguresOfWhatWasDone)
     EXPECT_EQ(done, 2U);
 }
 
-TEST_F(BenchShareTest, AFailureTellsWhatWasDueByThen)
+TEST_F(BenchShareTest, AFailureCountsTheMessagesDueByThen)
 {
     load.rate = 100;
     failsAt = 3;
@@ -220,7 +219,7 @@ TEST_F(BenchShareTest, AFailureTellsWhatWasDueByThen)
     EXPECT_EQ(figures.unsent, 3U); // due at 30, 40 and 50 of 55 milliseconds; the one in hand was sent
 }
 
-TEST_F(BenchShareTest, TheClockIsReadOnceForEachMessageAndFlatOutTwice)
+TEST_F(BenchShareTest, TheClockIsReadOnceForEachMessageAndTwiceWithoutARate)
 {
     load.count = 1;
     const BenchShare share(load, 0, start);

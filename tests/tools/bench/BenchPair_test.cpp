@@ -26,7 +26,7 @@ protected:
     }
 };
 
-TEST_F(BenchPairTest, TheyTakeTurns)
+TEST_F(BenchPairTest, ConsolesSendAlternately)
 {
     for (int i = 0; i < 3; ++i)
         pair->exchange();
@@ -46,7 +46,7 @@ TEST_F(BenchPairTest, AMessageIsABroadcastToTheOtherOneAlone)
     EXPECT_EQ(sent.getBroadcastMsgLen(), 300U);
 }
 
-TEST_F(BenchPairTest, EachMessageHasItsTimeAtBothEnds)
+TEST_F(BenchPairTest, TheTimeoutAppliesToBothConsoles)
 {
     pair->exchange();
     pair->exchange();
@@ -57,7 +57,7 @@ TEST_F(BenchPairTest, EachMessageHasItsTimeAtBothEnds)
     }
 }
 
-TEST_F(BenchPairTest, BroadcastsOfOthersInBetweenDoNotCount)
+TEST_F(BenchPairTest, BroadcastsOfOtherConsolesAreSkipped)
 {
     second->push(QelMessageDaxBroadcastOutboundAsync(1, 9, "three", "x"));
     second->push(QelMessageDaxBroadcastOutboundAsync(1, 8, "one", "x"));
@@ -65,48 +65,48 @@ TEST_F(BenchPairTest, BroadcastsOfOthersInBetweenDoNotCount)
     EXPECT_NO_THROW(pair->exchange());
 }
 
-TEST_F(BenchPairTest, AMessageThatDoesNotArriveIsWaitedFor)
+TEST_F(BenchPairTest, AMissingMessageIsAwaited)
 {
     first->onMessage = [this](const QelMessage& message) { first->grant(message); };
     EXPECT_THAT([this] { pair->exchange(); }, ThrowsMessage<StreamIOException>(StrEq("I/O deadline")));
 }
 
-TEST_F(BenchPairTest, AMessageThatArrivesChangedIsNoAnswer)
+TEST_F(BenchPairTest, AChangedMessageBreaksTheProtocol)
 {
     first->onMessage = [this](const QelMessage& message) {
         first->grant(message);
         second->push(QelMessageDaxBroadcastOutboundAsync(300, 9, "one", std::string(300, 'x').data()));
     };
     EXPECT_THAT([this] { pair->exchange(); },
-                ThrowsMessage<CommandFailure>(StrEq("a message did not arrive as it was sent")));
+                ThrowsMessage<CommandFailure>(StrEq("the server broke the protocol: a message arrived changed")));
 }
 
-TEST_F(BenchPairTest, AMessageThatArrivesShortIsNoAnswer)
+TEST_F(BenchPairTest, AShortMessageBreaksTheProtocol)
 {
     first->onMessage = [this](const QelMessage& message) {
         first->grant(message);
         second->push(QelMessageDaxBroadcastOutboundAsync(299, 9, "one", request(*first, 0).getDaxPacket()));
     };
     EXPECT_THAT([this] { pair->exchange(); },
-                ThrowsMessage<CommandFailure>(StrEq("a message did not arrive as it was sent")));
+                ThrowsMessage<CommandFailure>(StrEq("the server broke the protocol: a message arrived changed")));
 }
 
-TEST_F(BenchPairTest, ARefusalEndsIt)
+TEST_F(BenchPairTest, ARefusalEndsTheExchange)
 {
     first->onMessage = [this](const QelMessage& message) { first->respond(message, QelMessageStatusCmdFailed); };
     EXPECT_THAT([this] { pair->exchange(); },
-                ThrowsMessage<RequestRefused>(StrEq("broadcast refused: 0x00000006 (QelMessageStatusCmdFailed)")));
+                ThrowsMessage<RequestRefused>(
+                    StrEq("the addressed console takes no more messages at the moment; try again later: 0x00000006 "
+                          "(QelMessageStatusCmdFailed)")));
 }
 
-TEST_F(BenchPairTest, AHypervisorThatClosesIsNoticedAtEitherEnd)
+TEST_F(BenchPairTest, TheConnectionClosedNoticeIsSeenByEitherConsole)
 {
     second->push(QelMessageKrogConnectionClosedAsync());
-    EXPECT_THAT([this] { pair->exchange(); },
-                ThrowsMessage<CommandFailure>(StrEq("the hypervisor closed the connection")));
+    EXPECT_THAT([this] { pair->exchange(); }, ThrowsMessage<CommandFailure>(StrEq("the server closed the connection")));
     second->push(QelMessageKrogConnectionClosedAsync());
     second->onMessage = [this](const QelMessage& message) { second->grant(message); };
-    EXPECT_THAT([this] { pair->exchange(); },
-                ThrowsMessage<CommandFailure>(StrEq("the hypervisor closed the connection")));
+    EXPECT_THAT([this] { pair->exchange(); }, ThrowsMessage<CommandFailure>(StrEq("the server closed the connection")));
 }
 
 } // namespace

@@ -67,7 +67,7 @@ TEST(BenchReport, TextForPeople)
               "  to 20 ms              1\n");
 }
 
-TEST(BenchReport, WithARateTheTextSaysWhatWasNotSent)
+TEST(BenchReport, WithARateTheTextCountsUnsentMessages)
 {
     BenchLoad load = someLoad();
     load.pairs = 1;
@@ -124,7 +124,7 @@ TEST(BenchReport, JsonForPrograms)
                                "max": 20000000000}})"));
 }
 
-TEST(BenchReport, FlatOutTheRateIsNull)
+TEST(BenchReport, WithoutARateTheRateIsNull)
 {
     EXPECT_TRUE(tool::reportJson("x", someLoad(), BenchFigures())["rate"].is_null());
 }

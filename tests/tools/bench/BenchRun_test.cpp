@@ -62,7 +62,7 @@ TEST_F(BenchRunTest, TheFiguresOfAllPairsAreAddedUp)
     EXPECT_FALSE(figures.interrupted);
 }
 
-TEST_F(BenchRunTest, ToldToStopItStopsAndSaysSo)
+TEST_F(BenchRunTest, StoppingMarksTheRunInterrupted)
 {
     const auto run = start();
     awaitMessages(*run, 10);
@@ -72,7 +72,7 @@ TEST_F(BenchRunTest, ToldToStopItStopsAndSaysSo)
     EXPECT_EQ(figures.latency.count(), run->done());
 }
 
-TEST_F(BenchRunTest, WhoeverWaitsForTheTimeOfAMessageIsWoken)
+TEST_F(BenchRunTest, StoppingWakesAPairThatWaitsForADueTime)
 {
     load.rate = 0.0001;
     const auto run = start();
@@ -81,16 +81,18 @@ TEST_F(BenchRunTest, WhoeverWaitsForTheTimeOfAMessageIsWoken)
     EXPECT_EQ(run->finish().latency.count(), 1U); // the pair whose message was due at once
 }
 
-TEST_F(BenchRunTest, TheFailureOfOnePairEndsAllAndIsTold)
+TEST_F(BenchRunTest, TheFailureOfOnePairEndsTheRunAndIsThrown)
 {
     FakeHypervisorEnd* const end = fakes[1].first;
     end->onMessage = [end](const QelMessage& message) { end->respond(message, QelMessageStatusCmdFailed); };
     const auto run = start();
     EXPECT_THAT([&] { run->finish(); },
-                ThrowsMessage<RequestRefused>(StrEq("broadcast refused: 0x00000006 (QelMessageStatusCmdFailed)")));
+                ThrowsMessage<RequestRefused>(
+                    StrEq("the addressed console takes no more messages at the moment; try again later: 0x00000006 "
+                          "(QelMessageStatusCmdFailed)")));
 }
 
-TEST_F(BenchRunTest, AFailureAfterTheEndIsNone)
+TEST_F(BenchRunTest, AFailureAfterTheEndIsDropped)
 {
     std::atomic<bool> stopped{false};
     FakeHypervisorEnd* const end = fakes[1].first;
@@ -135,7 +137,7 @@ struct StalledPair {
     std::unique_ptr<tool::BenchPair> pair;
 };
 
-TEST(BenchRunEnd, AllPairsLeaveAtOnceAndAServerThatHasStoppedIsNotWaitedForByOneAfterTheOther)
+TEST(BenchRunEnd, AllPairsLeaveInParallel)
 {
     std::array<StalledPair, 4> stalled;
     std::vector<std::unique_ptr<tool::BenchPair>> pairs;
@@ -152,7 +154,7 @@ TEST(BenchRunEnd, AllPairsLeaveAtOnceAndAServerThatHasStoppedIsNotWaitedForByOne
     EXPECT_THROW(run.finish(), StreamIOException);
 }
 
-TEST_F(BenchRunTest, ToldToStopWhenAllIsDoneItWasNotInterrupted)
+TEST_F(BenchRunTest, StoppingAfterTheEndDoesNotMarkTheRunInterrupted)
 {
     load.count = 10;
     const auto run = start();
@@ -161,7 +163,7 @@ TEST_F(BenchRunTest, ToldToStopWhenAllIsDoneItWasNotInterrupted)
     EXPECT_FALSE(run->finish().interrupted);
 }
 
-TEST_F(BenchRunTest, ARunThatNobodyWaitsForEnds)
+TEST_F(BenchRunTest, ARunThatIsNotFinishedEndsOnDestruction)
 {
     const auto run = start();
     awaitMessages(*run, 10);

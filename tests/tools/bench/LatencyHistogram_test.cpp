@@ -23,7 +23,7 @@ std::vector<std::pair<long long, unsigned long>> rowsOf(const LatencyHistogram& 
 
 using Rows = std::vector<std::pair<long long, unsigned long>>;
 
-TEST(LatencyHistogram, AnEmptyOneSaysZero)
+TEST(LatencyHistogram, AnEmptyHistogramHasZeros)
 {
     const LatencyHistogram histogram;
     EXPECT_EQ(histogram.count(), 0U);
@@ -69,7 +69,7 @@ TEST(LatencyHistogram, BothEndsOfAClass)
     EXPECT_EQ(histogram.percentile(1000), nanoseconds(130)); // and not 131, which never was
 }
 
-TEST(LatencyHistogram, TheLongestThereCanBeIsCounted)
+TEST(LatencyHistogram, TheLongestDurationIsCounted)
 {
     LatencyHistogram histogram;
     histogram.record(nanoseconds::max());
@@ -87,7 +87,7 @@ TEST(LatencyHistogram, ANegativeLatencyCountsAsZero)
     EXPECT_EQ(rowsOf(histogram), (Rows{{1000, 1}}));
 }
 
-TEST(LatencyHistogram, RowsEndWhereTheySay)
+TEST(LatencyHistogram, RowsHaveExactLimits)
 {
     LatencyHistogram histogram;
     histogram.record(microseconds(5)); // to 5 us, inclusively
@@ -97,7 +97,7 @@ TEST(LatencyHistogram, RowsEndWhereTheySay)
     EXPECT_EQ(rowsOf(histogram), (Rows{{5000, 1}, {10000, 1}, {20000, 0}, {50000, 2}}));
 }
 
-TEST(LatencyHistogram, TheLastRowHasNoEnd)
+TEST(LatencyHistogram, TheLastRowHasNoLimit)
 {
     LatencyHistogram histogram;
     histogram.record(seconds(10));
@@ -105,7 +105,7 @@ TEST(LatencyHistogram, TheLastRowHasNoEnd)
     EXPECT_EQ(rowsOf(histogram), (Rows{{10000000000, 1}, {nanoseconds::max().count(), 1}}));
 }
 
-TEST(LatencyHistogram, SeveralAreAddedUp)
+TEST(LatencyHistogram, HistogramsAreAdded)
 {
     LatencyHistogram first;
     LatencyHistogram second;

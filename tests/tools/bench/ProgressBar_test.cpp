@@ -40,7 +40,7 @@ TEST(ProgressBar, TheLine)
     }
 }
 
-TEST(ProgressBar, ATerminalGetsOneLineThatIsClearedAtTheEnd)
+TEST(ProgressBar, ATerminalShowsOneLineThatIsClearedAtTheEnd)
 {
     const Pty terminal;
     winsize size{};
@@ -51,7 +51,7 @@ TEST(ProgressBar, ATerminalGetsOneLineThatIsClearedAtTheEnd)
         ProgressBar bar(terminal.slave());
         EXPECT_TRUE(bar.isShown());
         bar.update(0.5, "abc");
-        size.ws_col = 0; // nobody has said how wide it is
+        size.ws_col = 0; // the width is unknown
         ASSERT_EQ(::ioctl(terminal.slave(), TIOCSWINSZ, &size), 0);
         bar.update(1, "abc");
     }
@@ -61,7 +61,7 @@ TEST(ProgressBar, ATerminalGetsOneLineThatIsClearedAtTheEnd)
     EXPECT_EQ(terminal.read(expected.size()), expected);
 }
 
-TEST(ProgressBar, WhatIsNoTerminalGetsNothing)
+TEST(ProgressBar, OtherDescriptorsGetNothing)
 {
     int ends[2];
     ASSERT_EQ(::pipe(ends), 0);

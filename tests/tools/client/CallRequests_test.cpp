@@ -14,6 +14,7 @@ namespace qel::test {
 
 namespace {
 
+using ::testing::StartsWith;
 using ::testing::StrEq;
 using ::testing::ThrowsMessage;
 using tool::Answer;
@@ -73,7 +74,7 @@ TEST(CallRequests, EachRequestSendsItsMessage)
     }
 }
 
-TEST(CallRequests, TheVersionIsWhatTheConnectionBeganWith)
+TEST(CallRequests, VersionIsReadFromTheFirstResponse)
 {
     EXPECT_EQ(tool::versionRequest().message, nullptr);
     const QelMessageGetEnclTypeAndInterfaceVersionRsp answer(1, 'Q', 2, 3, "type", "serial");
@@ -97,7 +98,7 @@ TEST(CallRequests, CapabilitiesAreSentAndRead)
               R"({"capabilities":"01000000000000000000000000000000"})");
 }
 
-TEST(CallRequests, LimitsAreReadFromThePlainMessage)
+TEST(CallRequests, LimitsAreReadFromAPlainMessage)
 {
     EXPECT_EQ(asJson(tool::limitsRequest(), QelMessageGetInterfaceLimitsRsp(1)),
               R"({"maxCommandSize":16384,"maxHypervisorCommandSize":4096,"broadcastPacketSize":16306,)"
@@ -113,12 +114,12 @@ TEST(CallRequests, ShortLimitsAreABrokenProtocol)
     for (const std::size_t length : {0U, 1U, 15U}) {
         SCOPED_TRACE(length);
         EXPECT_THAT([&] { asJson(tool::limitsRequest(), response(0x6003, 0x0105, std::string(length, '\0'))); },
-                    ThrowsMessage<QelMessageValidationException>(StrEq("response shorter than its payload")));
+                    ThrowsMessage<QelMessageValidationException>(StrEq("the response is too short")));
     }
     EXPECT_NO_THROW(asJson(tool::limitsRequest(), response(0x6003, 0x0105, std::string(17, '\0'))));
 }
 
-TEST(CallRequests, TheTimeIsReadFromThePlainMessage)
+TEST(CallRequests, TimeIsReadFromAPlainMessage)
 {
     EXPECT_EQ(asJson(tool::timeRequest(), QelMessageGetQelTodRsp(1, std::time_t{1709618828})),
               R"({"time":"2024-03-05T06:07:08Z"})");
@@ -131,15 +132,23 @@ TEST(CallRequests, AShortTimeIsABrokenProtocol)
     for (const std::size_t length : {0U, 7U}) {
         SCOPED_TRACE(length);
         EXPECT_THAT([&] { asJson(tool::timeRequest(), response(0x6003, 0x0107, std::string(length, '\0'))); },
-                    ThrowsMessage<QelMessageValidationException>(StrEq("response shorter than its payload")));
+                    ThrowsMessage<QelMessageValidationException>(StrEq("the response is too short")));
     }
     EXPECT_NO_THROW(asJson(tool::timeRequest(), response(0x6003, 0x0107, std::string(9, '\0'))));
 }
 
-TEST(CallRequests, ATimeWithImpossibleDigitsIsPrintedAsItIs)
+TEST(CallRequests, ATimeWithADigitAbove9IsABrokenProtocol)
 {
-    EXPECT_EQ(asJson(tool::timeRequest(), response(0x6003, 0x0107, std::string(8, '\xFF'))),
-              R"({"time":"16665-165-165T165:165:165Z"})");
+    const std::string good("\x20\x24\x03\x05\x06\x07\x08\xFF", 8); // the last byte is reserved
+    EXPECT_EQ(asJson(tool::timeRequest(), response(0x6003, 0x0107, good)), R"({"time":"2024-03-05T06:07:08Z"})");
+    for (std::size_t digit = 0; digit < 14; ++digit) {
+        SCOPED_TRACE(digit);
+        std::string bad = good;
+        char& byte = bad[digit / 2];
+        byte = static_cast<char>(digit % 2 == 0 ? 0xA0 | (byte & 0x0F) : (byte & 0xF0) | 0x0A);
+        EXPECT_THAT([&] { asJson(tool::timeRequest(), response(0x6003, 0x0107, bad)); },
+                    ThrowsMessage<QelMessageValidationException>(StartsWith("the time of day has digits above 9: ")));
+    }
 }
 
 TEST(CallRequests, TheMaximumOfSessionsIsRead)

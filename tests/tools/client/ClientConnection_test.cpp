@@ -78,20 +78,21 @@ TEST_F(ClientConnectionTest, ARequestIsSentAndItsResponseReturned)
     EXPECT_THAT(stream->writes(), ElementsAre(frameOf(request)));
 }
 
-TEST_F(ClientConnectionTest, ARefusalIsAResponseToExchange)
+TEST_F(ClientConnectionTest, ExchangeReturnsARefusal)
 {
     deliver(responseTo(request, QelMessageStatusInvalidData));
     EXPECT_EQ(connection->exchange(request)->getStatus(), QelMessageStatusInvalidData);
 }
 
-TEST_F(ClientConnectionTest, ARefusalIsAFailureToRequire)
+TEST_F(ClientConnectionTest, RequireThrowsOnARefusal)
 {
     deliver(responseTo(request, QelMessageStatusInvalidData));
     EXPECT_THAT([&] { connection->require("the time", request); },
-                ThrowsMessage<RequestRefused>(StrEq("the time refused: 0x00000003 (QelMessageStatusInvalidData)")));
+                ThrowsMessage<RequestRefused>(StrEq(
+                    "the server does not accept the values in the request: 0x00000003 (QelMessageStatusInvalidData)")));
 }
 
-TEST_F(ClientConnectionTest, NoticesAreHandedOnWhileAResponseIsAwaited)
+TEST_F(ClientConnectionTest, NoticesBeforeTheResponseGoToTheHandler)
 {
     deliver(QelMessageDaxBroadcastOutboundAsync(1, 7, "them", "x"));
     deliver(QelMessageGetQelTodReq()); // what a hypervisor should not send is handed on as well
@@ -109,34 +110,34 @@ TEST_F(ClientConnectionTest, WithoutAHandlerNoticesAreDropped)
     EXPECT_NE(connection->exchange(request), nullptr);
 }
 
-TEST_F(ClientConnectionTest, AHypervisorThatWantsTlsEndsTheExchange)
+TEST_F(ClientConnectionTest, TheAbortNoticeEndsTheExchange)
 {
     deliver(QelMessageAbortHandshakeAsync());
     EXPECT_THAT([&] { connection->exchange(request); },
-                ThrowsMessage<CommandFailure>(
-                    StrEq("the hypervisor end turned this console away: it wants to be asked for TLS")));
+                ThrowsMessage<CommandFailure>(StrEq("the server refused the connection: it accepts only TLS; give "
+                                                    "credentials instead of --plain")));
     deliver(QelMessageAbortHandshakeAsync());
     EXPECT_EQ(exitStatusOf([&] { connection->exchange(request); }), ExitStatus::Refused);
 }
 
-TEST_F(ClientConnectionTest, APlainConnectionIsNotProtectedAndHoldsNothingBack)
+TEST_F(ClientConnectionTest, APlainConnectionIsNotProtectedAndHasNothingPending)
 {
     EXPECT_FALSE(connection->isProtected());
     EXPECT_FALSE(connection->hasPending());
 }
 
-TEST_F(ClientConnectionTest, LettingInAConnectionWithoutAnEndChangesNoDeadline)
+TEST_F(ClientConnectionTest, EndOfTheHandshakeWithoutADeadlineChangesNoDeadline)
 {
-    connection->letIn();
+    connection->onHandshakeDone();
     EXPECT_TRUE(stream->readDeadlines().empty());
     EXPECT_TRUE(stream->writeDeadlines().empty());
 }
 
-TEST_F(ClientConnectionTest, TheNoticeThatTheConnectionClosesEndsTheExchange)
+TEST_F(ClientConnectionTest, TheConnectionClosedNoticeEndsTheExchange)
 {
     deliver(QelMessageKrogConnectionClosedAsync());
     EXPECT_THAT([&] { connection->exchange(request); },
-                ThrowsMessage<CommandFailure>(StrEq("the hypervisor closed the connection")));
+                ThrowsMessage<CommandFailure>(StrEq("the server closed the connection")));
     deliver(QelMessageKrogConnectionClosedAsync());
     EXPECT_EQ(exitStatusOf([&] { connection->exchange(request); }), ExitStatus::ClosedByPeer);
 }
@@ -144,8 +145,9 @@ TEST_F(ClientConnectionTest, TheNoticeThatTheConnectionClosesEndsTheExchange)
 TEST_F(ClientConnectionTest, AResponseToAnotherRequestIsABrokenProtocol)
 {
     deliver(responseTo(QelMessageGetQelTodReq()));
-    EXPECT_THAT([&] { connection->exchange(request); },
-                ThrowsMessage<CommandFailure>(StrEq("response to a request that was not made")));
+    EXPECT_THAT(
+        [&] { connection->exchange(request); },
+        ThrowsMessage<CommandFailure>(StrEq("the peer broke the protocol: a response to a request that was not sent")));
 }
 
 TEST_F(ClientConnectionTest, AResponseOfAnotherKindIsABrokenProtocol)
@@ -155,7 +157,8 @@ TEST_F(ClientConnectionTest, AResponseOfAnotherKindIsABrokenProtocol)
                                 static_cast<unsigned short>(identity.second), MsgResponse);
         deliver(other);
         EXPECT_THAT([&] { connection->exchange(request); },
-                    ThrowsMessage<CommandFailure>(StrEq("response of another kind than its request")));
+                    ThrowsMessage<CommandFailure>(
+                        StrEq("the peer broke the protocol: a response of another kind than its request")));
         deliver(other);
         EXPECT_EQ(exitStatusOf([&] { connection->exchange(request); }), ExitStatus::ProtocolBroken);
     }
@@ -187,7 +190,7 @@ TEST_F(ClientConnectionTest, DeadlinesAreSetAndClearedForBothDirections)
     EXPECT_THAT(stream->writeDeadlines(), ElementsAre(std::chrono::milliseconds(250), std::chrono::milliseconds(-1)));
 }
 
-TEST_F(ClientConnectionTest, MessagesGoAndComeWithoutAnExchange)
+TEST_F(ClientConnectionTest, MessagesAreSentAndReceivedWithoutAnExchange)
 {
     deliver(QelMessageKrogConnectionClosedAsync());
     connection->send(request);
@@ -195,7 +198,7 @@ TEST_F(ClientConnectionTest, MessagesGoAndComeWithoutAnExchange)
     EXPECT_EQ(connection->receive()->getOperation(), 0xA009U);
 }
 
-TEST_F(ClientConnectionTest, WithoutADescriptorThereIsNothingToWaitOn)
+TEST_F(ClientConnectionTest, WithoutADescriptorThePollFdIsIgnored)
 {
     EXPECT_EQ(connection->getPollFd(PollEvents::Read).mFd.fd, -1);
     const ClientConnection other(std::make_unique<ScriptedStream>(), 42);
@@ -227,14 +230,14 @@ TEST_F(ClientConnectionTest, IntroducingSendsTheIdentity)
     EXPECT_EQ(version.getMinorVersion(), 0U);
 }
 
-TEST_F(ClientConnectionTest, OpeningTheSessionIsARequestLikeAnyOther)
+TEST_F(ClientConnectionTest, OpeningTheSessionSendsItsRequest)
 {
     const unsigned int callerId = QelMessage::generateNextUint32() + 1;
     QelMessageGeneric refusal(callerId, 0x6003, 0x0102, MsgResponse);
     refusal.setStatus(QelMessageStatusKrogSessionAlreadyOpen);
     deliver(refusal);
     EXPECT_THAT([&] { tool::openHypervisorSession(*connection); },
-                ThrowsMessage<RequestRefused>(HasSubstr("open session refused: 0x00000017")));
+                ThrowsMessage<RequestRefused>(HasSubstr("this console has opened its session already: 0x00000017")));
 }
 
 // With real sockets.
@@ -264,7 +267,7 @@ TEST(ClientConnection, WhereNobodyListensThereIsNoConnection)
     }
 }
 
-TEST(ClientConnection, TheTimeLeftLimitsTheExchange)
+TEST(ClientConnection, TheTimeoutLimitsTheExchange)
 {
     Socket listener = listenOn(IPEndpoint("127.0.0.1:0"), 1);
     const auto connection = ClientConnection::connect(plainTo(listener.getSocketName(), 0.1));
@@ -277,7 +280,7 @@ TEST(ClientConnection, TheTimeLeftLimitsTheExchange)
     }
 }
 
-TEST(ClientConnection, TheTimeOfTheHandshakeLimitsTheVersionRequestAndNothingAfterIt)
+TEST(ClientConnection, TheHandshakeTimeoutEndsWithTheVersionRequest)
 {
     Socket listener = listenOn(IPEndpoint("127.0.0.1:0"), 1);
     tool::ConnectOptions options = plainTo(listener.getSocketName(), 20);
@@ -303,7 +306,7 @@ TEST(ClientConnection, TheTimeOfTheHandshakeLimitsTheVersionRequestAndNothingAft
     server.join();
 }
 
-TEST(ClientConnection, LeavingWaitsForTheOtherEnd)
+TEST(ClientConnection, LeavingWaitsForThePeer)
 {
     Socket listener = listenOn(IPEndpoint("127.0.0.1:0"), 1);
     const auto connection = ClientConnection::connect(plainTo(listener.getSocketName(), 10));

@@ -9,7 +9,7 @@ namespace qel::test {
 
 namespace {
 
-TEST(ConnectOptions, TheIdentityHasADefaultOfItsOwn)
+TEST(ConnectOptions, TheToolIdDefaultsToTheProcessId)
 {
     tool::IdentityOptions options;
     EXPECT_EQ(tool::completeIdentity(options).toolId, "qel-" + std::to_string(::getpid()));
@@ -49,7 +49,7 @@ TEST(ConnectOptions, ConnectOptionsAreRead)
     EXPECT_EQ(parsed.options.identity.toolId, std::string(32, 'x'));
 }
 
-TEST(ConnectOptions, WithoutATimeoutItIsTenSeconds)
+TEST(ConnectOptions, TheTimeoutDefaultsToTenSeconds)
 {
     EXPECT_EQ(parse({"--connect", "127.0.0.1:80"}).options.timeout(), std::chrono::seconds(10));
 }
@@ -79,7 +79,7 @@ TEST(ConnectOptions, BadConnectOptionsAreRefused)
         EXPECT_NE(parse(arguments).status, 0) << CLI::detail::join(arguments, " ");
 }
 
-TEST(ConnectOptions, TheToolTypeMayHaveZerosInFront)
+TEST(ConnectOptions, TheToolTypeMayHaveLeadingZeros)
 {
     EXPECT_EQ(parse({"--connect", "127.0.0.1:80", "--tool-type", "010"}).options.identity.toolType, 10U);
 }

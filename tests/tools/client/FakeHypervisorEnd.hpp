@@ -20,7 +20,7 @@
 
 namespace qel::test {
 
-/// The stream of a console, with the hypervisor end behind it played by the test: hands every message that the console
+/// The stream of a console whose hypervisor the test plays: hands every message that the console
 /// writes to onMessage, and lets it read what push() puts there. Its descriptor is ready as that of a socket would be.
 ///
 /// A read() with nothing to read throws StreamIOException("I/O deadline"), as if the hypervisor had not answered in

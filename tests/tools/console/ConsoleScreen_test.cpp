@@ -42,13 +42,13 @@ TEST_F(ConsoleScreenTest, OutputIsKeptUntilItIsWritten)
     EXPECT_EQ(pty.read(9), "something");
 }
 
-TEST_F(ConsoleScreenTest, ALineBeginsWithTheNameOfTheProgram)
+TEST_F(ConsoleScreenTest, AMessageBeginsWithTheNameOfTheProgram)
 {
     apart.say("hello");
     EXPECT_EQ(errors.str(), "qel: hello\n");
 }
 
-TEST_F(ConsoleScreenTest, WhatCameBeforeALineStandsBeforeIt)
+TEST_F(ConsoleScreenTest, OutputBeforeAMessageIsWrittenFirst)
 {
     show(apart, "before");
     apart.say("hello");
@@ -56,7 +56,7 @@ TEST_F(ConsoleScreenTest, WhatCameBeforeALineStandsBeforeIt)
     EXPECT_EQ(pty.read(6), "before");
 }
 
-TEST_F(ConsoleScreenTest, OnOneTerminalALineBeginsALine)
+TEST_F(ConsoleScreenTest, OnASharedTerminalAMessageStartsANewLine)
 {
     together.say("first");
     show(together, "$ ");
@@ -66,7 +66,7 @@ TEST_F(ConsoleScreenTest, OnOneTerminalALineBeginsALine)
     EXPECT_EQ(errors.str(), "qel: first\n\nqel: second\nqel: third\n");
 }
 
-TEST_F(ConsoleScreenTest, InRawModeALineEndNeedsAReturn)
+TEST_F(ConsoleScreenTest, InRawModeAMessageEndsWithCarriageReturn)
 {
     mode.enterRaw();
     EXPECT_STREQ(together.lineEnd(), "\r\n");
@@ -77,7 +77,7 @@ TEST_F(ConsoleScreenTest, InRawModeALineEndNeedsAReturn)
     EXPECT_STREQ(together.lineEnd(), "\n");
 }
 
-TEST_F(ConsoleScreenTest, LinesThatGoElsewhereAreNotTouchedByRawMode)
+TEST_F(ConsoleScreenTest, MessagesToAnotherPlaceIgnoreRawMode)
 {
     mode.enterRaw();
     show(apart, "$ ");
@@ -85,7 +85,7 @@ TEST_F(ConsoleScreenTest, LinesThatGoElsewhereAreNotTouchedByRawMode)
     EXPECT_EQ(errors.str(), "qel: hello\n");
 }
 
-TEST_F(ConsoleScreenTest, OutputThatGoesElsewhereLeavesNoLineToEnd)
+TEST_F(ConsoleScreenTest, OutputToAnotherPlaceDoesNotAffectMessages)
 {
     const TemporaryDirectory directory;
     const UniqueFd file(::open(directory.file("output").c_str(), O_WRONLY | O_CREAT | O_CLOEXEC, 0600));
@@ -96,7 +96,7 @@ TEST_F(ConsoleScreenTest, OutputThatGoesElsewhereLeavesNoLineToEnd)
     EXPECT_EQ(errors.str(), "qel: hello\r\n");
 }
 
-TEST_F(ConsoleScreenTest, ABroadcastSaysWhoSentIt)
+TEST_F(ConsoleScreenTest, ABroadcastNamesItsSender)
 {
     broadcast(apart, 4294967295, "them", "hello there");
     EXPECT_EQ(errors.str(), "qel: broadcast from tool type 4294967295, \"them\": hello there\n");
@@ -108,7 +108,7 @@ TEST_F(ConsoleScreenTest, ABroadcastMayBeEmpty)
     EXPECT_EQ(errors.str(), "qel: broadcast from tool type 0, \"\": \n");
 }
 
-TEST_F(ConsoleScreenTest, ABroadcastCannotTouchTheTerminal)
+TEST_F(ConsoleScreenTest, ABroadcastIsEscaped)
 {
     broadcast(apart, 1, "a\", \x1B", std::string("\x1B[2J\r\nqel: \0\xFF", 13));
     EXPECT_EQ(errors.str(), "qel: broadcast from tool type 1, \"a\\\", \\x1b\": \\x1b[2J\\x0d\\x0aqel: \\x00\\xff\n");

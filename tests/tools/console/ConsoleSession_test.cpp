@@ -149,7 +149,9 @@ TEST_F(ConsoleSessionTest, ARefusalOfAnyStepIsReportedAndEndsTheOpening)
     const Row rows[] = {
         {QelMessageOpOpenKrogSession, "open session refused: 0x00000013 (QelMessageStatusConnectionNotAvailable)", 1},
         {QelMessageOpOpenVirtualSerialSession,
-         "open serial session refused: 0x00000013 (QelMessageStatusConnectionNotAvailable)", 2},
+         "partition 7 is held by another console; --force takes it: 0x00000013 "
+         "(QelMessageStatusConnectionNotAvailable)",
+         2},
         {QelMessageOpSetupVirtualSerialSession,
          "set up serial session refused: 0x00000013 (QelMessageStatusConnectionNotAvailable)", 3},
     };
@@ -162,7 +164,7 @@ TEST_F(ConsoleSessionTest, ARefusalOfAnyStepIsReportedAndEndsTheOpening)
     }
 }
 
-TEST_F(ConsoleSessionTest, WhatIsTypedIsSent)
+TEST_F(ConsoleSessionTest, InputIsSent)
 {
     open();
     std::string typed("ls\r\0\xFF", 5);
@@ -174,9 +176,9 @@ TEST_F(ConsoleSessionTest, WhatIsTypedIsSent)
     EXPECT_EQ(std::string(data.getSerialData(), data.getSerialDataLength()), std::string("ls\r\0\xFF", 5));
 }
 
-TEST_F(ConsoleSessionTest, TheMostThatFitsAFrameIsSentAtATime)
+TEST_F(ConsoleSessionTest, AFullFrameIsSentAtATime)
 {
-    ASSERT_EQ(ConsoleSession::kMostData, 16346U);
+    ASSERT_EQ(ConsoleSession::kMaxData, 16346U);
     open();
     std::string typed(16346, 'x');
     session->send(typed);
@@ -191,7 +193,7 @@ TEST_F(ConsoleSessionTest, TheMostThatFitsAFrameIsSentAtATime)
     EXPECT_EQ(received<QelMessageVirtualSerialDataToOsAsync>(2).getSerialDataLength(), 1U);
 }
 
-TEST_F(ConsoleSessionTest, OutputIsHandedOn)
+TEST_F(ConsoleSessionTest, OutputGoesToTheReceiver)
 {
     open();
     receive(dataFrom(7, 3, "one"));
@@ -201,7 +203,7 @@ TEST_F(ConsoleSessionTest, OutputIsHandedOn)
     EXPECT_THAT(log.lines(), IsEmpty());
 }
 
-TEST_F(ConsoleSessionTest, WhatBelongsToAnotherSessionIsIgnored)
+TEST_F(ConsoleSessionTest, NoticesOfAnotherSessionAreIgnored)
 {
     open();
     receive(dataFrom(8, 3, "another partition"));
@@ -214,7 +216,7 @@ TEST_F(ConsoleSessionTest, WhatBelongsToAnotherSessionIsIgnored)
     EXPECT_THAT(log.lines(), Each(HasSubstr("ignored [CID: ")));
 }
 
-TEST_F(ConsoleSessionTest, WhatComesBeforeTheSessionIsOpenIsIgnored)
+TEST_F(ConsoleSessionTest, NoticesBeforeTheSessionIsOpenAreIgnored)
 {
     receive(dataFrom(7, 3, "early"));
     receive(ClosedNotice(7, 3, ClosedNotice::CloseReasonReadFailure));
@@ -222,7 +224,7 @@ TEST_F(ConsoleSessionTest, WhatComesBeforeTheSessionIsOpenIsIgnored)
     EXPECT_EQ(session->getEnd(), SessionEnd::None);
 }
 
-TEST_F(ConsoleSessionTest, WhatIsUnknownIsIgnored)
+TEST_F(ConsoleSessionTest, UnknownNoticesAreIgnored)
 {
     open();
     receive(QelMessageGeneric(1, 0x7000, 0x1234, NoFlagSet));
@@ -242,11 +244,10 @@ TEST_F(ConsoleSessionTest, ANoticeEndsTheSessionWithItsReason)
     const Row rows[] = {
         {0, SessionEnd::Unknown, ExitStatus::ClosedByPeer, "session closed: unknown reason"},
         {1, SessionEnd::Unknown, ExitStatus::ClosedByPeer, "session closed: unknown reason"},
-        {2, SessionEnd::Taken, ExitStatus::Refused, "session closed: force close by another console"},
-        {3, SessionEnd::ShutDown, ExitStatus::ClosedByPeer, "session closed: shutdown of the hypervisor end"},
-        {4, SessionEnd::CommandEnded, ExitStatus::Done, "session closed: read failure, the command has ended"},
-        {5, SessionEnd::WriteFailure, ExitStatus::ClosedByPeer,
-         "session closed: write failure, the partition takes no input"},
+        {2, SessionEnd::Taken, ExitStatus::Refused, "session closed: taken or closed by another console"},
+        {3, SessionEnd::ShutDown, ExitStatus::ClosedByPeer, "session closed: the server shut down"},
+        {4, SessionEnd::CommandEnded, ExitStatus::Done, "session closed: the command ended"},
+        {5, SessionEnd::WriteFailure, ExitStatus::ClosedByPeer, "session closed: the partition takes no input"},
         {9, SessionEnd::Unknown, ExitStatus::ClosedByPeer, "session closed: unknown reason"},
     };
     for (const Row& row : rows) {
@@ -274,26 +275,27 @@ TEST_F(ConsoleSessionTest, TheEndOfTheConnectionEndsTheSession)
     receive(QelMessageKrogConnectionClosedAsync());
     EXPECT_EQ(session->getEnd(), SessionEnd::ConnectionClosed);
     EXPECT_EQ(tool::exitStatusOf(SessionEnd::ConnectionClosed), ExitStatus::ClosedByPeer);
-    EXPECT_STREQ(tool::describe(SessionEnd::ConnectionClosed), "the hypervisor closed the connection");
+    EXPECT_STREQ(tool::describe(SessionEnd::ConnectionClosed), "the server closed the connection");
 }
 
-TEST_F(ConsoleSessionTest, BroadcastsAreHandedOn)
+TEST_F(ConsoleSessionTest, BroadcastsGoToTheReceiver)
 {
     open();
     receive(QelMessageDaxBroadcastOutboundAsync(2, 1, "them", "hi"));
     EXPECT_THAT(receiver.broadcasts, ElementsAre("them"));
 }
 
-TEST_F(ConsoleSessionTest, AResponseThatNobodyAskedForBreaksTheProtocol)
+TEST_F(ConsoleSessionTest, AnUnexpectedResponseBreaksTheProtocol)
 {
     open();
     const QelMessageGeneric response(99, 0x6003, 0x0107, MsgResponse);
-    EXPECT_THAT([&] { receive(response); },
-                ThrowsMessage<CommandFailure>(StrEq("response to a request that was not made")));
+    EXPECT_THAT(
+        [&] { receive(response); },
+        ThrowsMessage<CommandFailure>(StrEq("the peer broke the protocol: a response to a request that was not sent")));
     EXPECT_EQ(exitStatusOf(response), ExitStatus::ProtocolBroken);
 }
 
-TEST_F(ConsoleSessionTest, ANoticeThatIsNotWhatItSaysBreaksTheProtocol)
+TEST_F(ConsoleSessionTest, AMalformedNoticeBreaksTheProtocol)
 {
     open();
     const QelMessageGeneric malformed[] = {
@@ -304,7 +306,8 @@ TEST_F(ConsoleSessionTest, ANoticeThatIsNotWhatItSaysBreaksTheProtocol)
     for (const QelMessageGeneric& message : malformed) {
         SCOPED_TRACE(message.getOperation());
         EXPECT_EQ(exitStatusOf(message), ExitStatus::ProtocolBroken);
-        EXPECT_THAT([&] { receive(message); }, ThrowsMessage<CommandFailure>(HasSubstr("malformed notice [CID: ")));
+        EXPECT_THAT([&] { receive(message); },
+                    ThrowsMessage<CommandFailure>(HasSubstr("the peer broke the protocol: malformed notice [CID: ")));
     }
     EXPECT_EQ(receiver.output, "");
 }
@@ -334,7 +337,7 @@ TEST_F(ConsoleSessionTest, ASessionThatHasEndedIsNotClosedAgain)
     EXPECT_THAT(operations(), ElementsAre(0x0103U));
 }
 
-TEST_F(ConsoleSessionTest, NothingIsAskedOfAHypervisorThatGoesDown)
+TEST_F(ConsoleSessionTest, NothingIsSentToAHypervisorThatShutsDown)
 {
     open();
     receive(ClosedNotice(7, 3, ClosedNotice::CloseReasonQelShutdown));
@@ -342,7 +345,7 @@ TEST_F(ConsoleSessionTest, NothingIsAskedOfAHypervisorThatGoesDown)
     EXPECT_THAT(end->received, IsEmpty());
 }
 
-TEST_F(ConsoleSessionTest, NothingIsAskedOverAConnectionThatCloses)
+TEST_F(ConsoleSessionTest, NothingIsSentOverAConnectionThatCloses)
 {
     open();
     receive(QelMessageKrogConnectionClosedAsync());
@@ -350,7 +353,7 @@ TEST_F(ConsoleSessionTest, NothingIsAskedOverAConnectionThatCloses)
     EXPECT_THAT(end->received, IsEmpty());
 }
 
-TEST_F(ConsoleSessionTest, WhatComesWhileClosingIsHandedOn)
+TEST_F(ConsoleSessionTest, OutputDuringClosingGoesToTheReceiver)
 {
     open();
     end->onMessage = [&](const QelMessage& message) {
@@ -376,7 +379,7 @@ TEST_F(ConsoleSessionTest, ASessionMayEndWhileItIsClosed)
     EXPECT_EQ(session->getEnd(), SessionEnd::CommandEnded);
 }
 
-TEST_F(ConsoleSessionTest, TheHypervisorMayGoDownWhileTheSessionIsClosed)
+TEST_F(ConsoleSessionTest, TheHypervisorMayShutDownWhileTheSessionIsClosed)
 {
     open();
     end->onMessage = [&](const QelMessage& message) {
@@ -393,13 +396,14 @@ TEST_F(ConsoleSessionTest, ARefusalToCloseIsReported)
     open();
     refuse(QelMessageOpCloseVirtualSerialSession, QelMessageStatusConnectionClosureFailure);
     EXPECT_THAT([&] { session->close(); },
-                ThrowsMessage<RequestRefused>(
-                    StrEq("close serial session refused: 0x00000014 (QelMessageStatusConnectionClosureFailure)")));
+                ThrowsMessage<RequestRefused>(StrEq("this console does not hold partition 7: 0x00000014 "
+                                                    "(QelMessageStatusConnectionClosureFailure)")));
     refuse(QelMessageOpCloseKrogSession, QelMessageStatusCmdFailed);
-    EXPECT_THAT([&] { session->close(); }, ThrowsMessage<RequestRefused>(HasSubstr("close session refused: ")));
+    EXPECT_THAT([&] { session->close(); }, ThrowsMessage<RequestRefused>(HasSubstr(
+                                               "the server could not carry out the request; its log may say why: ")));
 }
 
-TEST_F(ConsoleSessionTest, EveryMessageAndEveryAnswerHasTheTimeout)
+TEST_F(ConsoleSessionTest, EachMessageAndEachResponseHasTheTimeout)
 {
     open();
     EXPECT_THAT(end->readDeadlines, IsEmpty()) << "opening has what connecting leaves";
@@ -412,7 +416,7 @@ TEST_F(ConsoleSessionTest, EveryMessageAndEveryAnswerHasTheTimeout)
     EXPECT_THAT(end->writeDeadlines, Each(Eq(kTimeout)));
 }
 
-TEST_F(ConsoleSessionTest, NobodyIsToldOnceTheSessionObjectIsGone)
+TEST_F(ConsoleSessionTest, DestructionRemovesTheNoticeHandler)
 {
     open();
     session.reset();

@@ -77,7 +77,7 @@ TEST_P(EscapeFilterRows, TypedKeyByKey) { type(GetParam(), 1); }
 INSTANTIATE_TEST_SUITE_P(All, EscapeFilterRows, ::testing::ValuesIn(rows()),
                          [](const auto& row) { return row.param.name; });
 
-TEST(EscapeFilter, WhatIsTypedBehindACommandStays)
+TEST(EscapeFilter, InputAfterACommandIsKept)
 {
     EscapeFilter filter('~');
     std::string typed = "~.rest";
@@ -99,7 +99,7 @@ TEST(EscapeFilter, TheEscapeCharacterAloneWaitsForTheNext)
     EXPECT_EQ(forPartition, "~a");
 }
 
-TEST(EscapeFilter, AnyCharacterCanBeTheEscape)
+TEST(EscapeFilter, AnyOtherCharacterCanBeTheEscape)
 {
     EscapeFilter filter('\x1D');
     std::string typed = "~.\r\x1D\x1D\r\x1D.";
@@ -108,14 +108,14 @@ TEST(EscapeFilter, AnyCharacterCanBeTheEscape)
     EXPECT_EQ(forPartition, "~.\r\x1D\r");
 }
 
-TEST(EscapeFilter, WithoutAnEscapeEverythingIsForThePartition)
+TEST(EscapeFilter, WithoutAnEscapeEverythingIsInput)
 {
     EscapeFilter filter(std::nullopt);
     std::string typed = "~.\r~?\r~~";
     std::string forPartition;
     EXPECT_EQ(filter.take(typed, forPartition), Command::None);
     EXPECT_EQ(forPartition, "~.\r~?\r~~");
-    EXPECT_EQ(filter.help("\n"), "there is no escape character");
+    EXPECT_EQ(filter.help("\n"), "no escape character is set");
 }
 
 TEST(EscapeFilter, HelpNamesTheCommands)
@@ -129,7 +129,7 @@ TEST(EscapeFilter, HelpNamesTheCommands)
               "at the start of a line:|  ^].   leave|  ^]^Z  suspend this program|  ^]?   this list|  ^]^]   type ^]");
 }
 
-TEST(EscapeFilter, CharactersWithAMeaningCannotBeTheEscape)
+TEST(EscapeFilter, CommandCharactersCannotBeTheEscape)
 {
     for (const char c : {'.', '?', '\x1A', '\r', '\n'})
         EXPECT_TRUE(EscapeFilter::isCommandCharacter(c)) << int{c};

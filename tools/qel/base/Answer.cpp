@@ -5,6 +5,8 @@
 #include "base/Text.hpp"
 
 #include <algorithm>
+#include <array>
+#include <cstdio>
 
 namespace qel::tool {
 
@@ -13,6 +15,35 @@ namespace {
 std::string asText(const nlohmann::ordered_json& value)
 {
     return value.is_string() ? value.get<std::string>() : value.dump();
+}
+
+std::string unicodeEscape(unsigned char codePoint)
+{
+    std::array<char, 8> text{};
+    std::snprintf(text.data(), text.size(), "\\u%04x", static_cast<unsigned int>(codePoint));
+    return text.data();
+}
+
+/// JSON leaves U+007F to U+009F as they are, and a terminal obeys the latter like escape sequences.
+/// @param json  a document in UTF-8
+std::string withControlsEscaped(const std::string& json)
+{
+    constexpr unsigned char kDelete = 0x7F;
+    constexpr unsigned char kLead = 0xC2; // of U+0080 to U+00BF
+    std::string escaped;
+    for (std::size_t i = 0; i < json.size(); ++i) {
+        const auto byte = static_cast<unsigned char>(json[i]);
+        const auto next = static_cast<unsigned char>(i + 1 < json.size() ? json[i + 1] : 0);
+        if (byte == kDelete) {
+            escaped += unicodeEscape(byte);
+        } else if (byte == kLead && next >= 0x80 && next <= 0x9F) {
+            escaped += unicodeEscape(next);
+            ++i;
+        } else {
+            escaped += json[i];
+        }
+    }
+    return escaped;
 }
 
 } // namespace
@@ -64,7 +95,8 @@ std::string statusName(QelMessageStatusCodes status)
 void printJson(std::ostream& os, const nlohmann::ordered_json& document)
 {
     constexpr int kIndent = 2;
-    os << document.dump(kIndent, ' ', false, nlohmann::ordered_json::error_handler_t::replace) << "\n";
+    const std::string text = document.dump(kIndent, ' ', false, nlohmann::ordered_json::error_handler_t::replace);
+    os << withControlsEscaped(text) << "\n";
 }
 
 } // namespace qel::tool

@@ -13,9 +13,9 @@ namespace qel::tool {
 
 namespace {
 
-/// A terminal that takes nothing is reported to be ready for writing as soon as it has room for one byte; a write of
-/// more would wait, with the signals that end this program blocked.
-/// @return none when it is no terminal, or cannot be opened
+/// poll() reports a terminal as writable when it has room for one byte. A longer write could block while SignalWatch
+/// blocks the termination signals, so the terminal is opened with O_NONBLOCK.
+/// @return none when the descriptor is not a terminal, or cannot be opened
 UniqueFd openTerminal(int descriptor)
 {
     unsigned int number = 0;
@@ -61,7 +61,7 @@ void DescriptorOutput::flush()
 
 bool DescriptorOutput::pIsReady() const { return PollSet(getPollFd()).poll().anyReady(); }
 
-/// @return how many bytes were taken; 0: none at the moment
+/// @return the number of bytes written; 0: none at the moment
 std::size_t DescriptorOutput::pWrite(const char* data, std::size_t length) const
 {
     const ssize_t count = ::write(mDescriptor, data, std::min<std::size_t>(length, PIPE_BUF));

@@ -9,43 +9,43 @@
 
 namespace qel::tool {
 
-/// Writes to a descriptor, such as standard output, without ever waiting for it: what it does not take yet is kept.
+/// Writes to a descriptor, such as standard output, without blocking. Keeps what the descriptor does not take yet.
 ///
-/// The descriptor's own file description is left as it is, because other processes share it: making it non-blocking
-/// would make theirs non-blocking too. A terminal is opened anew for that reason; to anything else no more is written
-/// at a time than it takes without waiting once it is ready for writing (see pipe(7): PIPE_BUF).
+/// The descriptor's file description stays unchanged, because other processes share it: O_NONBLOCK would apply to them
+/// too. A terminal is therefore opened again. To anything else at most PIPE_BUF bytes are written at a time, and only
+/// when it is ready, so that the write does not block (pipe(7)).
 ///
 /// Ownership: borrows the descriptor. Thread safety: one thread.
 class DescriptorOutput {
 public:
-    /// Bytes that may be kept before hasRoom() is false.
+    /// hasRoom() is false once this many bytes are kept.
     static constexpr std::size_t kRoom = 64 * 1024;
 
     explicit DescriptorOutput(int descriptor);
 
-    /// Keeps bytes for the descriptor, beyond kRoom too.
+    /// Keeps bytes for the descriptor, even beyond kRoom.
     void append(const char* data, std::size_t length);
 
     bool isEmpty() const noexcept { return mKept.empty(); }
     bool hasRoom() const noexcept { return mKept.size() < kRoom; }
 
-    /// True when the last byte that was appended ended a line, and when there was none yet.
+    /// True when the last byte that was appended is a line feed, and before the first byte.
     bool endsLine() const noexcept { return mEndsLine; }
 
-    /// Ready once writeSome() gets on.
+    /// Ready when writeSome() can write.
     PollFd getPollFd() const;
 
-    /// Writes what the descriptor takes at once. @throws PosixError  it cannot be written to
+    /// Writes what the descriptor takes without blocking. @throws PosixError  writing failed
     void writeSome();
 
-    /// Writes everything, and waits as long as that takes. @throws PosixError  as writeSome()
+    /// Writes everything and waits without limit. @throws PosixError  writing failed
     void flush();
 
 private:
     bool pIsReady() const;
     std::size_t pWrite(const char* data, std::size_t length) const;
 
-    UniqueFd mOwn; ///< the terminal, opened anew; none for anything else
+    UniqueFd mOwn; ///< the terminal, opened again; none for anything else
     int mDescriptor;
     std::string mKept;
     bool mEndsLine = true;

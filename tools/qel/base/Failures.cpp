@@ -5,6 +5,8 @@
 #include <qel/common/io/StreamIOException.hpp>
 #include <qel/common/util/PosixError.hpp>
 
+#include "base/RefusalReason.hpp"
+
 #include <cerrno>
 #include <cstring>
 
@@ -12,8 +14,8 @@ namespace qel::tool {
 
 namespace {
 
-// The stream layer reports a passed deadline in two shapes: with this text when it had passed before the wait began,
-// and as the system's "try again" when it passed during the wait.
+// A stream reports a passed deadline in two ways: with this text when the deadline passed before the wait began, and
+// with the system's EAGAIN as the cause when it passed during the wait.
 constexpr const char* kDeadlineText = "I/O deadline";
 
 bool isDeadline(const StreamIOException& error)
@@ -30,6 +32,12 @@ bool isDeadline(const StreamIOException& error)
     return false;
 }
 
+std::string refusalText(const std::string& step, const QelMessage& response, const std::string& subject)
+{
+    const std::string reason = refusalReason(response, subject);
+    return (reason.empty() ? step + " refused" : reason) + ": " + toString(response.getStatus());
+}
+
 } // namespace
 
 CommandFailure::CommandFailure(ExitStatus status, const std::string& reason)
@@ -38,8 +46,8 @@ CommandFailure::CommandFailure(ExitStatus status, const std::string& reason)
 
 CommandFailure::~CommandFailure() = default;
 
-RequestRefused::RequestRefused(const std::string& step, const QelMessage& response)
-    : CommandFailure(ExitStatus::Refused, step + " refused: " + toString(response.getStatus())), mStep(step),
+RequestRefused::RequestRefused(const std::string& step, const QelMessage& response, const std::string& subject)
+    : CommandFailure(ExitStatus::Refused, refusalText(step, response, subject)), mStep(step),
       mStatus(response.getStatus()), mStatusDetail(response.getStatusDetail())
 {}
 
@@ -73,9 +81,9 @@ std::string userMessage(const std::exception& error)
     if (dynamic_cast<const CommandFailure*>(&error) != nullptr) return explain(error);
     switch (exitStatusOf(error)) {
     case ExitStatus::ProtocolBroken:
-        return "the other end broke the protocol: " + explain(error);
+        return "the peer broke the protocol: " + explain(error);
     case ExitStatus::DeadlinePassed:
-        return "the other end did not answer in time: " + explain(error);
+        return "the peer did not answer in time: " + explain(error);
     case ExitStatus::ClosedByPeer:
         return "connection lost: " + explain(error);
     default:

@@ -10,7 +10,7 @@
 
 namespace qel::tool {
 
-/// A command gives up; says with which exit status and, in what(), why, as one line for a person to read.
+/// Ends a command: carries the exit status and, in what(), the reason in one line for a person.
 class CommandFailure : public std::runtime_error {
 public:
     CommandFailure(ExitStatus status, const std::string& reason);
@@ -22,12 +22,15 @@ private:
     ExitStatus mStatus;
 };
 
-/// The other end answered a request with a status other than zero. Ends a command with ExitStatus::Refused.
+/// The peer answered a request with a status other than zero. Ends a command with ExitStatus::Refused.
+/// what() is the reason in words, then the status: "partition 3 is held by another console; --force takes it:
+/// 0x00000013 (QelMessageStatusConnectionNotAvailable)". See refusalReason().
 class RequestRefused : public CommandFailure {
 public:
-    /// @param step  what was asked for, in a word or two, such as "open session"
+    /// @param step  the name of the request, such as "open session"; part of what() only for an unknown status
     /// @param response  borrowed for the call; its status and status detail are kept
-    RequestRefused(const std::string& step, const QelMessage& response);
+    /// @param subject  what the request is about, as refusalReason() takes it
+    RequestRefused(const std::string& step, const QelMessage& response, const std::string& subject = {});
     ~RequestRefused() override;
 
     const std::string& getStep() const noexcept { return mStep; }
@@ -40,16 +43,15 @@ private:
     unsigned short mStatusDetail;
 };
 
-/// Which exit status an exception of the library or of this program ends a command with:
-/// CommandFailure its own; QelMessageValidationException ProtocolBroken; StreamIOException DeadlinePassed when a
-/// deadline passed and ClosedByPeer otherwise; everything else Failed.
+/// The exit status for an exception: CommandFailure has its own; QelMessageValidationException is ProtocolBroken;
+/// StreamIOException is DeadlinePassed when a deadline passed, else ClosedByPeer; everything else is Failed.
 ExitStatus exitStatusOf(const std::exception& error);
 
-/// One line that says what happened, the nested causes included: "outer: inner".
+/// The exception and its nested causes in one line: "outer: inner".
 std::string explain(const std::exception& error);
 
-/// The line for whoever typed the command: explain(), and in front of what the library says of a connection, which is a
-/// short phrase such as "EOF", what that means for the command. A CommandFailure says so itself.
+/// The line that the user reads. The library's phrase about a connection is short, such as "EOF", so what it means for
+/// the command comes first: "connection lost: EOF". A CommandFailure is complete as it is.
 std::string userMessage(const std::exception& error);
 
 } // namespace qel::tool

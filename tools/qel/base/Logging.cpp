@@ -33,13 +33,13 @@ public:
 private:
     void pLog(const std::string& line) override
     {
-        // One call a line, so that lines stay whole beside those of other processes on the same terminal.
+        // One call for each line, so that lines of several processes on a terminal do not mix.
         const std::string whole = line + lineEndOf(STDERR_FILENO);
         static_cast<void>(std::fwrite(whole.data(), 1, whole.size(), stderr));
     }
 };
 
-/// Stricter than the library, which takes a text that begins with a number, and the level of a parent for a level.
+/// Stricter than LogLevel::parse(), which accepts text after a number, and "inherit".
 bool isLevel(const std::string& text)
 {
     try {
@@ -66,12 +66,11 @@ std::string checkDirectory(std::string& name)
 std::string describeLevels(const LogOptions& options)
 {
     const std::string usual = Utilities::lowercase(LogLevel::getName(options.usual));
-    return "Write lines of this level and above: debug, info, warn, error or critical; " +
-           (options.quiet ? "nothing is written unless this or --log-dir is given, then " + usual
-                          : usual + " unless given");
+    return "Log lines of this level and above: debug, info, warn, error or critical (default: " +
+           (options.quiet ? "no log; with --log-dir " + usual : usual) + ")";
 }
 
-/// The back-end drops its lines without a word when it cannot open its file; whoever wants a log wants to know that.
+/// The back-end drops lines silently when it cannot open its file, so check that first.
 void requireWritable(const std::string& path)
 {
     const UniqueFd file(::open(path.c_str(), O_WRONLY | O_APPEND | O_NONBLOCK | O_CLOEXEC));
@@ -84,13 +83,13 @@ void requireWritable(const std::string& path)
 void addLogOptions(CLI::App& app, LogOptions& options)
 {
     app.add_option("--log-dir", options.directory,
-                   "Write the log to files in this directory, five of them at most; without it, to standard error")
+                   "Write the log to files in this directory, at most five, instead of standard error")
         ->type_name("DIR")
         ->check(CLI::Validator(checkDirectory, ""));
     app.add_option("--log-level", options.level, describeLevels(options))
         ->type_name("LEVEL")
         ->check(CLI::Validator(checkLevel, ""));
-    app.add_option("--log-size", options.fileBytes, "Bytes that one log file may hold")
+    app.add_option("--log-size", options.fileBytes, "Maximum size of one log file")
         ->type_name("BYTES")
         ->transform(integerIn(4096, std::uint64_t{1} << 40))
         ->capture_default_str();

@@ -10,30 +10,29 @@
 
 namespace qel::tool {
 
-/// Where the log goes and how much of it is written.
+/// Options of the log.
 struct LogOptions {
     std::string directory; ///< of the rotating files; empty: standard error
-    std::string level;     ///< as LogLevel::parse() takes it; empty: not said
+    std::string level;     ///< as LogLevel::parse() takes it; empty: not given
     std::size_t fileBytes = 1024 * 1024;
 
-    LogLevel::Level usual = LogLevel::Info; ///< the level unless one is said
-    bool quiet = false; ///< without any of the options nothing is logged: for commands whose output is their answer
+    LogLevel::Level usual = LogLevel::Info; ///< the default level
+    bool quiet = false;                     ///< log nothing unless --log-dir or --log-level is given
 };
 
-/// Adds --log-dir, --log-level and --log-size. The help says what is logged unless they are given, so `usual` and
-/// `quiet` have to be set before.
+/// Adds --log-dir, --log-level and --log-size. Set `usual` and `quiet` before: the help text depends on them.
 void addLogOptions(CLI::App& app, LogOptions& options);
 
-/// Gives the root logger its back-end and level.
+/// Sets the back-end and the level of the root logger.
 /// @param name  of the log file within the directory
-/// @throws FileIOError  the log file cannot be written; later trouble with it goes to the system log alone
+/// @throws FileIOError  the log file cannot be written; later failures go to the system log
 void startLogging(const LogOptions& options, const std::string& name);
 
-/// The logger of this program's own lines, which tells them from the library's: "[qel] ".
+/// The logger of this program, whose lines begin with "[qel] ".
 /// Thread safety: any thread.
 QelLogger& programLogger();
 
-/// Writes one line to the program's logger when its level is enabled.
+/// Logs one line if the level is enabled.
 template <typename... Parts>
 void logLine(LogLevel::Level level, const Parts&... parts)
 {
@@ -43,7 +42,7 @@ void logLine(LogLevel::Level level, const Parts&... parts)
     (line << ... << parts);
 }
 
-/// Writes each line of a text as a line of its own.
+/// Logs each line of a text separately.
 void logLines(LogLevel::Level level, const std::string& text);
 
 } // namespace qel::tool

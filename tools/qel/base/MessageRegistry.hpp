@@ -4,7 +4,7 @@
 
 namespace qel::tool {
 
-/// The messages that consoles and hypervisors exchange; one registry for the whole process.
+/// The registry of the messages between consoles and hypervisors; one for the process.
 /// Thread safety: any thread.
 inline QelMessageRegistry& messageRegistry()
 {

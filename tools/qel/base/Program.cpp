@@ -51,7 +51,7 @@ void addStandardFlags(CLI::App& app)
 
 void addJsonOption(CLI::App& app, bool& json)
 {
-    app.add_flag("--json", json, "Print one JSON document instead of text for people");
+    app.add_flag("--json", json, "Print one JSON document instead of text");
 }
 
 CLI::App& addCommand(CLI::App& parent, const char* name, const char* description)
@@ -77,8 +77,8 @@ void reserveStandardDescriptors() noexcept
 {
     for (int descriptor = STDIN_FILENO; descriptor <= STDERR_FILENO; ++descriptor) {
         if (::fcntl(descriptor, F_GETFD) != -1) continue;
-        // The lowest free descriptor is this one. It is opened for what is not done with it, so that using it fails
-        // just as it did before.
+        // open() returns the lowest free descriptor, which is this one. The access mode is the wrong one on purpose:
+        // using the descriptor fails, as it did while it was closed.
         static_cast<void>(::open("/dev/null", descriptor == STDIN_FILENO ? O_WRONLY : O_RDONLY));
     }
 }

@@ -7,10 +7,10 @@
 
 namespace qel::tool {
 
-/// What the command line asked for. Parsing only chooses it; it runs once the whole line has been understood.
+/// What the command line asks for. Parsing only selects it; it runs after the whole command line has been parsed.
 using Action = std::function<ExitStatus()>;
 
-/// Gives an app the options that stand at every level: --help (-h) and --version.
+/// Adds the options of every level: --help (-h) and --version.
 void addStandardFlags(CLI::App& app);
 
 /// Adds --json.
@@ -21,17 +21,16 @@ void addJsonOption(CLI::App& app, bool& json);
 CLI::App& addCommand(CLI::App& parent, const char* name, const char* description);
 
 /// Parses the command line, runs the chosen action, and reports failures on standard error as "qel: reason".
-/// @param action  where the subcommands of `app` leave what is to run
+/// @param action  set by the subcommands of `app` during parsing
 /// @return the exit status of the process
 int runProgram(CLI::App& app, Action& action, int argc, const char* const* argv) noexcept;
 
-/// Sees to it that a standard descriptor which was closed when this process was started does not become the number of
-/// something else: a connection would otherwise be read as standard input, or take what was meant for a person.
-/// runProgram() begins with it.
+/// Opens /dev/null for each standard descriptor that was closed when this process started. Otherwise a socket could get
+/// its number, and be read as standard input or receive messages for the user. runProgram() calls it first.
 void reserveStandardDescriptors() noexcept;
 
-/// Makes sure that what went to standard output has left the process.
-/// @throws CommandFailure  Failed: it could not be written
+/// Flushes standard output.
+/// @throws CommandFailure  Failed: writing failed
 void flushOutput();
 
 } // namespace qel::tool

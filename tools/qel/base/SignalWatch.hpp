@@ -9,24 +9,24 @@
 
 namespace qel::tool {
 
-/// Turns signals into something to wait for. While it lives they are blocked in the thread that made it and in all
-/// threads that this one starts: make it before the threads. See signalfd(2).
+/// Makes signals readable from a descriptor (signalfd(2)). Blocks them in the constructing thread and in the threads
+/// that it starts later, until destruction: construct it before starting threads.
 /// Thread safety: one thread.
 class SignalWatch {
 public:
-    /// @throws PosixError  no descriptor is left
+    /// @throws PosixError  the descriptor cannot be created
     explicit SignalWatch(std::initializer_list<int> signals);
 
-    /// The signals are as before.
+    /// Restores the signal mask.
     ~SignalWatch();
 
     SignalWatch(const SignalWatch&) = delete;
     SignalWatch& operator=(const SignalWatch&) = delete;
 
-    /// Readable once one of the signals has come.
+    /// Readable when a signal is pending.
     PollFd getPollFd() const;
 
-    /// Takes one signal. @return its number; 0: none has come
+    /// Reads one signal. @return its number; 0: none is pending
     int take();
 
 private:

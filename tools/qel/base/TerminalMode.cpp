@@ -16,7 +16,7 @@ termios rawFrom(const termios& original)
     return raw;
 }
 
-/// At once, not after what is still to be printed: that may take for ever on a terminal which has been halted.
+/// TCSANOW: waiting for pending output (TCSADRAIN) may take forever on a halted terminal.
 bool setAttributes(int descriptor, const termios& attributes)
 {
     int result = 0;
@@ -26,7 +26,7 @@ bool setAttributes(int descriptor, const termios& attributes)
     return result == 0;
 }
 
-/// A process group that is not the terminal's foreground one would be stopped for changing it.
+/// True when another process group is in the foreground. Changing the mode from the background stops this process.
 bool servesAnotherJob(int descriptor)
 {
     const pid_t foreground = ::tcgetpgrp(descriptor);

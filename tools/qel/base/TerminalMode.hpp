@@ -4,11 +4,11 @@
 
 namespace qel::tool {
 
-/// Puts a terminal into raw mode, in which every key goes through as it is typed and nothing is done to what is
-/// printed, and puts it back as it was: when told, and in any case when this object goes.
+/// Puts a terminal into raw mode, in which keys are delivered as typed and output is unprocessed (termios(3)), and
+/// restores its mode in restore() or at the latest on destruction.
 ///
-/// For a descriptor that is no terminal nothing is ever done. Whoever stops this process in between stops it in raw
-/// mode unless restore() came first. Sources: termios(3), tty_ioctl(4).
+/// Does nothing for a descriptor that is not a terminal. Call restore() before stopping this process; otherwise the
+/// terminal stays in raw mode while the process is stopped.
 ///
 /// Ownership: borrows the descriptor. Thread safety: one thread.
 class TerminalMode {
@@ -27,24 +27,25 @@ public:
     /// True from enterRaw() to restore(): a line end must be written as "\r\n".
     bool isRaw() const noexcept { return mIsRaw; }
 
-    /// Puts the terminal into raw mode, again if need be: somebody else may have changed it. What restore() goes back
-    /// to is what was found the first time. Typed characters that nobody has read yet are kept.
-    /// @throws PosixError  the terminal's mode cannot be changed
+    /// Puts the terminal into raw mode, also when it was in raw mode before: another process may have changed it. Keeps
+    /// unread input. The first call saves the mode that restore() sets.
+    /// @throws PosixError  the terminal's mode cannot be read or changed
     void enterRaw();
 
-    /// Puts the terminal back. Leaves it alone while it serves another job of the shell, which has its own idea of it.
+    /// Restores the saved mode. Does nothing while another job of the shell is in the foreground, which sets a mode of
+    /// its own.
     void restore() noexcept;
 
 private:
     int mDescriptor;
     bool mIsTerminal;
     bool mIsRaw = false;
-    bool mIsKnown = false; ///< mOriginal is set
+    bool mIsKnown = false; ///< true when mOriginal is set
     termios mOriginal{};
 };
 
-/// What ends a line that is written to a descriptor: "\r\n" for a terminal that does nothing to what is printed, as one
-/// in raw mode, whoever put it there; "\n" for everything else. Sets errno for what is no terminal.
+/// The line end for a descriptor: "\r\n" for a terminal without output processing, as in raw mode; "\n" for everything
+/// else. Sets errno when the descriptor is not a terminal.
 const char* lineEndOf(int descriptor) noexcept;
 
 } // namespace qel::tool

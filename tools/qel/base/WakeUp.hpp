@@ -7,11 +7,10 @@
 
 namespace qel::tool {
 
-/// A PollInterrupt that is known to work. One that found no descriptor would fail only when it is needed, in the middle
-/// of something that cannot fail.
+/// A PollInterrupt that reports a missing descriptor on construction rather than when it is used.
 class WakeUp : public PollInterrupt {
 public:
-    /// @throws PosixError  no descriptor is left
+    /// @throws PosixError  the descriptor cannot be created
     WakeUp()
     {
         if (getPollFd().mFd.fd < 0) throw PosixError(EMFILE, "cannot open a wake-up");

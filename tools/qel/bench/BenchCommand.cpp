@@ -26,16 +26,16 @@ namespace qel::tool {
 
 namespace {
 
-constexpr unsigned int kMostConnections = 254; // a server takes 255 consoles at most
-constexpr std::size_t kLongestToolId = 28;     // of 32, for a dash and the number of the connection
-constexpr double kHighestRate = 1e6;
-constexpr std::uint64_t kMostMessages = 1'000'000'000'000;
-constexpr double kUsualSeconds = 10;
-constexpr double kLongestSeconds = 7 * 24 * 60 * 60;
+constexpr unsigned int kMaxConnections = 254; // a server takes at most 255 consoles
+constexpr std::size_t kMaxToolId = 28;        // of 32: a dash and the connection number follow
+constexpr double kMaxRate = 1e6;
+constexpr std::uint64_t kMaxMessages = 1'000'000'000'000;
+constexpr double kDefaultSeconds = 10;
+constexpr double kMaxSeconds = 7 * 24 * 60 * 60;
 
 constexpr std::initializer_list<int> kStopSignals{SIGINT, SIGTERM, SIGHUP};
 constexpr std::chrono::milliseconds kProgressInterval(200);
-constexpr std::chrono::milliseconds kGrace(1000); // for the messages in hand when the run is interrupted
+constexpr std::chrono::milliseconds kGrace(1000); // for messages in flight when the run is interrupted
 
 struct BenchOptions {
     ConnectOptions connect;
@@ -56,19 +56,14 @@ BenchLoad makeLoad(const BenchOptions& options)
     load.rate = options.rate;
     load.count = options.count;
     const bool unlimited = options.count == 0 && options.seconds <= 0;
-    const std::chrono::duration<double> time(unlimited ? kUsualSeconds : options.seconds);
+    const std::chrono::duration<double> time(unlimited ? kDefaultSeconds : options.seconds);
     load.time = std::chrono::duration_cast<std::chrono::nanoseconds>(time);
     return load;
 }
 
-std::string hint(const CommandFailure& failure)
-{
-    const auto* refusal = dynamic_cast<const RequestRefused*>(&failure);
-    const bool full = refusal != nullptr && refusal->getStatus() == QelMessageStatusTooManyConnections;
-    return full ? "; the server takes no more consoles (--max-consoles)" : "";
-}
-
-/// Connects the console of a number, from 1 on, under a name of its own: two of one name are one to the server.
+/// Connects one console. Its tool id ends with its number, because the server refuses a second console with the same
+/// id.
+/// @param number  from 1 on
 BenchConsole connectNumber(const BenchOptions& options, unsigned int number)
 {
     ConnectOptions own = options.connect;
@@ -79,8 +74,7 @@ BenchConsole connectNumber(const BenchOptions& options, unsigned int number)
     } catch (const CommandFailure& failure) {
         if (failure.getExitStatus() != ExitStatus::Refused) throw;
         throw CommandFailure(ExitStatus::Refused, "connection " + std::to_string(number) + " of " +
-                                                      std::to_string(options.connections) + ": " + failure.what() +
-                                                      hint(failure));
+                                                      std::to_string(options.connections) + ": " + failure.what());
     }
 }
 
@@ -109,7 +103,7 @@ void showProgress(ProgressBar& bar, const BenchLoad& load, const BenchRun& run)
     bar.update(fraction, std::to_string(run.done()) + " messages, " + std::to_string(perSecond) + " a second");
 }
 
-/// Waits for the run to end, or for a signal to end it.
+/// Waits until the run ends or a signal interrupts it.
 void watchRun(BenchRun& run, const BenchLoad& load, SignalWatch& signals)
 {
     ProgressBar bar(STDERR_FILENO);
@@ -132,7 +126,7 @@ ExitStatus runBench(const BenchOptions& options, const BenchLoad& load)
     auto pairs = connectPairs(options);
     SignalWatch signals(kStopSignals);
     BenchRun run(std::move(pairs), load);
-    logLine(LogLevel::Info, options.connections, " connections are there, and messages on their way");
+    logLine(LogLevel::Info, options.connections, " connections are open; the run begins");
     watchRun(run, load, signals);
     const BenchFigures figures = run.finish();
     if (options.json) {
@@ -142,7 +136,7 @@ ExitStatus runBench(const BenchOptions& options, const BenchLoad& load)
     }
     flushOutput();
     while (signals.take() != 0)
-        continue; // one that came when all was over must not end the program as if it had been in time
+        continue; // a signal after the end of the run must not end the process: the result is complete
     return ExitStatus::Done;
 }
 
@@ -155,20 +149,25 @@ std::string checkEven(std::string& text)
 
 void addLoadOptions(CLI::App& command, BenchOptions& options)
 {
-    command.add_option("--connections", options.connections, "Consoles, of which every two send each other messages")
-        ->transform(integerIn(2, kMostConnections))
+    command
+        .add_option("--connections", options.connections,
+                    "Number of consoles; each two form a pair that exchanges messages")
+        ->transform(integerIn(2, kMaxConnections))
         ->check(CLI::Validator(checkEven, ""))
         ->capture_default_str();
-    command.add_option("--size", options.bytes, "Bytes of payload in a message")
+    command.add_option("--size", options.bytes, "Payload of a message in bytes")
         ->type_name("BYTES")
         ->transform(integerIn(1, kMaxBroadcast))
         ->capture_default_str();
-    command.add_option("--rate", options.rate, "Messages a second, all connections together; flat out unless given")
-        ->check(numberIn(0.001, kHighestRate));
-    CLI::Option* const count = command.add_option("--count", options.count, "Messages, all connections together")
-                                   ->transform(integerIn(1, kMostMessages));
-    command.add_option("--seconds", options.seconds, "How long to go on; 10 unless this or --count is given")
-        ->check(numberIn(0.001, kLongestSeconds))
+    command
+        .add_option("--rate", options.rate,
+                    "Messages per second, all connections together (default: as fast as possible)")
+        ->check(numberIn(0.001, kMaxRate));
+    CLI::Option* const count =
+        command.add_option("--count", options.count, "Number of messages, all connections together")
+            ->transform(integerIn(1, kMaxMessages));
+    command.add_option("--seconds", options.seconds, "Duration of the run (default: 10, or until --count is reached)")
+        ->check(numberIn(0.001, kMaxSeconds))
         ->excludes(count);
 }
 
@@ -176,14 +175,14 @@ void addLoadOptions(CLI::App& command, BenchOptions& options)
 
 CLI::App& addBenchCommand(CLI::App& parent, Action& action)
 {
-    CLI::App& command = addCommand(parent, "bench", "Put load on a hypervisor end and measure how it answers");
+    CLI::App& command = addCommand(parent, "bench", "Put load on a server and measure its latency");
     const auto options = std::make_shared<BenchOptions>();
     addConnectOptions(command, options->connect);
-    command.get_option("--timeout")->description("Seconds for each connection to be made, and then for each message");
+    command.get_option("--timeout")
+        ->description("Timeout in seconds: for each connection to be made, then for each message");
     command.get_option("--tool-id")
-        ->description(
-            "What the ids begin with that the consoles introduce themselves with, at most 28 bytes; a dash and "
-            "a number follow; qel-<process id> unless given");
+        ->description("Prefix of the consoles' tool ids, at most 28 bytes; a dash and a number follow (default: "
+                      "qel-<process id>)");
     addLoadOptions(command, *options);
     addJsonOption(command, options->json);
     options->log.usual = LogLevel::Warn;
@@ -191,7 +190,7 @@ CLI::App& addBenchCommand(CLI::App& parent, Action& action)
     addLogOptions(command, options->log);
     command.callback([&action, options] {
         checkTransport(options->connect.transport, options->connect.endpoint);
-        if (options->connect.identity.toolId.size() > kLongestToolId) {
+        if (options->connect.identity.toolId.size() > kMaxToolId) {
             throw CLI::ValidationError("--tool-id", "longer than 28 bytes: each connection adds its number");
         }
         action = [options] { return runBench(*options, makeLoad(*options)); };

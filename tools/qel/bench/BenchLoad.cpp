@@ -33,14 +33,14 @@ void BenchShare::run(const Exchange& exchange, const WaitUntil& waitUntil, Bench
     if (paced) figures.unsent = pUnsent(sent);
 }
 
-/// How many messages should have been sent by now, besides those that were.
+/// The number of messages that are due by now and have not been sent.
 std::uint64_t BenchShare::pUnsent(std::uint64_t sent) const
 {
     const TimePoint now = TimeProvider::steady();
     const auto wasDue = [&](std::uint64_t message) {
         return message < pMessages() && pDueTime(message) <= now && !pIsOver(pDueTime(message));
     };
-    // There may be far too many to look at each. Of two the earlier is due first, so the last is closed in on.
+    // Binary search for the last one that was due: there may be too many to look at each.
     std::uint64_t step = 1;
     while (wasDue(sent + step - 1))
         step *= 2;
@@ -51,7 +51,7 @@ std::uint64_t BenchShare::pUnsent(std::uint64_t sent) const
     return unsent;
 }
 
-/// How many messages the share has: every pair's number, and every so many from there.
+/// The number of messages of this share: those whose number modulo the number of pairs is the number of this pair.
 std::uint64_t BenchShare::pMessages() const
 {
     if (mLoad.count == 0) return std::numeric_limits<std::uint64_t>::max();

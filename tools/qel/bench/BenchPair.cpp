@@ -12,7 +12,7 @@ namespace qel::tool {
 
 namespace {
 
-/// The broadcast type that goes to one console alone.
+/// The broadcast type for a single addressee.
 constexpr std::uint8_t kUnicast = 1;
 
 bool isFrom(const QelMessageDaxBroadcastOutboundAsync& notice, const IdentityOptions& sender)
@@ -28,9 +28,9 @@ BenchPair::BenchPair(BenchConsole first, BenchConsole second, std::size_t bytes,
 
 void BenchPair::exchange()
 {
-    BenchConsole& sender = mConsoles[mTurn];
-    BenchConsole& addressee = mConsoles[1 - mTurn];
-    mTurn = 1 - mTurn;
+    BenchConsole& sender = mConsoles[mSender];
+    BenchConsole& addressee = mConsoles[1 - mSender];
+    mSender = 1 - mSender;
     sender.connection->setDeadline(mTimeout);
     addressee.connection->setDeadline(mTimeout);
     static_cast<void>(sender.connection->require(
@@ -52,18 +52,18 @@ void BenchPair::cut()
         console.connection->close();
 }
 
-/// Takes what comes to the addressee until it is the message; broadcasts of strangers may come in between.
+/// Receives at the addressee until the message arrives; broadcasts of other consoles are skipped.
 void BenchPair::pAwait(const BenchConsole& sender, BenchConsole& addressee) const
 {
     for (;;) {
         const std::unique_ptr<QelMessage> message = addressee.connection->receive();
         if (dynamic_cast<const QelMessageKrogConnectionClosedAsync*>(message.get()) != nullptr) {
-            throw CommandFailure(ExitStatus::ClosedByPeer, "the hypervisor closed the connection");
+            throw CommandFailure(ExitStatus::ClosedByPeer, "the server closed the connection");
         }
         const auto* notice = dynamic_cast<const QelMessageDaxBroadcastOutboundAsync*>(message.get());
         if (notice == nullptr || !isFrom(*notice, sender.identity)) continue;
         if (std::string(notice->getDaxPacket(), notice->getBroadcastMsgLen()) == mPayload) return;
-        throw CommandFailure(ExitStatus::ProtocolBroken, "a message did not arrive as it was sent");
+        throw CommandFailure(ExitStatus::ProtocolBroken, "the server broke the protocol: a message arrived changed");
     }
 }
 

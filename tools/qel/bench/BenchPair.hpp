@@ -12,32 +12,32 @@
 
 namespace qel::tool {
 
-/// A console of a benchmark: its connection, introduced.
+/// A console of a benchmark, after the version request.
 struct BenchConsole {
     IdentityOptions identity; ///< complete
     std::unique_ptr<ClientConnection> connection;
 };
 
-/// Two consoles that send each other messages in turn. A message is a broadcast that the one addresses to the other:
-/// its payload goes up to the hypervisor and comes down to the addressee, and the sender gets an answer. It changes
-/// nothing at the hypervisor and bothers no other console. Thread safety: one thread; cut() from any.
+/// Two consoles that alternately send each other messages. A message is a broadcast addressed to the other console: the
+/// hypervisor sends its payload on as a notice and answers the sender. It changes no state of the hypervisor and
+/// reaches no other console. Thread safety: one thread; cut() from any thread.
 class BenchPair {
 public:
     /// @param bytes  of payload, 1 to kMaxBroadcast
     /// @param timeout  for each message
     BenchPair(BenchConsole first, BenchConsole second, std::size_t bytes, std::chrono::milliseconds timeout);
 
-    /// Sends one message; returns when the sender has its answer and the addressee the message.
-    /// @throws RequestRefused  the hypervisor could not pass it on
+    /// Sends one message; returns when the sender has the response and the addressee has the message.
+    /// @throws RequestRefused  the hypervisor could not send it on
     /// @throws CommandFailure  ClosedByPeer: the hypervisor closes the connection; ProtocolBroken: what arrived is not
     ///         what was sent
     /// @throws StreamIOException, QelMessageValidationException  as ClientConnection does
     void exchange();
 
-    /// Ends both connections politely.
+    /// Ends both connections gracefully: ClientConnection::leave().
     void leave() noexcept;
 
-    /// Ends both at once: an exchange() on another thread fails.
+    /// Ends both connections at once; an exchange() on another thread throws.
     void cut();
 
 private:
@@ -46,7 +46,7 @@ private:
     std::array<BenchConsole, 2> mConsoles;
     const std::string mPayload;
     const std::chrono::milliseconds mTimeout;
-    unsigned int mTurn = 0; // whose it is to send
+    unsigned int mSender = 0; // index of the console that sends next
 };
 
 } // namespace qel::tool

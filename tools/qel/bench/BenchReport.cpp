@@ -27,7 +27,7 @@ constexpr std::uint64_t kBarWidth = 50;
 
 double seconds(nanoseconds time) { return std::chrono::duration<double>(time).count(); }
 
-/// A number with so many digits behind the point, without touching the flags of any stream.
+/// A number with `digits` decimals.
 std::string fixed(double value, int digits)
 {
     std::ostringstream text;
@@ -37,7 +37,7 @@ std::string fixed(double value, int digits)
 
 std::string microseconds(nanoseconds time) { return fixed(std::chrono::duration<double, std::micro>(time).count(), 1); }
 
-/// Messages and payload bytes per second of the time that the run took.
+/// Messages and payload bytes per second of elapsed time.
 QelMessageThroughput throughputOf(const BenchLoad& load, const BenchFigures& figures)
 {
     QelMessageThroughput throughput;

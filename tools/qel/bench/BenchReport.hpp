@@ -8,11 +8,11 @@
 
 namespace qel::tool {
 
-/// Prints the outcome of a run for people: what was measured, throughput, percentiles, and the histogram.
+/// Prints the result of a run as text: load, throughput, percentiles and histogram.
 /// @param endpoint  of the server
 void printReport(std::ostream& os, const std::string& endpoint, const BenchLoad& load, const BenchFigures& figures);
 
-/// The same as a document for programs.
+/// The same as a JSON document.
 nlohmann::ordered_json reportJson(const std::string& endpoint, const BenchLoad& load, const BenchFigures& figures);
 
 } // namespace qel::tool

@@ -63,8 +63,7 @@ BenchFigures BenchRun::finish()
 
 void BenchRun::pRunPair(std::size_t number) noexcept
 {
-    // The system may wake a thread 50 microseconds late unless asked not to, and all of it would count as latency. See
-    // prctl(2).
+    // The default timer slack wakes a thread up to 50 microseconds late, which would count as latency. See prctl(2).
     static_cast<void>(::prctl(PR_SET_TIMERSLACK, 1UL));
     try {
         pCarryShare(number);
@@ -81,7 +80,7 @@ void BenchRun::pCarryShare(std::size_t number)
     share.run([this, number] { mPairs[number]->exchange(); },
               [this](BenchShare::TimePoint time) { return pWaitUntil(time); }, mFigures[number], mDone);
     const MutexLock lock(mMutex);
-    if (--mCarrying == 0) mStop = true; // whoever interrupts it now is too late
+    if (--mCarrying == 0) mStop = true; // an interruption from now on has no effect
 }
 
 bool BenchRun::pWaitUntil(BenchShare::TimePoint time)
@@ -94,7 +93,7 @@ bool BenchRun::pWaitUntil(BenchShare::TimePoint time)
     return false;
 }
 
-/// The first failure ends the run. Those after that, or after the run was told to end, are its consequences.
+/// The first failure stops the run. Later failures, and failures after stop(), are consequences and are dropped.
 void BenchRun::pKeepFailure(std::exception_ptr failure)
 {
     const MutexLock lock(mMutex);

@@ -18,28 +18,28 @@
 
 namespace qel::tool {
 
-/// A run of a benchmark: each pair of consoles on a thread of its own, all from the same moment on.
+/// A run of a benchmark. Each pair of consoles has a thread; all share one start time.
 ///
-/// When one pair fails, the others end with the message they have in hand. A pair that is done leaves politely, on its
-/// own thread: a server that has stopped is waited for once, and not by one pair after the other.
+/// When one pair fails, the others stop after their current message. Each pair ends its connections on its own thread,
+/// so that the waits for a stopped server run in parallel.
 /// Thread safety: one thread owns it.
 class BenchRun {
 public:
     /// Starts the threads.
     /// @param pairs  as many as the load says
-    /// @throws std::system_error  there can be no more threads
+    /// @throws std::system_error  a thread cannot be started
     BenchRun(std::vector<std::unique_ptr<BenchPair>> pairs, const BenchLoad& load);
 
-    /// Cuts what still runs.
+    /// Calls cut() if the run has not finished, and joins the threads.
     ~BenchRun();
 
     BenchRun(const BenchRun&) = delete;
     BenchRun& operator=(const BenchRun&) = delete;
 
-    /// Readable once all pairs are done and have left.
+    /// Readable once all pairs have finished and closed their connections.
     PollFd getPollFd() const { return mEnded.getPollFd(); }
 
-    /// How many messages are done, so far.
+    /// Messages completed so far.
     std::uint64_t done() const noexcept { return mDone; }
 
     std::chrono::nanoseconds elapsed() const;

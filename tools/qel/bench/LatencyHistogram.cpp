@@ -8,8 +8,8 @@ namespace {
 
 using std::chrono::nanoseconds;
 
-// Values below 64 are classes of their own. Above, a value is cut to its seven leading bits: the doubling it lies in,
-// and its 64th within it.
+// Each value below 64 is a class. Above, the seven leading bits of a value select its class: the power of two, and one
+// of 64 parts of it.
 constexpr unsigned int kLeadingBits = 6;
 constexpr std::uint64_t kPerDoubling = std::uint64_t{1} << kLeadingBits;
 constexpr std::size_t kClasses = kPerDoubling * (63 - kLeadingBits + 1);
@@ -37,7 +37,7 @@ std::uint64_t endOf(std::size_t index)
     return ((index - kPerDoubling * doubling + 1) << doubling) - 1;
 }
 
-/// 1, 2, 5, 10, ... microseconds up to ten seconds, and whatever is longer.
+/// 1, 2, 5, 10, ... microseconds up to ten seconds; the last row has no limit.
 nanoseconds endOfRow(std::size_t row, std::size_t rows)
 {
     if (row + 1 == rows) return nanoseconds::max();

@@ -9,8 +9,8 @@ namespace qel::tool {
 
 namespace {
 
-constexpr std::size_t kUsualColumns = 80;
-constexpr std::size_t kLongestBar = 40;
+constexpr std::size_t kDefaultColumns = 80;
+constexpr std::size_t kMaxBar = 40;
 
 } // namespace
 
@@ -29,7 +29,7 @@ std::string ProgressBar::line(double fraction, const std::string& remark, std::s
     const std::string text = " " + std::to_string(std::lround(done * 100)) + "%  " + remark;
     const std::size_t taken = text.size() + 3; // the brackets, and one column for the cursor
     if (columns <= taken) return columns == 0 ? std::string() : text.substr(1, columns - 1);
-    const std::size_t width = std::min(columns - taken, kLongestBar);
+    const std::size_t width = std::min(columns - taken, kMaxBar);
     const auto full = static_cast<std::size_t>(done * static_cast<double>(width));
     return "[" + std::string(full, '#') + std::string(width - full, '.') + "]" + text;
 }
@@ -37,7 +37,7 @@ std::string ProgressBar::line(double fraction, const std::string& remark, std::s
 std::size_t ProgressBar::pColumns() const
 {
     winsize size{};
-    if (::ioctl(mDescriptor, TIOCGWINSZ, &size) != 0 || size.ws_col == 0) return kUsualColumns;
+    if (::ioctl(mDescriptor, TIOCGWINSZ, &size) != 0 || size.ws_col == 0) return kDefaultColumns;
     return size.ws_col;
 }
 

@@ -6,8 +6,8 @@
 
 namespace qel::tool {
 
-/// Shows on a terminal how far something has come: one line, written over again and again. Does nothing when the
-/// descriptor is no terminal, or the terminal is gone.
+/// Shows progress on one line of a terminal. Does nothing when the descriptor is not a terminal, or after writing to it
+/// failed.
 /// Thread safety: one thread.
 class ProgressBar {
 public:
@@ -22,11 +22,11 @@ public:
 
     bool isShown() const noexcept { return mShown; }
 
-    /// @param fraction  0 to 1; what is beyond counts as the nearest of these
-    /// @param remark  stands behind the bar
+    /// @param fraction  clamped to [0, 1]
+    /// @param remark  printed after the bar
     void update(double fraction, const std::string& remark);
 
-    /// The line for a terminal of so many columns; shorter than that, so that the cursor stays in it.
+    /// The line for a terminal of `columns` columns; one column shorter, so that the cursor stays on it.
     static std::string line(double fraction, const std::string& remark, std::size_t columns);
 
 private:

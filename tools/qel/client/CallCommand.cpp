@@ -24,7 +24,7 @@ struct CallOptions {
     bool json = false;
 };
 
-/// The arguments of all requests; each request looks at its own.
+/// The arguments of all requests; each request uses its own.
 struct RequestArguments {
     std::string capabilities = std::string(QelCapabilities::size(), '1');
     std::uint32_t mode = 0;
@@ -93,8 +93,8 @@ CLI::App& addRequest(CLI::App& command, Action& action, const std::shared_ptr<Ca
                      const char* description, RequestMaker make)
 {
     CLI::App& request = addCommand(command, name, description);
-    request.fallthrough(); // so that the options of "call" may also stand behind the request
-    request.footer("The options of \"qel call\", such as --connect and --json, may also stand here.");
+    request.fallthrough(); // accept the options of "call" after the request too
+    request.footer("The options of \"qel call\", such as --connect and --json, are accepted here too.");
     request.callback([&action, call, make = std::move(make)] {
         checkTransport(call->options.connect.transport, call->options.connect.endpoint);
         action = [call, make] { return runCall(call->options, make(call->arguments)); };
@@ -107,10 +107,10 @@ void addPlainRequests(CLI::App& command, Action& action, const std::shared_ptr<C
     const auto add = [&](const char* name, const char* description, CallRequest (*make)()) {
         addRequest(command, action, call, name, description, [make](const RequestArguments&) { return make(); });
     };
-    add("version", "What the hypervisor end is and which interface it speaks", versionRequest);
-    add("limits", "How large commands may be and how many consoles are served", limitsRequest);
-    add("time", "The time of day of the hypervisor end", timeRequest);
-    add("max-sessions", "How many virtual serial sessions there can be", maxSessionsRequest);
+    add("version", "Identity and interface version of the server", versionRequest);
+    add("limits", "Maximum sizes of commands, number of consoles", limitsRequest);
+    add("time", "Time of day of the server", timeRequest);
+    add("max-sessions", "Maximum number of virtual serial sessions", maxSessionsRequest);
     add("get-mode", "The global mode attribute", getModeRequest);
     add("get-metadata", "The metadata of the global save area", getMetadataRequest);
 }
@@ -120,7 +120,7 @@ void addCapabilities(CLI::App& command, Action& action, const std::shared_ptr<Ca
     CLI::App& request = addRequest(
         command, action, call, "capabilities", "Exchange capabilities",
         [](const RequestArguments& arguments) { return capabilitiesRequest(QelCapabilities(arguments.capabilities)); });
-    request.add_option("bits", call->arguments.capabilities, "What this end offers, bit 0 first; all unless given")
+    request.add_option("bits", call->arguments.capabilities, "Capabilities to offer, bit 0 first (default: all)")
         ->type_name("BITS")
         ->check(capabilityValidator());
 }
@@ -154,19 +154,19 @@ void addBroadcast(CLI::App& command, Action& action, const std::shared_ptr<Call>
 {
     RequestArguments& arguments = call->arguments;
     CLI::App& request =
-        addRequest(command, action, call, "broadcast", "Send a text to the other consoles", makeBroadcast);
-    request.add_option("text", arguments.broadcast, "What to send")->required()->check(textUpTo(kMaxBroadcast));
+        addRequest(command, action, call, "broadcast", "Send text to the other consoles", makeBroadcast);
+    request.add_option("text", arguments.broadcast, "Text to send")->required()->check(textUpTo(kMaxBroadcast));
     CLI::Option* const type =
-        request.add_option("--type", arguments.broadcastType, "Broadcast type; 1 goes to one console alone")
+        request.add_option("--type", arguments.broadcastType, "Broadcast type; type 1 goes to a single console")
             ->transform(integerIn(0, 255))
             ->capture_default_str();
-    request.add_option("--to-type", arguments.address.toolType, "Tool type of the console it goes to")
+    request.add_option("--to-type", arguments.address.toolType, "Tool type of the addressed console")
         ->transform(integerIn(0, std::numeric_limits<std::uint32_t>::max()))
         ->needs(type);
-    request.add_option("--to-id", arguments.address.toolId, "Tool id of the console it goes to")
+    request.add_option("--to-id", arguments.address.toolId, "Tool id of the addressed console")
         ->needs(type)
         ->check(textUpTo(32));
-    // The library refuses to build a broadcast to one tool that is not named; on a command line that is bad usage.
+    // The library refuses to build a type 1 broadcast without a tool id; here that is a usage error.
     request.parse_complete_callback([&arguments] {
         if (arguments.broadcastType == 1 && arguments.address.toolId.empty()) {
             throw CLI::ValidationError("--type 1 needs --to-id");
@@ -178,7 +178,7 @@ void addBroadcast(CLI::App& command, Action& action, const std::shared_ptr<Call>
 
 CLI::App& addCallCommand(CLI::App& parent, Action& action)
 {
-    CLI::App& command = addCommand(parent, "call", "Send one request to a hypervisor end and print the answer");
+    CLI::App& command = addCommand(parent, "call", "Send one request to a server and print the response");
     const auto call = std::make_shared<Call>();
     addConnectOptions(command, call->options.connect);
     addJsonOption(command, call->options.json);

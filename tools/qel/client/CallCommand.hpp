@@ -4,7 +4,7 @@
 
 namespace qel::tool {
 
-/// Adds "qel call": sends one request to the hypervisor end and prints the answer.
+/// Adds "qel call": sends one request to a server and prints the response.
 /// @param action  set when the command line asks for it
 CLI::App& addCallCommand(CLI::App& parent, Action& action);
 

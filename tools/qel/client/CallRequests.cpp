@@ -9,6 +9,8 @@
 
 #include "base/Text.hpp"
 
+#include <algorithm>
+#include <cstddef>
 #include <cstdio>
 #include <cstring>
 
@@ -16,8 +18,7 @@ namespace qel::tool {
 
 namespace {
 
-// The two responses that no registry turns into an object arrive as plain messages; these are their payloads. Offsets
-// are from the first payload byte.
+// The payloads of the two responses for which the registry has no class. Offsets are from the first payload byte.
 
 struct LimitsPayload {
     be_uint16_t maxCommandSize;     //  0  bytes
@@ -46,7 +47,7 @@ template <typename Payload>
 Payload payloadOf(const QelMessage& message)
 {
     if (message.dataLength() < sizeof(Payload)) {
-        throw QelMessageValidationException("response shorter than its payload");
+        throw QelMessageValidationException("the response is too short");
     }
     Payload payload;
     std::memcpy(&payload, message.getData(), sizeof(payload));
@@ -70,7 +71,7 @@ Answer describeCapabilities(const QelMessage& message)
 {
     const auto& response = qelMessageCast<QelMessageExchIntCapabilitiesRsp>(message);
     Answer answer;
-    answer.add("capabilities", "Capabilities of both ends", response.getCapabilities().to_string());
+    answer.add("capabilities", "Common capabilities", response.getCapabilities().to_string());
     return answer;
 }
 
@@ -87,9 +88,25 @@ Answer describeLimits(const QelMessage& message)
     return answer;
 }
 
+/// BCD has a decimal digit in each half byte.
+void requireDecimalDigits(const QelMessage& message)
+{
+    constexpr std::size_t kDigitBytes = offsetof(TimePayload, reserved);
+    const char* const bytes = message.getData();
+    const bool isDecimal = std::all_of(bytes, bytes + kDigitBytes, [](char c) {
+        const auto byte = static_cast<unsigned char>(c);
+        return (byte >> 4) <= 9 && (byte & 0x0F) <= 9;
+    });
+    if (!isDecimal) {
+        const std::string hex = hexDigits(std::string(bytes, kDigitBytes));
+        throw QelMessageValidationException("the time of day has digits above 9: " + hex);
+    }
+}
+
 Answer describeTime(const QelMessage& message)
 {
     const auto time = payloadOf<TimePayload>(message);
+    requireDecimalDigits(message);
     char text[64];
     std::snprintf(text, sizeof(text), "%04u-%02u-%02uT%02u:%02u:%02uZ", static_cast<unsigned>(time.year.value()),
                   static_cast<unsigned>(time.month.value()), static_cast<unsigned>(time.day.value()),
@@ -128,7 +145,7 @@ Answer describeMetadata(const QelMessage& message)
     return answer;
 }
 
-/// For responses that say all they have to say with their status.
+/// For responses without a payload.
 Answer describeDone(const QelMessage&) { return Answer(); }
 
 } // namespace

@@ -12,25 +12,24 @@
 #include <string>
 
 /// @file
-/// The requests that "qel call" can send and how their responses read. Nothing here does any input or output.
+/// The requests of "qel call" and the contents of their responses. No input or output happens here.
 
 namespace qel::tool {
 
-/// One request: the message, and what to make of the response to it.
+/// One request and how to read its response.
 struct CallRequest {
-    std::string name; ///< as on the command line
-    std::unique_ptr<QelMessage>
-        message;               ///< null: the version request that opens every connection is the request itself
-    bool needsSession = false; ///< the hypervisor session must be open
+    std::string name;                    ///< as on the command line
+    std::unique_ptr<QelMessage> message; ///< null: the version request, which every connection begins with anyway
+    bool needsSession = false;           ///< the hypervisor session must be open
 
-    /// Reads the response, whose status is zero.
-    /// @throws QelMessageValidationException  the response is not what its identity promises
+    /// Reads a response with status zero.
+    /// @throws QelMessageValidationException  the payload is malformed
     std::function<Answer(const QelMessage&)> describe;
 };
 
-/// To whom a broadcast goes.
+/// The addressees of a broadcast.
 struct BroadcastAddress {
-    std::uint8_t type = 0; ///< 1: to one tool, the one named by the other two
+    std::uint8_t type = 0; ///< 1: the console with this tool type and id; others: all consoles
     std::uint32_t toolType = 0;
     std::string toolId;
 };
@@ -45,7 +44,7 @@ CallRequest setModeRequest(std::uint8_t mode, const std::string& mtms);
 CallRequest getMetadataRequest();
 CallRequest setMetadataRequest(const std::string& metadata);
 /// @param text  at most kMaxBroadcast bytes
-/// @throws QelMessageValidationException  the address is one that no broadcast can be built for
+/// @throws QelMessageValidationException  type 1 without a tool id
 CallRequest broadcastRequest(const BroadcastAddress& address, const std::string& text);
 
 } // namespace qel::tool

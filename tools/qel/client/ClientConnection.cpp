@@ -23,12 +23,12 @@ namespace qel::tool {
 
 namespace {
 
-// What this console says it speaks. The hypervisor end carries the numbers as given.
+// The versions that this console reports. The hypervisor does not check them.
 constexpr std::uint32_t kInterfaceVersion = 1;
 constexpr std::uint16_t kMajorVersion = 1;
 constexpr std::uint16_t kMinorVersion = 0;
 
-constexpr std::chrono::milliseconds kLongestFarewell(1000);
+constexpr std::chrono::milliseconds kMaxFarewell(1000);
 
 Socket connectSocket(const IPEndpoint& endpoint, std::chrono::milliseconds timeout)
 {
@@ -53,7 +53,7 @@ std::unique_ptr<SocketStream> tuneSocket(Socket socket, const IPEndpoint& endpoi
 
 using TimePoint = std::chrono::steady_clock::time_point;
 
-/// From a connection in the clear to one that is protected and leads to whom it should.
+/// Upgrades a plain connection to TLS and checks the peer.
 std::unique_ptr<Stream> protect(std::unique_ptr<Stream> stream, int descriptor, SSLClientContext& context,
                                 const ConnectOptions& options, TimePoint end)
 {
@@ -104,7 +104,7 @@ std::unique_ptr<ClientConnection> ClientConnection::connect(const ConnectOptions
     return connection;
 }
 
-void ClientConnection::letIn()
+void ClientConnection::onHandshakeDone()
 {
     if (!mEnd.isDisabled()) limitTo(*mStream, mEnd);
 }
@@ -136,10 +136,11 @@ std::unique_ptr<QelMessage> ClientConnection::exchange(const QelMessage& request
     }
 }
 
-std::unique_ptr<QelMessage> ClientConnection::require(const std::string& step, const QelMessage& request)
+std::unique_ptr<QelMessage> ClientConnection::require(const std::string& step, const QelMessage& request,
+                                                      const std::string& subject)
 {
     std::unique_ptr<QelMessage> response = exchange(request);
-    if (response->getStatus() != QelMessageStatusNoError) throw RequestRefused(step, *response);
+    if (response->getStatus() != QelMessageStatusNoError) throw RequestRefused(step, *response, subject);
     return response;
 }
 
@@ -172,7 +173,7 @@ void ClientConnection::close() { mStream->close(); }
 void ClientConnection::pAwaitEnd()
 {
     std::array<char, 4096> rest;
-    mStream->setReadDeadline(kLongestFarewell);
+    mStream->setReadDeadline(kMaxFarewell);
     while (mStream->read(rest.data(), rest.size()) > 0)
         continue;
 }
@@ -180,21 +181,24 @@ void ClientConnection::pAwaitEnd()
 void ClientConnection::pCheckResponse(const QelMessage& request, const QelMessage& response) const
 {
     if (response.getCallerId() != request.getCallerId()) {
-        throw CommandFailure(ExitStatus::ProtocolBroken, "response to a request that was not made");
+        throw CommandFailure(ExitStatus::ProtocolBroken,
+                             "the peer broke the protocol: a response to a request that was not sent");
     }
     if (response.getFunction() != request.getFunction() || response.getOperation() != request.getOperation()) {
-        throw CommandFailure(ExitStatus::ProtocolBroken, "response of another kind than its request");
+        throw CommandFailure(ExitStatus::ProtocolBroken,
+                             "the peer broke the protocol: a response of another kind than its request");
     }
 }
 
 void ClientConnection::pHandleNotice(const QelMessage& message) const
 {
     if (is<QelMessageKrogConnectionClosedAsync>(message)) {
-        throw CommandFailure(ExitStatus::ClosedByPeer, "the hypervisor closed the connection");
+        throw CommandFailure(ExitStatus::ClosedByPeer, "the server closed the connection");
     }
     if (is<QelMessageAbortHandshakeAsync>(message)) {
         throw CommandFailure(ExitStatus::Refused,
-                             "the hypervisor end turned this console away: it wants to be asked for TLS");
+                             "the server refused the connection: it accepts only TLS; give credentials instead of "
+                             "--plain");
     }
     logLine(LogLevel::Debug, "notice while waiting for a response: ", message.getLogID());
     if (mNoticeHandler) mNoticeHandler(message);
@@ -214,13 +218,12 @@ std::unique_ptr<QelMessage> introduce(ClientConnection& connection, const Identi
                                                               kMinorVersion, complete.toolId);
     try {
         auto response = connection.require("version request", request);
-        connection.letIn();
+        connection.onHandshakeDone();
         return response;
     } catch (const StreamIOException& error) {
         if (!connection.isProtected() || exitStatusOf(error) != ExitStatus::ClosedByPeer) throw;
-        throw CommandFailure(ExitStatus::ClosedByPeer, "the hypervisor end closed the connection right after the TLS "
-                                                       "handshake, perhaps because it does not know this end's "
-                                                       "certificate: " +
+        throw CommandFailure(ExitStatus::ClosedByPeer, "the server closed the connection right after the TLS "
+                                                       "handshake; it may not accept this console's certificate: " +
                                                            explain(error));
     }
 }

@@ -11,8 +11,8 @@ namespace qel::tool {
 namespace {
 
 constexpr std::size_t kToolIdBytes = 32;
-constexpr double kShortestTimeout = 0.001;
-constexpr double kLongestTimeout = 24 * 60 * 60;
+constexpr double kMinTimeout = 0.001;
+constexpr double kMaxTimeout = 24 * 60 * 60;
 
 } // namespace
 
@@ -23,20 +23,20 @@ std::chrono::milliseconds ConnectOptions::timeout() const
 
 void addConnectOptions(CLI::App& app, ConnectOptions& options)
 {
-    app.add_option("--connect", options.endpoint, "The hypervisor end, as 127.0.0.1:PORT or [::1]:PORT")
+    app.add_option("--connect", options.endpoint, "Server to connect to: 127.0.0.1:PORT or [::1]:PORT")
         ->required()
         ->type_name("ENDPOINT")
         ->check(endpointValidator());
     addTransportOptions(app, options.transport);
-    app.add_option("--timeout", options.timeoutSeconds, "Seconds for connecting and all answers together")
+    app.add_option("--timeout", options.timeoutSeconds, "Timeout in seconds for connecting and all responses together")
         ->type_name("SECONDS")
-        ->check(numberIn(kShortestTimeout, kLongestTimeout))
+        ->check(numberIn(kMinTimeout, kMaxTimeout))
         ->capture_default_str();
-    app.add_option("--tool-type", options.identity.toolType, "Type that this console introduces itself with")
+    app.add_option("--tool-type", options.identity.toolType, "Tool type of this console")
         ->transform(integerIn(0, std::numeric_limits<std::uint32_t>::max()))
         ->capture_default_str();
     app.add_option("--tool-id", options.identity.toolId,
-                   "Id that this console introduces itself with, at most 32 bytes; qel-<process id> unless given")
+                   "Tool id of this console, at most 32 bytes (default: qel-<process id>)")
         ->check(textUpTo(kToolIdBytes));
 }
 

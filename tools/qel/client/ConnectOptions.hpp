@@ -9,18 +9,17 @@
 
 namespace qel::tool {
 
-/// How this process introduces itself to the hypervisor. Two consoles with the same type and id are one console to it,
-/// and the second is turned away.
+/// The identity of this console. A hypervisor refuses a second console with the same type and id.
 struct IdentityOptions {
     std::uint32_t toolType = 1;
     std::string toolId; ///< at most 32 bytes; empty: "qel-" and the process id
 };
 
-/// How to reach the hypervisor end.
+/// How to reach the server.
 struct ConnectOptions {
     std::string endpoint; ///< as IPEndpoint takes it
     TransportOptions transport;
-    double timeoutSeconds = 10; ///< for connecting and the answers to all requests together
+    double timeoutSeconds = 10; ///< for connecting and all responses together
     IdentityOptions identity;
 
     std::chrono::milliseconds timeout() const;

@@ -20,6 +20,7 @@
 #include <iostream>
 #include <memory>
 #include <optional>
+#include <sstream>
 #include <string>
 #include <unistd.h>
 
@@ -27,20 +28,20 @@ namespace qel::tool {
 
 namespace {
 
-constexpr double kLongestLinger = 24 * 60 * 60;
+constexpr double kMaxLinger = 24 * 60 * 60;
 
-/// Those that ask a program to end, and those about stopping and going on.
+/// Termination, suspension and continuation.
 constexpr std::initializer_list<int> kSignals{SIGINT, SIGTERM, SIGHUP, SIGQUIT, SIGTSTP, SIGCONT};
 
 constexpr const char* kFooter = R"(
-On a terminal, "~." at the start of a line leaves and "~?" lists what else there is. Anything but a terminal is sent as
-it is: echo 'uname -srm' | qel console ... PARTITION. When such an input ends, the partition is told by an end-of-file
-character (control-D), again after every second of silence, and everything it puts out is printed until its command
-ends. The output contains the echo of the input if the partition echoes it, as terminals do.
+On a terminal, "~." at the start of a line leaves the session and "~?" lists the other commands. Input that is not a
+terminal is sent as it is: echo 'uname -srm' | qel console ... PARTITION. At the end of such input the console sends an
+end-of-file character (control-D), repeats it after each second without output, and prints all output until the
+partition's command ends. The output includes the echo of the input if the partition echoes it, as terminals do.
 
-Exit status: 0 the command ended, or you left; 1 refused, or the hypervisor end is not who it should be, or another
-console took the session; 2 usage; 3 cannot connect; 4 something failed on this machine; 5 the hypervisor end broke the
-protocol; 6 it did not answer in time; 7 it shut down or the connection was lost.)";
+Exit status: 0 the command ended, or you left; 1 a request was refused, the server has the wrong certificate, or another
+console took the session; 2 usage error; 3 cannot connect; 4 failure on this machine; 5 the server broke the protocol;
+6 timeout; 7 the server shut down or the connection was lost.)";
 
 struct ConsoleOptions {
     ConnectOptions connect;
@@ -51,16 +52,16 @@ struct ConsoleOptions {
     std::string escape = "~";
     std::optional<double> lingerSeconds;
 
-    ConsoleManners manners() const;
+    InputOptions inputOptions() const;
 };
 
-/// "^" and the character that a control character is typed with, "^[" for escape.
+/// True for caret notation, such as "^[" for escape.
 bool isControlText(const std::string& text)
 {
     return text.size() == 2 && text[0] == '^' && text[1] >= '@' && text[1] <= '_';
 }
 
-/// "none", a character, or "^" and the one of a control character.
+/// @param text  "none", one character, or a control character in caret notation
 std::optional<char> parseEscape(const std::string& text)
 {
     if (text == "none") return std::nullopt;
@@ -81,37 +82,37 @@ std::string checkEscape(std::string& text)
     return {};
 }
 
-ConsoleManners ConsoleOptions::manners() const
+InputOptions ConsoleOptions::inputOptions() const
 {
-    ConsoleManners manners;
-    manners.escape = parseEscape(escape);
-    manners.tellsEnd = !noEof;
+    InputOptions options;
+    options.escape = parseEscape(escape);
+    options.sendsEnd = !noEof;
     if (lingerSeconds) {
-        manners.linger =
+        options.linger =
             std::chrono::duration_cast<std::chrono::milliseconds>(std::chrono::duration<double>(*lingerSeconds));
     }
-    return manners;
+    return options;
 }
 
 ConsoleLoop::Outcome join(ConsoleSession& session, ConsoleScreen& screen, TerminalMode& mode,
-                          const ConsoleManners& manners)
+                          const InputOptions& options)
 {
-    // Signals are watched for only while there is a terminal to be put back: at all other times they end this process
-    // at once, whatever it waits for.
+    // Signals are watched only while the terminal may have to be restored. At all other times they end this process at
+    // once.
     SignalWatch signals(kSignals);
-    ConsoleLoop loop(session, screen, STDIN_FILENO, mode, signals, manners);
+    ConsoleLoop loop(session, screen, STDIN_FILENO, mode, signals, options);
     return loop.run();
 }
 
-/// The session from its beginning to its end.
-ConsoleLoop::Outcome attend(ClientConnection& connection, ConsoleSession& session, ConsoleScreen& screen,
-                            TerminalMode& mode, const ConsoleOptions& options)
+/// Runs the session from opening to closing.
+ConsoleLoop::Outcome runSession(ClientConnection& connection, ConsoleSession& session, ConsoleScreen& screen,
+                                TerminalMode& mode, const ConsoleOptions& options)
 {
     try {
         session.open(options.force);
-        const ConsoleLoop::Outcome outcome = join(session, screen, mode, options.manners());
-        // Whoever is told to end does so without asking for anything; the hypervisor closes what is left behind.
-        if (outcome.departure != ConsoleLoop::Departure::Signal) session.close();
+        const ConsoleLoop::Outcome outcome = join(session, screen, mode, options.inputOptions());
+        // After a signal the process ends without further requests; the hypervisor closes its sessions.
+        if (outcome.reason != ConsoleLoop::ExitReason::Signal) session.close();
         connection.leave();
         return outcome;
     } catch (...) {
@@ -120,7 +121,7 @@ ConsoleLoop::Outcome attend(ClientConnection& connection, ConsoleSession& sessio
     }
 }
 
-/// Ends this process by a signal that it had only postponed, so that whoever started it sees why it ended.
+/// Ends this process by the signal that SignalWatch held back, so that its parent sees the signal as the reason.
 [[noreturn]] void endBy(int signal)
 {
     static_cast<void>(::raise(signal));
@@ -130,14 +131,14 @@ ConsoleLoop::Outcome attend(ClientConnection& connection, ConsoleSession& sessio
 ExitStatus conclude(const ConsoleLoop::Outcome& outcome, const ConsoleSession& session, ConsoleScreen& screen,
                     const TerminalMode& mode)
 {
-    switch (outcome.departure) {
-    case ConsoleLoop::Departure::Signal:
+    switch (outcome.reason) {
+    case ConsoleLoop::ExitReason::Signal:
         endBy(outcome.signal);
-    case ConsoleLoop::Departure::Left:
+    case ConsoleLoop::ExitReason::Left:
         screen.output().writeSome();
         if (mode.isTerminal()) screen.say("left partition " + std::to_string(session.getAddress().partition));
         return ExitStatus::Done;
-    case ConsoleLoop::Departure::Ended:
+    case ConsoleLoop::ExitReason::Ended:
         screen.output().flush();
         screen.say(describe(session.getEnd()));
         return exitStatusOf(session.getEnd());
@@ -147,19 +148,27 @@ ExitStatus conclude(const ConsoleLoop::Outcome& outcome, const ConsoleSession& s
     }
 }
 
+std::string timeoutText(const ConnectOptions& options)
+{
+    std::ostringstream text;
+    text << "timed out after " << options.timeoutSeconds << " s (--timeout): ";
+    return text.str();
+}
+
 ExitStatus runConsole(const ConsoleOptions& options)
 {
     startLogging(options.log, "qel-console.log");
-    static_cast<void>(std::signal(SIGPIPE, SIG_IGN)); // nobody reads the output: still the terminal is to be put back
+    static_cast<void>(std::signal(SIGPIPE, SIG_IGN)); // the terminal must be restored even when the output is closed
     TerminalMode mode(STDIN_FILENO);
     ConsoleScreen screen(STDOUT_FILENO, std::cerr, ::isatty(STDERR_FILENO) == 1, mode);
+    const auto connection = connectConsole(options.connect);
     try {
-        const auto connection = connectConsole(options.connect);
         ConsoleSession session(*connection, options.address, options.connect.timeout(), screen);
-        const ConsoleLoop::Outcome outcome = attend(*connection, session, screen, mode, options);
+        const ConsoleLoop::Outcome outcome = runSession(*connection, session, screen, mode, options);
         return conclude(outcome, session, screen, mode);
     } catch (const StreamIOException& error) {
-        throw CommandFailure(exitStatusOf(error), "connection lost: " + explain(error));
+        if (exitStatusOf(error) != ExitStatus::DeadlinePassed) throw;
+        throw CommandFailure(ExitStatus::DeadlinePassed, timeoutText(options.connect) + explain(error));
     }
 }
 
@@ -167,8 +176,8 @@ void addEscape(CLI::App& command, ConsoleOptions& options)
 {
     command
         .add_option("--escape", options.escape,
-                    "On a terminal: the character that begins a command to this program at the start of a line; ^X for "
-                    "a control character")
+                    "On a terminal: the character that begins a command at the start of a line; ^X means a control "
+                    "character")
         ->type_name("CHAR|none")
         ->check(CLI::Validator(checkEscape, ""))
         ->capture_default_str();
@@ -176,31 +185,30 @@ void addEscape(CLI::App& command, ConsoleOptions& options)
 
 void addInputOptions(CLI::App& command, ConsoleOptions& options)
 {
-    command.add_flag("--no-eof", options.noEof,
-                     "Do not tell the partition that the input, which is no terminal, has ended");
+    command.add_flag("--no-eof", options.noEof, "Do not send an end-of-file character at the end of the input");
     command
         .add_option("--linger", options.lingerSeconds,
-                    "Leave when the partition has been silent for so long after the end of the input, which it is then "
-                    "told only once; wait for its command to end unless given")
+                    "After the end of the input, leave once the partition has sent nothing for this long; the "
+                    "end-of-file character is then sent only once (default: wait for the command to end)")
         ->type_name("SECONDS")
-        ->check(numberIn(0.0, kLongestLinger));
+        ->check(numberIn(0.0, kMaxLinger));
 }
 
 } // namespace
 
 CLI::App& addConsoleCommand(CLI::App& parent, Action& action)
 {
-    CLI::App& command = addCommand(parent, "console", "Join the serial console of a partition to the terminal");
+    CLI::App& command = addCommand(parent, "console", "Connect the terminal to the serial console of a partition");
     const auto options = std::make_shared<ConsoleOptions>();
-    command.add_option("partition", options->address.partition, "The partition's id")
+    command.add_option("partition", options->address.partition, "Partition id")
         ->required()
         ->type_name("PARTITION")
         ->transform(integerIn(0, 65535));
     addConnectOptions(command, options->connect);
     command.get_option("--timeout")
-        ->description("Seconds for connecting and opening the session together, and then for each answer and for each "
-                      "message that has begun");
-    command.add_option("--connection", options->address.connection, "Number of the serial connection")
+        ->description("Timeout in seconds: one for connecting and opening the session, then one for each response and "
+                      "for each message once it has begun");
+    command.add_option("--connection", options->address.connection, "Serial connection of the partition")
         ->type_name("N")
         ->transform(integerIn(0, 65535))
         ->capture_default_str();

@@ -6,8 +6,8 @@
 
 namespace qel::tool {
 
-/// "qel console": joins the serial console of a partition to the terminal, or to whatever standard input and output
-/// are.
+/// Adds "qel console": connects standard input and output to the serial console of a partition.
+/// @param action  set when the command line asks for it
 CLI::App& addConsoleCommand(CLI::App& parent, Action& action);
 
 } // namespace qel::tool

@@ -17,7 +17,7 @@ namespace {
 
 constexpr char kEndOfFile = 'D' & 0x1F; // control-D
 
-/// Raw mode for as long as it lives.
+/// Raw mode from construction to destruction.
 class RawMode {
 public:
     explicit RawMode(TerminalMode& mode) : mMode(mode) { mMode.enterRaw(); }
@@ -29,16 +29,16 @@ private:
     TerminalMode& mMode;
 };
 
-/// Signals that are ignored come to a SignalWatch all the same, because it blocks them. Whoever started this process
-/// with one of them ignored, as nohup(1) does, does not want it to end by that.
+/// A SignalWatch blocks its signals, so it receives ignored ones too. A signal that was ignored when this process
+/// started, as nohup(1) does it, must not end the process.
 bool isIgnored(int signal)
 {
     struct sigaction action = {};
     return ::sigaction(signal, nullptr, &action) == 0 && action.sa_handler == SIG_IGN;
 }
 
-/// Stops this process as the signal would have done had it not been watched for; returns when it has been continued.
-/// The system does not stop it when nobody could continue it.
+/// Stops this process as SIGTSTP would without the SignalWatch; returns when the process continues. The system does not
+/// stop a process in an orphaned process group.
 void stop()
 {
     sigset_t signal;
@@ -53,69 +53,67 @@ void stop()
 } // namespace
 
 ConsoleLoop::ConsoleLoop(ConsoleSession& session, ConsoleScreen& screen, int input, TerminalMode& mode,
-                         SignalWatch& signals, const ConsoleManners& manners)
-    : mSession(session), mScreen(screen), mInput(input), mMode(mode), mSignals(signals), mManners(manners),
-      mEscape(manners.escape)
+                         SignalWatch& signals, const InputOptions& options)
+    : mSession(session), mScreen(screen), mInput(input), mMode(mode), mSignals(signals), mInputOptions(options),
+      mEscape(options.escape)
 {}
 
 ConsoleLoop::Outcome ConsoleLoop::run()
 {
     const RawMode raw(mMode);
-    if (mMode.isTerminal() && mManners.escape) {
-        mScreen.say("connected; " + characterName(*mManners.escape) + "? at the start of a line lists the commands");
+    if (mMode.isTerminal() && mInputOptions.escape) {
+        mScreen.say("connected; " + characterName(*mInputOptions.escape) +
+                    "? at the start of a line lists the commands");
     }
     while (!pIsDone())
-        pTurn();
-    if (mFailure && mOutcome.departure == Departure::Ended) std::rethrow_exception(mFailure);
+        pPollOnce();
+    if (mFailure && mOutcome.reason == ExitReason::Ended) std::rethrow_exception(mFailure);
     return mOutcome;
 }
 
 bool ConsoleLoop::pIsDone() const
 {
-    switch (mOutcome.departure) {
-    case Departure::None:
+    switch (mOutcome.reason) {
+    case ExitReason::None:
         return false;
-    case Departure::Left:
-    case Departure::Signal:
+    case ExitReason::Left:
+    case ExitReason::Signal:
         return true;
     default:
         return mScreen.output().isEmpty();
     }
 }
 
-bool ConsoleLoop::pWantsInput() const
-{
-    return mOutcome.departure == Departure::None && mInputOpen && mPending.empty();
-}
+bool ConsoleLoop::pWantsInput() const { return mOutcome.reason == ExitReason::None && mInputOpen && mPending.empty(); }
 
-bool ConsoleLoop::pWantsMessages() const { return mOutcome.departure == Departure::None && mScreen.output().hasRoom(); }
+bool ConsoleLoop::pWantsMessages() const { return mOutcome.reason == ExitReason::None && mScreen.output().hasRoom(); }
 
-bool ConsoleLoop::pWantsToSend() const { return mOutcome.departure == Departure::None && !mPending.empty(); }
+bool ConsoleLoop::pWantsToSend() const { return mOutcome.reason == ExitReason::None && !mPending.empty(); }
 
-/// When pLookAtTime() will have something to do if nothing else happens.
+/// When pCheckTimers() is due; disabled while data is in flight.
 PollDeadline ConsoleLoop::pDeadline() const
 {
-    const bool isWaiting = mOutcome.departure == Departure::None && !mInputOpen && !mSendBroken && mPending.empty() &&
+    const bool isWaiting = mOutcome.reason == ExitReason::None && !mInputOpen && !mSendBroken && mPending.empty() &&
                            mScreen.output().isEmpty();
     if (!isWaiting) return PollDeadline();
-    if (mManners.linger) return mQuietSince + *mManners.linger;
-    return mManners.tellsEnd ? PollDeadline(mQuietSince + kTellAgain) : PollDeadline();
+    if (mInputOptions.linger) return mQuietSince + *mInputOptions.linger;
+    return mInputOptions.sendsEnd ? PollDeadline(mQuietSince + kEndRepeat) : PollDeadline();
 }
 
-void ConsoleLoop::pTurn()
+void ConsoleLoop::pPollOnce()
 {
     const PollFd input(mInput, PollEvents::Read);
     const PollFd messages = mSession.getPollFd(PollEvents::Read);
     const PollFd sending = mSession.getPollFd(PollEvents::Write);
     const PollFd output = mScreen.output().getPollFd();
 
-    // Nothing is waited for that would not be acted upon: what is ready and stays so would be reported without end.
+    // Poll only for events that are handled now. An event that is left unhandled would make this a busy loop.
     PollSet set(mSignals.getPollFd());
     if (pWantsInput()) set += input;
     if (pWantsMessages()) set += messages;
     if (pWantsToSend()) set += sending;
     if (!mScreen.output().isEmpty()) set += output;
-    // What TLS has taken from the socket is there to be received although the socket has nothing.
+    // TLS may hold received bytes while the socket has none.
     const bool isPending = pWantsMessages() && mSession.hasPending();
     const auto timeout = pDeadline().getTimeout(TimeProvider::steady());
     const PollResult ready = isPending ? set.poll() : set.wait(timeout);
@@ -125,7 +123,7 @@ void ConsoleLoop::pTurn()
     if (pWantsMessages() && (isPending || ready.contains(messages))) pReceive();
     if (pWantsToSend() && ready.contains(sending)) pSend();
     if (pWantsInput() && ready.contains(input)) pReadInput();
-    if (!ready.anyReady() && !isPending) pLookAtTime();
+    if (!ready.anyReady() && !isPending) pCheckTimers();
 }
 
 void ConsoleLoop::pHandleSignal()
@@ -135,7 +133,7 @@ void ConsoleLoop::pHandleSignal()
     if (signal == SIGTSTP) return pSuspend();
     if (signal == SIGCONT) return mMode.enterRaw();
     mOutcome.signal = signal;
-    pDepart(Departure::Signal);
+    pExit(ExitReason::Signal);
 }
 
 void ConsoleLoop::pSuspend()
@@ -157,33 +155,32 @@ void ConsoleLoop::pReceive()
         mSession.receive();
     } catch (...) {
         mFailure = std::current_exception();
-        pDepart(Departure::Ended);
+        pExit(ExitReason::Ended);
     }
-    if (mSession.getEnd() != SessionEnd::None) pDepart(Departure::Ended);
+    if (mSession.getEnd() != SessionEnd::None) pExit(ExitReason::Ended);
 }
 
-/// The connection is ready to be written to, which Linux reports once a third of its send buffer is free. That buffer
-/// is four times as large as the longest message, so that this does not wait; would it wait all the same, then not
-/// without limit.
+/// Called when the connection is writable: on Linux that means a third of the send buffer is free, which is more than
+/// the longest message. The send therefore does not block; if it does, the session's timeout limits it.
 void ConsoleLoop::pSend()
 {
     try {
         mQuietSince = TimeProvider::steady();
         mSession.send(mPending);
     } catch (const StreamIOException& error) {
-        // A hypervisor that closes the connection may have said why: that is still to be read, unless by TLS.
+        // A hypervisor that closes the connection may have sent the reason. Without TLS it can still be read.
         mPending.clear();
         mInputOpen = false;
         mSendBroken = true;
         if (exitStatusOf(error) != ExitStatus::DeadlinePassed && mSession.outlivesFailedSend()) return;
         mFailure = std::current_exception();
-        pDepart(Departure::Ended);
+        pExit(ExitReason::Ended);
     }
 }
 
 void ConsoleLoop::pReadInput()
 {
-    std::array<char, ConsoleSession::kMostData> buffer;
+    std::array<char, ConsoleSession::kMaxData> buffer;
     const ssize_t count = ::read(mInput, buffer.data(), buffer.size());
     const int error = errno;
     if (count > 0) return pTakeTyped(buffer.data(), static_cast<std::size_t>(count));
@@ -198,11 +195,11 @@ void ConsoleLoop::pTakeTyped(const char* data, std::size_t length)
         return;
     }
     std::string typed(data, length);
-    while (!typed.empty() && mOutcome.departure == Departure::None)
-        pObey(mEscape.take(typed, mPending));
+    while (!typed.empty() && mOutcome.reason == ExitReason::None)
+        pExecute(mEscape.take(typed, mPending));
 }
 
-void ConsoleLoop::pObey(EscapeFilter::Command command)
+void ConsoleLoop::pExecute(EscapeFilter::Command command)
 {
     switch (command) {
     case EscapeFilter::Command::None:
@@ -214,29 +211,29 @@ void ConsoleLoop::pObey(EscapeFilter::Command command)
     case EscapeFilter::Command::Leave:
         break;
     }
-    // What was typed before is meant for the partition, if it takes it.
+    // Characters typed before the command still go to the partition if it takes them at once.
     if (!mPending.empty() && PollSet(mSession.getPollFd(PollEvents::Write)).poll().anyReady()) pSend();
-    pDepart(Departure::Left);
+    pExit(ExitReason::Left);
 }
 
 void ConsoleLoop::pEndInput()
 {
-    if (mMode.isTerminal()) return pDepart(Departure::Left); // it is gone: in raw mode there is no other end
+    if (mMode.isTerminal()) return pExit(ExitReason::Left); // in raw mode this means that the terminal hung up
     mInputOpen = false;
     mQuietSince = TimeProvider::steady();
-    if (mManners.tellsEnd) mPending += kEndOfFile;
+    if (mInputOptions.sendsEnd) mPending += kEndOfFile;
 }
 
-void ConsoleLoop::pLookAtTime()
+void ConsoleLoop::pCheckTimers()
 {
     if (!pDeadline().isExpired(TimeProvider::steady())) return;
-    if (mManners.linger) return pDepart(Departure::Lingered);
+    if (mInputOptions.linger) return pExit(ExitReason::Lingered);
     mPending += kEndOfFile;
 }
 
-void ConsoleLoop::pDepart(Departure departure)
+void ConsoleLoop::pExit(ExitReason reason)
 {
-    if (mOutcome.departure != Departure::Signal) mOutcome.departure = departure;
+    if (mOutcome.reason != ExitReason::Signal) mOutcome.reason = reason;
     mPending.clear();
 }
 

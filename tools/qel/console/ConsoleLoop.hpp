@@ -15,66 +15,63 @@
 
 namespace qel::tool {
 
-/// How a console treats its input.
-struct ConsoleManners {
-    /// For a terminal: the escape character, if there is one.
+/// What a console does with its input.
+struct InputOptions {
+    /// The escape character on a terminal; none: there are no commands.
     std::optional<char> escape = '~';
 
-    // For anything else:
+    // For input that is not a terminal:
 
-    /// The partition is told when the input has ended.
-    bool tellsEnd = true;
-    /// The session is left when the partition has been silent for this long after the end of the input.
+    /// Send an end-of-file character at the end of the input.
+    bool sendsEnd = true;
+    /// After the end of the input, leave once the partition has sent nothing for this long.
     std::optional<std::chrono::milliseconds> linger;
 };
 
-/// Joins an open virtual serial session to an input and a screen: moves bytes in both directions until the session
-/// ends, the person leaves, the input has ended and nothing more is to be expected, or a signal asks this process to
-/// end.
+/// Connects an open virtual serial session to an input and a screen. Moves bytes in both directions until the session
+/// ends, the user leaves, the linger time passes, or a termination signal arrives.
 ///
-/// One thread waits on everything at once, and neither direction waits for the other: the session is read while it
-/// takes no input, and written to while the screen takes no output. In each direction no more is kept than fits some
-/// messages, so that whoever is too fast is slowed down instead.
+/// One thread polls everything, and the directions do not wait for each other: output is read while the session takes
+/// no input, and input is sent while the screen takes no output. Each direction buffers a few messages and then stops
+/// reading from its source.
 ///
-/// A terminal is in raw mode meanwhile, and an escape character types commands to this program (EscapeFilter).
+/// A terminal is in raw mode while run() is active, and the escape character introduces commands (EscapeFilter).
 ///
-/// Any other input is sent as it is. Where it ends, the partition is told as a person would tell it: by the end-of-file
-/// character, control-D (termios(3): VEOF). A terminal hands that character to whichever command happens to read, once;
-/// and one that is typed ahead of a command which changes the terminal's mode is lost. An input that has ended has
-/// ended for all commands, so the character is sent again after every second in which the partition put nothing out,
-/// until the session ends. With a linger time it is sent once: then the time ends the session.
+/// Any other input is sent as it is. At its end the loop sends the end-of-file character, control-D (termios(3): VEOF),
+/// as a person would type it. The partition's terminal delivers that character once, to the command that happens to
+/// read, and drops it when a command changes the terminal's mode before reading. The end of the input is meant for all
+/// commands, so the loop repeats the character after each second without output until the session ends. With a linger
+/// time it is sent once, and the linger time ends the session.
 ///
 /// Lifetime: borrows everything it is given. Thread safety: one thread.
 class ConsoleLoop {
 public:
-    enum class Departure {
-        None,     ///< still there
-        Left,     ///< the person left, or the terminal is gone
-        Lingered, ///< the linger time has passed
+    enum class ExitReason {
+        None,     ///< still running
+        Left,     ///< the user left, or the terminal hung up
+        Lingered, ///< the linger time passed
         Ended,    ///< the session ended: see ConsoleSession::getEnd()
-        Signal,   ///< a signal asked this process to end
+        Signal,   ///< a termination signal arrived
     };
     struct Outcome {
-        Departure departure = Departure::None;
-        int signal = 0; ///< which one; 0 unless it was a signal
+        ExitReason reason = ExitReason::None;
+        int signal = 0; ///< its number for ExitReason::Signal, else 0
     };
 
-    /// How long the partition must be silent before it is told again that the input has ended.
-    static constexpr std::chrono::milliseconds kTellAgain{1000};
+    /// Time without output after which the end-of-file character is repeated.
+    static constexpr std::chrono::milliseconds kEndRepeat{1000};
 
-    /// @param input  a descriptor to read from
-    /// @param mode  that of the input
-    /// @param signals  watches those that ask this process to end, SIGTSTP and SIGCONT. What the process was started to
-    ///        ignore is ignored.
+    /// @param input  descriptor to read from
+    /// @param mode  the terminal mode of `input`
+    /// @param signals  watches the termination signals, SIGTSTP and SIGCONT. Signals that the process inherited as
+    ///        ignored stay ignored.
     ConsoleLoop(ConsoleSession& session, ConsoleScreen& screen, int input, TerminalMode& mode, SignalWatch& signals,
-                const ConsoleManners& manners);
+                const InputOptions& options);
 
-    /// Moves bytes until there is a reason to depart. Then the terminal is in its own mode again, and everything the
-    /// partition put out has been written, except when the person left or a signal came: those do not wait for an
-    /// output that takes nothing.
-    /// @throws CommandFailure, StreamIOException, QelMessageValidationException  the session broke; what came before
-    /// has
-    ///         been written
+    /// Moves bytes until there is a reason to exit. On return the terminal is restored and all output has been written.
+    /// After ExitReason::Left and Signal some output may be dropped, since these do not wait for the screen.
+    /// @throws CommandFailure, StreamIOException, QelMessageValidationException  the session failed; output received
+    ///         before the failure has been written
     /// @throws PosixError  reading the input or writing the output failed
     Outcome run();
 
@@ -85,7 +82,7 @@ private:
     bool pWantsToSend() const;
     PollDeadline pDeadline() const;
 
-    void pTurn();
+    void pPollOnce();
     void pHandleSignal();
     void pSuspend();
     void pWriteOutput();
@@ -93,25 +90,25 @@ private:
     void pSend();
     void pReadInput();
     void pTakeTyped(const char* data, std::size_t length);
-    void pObey(EscapeFilter::Command command);
+    void pExecute(EscapeFilter::Command command);
     void pEndInput();
-    void pLookAtTime();
-    void pDepart(Departure departure);
+    void pCheckTimers();
+    void pExit(ExitReason reason);
 
     ConsoleSession& mSession;
     ConsoleScreen& mScreen;
     const int mInput;
     TerminalMode& mMode;
     SignalWatch& mSignals;
-    const ConsoleManners mManners;
+    const InputOptions mInputOptions;
     EscapeFilter mEscape;
 
-    std::string mPending;     // input, to be sent
-    bool mInputOpen = true;   // more may come
-    bool mSendBroken = false; // the connection takes nothing any more; what it still holds for us may be read
-    PollDeadline::time_point mQuietSince{}; // of the partition, and of us; meaningful once the input has ended
+    std::string mPending;                   // input to send
+    bool mInputOpen = true;                 // false after the end of the input
+    bool mSendBroken = false;               // sending failed; messages may still be received
+    PollDeadline::time_point mQuietSince{}; // last output or input; used after the end of the input
     Outcome mOutcome;
-    std::exception_ptr mFailure; // why the session broke, until the output has been written
+    std::exception_ptr mFailure; // thrown once the output has been written
 };
 
 } // namespace qel::tool

@@ -13,7 +13,7 @@ ConsoleScreen::ConsoleScreen(int output, std::ostream& errors, bool errorsOnTerm
 
 void ConsoleScreen::say(const std::string& text)
 {
-    mOutput.writeSome(); // what came before stands before
+    mOutput.writeSome(); // earlier output first
     if (mIsOneTerminal && !mOutput.endsLine()) mErrors << lineEnd();
     mErrors << "qel: " << text << lineEnd() << std::flush;
 }

@@ -9,37 +9,37 @@
 
 namespace qel::tool {
 
-/// What the person at a console sees: the partition's output as it is, and between it, a line each, what this program
-/// has to say.
+/// What the user of a console sees: the partition's output unchanged, and the messages of this program, each on a line
+/// of its own.
 /// Thread safety: one thread.
 class ConsoleScreen final : public ConsoleSession::Receiver {
 public:
-    /// @param output  a descriptor for the partition's output
-    /// @param errors  for the lines of this program
-    /// @param errorsOnTerminal  these go to the terminal, which `mode` may have put into raw mode
-    /// Borrows all of them.
+    /// Borrows its arguments.
+    /// @param output  descriptor for the partition's output
+    /// @param errors  for the messages of this program
+    /// @param errorsOnTerminal  true when `errors` is the terminal that `mode` controls
     ConsoleScreen(int output, std::ostream& errors, bool errorsOnTerminal, const TerminalMode& mode);
 
     /// Prints "qel: " and the text on a line of its own.
     void say(const std::string& text);
 
-    /// What ends such a line in the present mode of the terminal.
+    /// The line end of a message: "\r\n" while the terminal is in raw mode.
     const char* lineEnd() const;
 
-    /// The partition's output on its way out.
+    /// The buffer of the partition's output.
     DescriptorOutput& output() noexcept { return mOutput; }
 
-    /// Keeps the data for output().
+    /// Appends the data to output().
     void onOutput(const char* data, std::size_t length) override;
 
-    /// Says who sent which text; nothing in it can do anything to the terminal.
+    /// Prints sender and text, with control characters escaped.
     void onBroadcast(const QelMessageDaxBroadcastOutboundAsync& broadcast) override;
 
 private:
     DescriptorOutput mOutput;
     std::ostream& mErrors;
     const bool mErrorsOnTerminal;
-    const bool mIsOneTerminal; ///< both are seen there
+    const bool mIsOneTerminal; ///< output and messages share a terminal
     const TerminalMode& mMode;
 };
 

@@ -21,14 +21,15 @@ bool hasIdentityOf(const QelMessage& message)
                            message.getClassification()) == T::getMessageID();
 }
 
-/// The message as a T; null when it is something else.
-/// @throws CommandFailure  ProtocolBroken: it says that it is a T, and is none
+/// The message as a T; null when it is another message.
+/// @throws CommandFailure  ProtocolBroken: it has the identity of a T, but its payload is malformed
 template <typename T>
 const T* as(const QelMessage& message)
 {
     const auto* typed = dynamic_cast<const T*>(&message);
     if (typed == nullptr && hasIdentityOf<T>(message)) {
-        throw CommandFailure(ExitStatus::ProtocolBroken, "malformed notice " + toString(message.getLogID()));
+        throw CommandFailure(ExitStatus::ProtocolBroken,
+                             "the peer broke the protocol: malformed notice " + toString(message.getLogID()));
     }
     return typed;
 }
@@ -41,19 +42,19 @@ const char* describe(SessionEnd end)
     case SessionEnd::None:
         return "session open";
     case SessionEnd::CommandEnded:
-        return "session closed: read failure, the command has ended";
+        return "session closed: the command ended";
     case SessionEnd::Taken:
-        return "session closed: force close by another console";
+        return "session closed: taken or closed by another console";
     case SessionEnd::ShutDown:
-        return "session closed: shutdown of the hypervisor end";
+        return "session closed: the server shut down";
     case SessionEnd::WriteFailure:
-        return "session closed: write failure, the partition takes no input";
+        return "session closed: the partition takes no input";
     case SessionEnd::Unknown:
         return "session closed: unknown reason";
     case SessionEnd::ConnectionClosed:
         break;
     }
-    return "the hypervisor closed the connection";
+    return "the server closed the connection";
 }
 
 ExitStatus exitStatusOf(SessionEnd end)
@@ -82,15 +83,17 @@ void ConsoleSession::open(bool force)
 {
     openHypervisorSession(mConnection);
     static_cast<void>(mConnection.require(
-        "open serial session", QelMessageVirtualSerialOpenReq(mAddress.partition, mAddress.connection, force)));
+        "open serial session", QelMessageVirtualSerialOpenReq(mAddress.partition, mAddress.connection, force),
+        pSubject()));
     mIsSerialOpen = true;
     static_cast<void>(mConnection.require(
-        "set up serial session", QelMessageVirtualSerialSetupSessionReq(mAddress.partition, mAddress.connection)));
+        "set up serial session", QelMessageVirtualSerialSetupSessionReq(mAddress.partition, mAddress.connection),
+        pSubject()));
 }
 
 void ConsoleSession::send(std::string& typed)
 {
-    const std::size_t length = std::min(typed.size(), kMostData);
+    const std::size_t length = std::min(typed.size(), kMaxData);
     mConnection.setDeadline(mTimeout);
     mConnection.send(QelMessageVirtualSerialDataToOsAsync(mAddress.partition, mAddress.connection,
                                                           static_cast<std::uint16_t>(length), typed.data()));
@@ -110,9 +113,9 @@ void ConsoleSession::close()
     if (mIsSerialOpen) {
         const QelMessageVirtualSerialCloseReq request(mAddress.partition, mAddress.connection, false);
         const auto response = mConnection.exchange(request);
-        // A session that ended while the request was on its way has nothing left to close; its notice came first.
+        // The session may have ended while the request was on its way; its notice then came before the response.
         if (mIsSerialOpen && response->getStatus() != QelMessageStatusNoError) {
-            throw RequestRefused("close serial session", *response);
+            throw RequestRefused("close serial session", *response, pSubject());
         }
         mIsSerialOpen = false;
         if (mEnd == SessionEnd::ShutDown) return;
@@ -120,6 +123,9 @@ void ConsoleSession::close()
     mConnection.setDeadline(mTimeout);
     static_cast<void>(mConnection.require("close session", QelMessageInterfaceCmpCloseKrogSessionReq()));
 }
+
+/// What the requests are about, for RequestRefused.
+std::string ConsoleSession::pSubject() const { return "partition " + std::to_string(mAddress.partition); }
 
 void ConsoleSession::pHandle(const QelMessage& message)
 {
@@ -129,7 +135,8 @@ void ConsoleSession::pHandle(const QelMessage& message)
         return;
     }
     if (message.getClassification() == QelMessageClassification::Response) {
-        throw CommandFailure(ExitStatus::ProtocolBroken, "response to a request that was not made");
+        throw CommandFailure(ExitStatus::ProtocolBroken,
+                             "the peer broke the protocol: a response to a request that was not sent");
     }
     pHandleNotice(message);
 }
@@ -139,14 +146,14 @@ void ConsoleSession::pHandleNotice(const QelMessage& message)
     if (const auto* data = as<QelMessageVirtualSerialDataToDaxAsync>(message)) {
         if (pIsOurs(*data)) return mReceiver.onOutput(data->getSerialData(), data->getSerialDataLength());
     } else if (const auto* closed = as<QelMessageVirtualSerialSessionClosedAsync>(message)) {
-        if (pIsOurs(*closed)) return pEnd(*closed);
+        if (pIsOurs(*closed)) return pEndSession(*closed);
     } else if (const auto* broadcast = as<QelMessageDaxBroadcastOutboundAsync>(message)) {
         return mReceiver.onBroadcast(*broadcast);
     }
     logLine(LogLevel::Warn, "ignored ", message.getLogID());
 }
 
-void ConsoleSession::pEnd(const QelMessageVirtualSerialSessionClosedAsync& notice)
+void ConsoleSession::pEndSession(const QelMessageVirtualSerialSessionClosedAsync& notice)
 {
     using Notice = QelMessageVirtualSerialSessionClosedAsync;
     mIsSerialOpen = false;
@@ -169,7 +176,7 @@ void ConsoleSession::pEnd(const QelMessageVirtualSerialSessionClosedAsync& notic
     }
 }
 
-/// False also before the session is open and after it has ended.
+/// True while the session is open and the notice is about it.
 template <typename T>
 bool ConsoleSession::pIsOurs(const T& notice) const
 {

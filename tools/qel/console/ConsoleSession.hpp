@@ -15,59 +15,59 @@
 
 namespace qel::tool {
 
-/// Why a virtual serial session is over.
+/// Why a virtual serial session ended.
 enum class SessionEnd {
-    None,             ///< it is not
-    CommandEnded,     ///< read failure: nothing more can come from the partition, and everything that came is here
-    Taken,            ///< force close: another console has it, or closed it
-    ShutDown,         ///< the hypervisor side goes down
+    None,             ///< it has not ended
+    CommandEnded,     ///< read failure: the partition's command ended, and all of its output has been received
+    Taken,            ///< force close: another console took or closed the session
+    ShutDown,         ///< the hypervisor shuts down
     WriteFailure,     ///< the partition takes no more input
-    Unknown,          ///< the notice gave no reason that is known here
+    Unknown,          ///< the notice has an unknown reason
     ConnectionClosed, ///< the hypervisor closes the connection
 };
 
-/// What happened, in words, the reason of the notice first.
+/// The end in words, for the user.
 const char* describe(SessionEnd end);
 
-/// The exit status of a command whose session has ended that way: Done for the end of the command and while there is no
-/// end, Refused when it was taken, ClosedByPeer otherwise.
+/// The exit status of a command whose session ended this way: Done for CommandEnded and None, Refused for Taken,
+/// ClosedByPeer otherwise.
 ExitStatus exitStatusOf(SessionEnd end);
 
-/// One virtual serial session, as the console sees it: opens it, moves its data, closes it.
+/// The console's side of one virtual serial session: opens it, moves its data, closes it.
 ///
-/// Every wait for the hypervisor has a limit: from its first byte to its last a message has the time given here, and so
-/// has the answer to each request; open() has what the connection's deadline leaves.
+/// Every wait for the hypervisor is limited. The timeout given here applies to each message, from its first byte to its
+/// last, and to each response. open() uses the deadline that the connection already has.
 ///
-/// What the hypervisor sends without being asked goes to the receiver from within receive(), open() and close(). What
-/// belongs to another session is ignored; a notice that is known but cannot be understood breaks the protocol.
+/// Notices go to the receiver from within receive(), open() and close(). Notices for other sessions are ignored; a
+/// malformed notice breaks the protocol.
 ///
-/// Lifetime: borrows connection and receiver, which must outlive it; is the connection's notice handler meanwhile.
+/// Lifetime: borrows connection and receiver, which must outlive it. Sets itself as the connection's notice handler.
 /// Thread safety: one thread.
 class ConsoleSession {
 public:
-    /// Where a session leads to.
+    /// Which serial connection of which partition.
     struct Address {
         std::uint16_t partition = 0;
         std::uint16_t connection = 0; ///< number of the serial connection within the partition
     };
 
-    /// Takes what comes.
+    /// Receives output and broadcasts.
     class Receiver {
     public:
         virtual ~Receiver() = default;
 
-        /// What the partition put out. @param data  `length` bytes, borrowed for the call
+        /// Output of the partition. @param data  `length` bytes, borrowed for the call
         virtual void onOutput(const char* data, std::size_t length) = 0;
 
-        /// A broadcast of another console. Everything in it is as that console chose it.
+        /// A broadcast of another console. Its contents are untrusted.
         virtual void onBroadcast(const QelMessageDaxBroadcastOutboundAsync& broadcast) = 0;
     };
 
-    /// Bytes that one data message can carry in a frame that a stream accepts.
-    static constexpr std::size_t kMostData =
+    /// The most bytes that one data message can carry.
+    static constexpr std::size_t kMaxData =
         QelMessage::MtuMax - QelMessage::MaxHeaderSize - sizeof(QelMessageVirtualSerialDataToOsAsync::Data);
 
-    /// @param timeout  what one message, or the answer to one request, may take
+    /// @param timeout  for one message, or for the response to one request
     ConsoleSession(ClientConnection& connection, Address address, std::chrono::milliseconds timeout,
                    Receiver& receiver);
     ~ConsoleSession();
@@ -76,39 +76,41 @@ public:
 
     const Address& getAddress() const noexcept { return mAddress; }
 
-    /// Opens the hypervisor session, then the virtual serial session, and lets its data flow.
+    /// Opens the hypervisor session and the virtual serial session, and sets the latter up for data.
     /// @param force  take the session from the console that holds it
     /// @throws RequestRefused, and what ClientConnection::require() throws
     void open(bool force);
 
-    /// Sends the first bytes of what was typed as one message.
-    /// @param typed  not empty; loses what was sent, at most kMostData bytes
+    /// Sends the beginning of the typed bytes as one message.
+    /// @param typed  not empty; the bytes that were sent, at most kMaxData, are removed
     /// @throws StreamIOException
     void send(std::string& typed);
 
-    /// Takes one message; waits until one has begun to come.
-    /// @throws CommandFailure  ProtocolBroken: one that has no place here
+    /// Receives one message; waits without limit for its first byte.
+    /// @throws CommandFailure  ProtocolBroken: an unexpected response or a malformed notice
     /// @throws StreamIOException, QelMessageValidationException
     void receive();
 
-    /// Why the session is over; None while it is not.
+    /// Why the session ended; None while it is open.
     SessionEnd getEnd() const noexcept { return mEnd; }
 
-    /// Closes what is open: the virtual serial session, then the hypervisor session.
+    /// Closes the virtual serial session and the hypervisor session, as far as they are open.
     /// @throws RequestRefused, and what ClientConnection::require() throws
     void close();
 
-    /// For waiting on messages, or for a message to be taken.
+    /// For waiting until the connection can be read from or written to.
     PollFd getPollFd(PollEvents events) const { return mConnection.getPollFd(events); }
 
-    /// Whether to receive() without waiting, and whether that still makes sense when send() has failed.
+    /// True when receive() has bytes to read although the socket has none.
     bool hasPending() const { return mConnection.hasPending(); }
+    /// True when messages can still be received after send() has failed.
     bool outlivesFailedSend() const noexcept { return !mConnection.isProtected(); }
 
 private:
+    std::string pSubject() const;
     void pHandle(const QelMessage& message);
     void pHandleNotice(const QelMessage& message);
-    void pEnd(const QelMessageVirtualSerialSessionClosedAsync& notice);
+    void pEndSession(const QelMessageVirtualSerialSessionClosedAsync& notice);
     template <typename T>
     bool pIsOurs(const T& notice) const;
 

@@ -12,7 +12,7 @@ constexpr char kSuspend = 'Z' & 0x1F; // control-Z
 
 constexpr unsigned char kFirstPrintable = 0x20;
 constexpr unsigned char kDelete = 0x7F;
-constexpr unsigned char kControlBit = 0x40; // between a control character and the letter it is named by
+constexpr unsigned char kControlBit = 0x40; // differs between a control character and its letter
 
 } // namespace
 
@@ -30,7 +30,7 @@ EscapeFilter::Command EscapeFilter::take(std::string& typed, std::string& forPar
 
 std::string EscapeFilter::help(const std::string& lineEnd) const
 {
-    if (!mEscape) return "there is no escape character";
+    if (!mEscape) return "no escape character is set";
     const std::string escape = characterName(*mEscape);
     return "at the start of a line:" + lineEnd +                  //
            "  " + escape + ".   leave" + lineEnd +                //

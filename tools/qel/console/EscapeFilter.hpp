@@ -5,34 +5,34 @@
 
 namespace qel::tool {
 
-/// Finds what a person types to this program in what they type to the partition, as remote shells do it: at the start
-/// of a line, the escape character makes a command of the character behind it.
+/// Separates commands to this program from input for the partition. As in remote shells, the escape character at the
+/// start of a line makes a command of the character after it.
 ///
 ///     ~.    leave            ~^Z   suspend this program
 ///     ~?    list these       ~~    type one ~
 ///
-/// The escape character before any other character is no command; both are typed. A line starts at the beginning of the
-/// session and behind every carriage return or line feed that was typed. A command types nothing, so that behind one
-/// the line has still not begun.
+/// The escape character before any other character is not a command; both characters are input. A line starts at the
+/// beginning of the session and after every carriage return or line feed in the input. A command is not input, so
+/// another one may follow it.
 ///
 /// Thread safety: one thread.
 class EscapeFilter {
 public:
     enum class Command { None, Leave, Help, Suspend };
 
-    /// @param escape  the escape character; none: everything is for the partition
+    /// @param escape  the escape character; none: everything is input
     explicit EscapeFilter(std::optional<char> escape);
 
-    /// Takes typed characters up to the end or to the first command, which is taken too.
-    /// @param typed  loses what was taken
-    /// @param forPartition  gets what is for the partition appended
-    /// @return the command; None: all characters have been taken
+    /// Reads typed characters up to the end or through the first command.
+    /// @param typed  the characters that were read are removed
+    /// @param forPartition  input for the partition is appended
+    /// @return the command; None: all characters have been read
     Command take(std::string& typed, std::string& forPartition);
 
-    /// The commands, a line each, without line ends around them: for the person who asks.
+    /// The list of commands, with `lineEnd` between the lines.
     std::string help(const std::string& lineEnd) const;
 
-    /// The characters that cannot be the escape character, because commands are called by them.
+    /// True for the characters that name commands; they cannot be the escape character.
     static bool isCommandCharacter(char c);
 
 private:
@@ -42,10 +42,10 @@ private:
 
     std::optional<char> mEscape;
     bool mAtLineStart = true;
-    bool mEscaped = false; // the escape character was the last one
+    bool mEscaped = false; // the last character was the escape character
 };
 
-/// How a character is shown to a person and named on a command line: "^]" for a control character, else itself.
+/// A character as it is printed and given on a command line: a control character in caret notation, "^]".
 std::string characterName(char c);
 
 } // namespace qel::tool

@@ -1,0 +1,77 @@
+#include "base/RefusalReason.hpp"
+
+#include <cstdint>
+
+namespace qel::tool {
+
+namespace {
+
+constexpr std::uint16_t kConnection = QelMessageFunctionQelInterfaceCmp;
+constexpr std::uint16_t kSerial = QelMessageFunctionVirtualSerial;
+constexpr std::uint16_t kAny = 0;
+
+struct Row {
+    std::uint16_t function;
+    std::uint16_t operation;
+    QelMessageStatusCodes status;
+    const char* reason; ///< "$" stands for the subject
+};
+
+/// The first row that fits applies: what a status means for one request comes before what it means in general.
+constexpr Row kReasons[] = {
+    {kConnection, QelMessageOpGetEnclTypeAndInterfaceVersion, QelMessageStatusDaxAlreadyConnected,
+     "a console with this tool type and id is connected already; choose another --tool-id"},
+    {kConnection, QelMessageOpGetEnclTypeAndInterfaceVersion, QelMessageStatusTooManyConnections,
+     "the server takes no more consoles; wait until one leaves, or raise --max-consoles of the server"},
+    {kConnection, QelMessageOpOpenKrogSession, QelMessageStatusKrogSessionAlreadyOpen,
+     "this console has opened its session already"},
+    {kConnection, QelMessageOpDaxBroadcast, QelMessageStatusConnectionNotAvailable,
+     "no other console has this tool type and id"},
+    {kConnection, QelMessageOpDaxBroadcast, QelMessageStatusCmdFailed,
+     "the addressed console takes no more messages at the moment; try again later"},
+
+    {kSerial, QelMessageOpOpenVirtualSerialSession, QelMessageStatusConnectionNotAvailable,
+     "$ is held by another console; --force takes it"},
+    {kSerial, QelMessageOpOpenVirtualSerialSession, QelMessageStatusCmdFailed,
+     "the command of $ cannot be started; the log of the server says why"},
+    {kSerial, QelMessageOpSetupVirtualSerialSession, QelMessageStatusInvalidCmdSequence,
+     "another console has taken $ in the meantime"},
+    {kSerial, QelMessageOpCloseVirtualSerialSession, QelMessageStatusConnectionClosureFailure,
+     "this console does not hold $"},
+    {kSerial, kAny, QelMessageStatusInvalidLparId, "the server does not have $"},
+    {kSerial, kAny, QelMessageStatusInvalidConnectionNumber,
+     "$ does not have this serial connection; --connection 0 is the first"},
+
+    {kAny, kAny, QelMessageStatusInvalidFunction, "the server does not know this kind of request"},
+    {kAny, kAny, QelMessageStatusInvalidOperation, "the server does not know this request"},
+    {kAny, kAny, QelMessageStatusInvalidDestination, "the server does not know the destination of the request"},
+    {kAny, kAny, QelMessageStatusInvalidData, "the server does not accept the values in the request"},
+    {kAny, kAny, QelMessageStatusInvalidCmdSequence, "the server expects another request first"},
+    {kAny, kAny, QelMessageStatusCmdFailed, "the server could not carry out the request; its log may say why"},
+    {kAny, kAny, QelMessageStatusCmdTimeout, "the server could not carry out the request in time; try again later"},
+    {kAny, kAny, QelMessageStatusVttyBufferFull, "the partition takes no more input at the moment; try again later"},
+    {kAny, kAny, QelMessageStatusIncompatibleClient, "the server does not work with this version of the program"},
+    {kAny, kAny, QelMessageStatusHypervisorGenericError, "the hypervisor failed; its log may say why"},
+};
+
+bool fits(const Row& row, const QelMessage& response)
+{
+    return (row.function == kAny || row.function == response.getFunction()) &&
+           (row.operation == kAny || row.operation == response.getOperation()) && row.status == response.getStatus();
+}
+
+} // namespace
+
+std::string refusalReason(const QelMessage& response, const std::string& subject)
+{
+    for (const Row& row : kReasons) {
+        if (!fits(row, response)) continue;
+        std::string text = row.reason;
+        const std::size_t place = text.find('$');
+        if (place != std::string::npos) text.replace(place, 1, subject.empty() ? "the partition" : subject);
+        return text;
+    }
+    return {};
+}
+
+} // namespace qel::tool
