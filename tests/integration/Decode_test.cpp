@@ -107,7 +107,7 @@ TEST_F(DecodeTest, TheFilesOfGoldenFramesAreRead)
     EXPECT_EQ(decode(together).output, decode(goldenFrames()).output);
 }
 
-TEST_F(DecodeTest, ABadFrameMakesTheAnswerNo)
+TEST_F(DecodeTest, ABadFrameIsExitStatusOne)
 {
     const auto result = decode(goldenFrames() + "x");
     EXPECT_EQ(result.exitStatus, 1);
@@ -116,7 +116,7 @@ TEST_F(DecodeTest, ABadFrameMakesTheAnswerNo)
               "qel: bad frame at offset " + std::to_string(goldenFrames().size()) + ": i_buffer bad eyecatcher\n");
 }
 
-TEST_F(DecodeTest, NothingIsNothingBad)
+TEST_F(DecodeTest, EmptyInputIsDone)
 {
     const auto result = decode("");
     EXPECT_EQ(result.exitStatus, 0);
@@ -134,7 +134,7 @@ TEST_F(DecodeTest, JsonIsOneDocument)
     EXPECT_THAT(result.output, HasSubstr("\"reason\": \"i_buffer bad eyecatcher\""));
 }
 
-TEST_F(DecodeTest, TheLogOfTheLibraryComesOnDemandOnly)
+TEST_F(DecodeTest, LibraryLogIsWrittenOnRequest)
 {
     std::string bad = GoldenFrame::load("QelMessageGetQelTodReq").bytes();
     bad[3] = '\x21';
@@ -142,14 +142,14 @@ TEST_F(DecodeTest, TheLogOfTheLibraryComesOnDemandOnly)
     EXPECT_THAT(decode(bad, {"--log-level", "error"}).errors, HasSubstr(" (E): "));
 }
 
-TEST_F(DecodeTest, AFileThatIsNotThereIsUsage)
+TEST_F(DecodeTest, AMissingFileIsUsage)
 {
     const auto result = runQel({"decode", directory.file("none")});
     EXPECT_EQ(result.exitStatus, 2);
-    EXPECT_THAT(result.errors, HasSubstr("'" + directory.file("none") + "' does not exist"));
+    EXPECT_THAT(result.errors, HasSubstr("\"" + directory.file("none") + "\" does not exist"));
 }
 
-TEST_F(DecodeTest, OptionsThatContradictEachOtherAreUsage)
+TEST_F(DecodeTest, ConflictingOptionsAreUsage)
 {
     EXPECT_EQ(decode("", {"--raw", "--hex"}).exitStatus, 2);
     EXPECT_EQ(decode("", {"--unknown"}).exitStatus, 2);
@@ -194,7 +194,7 @@ TEST_F(DecodeTest, OutputThatCannotBeWrittenIsAFailure)
     }
 }
 
-TEST_F(DecodeTest, WhoeverReadsTheOutputMayGo)
+TEST_F(DecodeTest, TheReaderOfTheOutputMayClose)
 {
     std::string much;
     while (much.size() < 500000)

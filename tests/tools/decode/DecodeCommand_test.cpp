@@ -75,21 +75,21 @@ protected:
     std::ostringstream errors;
 };
 
-TEST_F(DecodeCommandTest, AFrameIsPrintedWithItsPlaceItsIdAndItsDump)
+TEST_F(DecodeCommandTest, PrintsOffsetIdAndDumpOfAFrame)
 {
     EXPECT_EQ(decode(closedFrame()), ExitStatus::Done);
     EXPECT_EQ(output.str(), std::string("frame at offset 0, 40 bytes\n") + kClosedText);
     EXPECT_EQ(errors.str(), "");
 }
 
-TEST_F(DecodeCommandTest, EveryFrameIsPrinted)
+TEST_F(DecodeCommandTest, PrintsEveryFrame)
 {
     EXPECT_EQ(decode(closedFrame() + closedFrame()), ExitStatus::Done);
     EXPECT_EQ(output.str(), std::string("frame at offset 0, 40 bytes\n") + kClosedText +
                                 "frame at offset 40, 40 bytes\n" + kClosedText);
 }
 
-TEST_F(DecodeCommandTest, HexadecimalTextIsReadToo)
+TEST_F(DecodeCommandTest, ReadsHexadecimalText)
 {
     EXPECT_EQ(decode(kClosedHex), ExitStatus::Done);
     EXPECT_EQ(output.str(), std::string("frame at offset 0, 40 bytes\n") + kClosedText);
@@ -102,7 +102,7 @@ TEST_F(DecodeCommandTest, OffsetsCountBytesNotDigits)
     EXPECT_THAT(output.str(), HasSubstr("frame at offset 40, 40 bytes\n"));
 }
 
-TEST_F(DecodeCommandTest, NothingIsNothingBad)
+TEST_F(DecodeCommandTest, EmptyInputIsDone)
 {
     for (const FrameNotation notation : {FrameNotation::Guess, FrameNotation::Raw, FrameNotation::Hex}) {
         EXPECT_EQ(decode("", false, notation), ExitStatus::Done);
@@ -113,7 +113,7 @@ TEST_F(DecodeCommandTest, NothingIsNothingBad)
     EXPECT_EQ(output.str(), "{\n  \"frames\": [],\n  \"bad\": []\n}\n");
 }
 
-TEST_F(DecodeCommandTest, ABadFrameIsNamedAndTheNextOneStillPrinted)
+TEST_F(DecodeCommandTest, ReportsABadFrameAndPrintsTheNext)
 {
     std::string bad = closedFrame();
     bad[3] = '\x21';
@@ -123,26 +123,26 @@ TEST_F(DecodeCommandTest, ABadFrameIsNamedAndTheNextOneStillPrinted)
     EXPECT_EQ(errors.str(), "qel: bad frame at offset 40: i_buffer bad header version\n");
 }
 
-TEST_F(DecodeCommandTest, GarbageIsABadFrame)
+TEST_F(DecodeCommandTest, ReportsGarbage)
 {
     EXPECT_EQ(decode("\x01 is no frame"), ExitStatus::Refused);
     EXPECT_EQ(output.str(), "");
     EXPECT_EQ(errors.str(), "qel: bad frame at offset 0: i_buffer bad eyecatcher\n");
     EXPECT_EQ(decode("no frame"), ExitStatus::Refused);
     EXPECT_EQ(output.str(), "");
-    EXPECT_EQ(errors.str(), "qel: bad frame at offset 0: line 1: 'n' is no hexadecimal digit\n");
+    EXPECT_EQ(errors.str(), "qel: bad frame at offset 0: line 1: 'n' is not a hexadecimal digit\n");
 }
 
-TEST_F(DecodeCommandTest, ACutFrameIsABadFrame)
+TEST_F(DecodeCommandTest, ReportsATruncatedFrame)
 {
     EXPECT_EQ(decode(closedFrame() + closedFrame().substr(0, 5)), ExitStatus::Refused);
     EXPECT_EQ(errors.str(),
-              "qel: bad frame at offset 40: the input ends after 5 of 8 bytes that tell the length of a frame\n");
+              "qel: bad frame at offset 40: the input ends after 5 of 8 bytes that hold the length of a frame\n");
     EXPECT_EQ(decode(closedFrame() + closedFrame().substr(0, 39)), ExitStatus::Refused);
     EXPECT_EQ(errors.str(), "qel: bad frame at offset 40: the input ends after 39 of 40 bytes\n");
 }
 
-TEST_F(DecodeCommandTest, ARefusedPayloadIsPrintedAndNamed)
+TEST_F(DecodeCommandTest, PrintsAndReportsAMalformedPayload)
 {
     std::string cut = closedFrame(); // one byte of payload less, and lengths to match
     cut.pop_back();
@@ -154,26 +154,26 @@ TEST_F(DecodeCommandTest, ARefusedPayloadIsPrintedAndNamed)
     EXPECT_EQ(errors.str(), "qel: bad frame at offset 0: dataLength shorter than actual data size\n");
 }
 
-TEST_F(DecodeCommandTest, MistakesInTheTextAreNamedAsFramesThatAreNone)
+TEST_F(DecodeCommandTest, ReportsMistakesInTheText)
 {
     EXPECT_EQ(decode(std::string(kClosedHex) + "\nDECAFF2g"), ExitStatus::Refused);
     EXPECT_EQ(output.str(), std::string("frame at offset 0, 40 bytes\n") + kClosedText);
-    EXPECT_EQ(errors.str(), "qel: bad frame at offset 40: line 2: 'g' is no hexadecimal digit\n");
+    EXPECT_EQ(errors.str(), "qel: bad frame at offset 40: line 2: 'g' is not a hexadecimal digit\n");
     EXPECT_EQ(decode("DECAFF20 00000028\nx"), ExitStatus::Refused);
-    EXPECT_EQ(errors.str(), "qel: bad frame at offset 0: line 2: 'x' is no hexadecimal digit\n");
+    EXPECT_EQ(errors.str(), "qel: bad frame at offset 0: line 2: 'x' is not a hexadecimal digit\n");
 }
 
-TEST_F(DecodeCommandTest, WhatItIsCanBeSaidInsteadOfGuessed)
+TEST_F(DecodeCommandTest, TheFormCanBeGiven)
 {
     EXPECT_EQ(decode(kClosedHex, false, FrameNotation::Hex), ExitStatus::Done);
     EXPECT_EQ(decode(kClosedHex, false, FrameNotation::Raw), ExitStatus::Refused);
     EXPECT_EQ(errors.str(), "qel: bad frame at offset 0: i_buffer bad eyecatcher\n");
     EXPECT_EQ(decode(closedFrame(), false, FrameNotation::Raw), ExitStatus::Done);
     EXPECT_EQ(decode(closedFrame(), false, FrameNotation::Hex), ExitStatus::Refused);
-    EXPECT_EQ(errors.str(), "qel: bad frame at offset 0: line 1: '\\xde' is no hexadecimal digit\n");
+    EXPECT_EQ(errors.str(), "qel: bad frame at offset 0: line 1: '\\xde' is not a hexadecimal digit\n");
 }
 
-TEST_F(DecodeCommandTest, TextsInAFrameCannotTouchTheTerminal)
+TEST_F(DecodeCommandTest, EscapesTextsOfAFrame)
 {
     std::string frame = GoldenFrame::load("QelMessageSetGlobalSaveAreaMetadataReq").bytes();
     ASSERT_EQ(frame.size(), 43U);
@@ -199,7 +199,7 @@ TEST_F(DecodeCommandTest, AllGoldenFramesAreGood)
     EXPECT_THAT(document["bad"], IsEmpty());
 }
 
-TEST_F(DecodeCommandTest, JsonHasEverythingThatIsPrintedAndMore)
+TEST_F(DecodeCommandTest, JsonHoldsAllFields)
 {
     const Json document = decodeToJson(closedFrame());
     const std::string dump = std::string(kClosedText).substr(std::string(kClosedText).find('\n') + 1);
@@ -225,7 +225,7 @@ TEST_F(DecodeCommandTest, JsonHasEverythingThatIsPrintedAndMore)
     EXPECT_EQ(output.str().back(), '\n');
 }
 
-TEST_F(DecodeCommandTest, JsonTellsRequestsFromResponses)
+TEST_F(DecodeCommandTest, JsonNamesTheClassification)
 {
     const Json request = decodeToJson(GoldenFrame::load("QelMessageVirtualSerialOpenReq").bytes())["frames"][0];
     EXPECT_EQ(request["classification"], "Request");
@@ -249,7 +249,7 @@ TEST_F(DecodeCommandTest, JsonOfAFrameWithoutPayload)
     EXPECT_EQ(frame["length"], 32);
 }
 
-TEST_F(DecodeCommandTest, JsonNamesWhatIsBad)
+TEST_F(DecodeCommandTest, JsonListsBadFrames)
 {
     std::string bad = closedFrame();
     bad[3] = '\x21';
@@ -261,15 +261,15 @@ TEST_F(DecodeCommandTest, JsonNamesWhatIsBad)
                                       R"({"offset":80,"reason":"i_buffer bad eyecatcher"}])");
 }
 
-TEST_F(DecodeCommandTest, JsonIsWholeEvenWhenTheTextIsNot)
+TEST_F(DecodeCommandTest, JsonIsCompleteAfterAMistakeInTheText)
 {
     EXPECT_EQ(decode(std::string(kClosedHex) + " zz", true), ExitStatus::Refused);
     const Json document = Json::parse(output.str());
     EXPECT_THAT(document["frames"], IsEmpty()) << "the line of the mistake is not read";
-    EXPECT_EQ(document["bad"].dump(), R"([{"offset":0,"reason":"line 1: 'z' is no hexadecimal digit"}])");
+    EXPECT_EQ(document["bad"].dump(), R"([{"offset":0,"reason":"line 1: 'z' is not a hexadecimal digit"}])");
 }
 
-TEST_F(DecodeCommandTest, JsonHoldsBytesThatAreNoText)
+TEST_F(DecodeCommandTest, JsonHoldsBytesThatAreNotText)
 {
     std::string frame = GoldenFrame::load("QelMessageSetGlobalSaveAreaMetadataReq").bytes();
     frame.replace(34, 9, std::string("\x1B[2J\xC3(\0\x7F\xFE", 9));
@@ -279,7 +279,7 @@ TEST_F(DecodeCommandTest, JsonHoldsBytesThatAreNoText)
         EXPECT_FALSE(c != '\n' && c >= 0 && c < ' ') << int{c};
 }
 
-TEST_F(DecodeCommandTest, InputThatCannotBeReadIsAFailure)
+TEST_F(DecodeCommandTest, ThrowsWhenTheInputCannotBeRead)
 {
     for (const FrameNotation notation : {FrameNotation::Guess, FrameNotation::Raw, FrameNotation::Hex}) {
         std::ifstream directory("/", std::ios::binary);

@@ -35,11 +35,11 @@ RawFrame frameOf(unsigned int length)
     return frame;
 }
 
-/// Only the first 8 bytes of a frame that says it has that length, and as many bytes behind them.
-std::string prefixed(unsigned int length, std::size_t behind)
+/// Only the first 8 bytes of a frame that says it has that length, and `more` bytes after them.
+std::string prefixed(unsigned int length, std::size_t more)
 {
     const auto byte = [length](unsigned int shift) { return static_cast<char>(length >> shift & 0xFF); };
-    return std::string("\xDE\xCA\xFF\x20", 4) + byte(24) + byte(16) + byte(8) + byte(0) + std::string(behind, '\0');
+    return std::string("\xDE\xCA\xFF\x20", 4) + byte(24) + byte(16) + byte(8) + byte(0) + std::string(more, '\0');
 }
 
 class FrameDecoderTest : public ::testing::Test {
@@ -68,7 +68,7 @@ protected:
     std::uint64_t taken = 0; // bytes by the last decode()
 };
 
-TEST_F(FrameDecoderTest, NoBytesAreNoFrames)
+TEST_F(FrameDecoderTest, EmptyInputHasNoFrames)
 {
     EXPECT_THAT(decode(""), IsEmpty());
     EXPECT_EQ(taken, 0U);
@@ -95,7 +95,7 @@ TEST_F(FrameDecoderTest, AFrameKeepsItsBytes)
     EXPECT_FALSE(decoder.next(item));
 }
 
-TEST_F(FrameDecoderTest, EveryMessageIsOfItsClass)
+TEST_F(FrameDecoderTest, DecodesEveryMessageAsItsClass)
 {
     // Two responses are built only; no frame becomes an object of theirs.
     const std::vector<std::string> builtOnly{"QelMessageGetInterfaceLimitsRsp", "QelMessageGetQelTodRsp"};
@@ -112,7 +112,7 @@ TEST_F(FrameDecoderTest, EveryMessageIsOfItsClass)
     EXPECT_EQ(taken, all.size());
 }
 
-TEST_F(FrameDecoderTest, TheMessagesOfTheConnectionHandshakeAreKnown)
+TEST_F(FrameDecoderTest, DecodesHandshakeMessages)
 {
     const QelMessageUpgradeConnectionAsync upgrade;
     const QelMessageAbortHandshakeAsync abort;
@@ -121,14 +121,14 @@ TEST_F(FrameDecoderTest, TheMessagesOfTheConnectionHandshakeAreKnown)
                 ElementsAre("0 QelMessageUpgradeConnectionAsync", "32 QelMessageAbortHandshakeAsync"));
 }
 
-TEST_F(FrameDecoderTest, AMessageOfTheConnectionHandshakeWithTheWrongFlagsIsUnknown)
+TEST_F(FrameDecoderTest, HandshakeMessageWithWrongFlagsIsUnknown)
 {
     RawFrame frame = RawFrame::newForm();
     frame.function(0x6001).operation(0x0001).flags(0x80);
     EXPECT_THAT(decode(text(frame)), ElementsAre("0 QelMessage"));
 }
 
-TEST_F(FrameDecoderTest, GarbageIsNoFrame)
+TEST_F(FrameDecoderTest, ReportsABadEyecatcher)
 {
     EXPECT_THAT(decode("this is no frame at all, whatever comes behind it"), ElementsAre("0: i_buffer bad eyecatcher"));
     EXPECT_THAT(decode("x"), ElementsAre("0: i_buffer bad eyecatcher"));
@@ -142,7 +142,7 @@ TEST_F(FrameDecoderTest, GarbageIsNoFrame)
     }
 }
 
-TEST_F(FrameDecoderTest, EveryTruncationIsNamed)
+TEST_F(FrameDecoderTest, ReportsEveryTruncation)
 {
     const std::string whole = text(frameOf(40));
     for (std::size_t length = 1; length < whole.size(); ++length) {
@@ -150,12 +150,12 @@ TEST_F(FrameDecoderTest, EveryTruncationIsNamed)
         const std::string there = "32: the input ends after " + std::to_string(length) + " of ";
         EXPECT_THAT(decode(text(frameOf(32)) + whole.substr(0, length)),
                     ElementsAre("0 QelMessage",
-                                length < 8 ? there + "8 bytes that tell the length of a frame" : there + "40 bytes"));
+                                length < 8 ? there + "8 bytes that hold the length of a frame" : there + "40 bytes"));
         EXPECT_EQ(taken, 32 + length);
     }
 }
 
-TEST_F(FrameDecoderTest, LengthsThatAreNoneEndTheDecoding)
+TEST_F(FrameDecoderTest, MalformedLengthEndsTheDecoding)
 {
     for (const unsigned int length : {0U, 1U, 8U, 16385U, 0xFFFFFFFFU}) {
         SCOPED_TRACE(length);
@@ -164,7 +164,7 @@ TEST_F(FrameDecoderTest, LengthsThatAreNoneEndTheDecoding)
     }
 }
 
-TEST_F(FrameDecoderTest, LengthsThatAreTooShortForAHeaderAreBadFrames)
+TEST_F(FrameDecoderTest, ReportsALengthTooShortForAHeader)
 {
     struct Row {
         unsigned int length;
@@ -179,13 +179,13 @@ TEST_F(FrameDecoderTest, LengthsThatAreTooShortForAHeaderAreBadFrames)
     }
 }
 
-TEST_F(FrameDecoderTest, TheLongestFrameIsTaken)
+TEST_F(FrameDecoderTest, DecodesTheLongestFrame)
 {
     EXPECT_THAT(decode(text(frameOf(16384)) + text(frameOf(32))), ElementsAre("0 QelMessage", "16384 QelMessage"));
     EXPECT_THAT(decode(text(frameOf(16385)) + text(frameOf(32))), ElementsAre("0: Invalid length 16385"));
 }
 
-TEST_F(FrameDecoderTest, ABadFrameOfKnownLengthDoesNotHideTheNext)
+TEST_F(FrameDecoderTest, GoesOnAfterABadFrameOfKnownLength)
 {
     std::string badVersion = text(frameOf(40));
     badVersion[3] = '\x10';
@@ -196,7 +196,7 @@ TEST_F(FrameDecoderTest, ABadFrameOfKnownLengthDoesNotHideTheNext)
                             "112 QelMessage"));
 }
 
-TEST_F(FrameDecoderTest, APayloadThatIsNotWhatTheMessageMustHaveIsNamed)
+TEST_F(FrameDecoderTest, ReportsAMalformedPayload)
 {
     RawFrame shortOpen = RawFrame::newForm();
     shortOpen.function(0x6002).operation(0x0402).flags(0x80).payload(bytes({0, 1, 0, 0, 0, 0, 0}));
@@ -204,7 +204,7 @@ TEST_F(FrameDecoderTest, APayloadThatIsNotWhatTheMessageMustHaveIsNamed)
                 ElementsAre("0 QelMessage: dataLength shorter than actual data size", "39 QelMessage"));
 }
 
-TEST_F(FrameDecoderTest, AResponseMayHaveAStatusInsteadOfItsPayload)
+TEST_F(FrameDecoderTest, AcceptsAStatusWithoutPayload)
 {
     RawFrame response = RawFrame::newForm();
     response.function(0x6002).operation(0x0402).flags(0x40);
@@ -213,7 +213,7 @@ TEST_F(FrameDecoderTest, AResponseMayHaveAStatusInsteadOfItsPayload)
     EXPECT_THAT(decode(text(response)), ElementsAre("0 QelMessage"));
 }
 
-TEST_F(FrameDecoderTest, OneRefusalIsNotBlamedOnTheNextFrame)
+TEST_F(FrameDecoderTest, ReasonOfOneFrameDoesNotReachTheNext)
 {
     RawFrame request = RawFrame::newForm();
     request.function(0x6002).operation(0x0402).flags(0x80);

@@ -9,8 +9,11 @@
 #include "base/Logging.hpp"
 #include "base/OptionChecks.hpp"
 #include "base/Text.hpp"
+#include "decode/CaptureDecoder.hpp"
 #include "decode/FrameDecoder.hpp"
 #include "decode/HexText.hpp"
+#include "decode/PcapReader.hpp"
+#include "decode/PrefixedInput.hpp"
 
 #include <cerrno>
 #include <fstream>
@@ -54,6 +57,7 @@ nlohmann::ordered_json describe(const FrameDecoder::Item& item)
 {
     const QelMessage& message = *item.message;
     nlohmann::ordered_json frame;
+    if (!item.stream.empty()) frame["stream"] = item.stream;
     frame["offset"] = item.offset;
     frame["length"] = message.msgLength();
     frame["class"] = TypeInfo::getTypeName(message);
@@ -73,7 +77,7 @@ nlohmann::ordered_json describe(const FrameDecoder::Item& item)
     return frame;
 }
 
-/// Where what is decoded goes: printed at once for people, collected into one document for programs.
+/// The output: text is printed at once, JSON is collected into one document.
 class Report {
 public:
     Report(bool json, std::ostream& output, std::ostream& errors) : mJson(json), mOutput(output), mErrors(errors) {}
@@ -81,31 +85,64 @@ public:
     void add(const FrameDecoder::Item& item)
     {
         if (item.message != nullptr) pAddFrame(item);
-        if (!item.reason.empty()) addBad(item.offset, item.reason);
+        if (!item.reason.empty()) addBad(item.stream, item.offset, item.reason);
     }
 
-    void addBad(std::uint64_t offset, const std::string& reason)
+    void addBad(const std::string& stream, std::uint64_t offset, const std::string& reason)
     {
-        mOutput.flush(); // so that the two streams stand in order on a terminal
-        mErrors << "qel: bad frame at offset " << offset << ": " << reason << std::endl;
-        mBad.push_back({{"offset", offset}, {"reason", reason}});
+        pSay("bad frame at " + place(stream, offset) + ": " + reason);
+        nlohmann::ordered_json bad;
+        if (!stream.empty()) bad["stream"] = stream;
+        bad["offset"] = offset;
+        bad["reason"] = reason;
+        mBad.push_back(std::move(bad));
+    }
+
+    /// The input as a whole cannot be decoded, or not all of it.
+    void refuse(const std::string& reason)
+    {
+        pSay(reason);
+        mBad.push_back({{"reason", reason}});
+    }
+
+    /// Something was left out that is not an error.
+    void addSkipped(const std::string& sentence)
+    {
+        if (sentence.empty()) return;
+        pSay(sentence);
+        mSkipped = sentence;
     }
 
     ExitStatus finish()
     {
-        if (mJson) printJson(mOutput, {{"frames", mFrames}, {"bad", mBad}});
+        if (mJson) {
+            nlohmann::ordered_json document{{"frames", mFrames}, {"bad", mBad}};
+            if (!mSkipped.empty()) document["skipped"] = mSkipped;
+            printJson(mOutput, document);
+        }
         return mBad.empty() ? ExitStatus::Done : ExitStatus::Refused;
     }
 
 private:
+    static std::string place(const std::string& stream, std::uint64_t offset)
+    {
+        return "offset " + std::to_string(offset) + (stream.empty() ? "" : " of " + stream);
+    }
+
+    void pSay(const std::string& text)
+    {
+        mOutput.flush(); // keeps the two streams in order on a terminal
+        mErrors << "qel: " << text << std::endl;
+    }
+
     void pAddFrame(const FrameDecoder::Item& item)
     {
         if (mJson) {
             mFrames.push_back(describe(item));
             return;
         }
-        // A dump contains texts of whoever made the frame, as they are.
-        mOutput << "frame at offset " << item.offset << ", " << item.message->msgLength() << " bytes\n"
+        // The dump contains texts of the frame, which are untrusted.
+        mOutput << "frame at " << place(item.stream, item.offset) << ", " << item.message->msgLength() << " bytes\n"
                 << toString(item.message->getLogID()) << '\n'
                 << printableLines(toString(item.message->debug()));
     }
@@ -115,6 +152,7 @@ private:
     std::ostream& mErrors;
     nlohmann::ordered_json mFrames = nlohmann::ordered_json::array();
     nlohmann::ordered_json mBad = nlohmann::ordered_json::array();
+    std::string mSkipped;
 };
 
 void decodeBytes(std::istream& bytes, Report& report)
@@ -126,7 +164,44 @@ void decodeBytes(std::istream& bytes, Report& report)
         for (; decoder.next(item); offset = decoder.offset())
             report.add(item);
     } catch (const CommandFailure& failure) {
-        report.addBad(offset, failure.what()); // hexadecimal text that is none
+        report.addBad({}, offset, failure.what()); // malformed hexadecimal text
+    }
+}
+
+void decodeCapture(std::istream& capture, Report& report)
+{
+    CaptureDecoder decoder(capture, [&report](const FrameDecoder::Item& item) { report.add(item); });
+    try {
+        decoder.run();
+    } catch (const CommandFailure& failure) {
+        report.refuse(failure.what());
+    }
+    report.addSkipped(decoder.skipped());
+    if (decoder.frameCount() == 0) report.refuse("no frame was found in the capture");
+}
+
+void decodeHexText(std::istream& text, Report& report)
+{
+    HexTextBuffer buffer(text);
+    std::istream bytes(&buffer);
+    bytes.exceptions(std::ios::badbit); // without it the stream hides what its buffer throws
+    decodeBytes(bytes, report);
+}
+
+/// Finds out by its first bytes what the input is.
+void decodeGuessed(std::istream& input, Report& report)
+{
+    PrefixedInput buffer(input, PcapReader::kMagicBytes);
+    std::istream bytes(&buffer);
+    if (PcapReader::isPcap(buffer.prefix())) {
+        decodeCapture(bytes, report);
+    } else if (PcapReader::isPcapng(buffer.prefix())) {
+        report.refuse("the input is a capture in pcapng form, which is not supported: convert it to pcap, for example "
+                      "with \"tshark -F pcap -r IN -w OUT\"");
+    } else if (looksLikeHexText(bytes)) {
+        decodeHexText(bytes, report);
+    } else {
+        decodeBytes(bytes, report);
     }
 }
 
@@ -135,7 +210,7 @@ std::string checkInput(std::string& name) { return name == "-" ? std::string() :
 ExitStatus runDecode(const DecodeOptions& options)
 {
     startLogging(options.log, "qel-decode.log");
-    std::ios::sync_with_stdio(false); // else a failure to read cannot be told from the end of the input
+    std::ios::sync_with_stdio(false); // otherwise a read error looks like the end of the input
     if (options.file == "-") return decodeFrames(std::cin, options.notation, options.json, std::cout, std::cerr);
 
     std::ifstream file(options.file, std::ios::binary);
@@ -152,13 +227,16 @@ ExitStatus decodeFrames(std::istream& input, FrameNotation notation, bool json, 
                         std::ostream& errors)
 {
     Report report(json, output, errors);
-    if (notation == FrameNotation::Hex || (notation == FrameNotation::Guess && looksLikeHexText(input))) {
-        HexTextBuffer buffer(input);
-        std::istream bytes(&buffer);
-        bytes.exceptions(std::ios::badbit); // a stream swallows what its buffer throws unless it is told otherwise
-        decodeBytes(bytes, report);
-    } else {
+    switch (notation) {
+    case FrameNotation::Guess:
+        decodeGuessed(input, report);
+        break;
+    case FrameNotation::Raw:
         decodeBytes(input, report);
+        break;
+    case FrameNotation::Hex:
+        decodeHexText(input, report);
+        break;
     }
     if (input.bad()) throw CommandFailure(ExitStatus::Failed, "cannot read the input");
     return report.finish();
@@ -166,23 +244,25 @@ ExitStatus decodeFrames(std::istream& input, FrameNotation notation, bool json, 
 
 CLI::App& addDecodeCommand(CLI::App& parent, Action& action)
 {
-    CLI::App& command = addCommand(parent, "decode", "Print the frames that a file or standard input holds");
+    CLI::App& command = addCommand(parent, "decode", "Print the frames in a file or on standard input");
     const auto options = std::make_shared<DecodeOptions>();
-    command.add_option("file", options->file, "The file; - for standard input")
+    command
+        .add_option("file", options->file,
+                    "The file; - is standard input. Raw frames, a pcap capture, or hexadecimal text")
         ->type_name("FILE")
         ->capture_default_str()
         ->check(CLI::Validator(checkInput, ""));
     CLI::Option* const raw = command.add_flag_callback(
         "--raw", [options] { options->notation = FrameNotation::Raw; },
-        "The input is the frames as they are on the wire; guessed unless given");
+        "The input is raw frames as on the wire (default: decided by its first bytes)");
     command
         .add_flag_callback(
             "--hex", [options] { options->notation = FrameNotation::Hex; },
-            "The input is hexadecimal text; # begins a comment, digits before ':' are an address. Golden frames are "
-            "such text, too")
+            "The input is hexadecimal text: digits with blanks, # comments and addresses that end in ':', output of "
+            "xxd or hexdump -C, or golden frames")
         ->excludes(raw);
     addJsonOption(command, options->json);
-    // What is wrong with a frame is said once, in the answer; the library's own lines about it come on demand.
+    // The output reports malformed frames; the library's log lines about them are optional.
     options->log.usual = LogLevel::Error;
     options->log.quiet = true;
     addLogOptions(command, options->log);

@@ -18,7 +18,7 @@ namespace {
 using Prefix = QelMessageStream::MessageHeader;
 using FastHeader = QelMessageRegistry::FastHeader;
 
-/// The registry that knows a frame, or else the public one.
+/// The registry that knows the message; the public one for an unknown message.
 const QelMessageRegistry& registryFor(const char* frame, unsigned int length)
 {
     const QelMessageRegistry& handshake = QelInternalMessageRegistry::getInstance();
@@ -27,8 +27,7 @@ const QelMessageRegistry& registryFor(const char* frame, unsigned int length)
     return handshake.findFactory(identifier) != nullptr ? handshake : messageRegistry();
 }
 
-/// What the class of a frame says against it; nothing when the identity is of no class. A registry itself tells only
-/// the log.
+/// Why the class of a message refuses the frame; empty for an unknown message. The registry only logs the reason.
 std::string refusalOf(const QelMessageRegistry& registry, const char* frame, unsigned int length)
 {
     const auto* const factory = registry.findFactory(reinterpret_cast<const FastHeader*>(frame)->getIdentifier());
@@ -49,7 +48,7 @@ bool isRefusedResponse(const QelMessage& message)
            message.getStatus() != QelMessageStatusNoError;
 }
 
-/// Looks at as much of the eyecatcher as there is.
+/// Compares as much of the eyecatcher as there is.
 bool beginsLikeFrame(const char* bytes, std::size_t length)
 {
     constexpr const auto& kEyecatcher = QelMessage::CommonHeader::DaxCmdDesc;
@@ -84,7 +83,7 @@ void FrameDecoder::pDecode(Item& item)
         return;
     }
     if (there < sizeof(Prefix)) {
-        item.reason = cutShort(there, sizeof(Prefix)) + " that tell the length of a frame";
+        item.reason = cutShort(there, sizeof(Prefix)) + " that hold the length of a frame";
         return;
     }
     const unsigned int length = reinterpret_cast<const Prefix*>(frame)->mMsgLength;

@@ -9,16 +9,16 @@
 
 namespace qel::tool {
 
-/// Takes frames that lie back to back out of a stream of bytes, one after the other, and says what is wrong with those
-/// that are none.
+/// Reads consecutive frames from a stream of bytes and reports the malformed ones.
 ///
 /// Lifetime: borrows the input, which must outlive this object. Thread safety: one thread.
 class FrameDecoder {
 public:
-    /// One frame, or what stands in the place of one.
+    /// A frame, or a malformed one.
     struct Item {
-        std::uint64_t offset = 0;            ///< of its first byte within the input
-        std::unique_ptr<QelMessage> message; ///< null: it is no frame
+        std::string stream;                  ///< of a capture: "127.0.0.1:40000 > 127.0.0.1:4711"; else empty
+        std::uint64_t offset = 0;            ///< of its first byte within the input, or within the stream
+        std::unique_ptr<QelMessage> message; ///< null: the frame is malformed
         std::string reason;                  ///< what is wrong with it; empty: nothing
     };
 
@@ -26,15 +26,14 @@ public:
     FrameDecoder(const FrameDecoder&) = delete;
     FrameDecoder& operator=(const FrameDecoder&) = delete;
 
-    /// Takes the next one. After one whose length cannot be believed there is no next one: where the frame behind it
-    /// begins is not known.
+    /// Reads the next frame. After a malformed length there is no next frame, since its beginning is unknown.
     ///
-    /// A frame of a known message whose payload is not what that message must have is a plain QelMessage, and the
-    /// reason says why. A response that carries a status may leave its payload out; nothing is wrong with that.
-    /// @return false at the end of the input
+    /// A known message with a malformed payload becomes a plain QelMessage with a reason. A response with a status
+    /// other than zero may omit its payload.
+    /// @return false at the end of the input, and after a malformed length
     bool next(Item& item);
 
-    /// Bytes taken so far.
+    /// Bytes read so far.
     std::uint64_t offset() const noexcept { return mOffset; }
 
 private:
@@ -43,7 +42,7 @@ private:
 
     std::istream& mInput;
     std::uint64_t mOffset = 0;
-    bool mLost = false; // the boundaries of the frames
+    bool mLost = false; // where the next frame begins is unknown
 };
 
 } // namespace qel::tool

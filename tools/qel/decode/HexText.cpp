@@ -1,72 +1,29 @@
 #include "decode/HexText.hpp"
 
 #include "base/Failures.hpp"
-#include "base/Text.hpp"
 
 #include <algorithm>
 #include <cctype>
-#include <string>
+#include <exception>
+#include <utility>
 
 namespace qel::tool {
 
 namespace {
 
 constexpr const char* kBlanks = " \t\r\v\f";
+constexpr std::size_t kPieceBytes = 4096; // far more than a row of any dump
 
 // The first line of a golden frame, and the one before its rows.
 constexpr const char* kGoldenBegin = "name:";
 constexpr const char* kGoldenRows = "frame:";
-
-bool isHexDigit(char c) { return std::isxdigit(static_cast<unsigned char>(c)) != 0; }
-
-int valueOf(char digit)
-{
-    if (digit >= '0' && digit <= '9') return digit - '0';
-    return std::tolower(static_cast<unsigned char>(digit)) - 'a' + 10;
-}
 
 [[noreturn]] void refuse(std::size_t lineNumber, const std::string& reason)
 {
     throw CommandFailure(ExitStatus::Refused, "line " + std::to_string(lineNumber) + ": " + reason);
 }
 
-std::string shortened(const std::string& text)
-{
-    constexpr std::size_t kLongest = 40;
-    return text.size() <= kLongest ? text : text.substr(0, kLongest) + "...";
-}
-
-/// Takes the address off the front of the line, if it begins with one.
-void dropAddress(std::string& line)
-{
-    const std::size_t begin = line.find_first_not_of(kBlanks);
-    if (begin == std::string::npos) return;
-    std::size_t end = begin;
-    while (end < line.size() && isHexDigit(line[end]))
-        ++end;
-    if (end > begin && end < line.size() && line[end] == ':') line.erase(0, end + 1);
-}
-
-/// Takes the first word off the line: the address of a row that ends it with a blank alone.
-void dropFirstWord(std::string& line)
-{
-    const std::size_t begin = std::min(line.find_first_not_of(kBlanks), line.size());
-    line.erase(0, line.find_first_of(kBlanks, begin));
-}
-
 bool beginsWith(const std::string& line, const char* text) { return line.rfind(text, 0) == 0; }
-
-/// The digits of one word, without the "0x" it may begin with.
-std::string digitsOf(const std::string& word, std::size_t lineNumber)
-{
-    const bool prefixed = word.size() > 2 && word[0] == '0' && (word[1] == 'x' || word[1] == 'X');
-    const std::string digits = prefixed ? word.substr(2) : word;
-    for (const char c : digits) {
-        if (!isHexDigit(c)) refuse(lineNumber, "'" + printable(std::string(1, c)) + "' is no hexadecimal digit");
-    }
-    if (digits.size() % 2 != 0) refuse(lineNumber, "'" + shortened(digits) + "' is not a whole number of bytes");
-    return digits;
-}
 
 } // namespace
 
@@ -74,54 +31,158 @@ HexTextBuffer::HexTextBuffer(std::istream& text) : mText(text) {}
 
 HexTextBuffer::int_type HexTextBuffer::underflow()
 {
-    do {
-        if (!pNextLine()) return traits_type::eof();
-        pDecodeLine();
-    } while (mBytes.empty());
+    mBytes.clear();
+    while (mBytes.empty()) {
+        if (mRepeats > 0) {
+            pRepeatRow();
+        } else if (!pNextPiece()) {
+            return traits_type::eof();
+        }
+    }
     setg(mBytes.data(), mBytes.data(), mBytes.data() + mBytes.size());
     return traits_type::to_int_type(mBytes.front());
 }
 
-bool HexTextBuffer::pNextLine()
+bool HexTextBuffer::pNextPiece()
 {
-    if (!std::getline(mText, mLine)) {
-        if (mPart == Part::GoldenHead) refuse(mLineNumber, "the line 'frame:' is missing behind it");
+    const bool isNewLine = mEndsLine;
+    if (!pReadPiece()) {
+        if (mPart == Part::GoldenHead) refuse(mLineNumber, "the line 'frame:' is missing after it");
         return false;
     }
-    ++mLineNumber;
-    pPassOver();
+    if (isNewLine) {
+        ++mLineNumber;
+        pBeginLine();
+    }
+    if (!mSkipLine) pDecodePiece();
     return true;
 }
 
-/// Takes everything off the line that stands for no bytes.
-void HexTextBuffer::pPassOver()
+/// @return false: the end of the text
+bool HexTextBuffer::pReadPiece()
 {
-    if (beginsWith(mLine, kGoldenBegin)) mPart = Part::GoldenHead;
-    if (mPart == Part::GoldenHead) {
-        if (beginsWith(mLine, kGoldenRows)) mPart = Part::GoldenRows;
-        mLine.clear();
-        return;
+    const bool isNewLine = mEndsLine;
+    mPiece.clear();
+    mEndsLine = false;
+    while (!mEndsLine && mPiece.size() < kPieceBytes) {
+        const int_type c = pReadCharacter();
+        if (traits_type::eq_int_type(c, traits_type::eof())) {
+            mEndsLine = true;
+            return !(mPiece.empty() && isNewLine);
+        }
+        mEndsLine = traits_type::to_char_type(c) == '\n';
+        if (!mEndsLine) mPiece += traits_type::to_char_type(c);
     }
-    mLine.erase(std::min(mLine.find('#'), mLine.size()));
-    if (mPart == Part::GoldenRows) {
-        dropFirstWord(mLine);
-    } else {
-        dropAddress(mLine);
+    return true;
+}
+
+/// A failure to read sets badbit, as the functions of a stream do.
+HexTextBuffer::int_type HexTextBuffer::pReadCharacter()
+{
+    try {
+        return mText.good() ? mText.rdbuf()->sbumpc() : traits_type::eof();
+    } catch (const std::exception&) {
+        mText.setstate(std::ios::badbit);
+        return traits_type::eof();
     }
 }
 
-void HexTextBuffer::pDecodeLine()
+/// Recognizes the kind of the line and removes everything but digits of bytes.
+void HexTextBuffer::pBeginLine()
 {
-    mBytes.clear();
-    std::size_t begin = mLine.find_first_not_of(kBlanks);
-    while (begin != std::string::npos) {
-        const std::size_t end = std::min(mLine.find_first_of(kBlanks, begin), mLine.size());
-        const std::string digits = digitsOf(mLine.substr(begin, end - begin), mLineNumber);
-        for (std::size_t i = 0; i < digits.size(); i += 2) {
-            mBytes += static_cast<char>(valueOf(digits[i]) * 16 + valueOf(digits[i + 1]));
-        }
-        begin = mLine.find_first_not_of(kBlanks, end);
+    mSkipLine = false;
+    mDigits.beginLine(mLineNumber);
+    if (beginsWith(mPiece, kGoldenBegin)) mPart = Part::GoldenHead;
+    if (mPart == Part::GoldenHead) {
+        if (beginsWith(mPiece, kGoldenRows)) mPart = Part::GoldenRows;
+        mSkipLine = true;
+    } else if (mPart == Part::GoldenRows) {
+        pDropFirstWord();
+    } else if (mEndsLine && pDecodeDump()) {
+        mSkipLine = true;
+    } else {
+        mRow.reset();
+        mSqueezed = false;
+        pDropAddress();
     }
+}
+
+/// @return false: the line is not part of a dump with a character column
+bool HexTextBuffer::pDecodeDump()
+{
+    if (const auto row = parseXxdRow(mPiece)) {
+        mBytes += row->bytes;
+        return true;
+    }
+    if (const auto row = parseHexdumpRow(mPiece)) {
+        pSkipTo(row->offset);
+        mNextRow = row;
+        if (mRepeats == 0) pEndRepeats();
+        return true;
+    }
+    if (!mRow) return false;
+    const std::size_t last = mPiece.find_last_not_of(kBlanks);
+    if (last == 0 && mPiece[0] == '*') {
+        mSqueezed = true;
+        return true;
+    }
+    const auto end = parseHexdumpEnd(mPiece);
+    if (!end || (!mSqueezed && *end != mRow->offset + mRow->bytes.size())) return false;
+    pSkipTo(*end);
+    return true;
+}
+
+/// Repeats the row in place of a "*".
+void HexTextBuffer::pSkipTo(std::uint64_t offset)
+{
+    if (!mSqueezed) return;
+    mSqueezed = false;
+    const std::uint64_t size = mRow->bytes.size();
+    const std::uint64_t begin = mRow->offset + size;
+    if (offset < begin || (offset - begin) % size != 0) {
+        refuse(mLineNumber, "the offset does not fit a repetition of the row before '*'");
+    }
+    mRepeats = (offset - begin) / size;
+}
+
+void HexTextBuffer::pRepeatRow()
+{
+    for (; mRepeats > 0 && mBytes.size() < kPieceBytes; --mRepeats)
+        mBytes += mRow->bytes;
+    if (mRepeats == 0) pEndRepeats();
+}
+
+/// Goes on with the row after the repeated ones, if there is one.
+void HexTextBuffer::pEndRepeats()
+{
+    if (!mNextRow) return;
+    mBytes += mNextRow->bytes;
+    mRow = std::move(mNextRow);
+    mNextRow.reset();
+}
+
+void HexTextBuffer::pDropAddress()
+{
+    const std::size_t begin = mPiece.find_first_not_of(kBlanks);
+    if (begin == std::string::npos) return;
+    std::size_t end = begin;
+    while (end < mPiece.size() && isHexDigit(mPiece[end]))
+        ++end;
+    if (end > begin && end < mPiece.size() && mPiece[end] == ':') mPiece.erase(0, end + 1);
+}
+
+void HexTextBuffer::pDropFirstWord()
+{
+    const std::size_t begin = std::min(mPiece.find_first_not_of(kBlanks), mPiece.size());
+    if (begin < mPiece.size() && mPiece[begin] == '#') return;
+    mPiece.erase(0, std::min(mPiece.find_first_of(" \t\r\v\f#", begin), mPiece.size()));
+}
+
+void HexTextBuffer::pDecodePiece()
+{
+    for (const char c : mPiece)
+        mDigits.take(c, mBytes);
+    if (mEndsLine) mDigits.endLine();
 }
 
 bool looksLikeHexText(std::istream& input)
