@@ -12,27 +12,27 @@
 namespace qel {
 
 /// Loads an object from a PEM text.
-/// @param read       one of OpenSSL's PEM_read_bio_... functions
-/// @param complaint  the text of the exception when the text cannot be read
-/// @return what the function made, owned by the caller, never null
+/// @param read   one of OpenSSL's PEM_read_bio_... functions
+/// @param error  the text of the exception when the text cannot be read
+/// @return the object, owned by the caller, never null
 template <typename Object, typename User>
-Object* readPEM(const std::string& pem, Object* (*read)(BIO*, Object**, pem_password_cb*, User*), const char* complaint)
+Object* readPEM(const std::string& pem, Object* (*read)(BIO*, Object**, pem_password_cb*, User*), const char* error)
 {
-    if (pem.size() > INT_MAX) throw SSLException(complaint); // a length that OpenSSL cannot be told
+    if (pem.size() > INT_MAX) throw SSLException(error); // OpenSSL takes the length as an int
     const BIO_PTR bio(BIO_new_mem_buf(pem.data(), static_cast<int>(pem.size())));
     checkSSL(bio != nullptr);
-    // Without a callback the last argument is the pass phrase. Were it null, OpenSSL would ask at the terminal.
+    // Without a callback, the last argument is the pass phrase. With null, OpenSSL would prompt at the terminal.
     char noPassPhrase[] = "";
     Object* const object = read(bio.get(), nullptr, nullptr, noPassPhrase);
     if (object == nullptr) {
         SSLException::flushErrorQueue();
-        throw SSLException(complaint);
+        throw SSLException(error);
     }
     return object;
 }
 
-/// @param write  called with a BIO to write to; throws when it cannot
-/// @return what was written
+/// @param write  called with a BIO to write to; throws when it fails
+/// @return the bytes written
 template <typename Write>
 std::string writePEM(const Write& write)
 {

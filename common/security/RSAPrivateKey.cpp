@@ -44,7 +44,7 @@ EVP_PKEY_PTR loadKey(const std::string& pem)
     return wrap(rsa);
 }
 
-/// A second handle would share the key itself with the first one, so the RSA key is duplicated.
+/// Duplicates the RSA key itself: a second EVP_PKEY would share it with the first.
 EVP_PKEY_PTR duplicate(const RSA_PTR& rsa)
 {
     const RSA_PTR copy(RSAPrivateKey_dup(rsa.get()));
@@ -83,8 +83,9 @@ std::string RSAPrivateKey::getPEM() const
     });
 }
 
-/// @return a counted reference to the RSA key inside the handle. EVP_PKEY_get0_RSA would do without the counting, but
-///         its result is const in OpenSSL 3 and not in 1.1.1, and the functions that take it likewise.
+/// @return a counted reference to the RSA key inside the handle. EVP_PKEY_get0_RSA would need no counting, but its
+/// result,
+///         and the parameters that take it, are const in OpenSSL 3 and not in 1.1.1.
 RSA_PTR RSAPrivateKey::pShareRSA() const
 {
     checkSSL(mKey != nullptr); // moved from

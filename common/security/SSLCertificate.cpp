@@ -7,6 +7,7 @@
 #include "security/X509Name.hpp"
 
 #include <ctime>
+#include <openssl/objects.h>
 #include <utility>
 
 namespace qel {
@@ -29,9 +30,16 @@ X509_PTR newCertificate()
     return certificate;
 }
 
-/// Every certificate that is finished has a public key. Without this check, versions of OpenSSL differ in what they
-/// make of an empty one, from an unreadable text to an error.
-void checkNotEmpty(const X509* certificate) { checkSSL(X509_get0_pubkey(certificate) != nullptr); }
+/// A certificate that was parsed or signed names the algorithm of its public key, whether or not this OpenSSL knows
+/// that algorithm; an empty certificate names none. Without this check, versions of OpenSSL differ in what they make of
+/// an empty certificate: an unreadable text or an error.
+void checkNotEmpty(const X509* certificate)
+{
+    checkSSL(certificate != nullptr); // null after a move
+    ASN1_OBJECT* algorithm = nullptr;
+    checkSSL(X509_PUBKEY_get0_param(&algorithm, nullptr, nullptr, nullptr, X509_get_X509_PUBKEY(certificate)) == 1);
+    checkSSL(OBJ_length(algorithm) > 0);
+}
 
 X509_PTR duplicate(X509* certificate)
 {
@@ -43,7 +51,7 @@ X509_PTR duplicate(X509* certificate)
 
 std::unique_ptr<RSAPrivateKey> cloneOf(const RSAPrivateKey* key) { return key != nullptr ? key->clone() : nullptr; }
 
-/// No digest is named, so that of the kind of key applies.
+/// Passes no digest, so the default digest of the key applies.
 void sign(X509* certificate, const RSAPrivateKey& key)
 {
     const int signatureBytes = X509_sign(certificate, key.get(), nullptr);
@@ -58,7 +66,7 @@ void setSerialNumber(X509* certificate, const ASN1_INT_PTR& serial)
 Clock::time_point timePointOf(const ASN1_TIME* time)
 {
     std::tm calendar{};
-    checkSSL(ASN1_TIME_to_tm(time, &calendar) == 1); // UTC, whatever the certificate's way of writing it
+    checkSSL(ASN1_TIME_to_tm(time, &calendar) == 1); // UTC, in either notation of a certificate
     return Clock::from_time_t(::timegm(&calendar));
 }
 
@@ -150,8 +158,8 @@ SSLValidityPeriod SSLCertificate::getValidityPeriod() const
                              timePointOf(X509_get0_notAfter(mCert.get())));
 }
 
-/// Random, so that nothing has to be kept to never give a number twice. Half of all numbers begin with a zero bit, half
-/// of all are even: nothing is forced.
+/// Random numbers need no record of those already used. No bit is forced: half of the numbers begin with a zero bit,
+/// half are even.
 ASN1_INT_PTR SSLCertificate::pGenerateSerialNumber()
 {
     constexpr int kAnyTopBit = -1;

@@ -4,16 +4,16 @@
 
 namespace qel {
 
-/// Reports a failed call of OpenSSL: drains its error queue into the log, then throws an exception that names the
-/// caller's source file and line.
+/// Reports a failed OpenSSL call: drains the error queue into the log, then throws an exception that names the caller's
+/// source file and line.
 [[noreturn]] inline void throwSSLError(const char* file = __builtin_FILE(), int line = __builtin_LINE())
 {
     SSLException::flushErrorQueue();
     throw SSLException(file, line);
 }
 
-/// Throws unless a call of OpenSSL has succeeded; see throwSSLError().
-/// @param succeeded  the comparison that the call's manual page prescribes; what counts as success differs by function
+/// Throws unless an OpenSSL call succeeded; see throwSSLError().
+/// @param succeeded  the comparison that the manual page of the call prescribes; it differs between functions
 inline void checkSSL(bool succeeded, const char* file = __builtin_FILE(), int line = __builtin_LINE())
 {
     if (!succeeded) throwSSLError(file, line);

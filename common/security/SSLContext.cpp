@@ -9,12 +9,12 @@ namespace qel {
 namespace {
 
 constexpr auto kOptions = SSL_OP_NO_RENEGOTIATION | SSL_OP_NO_COMPRESSION | SSL_OP_NO_TICKET;
-static_assert(kOptions == 0x40024000, "nothing that could be negotiated later or carried over");
+static_assert(kOptions == 0x40024000, "no renegotiation, no compression, no tickets");
 
 } // namespace
 
-// The mode lets SSL_write(3) return after each record, so that ciphertext leaves while the rest is still to be
-// encrypted. Tickets are switched off twice: the option is for the older protocols, the number for TLS 1.3.
+// The mode lets SSL_write(3) return after each record, so that one record is sent before the next is encrypted. Tickets
+// need two settings: the option is for older protocols, the number for TLS 1.3.
 SSLContext::SSLContext() : mContext(SSL_CTX_new(TLS_method()))
 {
     checkSSL(mContext != nullptr);
@@ -53,7 +53,7 @@ void SSLContext::pSetRootCA(SSLCertificate& root)
     X509_STORE_PTR store(X509_STORE_new());
     checkSSL(store != nullptr);
     checkSSL(X509_STORE_add_cert(store.get(), root.get()) == 1);
-    SSL_CTX_set_cert_store(mContext.get(), store.release()); // owned by the context from here on
+    SSL_CTX_set_cert_store(mContext.get(), store.release()); // the context owns it now
 }
 
 SSLClientContext::SSLClientContext() = default;

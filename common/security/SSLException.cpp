@@ -9,12 +9,12 @@ namespace qel {
 
 namespace {
 
-constexpr std::size_t kErrorTextBytes = 256; // what ERR_error_string(3) asks for
+constexpr std::size_t kErrorTextBytes = 256; // the size that ERR_error_string(3) requires
 
 void logError(const char* file, int line, unsigned long code)
 {
     if (!QelLogger::get().isLevelEnabled(LogLevel::Error)) return;
-    // A buffer of our own: the one that ERR_error_string uses otherwise is shared by all threads.
+    // A local buffer: the default buffer of ERR_error_string is shared by all threads.
     char text[kErrorTextBytes];
     ERR_error_string_n(code, text, sizeof(text));
     logLine(LogLevel::Error, "[libssl] ", file, ":", decFormat(line), ": ", text);
@@ -28,22 +28,16 @@ SSLException::SSLException(const char* file, int line)
     : std::runtime_error(std::string("An SSL error occurred at ") + file + ":" + std::to_string(line))
 {}
 
-// Out of line, so that there is one type information of this class in the whole program and catching by type works.
+// Out of line: the program then has a single type information for this class, and catching it by type works.
 SSLException::~SSLException() = default;
 
 void SSLException::flushErrorQueue()
 {
-    // Taking entries until there is none costs an empty queue, the usual case, a look at its head; ERR_clear_error
-    // would go over all its places.
+    // An empty queue, the usual case, costs one check here; ERR_clear_error would visit every slot.
     const char* file = nullptr;
     int line = 0;
-    try {
-        while (const unsigned long code = ERR_get_error_line(&file, &line))
-            logError(file, line, code);
-    } catch (...) {
-        ERR_clear_error();
-        throw;
-    }
+    while (const unsigned long code = ERR_get_error_line(&file, &line))
+        logError(file, line, code);
 }
 
 } // namespace qel

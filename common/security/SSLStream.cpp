@@ -22,10 +22,10 @@ namespace qel {
 
 namespace {
 
-// The buffers of the pair, each way, and the most ciphertext that moves in one transfer.
+// The size of the BIO pair's buffers in each direction, and the maximum ciphertext in one transfer.
 constexpr std::size_t kTransferBytes = 8192;
 
-// OpenSSL counts in int; the loops take care of the rest.
+// OpenSSL takes lengths as int; callers loop over longer ones.
 int cappedLength(std::size_t length) noexcept
 {
     constexpr std::size_t longest = std::numeric_limits<int>::max();
@@ -46,7 +46,7 @@ SSLStream::SSLStream(SSLContext& context, std::unique_ptr<Stream> stream)
     BIO* internal = nullptr;
     BIO* network = nullptr;
     checkSSL(BIO_new_bio_pair(&internal, kTransferBytes, &network, kTransferBytes) == 1);
-    SSL_set_bio(mSSL.get(), internal, internal); // mSSL owns it from here on
+    SSL_set_bio(mSSL.get(), internal, internal); // mSSL owns it now
     mBuffer.reset(network);
 }
 
@@ -69,7 +69,7 @@ std::size_t SSLStream::read(char* buffer, std::size_t length)
     try {
         return pRead(lock, buffer, length);
     } catch (...) {
-        pEnd(lock);
+        pCloseAfterException(lock);
         throw;
     }
 }
@@ -81,7 +81,7 @@ void SSLStream::write(const char* buffer, std::size_t length)
     try {
         pWrite(lock, buffer, length);
     } catch (...) {
-        pEnd(lock);
+        pCloseAfterException(lock);
         throw;
     }
 }
@@ -97,7 +97,7 @@ std::unique_ptr<SSLCertificate> SSLStream::getPeerCertificate() const
     X509_PTR certificate;
     {
         const MutexLock lock(mLock);
-        // In the middle of a handshake there may be a certificate whose key the peer has not yet proven to hold.
+        // During the handshake the peer may not yet have proven that it holds the key of its certificate.
         if (mStatus != STATUS_ENCRYPTED) return nullptr;
         certificate.reset(SSL_get_peer_certificate(mSSL.get()));
     }
@@ -117,7 +117,7 @@ bool SSLStream::hasPending() const
 {
     const MutexLock lock(mLock);
     if (mStatus != STATUS_ENCRYPTED) return false;
-    // Ciphertext first waits in the pair of buffers, then, record by record, in the engine.
+    // Ciphertext waits in the BIO pair first, then, record by record, in the engine.
     return BIO_ctrl_pending(SSL_get_rbio(mSSL.get())) > 0 || SSL_has_pending(mSSL.get()) == 1;
 }
 
@@ -134,8 +134,8 @@ void SSLStream::handshake()
     try {
         pHandshake(lock);
     } catch (...) {
-        pEnd(lock);
-        throw; // not a copy: the cause may be nested inside
+        pCloseAfterException(lock);
+        throw; // rethrow the original: the cause may be nested in it
     }
 }
 
@@ -156,26 +156,19 @@ void SSLStream::pHandshake(UniqueMutexLock& lock)
     logLine(LogLevel::Debug, "SSLStream: protocol init write complete");
     if (pRead(lock, &version, sizeof(version)) == 0) failAtEndOfStream();
 
-    // Another thread may have closed the stream while this one waited; it must not come back to life.
+    // Another thread may have closed the stream while this one waited. It must stay closed.
     pCheckStatusLocked(STATUS_UNENCRYPTED);
     logLine(LogLevel::Info, "SSLStream protocol init complete: ", SSL_get_version(mSSL.get()), " ",
             SSL_CIPHER_get_name(SSL_get_current_cipher(mSSL.get())));
     mStatus = STATUS_ENCRYPTED;
 }
 
-/// Leaves the stream closed when an exception is on its way out. Most exceptions come from where it has been closed
-/// already, but not all: a line of log may fail, since a substitute clock may throw, in front of anything.
-// Exempt from the analysis: whether the lock is held is known only at run time, when an exception has come from either
-// side of the end of the stream.
-void SSLStream::pEnd(UniqueMutexLock& lock) QEL_NO_THREAD_SAFETY_ANALYSIS
+/// Closes the stream unless the failing step has done so.
+// Exempt from the analysis: only at run time is it known whether the lock is held. It is not at the end of the stream.
+void SSLStream::pCloseAfterException(UniqueMutexLock& lock) QEL_NO_THREAD_SAFETY_ANALYSIS
 {
     if (!lock.ownsLock()) lock.lock();
     if (mStatus != STATUS_CLOSED) pCloseLocked();
-    try {
-        SSLException::flushErrorQueue();
-    } catch (...) {
-        // The queue is empty all the same, and the first exception is the one to know of.
-    }
 }
 
 void SSLStream::pCheckStatusLocked(Status status) const
@@ -189,15 +182,15 @@ void SSLStream::pCloseLocked() noexcept
     try {
         mStream->close();
     } catch (...) {
-        // Closed is closed; and whoever handles another exception just now must be left with that one.
+        // The stream counts as closed, and a caller that is handling another exception must keep that one.
     }
 }
 
-/// Passes success and the wish to read or to write on; everything else ends the stream.
+/// Returns success, want-read and want-write; any other result closes the stream and throws.
 /// @return the code of SSL_get_error(3)
 int SSLStream::pHandleErrorLocked(int result)
 {
-    const int systemError = errno; // first: everything below may change it
+    const int systemError = errno; // saved first: the calls below may change it
     const int error = SSL_get_error(mSSL.get(), result);
     switch (error) {
     case SSL_ERROR_NONE:
@@ -217,7 +210,7 @@ int SSLStream::pHandleErrorLocked(int result)
     throw StreamIOException("SSL error " + std::to_string(error));
 }
 
-/// Says why the peer's certificate was refused, if that is what happened: OpenSSL's queue does not.
+/// Logs why the peer's certificate was refused, if it was: OpenSSL's error queue does not say.
 void SSLStream::pLogVerificationLocked()
 {
     const long result = SSL_get_verify_result(mSSL.get());
@@ -241,10 +234,10 @@ void SSLStream::pFailTransferLocked(const char* description, int result, const c
     throw StreamIOException(text);
 }
 
-/// Sends the ciphertext that the engine has produced.
+/// Sends the ciphertext that the engine has produced to the underlying stream.
 void SSLStream::pFlush(UniqueMutexLock& lock)
 {
-    char scratch[kTransferBytes]; // written before it is read, so never initialised
+    char scratch[kTransferBytes]; // not initialised: written before it is read
     std::size_t pending = BIO_ctrl_pending(mBuffer.get());
     while (pending > 0) {
         const std::size_t chunk = std::min(pending, sizeof(scratch));
@@ -257,7 +250,7 @@ void SSLStream::pFlush(UniqueMutexLock& lock)
     }
 }
 
-/// Writes to the stream underneath, without the lock meanwhile.
+/// Writes to the underlying stream and releases the lock meanwhile.
 // Exempt from the analysis, which does not follow a lock that is a parameter.
 void SSLStream::pSendReleased(UniqueMutexLock& lock, const char* buffer,
                               std::size_t length) QEL_NO_THREAD_SAFETY_ANALYSIS
@@ -273,11 +266,11 @@ void SSLStream::pSendReleased(UniqueMutexLock& lock, const char* buffer,
     lock.lock();
 }
 
-/// Brings ciphertext in for the engine, without the lock while it waits for it.
-/// @return true; or false at the end of the stream, and then the lock stays released
+/// Reads ciphertext for the engine from the underlying stream and releases the lock meanwhile.
+/// @return true when data arrived; false at the end of the stream, and then the lock stays released
 bool SSLStream::pFulfillInboundRequest(UniqueMutexLock& lock)
 {
-    char scratch[kTransferBytes]; // written before it is read, so never initialised
+    char scratch[kTransferBytes]; // not initialised: written before it is read
     const std::size_t room = std::min(sizeof(scratch), BIO_ctrl_get_write_guarantee(mBuffer.get()));
     std::size_t count = 0;
     lock.unlock();
@@ -298,12 +291,12 @@ bool SSLStream::pFulfillInboundRequest(UniqueMutexLock& lock)
     return true;
 }
 
-/// @return the bytes read, at least one; or 0 at the end of the stream, and then the lock stays released
+/// @return the number of bytes read, at least 1; or 0 at the end of the stream, and then the lock stays released
 std::size_t SSLStream::pRead(UniqueMutexLock& lock, char* buffer, std::size_t length)
 {
     std::size_t total = 0;
     while (length > 0) {
-        SSLException::flushErrorQueue(); // a stale entry would pass for a failure of this call
+        SSLException::flushErrorQueue(); // a stale entry would look like a failure of this call
         const int result = SSL_read(mSSL.get(), buffer, cappedLength(length));
         const int error = pHandleErrorLocked(result);
         if (error == SSL_ERROR_WANT_WRITE) pRefuseRenegotiationLocked();
@@ -324,12 +317,12 @@ std::size_t SSLStream::pRead(UniqueMutexLock& lock, char* buffer, std::size_t le
 void SSLStream::pWrite(UniqueMutexLock& lock, const char* buffer, std::size_t length)
 {
     while (length > 0) {
-        SSLException::flushErrorQueue(); // a stale entry would pass for a failure of this call
+        SSLException::flushErrorQueue(); // a stale entry would look like a failure of this call
         const int result = SSL_write(mSSL.get(), buffer, cappedLength(length));
         const int error = pHandleErrorLocked(result);
         if (error == SSL_ERROR_WANT_READ) pRefuseRenegotiationLocked();
         pFlush(lock);
-        // With its buffer full the engine has kept its place: the next call passes the same bytes again.
+        // The engine's buffer was full and it has kept its position: pass the same bytes again.
         if (error == SSL_ERROR_WANT_WRITE) continue;
         logLine(LogLevel::Debug, "SSL stream encrypted ", decFormat(result), " byte(s) of data");
         const std::size_t count = static_cast<std::size_t>(result);

@@ -15,7 +15,7 @@ constexpr seconds kDay = std::chrono::hours(24);
 
 const SSLValidityPeriod SSLValidityPeriod::Infinite((Clock::min)(), (Clock::max)());
 
-// The clock is read once: read twice, it could have moved on between the two ends.
+// Reads the clock once, so that both ends refer to the same moment.
 SSLValidityPeriod::SSLValidityPeriod(seconds duration) noexcept : mNotBefore(Clock::now()), mNotAfter(mNotBefore)
 {
     mNotAfter += (std::min)(duration, (Clock::max)() - mNotBefore);
@@ -24,8 +24,8 @@ SSLValidityPeriod::SSLValidityPeriod(seconds duration) noexcept : mNotBefore(Clo
 
 seconds SSLValidityPeriod::days(unsigned long n) noexcept
 {
-    constexpr auto kMostDays = static_cast<unsigned long>((seconds::max)() / kDay);
-    return static_cast<seconds::rep>((std::min)(n, kMostDays)) * kDay;
+    constexpr auto kMaxDays = static_cast<unsigned long>((seconds::max)() / kDay);
+    return static_cast<seconds::rep>((std::min)(n, kMaxDays)) * kDay;
 }
 
 } // namespace qel

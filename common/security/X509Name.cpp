@@ -18,7 +18,7 @@ std::string fieldName(const ASN1_OBJECT* object)
 {
     const int nid = OBJ_obj2nid(object);
     const char* const shortName = nid != NID_undef ? OBJ_nid2sn(nid) : nullptr;
-    if (shortName != nullptr) return shortName;            // fields that a program has registered itself may have none
+    if (shortName != nullptr) return shortName;            // a field that a program has registered may have none
     const int length = OBJ_obj2txt(nullptr, 0, object, 1); // without the NUL that the second call adds
     checkSSL(length > 0);
     std::string numbers(static_cast<std::size_t>(length) + 1, '\0');

@@ -6,7 +6,7 @@
 namespace qel {
 
 /// Appends the fields to a name, in the order of the map's keys.
-/// @throws SSLException  a field or a value is not accepted
+/// @throws SSLException  a field or value is not accepted
 void addFields(X509_NAME* name, const SSLSubject& fields);
 
 /// @return the fields of a name, as SSLCertificate::getSubject() describes

@@ -33,7 +33,7 @@ std::vector<std::string> issueConsole(const std::string& directory)
 }
 
 // Each of the three files at each of its steps.
-TEST_F(CaFaults, AFileThatCannotBeWrittenLeavesNone)
+TEST_F(CaFaults, AFailedWriteLeavesNoFile)
 {
     bringRoot();
     struct Row {
@@ -79,7 +79,7 @@ TEST_F(CaFaults, AFailedReplacementKeepsTheOldFiles)
     }
 }
 
-TEST_F(CaFaults, NamesThatMayNotReachTheDiskAreAnError)
+TEST_F(CaFaults, AFailedSyncOfTheDirectoryIsAnError)
 {
     bringRoot();
     const auto result =
@@ -89,7 +89,7 @@ TEST_F(CaFaults, NamesThatMayNotReachTheDiskAreAnError)
     EXPECT_THAT(names(), ElementsAreArray(kIssued));
 }
 
-TEST_F(CaFaults, ADirectoryThatCannotBeForcedToTheDiskIsNone)
+TEST_F(CaFaults, AFileSystemThatCannotSyncDirectoriesIsAccepted)
 {
     bringRoot();
     const auto result =
@@ -98,7 +98,7 @@ TEST_F(CaFaults, ADirectoryThatCannotBeForcedToTheDiskIsNone)
     EXPECT_THAT(names(), ElementsAreArray(kIssued));
 }
 
-TEST_F(CaFaults, WhatIsWrittenInPiecesIsWhole)
+TEST_F(CaFaults, ShortWritesAreContinued)
 {
     bringRoot();
     const auto pieces = runCa(issueConsole(path()), faults({{"BYTES", "7"}}));
@@ -125,7 +125,7 @@ TEST_F(CaFaults, ATemporaryNameThatIsTakenIsLeftAlone)
 }
 
 // Not every file system can rename without replacing.
-TEST_F(CaFaults, WhereRenamingCannotKeepFilesLinksDo)
+TEST_F(CaFaults, UsesLinksWhereRenameCannotKeepFiles)
 {
     bring({"root.crt", "root.key", "server.csr"});
     for (const int error : {EINVAL, ENOSYS}) {
@@ -141,7 +141,7 @@ TEST_F(CaFaults, WhereRenamingCannotKeepFilesLinksDo)
 }
 
 // Any other error is one.
-TEST_F(CaFaults, WhereRenamingFailsThereIsNoFile)
+TEST_F(CaFaults, AFailedRenameLeavesNoFile)
 {
     bring({"root.crt", "root.key", "server.csr"});
     const auto result =
@@ -152,7 +152,7 @@ TEST_F(CaFaults, WhereRenamingFailsThereIsNoFile)
 }
 
 // Another program makes the certificate when key and request have their names already.
-TEST_F(CaFaults, AFileThatComesAtTheLastMomentIsKept)
+TEST_F(CaFaults, AFileThatAppearsAtTheLastMomentIsKept)
 {
     bringRoot();
     struct Row {
@@ -166,7 +166,7 @@ TEST_F(CaFaults, AFileThatComesAtTheLastMomentIsKept)
                                                                 {"ERROR", std::to_string(row.error)},
                                                                 {"MAKE", file("console.crt")}}));
         EXPECT_EQ(result.exitStatus, 1);
-        EXPECT_EQ(result.errors, "qel: " + file("console.crt") + " is there already; --force replaces it\n");
+        EXPECT_EQ(result.errors, "qel: " + file("console.crt") + " already exists; --force replaces it\n");
         EXPECT_THAT(names(), ElementsAre("console.crt", "root.crt", "root.key"));
         EXPECT_EQ(read("console.crt"), "");
         std::filesystem::remove(file("console.crt"));
@@ -245,12 +245,12 @@ Outcome runAtOnce(const std::vector<std::string>& command, int count)
         const auto result = process->wait();
         if (result.exitStatus == 0) ++outcome.done;
         if (result.exitStatus == 1) ++outcome.refused;
-        EXPECT_THAT(result.errors, AnyOf(IsEmpty(), HasSubstr(" is there already; --force replaces it\n")));
+        EXPECT_THAT(result.errors, AnyOf(IsEmpty(), HasSubstr(" already exists; --force replaces it\n")));
     }
     return outcome;
 }
 
-TEST_F(CaFaults, OfSeveralAtTheSameTimeOneWins)
+TEST_F(CaFaults, OneOfSeveralConcurrentRunsSucceeds)
 {
     const Outcome outcome = runAtOnce(caCommand({"init", path(), "--subject", "CN=Our root"}), 4);
     EXPECT_EQ(outcome.done, 1);
@@ -259,7 +259,7 @@ TEST_F(CaFaults, OfSeveralAtTheSameTimeOneWins)
     EXPECT_NO_THROW(SSLCertificate(read("root.crt"), RSAPrivateKey(read("root.key"))));
 }
 
-TEST_F(CaFaults, SeveralThatReplaceLeaveTheFilesOfOne)
+TEST_F(CaFaults, ConcurrentReplacementsLeaveTheFilesOfOneRun)
 {
     bringRoot();
     auto command = caCommand(issueConsole(path()));

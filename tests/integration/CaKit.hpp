@@ -1,5 +1,10 @@
 #pragma once
 
+#include <qel/common/Utilities.hpp>
+#include <qel/common/security/RSAPrivateKey.hpp>
+#include <qel/common/security/SSLCertificate.hpp>
+#include <qel/common/security/SSLCertificateRequest.hpp>
+
 #include "support/Process.hpp"
 #include "support/TemporaryDirectory.hpp"
 
@@ -49,6 +54,24 @@ protected:
 
 private:
     TemporaryDirectory mDirectory;
+};
+
+/// With what most tests of the authority use.
+class Ca : public CaTest {
+protected:
+    using Clock = SSLValidityPeriod::Clock;
+
+    static std::string readShared(const std::string& name) { return Utilities::readFile(shared() + "/" + name); }
+
+    SSLCertificate certificate(const std::string& name) const { return SSLCertificate(read(name)); }
+
+    /// A certificate of that period, for the shared server by the shared root.
+    void writeCertificate(const std::string& name, Clock::time_point from, Clock::time_point until) const
+    {
+        static const SSLCertificate sRoot(readShared("root.crt"), RSAPrivateKey(readShared("root.key")));
+        SSLCertificateRequest request(readShared("server.csr"));
+        write(name, sRoot.sign(request, SSLValidityPeriod(from, until)).getPEM());
+    }
 };
 
 } // namespace qel::test

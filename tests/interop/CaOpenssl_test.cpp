@@ -54,20 +54,20 @@ protected:
     }
 };
 
-TEST_F(CaOpenssl, VerifiesWhatIsIssued)
+TEST_F(CaOpenssl, VerifiesIssuedCertificates)
 {
     EXPECT_THAT(openssl({"verify", "-CAfile", shared() + "/root.crt", shared() + "/server.crt"}), HasSubstr(": OK\n"));
     EXPECT_THAT(openssl({"verify", "-check_ss_sig", "-CAfile", shared() + "/root.crt", shared() + "/root.crt"}),
                 HasSubstr(": OK\n"));
 }
 
-TEST_F(CaOpenssl, RefusesWhatAnotherRootIssued)
+TEST_F(CaOpenssl, RefusesCertificatesOfAnotherRoot)
 {
     ASSERT_EQ(runCa({"init", path(), "--subject", "CN=another"}).exitStatus, 0);
     EXPECT_NE(runOpenssl({"verify", "-CAfile", file("root.crt"), shared() + "/server.crt"}).exitStatus, 0);
 }
 
-TEST_F(CaOpenssl, PrintsTheSameOfACertificate)
+TEST_F(CaOpenssl, PrintsTheSameFactsOfACertificate)
 {
     const std::string server = shared() + "/server.crt";
     const Json ours = show(server);
@@ -151,7 +151,7 @@ TEST_F(CaOpenssl, MakesARootThatSigns)
     EXPECT_EQ(runCa({"check", file("root.crt"), "--within", "30d"}).exitStatus, 10);
 }
 
-TEST_F(CaOpenssl, ACertificateInAnotherFormIsNamedAsSuch)
+TEST_F(CaOpenssl, ShowRefusesADerCertificate)
 {
     openssl({"x509", "-in", shared() + "/server.crt", "-outform", "DER", "-out", file("server.der")});
     EXPECT_EQ(runCa({"show", file("server.der")}).errors,

@@ -86,7 +86,7 @@ TEST_F(GnuTLSPrograms, ClientAndOurServerTalk)
     EXPECT_THAT(client->wait().output, HasSubstr("The certificate is trusted"));
 }
 
-TEST_F(GnuTLSPrograms, OurServerTakesNewKeysOfAClient)
+TEST_F(GnuTLSPrograms, OurServerAcceptsAKeyUpdateOfAClient)
 {
     Options options = credentials(mClientFiles);
     options.emplace_back("--inline-commands");

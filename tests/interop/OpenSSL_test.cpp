@@ -107,7 +107,7 @@ TEST_F(OpenSSLPrograms, ClientAndOurServerExchangeMuch)
     EXPECT_EQ(client->output(), std::string(1, '\0') + data); // our version first
 }
 
-TEST_F(OpenSSLPrograms, OurServerTakesNewKeysOfAClient)
+TEST_F(OpenSSLPrograms, OurServerAcceptsAKeyUpdateOfAClient)
 {
     const auto client = startClient(credentials(mClientFiles));
     client->writeInput("v");
@@ -219,7 +219,7 @@ TEST_F(OpenSSLPrograms, ServerAndOurClientExchangeMuch)
     EXPECT_EQ(server->output(), std::string(1, '\0') + data);
 }
 
-TEST_F(OpenSSLPrograms, OurClientTakesNewKeysOfAServer)
+TEST_F(OpenSSLPrograms, OurClientAcceptsAKeyUpdateOfAServer)
 {
     const auto server = startServer(credentials(mServerFiles));
     server->writeInput("v");
@@ -236,7 +236,7 @@ TEST_F(OpenSSLPrograms, OurClientTakesNewKeysOfAServer)
     }
 }
 
-TEST_F(OpenSSLPrograms, AServerThatQuitsIsTheEnd)
+TEST_F(OpenSSLPrograms, AServerThatQuitsEndsTheStream)
 {
     const auto server = startServer(credentials(mServerFiles));
     server->writeInput("v");
@@ -331,7 +331,7 @@ protected:
     TemporaryDirectory mDirectory;
 };
 
-TEST_F(OpenSSLCredentials, ServeOurStreams)
+TEST_F(OpenSSLCredentials, WorkInOurStreams)
 {
     makeRoot("root");
     issue("root", "console");

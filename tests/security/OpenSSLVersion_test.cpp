@@ -1,5 +1,5 @@
-// Which OpenSSL these tests run with. A build against another version than the system's could otherwise load the
-// system's all the same, and every other test would pass without having tried what it was built for.
+// Which OpenSSL these tests run with. A build against another version than the system's could still load the system's,
+// and the other tests would then pass without testing that version.
 
 #include <qel/common/security/SSLContext.hpp>
 
@@ -18,7 +18,7 @@ using testing::StartsWith;
 
 namespace {
 
-// "OpenSSL 3.0" of "OpenSSL 3.0.20 1 Jan 2030": what is compatible with it carries the same two numbers.
+// "OpenSSL 3.0" of "OpenSSL 3.0.20 1 Jan 2030": compatible versions share these two numbers.
 std::string release(const std::string& version) { return version.substr(0, version.find('.', version.find('.') + 1)); }
 
 /// @param name  of a library, without a version: "libssl.so"
@@ -40,19 +40,19 @@ std::vector<std::string> loadedLibraries(const std::string& name)
     return search.files;
 }
 
-TEST(OpenSSLVersion, IsAtRunTimeTheReleaseThatTheHeadersCameFrom)
+TEST(OpenSSLVersion, TheLoadedReleaseIsThatOfTheHeaders)
 {
     EXPECT_EQ(release(OpenSSL_version(OPENSSL_VERSION)), release(OPENSSL_VERSION_TEXT));
 }
 
-TEST(OpenSSLVersion, IsAtRunTimeTheOneThatTheBuildAskedFor)
+TEST(OpenSSLVersion, TheLoadedVersionIsTheRequestedOne)
 {
     const std::string asked = std::string("OpenSSL ") + QEL_EXPECTED_OPENSSL; // nothing: any version will do
     EXPECT_THAT(std::string(OPENSSL_VERSION_TEXT), StartsWith(asked));
     EXPECT_THAT(std::string(OpenSSL_version(OPENSSL_VERSION)), StartsWith(asked));
 }
 
-// The library and its tests are linked one by one, so each might have found its own.
+// The library and its tests are linked separately, so each might load a different one.
 TEST(OpenSSLVersion, IsLoadedOnce)
 {
     const qel::SSLClientContext context; // the library is in use

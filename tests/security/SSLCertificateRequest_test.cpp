@@ -44,7 +44,7 @@ static_assert(sizeof(SSLCertificateRequest) == sizeof(X509_REQ*) + sizeof(RSAPri
 const char* const kBadFormat = "X509 certificate request string is not in a supported format";
 const char* const kFile = "SSLCertificateRequest.cpp";
 
-// A request that is shared by all tests, which must not change it.
+// A request shared by all tests; they must not change it.
 const SSLCertificateRequest& shared()
 {
     static const SSLCertificateRequest sRequest(SSLSubject{{"CN", "console"}, {"O", "Org"}, {"C", "US"}});
@@ -105,7 +105,7 @@ TEST(SSLCertificateRequestNew, MayHaveAnEmptySubject)
     EXPECT_EQ(SSLCertificateRequest(request.getPEM()).getPEM(), request.getPEM());
 }
 
-TEST(SSLCertificateRequestNew, RefusesWhatCannotBeAName)
+TEST(SSLCertificateRequestNew, RefusesInvalidFieldsAndValues)
 {
     const QuickKeys quick;
     for (const SSLSubject& subject :
@@ -148,7 +148,7 @@ TEST(SSLCertificateRequestText, LoadsBackWithoutKey)
     EXPECT_EQ(loaded.getPrivateKey(), nullptr);
 }
 
-TEST(SSLCertificateRequestText, MayHoldMore)
+TEST(SSLCertificateRequestText, LoadsTheFirstOfItsKindFromALongerText)
 {
     const std::string pem = shared().getPEM();
     const std::string other = Authority::trusted().clientRequest().getPEM();
@@ -158,7 +158,7 @@ TEST(SSLCertificateRequestText, MayHoldMore)
     EXPECT_EQ(SSLCertificateRequest(pem.substr(0, pem.size() - 1)).getPEM(), pem);
 }
 
-TEST(SSLCertificateRequestText, IsRefusedWhenItHoldsNoRequest)
+TEST(SSLCertificateRequestText, RefusesATextWithoutARequest)
 {
     const std::string pem = shared().getPEM();
     std::string spoilt = pem;

@@ -36,13 +36,13 @@ std::string errorText(int reason)
     return text.data();
 }
 
-TEST(SSLException, CarriesAMessageAsItIs)
+TEST(SSLException, KeepsItsMessage)
 {
     EXPECT_STREQ(SSLException(std::string("no such key")).what(), "no such key");
     EXPECT_STREQ(SSLException(std::string()).what(), "");
 }
 
-TEST(SSLException, SaysWhereAnErrorOccurred)
+TEST(SSLException, NamesFileAndLineOfTheError)
 {
     EXPECT_STREQ(SSLException("common/security/Some.cpp", 1234567).what(),
                  "An SSL error occurred at common/security/Some.cpp:1234567");

@@ -25,8 +25,8 @@ static_assert(isOwnerOf<RSA_PTR, RSA, RSA_free>(), "");
 static_assert(isOwnerOf<BN_PTR, BIGNUM, BN_free>(), "");
 static_assert(isOwnerOf<ASN1_INT_PTR, ASN1_INTEGER, ASN1_INTEGER_free>(), "");
 
-// What the address sanitizer sees as a leak when a pointer does not free its handle.
-TEST(SSLTypes, OwnWhatOpenSSLMakes)
+// The address sanitizer reports a leak when a pointer does not free its handle.
+TEST(SSLTypes, FreeTheirHandles)
 {
     const SSL_CTX_PTR context(SSL_CTX_new(TLS_method()));
     ASSERT_NE(context, nullptr);

@@ -1,7 +1,7 @@
 #include <chrono>
 #include <ctime>
 
-// Some C headers define these; the header is to live with them.
+// Some C headers define these macros; the header must work with them.
 #define min(a, b) ((a) < (b) ? (a) : (b))
 #define max(a, b) ((a) > (b) ? (a) : (b))
 #include <qel/common/security/SSLValidityPeriod.hpp>
@@ -55,7 +55,7 @@ TEST(SSLValidityPeriodClock, IsTheCalendarOfTheSystem)
     EXPECT_GT(now, 1700000000);
 }
 
-TEST(SSLValidityPeriodClock, ReadsTheTimeOfTheSystemOnly)
+TEST(SSLValidityPeriodClock, ReadsOnlyTheSystemTime)
 {
     CalendarTime calendar(kNow);
     SettableClock substituted;
@@ -74,7 +74,7 @@ TEST(SSLValidityPeriodClock, ConvertsExactly)
     }
 }
 
-TEST(SSLValidityPeriod, OfADurationBeginsADayAgoAndEndsThatLongFromNow)
+TEST(SSLValidityPeriod, OfADurationBeginsADayAgo)
 {
     const CalendarTime calendar(kNow);
     const SSLValidityPeriod period(seconds(10));
@@ -112,7 +112,7 @@ TEST(SSLValidityPeriod, DoesNotFollowASubstitutedClock)
     EXPECT_EQ(beginOf(second), kNow - kDay);
 }
 
-TEST(SSLValidityPeriod, MayBeEmptyOrHavePassed)
+TEST(SSLValidityPeriod, AcceptsAnEmptyAndAPastPeriod)
 {
     const CalendarTime calendar(kNow);
     const SSLValidityPeriod none(seconds(0));
@@ -146,7 +146,7 @@ TEST(SSLValidityPeriod, DaysHaveTwentyFourHours)
     EXPECT_EQ(SSLValidityPeriod::days(3650000), hours(87600000));
 }
 
-TEST(SSLValidityPeriod, DaysStayWithinTheirType)
+TEST(SSLValidityPeriod, DaysAreClampedToTheirType)
 {
     const auto most = static_cast<unsigned long>((seconds::max)().count() / kDay);
     EXPECT_EQ(SSLValidityPeriod::days(most).count(), static_cast<seconds::rep>(most) * kDay);
@@ -155,7 +155,7 @@ TEST(SSLValidityPeriod, DaysStayWithinTheirType)
     EXPECT_EQ(SSLValidityPeriod::days(std::numeric_limits<unsigned long>::max()), SSLValidityPeriod::days(most));
 }
 
-TEST(SSLValidityPeriod, TakesTwoPointsInTimeAsTheyAre)
+TEST(SSLValidityPeriod, KeepsTwoTimePointsUnchanged)
 {
     const SSLValidityPeriod period(Clock::from_time_t(kNow), Clock::from_time_t(5));
     EXPECT_EQ(beginOf(period), kNow);

@@ -44,14 +44,14 @@ TEST(CertificateState, ChangesAtTheSecond)
     }
 }
 
-TEST(CertificateState, WithinNothingIsDueInTheLastSecondOnly)
+TEST(CertificateState, WithinZeroIsDueOnlyInTheLastSecond)
 {
     const SSLValidityPeriod validity(at(1000), at(2000));
     EXPECT_EQ(stateAt(validity, at(1999), seconds(0)), CertificateState::Fine);
     EXPECT_EQ(stateAt(validity, at(2000), seconds(0)), CertificateState::Due);
 }
 
-TEST(CertificateState, OneThatEndsBeforeItBeginsIsExpiredOnceItHasEnded)
+TEST(CertificateState, AReversedPeriodIsExpiredAfterItsEnd)
 {
     const SSLValidityPeriod validity(at(2000), at(1000));
     EXPECT_EQ(stateAt(validity, at(1000), seconds(0)), CertificateState::NotYetValid);
@@ -80,15 +80,16 @@ TEST(ParsePeriod, IsAtMostAHundredYears)
     }
 }
 
-TEST(ParsePeriod, IsNothingElse)
+TEST(ParsePeriod, RefusesEverythingElse)
 {
     for (const char* text :
          {"", "d", "30", "d30", "30D", "30y", "-1d", "+1d", "1.5d", " 1d", "1 d", "1d ", "1d1h", "0x1d"}) {
         SCOPED_TRACE(text);
-        EXPECT_THAT([&] { parsePeriod(text); },
-                    ThrowsMessage<std::invalid_argument>(StrEq(
-                        "\"" + std::string(text) +
-                        "\" is no length of time: a number with s, m, h, d or w, as in 30d, and at most 100 years")));
+        EXPECT_THAT(
+            [&] { parsePeriod(text); },
+            ThrowsMessage<std::invalid_argument>(
+                StrEq("\"" + std::string(text) +
+                      "\" is not a length of time: a number with s, m, h, d or w, as in 30d, and at most 100 years")));
     }
 }
 

@@ -38,7 +38,7 @@ SSLCertificateRequest requestFor(const std::vector<std::pair<std::string, std::s
     return request;
 }
 
-TEST(CertificateView, TellsWhatACertificateSays)
+TEST(CertificateView, ReportsTheFactsOfACertificate)
 {
     const SSLCertificate& certificate = Authority::trusted().server();
     const auto facts = factsOf(certificate);
@@ -60,7 +60,7 @@ TEST(CertificateView, AFingerprintNamesOneCertificate)
     EXPECT_NE(tool::fingerprintOf(server), tool::fingerprintOf(Authority::trusted().client()));
 }
 
-TEST(CertificateView, TellsWhatARequestSays)
+TEST(CertificateView, ReportsTheFactsOfARequest)
 {
     const auto facts = factsOf(Authority::trusted().clientRequest());
     EXPECT_EQ(textOf(facts.subject), "[CN:client]");
@@ -76,7 +76,7 @@ TEST(CertificateView, ANameKeepsItsOrderItsRepetitionsAndItsUtf8)
     EXPECT_EQ(textOf(factsOf(request).subject), "[OU:b][CN:\xC3\xA9][OU:a][1.2.3.4:x]");
 }
 
-TEST(CertificateView, AValueThatIsNoTextIsWrittenInHex)
+TEST(CertificateView, AValueThatIsNotTextIsPrintedInHex)
 {
     SSLCertificateRequest request = requestFor({});
     const unsigned char bytes[] = {0x00, 0x1B, 0xFF};
@@ -123,7 +123,7 @@ TEST(CertificateView, AnAttributeHasOneName)
     EXPECT_EQ(attributeName(""), "");
 }
 
-TEST(CertificateView, AValueThatCannotBeIsToldFromOneThatCan)
+TEST(CertificateView, ReportsWhyAValueIsNotAllowed)
 {
     EXPECT_EQ(objectionTo("CN", std::string(64, 'x')), "");
     EXPECT_EQ(objectionTo("CN", std::string(65, 'x')), "string too long");

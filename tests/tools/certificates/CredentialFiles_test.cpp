@@ -101,7 +101,7 @@ TEST_F(CredentialFilesTest, LieInADirectoryByName)
     EXPECT_EQ(tool::credentialPaths("", "x").key, "x.key");
 }
 
-TEST_F(CredentialFilesTest, ANameIsOneFilesName)
+TEST_F(CredentialFilesTest, ANameIsAPlainFileName)
 {
     const auto check = [](std::string name) { return tool::credentialNameValidator()(name); };
     for (const std::string& name : {std::string("a"), std::string("7"), std::string("Console-1.example_x"),
@@ -112,9 +112,10 @@ TEST_F(CredentialFilesTest, ANameIsOneFilesName)
          {std::string(), std::string("."), std::string(".."), std::string(".a"), std::string("-a"), std::string("_a"),
           std::string("a/b"), std::string("../a"), std::string("a b"), std::string("a\nb"), std::string("a\0b", 3),
           std::string("\xC3\xA9"), std::string("a*"), std::string(65, 'x')}) {
-        EXPECT_EQ(check(name), "'" + name +
-                                   "' is no name: 1 to 64 letters, digits, '.', '_' and '-', the first a letter "
-                                   "or a digit");
+        EXPECT_EQ(check(name),
+                  "'" + name +
+                      "' is not a name for credentials: 1 to 64 letters, digits, '.', '_' and '-', the first a letter "
+                      "or a digit");
     }
 }
 
@@ -132,7 +133,7 @@ TEST_F(CredentialFilesTest, AKeyThatOthersMayReadOrWriteIsRefused)
         const std::string key = write("k", "key", mode);
         EXPECT_THAT([&] { tool::readKeyFile(key, KeyPermissions::OwnerOnly); },
                     refused<CommandFailure>("others may read or write the private key " + key + " (mode " + text +
-                                            "): take that from them with chmod 600, or say --insecure-permissions"));
+                                            "): use chmod 600, or --insecure-permissions to allow it"));
         EXPECT_EQ(tool::readKeyFile(key, KeyPermissions::Any), "key");
     }
 }
@@ -156,9 +157,9 @@ TEST_F(CredentialFilesTest, OnlyRegularFilesAreRead)
 {
     ASSERT_EQ(::mkfifo(file("fifo").c_str(), 0600), 0);
     for (const std::string& name : {file("fifo"), path(), std::string("/dev/zero")}) {
-        EXPECT_THAT([&] { tool::readPemFile(name); }, refused<CommandFailure>(name + " is no regular file"));
+        EXPECT_THAT([&] { tool::readPemFile(name); }, refused<CommandFailure>(name + " is not a regular file"));
         EXPECT_THAT([&] { tool::readKeyFile(name, KeyPermissions::OwnerOnly); },
-                    refused<CommandFailure>(name + " is no regular file"));
+                    refused<CommandFailure>(name + " is not a regular file"));
     }
 }
 
@@ -177,7 +178,7 @@ TEST_F(CredentialFilesTest, AFileThatIsMissingIsNamed)
         ThrowsMessage<FileIOError>(StrEq("cannot open " + file("missing") + ": 2 (No such file or directory)")));
 }
 
-TEST_F(CredentialFilesTest, AllThreeAreReadAsTheyAre)
+TEST_F(CredentialFilesTest, AllThreeAreReadUnchanged)
 {
     write("server.crt", "certificate");
     write("server.key", "key");
@@ -200,7 +201,7 @@ TEST_F(CredentialFilesTest, ADirectoryIsMadeForItsOwnerOnly)
     EXPECT_EQ(modeOf("new"), 0700U);
 }
 
-TEST_F(CredentialFilesTest, ADirectoryThatIsThereStaysAsItIs)
+TEST_F(CredentialFilesTest, AnExistingDirectoryStaysUnchanged)
 {
     ASSERT_EQ(::mkdir(file("there").c_str(), 0750), 0);
     ASSERT_EQ(::chmod(file("there").c_str(), 0755), 0);
@@ -208,7 +209,7 @@ TEST_F(CredentialFilesTest, ADirectoryThatIsThereStaysAsItIs)
     EXPECT_EQ(modeOf("there"), 0755U);
 }
 
-TEST_F(CredentialFilesTest, WhereNoDirectoryCanBeIsAnError)
+TEST_F(CredentialFilesTest, ADirectoryThatCannotBeMadeIsAnError)
 {
     write("file", "");
     EXPECT_THAT([&] { tool::makeDirectory(file("file")); },
@@ -260,7 +261,7 @@ TEST_F(NewFilesTest, AreCreatedWithTheirMode)
     }
 }
 
-TEST_F(NewFilesTest, KeepWhatIsThere)
+TEST_F(NewFilesTest, KeepExistingFiles)
 {
     write("b", "old");
     NewFiles files(path(), Existing::Keep);
@@ -269,10 +270,10 @@ TEST_F(NewFilesTest, KeepWhatIsThere)
         [&] {
             files.checkFree({"a", "b"});
         },
-        refused<CommandFailure>(file("b") + " is there already; --force replaces it"));
+        refused<CommandFailure>(file("b") + " already exists; --force replaces it"));
 }
 
-TEST_F(NewFilesTest, ALinkToNothingIsAlsoThere)
+TEST_F(NewFilesTest, ADanglingLinkCountsAsAnExistingFile)
 {
     fs::create_symlink(file("nowhere"), file("a"));
     NewFiles files(path(), Existing::Keep);
@@ -283,7 +284,7 @@ TEST_F(NewFilesTest, ALinkToNothingIsAlsoThere)
 }
 
 // Another program made the file after it had been looked for.
-TEST_F(NewFilesTest, KeepWhatHasComeInTheMeantimeAndTakeBackTheRest)
+TEST_F(NewFilesTest, KeepAFileThatAppearedMeanwhileAndRemoveTheOthers)
 {
     {
         NewFiles files(path(), Existing::Keep);
@@ -293,13 +294,13 @@ TEST_F(NewFilesTest, KeepWhatHasComeInTheMeantimeAndTakeBackTheRest)
         files.add("c", "three", Readers::Owner);
         write("b", "another's");
         EXPECT_THAT([&] { files.publish(); },
-                    refused<CommandFailure>(file("b") + " is there already; --force replaces it"));
+                    refused<CommandFailure>(file("b") + " already exists; --force replaces it"));
     }
     EXPECT_THAT(names(), ElementsAre("b"));
     EXPECT_EQ(read("b"), "another's");
 }
 
-TEST_F(NewFilesTest, ReplaceWhenTheyShall)
+TEST_F(NewFilesTest, ReplaceExistingFilesOnRequest)
 {
     write("a", "a long old text", 0644);
     NewFiles files(path(), Existing::Replace);
@@ -312,7 +313,7 @@ TEST_F(NewFilesTest, ReplaceWhenTheyShall)
     EXPECT_THAT(names(), ElementsAre("a"));
 }
 
-TEST_F(NewFilesTest, ReplaceALinkAndNotWhatItPointsTo)
+TEST_F(NewFilesTest, ReplaceALinkButNotItsTarget)
 {
     write("target", "old");
     fs::create_symlink(file("target"), file("a"));

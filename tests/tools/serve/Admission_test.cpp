@@ -123,7 +123,7 @@ TEST_F(AdmissionTest, ASilentConsoleIsClosedWhenTheTimeIsOver)
 {
     start(std::chrono::milliseconds(20));
     expectClosed();
-    expectRefusal("the other end did not ask for TLS in time");
+    expectRefusal("the peer did not ask for TLS in time");
 }
 
 TEST_F(AdmissionTest, AConsoleThatStopsInTheMiddleOfItsRequestIsClosedWhenTheTimeIsOver)
@@ -132,7 +132,7 @@ TEST_F(AdmissionTest, AConsoleThatStopsInTheMiddleOfItsRequestIsClosedWhenTheTim
     const QelMessageUpgradeConnectionAsync request;
     loopback.near->write(request.serialize(), request.msgLength() - 1);
     expectClosed();
-    expectRefusal("the other end did not ask for TLS in time");
+    expectRefusal("the peer did not ask for TLS in time");
 }
 
 TEST_F(AdmissionTest, AConsoleThatAsksAndThenSaysNothingIsClosedWhenTheTimeIsOver)
@@ -141,7 +141,7 @@ TEST_F(AdmissionTest, AConsoleThatAsksAndThenSaysNothingIsClosedWhenTheTimeIsOve
     send(QelMessageUpgradeConnectionAsync());
     expect<QelMessageUpgradeConnectionAsync>();
     expectClosed();
-    expectRefusal("the TLS handshake was not done in time");
+    expectRefusal("the TLS handshake did not finish in time");
 }
 
 TEST_F(AdmissionTest, TheTimeIsOneForAllSteps)
@@ -163,7 +163,7 @@ TEST_F(AdmissionTest, AConsoleThatGoesIsNoticed)
 {
     start();
     loopback.near.reset();
-    expectRefusal("the other end did not ask for TLS but ended the connection: EOF");
+    expectRefusal("the peer did not ask for TLS but ended the connection: EOF");
 }
 
 TEST_F(AdmissionTest, AConsoleThatDoesNotAskIsTurnedAway)
@@ -174,7 +174,7 @@ TEST_F(AdmissionTest, AConsoleThatDoesNotAskIsTurnedAway)
     expectClosed();
     awaitEnd();
     EXPECT_EQ(admission->release().stream, nullptr);
-    EXPECT_THAT(log.lines(), Contains(HasSubstr("the test: not let in: the other end did not ask for TLS but sent "
+    EXPECT_THAT(log.lines(), Contains(HasSubstr("the test: not let in: the peer did not ask for TLS but sent "
                                                 "something else: [CID: ")));
 }
 
@@ -183,7 +183,7 @@ TEST_F(AdmissionTest, TlsThatBeginsWithoutAskingIsNoMessage)
     start();
     const std::string hello("\x16\x03\x01\x02\x00\x01\x00\x01\xfc\x03\x03", 11);
     loopback.near->write(hello.data(), hello.size());
-    expectRefusal("the other end did not ask for TLS but sent something else: Invalid length");
+    expectRefusal("the peer did not ask for TLS but sent something else: Invalid length");
 }
 
 TEST_F(AdmissionTest, WhatComesBehindTheRequestInTheClearIsNotUsed)
@@ -194,7 +194,7 @@ TEST_F(AdmissionTest, WhatComesBehindTheRequestInTheClearIsNotUsed)
         std::string(request.serialize(), request.msgLength()) + std::string(version.serialize(), version.msgLength());
     loopback.near->write(both.data(), both.size());
     start();
-    expectRefusal("the other end did not wait for its turn in the handshake");
+    expectRefusal("the peer sent data too early in the handshake");
 }
 
 TEST_F(AdmissionTest, MessagesInsteadOfTlsAreNotUsed)
@@ -286,7 +286,7 @@ TEST_F(AdmissionTest, AConsoleWithACertificateOfAnotherRootIsRefused)
     clientContext.setCredentials(stranger);
     start();
     EXPECT_THROW(startTls(), StreamIOException);
-    expectRefusal("the other end has no valid certificate of our root: unable to get local issuer certificate");
+    expectRefusal("the peer's certificate is refused: unable to get local issuer certificate");
 }
 
 TEST_F(AdmissionTest, OnlyThosePinnedComeIn)
@@ -295,7 +295,7 @@ TEST_F(AdmissionTest, OnlyThosePinnedComeIn)
     const auto console = startTls(); // for the console TLS is done
     char byte = 0;
     EXPECT_EQ(console->read(&byte, 1), 0U);
-    expectRefusal("the other end is not who it should be: the name \"client\" is not what --peer-name says");
+    expectRefusal("wrong peer: the name \"client\" does not match --peer-name");
 }
 
 TEST_F(AdmissionTest, WhomThePinsNameComesIn)

@@ -70,34 +70,33 @@ TEST(RequestUpgrade, SendsTheUpgradeMessageAndTakesItAsTheAnswer)
     EXPECT_EQ(stream.bytesLeft(), 0U);
 }
 
-TEST(RequestUpgrade, TheAbortMessageIsARefusal)
+TEST(RequestUpgrade, TheAbortMessageIsRefused)
 {
     ScriptedStream stream;
     stream.deliver(abortMessage());
     EXPECT_THAT([&] { tool::requestUpgrade(stream, kNoDescriptor); },
-                failsWith(ExitStatus::Refused, StartsWith("the hypervisor end turned this console away: ")));
+                failsWith(ExitStatus::Refused, StartsWith("the server refused this console: ")));
 }
 
 TEST(RequestUpgrade, AnyOtherMessageBreaksTheProtocol)
 {
     ScriptedStream stream;
     stream.deliver(frameOf(QelMessageGetQelTodReq()));
-    EXPECT_THAT(
-        [&] { tool::requestUpgrade(stream, kNoDescriptor); },
-        failsWith(ExitStatus::ProtocolBroken,
-                  StartsWith("the other end did not answer the request for TLS but sent something else: [CID: ")));
+    EXPECT_THAT([&] { tool::requestUpgrade(stream, kNoDescriptor); },
+                failsWith(ExitStatus::ProtocolBroken,
+                          StartsWith("the peer did not answer the request for TLS but sent something else: [CID: ")));
 }
 
-TEST(RequestUpgrade, WhatIsNoMessageBreaksTheProtocol)
+TEST(RequestUpgrade, BytesThatAreNotAMessageBreakTheProtocol)
 {
     ScriptedStream stream;
     stream.deliver(std::vector<char>(64, '\x16'));
     EXPECT_THAT([&] { tool::requestUpgrade(stream, kNoDescriptor); },
                 failsWith(ExitStatus::ProtocolBroken,
-                          "the other end did not answer the request for TLS but sent something else: Invalid length"));
+                          "the peer did not answer the request for TLS but sent something else: Invalid length"));
 }
 
-TEST(RequestUpgrade, AnEndOfTheConnectionIsSaid)
+TEST(RequestUpgrade, ReportsTheEndOfTheConnection)
 {
     for (std::size_t length : {std::size_t{0}, std::size_t{5}, upgrade().size() - 1}) {
         SCOPED_TRACE(length);
@@ -108,16 +107,16 @@ TEST(RequestUpgrade, AnEndOfTheConnectionIsSaid)
         stream.end();
         EXPECT_THAT([&] { tool::requestUpgrade(stream, kNoDescriptor); },
                     failsWith(ExitStatus::ClosedByPeer,
-                              "the other end did not answer the request for TLS but ended the connection: EOF"));
+                              "the peer did not answer the request for TLS but ended the connection: EOF"));
     }
 }
 
-TEST(RequestUpgrade, ADeadlineIsSaid)
+TEST(RequestUpgrade, ReportsAPassedDeadline)
 {
     ScriptedStream stream;
     stream.fail("I/O deadline");
     EXPECT_THAT([&] { tool::requestUpgrade(stream, kNoDescriptor); },
-                failsWith(ExitStatus::DeadlinePassed, "the other end did not answer the request for TLS in time"));
+                failsWith(ExitStatus::DeadlinePassed, "the peer did not answer the request for TLS in time"));
 }
 
 TEST(RequestUpgrade, NothingBeyondTheAnswerIsRead)
@@ -130,7 +129,7 @@ TEST(RequestUpgrade, NothingBeyondTheAnswerIsRead)
     EXPECT_EQ(stream.bytesLeft(), 1U);
 }
 
-TEST(RequestUpgrade, BytesBehindTheAnswerBreakTheProtocol)
+TEST(RequestUpgrade, BytesAfterTheAnswerBreakTheProtocol)
 {
     Loopback loopback;
     auto both = upgrade();
@@ -138,7 +137,7 @@ TEST(RequestUpgrade, BytesBehindTheAnswerBreakTheProtocol)
     loopback.near->write(both.data(), both.size());
     loopback.far->setReadDeadline(Loopback::kDeadline);
     EXPECT_THAT([&] { tool::requestUpgrade(*loopback.far, loopback.far->getSocket().getFd()); },
-                failsWith(ExitStatus::ProtocolBroken, "the other end did not wait for its turn in the handshake"));
+                failsWith(ExitStatus::ProtocolBroken, "the peer sent data too early in the handshake"));
 }
 
 // The hypervisor end's step.
@@ -160,22 +159,22 @@ TEST(AwaitUpgrade, AnyOtherMessageIsAnsweredWithTheAbortMessage)
         stream.deliver(frame);
         EXPECT_THAT([&] { tool::awaitUpgrade(stream, kNoDescriptor); },
                     failsWith(ExitStatus::ProtocolBroken,
-                              StartsWith("the other end did not ask for TLS but sent something else: [CID: ")));
+                              StartsWith("the peer did not ask for TLS but sent something else: [CID: ")));
         EXPECT_TRUE(wrote<QelMessageAbortHandshakeAsync>(stream));
     }
 }
 
-TEST(AwaitUpgrade, WhatIsNoMessageIsAnsweredWithNothing)
+TEST(AwaitUpgrade, BytesThatAreNotAMessageGetNoAnswer)
 {
     ScriptedStream stream;
     stream.deliver(std::vector<char>(64, '\x16'));
-    EXPECT_THAT([&] { tool::awaitUpgrade(stream, kNoDescriptor); },
-                failsWith(ExitStatus::ProtocolBroken,
-                          "the other end did not ask for TLS but sent something else: Invalid length"));
+    EXPECT_THAT(
+        [&] { tool::awaitUpgrade(stream, kNoDescriptor); },
+        failsWith(ExitStatus::ProtocolBroken, "the peer did not ask for TLS but sent something else: Invalid length"));
     EXPECT_TRUE(stream.written().empty());
 }
 
-TEST(AwaitUpgrade, BytesBehindTheRequestBreakTheProtocol)
+TEST(AwaitUpgrade, BytesAfterTheRequestBreakTheProtocol)
 {
     Loopback loopback;
     auto both = upgrade();
@@ -183,10 +182,10 @@ TEST(AwaitUpgrade, BytesBehindTheRequestBreakTheProtocol)
     loopback.near->write(both.data(), both.size());
     loopback.far->setReadDeadline(Loopback::kDeadline);
     EXPECT_THAT([&] { tool::awaitUpgrade(*loopback.far, loopback.far->getSocket().getFd()); },
-                failsWith(ExitStatus::ProtocolBroken, "the other end did not wait for its turn in the handshake"));
+                failsWith(ExitStatus::ProtocolBroken, "the peer sent data too early in the handshake"));
 }
 
-TEST(AwaitUpgrade, AConsoleThatOnlyEndsItsSideHasNotSpokenOutOfTurn)
+TEST(AwaitUpgrade, AConsoleThatShutsDownItsSideIsNotTooEarly)
 {
     Loopback loopback;
     loopback.near->write(upgrade().data(), upgrade().size());
@@ -202,16 +201,16 @@ TEST(AbortHandshake, SendsTheAbortMessage)
     EXPECT_TRUE(wrote<QelMessageAbortHandshakeAsync>(stream));
 }
 
-TEST(GrantUpgrade, AConsoleThatIsGoneIsSaid)
+TEST(GrantUpgrade, ReportsAConsoleThatHasGone)
 {
     ScriptedStream stream;
     stream.failWriteAt(0, "gone");
     EXPECT_THAT([&] { tool::grantUpgrade(stream); },
-                failsWith(ExitStatus::ClosedByPeer, "the other end did not take the answer to its request for TLS but "
+                failsWith(ExitStatus::ClosedByPeer, "the peer did not take the answer to its request for TLS but "
                                                     "ended the connection: gone"));
 }
 
-TEST(LimitTo, BothDirectionsGetWhatIsLeftAndAtLeastAMillisecond)
+TEST(LimitTo, GivesBothDirectionsTheRemainingTime)
 {
     ScriptedStream stream;
     tool::limitTo(stream, TimeProvider::steady() - std::chrono::seconds(1));
@@ -268,54 +267,51 @@ protected:
 
     const SSLCredentials client = Authority::trusted().clientCredentials();
     const SSLCredentials server = Authority::trusted().serverCredentials();
-    const std::string refusedByTheOther = "7: the other end ended the connection in the TLS handshake, perhaps because "
-                                          "it does not accept this end's certificate: ";
+    const std::string refusedByTheOther =
+        "7: the peer closed the connection in the TLS handshake, perhaps because it refuses this end's certificate: ";
 };
 
-TEST_F(StartTls, BothEndsComeThrough)
+TEST_F(StartTls, SucceedsAtBothEnds)
 {
     const Outcomes outcomes = start(client, server);
     EXPECT_EQ(outcomes.console, "");
     EXPECT_EQ(outcomes.hypervisor, "");
 }
 
-TEST_F(StartTls, AnExpiredCertificateIsNamedByWhomItIsShownTo)
+TEST_F(StartTls, ThePeerOfAnExpiredCertificateReportsIt)
 {
     const Outcomes console = start(expiredCredentials(Authority::trusted().clientRequest()), server);
     EXPECT_THAT(console.console, StartsWith(refusedByTheOther));
-    EXPECT_EQ(console.hypervisor, "1: the other end has no valid certificate of our root: certificate has expired");
+    EXPECT_EQ(console.hypervisor, "1: the peer's certificate is refused: certificate has expired");
 
     const Outcomes hypervisor = start(client, expiredCredentials(Authority::trusted().serverRequest()));
-    EXPECT_EQ(hypervisor.console, "1: the other end has no valid certificate of our root: certificate has expired");
+    EXPECT_EQ(hypervisor.console, "1: the peer's certificate is refused: certificate has expired");
     EXPECT_THAT(hypervisor.hypervisor, StartsWith(refusedByTheOther));
 }
 
-TEST_F(StartTls, ACertificateThatIsNotYetValidIsNamed)
+TEST_F(StartTls, ReportsACertificateThatIsNotYetValid)
 {
     const Outcomes outcomes = start(futureCredentials(Authority::trusted().clientRequest()), server);
-    EXPECT_EQ(outcomes.hypervisor,
-              "1: the other end has no valid certificate of our root: certificate is not yet valid");
+    EXPECT_EQ(outcomes.hypervisor, "1: the peer's certificate is refused: certificate is not yet valid");
 }
 
-TEST_F(StartTls, ACertificateOfAnotherRootIsNamed)
+TEST_F(StartTls, ReportsACertificateOfAnotherRoot)
 {
     const Outcomes outcomes = start(strangerThatTrustsUs(), server);
     EXPECT_THAT(outcomes.console, StartsWith(refusedByTheOther));
-    EXPECT_EQ(outcomes.hypervisor,
-              "1: the other end has no valid certificate of our root: unable to get local issuer certificate");
+    EXPECT_EQ(outcomes.hypervisor, "1: the peer's certificate is refused: unable to get local issuer certificate");
 }
 
-TEST_F(StartTls, ACertificateWithTheSubjectOfTheRootIsNamed)
+TEST_F(StartTls, ReportsACertificateWithTheRootsSubject)
 {
     const Authority& authority = Authority::trusted();
     const SSLCertificateRequest request(authority.root().getSubject());
     const SSLCertificate impostor = authority.issue(request, SSLValidityPeriod::days(1));
     const Outcomes outcomes = start(client, authority.credentialsOf(impostor));
-    EXPECT_THAT(outcomes.console,
-                MatchesRegex("1: the other end has no valid certificate of our root: self.signed certificate"));
+    EXPECT_THAT(outcomes.console, MatchesRegex("1: the peer's certificate is refused: self.signed certificate"));
 }
 
-TEST_F(StartTls, WhatIsNoTlsBreaksTheProtocol)
+TEST_F(StartTls, BytesThatAreNotTlsBreakTheProtocol)
 {
     Loopback loopback;
     SSLServerContext context;
@@ -325,14 +321,14 @@ TEST_F(StartTls, WhatIsNoTlsBreaksTheProtocol)
     EXPECT_EQ(outcomeOf([&] { tool::startTls(stream); }), "5: the TLS handshake failed: SSL error 1");
 }
 
-TEST_F(StartTls, ADeadlineIsSaid)
+TEST_F(StartTls, ReportsAPassedDeadline)
 {
     Loopback loopback;
     SSLServerContext context;
     context.setCredentials(server);
     loopback.far->setReadDeadline(std::chrono::milliseconds(20));
     SSLStream stream(context, std::move(loopback.far));
-    EXPECT_EQ(outcomeOf([&] { tool::startTls(stream); }), "6: the TLS handshake was not done in time");
+    EXPECT_EQ(outcomeOf([&] { tool::startTls(stream); }), "6: the TLS handshake did not finish in time");
 }
 
 } // namespace

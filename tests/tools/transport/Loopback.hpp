@@ -50,6 +50,7 @@ public:
         send(request);
         return receive();
     }
+    Stream& stream() { return mStream; }
     void sendBytes(const std::string& bytes) { mStream.write(bytes.data(), bytes.size()); }
 
     /// True when the other end has ended the connection and nothing was left to read.

@@ -32,14 +32,14 @@ std::string repeated(const std::string& text, unsigned times)
 
 const std::string kNormal = repeated("0A:", 31) + "0A";
 
-TEST(NormalizedFingerprint, EverySpellingBecomesTheOne)
+TEST(NormalizedFingerprint, AcceptsEverySpelling)
 {
     for (const std::string& text : {kNormal, repeated("0a:", 31) + "0a", repeated("0A", 32), repeated("0a", 32)}) {
         EXPECT_EQ(normalizedFingerprint(text), kNormal) << text;
     }
 }
 
-TEST(NormalizedFingerprint, EverythingElseIsNone)
+TEST(NormalizedFingerprint, RefusesEverythingElse)
 {
     const std::vector<std::string> bad{
         "",
@@ -97,7 +97,7 @@ protected:
     SSLStream server{configured(serverContext, Authority::trusted().serverCredentials()), memory.takeServer()};
 };
 
-TEST_F(CheckPeer, WithoutPinsAnyCertificateOfTheRootWillDo)
+TEST_F(CheckPeer, WithoutPinsAcceptsAnyCertificateOfTheRoot)
 {
     EXPECT_NO_THROW(tool::checkPeer(client, {}));
     EXPECT_NO_THROW(tool::checkPeer(server, {}));
@@ -113,7 +113,7 @@ TEST_F(CheckPeer, TheNameMustBeOneOfThoseGiven)
             [&] {
                 tool::checkPeer(client, {{name}, {}});
             },
-            refusal("the other end is not who it should be: the name \"server\" is not what --peer-name says"))
+            refusal("wrong peer: the name \"server\" does not match --peer-name"))
             << name;
     }
 }
@@ -127,8 +127,7 @@ TEST_F(CheckPeer, TheFingerprintMustBeOneOfThoseGiven)
         [&] {
             tool::checkPeer(client, {{}, {kNormal}});
         },
-        refusal("the other end is not who it should be: the fingerprint " + right +
-                " is not what --peer-fingerprint says"));
+        refusal("wrong peer: the fingerprint " + right + " does not match --peer-fingerprint"));
 }
 
 TEST_F(CheckPeer, NameAndFingerprintMustBothBeRight)
@@ -138,7 +137,7 @@ TEST_F(CheckPeer, NameAndFingerprintMustBothBeRight)
     EXPECT_THROW(tool::checkPeer(client, {{"other"}, {serverFingerprint()}}), CommandFailure);
 }
 
-TEST_F(CheckPeer, AConnectionThatIsClosedMeanwhileHasNoPeer)
+TEST_F(CheckPeer, ReportsAConnectionThatWasClosedMeanwhile)
 {
     client.close();
     EXPECT_THAT([&] { tool::checkPeer(client, {}); },
@@ -179,7 +178,7 @@ TEST_F(CheckPeerName, IsTheCommonNameAndNoOtherField)
     EXPECT_THROW(check(subject, "two"), CommandFailure);
 }
 
-TEST_F(CheckPeerName, ACertificateWithoutACommonNameHasNoneThatCouldBePinned)
+TEST_F(CheckPeerName, NoPinMatchesACertificateWithoutACommonName)
 {
     const SSLSubject subject{{"O", "two"}};
     EXPECT_THROW(check(subject, "two"), CommandFailure);

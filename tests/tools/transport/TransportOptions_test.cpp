@@ -47,7 +47,7 @@ Parsed parse(std::vector<std::string> arguments)
 
 // The command line.
 
-TEST(TransportOptions, CredentialsLieInADirectoryByName)
+TEST(TransportOptions, ReadsCredentialsFromADirectory)
 {
     const Parsed parsed = parse({"--credentials", "/etc/qel", "--name", "server"});
     EXPECT_THAT(parsed.failure, IsEmpty());
@@ -59,7 +59,7 @@ TEST(TransportOptions, CredentialsLieInADirectoryByName)
     EXPECT_EQ(parsed.options.handshakeTimeout(), std::chrono::seconds(10));
 }
 
-TEST(TransportOptions, CredentialsAreThreeFiles)
+TEST(TransportOptions, ReadsCredentialsFromThreeFiles)
 {
     const Parsed parsed = parse({"--cert", "a", "--key", "b", "--root", "c"});
     EXPECT_THAT(parsed.failure, IsEmpty());
@@ -80,7 +80,7 @@ TEST(TransportOptions, PinsTimeAndPermissionsAreRead)
     EXPECT_EQ(parsed.options.handshakeTimeout(), std::chrono::milliseconds(250));
 }
 
-TEST(TransportOptions, WhatCannotGoTogetherIsRefused)
+TEST(TransportOptions, RefusesContradictingOptions)
 {
     const std::vector<std::vector<std::string>> bad{
         {"--credentials", "d"},
@@ -109,15 +109,15 @@ TEST(TransportOptions, WhatCannotGoTogetherIsRefused)
         EXPECT_NE(parse(arguments).failure, "") << CLI::detail::join(arguments, " ");
 }
 
-TEST(TransportOptions, TheReasonIsSaid)
+TEST(TransportOptions, RefusalsNameTheReason)
 {
     EXPECT_EQ(parse({"--credentials", "d"}).failure, "--credentials requires --name");
     EXPECT_EQ(parse({"--plain", "--peer-name", "x"}).failure, "--plain excludes --peer-name");
     EXPECT_EQ(parse({"--peer-fingerprint", "xyz"}).failure,
-              "--peer-fingerprint: 'xyz' is no SHA-256 fingerprint: 64 hexadecimal digits");
+              "--peer-fingerprint: 'xyz' is not a SHA-256 fingerprint: 64 hexadecimal digits");
 }
 
-TEST(TransportOptions, AWayMustBeChosen)
+TEST(TransportOptions, RequiresCredentialsOrPlain)
 {
     EXPECT_THAT(
         [] { tool::checkTransport(TransportOptions(), "127.0.0.1:80"); },
@@ -128,7 +128,7 @@ TEST(TransportOptions, AWayMustBeChosen)
     EXPECT_THROW(tool::checkTransport(empty, "127.0.0.1:80"), CLI::ValidationError);
 }
 
-TEST(TransportOptions, PlainIsForLoopbackAloneAndTlsForEveryAddress)
+TEST(TransportOptions, PlainIsForLoopbackOnly)
 {
     TransportOptions plain;
     plain.plain = true;
@@ -187,13 +187,13 @@ TEST_F(TransportCredentials, AreNotNeededForAPlainConnection)
     EXPECT_EQ(tool::makeClientContext(plain), nullptr);
 }
 
-TEST_F(TransportCredentials, ThatAreNotThereAreNamed)
+TEST_F(TransportCredentials, ReportMissingFiles)
 {
     EXPECT_THAT([&] { tool::makeServerContext(optionsOf("nobody")); },
                 ThrowsMessage<FileIOError>(HasSubstr("cannot open " + directory.file("nobody.crt"))));
 }
 
-TEST_F(TransportCredentials, AFileThatDoesNotHoldWhatItShouldIsNamed)
+TEST_F(TransportCredentials, ReportAFileWithTheWrongContent)
 {
     overwrite("root.crt", "nonsense");
     EXPECT_THAT([&] { tool::makeServerContext(optionsOf("server")); },
@@ -208,7 +208,7 @@ TEST_F(TransportCredentials, AFileThatDoesNotHoldWhatItShouldIsNamed)
                 refusal(directory.file("server.key") + ": RSA private key string is not in a supported format"));
 }
 
-TEST_F(TransportCredentials, ACertificateAndTheKeyOfAnotherAreRefused)
+TEST_F(TransportCredentials, RefuseAKeyThatDoesNotMatch)
 {
     overwrite("server.crt", Authority::trusted().client().getPEM());
     EXPECT_THAT([&] { tool::makeServerContext(optionsOf("server")); },
@@ -216,7 +216,41 @@ TEST_F(TransportCredentials, ACertificateAndTheKeyOfAnotherAreRefused)
                         " cannot be used: they do not belong together"));
 }
 
-TEST_F(TransportCredentials, AKeyThatOthersMayReadIsRefusedUnlessItIsSaid)
+TEST_F(TransportCredentials, ReportTheKindOfObjectInTheWrongFile)
+{
+    overwrite("server.crt", Authority::trusted().server().getPrivateKey()->getPEM());
+    EXPECT_THAT([&] { tool::makeServerContext(optionsOf("server")); },
+                refusal(directory.file("server.crt") + " holds a private key, not a certificate"));
+    overwrite("client.key", Authority::trusted().client().getPEM());
+    EXPECT_THAT([&] { tool::makeClientContext(optionsOf("client")); },
+                refusal(directory.file("client.key") + " holds a certificate, not a private key"));
+}
+
+TEST_F(TransportCredentials, AreRefusedOutsideTheirValidity)
+{
+    directory.put("old", expiredCredentials(Authority::trusted().serverRequest()));
+    EXPECT_THAT([&] { tool::makeServerContext(optionsOf("old")); },
+                refusal("own certificate " + directory.file("old.crt") + " expired at "));
+    EXPECT_THAT([&] { tool::makeClientContext(optionsOf("old")); },
+                refusal("own certificate " + directory.file("old.crt") + " expired at "));
+    directory.put("young", futureCredentials(Authority::trusted().serverRequest()));
+    EXPECT_THAT([&] { tool::makeServerContext(optionsOf("young")); },
+                refusal("own certificate " + directory.file("young.crt") + " is not valid before "));
+    EXPECT_THAT([&] { tool::makeClientContext(optionsOf("young")); },
+                refusal("own certificate " + directory.file("young.crt") + " is not valid before "));
+}
+
+TEST_F(TransportCredentials, AreRefusedWithAnExpiredRoot)
+{
+    const auto now = SSLValidityPeriod::Clock::now();
+    const SSLCertificate root(SSLSubject{{"CN", "old root"}},
+                              SSLValidityPeriod(now - std::chrono::hours(48), now - std::chrono::hours(24)));
+    overwrite("root.crt", root.getPEM());
+    EXPECT_THAT([&] { tool::makeClientContext(optionsOf("client")); },
+                refusal("root certificate " + directory.file("root.crt") + " expired at "));
+}
+
+TEST_F(TransportCredentials, RefusesAKeyThatOthersMayReadUnlessAllowed)
 {
     ASSERT_EQ(::chmod(directory.file("server.key").c_str(), 0644), 0);
     TransportOptions options = optionsOf("server");

@@ -10,6 +10,7 @@
 #include "certificates/CertificateState.hpp"
 #include "certificates/CertificateView.hpp"
 #include "certificates/CredentialFiles.hpp"
+#include "certificates/PemContent.hpp"
 #include "certificates/SubjectText.hpp"
 
 #include <csignal>
@@ -24,11 +25,12 @@ namespace {
 
 constexpr unsigned long kRootDays = 3650;
 constexpr unsigned long kLeafDays = 365;
-constexpr unsigned long kMostDays = 36525;
+constexpr unsigned long kMaxDays = 36525;
+constexpr int kMinKeyBits = 2048;
 
 using Clock = SSLValidityPeriod::Clock;
 
-/// The arguments of all subcommands; each looks at its own.
+/// The arguments of all subcommands; each uses its own.
 struct CaOptions {
     std::string directory;
     std::string name;
@@ -48,7 +50,7 @@ struct CaOptions {
 
 [[noreturn]] void refuse(const std::string& reason) { throw CommandFailure(ExitStatus::Refused, reason); }
 
-/// Does something with what a file holds; complaints about the content get the file's name.
+/// Reads facts from the content of a file; errors get the file's name.
 template <typename Use>
 auto usingFile(const std::string& path, const Use& use)
 {
@@ -65,8 +67,8 @@ SSLCertificate loadRoot(const CaOptions& options)
     const std::string keyPath = options.pathOf(keyFile(kRootName));
     const std::string pem = readPemFile(certificatePath);
     const std::string keyPem = readKeyFile(keyPath, options.permissions);
-    const SSLCertificate certificate = usingFile(certificatePath, [&] { return SSLCertificate(pem); });
-    const RSAPrivateKey key = usingFile(keyPath, [&] { return RSAPrivateKey(keyPem); });
+    parseCertificate(certificatePath, pem); // for its message
+    const RSAPrivateKey key = parseKey(keyPath, keyPem);
     try {
         return SSLCertificate(pem, key);
     } catch (const SSLException&) {
@@ -74,19 +76,32 @@ SSLCertificate loadRoot(const CaOptions& options)
     }
 }
 
-/// Signs a request after the checks that the library leaves to its user.
+/// Refuses a key that no end of a connection can use: the library takes RSA keys only, and OpenSSL's usual security
+/// level wants 2048 bits.
+void checkKey(const PublicKeyFacts& key, const std::string& owner)
+{
+    if (key.type == "RSA" && key.bits >= kMinKeyBits) return;
+    const std::string bits = key.bits == 0 ? "" : " with " + std::to_string(key.bits) + " bits";
+    refuse(owner + " has a key of type " + key.type + bits + ": connections need RSA keys with at least " +
+           std::to_string(kMinKeyBits) + " bits");
+}
+
+/// Signs a request after the checks that the library leaves to its caller.
 SSLCertificate issue(const SSLCertificate& root, SSLCertificateRequest& request, const CaOptions& options)
 {
+    checkKey(factsOf(root).key, "the root");
+    checkKey(factsOf(request).key, "the request of " + options.name);
     if (!isSignatureValid(request)) {
         refuse("the request of " + options.name +
-               " is not signed with its own key: whoever sent it may not have that key, or it was changed on its way");
+               " is not signed with its own key: the sender may not have that key, or the request was changed");
     }
     if (haveSameSubject(request, root)) {
         refuse("the subject of " + options.name +
-               " is that of the root: every peer would take the certificate for self-signed and refuse it");
+               " equals the root's: every peer would take the certificate for self-signed and refuse it");
     }
-    if (Clock::now() > root.getValidityPeriod().getNotAfter()) {
-        refuse("the root has expired: no peer would accept the certificate");
+    const Clock::time_point end = root.getValidityPeriod().getNotAfter();
+    if (Clock::now() > end) {
+        refuse("the root expired at " + isoTime(end) + ": no peer would accept the certificate");
     }
     return root.sign(request, SSLValidityPeriod::days(options.days));
 }
@@ -120,7 +135,7 @@ void addFile(Answer& answer, const std::string& key, const std::string& path)
     answer.addText(key + "File", key + " file", path);
 }
 
-/// What was issued, as far as whoever issued it will want to pass on.
+/// The facts about an issued certificate that its recipient needs.
 void addIssued(Answer& answer, const SSLCertificate& certificate)
 {
     const CertificateFacts facts = factsOf(certificate);
@@ -129,7 +144,7 @@ void addIssued(Answer& answer, const SSLCertificate& certificate)
     answer.add("sha256", "SHA-256", facts.fingerprint);
 }
 
-/// A certificate is worth nothing once its root has expired.
+/// Warns about a certificate that outlives its root: peers refuse it once the root has expired.
 void noteShortLivedRoot(const SSLCertificate& root, const SSLCertificate& issued)
 {
     const Clock::time_point end = root.getValidityPeriod().getNotAfter();
@@ -188,7 +203,7 @@ ExitStatus runSign(const CaOptions& options)
     const SSLCertificate root = loadRoot(options);
     const std::string csr = options.pathOf(requestFile(options.name));
     const std::string pem = readPemFile(csr);
-    SSLCertificateRequest request = usingFile(csr, [&] { return SSLCertificateRequest(pem); });
+    SSLCertificateRequest request = parseRequest(csr, pem);
     const SSLCertificate issued = issue(root, request, options);
     files.add(certificate, issued.getPEM(), NewFiles::Readers::Everybody);
     files.publish();
@@ -227,16 +242,6 @@ ExitStatus runIssue(const CaOptions& options, const SSLSubject& subject)
     return ExitStatus::Done;
 }
 
-bool contains(const std::string& text, const char* part) { return text.find(part) != std::string::npos; }
-
-bool holdsCertificate(const std::string& pem)
-{
-    return contains(pem, "-----BEGIN CERTIFICATE-----") || contains(pem, "-----BEGIN X509 CERTIFICATE-----");
-}
-
-/// OpenSSL also knows "NEW CERTIFICATE REQUEST".
-bool holdsRequest(const std::string& pem) { return contains(pem, "CERTIFICATE REQUEST-----"); }
-
 Answer describe(const SSLCertificate& certificate)
 {
     const CertificateFacts facts = factsOf(certificate);
@@ -269,10 +274,14 @@ ExitStatus runShow(const CaOptions& options)
     const std::string pem = readPemFile(options.file);
     const bool isCertificate = holdsCertificate(pem);
     if (!isCertificate && !holdsRequest(pem)) {
-        refuse(options.file + " holds neither a certificate nor a certificate request in PEM form");
+        const std::string found = describePem(pem);
+        refuse(options.file + " holds " +
+               (found.empty() ? "neither a certificate nor a certificate request in PEM form"
+                              : found + ", neither a certificate nor a certificate request"));
     }
     print(options, usingFile(options.file, [&] {
-              return isCertificate ? describe(SSLCertificate(pem)) : describe(SSLCertificateRequest(pem));
+              return isCertificate ? describe(parseCertificate(options.file, pem))
+                                   : describe(parseRequest(options.file, pem));
           }));
     return ExitStatus::Done;
 }
@@ -295,7 +304,8 @@ ExitStatus statusOf(CertificateState state)
 ExitStatus runCheck(const CaOptions& options, std::chrono::seconds within)
 {
     const std::string pem = readPemFile(options.file);
-    const auto validity = usingFile(options.file, [&] { return SSLCertificate(pem).getValidityPeriod(); });
+    const auto validity =
+        usingFile(options.file, [&] { return parseCertificate(options.file, pem).getValidityPeriod(); });
     const Clock::time_point now = Clock::now();
     const CertificateState state = stateAt(validity, now, within);
 
@@ -308,7 +318,7 @@ ExitStatus runCheck(const CaOptions& options, std::chrono::seconds within)
     return statusOf(state);
 }
 
-/// Calls a parser of the program's own as a part of reading the command line, so that what it refuses is bad usage.
+/// Calls one of the program's own parsers while the command line is read: what it refuses becomes a usage error.
 template <typename Parse>
 auto asUsage(const char* option, const Parse& parse)
 {
@@ -321,18 +331,18 @@ auto asUsage(const char* option, const Parse& parse)
 
 using Options = std::shared_ptr<CaOptions>;
 
-/// @param makeAction  called once the command line has been read; throws CLI::ValidationError for what cannot be done
+/// @param makeAction  called after the command line has been read; throws CLI::ValidationError for bad usage
 CLI::App& addSubcommand(CLI::App& command, Action& action, const Options& options, const char* name,
                         const char* description, std::function<Action()> makeAction)
 {
     CLI::App& subcommand = addCommand(command, name, description);
-    subcommand.fallthrough(); // so that the options of "ca" may also stand behind the subcommand
-    subcommand.footer("The options of \"qel ca\", such as --log-level, may also stand here.");
+    subcommand.fallthrough(); // accepts the options of "ca" after the subcommand too
+    subcommand.footer("The options of \"qel ca\", such as --log-level, are accepted here too.");
     addJsonOption(subcommand, options->json);
     subcommand.callback([&action, options, makeAction = std::move(makeAction)] {
         action = [options, run = makeAction()] {
             startLogging(options->log, "qel-ca.log");
-            static_cast<void>(std::signal(SIGXFSZ, SIG_IGN)); // a file that grows too large is an error, not the end
+            static_cast<void>(std::signal(SIGXFSZ, SIG_IGN)); // makes a file that is too large an error
             return run();
         };
     });
@@ -341,17 +351,19 @@ CLI::App& addSubcommand(CLI::App& command, Action& action, const Options& option
 
 void addDirectory(CLI::App& subcommand, const Options& options)
 {
-    subcommand.add_option("directory", options->directory, "Where the credentials lie")->type_name("DIR")->required();
+    subcommand.add_option("directory", options->directory, "Directory of the credentials")
+        ->type_name("DIR")
+        ->required();
 }
 
 void addNameArgument(CLI::App& subcommand, const Options& options)
 {
     const auto notRoot = CLI::Validator(
         [](std::string& name) {
-            return name == kRootName ? std::string("'root' is the authority's own name") : std::string();
+            return name == kRootName ? std::string("'root' is reserved for the authority") : std::string();
         },
         "");
-    subcommand.add_option("name", options->name, "Whose credentials: the first part of the files' names")
+    subcommand.add_option("name", options->name, "Whose credentials: the first part of the file names")
         ->type_name("NAME")
         ->required()
         ->check(credentialNameValidator())
@@ -362,7 +374,7 @@ void addSubject(CLI::App& subcommand, const Options& options)
 {
     subcommand
         .add_option("--subject", options->subject,
-                    "Whom the certificate is for: CN=...[,O=...]; a comma in a value is written \\,")
+                    "Subject of the certificate: CN=...[,O=...]; write a comma in a value as \\,")
         ->type_name("NAME=VALUE,...")
         ->required();
 }
@@ -371,13 +383,13 @@ void addDays(CLI::App& subcommand, unsigned long& days)
 {
     subcommand.add_option("--days", days, "Days until the certificate expires")
         ->type_name("DAYS")
-        ->transform(integerIn(1, kMostDays))
+        ->transform(integerIn(1, kMaxDays))
         ->capture_default_str();
 }
 
 void addForce(CLI::App& subcommand, const Options& options)
 {
-    subcommand.add_flag("--force", options->force, "Replace files that are there already");
+    subcommand.add_flag("--force", options->force, "Replace existing files");
 }
 
 void addFileArgument(CLI::App& subcommand, const Options& options, const char* description)
@@ -440,23 +452,24 @@ void addIssue(CLI::App& command, Action& action, const Options& options)
 
 void addShow(CLI::App& command, Action& action, const Options& options)
 {
-    CLI::App& show = addSubcommand(command, action, options, "show", "Print what a certificate or a request says",
+    CLI::App& show = addSubcommand(command, action, options, "show", "Print a certificate or a request",
                                    [options] { return [options] { return runShow(*options); }; });
-    addFileArgument(show, options, "The certificate or the request; of several in one file, the first");
+    addFileArgument(show, options, "The certificate or the request; the first one if the file has several");
 }
 
 void addCheck(CLI::App& command, Action& action, const Options& options)
 {
     CLI::App& check = addSubcommand(
         command, action, options, "check",
-        "Say by the exit status how long a certificate is valid: 0 long enough, 10 due, 11 expired, 12 not yet valid",
+        "Report by exit status how long a certificate is valid: 0 long enough, 10 due, 11 expired, 12 not yet valid",
         [options] {
             const auto within = asUsage("--within", [&] { return parsePeriod(options->within); });
             return [options, within] { return runCheck(*options, within); };
         });
-    addFileArgument(check, options, "The certificate; of several in one file, the first");
+    addFileArgument(check, options, "The certificate; the first one if the file has several");
     check
-        .add_option("--within", options->within, "Due when it expires within this time: a number with s, m, h, d or w")
+        .add_option("--within", options->within,
+                    "Report due when it expires within this time: a number with s, m, h, d or w")
         ->type_name("TIME")
         ->capture_default_str();
 }
@@ -465,7 +478,7 @@ void addCheck(CLI::App& command, Action& action, const Options& options)
 
 CLI::App& addCaCommand(CLI::App& parent, Action& action)
 {
-    CLI::App& command = addCommand(parent, "ca", "Be a small certificate authority");
+    CLI::App& command = addCommand(parent, "ca", "Run a small certificate authority");
     const auto options = std::make_shared<CaOptions>();
     options->log.usual = LogLevel::Error;
     options->log.quiet = true;

@@ -15,9 +15,9 @@ namespace {
 using std::chrono::seconds;
 using Clock = SSLValidityPeriod::Clock;
 
-constexpr seconds kLongest = std::chrono::hours(24) * 36525;
+constexpr seconds kMaxPeriod = std::chrono::hours(24) * 36525;
 
-/// @return 0 for what is no unit
+/// @return 0 when it is not a unit
 seconds unitOf(char c)
 {
     switch (c) {
@@ -71,8 +71,9 @@ seconds parsePeriod(const std::string& text)
 {
     const seconds unit = text.empty() ? seconds(0) : unitOf(text.back());
     const auto number = unit.count() == 0 ? std::nullopt : parseDecimal(text.substr(0, text.size() - 1));
-    if (number && *number <= static_cast<std::uint64_t>(kLongest / unit)) return *number * unit;
-    throw std::invalid_argument(quoted(text) + " is no length of time: a number with s, m, h, d or w, as in 30d, and " +
+    if (number && *number <= static_cast<std::uint64_t>(kMaxPeriod / unit)) return *number * unit;
+    throw std::invalid_argument(quoted(text) +
+                                " is not a length of time: a number with s, m, h, d or w, as in 30d, and " +
                                 "at most 100 years");
 }
 

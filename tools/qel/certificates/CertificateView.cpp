@@ -7,10 +7,12 @@
 #include "base/Text.hpp"
 
 #include <array>
+#include <climits>
 #include <memory>
 #include <openssl/err.h>
 #include <openssl/evp.h>
 #include <openssl/objects.h>
+#include <openssl/pem.h>
 #include <openssl/x509.h>
 
 namespace qel::tool {
@@ -24,8 +26,8 @@ struct FreeByOpenSSL {
     void operator()(unsigned char* text) const noexcept { OPENSSL_free(text); }
 };
 
-/// Some calls fail for what they are asked, which is no error here: drops what they leave in the error queue, from
-/// construction to destruction.
+/// Drops entries that calls add to the error queue between construction and destruction: some calls fail for inputs
+/// that are not errors here.
 class QueueUnchanged {
 public:
     QueueUnchanged() { ERR_set_mark(); }
@@ -40,10 +42,8 @@ public:
     throw SSLException(what);
 }
 
-std::string nameOf(const ASN1_OBJECT* object)
+std::string numberOf(const ASN1_OBJECT* object)
 {
-    const int nid = OBJ_obj2nid(object);
-    if (nid != NID_undef) return OBJ_nid2sn(nid);
     constexpr int kInDots = 1;
     const int length = OBJ_obj2txt(nullptr, 0, object, kInDots); // without the NUL that the second call adds
     if (length <= 0) fail("cannot read the number of an attribute");
@@ -51,6 +51,12 @@ std::string nameOf(const ASN1_OBJECT* object)
     OBJ_obj2txt(&number[0], length + 1, object, kInDots);
     number.pop_back();
     return number;
+}
+
+std::string nameOf(const ASN1_OBJECT* object)
+{
+    const int nid = OBJ_obj2nid(object);
+    return nid != NID_undef ? OBJ_nid2sn(nid) : numberOf(object);
 }
 
 std::string valueOf(const ASN1_STRING* value)
@@ -121,6 +127,17 @@ RequestFacts factsOf(const SSLCertificateRequest& request)
 
 std::string fingerprintOf(const SSLCertificate& certificate) { return digestOf<X509>(certificate.get(), &X509_digest); }
 
+std::string privateKeyType(const std::string& pem)
+{
+    const QueueUnchanged queue;
+    if (pem.size() > INT_MAX) return {};
+    const BIO_PTR bio(BIO_new_mem_buf(pem.data(), static_cast<int>(pem.size())));
+    if (bio == nullptr) fail("cannot read a private key");
+    char noPassPhrase[] = ""; // with null, OpenSSL would ask at the terminal
+    const EVP_PKEY_PTR key(PEM_read_bio_PrivateKey(bio.get(), nullptr, nullptr, noPassPhrase));
+    return key == nullptr ? std::string() : factsOf(key.get()).type;
+}
+
 bool isSignatureValid(const SSLCertificateRequest& request)
 {
     const QueueUnchanged queue;
@@ -138,6 +155,15 @@ std::string attributeName(const std::string& name)
     const QueueUnchanged queue;
     const Asn1ObjectPtr object(OBJ_txt2obj(name.c_str(), 0));
     return object == nullptr ? std::string() : nameOf(object.get());
+}
+
+bool isExtension(const std::string& name)
+{
+    const QueueUnchanged queue;
+    const Asn1ObjectPtr object(OBJ_txt2obj(name.c_str(), 0));
+    if (object == nullptr) return false;
+    const std::string number = numberOf(object.get());
+    return number.rfind("2.5.29.", 0) == 0 || number.rfind("1.3.6.1.5.5.7.1.", 0) == 0; // id-ce and id-pe, RFC 5280
 }
 
 std::string objectionTo(const std::string& attribute, const std::string& value)

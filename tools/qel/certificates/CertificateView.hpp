@@ -8,22 +8,22 @@
 #include <vector>
 
 /// @file
-/// What certificates and requests say, as far as the library does not tell. The one place of this program that calls
-/// OpenSSL.
-/// Thread safety: every function from any thread. Those that read throw SSLException when OpenSSL fails.
+/// Facts about certificates and requests beyond those that the library reports. The only file of this program that
+/// calls OpenSSL. Thread safety: any thread may call any function. Functions that read throw SSLException when OpenSSL
+/// fails.
 
 namespace qel::tool {
 
 struct NameField {
     std::string name;  ///< short name of the attribute, or its number in dots
-    std::string value; ///< UTF-8; "#" and hexadecimal digits for a value that is no text
+    std::string value; ///< UTF-8; "#" and hexadecimal digits for a value that is not a text
 };
 
-/// A name in the order in which it is written. A field may stand there several times.
+/// A name, in its own order. A field may occur several times.
 using NameFields = std::vector<NameField>;
 
 struct PublicKeyFacts {
-    std::string type; ///< "RSA", "EC", "ED25519", ...; "unknown" for one that OpenSSL does not know
+    std::string type; ///< "RSA", "EC", "ED25519", ...; "unknown" when OpenSSL does not know it
     int bits = 0;     ///< 0 if unknown
 };
 
@@ -46,21 +46,30 @@ struct RequestFacts {
 CertificateFacts factsOf(const SSLCertificate& certificate);
 RequestFacts factsOf(const SSLCertificateRequest& request);
 
-/// The SHA-256 of the DER form, which names a certificate: 32 bytes in upper-case hexadecimal, ':' between them.
+/// The SHA-256 of the DER form, which identifies a certificate: 32 bytes in upper-case hexadecimal, separated by ':'.
 std::string fingerprintOf(const SSLCertificate& certificate);
 
-/// Whether a request is signed with the private key that belongs to its public key, so that its sender has that key.
+/// The type of the first private key of a PEM text, as in PublicKeyFacts.
+/// @return empty when the text holds no key that can be read without a pass phrase
+std::string privateKeyType(const std::string& pem);
+
+/// Whether a request is signed with the private key of its public key, which proves that the sender has that key.
 bool isSignatureValid(const SSLCertificateRequest& request);
 
-/// Whether the two subjects are one name by the rules of RFC 5280, 7.1: upper and lower case are the same, and so are
-/// one blank and several. A certificate with the name of its issuer is taken for self-signed by every peer.
+/// Whether the two subjects are equal by the rules of RFC 5280, 7.1, which ignore case and the number of blanks. Every
+/// peer takes a certificate whose subject equals its issuer for self-signed.
 bool haveSameSubject(const SSLCertificateRequest& request, const SSLCertificate& certificate);
 
 /// @param name  the short or the long name of an attribute, or its number in dots
-/// @return the short name, or the number for one that has none; empty for an unknown name
+/// @return the short name, or the number when the attribute has no name; empty for an unknown name
 std::string attributeName(const std::string& name);
 
-/// Why a value cannot stand in a name: X.520 sets limits. @return empty when it can
+/// Whether a name of an attribute, in one of the forms above, is that of an X.509 extension, such as subjectAltName.
+/// OpenSSL puts even those into a subject, where no peer looks for them.
+bool isExtension(const std::string& name);
+
+/// Why an attribute cannot have a value: X.520 sets limits.
+/// @return empty when it can
 std::string objectionTo(const std::string& attribute, const std::string& value);
 
 } // namespace qel::tool

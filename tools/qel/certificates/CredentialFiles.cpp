@@ -29,7 +29,8 @@ std::string checkName(std::string& name)
                         name.find_first_not_of(allowed) == std::string::npos &&
                         std::string(kNameStart).find(name.front()) != std::string::npos;
     if (isName) return {};
-    return "'" + name + "' is no name: 1 to 64 letters, digits, '.', '_' and '-', the first a letter or a digit";
+    return "'" + name +
+           "' is not a name for credentials: 1 to 64 letters, digits, '.', '_' and '-', the first a letter or a digit";
 }
 
 std::string octal(mode_t mode)
@@ -47,7 +48,7 @@ UniqueFd openFile(const std::string& path, struct stat& status)
         const int error = errno;
         throw FileIOError(error, "cannot open " + path);
     }
-    if (!S_ISREG(status.st_mode)) throw CommandFailure(ExitStatus::Refused, path + " is no regular file");
+    if (!S_ISREG(status.st_mode)) throw CommandFailure(ExitStatus::Refused, path + " is not a regular file");
     return fd;
 }
 
@@ -148,8 +149,7 @@ std::string readKeyFile(const std::string& path, KeyPermissions permissions)
     if (isOpenToOthers && permissions == KeyPermissions::OwnerOnly) {
         throw CommandFailure(ExitStatus::Refused, "others may read or write the private key " + path + " (mode " +
                                                       octal(status.st_mode) +
-                                                      "): take that from them with chmod 600, or say "
-                                                      "--insecure-permissions");
+                                                      "): use chmod 600, or --insecure-permissions to allow it");
     }
     return readAll(fd, path);
 }
@@ -263,7 +263,7 @@ void NewFiles::pPublish(File& file) const
 
 void NewFiles::pRefuse(const std::string& name) const
 {
-    throw CommandFailure(ExitStatus::Refused, pathIn(mDirectory, name) + " is there already; --force replaces it");
+    throw CommandFailure(ExitStatus::Refused, pathIn(mDirectory, name) + " already exists; --force replaces it");
 }
 
 void NewFiles::pFail(int error, const char* what, const std::string& name) const

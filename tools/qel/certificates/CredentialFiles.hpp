@@ -12,10 +12,10 @@
 #include <vector>
 
 /// @file
-/// The files of certificates, keys and requests: where they lie, how they are read and how they are written.
+/// The files of certificates, keys and requests: their names, reading and writing.
 ///
-/// A directory holds them by name: NAME.crt is the certificate of NAME, NAME.key its private key, NAME.csr its request.
-/// The name "root" belongs to the authority itself; every end needs its root.crt, nobody else needs its root.key.
+/// In a directory, NAME.crt is the certificate of NAME, NAME.key its private key, NAME.csr its request. The name "root"
+/// belongs to the authority: every end needs root.crt, the authority alone needs root.key.
 
 namespace qel::tool {
 
@@ -29,11 +29,11 @@ std::string requestFile(const std::string& name);
 /// The path of a file in a directory.
 std::string pathIn(const std::string& directory, const std::string& file);
 
-/// Accepts a name for credentials: 1 to 64 letters, digits, '.', '_' and '-', of which the first is a letter or a
-/// digit, so that it is one file's name in the directory and no option. "root" is a name like any other here.
+/// Accepts a name for credentials: 1 to 64 letters, digits, '.', '_' and '-', the first a letter or a digit. Such a
+/// name can be neither a path nor an option. "root" is accepted too.
 CLI::Validator credentialNameValidator();
 
-/// Whether a private key is taken from a file that others than its owner may read or write.
+/// Whether a private key may come from a file that users other than the owner may read or write.
 enum class KeyPermissions { OwnerOnly, Any };
 
 /// Adds --insecure-permissions.
@@ -41,12 +41,12 @@ void addKeyPermissionsOption(CLI::App& app, KeyPermissions& permissions);
 
 /// Reads a certificate or a request: a regular file of at most 1 MiB.
 /// @throws FileIOError  it cannot be read
-/// @throws CommandFailure  Refused: it is no regular file, or too large
+/// @throws CommandFailure  Refused: it is not a regular file, or too large
 std::string readPemFile(const std::string& path);
 
-/// The same for a private key.
-/// @throws CommandFailure  Refused: also because of its permissions. What an access control list grants counts, too:
-///                         the bits of the group show it, see acl(5)
+/// Reads a private key.
+/// @throws FileIOError, CommandFailure  as readPemFile(). Refused also because of its permissions, access control lists
+///                                      included: the group bits show what they grant, see acl(5)
 std::string readKeyFile(const std::string& path, KeyPermissions permissions);
 
 /// The files that one end of a connection needs.
@@ -56,19 +56,19 @@ struct CredentialPaths {
     std::string root; ///< the certificate of the authority
 };
 
-/// Where the credentials of a name lie in a directory. Looks at no file.
+/// The paths of a name's credentials in a directory. Accesses no file.
 CredentialPaths credentialPaths(const std::string& directory, const std::string& name);
 
-/// Reads the three files. What is in them is not looked at; SSLContext::setCredentials() does.
+/// Reads the three files without checking their content; SSLContext::setCredentials() checks it.
 /// @throws FileIOError, CommandFailure  as readPemFile() and readKeyFile()
 SSLCredentials readCredentials(const CredentialPaths& paths, KeyPermissions permissions);
 
-/// Makes a directory that only its owner may enter; one that is there stays as it is.
+/// Makes a directory for its owner only. An existing directory stays as it is.
 /// @throws FileIOError  it cannot be made
 void makeDirectory(const std::string& path);
 
-/// Postpones the signals that ask this process to end (SIGHUP, SIGINT, SIGQUIT, SIGTERM) until it is destroyed.
-/// Thread safety: for programs with one thread.
+/// Blocks the signals that would end this process (SIGHUP, SIGINT, SIGQUIT, SIGTERM) until it is destroyed.
+/// Thread safety: for single-threaded programs.
 class EndPostponed {
 public:
     EndPostponed();
@@ -80,34 +80,33 @@ private:
     sigset_t mBefore;
 };
 
-/// Files that appear in a directory together, each of them whole.
+/// Files that appear in a directory together, each of them complete.
 ///
-/// add() writes a file under a temporary name, ".NAME.<random>.tmp", and forces it to the disk; publish() then gives
-/// all of them their names. Until then nobody sees any of them, and if publish() is not reached, nothing stays. Between
-/// construction and destruction the process does not end by a signal, unless by one that cannot be postponed; a
-/// process that is killed, or a machine that stops, may leave the temporary files.
+/// add() writes a file under a temporary name, ".NAME.<random>.tmp", and forces it to the disk; publish() then renames
+/// all files. If publish() is not reached, no file remains. Signals that end the process are blocked between
+/// construction and destruction. A process that is killed, or a machine that stops, may leave the temporary files.
 ///
-/// A file beyond the limit of setrlimit(2) is an error like any other only for a process that ignores SIGXFSZ.
+/// The process must ignore SIGXFSZ: otherwise a file that exceeds the limit of setrlimit(2) kills it.
 /// Thread safety: one thread.
 class NewFiles {
 public:
-    /// What to do with files that are there already.
+    /// What to do with existing files.
     enum class Existing { Keep, Replace };
 
-    /// Who may read a file. It is created so: at no time can more be done with it. The umask may take more away.
+    /// Who may read a file. The file is created with these permissions; the umask may remove some.
     enum class Readers { Owner, Everybody };
 
-    /// Waits for other processes that are making files in the directory.
+    /// Waits until no other process makes files in the directory.
     /// @throws FileIOError  the directory cannot be opened
     NewFiles(const std::string& directory, Existing existing);
 
-    /// Removes the temporary files that are left.
+    /// Removes the remaining temporary files.
     ~NewFiles();
     NewFiles(const NewFiles&) = delete;
     NewFiles& operator=(const NewFiles&) = delete;
 
-    /// Looks whether the names are free if they have to be, to know before the work is done; publish() looks again.
-    /// @throws CommandFailure  Refused: one of them is not
+    /// With Existing::Keep, checks that the names are free, to fail before the work is done. publish() checks again.
+    /// @throws CommandFailure  Refused: a file exists
     void checkFree(std::initializer_list<std::string> names) const;
 
     /// Writes a file under a temporary name. @throws FileIOError  it cannot be written

@@ -31,7 +31,7 @@ std::vector<std::string> splitFields(const std::string& text)
             continue;
         }
         if (text[i] == '\\') {
-            if (!beginsEscape(text, i)) refuse("a backslash stands only before a comma or another backslash");
+            if (!beginsEscape(text, i)) refuse("a backslash may only precede a comma or another backslash");
             ++i;
         }
         fields.back() += text[i];
@@ -42,16 +42,20 @@ std::vector<std::string> splitFields(const std::string& text)
 void addField(SSLSubject& subject, const std::string& field)
 {
     const std::size_t equals = field.find('=');
-    if (equals == std::string::npos) refuse(quoted(field) + " is no field: a subject is NAME=VALUE,NAME=VALUE,...");
+    if (equals == std::string::npos) refuse(quoted(field) + " is not a field: a subject is NAME=VALUE,NAME=VALUE,...");
     const std::string given = Utilities::strip(field.substr(0, equals), " ");
     const std::string value = Utilities::strip(field.substr(equals + 1), " ");
     const std::string name = attributeName(given);
-    if (name.empty()) refuse(quoted(given) + " is no attribute of a name, such as CN, O, OU, C, ST or L");
+    if (name.empty()) refuse(quoted(given) + " is not an attribute of a name, such as CN, O, OU, C, ST or L");
+    if (isExtension(given)) {
+        refuse(quoted(given) +
+               " is an extension, not an attribute of a name: certificates from here have no extensions");
+    }
     if (value.empty()) refuse(name + " has no value");
     if (!std::all_of(value.begin(), value.end(), isPrintable))
         refuse("the value of " + name + " is not printable ASCII");
     const std::string objection = objectionTo(name, value);
-    if (!objection.empty()) refuse(quoted(value) + " is no value for " + name + ": " + objection);
+    if (!objection.empty()) refuse(quoted(value) + " is not a value for " + name + ": " + objection);
     if (!subject.emplace(name, value).second) refuse(name + " is given twice");
 }
 

@@ -92,7 +92,7 @@ bool Admission::pAwaitFirstByte()
     for (;;) {
         const auto now = TimeProvider::steady();
         if (mEnd.isExpired(now)) {
-            throw CommandFailure(ExitStatus::DeadlinePassed, "the other end did not ask for TLS in time");
+            throw CommandFailure(ExitStatus::DeadlinePassed, "the peer did not ask for TLS in time");
         }
         const PollResult result = PollSet{socket, mWake.getPollFd()}.wait(mEnd.getTimeout(now));
         if (result.contains(mWake.getPollFd())) return false;

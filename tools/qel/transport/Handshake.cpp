@@ -29,24 +29,23 @@ bool is(const QelMessage& message)
 
 [[noreturn]] void breakOff(const std::string& reason) { throw CommandFailure(ExitStatus::ProtocolBroken, reason); }
 
-/// Does a step in the clear; what goes wrong is told in its terms.
-/// @param step  what the other end does in it, for "the other end did not ..."
+/// Performs a step before TLS and puts what fails in terms of that step.
+/// @param step  what the peer does in it, for "the peer did not ..."
 template <typename F>
 auto doStep(const std::string& step, F work)
 {
     try {
         return work();
     } catch (const QelMessageValidationException& error) {
-        breakOff("the other end did not " + step + " but sent something else: " + error.what());
+        breakOff("the peer did not " + step + " but sent something else: " + error.what());
     } catch (const StreamIOException& error) {
         const ExitStatus status = exitStatusOf(error);
-        if (status == ExitStatus::DeadlinePassed)
-            throw CommandFailure(status, "the other end did not " + step + " in time");
-        throw CommandFailure(status, "the other end did not " + step + " but ended the connection: " + explain(error));
+        if (status == ExitStatus::DeadlinePassed) throw CommandFailure(status, "the peer did not " + step + " in time");
+        throw CommandFailure(status, "the peer did not " + step + " but ended the connection: " + explain(error));
     }
 }
 
-/// Reads one message, and not a byte beyond it.
+/// Reads one message and no byte after it.
 std::unique_ptr<QelMessage> receive(Stream& stream)
 {
     return QelMessageStream(stream, QelInternalMessageRegistry::getInstance()).read();
@@ -57,33 +56,34 @@ void send(Stream& stream, const QelMessage& message)
     QelMessageStream(stream, QelInternalMessageRegistry::getInstance()).write(message);
 }
 
-/// It is this end's turn. Whatever the other end has sent all the same was sent in the clear by nobody knows whom, and
-/// would be the beginning of what TLS reads.
+/// Called while the peer must wait for this end. Bytes that it has sent anyway came in the clear, from an unknown
+/// sender, and TLS would read them first.
 void expectSilence(int descriptor)
 {
     char byte = 0;
     if (::recv(descriptor, &byte, sizeof(byte), MSG_PEEK | MSG_DONTWAIT) > 0) {
-        breakOff("the other end did not wait for its turn in the handshake");
+        breakOff("the peer sent data too early in the handshake");
     }
 }
 
-/// Why a TLS handshake failed, as far as it can be known.
+/// Explains why a TLS handshake failed, as far as this end can know.
 [[noreturn]] void explainTlsFailure(const SSLStream& stream, const StreamIOException& error)
 {
     const std::string refusal = stream.getVerificationFailure();
     if (!refusal.empty()) {
-        throw CommandFailure(ExitStatus::Refused, "the other end has no valid certificate of our root: " + refusal);
+        throw CommandFailure(ExitStatus::Refused, "the peer's certificate is refused: " + refusal);
     }
     const ExitStatus status = exitStatusOf(error);
     if (status == ExitStatus::DeadlinePassed) {
-        throw CommandFailure(status, "the TLS handshake was not done in time");
+        throw CommandFailure(status, "the TLS handshake did not finish in time");
     }
     if (std::strncmp(error.what(), "SSL error", std::strlen("SSL error")) == 0) {
         breakOff(std::string("the TLS handshake failed: ") + error.what());
     }
-    throw CommandFailure(status, "the other end ended the connection in the TLS handshake, perhaps because it does not "
-                                 "accept this end's certificate: " +
-                                     explain(error));
+    throw CommandFailure(
+        status,
+        "the peer closed the connection in the TLS handshake, perhaps because it refuses this end's certificate: " +
+            explain(error));
 }
 
 } // namespace
@@ -102,11 +102,12 @@ void requestUpgrade(Stream& stream, int descriptor)
         return receive(stream);
     });
     if (is<QelMessageAbortHandshakeAsync>(*answer)) {
-        throw CommandFailure(ExitStatus::Refused, "the hypervisor end turned this console away: it takes no more "
-                                                  "consoles, is about to stop, or does without TLS");
+        throw CommandFailure(
+            ExitStatus::Refused,
+            "the server refused this console: it admits no more consoles, is stopping, or does not use TLS");
     }
     if (!is<QelMessageUpgradeConnectionAsync>(*answer)) {
-        breakOff("the other end did not answer the request for TLS but sent something else: " +
+        breakOff("the peer did not answer the request for TLS but sent something else: " +
                  toString(answer->getLogID()));
     }
     expectSilence(descriptor);
@@ -117,7 +118,7 @@ void awaitUpgrade(Stream& stream, int descriptor)
     const auto request = doStep("ask for TLS", [&] { return receive(stream); });
     if (!is<QelMessageUpgradeConnectionAsync>(*request)) {
         abortHandshake(stream);
-        breakOff("the other end did not ask for TLS but sent something else: " + toString(request->getLogID()));
+        breakOff("the peer did not ask for TLS but sent something else: " + toString(request->getLogID()));
     }
     expectSilence(descriptor);
 }

@@ -6,30 +6,29 @@
 #include <chrono>
 
 /// @file
-/// The steps between a TCP connection and a protected one. The console asks for TLS with the upgrade message; the
-/// hypervisor end answers with the same message, and then both start TLS; or it answers with the abort message and
-/// closes. There is no other way on.
+/// The steps from a TCP connection to a protected one. The console sends the upgrade message; the hypervisor end
+/// answers with the same message, and both start TLS, or it answers with the abort message and closes.
 ///
-/// These two messages go in the clear, and nothing else does. What arrives in the clear is read message by message and
-/// never ahead, so that none of it is left over for TLS or for what comes after it.
+/// Only these two messages travel in the clear. Messages in the clear are read one at a time and never ahead, so no
+/// byte of TLS, or of what follows, is lost.
 ///
-/// All of it throws CommandFailure with a text for people: DeadlinePassed when the stream's deadline passes,
-/// ClosedByPeer when the other end goes, ProtocolBroken for what has no place here, Refused as said below. The caller
-/// closes the stream then.
+/// All functions throw CommandFailure with a text for people: DeadlinePassed when the stream's deadline passes,
+/// ClosedByPeer when the peer closes the connection, ProtocolBroken when it sends anything else, and Refused as noted
+/// below. The caller closes the stream then.
 
 namespace qel::tool {
 
-/// Gives both directions of a stream what is left of the time, a millisecond at least. The time of a direction runs
-/// from its next use: call it right before.
+/// Sets both deadlines of a stream to the time left until `end`, at least a millisecond. The time of a direction runs
+/// from its next use, so call this right before.
 void limitTo(Stream& stream, std::chrono::steady_clock::time_point end);
 
-/// The console's first step: asks for TLS, and waits for the answer.
-/// @param stream  in the clear, with deadlines
+/// The console's first step: asks for TLS and waits for the answer.
+/// @param stream  not yet protected, with deadlines
 /// @param descriptor  of the stream's socket
-/// @throws CommandFailure  Refused: the hypervisor end aborts
+/// @throws CommandFailure  Refused: the hypervisor end answers with the abort message
 void requestUpgrade(Stream& stream, int descriptor);
 
-/// The hypervisor end's first step: waits for the console to ask for TLS. Any other message is answered with the abort
+/// The hypervisor end's first step: waits for the console to ask for TLS. Answers any other message with the abort
 /// message.
 /// @param stream, descriptor  as for requestUpgrade()
 void awaitUpgrade(Stream& stream, int descriptor);
@@ -38,8 +37,8 @@ void awaitUpgrade(Stream& stream, int descriptor);
 void grantUpgrade(Stream& stream);
 void abortHandshake(Stream& stream);
 
-/// Does the TLS handshake.
-/// @throws CommandFailure  Refused: the other end's certificate is not accepted
+/// Performs the TLS handshake.
+/// @throws CommandFailure  Refused: the peer's certificate is not accepted
 void startTls(SSLStream& stream);
 
 } // namespace qel::tool

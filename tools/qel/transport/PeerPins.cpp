@@ -25,7 +25,7 @@ bool isHexDigit(char character) { return std::isxdigit(static_cast<unsigned char
 
 char upperCase(char character) { return static_cast<char>(std::toupper(static_cast<unsigned char>(character))); }
 
-/// @return empty when the other end has closed the connection meanwhile
+/// @return the peer's certificate, never null
 std::unique_ptr<SSLCertificate> certificateOf(const SSLStream& stream)
 {
     auto certificate = stream.getPeerCertificate();
@@ -43,8 +43,7 @@ std::string commonNameOf(const SSLCertificate& certificate)
 
 [[noreturn]] void refuse(const std::string& what, const std::string& option)
 {
-    throw CommandFailure(ExitStatus::Refused,
-                         "the other end is not who it should be: " + what + " is not what " + option + " says");
+    throw CommandFailure(ExitStatus::Refused, "wrong peer: " + what + " does not match " + option);
 }
 
 } // namespace
@@ -71,7 +70,7 @@ void checkPeer(const SSLStream& stream, const PeerPins& pins)
     const auto certificate = certificateOf(stream);
     if (!pins.names.empty()) {
         const std::string name = commonNameOf(*certificate);
-        // None is not the same as an empty one: no pin names a certificate without a name, not even an empty pin.
+        // No pin matches a certificate without a common name, not even an empty pin.
         if (name.empty() || !contains(pins.names, name)) refuse("the name " + quoted(name), "--peer-name");
     }
     if (!pins.fingerprints.empty()) {

@@ -1,26 +1,26 @@
 #include "transport/TransportOptions.hpp"
 
 #include <qel/common/net/IPEndpoint.hpp>
-#include <qel/common/security/RSAPrivateKey.hpp>
-#include <qel/common/security/SSLCertificate.hpp>
 #include <qel/common/security/SSLException.hpp>
 
 #include "base/Failures.hpp"
 #include "base/OptionChecks.hpp"
+#include "certificates/PemContent.hpp"
+#include "transport/OwnCertificate.hpp"
 
 namespace qel::tool {
 
 namespace {
 
-constexpr double kShortestHandshake = 0.001;
-constexpr double kLongestHandshake = 24 * 60 * 60;
+constexpr double kMinHandshake = 0.001;
+constexpr double kMaxHandshake = 24 * 60 * 60;
 
 CLI::Validator fingerprintValidator()
 {
     return CLI::Validator(
         [](std::string& text) {
             const std::string normalized = normalizedFingerprint(text);
-            if (normalized.empty()) return "'" + text + "' is no SHA-256 fingerprint: 64 hexadecimal digits";
+            if (normalized.empty()) return "'" + text + "' is not a SHA-256 fingerprint: 64 hexadecimal digits";
             text = normalized;
             return std::string();
         },
@@ -31,16 +31,16 @@ void addCredentialOptions(CLI::App& app, TransportOptions& options, CLI::Option*
 {
     CLI::Option* const directory =
         app.add_option("--credentials", options.directory,
-                       "Use TLS, with NAME.crt, NAME.key and root.crt from this directory, as \"qel ca\" makes them")
+                       "Use TLS with NAME.crt, NAME.key and root.crt from this directory, as \"qel ca\" writes them")
             ->type_name("DIR");
-    CLI::Option* const name = app.add_option("--name", options.name, "Whose certificate and key in that directory")
+    CLI::Option* const name = app.add_option("--name", options.name, "Which certificate and key in that directory")
                                   ->type_name("NAME")
                                   ->check(credentialNameValidator());
     CLI::Option* const certificate =
-        app.add_option("--cert", options.files.certificate, "Use TLS, with this certificate")->type_name("FILE");
-    CLI::Option* const key = app.add_option("--key", options.files.key, "its private key")->type_name("FILE");
+        app.add_option("--cert", options.files.certificate, "Use TLS with this certificate")->type_name("FILE");
+    CLI::Option* const key = app.add_option("--key", options.files.key, "The private key of --cert")->type_name("FILE");
     CLI::Option* const root =
-        app.add_option("--root", options.files.root, "and the root certificate to trust")->type_name("FILE");
+        app.add_option("--root", options.files.root, "The root certificate to trust, with --cert")->type_name("FILE");
     directory->needs(name)->excludes(certificate)->excludes(key)->excludes(root)->excludes(plain);
     name->needs(directory);
     certificate->needs(key)->needs(root)->excludes(plain);
@@ -50,28 +50,18 @@ void addCredentialOptions(CLI::App& app, TransportOptions& options, CLI::Option*
 
 void addPeerOptions(CLI::App& app, TransportOptions& options, CLI::Option* plain)
 {
-    // The values of these are taken one at a time: whatever follows is an argument of its own.
+    // Each of these takes one value; the next word on the command line is a separate argument.
     app.add_option("--peer-name", options.pins.names,
-                   "The common name (CN) that the other end's certificate must have; several: one of them")
+                   "Accept only a peer whose certificate has this common name (CN); may be repeated")
         ->type_name("CN")
         ->allow_extra_args(false)
         ->excludes(plain);
     app.add_option("--peer-fingerprint", options.pins.fingerprints,
-                   "The SHA-256 fingerprint that the other end's certificate must have; several: one of them")
+                   "Accept only a peer whose certificate has this SHA-256 fingerprint; may be repeated")
         ->type_name("HEX")
         ->allow_extra_args(false)
         ->transform(fingerprintValidator())
         ->excludes(plain);
-}
-
-template <typename Use>
-auto usingFile(const std::string& path, Use use)
-{
-    try {
-        return use();
-    } catch (const SSLException& error) {
-        throw CommandFailure(ExitStatus::Refused, path + ": " + error.what());
-    }
 }
 
 template <typename Context>
@@ -80,10 +70,10 @@ std::unique_ptr<Context> makeContext(const TransportOptions& options)
     if (options.plain) return nullptr;
     const CredentialPaths paths = options.paths();
     const SSLCredentials credentials = readCredentials(paths, options.permissions);
-    // The context would not say which of the three it is that is not in order.
-    usingFile(paths.root, [&] { return SSLCertificate(credentials.mRootCA); });
-    usingFile(paths.certificate, [&] { return SSLCertificate(credentials.mCert); });
-    usingFile(paths.key, [&] { return RSAPrivateKey(credentials.mKey); });
+    // Checked one by one first: the context's exception does not say which of the three is wrong.
+    const SSLCertificate root = parseCertificate(paths.root, credentials.mRootCA);
+    const SSLCertificate own = parseCertificate(paths.certificate, credentials.mCert);
+    parseKey(paths.key, credentials.mKey);
     auto context = std::make_unique<Context>();
     try {
         context->setCredentials(credentials);
@@ -91,6 +81,9 @@ std::unique_ptr<Context> makeContext(const TransportOptions& options)
         throw CommandFailure(ExitStatus::Refused, paths.certificate + " and " + paths.key +
                                                       " cannot be used: they do not belong together, or are too weak");
     }
+    const auto now = SSLValidityPeriod::Clock::now();
+    checkOwnCertificate("own certificate", paths.certificate, own, now);
+    checkOwnCertificate("root certificate", paths.root, root, now);
     return context;
 }
 
@@ -105,15 +98,14 @@ CredentialPaths TransportOptions::paths() const { return directory.empty() ? fil
 
 void addTransportOptions(CLI::App& app, TransportOptions& options)
 {
-    CLI::Option* const plain =
-        app.add_flag("--plain", options.plain, "Let the connection go unprotected; for loopback addresses only");
+    CLI::Option* const plain = app.add_flag("--plain", options.plain, "Use no TLS; for loopback addresses only");
     addCredentialOptions(app, options, plain);
     addPeerOptions(app, options, plain);
     addKeyPermissionsOption(app, options.permissions);
     app.add_option("--handshake-timeout", options.handshakeSeconds,
-                   "Seconds from the connection until the console is let in")
+                   "Seconds from the TCP connection to the end of the handshake")
         ->type_name("SECONDS")
-        ->check(numberIn(kShortestHandshake, kLongestHandshake))
+        ->check(numberIn(kMinHandshake, kMaxHandshake))
         ->capture_default_str();
 }
 

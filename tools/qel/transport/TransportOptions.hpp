@@ -11,41 +11,40 @@
 #include <string>
 
 /// @file
-/// How a connection is protected, as the command line says it: the same options for those that connect and for the one
-/// that listens.
+/// The options that say how connections are protected. They are the same for clients and for the server.
 
 namespace qel::tool {
 
-/// Either TLS, with credentials in a directory or in three files, or nothing at all.
+/// TLS, with credentials from a directory or from three files, or no protection.
 struct TransportOptions {
-    bool plain = false;    ///< the connection goes unprotected
+    bool plain = false;    ///< no TLS
     std::string directory; ///< holds the credentials of `name`
     std::string name;
-    CredentialPaths files; ///< meant unless there is a directory
+    CredentialPaths files; ///< used when `directory` is empty
     KeyPermissions permissions = KeyPermissions::OwnerOnly;
     PeerPins pins;
-    double handshakeSeconds = 10; ///< from the connection to a granted version request
+    double handshakeSeconds = 10; ///< from the TCP connection to the granted version request
 
     std::chrono::milliseconds handshakeTimeout() const;
 
-    /// Where the credentials lie. Not for a plain connection.
+    /// The files of the credentials. Not for plain connections.
     CredentialPaths paths() const;
 };
 
 /// Adds --credentials, --name, --cert, --key, --root, --peer-name, --peer-fingerprint, --insecure-permissions,
-/// --handshake-timeout and --plain. What of them cannot go together is a usage error.
+/// --handshake-timeout and --plain. Combinations that contradict each other are usage errors.
 void addTransportOptions(CLI::App& app, TransportOptions& options);
 
-/// Looks whether a way was chosen, and may be used for an endpoint: TLS for any, --plain for loopback addresses only.
-/// Meant for the parser's callbacks, where its exception becomes a usage error.
+/// Checks that the options select TLS or --plain, and --plain for a loopback address only. Call it in the parser's
+/// callback, where its exception becomes a usage error.
 /// @throws CLI::ValidationError
 void checkTransport(const TransportOptions& options, const std::string& endpoint);
 
-/// Makes a TLS configuration from the credentials that the files hold at this moment.
+/// Makes a TLS configuration from the current content of the credential files.
 /// @return null for a plain connection
 /// @throws FileIOError  a file cannot be read
-/// @throws CommandFailure  Refused: a file does not hold what it should, others may read the key, or the certificate
-///                         and the key do not belong together
+/// @throws CommandFailure  Refused: a file does not hold what it should; others may read the key; the certificate and
+///                         the key do not belong together; the certificate or the root is expired or not yet valid
 std::unique_ptr<SSLClientContext> makeClientContext(const TransportOptions& options);
 std::unique_ptr<SSLServerContext> makeServerContext(const TransportOptions& options);
 

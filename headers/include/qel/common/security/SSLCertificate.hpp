@@ -13,23 +13,22 @@ namespace qel {
 
 class SSLCertificateRequest;
 
-/// The fields of a name: from field name to value. A field name is the short or the long name of an X.509 attribute
-/// ("CN" or "commonName", "O", "C", ...) or its number in dots. The fields enter a name in the order of the map's keys,
-/// so {CN, O, C} gives C, CN, O.
+/// The fields of a name: field name to value. A field name is the short or the long name of an X.509 attribute ("CN" or
+/// "commonName", "O", "C", ...) or its number in dots. The fields enter a name in the order of the map's keys: {CN, O,
+/// C} gives C, CN, O.
 ///
-/// Values are taken byte by byte as Latin-1, up to the first NUL, so plain ASCII is best: UTF-8 text is stored, but not
-/// as what it means. The limits of X.520 hold: CN has 1 to 64 characters, C exactly 2; no value is empty.
+/// Values are read as Latin-1 up to the first NUL, so use plain ASCII: UTF-8 text is stored byte by byte as Latin-1.
+/// The limits of X.520 apply: CN has 1 to 64 characters, C exactly 2; a value must not be empty.
 ///
-/// Write the type when passing one, `SSLCertificateRequest(SSLSubject{{"CN", "console"}})`: without it a pair of texts
-/// can also mean a string made from two iterators.
+/// Write the type when you pass one, `SSLCertificateRequest(SSLSubject{{"CN", "console"}})`: without it, a pair of
+/// texts can also mean a string that is made from two iterators.
 using SSLSubject = std::map<std::string, std::string>;
 
-/// An X.509 certificate (RFC 5280), perhaps with its private key. With the key it can issue other certificates;
+/// An X.509 certificate (RFC 5280), with or without its private key. With the key it can issue other certificates;
 /// without it, it can only be presented or trusted.
 ///
-/// Certificates made here are of version 1 and hold no extensions: they say nothing about what they may be used for.
-/// The subject of an issued certificate must differ from that of its root: otherwise every peer takes it for
-/// self-signed and refuses it.
+/// Certificates made here have version 1 and no extensions, so they do not restrict how they may be used. The subject
+/// of an issued certificate must differ from the root's: otherwise every peer takes it for self-signed and refuses it.
 ///
 /// A small authority:
 /// @code
@@ -39,77 +38,81 @@ using SSLSubject = std::map<std::string, std::string>;
 /// const SSLCredentials credentials{console.getPEM(), console.getPrivateKey()->getPEM(), root.getPEM()};
 /// @endcode
 ///
-/// Copies own a certificate and a key of their own. One that was moved from may only be assigned to or destroyed.
-/// Thread safety: const operations from several threads at the same time; anything else by one thread.
+/// Ownership: owns the certificate and the key. Copies have their own. A moved-from certificate may only be destroyed
+/// or assigned to.
+///
+/// Thread safety: several threads may call const operations at the same time; anything else needs exclusive access.
 class QEL_EXPORT SSLCertificate {
 public:
-    /// Loads the first certificate of a PEM text ("CERTIFICATE"), without key. Whatever follows it, such as the rest of
-    /// a chain, is ignored.
+    /// Loads the first certificate of a PEM text ("CERTIFICATE"), without a key. Whatever follows it, such as the rest
+    /// of a chain, is ignored. The kind of its public key does not matter.
     /// @throws SSLException  "X509 certificate string is not in a supported format", or "An SSL error occurred at ..."
     explicit SSLCertificate(const std::string& pem);
 
-    /// The same with a copy of the key.
-    /// @throws SSLException  also "An SSL error occurred at ...": the key is not that of the certificate
+    /// Loads a certificate and attaches a copy of its key.
+    /// @throws SSLException  as above; "An SSL error occurred at ..." also when the key does not match the certificate
     SSLCertificate(const std::string& pem, const RSAPrivateKey& key);
 
-    /// Makes a self-signed root with a new key (getPrivateKey()): a random serial number, SHA-256 with RSA. An empty
-    /// subject is allowed.
-    /// @throws SSLException  "An SSL error occurred at ...": a field or value is not accepted, or the period cannot be
-    ///                       expressed
+    /// Makes a self-signed root with a new key (getPrivateKey()) and a random serial number, signed with SHA-256 and
+    /// RSA. An empty subject is allowed.
+    /// @throws SSLException  "An SSL error occurred at ...": also when a field or value is not accepted, or a
+    /// certificate
+    ///                       cannot express the period
     SSLCertificate(const SSLSubject& subject, const SSLValidityPeriod& validity);
 
-    /// Starts the certificate that is to be issued for a request: carries a copy of the request's key, if it has one,
-    /// and is otherwise empty. sign() makes use of this; an empty certificate is good for nothing else: copying it and
-    /// getPEM() throw.
+    /// Starts the certificate to be issued for a request: carries a copy of the request's key, if it has one, and is
+    /// otherwise empty. sign() uses this. An empty certificate has no other use: copying it and getPEM() throw.
     /// @throws SSLException  "An SSL error occurred at ..."
     explicit SSLCertificate(const SSLCertificateRequest& request);
 
-    /// @throws SSLException  the certificate is empty, or it or its key could not be duplicated
+    /// @throws SSLException  the certificate is empty, or it or its key cannot be duplicated
     SSLCertificate(const SSLCertificate& other);
-    /// @throws SSLException  as above; this one is as it was
+    /// @throws SSLException  as above; this certificate is unchanged
     SSLCertificate& operator=(const SSLCertificate& other);
     SSLCertificate(SSLCertificate&& other) noexcept;
     SSLCertificate& operator=(SSLCertificate&& other) noexcept;
     ~SSLCertificate();
 
-    /// Issues a certificate: subject, public key and, if it is there, private key of the request; issued and signed by
-    /// this certificate; a random serial number, SHA-256 with RSA.
+    /// Issues a certificate with the subject, the public key and, if present, the private key of the request. This
+    /// certificate is its issuer and signs it with SHA-256 and RSA. The serial number is random.
     ///
-    /// The request is believed: that its sender holds the private key (X509_REQ_verify(3)), and that the subject is
-    /// his, is for the caller to check. This certificate's own validity is not looked at.
+    /// The request is trusted as it is. The caller must check that the sender holds the private key
+    /// (X509_REQ_verify(3)) and may use the subject. The validity of this certificate is not checked.
     /// @param request  only read
     /// @throws SSLException  "Certificate cannot be used for signing - it does not have an associated private key", or
     ///                       "An SSL error occurred at ..."
     SSLCertificate sign(SSLCertificateRequest& request, const SSLValidityPeriod& validity) const;
 
-    /// @return the certificate as PEM text, "-----BEGIN CERTIFICATE-----"; the key is not in it
-    /// @throws SSLException  "An SSL error occurred at ..."
+    /// @return the certificate as PEM text, "-----BEGIN CERTIFICATE-----", without the key
+    /// @throws SSLException  "An SSL error occurred at ...": also when the certificate is empty
     std::string getPEM() const;
 
-    /// @return the handle, owned by this object and valid as long as it; null only after a move
+    /// @return the handle. This object owns it and keeps it valid until it is destroyed or assigned to. Null only after
+    ///         a move.
     X509* get() const noexcept { return mCert.get(); }
 
-    /// @return the private key, owned by this object and valid as long as it; null when there is none
+    /// @return the private key, owned by this object and valid as long as get(); null when there is none
     const RSAPrivateKey* getPrivateKey() const noexcept { return mPrivateKey.get(); }
 
-    /// Who the certificate is for. Look at this, after a handshake, to know whom one is talking to.
-    /// @return the subject by short field names, or numbers in dots for fields that have none; values in UTF-8. A field
-    ///         that stands there several times has its values in one text, in their order, with a line feed between
-    ///         them: such a text equals no single value, unless that itself holds a line feed, which nothing forbids.
-    /// @throws SSLException  "An SSL error occurred at ...": a value is no text
+    /// Who the certificate belongs to. After a handshake this names the peer.
+    /// @return the subject by short field names, or by numbers in dots for fields without one; values in UTF-8. The
+    ///         values of a field that occurs several times are joined in order, with a line feed between them. A single
+    ///         value may contain line feeds too.
+    /// @throws SSLException  "An SSL error occurred at ...": a value is not a text
     SSLSubject getSubject() const;
 
-    /// @return who issued it, in the form of getSubject()
-    /// @throws SSLException  "An SSL error occurred at ..."
+    /// @return the issuer, in the form of getSubject()
+    /// @throws SSLException  "An SSL error occurred at ...": a value is not a text
     SSLSubject getIssuer() const;
 
-    /// @return the serial number in upper-case hexadecimal, two digits a byte ("0" for the number 0), with a "-" in
-    ///         front of a negative one. An authority gives no number twice, so with the issuer it names a certificate.
+    /// @return the serial number in upper-case hexadecimal, two digits a byte ("0" for the number 0), with a leading
+    /// "-"
+    ///         when it is negative. An authority uses each number once, so issuer and number identify a certificate.
     /// @throws SSLException  "An SSL error occurred at ..."
     std::string getSerialNumber() const;
 
-    /// @return from when until when the certificate is valid
-    /// @throws SSLException  "An SSL error occurred at ...": the certificate holds no proper times
+    /// @return the first and the last second at which the certificate is valid
+    /// @throws SSLException  "An SSL error occurred at ...": a time in the certificate is malformed
     SSLValidityPeriod getValidityPeriod() const;
 
 private:

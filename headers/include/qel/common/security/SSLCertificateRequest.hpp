@@ -10,42 +10,44 @@
 
 namespace qel {
 
-/// A request for a certificate (PKCS #10, RFC 2986): a subject and a public key, signed with the private key, which may
-/// be kept beside it.
+/// A certificate request (PKCS #10, RFC 2986): a subject and a public key, signed with the private key. It may carry
+/// the private key.
 ///
-/// Copies own a request and a key of their own. One that was moved from may only be assigned to or destroyed.
-/// Thread safety: const operations from several threads at the same time; anything else by one thread.
+/// Ownership: owns the request and the key. Copies have their own. A moved-from request may only be destroyed or
+/// assigned to.
+/// Thread safety: several threads may call const operations at the same time; anything else needs exclusive access.
 class QEL_EXPORT SSLCertificateRequest {
 public:
-    /// Loads the first request of a PEM text ("CERTIFICATE REQUEST"), without key. Its signature is not verified.
+    /// Loads the first request of a PEM text ("CERTIFICATE REQUEST"), without a key. Its signature is not verified.
     /// @throws SSLException  "X509 certificate request string is not in a supported format", or
     ///                       "An SSL error occurred at ..."
     explicit SSLCertificateRequest(const std::string& pem);
 
-    /// The same with a copy of the key.
-    /// @throws SSLException  also "An SSL error occurred at ...": the key is not that of the request
+    /// Loads a request and attaches a copy of its key.
+    /// @throws SSLException  as above; "An SSL error occurred at ..." also when the key does not match the request
     SSLCertificateRequest(const std::string& pem, const RSAPrivateKey& key);
 
-    /// Makes a request with a new key (getPrivateKey()), signed by SHA-256 with RSA.
-    /// @throws SSLException  "An SSL error occurred at ...": a field or value is not accepted
+    /// Makes a request with a new key (getPrivateKey()), signed with SHA-256 and RSA.
+    /// @throws SSLException  "An SSL error occurred at ...": also when a field or value is not accepted
     explicit SSLCertificateRequest(const SSLSubject& subject);
 
-    /// @throws SSLException  the request or its key could not be duplicated
+    /// @throws SSLException  the request or its key cannot be duplicated
     SSLCertificateRequest(const SSLCertificateRequest& other);
-    /// @throws SSLException  as above; this one is as it was
+    /// @throws SSLException  as above; this request is unchanged
     SSLCertificateRequest& operator=(const SSLCertificateRequest& other);
     SSLCertificateRequest(SSLCertificateRequest&& other) noexcept;
     SSLCertificateRequest& operator=(SSLCertificateRequest&& other) noexcept;
     ~SSLCertificateRequest();
 
-    /// @return the request as PEM text, "-----BEGIN CERTIFICATE REQUEST-----"; the key is not in it
+    /// @return the request as PEM text, "-----BEGIN CERTIFICATE REQUEST-----", without the key
     /// @throws SSLException  "An SSL error occurred at ..."
     std::string getPEM() const;
 
-    /// @return the handle, owned by this object and valid as long as it; null only after a move
+    /// @return the handle. This object owns it and keeps it valid until it is destroyed or assigned to. Null only after
+    ///         a move.
     X509_REQ* get() const noexcept { return mReq.get(); }
 
-    /// @return the private key, owned by this object and valid as long as it; null when there is none
+    /// @return the private key, owned by this object and valid as long as get(); null when there is none
     const RSAPrivateKey* getPrivateKey() const noexcept { return mPrivateKey.get(); }
 
 private:

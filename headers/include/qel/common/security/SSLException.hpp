@@ -7,11 +7,11 @@
 
 namespace qel {
 
-/// OpenSSL could not do what it was asked to.
+/// A failed OpenSSL call, or a text or certificate that cannot be used.
 ///
-/// The text says where the library noticed, "An SSL error occurred at common/security/SSLContext.cpp:42", or, for
-/// texts and certificates that cannot be used, what is wrong with them in a fixed phrase. OpenSSL's own reasons are in
-/// the log: its error queue is drained there before the exception is thrown.
+/// The text is the place of the failure, "An SSL error occurred at common/security/SSLContext.cpp:42", or a fixed
+/// phrase. OpenSSL's own reasons are in the log: its error queue is drained there before the exception is thrown.
+/// Thread safety: that of std::runtime_error.
 class QEL_EXPORT SSLException : public std::runtime_error {
 public:
     /// @param message  the text of the exception
@@ -24,16 +24,15 @@ public:
 
     ~SSLException() override;
 
-    /// Empties the error queue that OpenSSL keeps for the calling thread.
+    /// Empties OpenSSL's error queue of the calling thread. Never throws.
     ///
-    /// Every entry becomes a line of log at Error, the oldest first: "[libssl] ", OpenSSL's source file, ":", the line
-    /// in decimal, ": " and the text of ERR_error_string(3). Entries are also removed when that level is disabled. An
-    /// empty queue costs one look.
+    /// Logs every entry at Error, the oldest first: "[libssl] ", OpenSSL's source file, ":", the line in decimal, ": "
+    /// and the text of ERR_error_string(3). Removes the entries also when that level is disabled.
     ///
     /// Call it before each TLS operation as well as after a failed one: with a stale entry in the queue,
     /// SSL_get_error(3) reports a failure that did not happen.
-    /// Thread safety: every thread has a queue of its own, and this touches no other.
-    /// @throws what a substitute clock throws for a line of log; the queue is empty all the same
+    ///
+    /// Thread safety: each thread has its own queue; this accesses no other.
     static void flushErrorQueue();
 };
 

@@ -12,14 +12,16 @@
 #include <openssl/x509.h>
 
 /// @file
-/// Owning pointers to the handles of OpenSSL, so that none is freed by hand. Each is a std::unique_ptr as small as a
-/// plain pointer; get() lends the handle, release() gives it away to a function that takes it over.
+/// Owning pointers to OpenSSL handles, so that no code frees one by hand. Each is a std::unique_ptr with the size of a
+/// plain pointer. get() lends the handle; release() gives it to a function that takes ownership.
 ///
-/// OpenSSL 1.1.1 and newer. Some of the functions that are used here and in programs are marked as outdated by OpenSSL
-/// 3; whoever includes this header is to be compiled with OPENSSL_API_COMPAT=0x10101000L, which the target qel::common
-/// and the pkg-config file carry.
+/// Needs OpenSSL 1.1.1 or newer. OpenSSL 3 marks some of the functions used here and in programs as deprecated: compile
+/// programs that include this header with OPENSSL_API_COMPAT=0x10101000L. The target qel::common and the pkg-config
+/// file set it.
+///
+/// Thread safety: that of std::unique_ptr, and of the handle inside (see the OpenSSL manual).
 
-static_assert(OPENSSL_VERSION_NUMBER >= 0x10101000L, "OpenSSL 1.1.1 or newer is needed: TLS 1.3 came with it");
+static_assert(OPENSSL_VERSION_NUMBER >= 0x10101000L, "OpenSSL 1.1.1 or newer is required for TLS 1.3");
 
 namespace qel {
 
@@ -27,7 +29,7 @@ namespace qel {
 using SSL_CTX_PTR = std::unique_ptr<SSL_CTX, CustomDeleter<SSL_CTX, void, SSL_CTX_free>>;
 /// One TLS connection.
 using SSL_PTR = std::unique_ptr<SSL, CustomDeleter<SSL, void, SSL_free>>;
-/// A chain of BIOs: freed with all that are pushed behind it.
+/// A chain of BIOs: all of its BIOs are freed together.
 using BIO_PTR = std::unique_ptr<BIO, CustomDeleter<BIO, void, BIO_free_all>>;
 /// A certificate.
 using X509_PTR = std::unique_ptr<X509, CustomDeleter<X509, void, X509_free>>;
@@ -41,7 +43,7 @@ using EVP_PKEY_PTR = std::unique_ptr<EVP_PKEY, CustomDeleter<EVP_PKEY, void, EVP
 using RSA_PTR = std::unique_ptr<RSA, CustomDeleter<RSA, void, RSA_free>>;
 /// A big number.
 using BN_PTR = std::unique_ptr<BIGNUM, CustomDeleter<BIGNUM, void, BN_free>>;
-/// An integer as certificates hold it.
+/// An ASN.1 integer, such as a serial number.
 using ASN1_INT_PTR = std::unique_ptr<ASN1_INTEGER, CustomDeleter<ASN1_INTEGER, void, ASN1_INTEGER_free>>;
 
 } // namespace qel

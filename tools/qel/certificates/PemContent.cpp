@@ -1,0 +1,117 @@
+#include "certificates/PemContent.hpp"
+
+#include <qel/common/security/SSLException.hpp>
+
+#include "base/Failures.hpp"
+#include "certificates/CertificateView.hpp"
+
+#include <array>
+#include <string_view>
+
+namespace qel::tool {
+
+namespace {
+
+constexpr std::string_view kCertificate = "a certificate";
+constexpr std::string_view kRequest = "a certificate request";
+constexpr std::string_view kKey = "a private key";
+constexpr std::string_view kEncryptedKey = "an encrypted private key";
+constexpr std::string_view kPublicKey = "a public key";
+
+struct Label {
+    const char* text; // as in "-----BEGIN text-----"
+    std::string_view kind;
+};
+
+constexpr std::array<Label, 11> kLabels{{
+    {"CERTIFICATE", kCertificate},
+    {"X509 CERTIFICATE", kCertificate},
+    {"CERTIFICATE REQUEST", kRequest},
+    {"NEW CERTIFICATE REQUEST", kRequest},
+    {"PRIVATE KEY", kKey},
+    {"RSA PRIVATE KEY", kKey},
+    {"EC PRIVATE KEY", kKey},
+    {"DSA PRIVATE KEY", kKey},
+    {"ENCRYPTED PRIVATE KEY", kEncryptedKey},
+    {"PUBLIC KEY", kPublicKey},
+    {"RSA PUBLIC KEY", kPublicKey},
+}};
+
+bool contains(const std::string& text, const std::string& part) { return text.find(part) != std::string::npos; }
+
+bool holds(const std::string& pem, std::string_view kind)
+{
+    for (const Label& label : kLabels) {
+        if (label.kind == kind && contains(pem, std::string("-----BEGIN ") + label.text + "-----")) return true;
+    }
+    return false;
+}
+
+[[noreturn]] void refuse(const std::string& reason) { throw CommandFailure(ExitStatus::Refused, reason); }
+
+/// Explains why a text could not be parsed as an object of a kind.
+[[noreturn]] void refuseContent(const std::string& path, const std::string& pem, std::string_view expected,
+                                const SSLException& error)
+{
+    const std::string found = describePem(pem);
+    if (!found.empty() && !holds(pem, expected)) refuse(path + " holds " + found + ", not " + std::string(expected));
+    refuse(path + ": " + error.what());
+}
+
+template <typename Object>
+Object parse(const std::string& path, const std::string& pem, std::string_view expected)
+{
+    try {
+        return Object(pem);
+    } catch (const SSLException& error) {
+        refuseContent(path, pem, expected, error);
+    }
+}
+
+} // namespace
+
+SSLCertificate parseCertificate(const std::string& path, const std::string& pem)
+{
+    return parse<SSLCertificate>(path, pem, kCertificate);
+}
+
+SSLCertificateRequest parseRequest(const std::string& path, const std::string& pem)
+{
+    return parse<SSLCertificateRequest>(path, pem, kRequest);
+}
+
+RSAPrivateKey parseKey(const std::string& path, const std::string& pem)
+{
+    try {
+        return RSAPrivateKey(pem);
+    } catch (const SSLException& error) {
+        if (describePem(pem) == kEncryptedKey) {
+            refuse(path + " holds an encrypted private key: keys are stored without a pass phrase");
+        }
+        const std::string type = privateKeyType(pem);
+        if (!type.empty() && type != "RSA") refuse(path + " holds a private key of type " + type + ", not RSA");
+        refuseContent(path, pem, kKey, error);
+    }
+}
+
+bool holdsCertificate(const std::string& pem) { return holds(pem, kCertificate); }
+
+bool holdsRequest(const std::string& pem) { return holds(pem, kRequest); }
+
+std::string describePem(const std::string& pem)
+{
+    const std::string begin = "-----BEGIN ";
+    const std::size_t start = pem.find(begin);
+    if (start == std::string::npos) return {};
+    const std::size_t end = pem.find("-----", start + begin.size());
+    if (end == std::string::npos) return {};
+    const std::string text = pem.substr(start + begin.size(), end - start - begin.size());
+    for (const Label& label : kLabels) {
+        if (text != label.text) continue;
+        const bool isEncrypted = label.kind == kKey && contains(pem, "Proc-Type: 4,ENCRYPTED");
+        return std::string(isEncrypted ? kEncryptedKey : label.kind);
+    }
+    return {};
+}
+
+} // namespace qel::tool

@@ -1,0 +1,40 @@
+#pragma once
+
+#include <qel/common/security/RSAPrivateKey.hpp>
+#include <qel/common/security/SSLCertificate.hpp>
+#include <qel/common/security/SSLCertificateRequest.hpp>
+
+#include <string>
+
+/// @file
+/// What a credential file holds. A text of the wrong kind, such as a key where a certificate is expected, gets a
+/// message that names the file and both kinds.
+///
+/// All functions are safe to call from any thread.
+
+namespace qel::tool {
+
+/// Parses the first certificate of a PEM text.
+/// @param path  of the file that the text came from, for messages
+/// @throws CommandFailure  Refused: the text holds no usable certificate
+SSLCertificate parseCertificate(const std::string& path, const std::string& pem);
+
+/// Parses the first certificate request of a PEM text.
+/// @throws CommandFailure  Refused: the text holds no usable request
+SSLCertificateRequest parseRequest(const std::string& path, const std::string& pem);
+
+/// Parses the first private key of a PEM text, an RSA key without encryption.
+/// @throws CommandFailure  Refused: the text holds no such key
+RSAPrivateKey parseKey(const std::string& path, const std::string& pem);
+
+/// Whether a PEM text holds a certificate, which need not be well-formed.
+bool holdsCertificate(const std::string& pem);
+
+/// Whether a PEM text holds a certificate request, which need not be well-formed.
+bool holdsRequest(const std::string& pem);
+
+/// The kind of the first object of a PEM text, such as "a private key", "an encrypted private key" or "a certificate".
+/// @return empty for a text without a PEM object of a known kind
+std::string describePem(const std::string& pem);
+
+} // namespace qel::tool
