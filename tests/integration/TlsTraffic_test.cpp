@@ -95,7 +95,7 @@ TEST_F(Tls, AStoppingServerNotifiesTheConsole)
     server->stop();
     const auto result = process.wait();
     EXPECT_EQ(result.exitStatus, 7);
-    EXPECT_THAT(result.errors, HasSubstr("shutdown"));
+    EXPECT_THAT(result.errors, HasSubstr("session closed: the server shut down\n"));
 }
 
 TEST_F(Tls, AKilledServerEndsTheConsole)
