@@ -10,9 +10,9 @@
 #include <atomic>
 #include <cstddef>
 #include <cstdint>
-#include <iosfwd>
 #include <map>
 #include <memory>
+#include <ostream> // derived classes print in pDerivedDebug()
 #include <type_traits>
 
 namespace qel {
