@@ -9,18 +9,19 @@
 
 namespace qel {
 
+/// A timeout longer than the range of the clock, which is 292 years, counts as that range.
 /// @return now + timeout; where the steady clock cannot hold that, the end of its range on that side
 inline std::chrono::steady_clock::time_point deadlineAfter(std::chrono::steady_clock::time_point now,
                                                            std::chrono::milliseconds timeout) noexcept
 {
     using std::chrono::milliseconds;
     using time_point = std::chrono::steady_clock::time_point;
+    using duration = time_point::duration;
 
-    constexpr milliseconds kMax = std::chrono::duration_cast<milliseconds>(time_point::duration::max());
-    if (timeout > kMax) timeout = kMax;
-    if (timeout < -kMax) timeout = -kMax;
+    constexpr milliseconds kMax = std::chrono::duration_cast<milliseconds>(duration::max());
+    duration delta = timeout > milliseconds(0) ? duration::max() : duration::min();
+    if (timeout >= -kMax && timeout <= kMax) delta = timeout;
 
-    const time_point::duration delta = timeout;
     if (delta.count() > 0 && now > time_point::max() - delta) return time_point::max();
     if (delta.count() < 0 && now < time_point::min() - delta) return time_point::min();
     return now + delta;

@@ -242,6 +242,14 @@ TEST_F(StreamDeadlineTest, TimeoutBeyondTheClockIsReturnedOnceAndSetsNoDeadline)
     EXPECT_EQ(timeout(deadline), -1);
 }
 
+TEST_F(StreamDeadlineTest, TimeoutBeyondTheClockSetsNoDeadlineAtTheEpochEither)
+{
+    mClock.setSteady(steady_point());
+    StreamDeadline deadline(milliseconds::max());
+    EXPECT_EQ(timeout(deadline), milliseconds::max().count());
+    EXPECT_EQ(timeout(deadline), -1);
+}
+
 TEST_F(StreamDeadlineTest, TimeoutThatEndsAtTheLastTimePointSetsNoDeadline)
 {
     mClock.setSteady(steady_point::max() - 1ms);
@@ -276,7 +284,7 @@ TEST_F(StreamDeadlineTest, LongestTimeoutUnderAClockBelowZeroDoesNotOverflow)
     StreamDeadline deadline;
     deadline.setDeadline(milliseconds::max());
     EXPECT_EQ(timeout(deadline), milliseconds::max().count());
-    // The longest timeout in nanoseconds is 9223372036854 ms; from the lowest time point it ends below zero.
+    // The timeout counts as the longest one in nanoseconds; from the lowest time point it ends 1 ns below zero.
     EXPECT_EQ(timeout(deadline), 9223372036854);
 }
 
