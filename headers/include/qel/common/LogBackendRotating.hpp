@@ -38,9 +38,9 @@ public:
 
     /// Repairs the set of files and opens <directory>/<name>, creating it with mode 0644 if it is missing; lines go
     /// after what the file holds. Trailing '/' characters of the whole path are dropped. The threshold is Warn.
-    /// @param rotateSize  the maximum size of a file in bytes, line ends included; a line of rotateSize bytes or more
-    /// is
-    ///        cut to rotateSize - 1 bytes and its line end. Do not pass 0: every line then rotates, and none is cut.
+    /// @param rotateSize  the maximum size of a file in bytes, line ends included. A line of rotateSize bytes or more
+    ///                    is cut to rotateSize - 1 bytes and its line end. Do not pass 0: every line then rotates, and
+    ///                    none is cut.
     /// @throws std::bad_alloc  no memory for the path; file errors do not throw
     LogBackendRotating(const std::string& directory, const std::string& name, std::size_t rotateSize);
     /// The same with a threshold; an invalid level leaves it at Warn.

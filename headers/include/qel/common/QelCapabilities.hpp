@@ -23,8 +23,7 @@ public:
     /// Reads the text form: character i equal to '1' sets bit i, '0' leaves it clear.
     /// @param text any length: bits without a character stay clear, and characters after the 32nd are ignored
     /// @throws std::invalid_argument "invalid string given to capability set": one of the first 32 characters is
-    /// neither
-    ///         '0' nor '1'
+    ///         neither '0' nor '1'
     explicit QelCapabilities(const std::string& text);
 
     /// @param index number of the bit, 0 to 31
