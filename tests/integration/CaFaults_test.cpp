@@ -212,7 +212,8 @@ TEST_F(CaFaults, ASignalDuringAFailureLeavesNothing)
     EXPECT_THAT(names(), ElementsAreArray(kRoot));
 }
 
-// Nothing can be done against this one; what stays is nobody's credentials, and only the owner can read the key.
+// A kill cannot be caught. The temporary files that remain belong to no credentials, and only the owner can read the
+// key.
 TEST_F(CaFaults, AKilledProgramLeavesNoFileOfThatName)
 {
     const auto killed = faults({{"CALL", "fsync"}, {"AFTER", "1"}, {"SIGNAL", std::to_string(SIGKILL)}});

@@ -188,7 +188,7 @@ TEST_F(Ca, RefusesARequestThatIsNotSignedWithItsOwnKey)
     bring({"root.crt", "root.key"});
     SSLCertificateRequest request(readShared("server.csr"));
     const RSAPrivateKey other;
-    ASSERT_EQ(X509_REQ_set_pubkey(request.get(), other.get()), 1); // so whoever signed it has not this key
+    ASSERT_EQ(X509_REQ_set_pubkey(request.get(), other.get()), 1); // a key that the signer does not have
     write("thief.csr", request.getPEM());
     const auto result = runCa({"sign", path(), "thief"});
     EXPECT_EQ(result.exitStatus, 1);

@@ -22,7 +22,7 @@ std::vector<std::string> caCommand(const std::vector<std::string>& arguments);
 Process::Result runCa(const std::vector<std::string>& arguments,
                       const std::map<std::string, std::string>& environment = {});
 
-/// Runs "qel ca" behind some commands of the shell, such as "umask 0".
+/// Runs "qel ca" after some shell commands, such as "umask 0".
 Process::Result runCaAfter(const std::string& shellCommands, const std::vector<std::string>& arguments);
 
 /// Runs the program openssl.
@@ -56,7 +56,7 @@ private:
     TemporaryDirectory mDirectory;
 };
 
-/// With what most tests of the authority use.
+/// The fixture of most tests of the authority.
 class Ca : public CaTest {
 protected:
     using Clock = SSLValidityPeriod::Clock;

@@ -12,22 +12,23 @@
 
 namespace qel::test {
 
-/// A console that takes the steps to TLS one at a time, and may stop or go astray at each. Reads have a deadline.
+/// A console that takes the steps to TLS one at a time, so that a test can stop or deviate at each. Reads have a
+/// deadline.
 class TlsConsole {
 public:
     /// Connects over TCP.
     explicit TlsConsole(const std::string& endpoint);
 
-    /// Asks for TLS. The answer is left to be taken.
+    /// Requests TLS and leaves the answer unread.
     void ask();
-    /// Takes a message in the clear. @return its operation: upgrade or abort
+    /// Reads a message in the clear. @return its operation: upgrade or abort
     unsigned int takeAnswer();
-    /// Takes the step to TLS, with the credentials of a client of Authority::trusted().
+    /// Performs the TLS handshake with these credentials.
     void startTls(const SSLCredentials& credentials);
-    /// All of it, and the version request.
+    /// Performs all steps, including the version request.
     void comeIn(const std::string& toolId);
 
-    /// Hands the connection in the clear to somebody else; nothing can be done with this console any more.
+    /// Gives away the unprotected connection; this console is unusable afterwards.
     std::unique_ptr<Stream> takeStream() { return std::move(mStream); }
 
     /// Bytes as they are, in the clear.

@@ -29,7 +29,7 @@ using ::testing::StartsWith;
 
 constexpr unsigned int kUpgrade = QelMessageOpUpgradeConnection;
 
-/// Passes everything on to a stream that somebody else owns.
+/// Forwards to a stream that it does not own.
 class BorrowedStream : public Stream {
 public:
     explicit BorrowedStream(Stream& stream) : mStream(stream) {}
@@ -90,7 +90,7 @@ TEST_F(Tls, AClientOfAnotherRootIsRefused)
 
 TEST_F(Tls, RefusesAPeerWhoseCertificateIsExpired)
 {
-    // A server of the test's own: ours refuses to start with such a certificate.
+    // A scripted server: qel serve refuses to start with such a certificate.
     const WrongServer server([](LoopbackMessages& messages) {
         messages.receive();
         messages.send(QelMessageUpgradeConnectionAsync());
@@ -133,9 +133,9 @@ TEST_F(Tls, RefusesAClientWithoutACertificate)
     TlsConsole console(server->endpoint());
     console.ask();
     ASSERT_EQ(console.takeAnswer(), kUpgrade);
-    RawTlsPeer nobody(RawTlsPeer::Client, {}, console.takeStream());
-    nobody.handshake(); // from which it cannot tell
-    EXPECT_EQ(nobody.read(1), "");
+    RawTlsPeer anonymous(RawTlsPeer::Client, {}, console.takeStream());
+    anonymous.handshake(); // succeeds: the refusal comes later
+    EXPECT_EQ(anonymous.read(1), "");
     EXPECT_THAT(server->stop().errors, AllOf(HasSubstr("peer did not return a certificate"),
                                              HasSubstr(": not let in: the TLS handshake failed: SSL error 1\n")));
 }
@@ -239,7 +239,7 @@ TEST_F(Tls, SighupLoadsTheCredentialsForNewConnections)
     const SSLCertificate fresh = authority.issue(authority.serverRequest(), SSLValidityPeriod::days(1));
     const Arguments pin{"--peer-fingerprint", tool::fingerprintOf(fresh)};
     directory.put("server", authority.credentialsOf(fresh));
-    EXPECT_EQ(call(*server, pin).exitStatus, 1) << "nobody has said so yet";
+    EXPECT_EQ(call(*server, pin).exitStatus, 1) << "before SIGHUP";
     server->process().signal(SIGHUP);
     server->process().awaitErrors("(I): [qel] SIGHUP: loaded " + directory.file("server.crt") +
                                   " for new connections\n");

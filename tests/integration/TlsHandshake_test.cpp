@@ -199,7 +199,7 @@ struct WrongServerRow {
     const char* name;
     std::function<void(LoopbackMessages&)> behave;
     int exitStatus;
-    std::string errors; // behind the endpoint
+    std::string errors; // after the endpoint
 };
 
 void PrintTo(const WrongServerRow& row, std::ostream* os) { *os << row.name; }

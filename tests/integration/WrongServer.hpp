@@ -16,7 +16,7 @@
 
 namespace qel::test {
 
-/// A server of the test's own: does one thing with the first connection.
+/// A server that a test scripts: runs one function on the first connection.
 class WrongServer {
 public:
     explicit WrongServer(std::function<void(LoopbackMessages&)> behave)
@@ -27,7 +27,7 @@ public:
               LoopbackMessages messages(stream);
               try {
                   behave(messages);
-              } catch (const std::exception&) { // the client has gone, which is its right
+              } catch (const std::exception&) { // the client has closed the connection
               }
           })
     {}

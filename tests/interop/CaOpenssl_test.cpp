@@ -28,7 +28,7 @@ protected:
 
     static Json show(const std::string& name) { return Json::parse(runCa({"show", "--json", name}).output); }
 
-    /// The value behind "name=" in openssl's output, without the line end.
+    /// The value after "name=" in openssl's output, without the line end.
     static std::string valueAfter(const std::string& name, const std::string& output)
     {
         const std::size_t start = output.find(name + "=") + name.size() + 1;
@@ -124,7 +124,7 @@ TEST_F(CaOpenssl, MakesARequestWhoseSignatureIsNotThatOfItsKey)
     const std::string der = file("server.der");
     openssl({"req", "-in", shared() + "/server.csr", "-outform", "DER", "-out", der});
     std::string bytes = read("server.der");
-    bytes.back() = static_cast<char>(bytes.back() ^ 1); // the signature stands at the end
+    bytes.back() = static_cast<char>(bytes.back() ^ 1); // the signature is at the end
     write("server.der", bytes);
     openssl({"req", "-inform", "DER", "-in", der, "-out", file("server.csr")});
     EXPECT_EQ(show(file("server.csr"))["signature"], "not valid");

@@ -192,7 +192,7 @@ TEST_F(GnuTLSPrograms, AServerRefusesOurClientOfAnotherRoot)
     const auto client = connectTo(*server, Identity::OtherRoot);
     const Outcome outcome = here([&client] { client->handshake(); });
     // For us the TLS handshake is over by then. This server sends an alert, unlike ours, and goes: whether we read it
-    // before our version byte meets a connection that is no more is luck.
+    // before our version byte meets a closed connection is undefined.
     EXPECT_THAT(outcome.failure, AnyOf(kSSLError1, kSendFailure, kReceiveFailure));
     EXPECT_EQ(client->getStatus(), SSLStream::STATUS_CLOSED);
 }

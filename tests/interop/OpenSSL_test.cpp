@@ -1,6 +1,6 @@
 // Our TLS streams against the programs of OpenSSL: openssl s_client and openssl s_server.
 //
-// What is typed into these programs goes to the other end. The first byte of it is taken for the protocol version.
+// What is typed into these programs goes to the peer, which takes the first byte for the protocol version.
 
 #include <qel/common/security/SSLCertificate.hpp>
 #include <qel/common/security/SSLStream.hpp>
@@ -282,7 +282,7 @@ TEST_F(OpenSSLPrograms, AServerRefusesOurClientOfAnotherRoot)
     const auto client = connectTo(*server, Identity::OtherRoot);
     const Outcome outcome = here([&client] { client->handshake(); });
     // For us the TLS handshake is over by then. This server sends an alert, unlike ours, and goes: whether we read it
-    // before our version byte meets a connection that is no more is luck.
+    // before our version byte meets a closed connection is undefined.
     EXPECT_THAT(outcome.failure, AnyOf(kSSLError1, kSendFailure, kReceiveFailure));
     EXPECT_EQ(client->getStatus(), SSLStream::STATUS_CLOSED);
     server->awaitErrors(X509_verify_cert_error_string(X509_V_ERR_UNABLE_TO_GET_ISSUER_CERT_LOCALLY));

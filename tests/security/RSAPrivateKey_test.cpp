@@ -212,7 +212,7 @@ TEST(RSAPrivateKeyText, LoadsFromEverySupportedForm)
     } rows[] = {
         {"PKCS #8", pkcs8Of(sharedKey())},
         {"text in front", "the key of the console:\n\n" + pem},
-        {"text behind", pem + "\nno more than this\n"},
+        {"text after it", pem + "\nno more than this\n"},
         {"carriage returns", withCrLf(pem)},
         {"a certificate in front", Authority::trusted().client().getPEM() + pem},
         {"two keys", pem + other},

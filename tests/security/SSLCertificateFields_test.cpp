@@ -140,7 +140,7 @@ TEST(SSLCertificateSubject, TakesShortAndLongNamesAndNumbers)
         {"short", {{"CN", "a"}}, "/CN=a", {{"CN", "a"}}},
         {"long", {{"commonName", "a"}}, "/CN=a", {{"CN", "a"}}},
         {"numbers", {{"2.5.4.3", "a"}}, "/CN=a", {{"CN", "a"}}},
-        {"numbers nobody knows", {{"1.2.3.4.5", "a"}}, "/1.2.3.4.5=a", {{"1.2.3.4.5", "a"}}},
+        {"an unknown number", {{"1.2.3.4.5", "a"}}, "/1.2.3.4.5=a", {{"1.2.3.4.5", "a"}}},
         {"country", {{"countryName", "DE"}}, "/C=DE", {{"C", "DE"}}},
         {"several",
          {{"O", "Org"}, {"ST", "State"}, {"L", "Place"}, {"OU", "Unit"}, {"CN", "name"}},

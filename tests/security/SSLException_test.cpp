@@ -23,7 +23,7 @@ using ::testing::IsEmpty;
 
 static_assert(std::is_base_of<std::runtime_error, SSLException>::value, "");
 static_assert(sizeof(SSLException) == sizeof(std::runtime_error), "no members of its own");
-static_assert(!std::is_convertible<std::string, SSLException>::value, "a text is no exception unless asked");
+static_assert(!std::is_convertible<std::string, SSLException>::value, "a text does not convert to an exception");
 static_assert(std::is_nothrow_copy_constructible<SSLException>::value, "as the language asks of exceptions");
 
 void putError(int reason, const char* file, int line) { ERR_put_error(ERR_LIB_USER, 0, reason, file, line); }

@@ -272,9 +272,9 @@ const std::string& endlessData()
 
 void writeLots(SSLStream& stream, const std::vector<std::size_t>& lengths)
 {
-    std::size_t turn = 0;
+    std::size_t next = 0;
     for (std::size_t position = 0; position < kLotsOfBytes;) {
-        const std::size_t length = std::min(lengths[turn++ % lengths.size()], kLotsOfBytes - position);
+        const std::size_t length = std::min(lengths[next++ % lengths.size()], kLotsOfBytes - position);
         stream.write(endlessData().data() + position % kPeriod, length);
         position += length;
     }
@@ -283,9 +283,9 @@ void writeLots(SSLStream& stream, const std::vector<std::size_t>& lengths)
 void readLots(SSLStream& stream, const std::vector<std::size_t>& lengths)
 {
     std::vector<char> buffer(*std::max_element(lengths.begin(), lengths.end()));
-    std::size_t turn = 0;
+    std::size_t next = 0;
     for (std::size_t position = 0; position < kLotsOfBytes;) {
-        const std::size_t room = std::min(lengths[turn++ % lengths.size()], kLotsOfBytes - position);
+        const std::size_t room = std::min(lengths[next++ % lengths.size()], kLotsOfBytes - position);
         const std::size_t count = stream.read(buffer.data(), room);
         ASSERT_GT(count, 0U) << "at " << position;
         ASSERT_EQ(endlessData().compare(position % kPeriod, count, buffer.data(), count), 0) << "at " << position;

@@ -340,7 +340,7 @@ TEST_F(EncryptedPair, AWriteGoesOutInChunksOf8192BytesAndIsLoggedOnce)
         writes.erase(writes.begin(), writes.begin() + static_cast<std::ptrdiff_t>(writesBefore));
         EXPECT_EQ(writes, chunks);
         EXPECT_THAT(mLog.lines(), ElementsAre(encryptedLine(length)));
-        EXPECT_THAT(linesAtEachTransfer, Each(0U)) << "the line comes behind the last transfer";
+        EXPECT_THAT(linesAtEachTransfer, Each(0U)) << "the line follows the last transfer";
         EXPECT_EQ(readExactly(mServer, length), pattern(length));
     }
 }

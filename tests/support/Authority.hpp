@@ -10,15 +10,14 @@
 namespace qel::test {
 
 /// A small certificate authority for tests: a root, and one certificate for each end of a connection, all valid now.
-/// Making a key takes long, so these are made when they are first asked for and then shared by all tests of the
-/// program, which must not change them.
-/// Thread safety: everything from any thread.
+/// Keys are slow to make, so they are made on first use and shared by all tests of the program. Tests must not change
+/// them. Thread safety: any thread may call any operation.
 class Authority {
 public:
     /// The root that both ends trust. Its subject is "CN=QEL test root", its certificates are "CN=server" and
     /// "CN=client".
     static const Authority& trusted();
-    /// Another one, with the same names for its certificates: "CN=another root".
+    /// Another authority, "CN=another root", with the same names for its certificates.
     static const Authority& stranger();
 
     const SSLCertificate& root() const { return mRoot; }

@@ -4,11 +4,10 @@
 
 namespace qel::test {
 
-/// Stands in for time(2), so that a test can stop the calendar or move it. A test program that links CalendarTime.cpp
-/// defines the function itself; the library and OpenSSL, when it looks at the validity of a certificate, then call the
-/// test program's.
+/// Replaces time(2), so that a test can stop or set the calendar. A test program that links CalendarTime.cpp defines
+/// the function itself; the library, and OpenSSL when it checks the validity of a certificate, then call that.
 ///
-/// In force for the thread that makes it, from construction to destruction; one at a time.
+/// Active for the thread that makes it, from construction to destruction; one at a time.
 class CalendarTime {
 public:
     /// @param now  what every call returns, in seconds since 1970-01-01 00:00 UTC
@@ -18,7 +17,7 @@ public:
     CalendarTime& operator=(const CalendarTime&) = delete;
 
     void set(std::time_t now) { mNow = now; }
-    /// Makes every call add so many seconds, so that reading twice shows.
+    /// Makes every call advance the time, so that a test notices a second read.
     void advanceByEachRead(std::time_t seconds) { mStep = seconds; }
     /// @return how often the time was read
     unsigned reads() const { return mReads; }

@@ -10,8 +10,8 @@
 
 namespace qel::test {
 
-/// A directory of credentials as the program takes them: those of "server" and "client" with the root of
-/// Authority::trusted(), and whatever else a test puts there.
+/// A directory of credentials for the program: those of "server" and "client" with the root of Authority::trusted(),
+/// and those that a test adds.
 class CredentialDirectory {
 public:
     CredentialDirectory();
@@ -19,7 +19,7 @@ public:
     std::string path() const { return mDirectory.path(); }
     std::string file(const std::string& name) const { return mDirectory.file(name); }
 
-    /// Writes NAME.crt, and NAME.key with mode 0600; replaces what is there. The root stays as it is.
+    /// Writes NAME.crt, and NAME.key with mode 0600; replaces existing files. Does not change the root.
     void put(const std::string& name, const SSLCredentials& credentials) const;
 
     /// The options of the program for TLS with the credentials of a name.
@@ -29,7 +29,7 @@ private:
     TemporaryDirectory mDirectory;
 };
 
-/// Credentials of Authority::trusted() whose time is over, or has not begun.
+/// Credentials of Authority::trusted() that are expired, or not yet valid.
 SSLCredentials expiredCredentials(const SSLCertificateRequest& request);
 SSLCredentials futureCredentials(const SSLCertificateRequest& request);
 

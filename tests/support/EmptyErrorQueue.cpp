@@ -1,5 +1,5 @@
-// A test program that links this file fails every test which leaves an entry in OpenSSL's error queue: nothing that
-// the library does may, whether it succeeds or fails.
+// A test program that links this file fails every test that leaves an entry in OpenSSL's error queue: no operation of
+// the library may leave one, whether it succeeds or fails.
 
 #include <gtest/gtest.h>
 #include <openssl/err.h>
@@ -10,7 +10,7 @@ class EmptyErrorQueue : public testing::EmptyTestEventListener {
     void OnTestEnd(const testing::TestInfo&) override
     {
         EXPECT_EQ(ERR_peek_error(), 0UL) << "left in the error queue: " << ERR_error_string(ERR_peek_error(), nullptr);
-        ERR_clear_error(); // the next test shall not suffer from it
+        ERR_clear_error(); // for the next test
     }
 };
 

@@ -8,7 +8,7 @@
 namespace qel::test {
 
 /// @param write  called with a BIO to write to; returns 1 when that succeeded, as OpenSSL's functions do
-/// @return what was written
+/// @return the bytes written
 template <typename Write>
 std::string writtenBy(const Write& write)
 {

@@ -56,7 +56,7 @@ Result callOrFail(const char* name, Result (*real)(Parameters...), Parameters...
     return real(arguments...);
 }
 
-// OpenSSL's own function comes behind the one that this program defines under the same name.
+// OpenSSL's own function is the next definition after this program's.
 template <typename Result, typename... Parameters>
 auto openSSLs(const char* name)
 {

@@ -6,11 +6,11 @@
 
 namespace qel::test {
 
-/// Watches the library's calls of OpenSSL and makes one of them fail on demand. A test program that links
-/// OpenSSLCalls.cpp defines the functions listed there itself; the library then calls the test program's, which pass
-/// every call on to OpenSSL.
+/// Records the library's OpenSSL calls and makes one of them fail on request. A test program that links
+/// OpenSSLCalls.cpp defines the functions listed there itself; the library then calls those, which pass every call on
+/// to OpenSSL.
 ///
-/// Calls that OpenSSL makes itself, inside of a watched one, are neither recorded nor made to fail.
+/// Calls that OpenSSL makes itself within a recorded one are neither recorded nor made to fail.
 ///
 /// In force for the thread that makes it, from construction to destruction; one at a time.
 class OpenSSLCalls {
@@ -52,8 +52,8 @@ private:
 /// @return the name in a recorded call
 inline std::string nameOf(const std::string& call) { return call.substr(0, call.find('(')); }
 
-/// While it exists, every key that the calling thread generates is a copy of one that was generated once: for tests
-/// that make many and do not care.
+/// While it exists, every key that the calling thread generates is a copy of a single key: for tests that make many
+/// keys.
 class QuickKeys {
 public:
     QuickKeys();
@@ -62,7 +62,7 @@ public:
     QuickKeys& operator=(const QuickKeys&) = delete;
 };
 
-/// The queue entry that a failed call leaves. The same can be put there by hand.
+/// Adds the queue entry that a failed call leaves.
 void putInjectedError();
 
 } // namespace qel::test

@@ -11,22 +11,21 @@
 
 namespace qel::test {
 
-/// The other end of a TLS connection, made of OpenSSL alone and able to misbehave: it offers what it is told to, and
-/// can send records of its own making.
+/// A TLS peer made of OpenSSL alone that can misbehave: the test chooses what it offers, and it can send hand-made
+/// records.
 ///
-/// Everything returns quietly when TLS or the stream ends; what went wrong is for the end under test to report. An
-/// exception of the stream comes through.
-/// Thread safety: belongs to one thread at a time.
+/// All operations return silently when TLS or the stream ends; the end under test reports the failure. Exceptions of
+/// the stream propagate. Thread safety: belongs to one thread at a time.
 class RawTlsPeer {
 public:
     enum Role { Client, Server };
 
     struct Options {
-        const SSLCredentials* credentials = nullptr; ///< what it presents and trusts; null: no certificate, trusts all
+        const SSLCredentials* credentials = nullptr; ///< presented and trusted; null: presents nothing, trusts all
         int minimumVersion = TLS1_3_VERSION;
         int maximumVersion = TLS1_3_VERSION;
         std::size_t tickets = 0;  ///< that a server sends after the handshake
-        bool verifiesPeer = true; ///< a server demands a certificate; a client looks at the server's
+        bool verifiesPeer = true; ///< a server requires a certificate; a client verifies the server's
     };
 
     RawTlsPeer(Role role, const Options& options, std::unique_ptr<Stream> stream);
@@ -34,28 +33,28 @@ public:
     RawTlsPeer(const RawTlsPeer&) = delete;
     RawTlsPeer& operator=(const RawTlsPeer&) = delete;
 
-    /// Only begins the TLS handshake: a client sends its offer.
+    /// Begins the TLS handshake only: a client sends its offer.
     void beginHandshake();
     /// The TLS handshake alone, without the version byte. @return whether it succeeded
     bool handshake();
     /// Sends data, a record for each call; at most 16384 bytes.
     void write(const std::string& data);
-    /// @return that many bytes of data, fewer when the connection ends
+    /// @return `length` bytes of data, fewer when the connection ends
     std::string read(std::size_t length);
     /// The version byte each way.
     void exchangeVersions(char version = 0);
 
-    /// Sends a KeyUpdate message. @param answered  the peer shall change its keys, too
+    /// Sends a KeyUpdate message. @param answered  requests new keys of the peer too
     void updateKeys(bool answered);
-    /// Says that no more data will come, as TLS wants it.
+    /// Sends close_notify.
     void closeNotify();
 
-    /// Collects what is sent from here on; release() sends all of it in one write.
+    /// Holds back everything sent from now on; release() sends it in one write.
     void hold() { mHeld = true; }
     void release();
 
-    /// Makes a record as this end would encrypt it at this moment. The engine does not know of it, so once it is sent
-    /// only further records of this kind may follow.
+    /// Makes a record as this end would encrypt it now. The engine does not count it, so only further records of this
+    /// kind may follow it.
     /// @param type  23 data, 22 handshake, 21 alert (RFC 8446, 5.1)
     std::string protectedRecord(std::uint8_t type, const std::string& content);
     /// Sends bytes as they are.

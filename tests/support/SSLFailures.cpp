@@ -36,7 +36,7 @@ struct Location {
     std::size_t line;
 };
 
-// The file stands there as the build calls it: relative to the root of the project, or to wherever a compiler cache
+// The file is named as in the build: relative to the root of the project, or to wherever a compiler cache
 // makes paths relative to. An absolute one would tell where the library was built.
 std::optional<Location> locationIn(const std::string& message)
 {

@@ -6,10 +6,9 @@
 
 namespace qel::test {
 
-/// Runs an action twice, the second time with a look at which calls of OpenSSL it makes; then once more for each of
-/// them, with that call failing. Expects each time that the action throws SSLException "An SSL error occurred at
-/// FILE:LINE", that the call stands there in the source, that OpenSSL's own reason is in the log, and that the error
-/// queue is empty.
+/// Runs an action twice and records its OpenSSL calls the second time; then runs it once for each of them with that
+/// call failing. Expects each time that the action throws SSLException "An SSL error occurred at FILE:LINE", that this
+/// line of the source has the call, that OpenSSL's own reason is in the log, and that the error queue is empty.
 /// @param action      makes the same calls each time
 /// @param exceptions  calls that cannot fail or whose failure shows otherwise: names, or whole calls as
 ///                    OpenSSLCalls::calls() has them

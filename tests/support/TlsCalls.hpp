@@ -16,15 +16,14 @@ struct SecondParameter<Result(First, Second)> {
     using Type = Second;
 };
 
-/// A certificate that is to be written: const in OpenSSL 3, not in 1.1.1.
+/// A certificate to be written: const in OpenSSL 3, not in 1.1.1.
 using WrittenCertificate = SecondParameter<decltype(::PEM_write_bio_X509)>::Type;
 
-/// Stands in for calls of OpenSSL, as SystemCalls does for those of the system: to reach failures that OpenSSL has no
-/// way to be driven into from outside. A test program that links TlsCalls.cpp defines these functions itself; the
-/// library and OpenSSL then call the test program's.
+/// Replaces OpenSSL functions, as SystemCalls does for system calls, to cause failures that no input can cause. A test
+/// program that links TlsCalls.cpp defines these functions itself; the library and OpenSSL then call those.
 ///
-/// A call goes to the member of its name when that is set, otherwise to OpenSSL. While a stand-in runs it is switched
-/// off, so it may make the real call.
+/// A call goes to the member of its name if that is set, otherwise to OpenSSL. A replacement is disabled while it runs,
+/// so it may make the real call.
 ///
 /// In force for the thread that makes it, from construction to destruction; they nest.
 class TlsCalls {
@@ -44,7 +43,7 @@ public:
     std::function<int(SSL* ssl, const void* buffer, int length)> SSL_write;
 
 private:
-    TlsCalls* const mOuter; // in force again when this one ends
+    TlsCalls* const mOuter; // active again when this one ends
 };
 
 } // namespace qel::test

@@ -17,26 +17,25 @@
 #include <vector>
 
 /// @file
-/// What tests of TLS connections share: an authority, connections, and the two ends of one on a thread each.
+/// Shared by the tests of TLS connections: credentials, connections, and both ends of one on a thread each.
 
 namespace qel::test {
 
-/// Who an end of a test connection says it is. All but the last trust the same root, that of Authority::trusted(), so
-/// that only what they present differs.
+/// What an end of a test connection presents. All but the last trust the same root, that of Authority::trusted().
 enum class Identity {
     Client,            ///< issued by the root to "client"
     Server,            ///< issued by the root to "server"
     Expired,           ///< issued by the root, until yesterday
     NotYetValid,       ///< issued by the root, from tomorrow
-    OtherRoot,         ///< issued by somebody else
-    WithSubjectOfRoot, ///< issued by the root to the subject that is the root's own
-    WithKeyOfAnother,  ///< issued by the root, but with a key that is not its own: contexts refuse these credentials
-                       ///< and are left with the root, to trust, and nothing to present
-    Stranger,          ///< issued by somebody else, whom alone it trusts
+    OtherRoot,         ///< issued by another root
+    WithSubjectOfRoot, ///< issued by the root, with the root's own subject
+    WithKeyOfAnother,  ///< issued by the root, with a key that does not match: contexts refuse these credentials, and
+                       ///< then trust the root but present nothing
+    Stranger,          ///< issued by another root, and trusts only that one
 };
 
-/// @return the credentials of an identity: made when they are first asked for, and then the same all the time
-/// Thread safety: from any thread.
+/// @return the credentials of an identity, made on first use
+/// Thread safety: any thread may call it.
 const SSLCredentials& credentialsOf(Identity identity);
 
 /// @return contexts with the credentials of an identity; the same objects each time
@@ -51,14 +50,15 @@ struct StreamPair {
     std::unique_ptr<Stream> server;
 };
 
-/// @return both ends of a new connection. Reads and writes that make no progress fail after a long time, so that a test
-///         with a mistake ends.
+/// @return both ends of a new connection. Reads and writes that make no progress fail after a long time, so that a
+/// broken
+///         test ends.
 StreamPair connectStreams(Transport transport);
 
 /// What one end of a connection did.
 struct Outcome {
-    std::string failure;          ///< "StreamIOException: EOF", for example; empty when it came to its end
-    std::vector<std::string> log; ///< what its thread wrote, see linesOfThread()
+    std::string failure;          ///< "StreamIOException: EOF", for example; empty when it succeeded
+    std::vector<std::string> log; ///< the log of its thread, see linesOfThread()
 };
 
 struct Outcomes {
@@ -67,52 +67,51 @@ struct Outcomes {
 };
 
 /// Does some work. The error queue of this thread must be empty afterwards.
-/// @return how it failed, as Outcome has it; empty when it came to its end
+/// @return its failure, as in Outcome; empty when it succeeded
 std::string failureOf(const std::function<void()>& work);
 
-/// Runs both ends of a connection, each on a thread of its own, until both have come to their end. Each must leave the
-/// error queue of its thread empty.
+/// Runs both ends of a connection on a thread each, until both have finished. Each must leave the error queue of its
+/// thread empty.
 Outcomes runEnds(const CapturedLog& log, const std::function<void()>& client, const std::function<void()>& server);
 
 /// Runs one piece of work on this thread. The error queue must be empty afterwards.
 Outcome runHere(const CapturedLog& log, const std::function<void()>& work);
 
-/// What one thread has written to the log: "E: text". Left out are the lines that socket streams write about each
-/// transfer; neighbouring lines with what OpenSSL says itself, which differs from version to version, stand as one
-/// "E: [libssl]".
+/// The log of one thread, as "E: text", without the lines of socket streams about each transfer. Consecutive lines with
+/// OpenSSL's own reasons, which differ between versions, are replaced by one "E: [libssl]".
 std::vector<std::string> linesOfThread(const CapturedLog& log, pid_t thread);
 
 /// Fails the test if the calling thread's error queue holds something, and empties it.
 void expectEmptyErrorQueue();
 
-/// What tests of TLS streams begin with; the log is captured.
+/// The base of tests of TLS streams. Captures the log.
 class TlsTest : public ::testing::Test {
 protected:
-    /// Does something on this thread. @return how it went
+    /// Runs work on this thread. @return its outcome
     Outcome here(const std::function<void()>& work) { return runHere(mLog, work); }
 
-    /// Both ends do their handshake at the same time.
+    /// Runs the handshakes of both ends at the same time.
     Outcomes shakeHands(SSLStream& client, SSLStream& server);
 
-    /// Both ends are encrypted afterwards, and the log is empty.
+    /// Encrypts both ends and clears the log.
     void encrypt(SSLStream& client, SSLStream& server);
 
     CapturedLog mLog;
 };
 
-// What our streams write to the log.
+// Log lines of our streams.
 
-/// The lines of a handshake that succeeds, in their order.
+/// The lines of a successful handshake, in order.
 std::vector<std::string> handshakeLines();
 std::string encryptedLine(std::size_t length);
 std::string decryptedLine(std::size_t length);
 
 // Data.
 
-/// Bytes that tell where they stand, more or less.
+/// Bytes that nearly identify their position.
 std::string pattern(std::size_t length);
 void writeText(Stream& stream, const std::string& data);
-/// What one read() delivers.
+/// The data of one read().
 std::string readSome(Stream& stream, std::size_t length);
 std::string readExactly(Stream& stream, std::size_t length);
 

@@ -167,7 +167,7 @@ std::unique_ptr<SSLStream> ProgramTest::connectTo(const Process& program, SSLCli
     const auto end = std::chrono::steady_clock::now() + kPatience;
     std::uint16_t port = 0;
     while ((port = listeningPort(program.pid())) == 0) {
-        if (std::chrono::steady_clock::now() > end) throw std::runtime_error("nobody listens: " + program.errors());
+        if (std::chrono::steady_clock::now() > end) throw std::runtime_error("no process listens: " + program.errors());
         std::this_thread::sleep_for(std::chrono::milliseconds(5));
     }
     Socket socket(IPFamily::IPv4, SOCK_STREAM | SOCK_CLOEXEC, 0);

@@ -14,11 +14,11 @@
 #include <vector>
 
 /// @file
-/// TLS programs of others as peers of our streams.
+/// TLS programs of other projects as peers of our streams.
 
 namespace qel::test {
 
-/// Credentials as files, for the length of a test.
+/// Credentials as files, for the duration of a test.
 class CredentialFiles {
 public:
     explicit CredentialFiles(const SSLCredentials& credentials);
@@ -34,15 +34,15 @@ private:
 /// @return whether a program can be started by its name
 bool hasProgram(const std::string& name);
 
-/// Our end of a connection to a program, over TCP. Whatever the program does not do in time fails.
+/// Our end of a connection to a program, over TCP. All waits have a deadline.
 class ProgramTest : public TlsTest {
 protected:
-    /// The end of the test that a program is missing for. To be called in SetUp().
+    /// Ends a test whose program is missing. Call it in SetUp().
     static void skipWithout(const std::string& program);
 
-    /// Starts a program that is found by its name.
+    /// Starts a program by name.
     static std::unique_ptr<Process> start(std::vector<std::string> command);
-    /// Starts one that would listen to the whole network and has no option against that: it is not let.
+    /// Starts a program that has no option to listen on loopback only, and restricts it to loopback.
     static std::unique_ptr<Process> startOnLoopback(std::vector<std::string> command);
 
     // We accept.
@@ -51,15 +51,15 @@ protected:
     std::string listen();
     /// Takes the next connection, as a server with the credentials of an identity.
     std::unique_ptr<SSLStream> acceptClient(Identity identity = Identity::Server);
-    /// The same with credentials of the test's own.
+    /// The same with other credentials.
     std::unique_ptr<SSLStream> acceptClient(SSLServerContext& context);
 
     // They accept.
 
     /// Connects to the port of 127.0.0.1 at which a program listens, once it does.
-    /// @throws std::runtime_error  it does not, or the rest of the network could connect to it as well
+    /// @throws std::runtime_error  it does not listen, or it listens beyond loopback
     std::unique_ptr<SSLStream> connectTo(const Process& program, Identity identity = Identity::Client);
-    /// The same with credentials of the test's own.
+    /// The same with other credentials.
     std::unique_ptr<SSLStream> connectTo(const Process& program, SSLClientContext& context);
 
     /// Waits until the program has sent something that our end has not read.

@@ -24,7 +24,7 @@ std::string textOf(const NameFields& fields)
     return text;
 }
 
-// Signed by nobody, which nobody minds who only looks at the subject.
+// Unsigned: these tests only read the subject.
 SSLCertificateRequest requestFor(const std::vector<std::pair<std::string, std::string>>& fields)
 {
     SSLCertificateRequest request(Authority::trusted().clientRequest());

@@ -53,7 +53,7 @@ public:
     Stream& stream() { return mStream; }
     void sendBytes(const std::string& bytes) { mStream.write(bytes.data(), bytes.size()); }
 
-    /// True when the other end has ended the connection and nothing was left to read.
+    /// True when the peer has closed the connection and no byte was left to read.
     bool isClosed()
     {
         char byte = 0;

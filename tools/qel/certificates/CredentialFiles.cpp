@@ -227,7 +227,7 @@ void NewFiles::publish()
         if (mExisting == Existing::Keep) pRemoveNames();
         throw;
     }
-    // The names, too, must be on the disk before anybody is told of them. Not every file system can be asked for that.
+    // The names must be on the disk too before the command reports them. Not every file system can sync a directory.
     if (::fsync(mFd.get()) == 0 || errno == EINVAL) return;
     const int error = errno;
     throw FileIOError(error, "cannot write the directory " + mDirectory);

@@ -13,8 +13,8 @@
 namespace qel::tool {
 
 /// Reads the text of a subject. Fields are named by their short name (CN), their long name (commonName) or their
-/// number in dots, with blanks around name and value if somebody likes them. Values are printable ASCII: the library
-/// would store anything else as something else than what was meant.
+/// number in dots; blanks around name and value are removed. Values are printable ASCII: the library would store other
+/// bytes as different characters.
 /// @return the fields, named by their short names if they have one
 /// @throws std::invalid_argument  says what is wrong: no field, a field that is unknown, given twice or without value,
 ///                                or a value that the field cannot have
