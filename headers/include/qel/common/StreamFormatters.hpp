@@ -37,7 +37,7 @@
 
 namespace qel {
 
-/// The integer as which a value is printed: `Type` is its type, `convert` computes it.
+/// Converts a value to the integer that is printed for it: `Type` is the type of the integer, `convert` computes it.
 ///
 /// Types of one byte become unsigned 16-bit numbers, so that they print as numbers and not as characters; the signed
 /// ones among them are sign-extended. Plain `char` counts as signed on every platform, so the character with code 0x80

@@ -55,11 +55,11 @@ private:
     QelMessageCount mPending;
     QelMessageCount mDropped;
     QelMessageCount mCompleted;
-    std::chrono::steady_clock::time_point mHeadReadyTime; // when the first message became the first
-    std::chrono::nanoseconds mTotalHeadLatency = {};      // the sum of those waits
+    std::chrono::steady_clock::time_point mHeadReadyTime; // when the head of the queue became the head
+    std::chrono::nanoseconds mTotalHeadLatency = {};      // total time that messages were the head
     QelMessageLatencyBuckets mEnqueueLatencyBuckets;      // time that producers were blocked
-    QelMessageLatencyBuckets mDequeueLatencyBuckets;      // time as the first message
-    QelMessageLatencyBuckets mE2ELatencyBuckets;          // from the call of the producer to the end
+    QelMessageLatencyBuckets mDequeueLatencyBuckets;      // time that a message was the head
+    QelMessageLatencyBuckets mE2ELatencyBuckets;          // from the call of the producer to leaving the queue
     QelMessageMaxLatencyStatistics mMaxLatency;
     QelMessageLatencyEvents mLatencyEvents;
 };

@@ -28,7 +28,7 @@ public:
         using pointer = const T*;
         using reference = const T&;
 
-        /// Does not belong to a ring; may only be assigned to and compared with its like.
+        /// Does not belong to a ring; it may only be assigned to and compared.
         ConstIterator() noexcept : mBuffer(nullptr), mOffset(0) {}
 
         reference operator*() const { return mBuffer->pAt(mOffset); }
