@@ -24,7 +24,9 @@ namespace {
 namespace fs = std::filesystem;
 
 using std::chrono::hours;
+using testing::AllOf;
 using testing::ElementsAre;
+using testing::EndsWith;
 using testing::MatchesRegex;
 using testing::StartsWith;
 using Clock = SSLValidityPeriod::Clock;
@@ -217,19 +219,19 @@ TEST_F(Ca, SignRefusesKeysThatNoConnectionCanUse)
     struct Row {
         int type;
         int bits;
-        std::string found;
+        std::string found; // versions of OpenSSL differ in the bits of ED25519
     };
     bringRoot();
     for (const Row& row :
-         {Row{EVP_PKEY_RSA, 1024, "RSA with 1024 bits"}, Row{EVP_PKEY_RSA, 2047, "RSA with 2047 bits"},
-          Row{EVP_PKEY_EC, 0, "EC with 256 bits"}, Row{EVP_PKEY_ED25519, 0, "ED25519 with 253 bits"}}) {
+         {Row{EVP_PKEY_RSA, 1024, "RSA with 1024 bits:"}, Row{EVP_PKEY_RSA, 2047, "RSA with 2047 bits:"},
+          Row{EVP_PKEY_EC, 0, "EC with 256 bits:"}, Row{EVP_PKEY_ED25519, 0, "ED25519 with 25"}}) {
         SCOPED_TRACE(row.found);
         write("foreign.csr", foreignRequest(foreignKey(row.type, row.bits)));
         const auto result = runCa({"sign", path(), "foreign"});
         EXPECT_EQ(result.exitStatus, 1);
         EXPECT_EQ(result.output, "");
-        EXPECT_EQ(result.errors, "qel: the request of foreign has a key of type " + row.found +
-                                     ": connections need RSA keys with at least 2048 bits\n");
+        EXPECT_THAT(result.errors, AllOf(StartsWith("qel: the request of foreign has a key of type " + row.found),
+                                         EndsWith(" bits: connections need RSA keys with at least 2048 bits\n")));
         EXPECT_THAT(names(), ElementsAre("foreign.csr", "root.crt", "root.key"));
     }
 }
