@@ -21,7 +21,7 @@ using ::testing::IsEmpty;
 using tool::Admission;
 using tool::PeerPins;
 
-/// The hypervisor end lets a console in; the test is the console.
+/// The hypervisor end admits a console; the test plays the console.
 class AdmissionTest : public HypervisorFixture {
 protected:
     AdmissionTest()
@@ -55,7 +55,7 @@ protected:
 
     static QelInternalMessageRegistry& internal() { return QelInternalMessageRegistry::getInstance(); }
 
-    /// Takes a message in the clear and expects that it is a T.
+    /// Reads a message in the clear and expects a T.
     template <typename T>
     void expect()
     {
@@ -69,7 +69,7 @@ protected:
         EXPECT_EQ(loopback.near->read(&byte, 1), 0U);
     }
 
-    /// The console's side up to TLS. @return its end
+    /// Runs the console's steps up to TLS. @return its stream
     std::unique_ptr<SSLStream> startTls()
     {
         send(QelMessageUpgradeConnectionAsync());
@@ -83,10 +83,10 @@ protected:
     SSLServerContext serverContext;
     SSLClientContext clientContext;
     std::promise<void> ended;
-    std::unique_ptr<Admission> admission; // gone before what it borrows
+    std::unique_ptr<Admission> admission; // destroyed before what it borrows
 };
 
-TEST_F(AdmissionTest, AConsoleThatAsksComesIn)
+TEST_F(AdmissionTest, AConsoleThatAsksForTlsIsAdmitted)
 {
     start();
     const auto console = startTls();
@@ -96,7 +96,7 @@ TEST_F(AdmissionTest, AConsoleThatAsksComesIn)
     EXPECT_EQ(admitted.peer, "the test");
     EXPECT_GT(admitted.timeLeft, std::chrono::milliseconds(0));
     EXPECT_LE(admitted.timeLeft, Loopback::kDeadline);
-    admission.reset(); // the connection does not need it any more
+    admission.reset(); // the stream outlives it
     console->write("to the server", 13);
     std::string text(13, '\0');
     admitted.stream->fill(&text[0], text.size());
@@ -105,7 +105,7 @@ TEST_F(AdmissionTest, AConsoleThatAsksComesIn)
     EXPECT_THAT(log.lines(), IsEmpty());
 }
 
-TEST_F(AdmissionTest, WhatWasLimitedIsNotLimitedAnyMoreForWriting)
+TEST_F(AdmissionTest, TheWriteDeadlineEndsWithTheHandshake)
 {
     start();
     const auto console = startTls();
@@ -113,20 +113,20 @@ TEST_F(AdmissionTest, WhatWasLimitedIsNotLimitedAnyMoreForWriting)
     const Admission::Admitted admitted = admission->release();
     timeval timeout{};
     socklen_t length = sizeof(timeout);
-    admitted.stream->write("x", 1); // the kernel is given a changed limit by the next transfer
+    admitted.stream->write("x", 1); // the next transfer passes the changed deadline to the kernel
     ASSERT_EQ(::getsockopt(admitted.descriptor, SOL_SOCKET, SO_SNDTIMEO, &timeout, &length), 0);
     EXPECT_EQ(timeout.tv_sec, 0);
     EXPECT_EQ(timeout.tv_usec, 0);
 }
 
-TEST_F(AdmissionTest, ASilentConsoleIsClosedWhenTheTimeIsOver)
+TEST_F(AdmissionTest, ASilentConsoleIsClosedAtTheDeadline)
 {
     start(std::chrono::milliseconds(20));
     expectClosed();
     expectRefusal("the peer did not ask for TLS in time");
 }
 
-TEST_F(AdmissionTest, AConsoleThatStopsInTheMiddleOfItsRequestIsClosedWhenTheTimeIsOver)
+TEST_F(AdmissionTest, APartialRequestIsClosedAtTheDeadline)
 {
     start(std::chrono::milliseconds(50));
     const QelMessageUpgradeConnectionAsync request;
@@ -135,18 +135,18 @@ TEST_F(AdmissionTest, AConsoleThatStopsInTheMiddleOfItsRequestIsClosedWhenTheTim
     expectRefusal("the peer did not ask for TLS in time");
 }
 
-TEST_F(AdmissionTest, AConsoleThatAsksAndThenSaysNothingIsClosedWhenTheTimeIsOver)
+TEST_F(AdmissionTest, AConsoleSilentAfterItsRequestIsClosedAtTheDeadline)
 {
-    start(std::chrono::milliseconds(500)); // enough for the answer
+    start(std::chrono::milliseconds(500)); // enough for the response
     send(QelMessageUpgradeConnectionAsync());
     expect<QelMessageUpgradeConnectionAsync>();
     expectClosed();
     expectRefusal("the TLS handshake did not finish in time");
 }
 
-TEST_F(AdmissionTest, TheTimeIsOneForAllSteps)
+TEST_F(AdmissionTest, OneDeadlineCoversAllSteps)
 {
-    // Each byte comes well within the time; all together they do not.
+    // Each byte comes well before the deadline, all of them together do not.
     start(std::chrono::milliseconds(200));
     const QelMessageUpgradeConnectionAsync request;
     unsigned sent = 0;
@@ -159,14 +159,14 @@ TEST_F(AdmissionTest, TheTimeIsOneForAllSteps)
     EXPECT_EQ(admission->release().stream, nullptr);
 }
 
-TEST_F(AdmissionTest, AConsoleThatGoesIsNoticed)
+TEST_F(AdmissionTest, AConsoleThatDisconnectsEndsTheAdmission)
 {
     start();
     loopback.near.reset();
     expectRefusal("the peer did not ask for TLS but ended the connection: EOF");
 }
 
-TEST_F(AdmissionTest, AConsoleThatDoesNotAskIsTurnedAway)
+TEST_F(AdmissionTest, AConsoleThatDoesNotAskForTlsIsRefused)
 {
     start();
     send(versionRequest("a"));
@@ -178,7 +178,7 @@ TEST_F(AdmissionTest, AConsoleThatDoesNotAskIsTurnedAway)
                                                 "something else: [CID: ")));
 }
 
-TEST_F(AdmissionTest, TlsThatBeginsWithoutAskingIsNoMessage)
+TEST_F(AdmissionTest, TlsWithoutARequestIsAMalformedMessage)
 {
     start();
     const std::string hello("\x16\x03\x01\x02\x00\x01\x00\x01\xfc\x03\x03", 11);
@@ -186,7 +186,7 @@ TEST_F(AdmissionTest, TlsThatBeginsWithoutAskingIsNoMessage)
     expectRefusal("the peer did not ask for TLS but sent something else: Invalid length");
 }
 
-TEST_F(AdmissionTest, WhatComesBehindTheRequestInTheClearIsNotUsed)
+TEST_F(AdmissionTest, BytesInTheClearAfterTheRequestAreRefused)
 {
     const QelMessageUpgradeConnectionAsync request;
     const auto version = versionRequest("a");
@@ -197,7 +197,7 @@ TEST_F(AdmissionTest, WhatComesBehindTheRequestInTheClearIsNotUsed)
     expectRefusal("the peer sent data too early in the handshake");
 }
 
-TEST_F(AdmissionTest, MessagesInsteadOfTlsAreNotUsed)
+TEST_F(AdmissionTest, MessagesInsteadOfTlsAreRefused)
 {
     start();
     send(QelMessageUpgradeConnectionAsync());
@@ -205,10 +205,10 @@ TEST_F(AdmissionTest, MessagesInsteadOfTlsAreNotUsed)
     send(versionRequest("a"));
     expectRefusal("the TLS handshake failed: SSL error 1");
     Peer other;
-    identify(other, "a"); // nobody has that name
+    identify(other, "a"); // the identity is free
 }
 
-TEST_F(AdmissionTest, WhenThereAreTooManyConsolesTheAnswerIsAbort)
+TEST_F(AdmissionTest, AtTheMaximumOfConsolesTheAnswerIsAbort)
 {
     tool::HypervisorSettings settings;
     settings.maxConsoles = 1;
@@ -222,7 +222,7 @@ TEST_F(AdmissionTest, WhenThereAreTooManyConsolesTheAnswerIsAbort)
     expectRefusal("no more consoles are taken");
 }
 
-TEST_F(AdmissionTest, ConsolesThatHaveNotIntroducedThemselvesAreNotTooMany)
+TEST_F(AdmissionTest, UnidentifiedConsolesDoNotCount)
 {
     tool::HypervisorSettings settings;
     settings.maxConsoles = 1;
@@ -233,7 +233,7 @@ TEST_F(AdmissionTest, ConsolesThatHaveNotIntroducedThemselvesAreNotTooMany)
     EXPECT_NE(startTls(), nullptr);
 }
 
-TEST_F(AdmissionTest, WhenTheHypervisorShutsDownTheAnswerIsAbort)
+TEST_F(AdmissionTest, DuringShutdownTheAnswerIsAbort)
 {
     hypervisor->shutDown();
     start();
@@ -242,7 +242,7 @@ TEST_F(AdmissionTest, WhenTheHypervisorShutsDownTheAnswerIsAbort)
     expectRefusal("no more consoles are taken");
 }
 
-TEST_F(AdmissionTest, AConsoleThatHasNotAskedWhenTheServerStopsIsTurnedAwayAtOnce)
+TEST_F(AdmissionTest, StopSendsAbortToAConsoleThatHasNotAsked)
 {
     start();
     admission->stop();
@@ -251,7 +251,7 @@ TEST_F(AdmissionTest, AConsoleThatHasNotAskedWhenTheServerStopsIsTurnedAwayAtOnc
     expectRefusal("the server stops");
 }
 
-TEST_F(AdmissionTest, AConsoleInTheMiddleOfTlsIsCutWhenTheServerStops)
+TEST_F(AdmissionTest, StopCutsAConsoleInTheTlsHandshake)
 {
     start();
     send(QelMessageUpgradeConnectionAsync());
@@ -262,7 +262,7 @@ TEST_F(AdmissionTest, AConsoleInTheMiddleOfTlsIsCutWhenTheServerStops)
     EXPECT_EQ(admission->release().stream, nullptr);
 }
 
-TEST_F(AdmissionTest, AnAdmissionCanGoAtAnyTime)
+TEST_F(AdmissionTest, CanBeDestroyedAtAnyTime)
 {
     start();
     send(QelMessageUpgradeConnectionAsync());
@@ -271,7 +271,7 @@ TEST_F(AdmissionTest, AnAdmissionCanGoAtAnyTime)
     expectClosed();
 }
 
-TEST_F(AdmissionTest, AnAdmissionThatWasNeverStartedCanGoToo)
+TEST_F(AdmissionTest, CanBeDestroyedWithoutAStart)
 {
     admission = std::make_unique<Admission>(*hypervisor, std::move(loopback.far), "the test", serverContext, PeerPins(),
                                             TimeProvider::steady(), [] {});
@@ -289,7 +289,7 @@ TEST_F(AdmissionTest, AConsoleWithACertificateOfAnotherRootIsRefused)
     expectRefusal("the peer's certificate is refused: unable to get local issuer certificate");
 }
 
-TEST_F(AdmissionTest, OnlyThosePinnedComeIn)
+TEST_F(AdmissionTest, AConsoleThatIsNotPinnedIsRefused)
 {
     start(Loopback::kDeadline, {{"server"}, {}});
     const auto console = startTls(); // for the console TLS is done
@@ -298,7 +298,7 @@ TEST_F(AdmissionTest, OnlyThosePinnedComeIn)
     expectRefusal("wrong peer: the name \"client\" does not match --peer-name");
 }
 
-TEST_F(AdmissionTest, WhomThePinsNameComesIn)
+TEST_F(AdmissionTest, APinnedConsoleIsAdmitted)
 {
     start(Loopback::kDeadline, {{"client"}, {}});
     const auto console = startTls();

@@ -18,13 +18,13 @@ using ChildReaperTest = PtyFixture;
 
 bool exists(pid_t pid) { return ::kill(pid, 0) == 0 || errno != ESRCH; }
 
-TEST_F(ChildReaperTest, WithoutChildrenThereIsNothingToDo)
+TEST_F(ChildReaperTest, HasNothingToDoWithoutChildren)
 {
     EXPECT_FALSE(reaper.reap());
     reaper.finish();
 }
 
-TEST_F(ChildReaperTest, ACommandIsAskedToEndAndNotKilledBeforeTheGracePeriodIsOver)
+TEST_F(ChildReaperTest, SendsSighupAndDoesNotKillWithinTheGracePeriod)
 {
     const TemporaryDirectory directory;
     const std::string file = directory.file("asked");
@@ -37,7 +37,7 @@ TEST_F(ChildReaperTest, ACommandIsAskedToEndAndNotKilledBeforeTheGracePeriodIsOv
     EXPECT_TRUE(std::ifstream(file).good());
 }
 
-TEST_F(ChildReaperTest, ACommandThatDoesNotListenIsKilled)
+TEST_F(ChildReaperTest, ACommandThatIgnoresSighupIsKilled)
 {
     PtyPort port("trap '' HUP; echo pid=$$; sleep 1000; sleep 1000", reaper);
     port.start();
@@ -62,7 +62,7 @@ TEST_F(ChildReaperTest, TheWholeGroupIsKilled)
     EXPECT_FALSE(exists(inner));
 }
 
-TEST_F(ChildReaperTest, AStoppedCommandEndsToo)
+TEST_F(ChildReaperTest, AStoppedCommandIsEnded)
 {
     PtyPort port("echo pid=$$; kill -STOP $$", reaper);
     port.start();
@@ -72,7 +72,7 @@ TEST_F(ChildReaperTest, AStoppedCommandEndsToo)
     EXPECT_FALSE(exists(pid));
 }
 
-TEST_F(ChildReaperTest, ALineThatGoesEndsItsCommand)
+TEST_F(ChildReaperTest, DestroyingTheLineEndsItsCommand)
 {
     pid_t pid = -1;
     {

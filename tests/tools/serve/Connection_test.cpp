@@ -39,7 +39,7 @@ protected:
         EXPECT_TRUE(connection->hasEnded());
     }
 
-    /// How many requests a console can send without reading a single answer, before the server stops reading.
+    /// Sends requests without reading responses until the server stops reading. @return how many it sent
     unsigned sendUntilStuck(const QelMessage& request)
     {
         loopback.near->setWriteDeadline(std::chrono::milliseconds(300));
@@ -52,8 +52,8 @@ protected:
         }
     }
 
-    /// Opens partition 1 and lets it print, and the console read nothing, until the partition is held back.
-    /// @return the pieces of 4 KiB that it has printed
+    /// Opens partition 1 and lets it print, while the console reads nothing, until the partition is held back.
+    /// @return how many pieces of 4 KiB it has printed
     unsigned printUntilHeldBack()
     {
         messages.ask(QelMessageInterfaceCmpOpenKrogSessionReq());
@@ -72,7 +72,7 @@ protected:
     }
 
     Loopback loopback;
-    /// Sends many requests before it takes the first answer.
+    /// Sends many requests before it reads the first response.
     void expectAnswersInOrder()
     {
         std::vector<unsigned int> asked;
@@ -87,7 +87,7 @@ protected:
 
     LoopbackMessages messages{*loopback.near};
     std::promise<void> ended;
-    std::unique_ptr<Connection> connection; // gone before what it borrows
+    std::unique_ptr<Connection> connection; // destroyed before what it borrows
 };
 
 TEST_F(ConnectionTest, RequestsAreAnsweredInOrder)
@@ -97,7 +97,7 @@ TEST_F(ConnectionTest, RequestsAreAnsweredInOrder)
     expectAnswersInOrder();
 }
 
-TEST_F(ConnectionTest, WhenTheConsoleGoesTheConnectionEnds)
+TEST_F(ConnectionTest, EndsWhenTheConsoleDisconnects)
 {
     start();
     identify();
@@ -106,10 +106,10 @@ TEST_F(ConnectionTest, WhenTheConsoleGoesTheConnectionEnds)
     FakeConsole other;
     const auto id = hypervisor->connect(other, "other");
     hypervisor->receive(id, versionRequest("a"));
-    EXPECT_EQ(other.take()->getStatus(), 0U); // the name is free again
+    EXPECT_EQ(other.take()->getStatus(), 0U); // the identity is free again
 }
 
-TEST_F(ConnectionTest, AConsoleThatSaysThatNothingMoreComesStillGetsItsAnswers)
+TEST_F(ConnectionTest, AHalfClosedConsoleStillGetsItsResponses)
 {
     start();
     identify();
@@ -121,7 +121,7 @@ TEST_F(ConnectionTest, AConsoleThatSaysThatNothingMoreComesStillGetsItsAnswers)
     expectEnd();
 }
 
-TEST_F(ConnectionTest, ABrokenFrameEndsTheConnection)
+TEST_F(ConnectionTest, AMalformedFrameEndsTheConnection)
 {
     struct Case {
         const char* name;
@@ -149,11 +149,11 @@ TEST_F(ConnectionTest, ABrokenFrameEndsTheConnection)
         frames.sendBytes(entry.bytes);
         EXPECT_TRUE(frames.isClosed());
         ASSERT_EQ(end.get_future().wait_for(Loopback::kDeadline), std::future_status::ready);
-        EXPECT_THAT(log.lines(), Contains(HasSubstr(std::string(": closed for a broken frame: ") + entry.reason)));
+        EXPECT_THAT(log.lines(), Contains(HasSubstr(std::string(": closed for a malformed frame: ") + entry.reason)));
     }
 }
 
-TEST_F(ConnectionTest, AnswersToWhatCameBeforeABrokenFrameStillGoOut)
+TEST_F(ConnectionTest, ResponsesFromBeforeAMalformedFrameAreStillSent)
 {
     start();
     identify();
@@ -163,7 +163,7 @@ TEST_F(ConnectionTest, AnswersToWhatCameBeforeABrokenFrameStillGoOut)
     EXPECT_TRUE(messages.isClosed());
 }
 
-TEST_F(ConnectionTest, AConsoleThatSaysNothingIsClosed)
+TEST_F(ConnectionTest, ASilentConsoleIsClosed)
 {
     ConnectionLimits limits;
     limits.handshake = std::chrono::milliseconds(20);
@@ -173,7 +173,7 @@ TEST_F(ConnectionTest, AConsoleThatSaysNothingIsClosed)
     EXPECT_THAT(log.lines(), Contains("W: [qel] console 1: closed, it did not introduce itself in time"));
 }
 
-TEST_F(ConnectionTest, AConsoleThatAsksWithoutIntroducingItselfIsClosed)
+TEST_F(ConnectionTest, AConsoleThatAsksWithoutIdentifyingItselfIsClosed)
 {
     ConnectionLimits limits;
     limits.handshake = std::chrono::milliseconds(50);
@@ -187,7 +187,7 @@ TEST_F(ConnectionTest, AConsoleThatAsksWithoutIntroducingItselfIsClosed)
     expectEnd();
 }
 
-TEST_F(ConnectionTest, AConsoleThatNeitherReadsNorIntroducesItselfIsClosed)
+TEST_F(ConnectionTest, AConsoleThatNeitherReadsNorIdentifiesItselfIsClosed)
 {
     ConnectionLimits limits;
     limits.handshake = std::chrono::milliseconds(400);
@@ -197,7 +197,7 @@ TEST_F(ConnectionTest, AConsoleThatNeitherReadsNorIntroducesItselfIsClosed)
     expectEnd();
 }
 
-TEST_F(ConnectionTest, AnIntroducedConsoleMayTakeItsTime)
+TEST_F(ConnectionTest, AnIdentifiedConsoleHasNoReadDeadline)
 {
     ConnectionLimits limits;
     limits.handshake = std::chrono::milliseconds(1000);
@@ -207,7 +207,7 @@ TEST_F(ConnectionTest, AnIntroducedConsoleMayTakeItsTime)
     EXPECT_EQ(messages.ask(QelMessageGetQelTodReq())->getStatus(), 0U);
 }
 
-TEST_F(ConnectionTest, AnIntroducedConsoleMayBeHeldBackForLongerThanItHadToIntroduceItself)
+TEST_F(ConnectionTest, AnIdentifiedConsoleMayBeHeldBackBeyondTheHandshakeTimeout)
 {
     ConnectionLimits limits;
     limits.handshake = std::chrono::milliseconds(1000);
@@ -218,19 +218,19 @@ TEST_F(ConnectionTest, AnIntroducedConsoleMayBeHeldBackForLongerThanItHadToIntro
     messages.ask(QelMessageVirtualSerialSetupSessionReq(1, 0));
     port1->takes = 0;
     const std::string data(16000, 'x');
-    for (int i = 0; i < 5; ++i) // more than the 64 KiB that are kept
+    for (int i = 0; i < 5; ++i) // more than the 64 KiB that the server keeps
         messages.send(QelMessageVirtualSerialDataToOsAsync(1, 0, 16000, data.data()));
     EXPECT_EQ(ended.get_future().wait_for(std::chrono::milliseconds(1200)), std::future_status::timeout);
     EXPECT_FALSE(hypervisor->mayReceive(1));
 }
 
-TEST_F(ConnectionTest, AConsoleThatDoesNotReadItsAnswersIsNotReadFromAndLosesNothing)
+TEST_F(ConnectionTest, AConsoleThatDoesNotReadItsResponsesIsNotReadAndLosesNothing)
 {
     start();
     identify();
     messages.ask(QelMessageSetGlobalSaveAreaMetadataReq(std::string(16000, 'm')));
     const QelMessageGetGlobalSaveAreaMetadataReq request;
-    const unsigned sent = sendUntilStuck(request); // 32 bytes ask for 16 thousand
+    const unsigned sent = sendUntilStuck(request); // a request of 32 bytes gets 16 KiB
     EXPECT_GT(sent, 10U);
     EXPECT_FALSE(hypervisor->mayReceive(1));
     for (unsigned i = 0; i < sent; ++i) {
@@ -240,7 +240,7 @@ TEST_F(ConnectionTest, AConsoleThatDoesNotReadItsAnswersIsNotReadFromAndLosesNot
     }
 }
 
-TEST_F(ConnectionTest, AConsoleThatDoesNotReadHoldsUpNobodyElse)
+TEST_F(ConnectionTest, AConsoleThatDoesNotReadDelaysNoOther)
 {
     start();
     identify();
@@ -256,7 +256,7 @@ TEST_F(ConnectionTest, AConsoleThatDoesNotReadHoldsUpNobodyElse)
     EXPECT_EQ(frames.ask(QelMessageDaxBroadcastReq(0, 1, 0, "", "x"))->getStatus(), 0U);
 }
 
-TEST_F(ConnectionTest, APartitionThatPrintsWithoutEndIsHeldBackAndLeavesRoomForTheRest)
+TEST_F(ConnectionTest, APartitionThatPrintsWithoutEndLeavesRoomForResponses)
 {
     start();
     identify();
@@ -265,8 +265,8 @@ TEST_F(ConnectionTest, APartitionThatPrintsWithoutEndIsHeldBackAndLeavesRoomForT
     const QelMessageGetQelTodReq request;
     messages.send(request);
 
-    // In the queue there are at most half of the limit and one message, one waits for room, and all of the rest must
-    // have been in the buffers of the system.
+    // The queue holds at most half of the limit and one message, and one message waits for room. The rest must be in
+    // the buffers of the system.
     std::ostringstream text;
     connection->dumpStatistics(text);
     EXPECT_THAT(text.str(), HasSubstr("\n  Limits:         131072/262144\n"));
@@ -279,7 +279,7 @@ TEST_F(ConnectionTest, APartitionThatPrintsWithoutEndIsHeldBackAndLeavesRoomForT
     EXPECT_EQ(messages.receive()->getCallerId(), request.getCallerId());
 }
 
-TEST_F(ConnectionTest, TheStatisticsSayWhoseTheyAre)
+TEST_F(ConnectionTest, TheStatisticsNameTheConsole)
 {
     ConnectionLimits limits;
     limits.queueBytes = 1001;
@@ -295,7 +295,7 @@ TEST_F(ConnectionTest, TheStatisticsSayWhoseTheyAre)
                                        "  Completed:      1 (80 B)\n"));
 }
 
-TEST_F(ConnectionTest, WithTheSmallestQueueThereIsOneMessageAtATime)
+TEST_F(ConnectionTest, TheSmallestQueueHoldsOneMessage)
 {
     ConnectionLimits limits;
     limits.queueBytes = 1;
@@ -304,7 +304,7 @@ TEST_F(ConnectionTest, WithTheSmallestQueueThereIsOneMessageAtATime)
     expectAnswersInOrder();
 }
 
-TEST_F(ConnectionTest, AConsoleThatGoesWhileItIsNotReadFromIsNoticed)
+TEST_F(ConnectionTest, NoticesADisconnectWhileItDoesNotRead)
 {
     start();
     identify();
@@ -313,7 +313,7 @@ TEST_F(ConnectionTest, AConsoleThatGoesWhileItIsNotReadFromIsNoticed)
     messages.ask(QelMessageVirtualSerialSetupSessionReq(1, 0));
     port1->takes = 0;
     const std::string data(16000, 'x');
-    // Five stop the reader; what comes behind them stays unread in the buffers of the system.
+    // Five stop the reader; what follows stays unread in the buffers of the system.
     for (int i = 0; i < 5; ++i)
         messages.send(QelMessageVirtualSerialDataToOsAsync(1, 0, 16000, data.data()));
     messages.send(QelMessageGetQelTodReq());
@@ -321,7 +321,7 @@ TEST_F(ConnectionTest, AConsoleThatGoesWhileItIsNotReadFromIsNoticed)
     expectEnd();
 }
 
-TEST_F(ConnectionTest, ReadingGoesOnWhenThePartitionTakesItsInput)
+TEST_F(ConnectionTest, ReadingResumesWhenThePartitionTakesItsInput)
 {
     start();
     identify();
@@ -346,7 +346,7 @@ TEST_F(ConnectionTest, ReadingGoesOnWhenThePartitionTakesItsInput)
     EXPECT_EQ(answer.get(), request.getCallerId());
 }
 
-TEST_F(ConnectionTest, ATurnedAwayConsoleGetsItsAnswerAndIsClosed)
+TEST_F(ConnectionTest, ARefusedConsoleGetsItsResponseAndIsClosed)
 {
     tool::HypervisorSettings settings;
     settings.maxConsoles = 1;
@@ -359,7 +359,7 @@ TEST_F(ConnectionTest, ATurnedAwayConsoleGetsItsAnswerAndIsClosed)
     expectEnd();
 }
 
-TEST_F(ConnectionTest, OnShutdownTheNoticeGoesOutAndTheConnectionEnds)
+TEST_F(ConnectionTest, OnShutdownTheNoticeIsSentAndTheConnectionEnds)
 {
     start();
     identify();
@@ -369,7 +369,7 @@ TEST_F(ConnectionTest, OnShutdownTheNoticeGoesOutAndTheConnectionEnds)
     expectEnd();
 }
 
-TEST_F(ConnectionTest, AnAbortedConnectionEndsWhateverItsConsoleDoes)
+TEST_F(ConnectionTest, AbortEndsTheConnectionWhateverTheConsoleDoes)
 {
     start();
     identify();
@@ -379,7 +379,7 @@ TEST_F(ConnectionTest, AnAbortedConnectionEndsWhateverItsConsoleDoes)
     expectEnd();
 }
 
-TEST_F(ConnectionTest, AConsoleThatIsSentAwayAndDoesNotReadIsCut)
+TEST_F(ConnectionTest, ARefusedConsoleThatDoesNotReadIsCut)
 {
     ConnectionLimits limits;
     limits.linger = std::chrono::milliseconds(20);
@@ -390,7 +390,7 @@ TEST_F(ConnectionTest, AConsoleThatIsSentAwayAndDoesNotReadIsCut)
     expectEnd();
 }
 
-TEST_F(ConnectionTest, AConsoleThatIsSentAwayAndReadsGetsEverything)
+TEST_F(ConnectionTest, ARefusedConsoleThatReadsGetsEverythingQueued)
 {
     start();
     identify();
@@ -405,7 +405,7 @@ TEST_F(ConnectionTest, AConsoleThatIsSentAwayAndReadsGetsEverything)
     expectEnd();
 }
 
-TEST_F(ConnectionTest, AConnectionCanGoAtAnyTime)
+TEST_F(ConnectionTest, CanBeDestroyedAtAnyTime)
 {
     start();
     identify();
@@ -413,7 +413,7 @@ TEST_F(ConnectionTest, AConnectionCanGoAtAnyTime)
     EXPECT_TRUE(messages.isClosed());
 }
 
-TEST_F(ConnectionTest, AConnectionThatWasNeverStartedCanGoToo)
+TEST_F(ConnectionTest, CanBeDestroyedWithoutAStart)
 {
     const int descriptor = loopback.far->getSocket().getFd();
     connection =

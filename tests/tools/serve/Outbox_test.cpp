@@ -25,7 +25,7 @@ std::unique_ptr<QelMessage> frame(unsigned int callerId, unsigned int length = 3
     return message;
 }
 
-/// The thread that waits for room.
+/// The feeder's thread.
 class Feeder {
 public:
     explicit Feeder(Outbox& outbox) : mOutbox(outbox), mThread([&outbox] { outbox.feed(); }) {}
@@ -37,7 +37,7 @@ public:
     Feeder(const Feeder&) = delete;
     Feeder& operator=(const Feeder&) = delete;
 
-    /// Waits for it to come to its end by itself.
+    /// Waits for it to end by itself.
     void join() { mThread.join(); }
 
 private:
@@ -55,7 +55,7 @@ protected:
         return message == nullptr ? 0 : message->getCallerId();
     }
 
-    /// @return the caller ids of all that comes until there will be no more
+    /// @return the caller ids of all messages until take() returns null
     std::vector<unsigned int> takeAll()
     {
         std::vector<unsigned int> ids;
@@ -88,12 +88,12 @@ TEST_F(OutboxTest, MessagesComeOutInOrder)
 TEST_F(OutboxTest, BelowTheLimitNothingWaits)
 {
     outbox.post(frame(1, 99));
-    outbox.post(frame(2, 1000)); // what is there counts, not what comes
+    outbox.post(frame(2, 1000)); // what is queued counts, not the new message
     EXPECT_TRUE(outbox.hasRoom());
     EXPECT_TRUE(outbox.hasSerialRoom());
     EXPECT_EQ(take(), 1U);
     EXPECT_EQ(take(), 2U);
-    EXPECT_EQ(roomCalls, 0U); // nobody had to be told
+    EXPECT_EQ(roomCalls, 0U); // nothing had waited
 }
 
 TEST_F(OutboxTest, AtTheLimitAResponseWaits)
@@ -112,7 +112,7 @@ TEST_F(OutboxTest, BelowHalfTheLimitSerialDataDoesNotWait)
     EXPECT_TRUE(outbox.hasSerialRoom());
 }
 
-TEST_F(OutboxTest, AtHalfTheLimitSerialDataWaitsAndOthersMayStillCome)
+TEST_F(OutboxTest, AtHalfTheLimitSerialDataWaitsAndResponsesDoNot)
 {
     outbox.post(frame(1, 50));
     outbox.postSerial(frame(2));
@@ -134,18 +134,18 @@ TEST_F(OddOutboxTest, HalfOfAnOddLimitIsRoundedUp)
     EXPECT_FALSE(outbox.hasSerialRoom());
 }
 
-TEST_F(OutboxTest, WhatWaitsIsTakenInInItsOrder)
+TEST_F(OutboxTest, WaitingMessagesEnterTheQueueInOrder)
 {
     outbox.post(frame(1, 60));
     outbox.postSerial(frame(2, 60)); // waits
-    outbox.post(frame(3, 60));       // would find room, and must not pass
+    outbox.post(frame(3, 60));       // would find room, and must not overtake
     outbox.post(frame(4, 60));
     outbox.finish();
     const Feeder feeder(outbox);
     EXPECT_THAT(takeAll(), ::testing::ElementsAre(1, 2, 3, 4));
 }
 
-TEST_F(OutboxTest, RoomIsAnnouncedForEachMessageThatWaited)
+TEST_F(OutboxTest, ReportsRoomForEachMessageThatWaited)
 {
     outbox.post(frame(1, 100));
     outbox.post(frame(2, 100));
@@ -158,7 +158,7 @@ TEST_F(OutboxTest, RoomIsAnnouncedForEachMessageThatWaited)
     EXPECT_TRUE(outbox.hasRoom());
 }
 
-TEST_F(OutboxTest, WhenRoomIsAnnouncedThereIsRoom)
+TEST_F(OutboxTest, WhenRoomIsReportedThereIsRoom)
 {
     std::promise<bool> announced;
     Outbox own([&] { announced.set_value(own.hasRoom() && own.hasSerialRoom()); }, 100);
@@ -169,7 +169,7 @@ TEST_F(OutboxTest, WhenRoomIsAnnouncedThereIsRoom)
     EXPECT_TRUE(announced.get_future().get());
 }
 
-TEST_F(OutboxTest, AnOfferIsTakenBelowTheLimitAndDroppedAtIt)
+TEST_F(OutboxTest, AnOfferIsAcceptedBelowTheLimitAndDroppedAtIt)
 {
     outbox.post(frame(1, 99));
     EXPECT_TRUE(outbox.offer(frame(2)));
@@ -177,10 +177,10 @@ TEST_F(OutboxTest, AnOfferIsTakenBelowTheLimitAndDroppedAtIt)
     EXPECT_THAT(statistics(), HasSubstr(" Dropped:        1 (33 B)\n"));
     EXPECT_EQ(take(), 1U);
     EXPECT_EQ(take(), 2U);
-    EXPECT_TRUE(outbox.hasRoom()); // it was not kept anywhere
+    EXPECT_TRUE(outbox.hasRoom()); // it was dropped, not kept
 }
 
-TEST_F(OutboxTest, AnOfferPassesSerialDataThatWaits)
+TEST_F(OutboxTest, AnOfferOvertakesWaitingSerialData)
 {
     outbox.post(frame(1, 50));
     outbox.postSerial(frame(2));
@@ -191,14 +191,14 @@ TEST_F(OutboxTest, AnOfferPassesSerialDataThatWaits)
     EXPECT_EQ(take(), 2U);
 }
 
-TEST_F(OutboxTest, WhatWasOfferedCounts)
+TEST_F(OutboxTest, OffersCountAgainstTheLimit)
 {
     EXPECT_TRUE(outbox.offer(frame(1, 100)));
     outbox.post(frame(2));
     EXPECT_FALSE(outbox.hasRoom());
 }
 
-TEST_F(OutboxTest, AfterFinishWhatIsHereGoesOutAndNothingElseComesIn)
+TEST_F(OutboxTest, AfterFinishQueuedMessagesGoOutAndNewOnesAreDropped)
 {
     outbox.post(frame(1, 100));
     outbox.post(frame(2)); // waits
@@ -221,7 +221,7 @@ TEST_F(OutboxTest, FinishingAnEmptyOutboxEndsIt)
     feeder.join();
 }
 
-TEST_F(OutboxTest, AnAbandonedOutboxHandsNothingOutAndHoldsNobodyUp)
+TEST_F(OutboxTest, AnAbandonedOutboxReturnsNothingAndBlocksNoCaller)
 {
     outbox.post(frame(1, 100));
     outbox.post(frame(2));
@@ -230,7 +230,7 @@ TEST_F(OutboxTest, AnAbandonedOutboxHandsNothingOutAndHoldsNobodyUp)
     EXPECT_TRUE(outbox.hasRoom());
     EXPECT_TRUE(outbox.hasSerialRoom());
     outbox.post(frame(4));
-    EXPECT_TRUE(outbox.offer(frame(5))); // nobody is too slow for it
+    EXPECT_TRUE(outbox.offer(frame(5))); // not reported as dropped
     EXPECT_EQ(take(), 0U);
     Feeder feeder(outbox);
     feeder.join();
@@ -258,14 +258,14 @@ TEST_F(OutboxTest, TheStatisticsAreThoseOfTheQueue)
                                                     " Completed:      1 (32 B)\n"));
 }
 
-TEST_F(OutboxTest, TheWriterIsWaitedFor)
+TEST_F(OutboxTest, WaitsForTheWriter)
 {
     EXPECT_FALSE(outbox.waitUntilWritten(std::chrono::milliseconds(1)));
     outbox.setWritten();
     EXPECT_TRUE(outbox.waitUntilWritten(std::chrono::milliseconds(0)));
 }
 
-TEST_F(OutboxTest, ManyWhoPostAndOneWriterLoseNothing)
+TEST_F(OutboxTest, ManyProducersAndOneWriterLoseNothing)
 {
     std::atomic<unsigned> sum{0};
     Feeder feeder(outbox);
@@ -290,16 +290,16 @@ TEST_F(OutboxTest, ManyWhoPostAndOneWriterLoseNothing)
     EXPECT_EQ(sum, 1001000U);
 }
 
-// The promise that memory stays bounded: whoever looks at the room first never makes more than one message wait, and
-// serial data alone never fills more than half, however slow the writer is.
-TEST_F(OutboxTest, AFloodOfSerialDataLeavesHalfOfTheRoom)
+// Memory stays bounded: a producer that checks for room first never makes more than one message wait, and serial data
+// alone never fills more than half of the limit, however slow the writer is.
+TEST_F(OutboxTest, AFloodOfSerialDataLeavesHalfOfTheLimit)
 {
     Feeder feeder(outbox);
     unsigned posted = 0;
     for (unsigned taken = 0; taken < 1000; ++taken) {
         while (posted == taken || (outbox.hasSerialRoom() && posted < taken + 100))
             outbox.postSerial(frame(++posted, 40));
-        EXPECT_LE(posted, taken + 4); // two in the queue, one on its way into it, one that just found room
+        EXPECT_LE(posted, taken + 4); // two in the queue, one entering it, one that just found room
         EXPECT_TRUE(outbox.hasRoom());
         EXPECT_EQ(take(), taken + 1);
     }

@@ -1,4 +1,4 @@
-// The server among its connections; as a process it is in tests/integration.
+// The server and its connections in one process; tests/integration runs it as a process of its own.
 
 #include <qel/common/LogBackend.hpp>
 #include <qel/common/QelInternalMessageRegistry.hpp>
@@ -30,7 +30,7 @@ using ::testing::EndsWith;
 using tool::ConnectionLimits;
 using tool::Server;
 
-/// Does something when a line with a certain part is logged.
+/// Runs a function when a line with a given part is logged.
 class OnLine : public LogBackend {
 public:
     OnLine(std::string part, std::function<void()> work) : mPart(std::move(part)), mWork(std::move(work)) {}
@@ -44,8 +44,7 @@ private:
     const std::function<void()> mWork;
 };
 
-/// A server that takes its time: whatever it ends soon, it has not ended because a time was over, unless the clock was
-/// moved.
+/// A server with timeouts of an hour: nothing ends by a timeout unless the test moves the clock.
 class ServerTest : public HypervisorFixture {
 protected:
     static constexpr std::chrono::hours kTime{1};
@@ -62,7 +61,7 @@ protected:
         mServer = std::make_unique<Server>(*hypervisor, std::move(listener), limits, std::move(context));
     }
 
-    /// Whatever the test came to, its consoles are gone by now, so that the server can end.
+    /// The consoles of the test are destroyed by now, so the server can end even after a failure.
     void TearDown() override { stop(); }
 
     /// Serves on a thread of its own until stop(), and then ends as the program does.
@@ -77,7 +76,7 @@ protected:
     void stop() { mStop.interrupt(); }
     bool hasEnded() const { return mServed.wait_for(Loopback::kDeadline) == std::future_status::ready; }
 
-    /// A console that has asked for nothing yet. Its reads have a deadline, on the server's clock.
+    /// A connection that has sent nothing yet. Its reads have a deadline, on the server's clock.
     std::unique_ptr<SocketStream> connect() const
     {
         Socket socket(IPFamily::IPv4, SOCK_STREAM | SOCK_CLOEXEC, 0);
@@ -87,7 +86,7 @@ protected:
         return stream;
     }
 
-    /// Takes a message in the clear and expects that it is a T.
+    /// Reads a message in the clear and expects a T.
     template <typename T>
     static void expect(Stream& stream)
     {
@@ -95,7 +94,7 @@ protected:
         EXPECT_NE(dynamic_cast<const T*>(message.get()), nullptr) << message->getLogID();
     }
 
-    /// Asks for TLS and gets it.
+    /// Asks for TLS and expects it to be granted.
     static void ask(Stream& stream)
     {
         QelMessageStream(stream, QelInternalMessageRegistry::getInstance()).write(QelMessageUpgradeConnectionAsync());
@@ -114,15 +113,15 @@ private:
     IPEndpoint mEndpoint;
     tool::WakeUp mStop;
     std::unique_ptr<Server> mServer;
-    std::future<void> mServed; // goes first, and waits for the thread
+    std::future<void> mServed; // destroyed first; waits for the thread
 };
 
-TEST_F(ServerTest, ConsolesOnTheirWayInAreNotWaitedForWhenItStops)
+TEST_F(ServerTest, StopsWithoutWaitingForUnfinishedHandshakes)
 {
     serve();
     const auto silent = connect();
     const auto stalled = connect();
-    ask(*stalled); // by now the other one, which came first, is there too
+    ask(*stalled); // the other connection came first, so it is accepted too
     stop();
     expect<QelMessageAbortHandshakeAsync>(*silent);
     EXPECT_TRUE(isClosed(*silent));
@@ -131,7 +130,7 @@ TEST_F(ServerTest, ConsolesOnTheirWayInAreNotWaitedForWhenItStops)
     EXPECT_THAT(log.lines(), Contains(EndsWith(": not let in: the server stops")));
 }
 
-TEST_F(ServerTest, TheTimeForComingInIsNotGivenOnceMoreInsideTls)
+TEST_F(ServerTest, TheHandshakeDeadlineContinuesInsideTls)
 {
     QelLogger::get().setLevel(LogLevel::Info);
     QelLogger::get().addBackend(std::make_shared<OnLine>(": over TLS: ", [this] { clock.advance(kTime); }));
@@ -140,13 +139,13 @@ TEST_F(ServerTest, TheTimeForComingInIsNotGivenOnceMoreInsideTls)
     serve();
     auto socket = connect();
     ask(*socket);
-    socket->clearReadDeadline(); // the clock will be moved
+    socket->clearReadDeadline(); // the test moves the clock
     SSLStream console(context, std::move(socket));
     console.handshake();
-    // It says nothing more, and the time is over.
+    // It sends nothing more, and the deadline has passed.
     auto closed = std::async(std::launch::async, [&console] { return isClosed(console); });
     EXPECT_EQ(closed.wait_for(Loopback::kDeadline), std::future_status::ready);
-    console.close(); // if it was not
+    console.close(); // in case it was not closed
     EXPECT_TRUE(closed.get());
     stop();
     EXPECT_TRUE(hasEnded());

@@ -19,9 +19,9 @@
 
 namespace qel::tool {
 
-/// The way of one connection of the hypervisor end from TCP to TLS: a thread of its own takes the steps of
-/// Handshake.hpp and looks at who the console is. Whoever has not come through when the time is over is closed, so that
-/// a console that is silent or slow holds nothing; and nobody else waits for it.
+/// Takes one connection of the hypervisor end from TCP to TLS: a thread of its own runs the steps of Handshake.hpp and
+/// checks the console's certificate. A connection that has not finished at the deadline is closed. No other connection
+/// waits for it.
 ///
 /// Thread safety: one thread owns it (constructor, start(), stop(), release(), destructor); hasEnded() may come from
 /// any.
@@ -29,12 +29,12 @@ class Admission {
 public:
     /// @param hypervisor  borrowed; must outlive this object
     /// @param stream  connected, not null
-    /// @param peer  where the console is, for the log
-    /// @param context  what this connection proves its identity with
-    /// @param pins  who may come in
-    /// @param end  of the time for the whole handshake, the version request included
+    /// @param peer  the console's address, for the log
+    /// @param context  the server's credentials
+    /// @param pins  which consoles are admitted
+    /// @param end  the deadline of the whole handshake, the version request included
     /// @param onEnd  called once, on the thread of this admission, when hasEnded() has become true
-    /// @throws PosixError, SSLException  there is no descriptor or no memory left
+    /// @throws PosixError, SSLException  descriptors or memory have run out
     Admission(const Hypervisor& hypervisor, std::unique_ptr<SocketStream> stream, std::string peer,
               SSLServerContext& context, PeerPins pins, std::chrono::steady_clock::time_point end,
               std::function<void()> onEnd);
@@ -44,24 +44,24 @@ public:
     Admission(const Admission&) = delete;
     Admission& operator=(const Admission&) = delete;
 
-    /// Starts the thread. @throws std::system_error  there can be no more threads
+    /// Starts the thread. @throws std::system_error  the system allows no more threads
     void start();
 
-    /// The server stops: a console that has not asked yet is turned away as soon as it can be, any other is cut.
+    /// For the end of the server: sends the abort message to a console that has not asked for TLS, cuts any other.
     void stop();
 
     /// True once the thread has nothing left to do.
     bool hasEnded() const noexcept { return mEnded; }
 
-    /// A connection that came through.
+    /// The outcome.
     struct Admitted {
-        std::unique_ptr<Stream> stream;     ///< null: this one did not; it is closed
+        std::unique_ptr<Stream> stream;     ///< null: the console was not admitted; the connection is closed
         int descriptor;                     ///< of its socket
-        std::string peer;                   ///< where the console is
+        std::string peer;                   ///< the console's address
         std::chrono::milliseconds timeLeft; ///< for the version request, at least one
     };
 
-    /// To be called once, when it has ended.
+    /// Returns the outcome. Call it once, after hasEnded() has become true.
     Admitted release();
 
 private:
@@ -75,16 +75,16 @@ private:
     const PeerPins mPins;
     const PollDeadline mEnd;
     const std::function<void()> mOnEnd;
-    SocketStream& mSocket; // what mStream owns; for the steps in the clear
+    SocketStream& mSocket; // owned by mStream; for the steps in the clear
     std::unique_ptr<SSLStream> mStream;
-    WakeUp mWake; // of the thread while the console has said nothing yet
+    WakeUp mWake; // for the thread, until the console's first byte
 
     // Guards the two flags by which stop() and the thread agree on who ends the connection.
     mutable Mutex mMutex;
     bool mStopping QEL_GUARDED_BY(mMutex) = false;
-    bool mHasBegun QEL_GUARDED_BY(mMutex) = false; // the thread waits in the stream and not for mWake any more
+    bool mHasBegun QEL_GUARDED_BY(mMutex) = false; // the thread waits in the stream, no longer for mWake
 
-    bool mAdmitted = false; // to be looked at once mEnded is true
+    bool mAdmitted = false; // valid once mEnded is true
     std::atomic<bool> mEnded{false};
     std::thread mThread;
 };

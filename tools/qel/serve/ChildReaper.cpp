@@ -22,7 +22,7 @@ ChildReaper::~ChildReaper() { finish(); }
 
 void ChildReaper::adopt(pid_t leader)
 {
-    // A stopped process gets no signal but the last one before it is continued.
+    // A stopped process acts on SIGHUP only after SIGCONT.
     static_cast<void>(::kill(-leader, SIGHUP));
     static_cast<void>(::kill(-leader, SIGCONT));
     const MutexLock lock(mMutex);

@@ -8,12 +8,12 @@
 
 namespace qel::tool {
 
-/// Sees to it that commands which are no longer wanted end, and are reaped.
+/// Ends commands and reaps them.
 ///
-/// A command that is handed over is asked to end (SIGHUP to its process group), killed with its group when it has not
-/// within the grace period (SIGKILL), and reaped in either case. Others of its group that outlive it are left alone:
-/// once it is reaped, the number of the group may come to mean another one. Nothing here waits but finish(): somebody
-/// must call reap() from time to time while it says that commands are left.
+/// adopt() sends SIGHUP to the command's process group. A command that has not ended after the grace period is killed
+/// with its group (SIGKILL). Other processes of the group that outlive the command are left alone: once the command is
+/// reaped, the system may use the number of the group again. Only finish() blocks; while commands are left, the owner
+/// must call reap() from time to time.
 ///
 /// Thread safety: any thread. Its lock is a leaf.
 class ChildReaper {
@@ -28,11 +28,11 @@ public:
     /// Takes over a child of this process that leads a process group, and asks it to end.
     void adopt(pid_t leader);
 
-    /// Reaps what has ended and kills what is overdue, without waiting.
-    /// @return true: some are left
+    /// Reaps what has ended and kills what is overdue, without blocking.
+    /// @return true: commands are left
     bool reap();
 
-    /// Waits until none is left; takes little more than the grace period. The destructor does the same.
+    /// Blocks until none is left, for little more than the grace period. The destructor does the same.
     void finish();
 
 private:

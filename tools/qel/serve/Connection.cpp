@@ -14,7 +14,7 @@ namespace qel::tool {
 
 namespace {
 
-/// Reports that the other end has closed its side, even while data it sent before is still unread.
+/// Reports that the peer has closed its side, even while earlier data is still unread.
 PollFd hangUpOf(int descriptor)
 {
     PollFd fd(descriptor, PollEvents::Error);
@@ -28,7 +28,7 @@ Connection::Connection(Hypervisor& hypervisor, std::unique_ptr<Stream> stream, i
                        ConnectionLimits limits, std::function<void()> onEnd)
     : mHypervisor(hypervisor), mStream(std::move(stream)), mHangUp(hangUpOf(descriptor)), mPeer(std::move(peer)),
       mLimits(limits), mOnEnd(std::move(onEnd)), mMessages(*mStream, messageRegistry()),
-      mOutbox([this] { pTellRoom(); }, limits.queueBytes)
+      mOutbox([this] { pOnRoom(); }, limits.queueBytes)
 {}
 
 Connection::~Connection()
@@ -87,34 +87,34 @@ void Connection::pRead() noexcept
     try {
         pReceiveAll();
     } catch (const QelMessageValidationException& error) {
-        logLine(LogLevel::Warn, "console ", mId, ": closed for a broken frame: ", error.what());
+        logLine(LogLevel::Warn, "console ", mId, ": closed for a malformed frame: ", error.what());
     } catch (const StreamIOException& error) {
         pReport(error);
     } catch (const std::exception& error) {
         logLine(LogLevel::Error, "console ", mId, ": ", explain(error));
     }
-    pEnd();
+    pFinish();
 }
 
 void Connection::pReceiveAll()
 {
-    bool introduced = false;
-    while (pWaitForTurn()) {
+    bool identified = false;
+    while (pAwaitReceive()) {
         const std::unique_ptr<QelMessage> message = mMessages.read();
         const ConsoleState state = mHypervisor.receive(mId, *message);
-        // It is sent away, and nothing it sends is looked at any more. It may take what is queued for it, but not hold
-        // its connection by not taking it.
+        // The hypervisor closes the connection and ignores further messages. The console may still take what is queued
+        // for it, within the linger time.
         if (state == ConsoleState::Closing && !mOutbox.waitUntilWritten(mLimits.linger)) abort();
-        if (!introduced && state == ConsoleState::Identified) {
-            introduced = true;
+        if (!identified && state == ConsoleState::Identified) {
+            identified = true;
             mHandshake = PollDeadline();
             mStream->clearReadDeadline();
         }
     }
 }
 
-/// @return false: there is nobody left to read from
-bool Connection::pWaitForTurn()
+/// Waits until the hypervisor takes another message. @return false: the console has hung up
+bool Connection::pAwaitReceive()
 {
     while (!mHypervisor.mayReceive(mId)) {
         const PollSet set{mWake.getPollFd(), mHangUp};
@@ -127,8 +127,8 @@ bool Connection::pWaitForTurn()
     return true;
 }
 
-/// The reader's last act: the hypervisor forgets the console, and what it still has for it may go out.
-void Connection::pEnd()
+/// The end of the reader: the hypervisor forgets the console, and the queued messages go out within the linger time.
+void Connection::pFinish()
 {
     mHypervisor.disconnect(mId);
     mOutbox.finish();
@@ -152,12 +152,12 @@ void Connection::pFeed() noexcept
         mOutbox.feed();
     } catch (const std::exception& error) {
         logLine(LogLevel::Error, "console ", mId, ": ", explain(error));
-        abort(); // what it had in hand is lost
+        abort(); // the message it was moving is lost
     }
 }
 
-/// Something that waited for room is in the queue: whoever held back for it may go on.
-void Connection::pTellRoom()
+/// A message that waited for room is in the queue: the reader and the serial thread may have held back for it.
+void Connection::pOnRoom()
 {
     resumeReading();
     mHypervisor.outputDrained();

@@ -20,45 +20,45 @@
 
 namespace qel::tool {
 
-/// What a connection of the hypervisor end allows its console.
+/// The limits of one connection.
 struct ConnectionLimits {
     std::chrono::milliseconds handshake{10000};     ///< from connecting to a granted version request
-    std::chrono::milliseconds linger{2000};         ///< to take what is still queued when the connection ends
-    std::size_t queueBytes = Outbox::kDefaultLimit; ///< of frames that may be queued for it; more than 0
+    std::chrono::milliseconds linger{2000};         ///< for the queued messages to go out when the connection ends
+    std::size_t queueBytes = Outbox::kDefaultLimit; ///< queue limit, in bytes of frames; more than 0
 };
 
-/// One connection of the hypervisor end: a thread that reads messages and hands them to the hypervisor, a thread that
-/// writes what the hypervisor has for this console, and one that waits for room in the queue between the two, so that
-/// nobody else has to. None waits for another connection.
+/// One connection of the hypervisor end, with three threads: the reader hands received messages to the hypervisor, the
+/// writer sends the queued messages, and the feeder waits for room in the queue, so that no other thread has to. None
+/// of them waits for another connection.
 ///
-/// The reader does not read while the hypervisor says that the next message has to wait; then it watches for the
-/// console to go away, so that a console which is gone does not hold its sessions.
+/// While Hypervisor::mayReceive() is false the reader does not read. It watches for the console to hang up instead, so
+/// that a console that has disconnected does not hold its sessions.
 ///
-/// Thread safety: one thread owns it (constructor, start(), destructor); the other operations may come from any.
+/// Thread safety: one thread owns it (constructor, start(), destructor); any thread may call the other operations.
 class Connection final : private ConsoleLink {
 public:
     /// @param hypervisor  borrowed; must outlive this object
     /// @param stream  connected; not null
-    /// @param descriptor  of the stream's socket, watched for the console to hang up; -1: there is none
-    /// @param peer  where the console is, for the log
+    /// @param descriptor  of the stream's socket, watched for a hang-up; -1: none
+    /// @param peer  the console's address, for the log
     /// @param onEnd  called once, on a thread of this connection, when hasEnded() has become true
-    /// @throws PosixError  no descriptor is left for the reader's wake-up
+    /// @throws PosixError  there is no descriptor for the reader's wake-up
     Connection(Hypervisor& hypervisor, std::unique_ptr<Stream> stream, int descriptor, std::string peer,
                ConnectionLimits limits, std::function<void()> onEnd);
 
-    /// Aborts the connection if need be and waits for its threads.
+    /// Aborts the connection unless it has ended, and waits for its threads.
     ~Connection() override;
 
-    /// Starts the threads. @throws std::system_error  there can be no more threads; the connection has ended
+    /// Starts the threads. @throws std::system_error  the system allows no more threads; the connection has ended
     void start();
 
-    /// Both directions are cut at once; what is queued is lost.
+    /// Cuts both directions at once; queued messages are lost.
     void abort();
 
     /// True once the threads have nothing left to do.
     bool hasEnded() const noexcept { return mEnded; }
 
-    /// Prints a line that says whose queue it is, and the statistics of the queue, indented.
+    /// Prints a line that names the console, and the statistics of its queue, indented.
     void dumpStatistics(std::ostream& os) const;
 
 private:
@@ -72,12 +72,12 @@ private:
 
     void pRead() noexcept;
     void pFeed() noexcept;
-    void pTellRoom();
+    void pOnRoom();
     void pWrite() noexcept;
     void pReceiveAll();
-    bool pWaitForTurn();
+    bool pAwaitReceive();
     void pSendAll();
-    void pEnd();
+    void pFinish();
     void pReport(const StreamIOException& error) const;
     void pCloseStream() noexcept;
 
@@ -89,7 +89,7 @@ private:
     const std::function<void()> mOnEnd;
     QelMessageStream mMessages;
     Outbox mOutbox;
-    WakeUp mWake;      // of the reader while it waits for its turn
+    WakeUp mWake;      // for the reader while mayReceive() is false
     ConsoleId mId = 0; // set before the threads start
     PollDeadline mHandshake;
     std::atomic<bool> mEnded{false};

@@ -8,25 +8,25 @@
 
 namespace qel::tool {
 
-/// Numbers the connections of a server, in the order in which they came; no number comes twice.
+/// Numbers the connections of a server in the order of connecting, from 1. No number is used twice.
 using ConsoleId = std::uint64_t;
 
-/// How far a connection has come. docs/connection.md has the table of what is answered in which state.
+/// The state of a connection. docs/connection.md has the table of what is answered in which state.
 enum class ConsoleState {
-    Connected,  ///< has not introduced itself
-    Identified, ///< has, by a granted version request
-    Closing     ///< is on its way out: nothing it sends is looked at any more
+    Connected,  ///< not identified yet
+    Identified, ///< its version request was granted
+    Closing     ///< its connection is being closed: further messages are ignored
 };
 
-/// What the hypervisor knows about one connection. Belongs to the hypervisor and is guarded by its lock.
+/// The hypervisor's entry for one connection. The hypervisor owns it and guards it with its lock.
 struct Console {
     Console(ConsoleId number, std::string from, ConsoleLink& to) : id(number), peer(std::move(from)), link(to) {}
 
     ConsoleId id;
-    std::string peer;  ///< where it comes from, for the log
+    std::string peer;  ///< its address, for the log
     ConsoleLink& link; ///< outlives the entry: see Hypervisor::connect()
     ConsoleState state = ConsoleState::Connected;
-    std::uint32_t toolType = 0; ///< from here on: meaningful once it is identified
+    std::uint32_t toolType = 0; ///< this and the members below: valid once it is identified
     std::string toolId;
     bool sessionOpen = false; ///< the hypervisor session
 };

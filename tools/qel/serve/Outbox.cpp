@@ -33,7 +33,7 @@ bool Outbox::offer(std::unique_ptr<QelMessage> message)
 bool Outbox::hasRoom() const
 {
     const MutexLock lock(mMutex);
-    if (mQueue.isShutdown()) return true; // whatever is posted is dropped
+    if (mQueue.isShutdown()) return true; // messages are dropped
     return std::none_of(mWaiting.begin(), mWaiting.end(),
                         [](const Waiting& waiting) { return waiting.priority == kNormal; });
 }
@@ -66,7 +66,7 @@ void Outbox::feed()
 {
     UniqueMutexLock lock(mMutex);
     while (pAwaitWaitingLocked(lock)) {
-        // Its place stays taken until it is in the queue, so that nothing posted meanwhile passes it.
+        // Its entry stays in the list until it is in the queue, so that nothing posted meanwhile overtakes it.
         Waiting& next = mWaiting.front();
         const MessageQueuingOptions priority = next.priority;
         std::unique_ptr<QelMessage> message = std::move(next.message);
@@ -122,7 +122,7 @@ void Outbox::pPost(std::unique_ptr<QelMessage> message, MessageQueuingOptions pr
     }
 }
 
-/// The queue's own rule, applied to a count that is never below the queue's: it is sure to admit the message.
+/// The queue's own rule, applied to a count that is never below the queue's: the queue will admit the message.
 bool Outbox::pFindsRoomLocked(MessageQueuingOptions priority) const
 {
     const std::size_t limit = priority == kSerial ? mLimitBytes - mLimitBytes / 2 : mLimitBytes;
@@ -133,12 +133,12 @@ void Outbox::pEnqueueLocked(std::unique_ptr<QelMessage> message, MessageQueuingO
 {
     QelMessageCount added;
     added += *message;
-    // Without BLOCKING, though it would not block: under this lock and those of the callers nothing may.
+    // Not BLOCKING: it would not block here, but nothing may under this lock and those of the callers.
     static_cast<void>(mQueue.enqueue(std::move(message), priority));
     mQueued += added;
 }
 
-/// @return false: nothing waits, and nothing will
+/// Waits for a message without room. @return false: there will be no more
 bool Outbox::pAwaitWaitingLocked(UniqueMutexLock& lock)
 {
     while (mWaiting.empty() && !mFinished)
@@ -146,7 +146,7 @@ bool Outbox::pAwaitWaitingLocked(UniqueMutexLock& lock)
     return !mWaiting.empty() && !mQueue.isShutdown();
 }
 
-/// A queue that is shut down hands nothing out any more: it must be empty when its work is done.
+/// Only when the queue is empty: after its shutdown it returns no messages.
 void Outbox::pShutDownWhenDoneLocked()
 {
     if (mFinished && mWaiting.empty() && mQueued.mCount == 0) mQueue.shutdown();

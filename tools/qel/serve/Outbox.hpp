@@ -15,68 +15,66 @@
 
 namespace qel::tool {
 
-/// What stands between those who have something to say to one console and the one thread that writes to it: a message
-/// queue, and in front of it a place to wait for those messages that find no room.
+/// The messages on their way to one console: a message queue, and a list of messages that wait for room in it.
 ///
-/// The queue makes its producers wait until there is room. Those who post must not wait: they hold locks, and have
-/// other consoles to serve. So what finds no room at once is put down here, and one thread, the feeder, takes it into
-/// the queue in their stead and does the waiting. Responses, notices and serial data keep their order. Serial data is
-/// of low priority: it gets in while less than half of the limit is queued, so that the other half stays for the rest.
+/// The queue makes its producers wait for room. The threads that post must not wait: they hold locks and serve other
+/// consoles. So a message without room is kept here, and one thread, the feeder, waits and moves it into the queue.
+/// Responses, notices and serial data keep their order. Serial data has low priority: it enters while less than half of
+/// the limit is queued, so that the other half is left for everything else.
 ///
-/// How much waits is up to those who post: hasRoom() and hasSerialRoom() tell them when to stop.
+/// The list is not bounded here: the threads that post stop when hasRoom() or hasSerialRoom() is false.
 ///
-/// Thread safety: any number of threads that post, one feeder, one writer. Its lock is held for moments, and never
-/// while anybody waits for room or for a message; with it held nothing but the queue is called, and never in a way that
-/// waits.
+/// Thread safety: any number of threads that post, one feeder, one writer. No thread waits for room or for a message
+/// with the lock held; under it only the queue is called, and never in a way that blocks.
 class Outbox {
 public:
-    /// Bytes of frames that fill the queue, unless said otherwise.
+    /// The default limit of the queue, in bytes of frames.
     static constexpr std::size_t kDefaultLimit = 256 * 1024;
 
-    /// @param onRoom  called without the lock, on the feeder's thread, whenever something that waited has got in
+    /// @param onRoom  called without the lock, on the feeder's thread, whenever a message that waited has entered
     /// @param limitBytes  more than 0
     explicit Outbox(std::function<void()> onRoom, std::size_t limitBytes = kDefaultLimit);
 
-    /// Takes a response or a notice, even without room. After finish() or abandon() it is dropped.
+    /// Takes a response or a notice, even without room. Drops it after finish() or abandon().
     void post(std::unique_ptr<QelMessage> message);
 
-    /// Takes serial data, even without room. After finish() or abandon() it is dropped.
+    /// Takes serial data, even without room. Drops it after finish() or abandon().
     void postSerial(std::unique_ptr<QelMessage> message);
 
-    /// Takes a message only while less than the limit is queued. It may pass those that wait for room.
-    /// @return false: it is dropped, and counted so in the statistics
+    /// Takes a message only while less than the limit is queued. It may overtake messages that wait for room.
+    /// @return false: it is dropped, and counted as dropped in the statistics
     bool offer(std::unique_ptr<QelMessage> message);
 
     /// False while a response or a notice waits for room.
     bool hasRoom() const;
 
-    /// False while anything waits for room.
+    /// False while any message waits for room.
     bool hasSerialRoom() const;
 
-    /// Nothing more will be posted; what is here still goes out.
+    /// Says that nothing more will be posted. Messages already here still go out.
     void finish();
 
-    /// Drops what is here: nothing can be written any more. Feeder and writer come to their ends.
+    /// Drops all messages, when nothing can be written any more. feed() and take() return.
     void abandon();
 
-    /// Prints the limits and the statistics of the queue. What waits in front of it is not in them yet.
-    /// @param indent  in front of every line
+    /// Prints the limits and the statistics of the queue, without the messages that wait for room.
+    /// @param indent  at the start of every line
     void dumpStatistics(std::ostream& os, const Indent& indent) const;
 
     // The feeder's side.
 
-    /// Takes into the queue what waits for room, until all of it is in and nothing more will be posted.
+    /// Moves waiting messages into the queue, until none is left and nothing more will be posted.
     void feed();
 
     // The writer's side.
 
-    /// Waits for the next message. @return null: there will be none
+    /// Waits for the next message. @return null: there will be no more
     std::unique_ptr<QelMessage> take();
 
-    /// The writer has ended.
+    /// Says that the writer has ended.
     void setWritten();
 
-    /// Waits for the writer to end. @return false: it has not within the time
+    /// Waits for the writer to end. @return false: timeout
     bool waitUntilWritten(std::chrono::milliseconds timeout) const;
 
 private:
@@ -98,7 +96,7 @@ private:
     mutable Mutex mMutex;
     mutable ConditionVariable mChanged;
     std::deque<Waiting> mWaiting QEL_GUARDED_BY(mMutex); // for room, in order
-    // What is in the queue: counted before it is in, and until after it is out, so that the queue never holds more.
+    // What is in the queue. Counts a message before it enters and until after it leaves: never less than the queue has.
     QelMessageCount mQueued QEL_GUARDED_BY(mMutex);
     bool mFinished QEL_GUARDED_BY(mMutex) = false;
     bool mWritten QEL_GUARDED_BY(mMutex) = false;

@@ -4,7 +4,7 @@
 
 namespace qel::tool {
 
-/// Adds "qel serve": the hypervisor end, which serves consoles until it is told to stop.
+/// Adds "qel serve", which runs the hypervisor end until a signal stops it.
 /// @param action  set when the command line asks for it
 CLI::App& addServeCommand(CLI::App& parent, Action& action);
 

@@ -15,12 +15,12 @@ namespace qel::tool {
 
 namespace {
 
-/// Before the next try when a connection could not be accepted for want of descriptors or memory; the end of another
-/// connection ends it early.
+/// Before the next attempt when a connection could not be accepted for want of descriptors or memory. The end of
+/// another connection ends the pause early.
 constexpr std::chrono::milliseconds kPause(1000);
 
-/// Failures of accept() that concern the one connection alone, or nothing at all: see accept(2).
-bool isPassing(int error)
+/// Failures of accept() that concern one connection only, or none: see accept(2).
+bool isTransient(int error)
 {
     switch (error) {
     case EAGAIN:
@@ -46,7 +46,7 @@ Server::Server(Hypervisor& hypervisor, Socket listener, ConnectionLimits limits,
     : mHypervisor(hypervisor), mListener(std::move(listener)), mLimits(limits), mContext(std::move(context)),
       mPins(std::move(pins))
 {
-    // A connection may be gone between the wait and accept(), which must not wait for the next one then.
+    // A connection may vanish between poll() and accept(), which must not block until the next one then.
     mListener.setFlags(mListener.getFlags() | O_NONBLOCK);
 }
 
@@ -97,15 +97,15 @@ void Server::finish()
 void Server::pAccept()
 {
     try {
-        pTakeIn(mListener.accept());
+        pServe(mListener.accept());
     } catch (const PosixError& error) {
-        if (!isPassing(error.getErrorCode().getCode())) pPause(error);
+        if (!isTransient(error.getErrorCode().getCode())) pPause(error);
     } catch (const std::exception& error) {
         pPause(error);
     }
 }
 
-void Server::pTakeIn(Socket socket)
+void Server::pServe(Socket socket)
 {
     std::string peer;
     std::unique_ptr<SocketStream> stream;
@@ -113,7 +113,7 @@ void Server::pTakeIn(Socket socket)
         peer = socket.getPeerName().str();
         stream = std::make_unique<SocketStream>(std::move(socket));
     } catch (const PosixError& error) {
-        logLine(LogLevel::Info, "a connection was gone before it was served: ", error.what());
+        logLine(LogLevel::Info, "a connection ended before it was served: ", error.what());
         return;
     }
     const int descriptor = stream->getSocket().getFd();
@@ -156,11 +156,11 @@ void Server::pDropEnded()
         return true;
     });
     for (Admission::Admitted& admitted : ended)
-        pLetIn(std::move(admitted));
-    if (mConnections.size() + mAdmissions.size() < before) mPausedUntil = PollDeadline(); // there are descriptors again
+        pOnAdmitted(std::move(admitted));
+    if (mConnections.size() + mAdmissions.size() < before) mPausedUntil = PollDeadline(); // descriptors are free again
 }
 
-void Server::pLetIn(Admission::Admitted admitted)
+void Server::pOnAdmitted(Admission::Admitted admitted)
 {
     if (admitted.stream == nullptr || mStopping) return;
     ConnectionLimits limits = mLimits;

@@ -22,13 +22,13 @@ namespace qel::tool {
 class Server {
 public:
     /// @param hypervisor  borrowed; must outlive this object
-    /// @param listener  listens already
-    /// @param context  for TLS; null: connections are plain
-    /// @param pins  who may come in over TLS
+    /// @param listener  a listening socket
+    /// @param context  the server's credentials for TLS; null: connections are plain
+    /// @param pins  which consoles are admitted over TLS
     Server(Hypervisor& hypervisor, Socket listener, ConnectionLimits limits,
            std::unique_ptr<SSLServerContext> context = nullptr, PeerPins pins = {});
 
-    /// Cuts what is left of the connections.
+    /// Cuts the remaining connections.
     ~Server();
 
     Server(const Server&) = delete;
@@ -37,34 +37,34 @@ public:
     /// Accepts connections until `stop` becomes readable. May be called again.
     void run(const PollFd& stop);
 
-    /// From now on connections are made with this; those that are there keep what they have.
+    /// Replaces the credentials for new connections. Present ones keep theirs.
     void setContext(std::unique_ptr<SSLServerContext> context) { mContext = std::move(context); }
 
-    /// Prints what is known about the queue of each connection, in the order in which they came.
+    /// Prints the statistics of each connection's queue, in the order of connecting.
     void dumpStatistics(std::ostream& os);
 
-    /// Accepts no more, waits for all connections to end and cuts those that have not in time. To be called after
-    /// Hypervisor::shutDown(), which makes them end.
+    /// Stops listening, waits for all connections to end and cuts those that have not ended after the linger time.
+    /// To be called after Hypervisor::shutDown(), which makes them end.
     void finish();
 
 private:
     void pAccept();
-    void pTakeIn(Socket socket);
+    void pServe(Socket socket);
     void pAdmit(std::unique_ptr<SocketStream> stream, const std::string& peer);
     void pConnect(std::unique_ptr<Stream> stream, int descriptor, const std::string& peer, ConnectionLimits limits);
     void pPause(const std::exception& reason);
     void pDropEnded();
-    void pLetIn(Admission::Admitted admitted);
+    void pOnAdmitted(Admission::Admitted admitted);
 
     Hypervisor& mHypervisor;
     Socket mListener;
     const ConnectionLimits mLimits;
     WakeUp mConnectionEnded;
-    PollDeadline mPausedUntil;                  // no connection is accepted before; disabled: not paused
+    PollDeadline mPausedUntil;                  // when to accept connections again; disabled: not paused
     std::unique_ptr<SSLServerContext> mContext; // null: connections are plain
     const PeerPins mPins;
     bool mStopping = false;
-    std::list<std::unique_ptr<Admission>> mAdmissions; // on their way to TLS
+    std::list<std::unique_ptr<Admission>> mAdmissions; // in their handshake
     std::list<std::unique_ptr<Connection>> mConnections;
 };
 
