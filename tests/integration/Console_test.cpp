@@ -26,7 +26,7 @@ using ::testing::HasSubstr;
 using ::testing::Not;
 using ::testing::StartsWith;
 
-constexpr const char* kEndedLine = "qel: session closed: the command ended\n";
+constexpr const char* kEndedLine = "qel: session closed: the command exited with status 0\n";
 
 using Arguments = std::vector<std::string>;
 
@@ -221,7 +221,7 @@ TEST_F(ConsoleTest, TheEndOfTheCommandEndsTheConsole)
     person.type("exit\r");
     const auto result = person.wait();
     EXPECT_EQ(result.exitStatus, 0);
-    EXPECT_THAT(result.screen, EndsWith("\r\nqel: session closed: the command ended\r\n"));
+    EXPECT_THAT(result.screen, EndsWith("\r\nqel: session closed: the command exited with status 0\r\n"));
     EXPECT_TRUE(person.isTerminalUntouched());
 }
 

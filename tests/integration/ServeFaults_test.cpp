@@ -1,4 +1,4 @@
-// What the world may do to the hypervisor end: broken bytes, consoles that vanish, no descriptors.
+// "qel serve" under faults: malformed frames, consoles that vanish, no descriptors.
 
 #include "integration/TestConsole.hpp"
 #include "support/ComesTrue.hpp"
@@ -27,15 +27,15 @@ std::size_t count(const std::string& text, const std::string& part)
     return found;
 }
 
-/// The processes that a process has started and not yet reaped.
+/// @return how many children a process has, zombies included
 std::size_t childrenOf(pid_t parent)
 {
     std::size_t children = 0;
     for (const auto& entry : std::filesystem::directory_iterator("/proc")) {
         std::ifstream stat(entry.path() / "stat");
         std::string text;
-        if (!std::getline(stat, text)) continue; // not a process, or one that has just gone
-        // Behind the name, which is in parentheses and may contain anything: the state and the parent. See proc(5).
+        if (!std::getline(stat, text)) continue; // not a process, or one that has just ended
+        // After the name, which is in parentheses and may contain anything: the state and the parent. See proc(5).
         std::istringstream rest(text.substr(text.rfind(')') + 1));
         std::string state;
         pid_t parentOfIt = 0;
@@ -45,7 +45,7 @@ std::size_t childrenOf(pid_t parent)
     return children;
 }
 
-/// Gives a process fewer descriptors, until release() or the end.
+/// Lowers the descriptor limit of a process until release() or destruction.
 class DescriptorLimit {
 public:
     DescriptorLimit(pid_t pid, std::size_t descriptors) : mPid(pid)
@@ -65,7 +65,7 @@ private:
     rlimit mBefore{};
 };
 
-/// The limit with which the server can open as many more descriptors and not one beyond.
+/// @return the limit under which the server can open exactly `more` descriptors
 std::size_t descriptorsFor(ServeProcess& server, std::size_t more)
 {
     const std::string directory = "/proc/" + std::to_string(server.process().pid()) + "/fd/";
@@ -89,7 +89,7 @@ TEST(ServeFaults, GarbageEndsItsOwnConnectionOnly)
         TestConsole bad(server.endpoint());
         std::string garbage(8 + random() % 200, '\0');
         std::generate(garbage.begin(), garbage.end(), [&] { return static_cast<char>(random()); });
-        garbage[4] = '\x01'; // the length: far beyond what is allowed, so that the server need not wait for more
+        garbage[4] = '\x01'; // a length above the maximum, so that the server does not wait for more
         bad.messages().sendBytes(garbage);
         EXPECT_TRUE(bad.messages().isClosed());
         const std::string line = "round " + std::to_string(round);
@@ -97,10 +97,10 @@ TEST(ServeFaults, GarbageEndsItsOwnConnectionOnly)
         good.readUntil(1, line + "\r\n" + line + "\r\n");
     }
     const auto result = server.stop();
-    EXPECT_EQ(count(result.errors, "closed for a broken frame: Invalid length"), 50U);
+    EXPECT_EQ(count(result.errors, "closed for a malformed frame: Invalid length"), 50U);
 }
 
-TEST(ServeFaults, AFrameThatIsCutShortAtAnyByteHarmsNobody)
+TEST(ServeFaults, AFrameTruncatedAtAnyByteEndsOnlyItsConnection)
 {
     ServeProcess server({"--log-level", "warn"});
     const QelMessageGetEnclTypeAndInterfaceVersionReq request(1, 1, 1, 1, "cut");
@@ -114,7 +114,7 @@ TEST(ServeFaults, AFrameThatIsCutShortAtAnyByteHarmsNobody)
     server.stop();
 }
 
-TEST(ServeFaults, EveryCorruptedByteOfAFrameHarmsNobody)
+TEST(ServeFaults, ACorruptedByteAnywhereInAFrameDoesNotStopTheServer)
 {
     ServeProcess server({"--log-level", "critical"});
     const QelMessageGetEnclTypeAndInterfaceVersionReq request(1, 1, 1, 1, "corrupt");
@@ -130,7 +130,7 @@ TEST(ServeFaults, EveryCorruptedByteOfAFrameHarmsNobody)
     server.stop();
 }
 
-TEST(ServeFaults, ConsolesThatVanishLeaveNothingBehind)
+TEST(ServeFaults, VanishedConsolesLeakNothing)
 {
     ServeProcess server({"--max-consoles", "200", "--partition", "1=cat", "--log-level", "critical"});
     const std::size_t threads = server.threads();
@@ -140,7 +140,7 @@ TEST(ServeFaults, ConsolesThatVanishLeaveNothingBehind)
     {
         TestConsole first(server.endpoint());
         first.openSession("first");
-        first.openSerial(1); // so that the command is there before and after
+        first.openSerial(1); // so that the command runs before and after
     }
     ASSERT_TRUE(comesTrue(quiet));
     for (int round = 0; round < 20; ++round) {
@@ -150,7 +150,7 @@ TEST(ServeFaults, ConsolesThatVanishLeaveNothingBehind)
             if (i > 0) consoles.back()->openSession(std::to_string(round) + "/" + std::to_string(i));
         }
         ASSERT_TRUE(comesTrue([&] {
-            return consoles[1]->statusOf(QelMessageVirtualSerialOpenReq(1, 0, false)) == 0; // free again
+            return consoles[1]->statusOf(QelMessageVirtualSerialOpenReq(1, 0, false)) == 0; // the session is free again
         }));
         consoles[1]->messages().send(QelMessageVirtualSerialSetupSessionReq(1, 0));
         consoles[2]->messages().sendBytes("\xDE\xCA\xFF");
@@ -167,7 +167,7 @@ TEST(ServeFaults, ConsolesThatVanishLeaveNothingBehind)
     server.stop();
 }
 
-TEST(ServeFaults, CommandsThatEndLeaveNothingBehind)
+TEST(ServeFaults, EndedCommandsLeakNothing)
 {
     ServeProcess server({"--partition", "1=exit 0", "--log-level", "critical"});
     TestConsole console(server.endpoint());
@@ -177,7 +177,7 @@ TEST(ServeFaults, CommandsThatEndLeaveNothingBehind)
         console.openSerial(1);
         ASSERT_EQ(console.awaitClosed(1), 4U);
     }
-    // The console is told before the terminal is put away.
+    // The notice goes out before the terminal is closed.
     EXPECT_TRUE(comesTrue([&] { return server.process().descriptors() == before; }));
     EXPECT_TRUE(comesTrue([&] { return childrenOf(server.process().pid()) == 0; }));
     server.stop();
@@ -194,7 +194,7 @@ protected:
     }
 };
 
-TEST_F(ServeDescriptors, WithoutAnyConnectionsWaitAndTheOthersGoOn)
+TEST_F(ServeDescriptors, NewConnectionsWaitForDescriptorsWhileOthersContinue)
 {
     ServeProcess server({"--log-level", "warn", "--partition", "1=cat"});
     TestConsole present(server.endpoint());
@@ -206,7 +206,7 @@ TEST_F(ServeDescriptors, WithoutAnyConnectionsWaitAndTheOthersGoOn)
     server.process().awaitErrors("(E): [qel] cannot accept a connection: 24 (Too many open files)");
     present.type(1, "still served\n");
     present.readUntil(1, "still served\r\nstill served\r\n");
-    // It does not try without a pause: at most once a second.
+    // It tries at most once a second.
     const auto begin = std::chrono::steady_clock::now();
     ASSERT_TRUE(comesTrue([&] { return count(server.process().errors(), "cannot accept") >= 2; }));
     const auto seconds = std::chrono::duration_cast<std::chrono::seconds>(std::chrono::steady_clock::now() - begin);
@@ -217,7 +217,7 @@ TEST_F(ServeDescriptors, WithoutAnyConnectionsWaitAndTheOthersGoOn)
     server.stop();
 }
 
-TEST_F(ServeDescriptors, TheEndOfAConnectionMakesRoomForTheOneThatWaits)
+TEST_F(ServeDescriptors, AClosedConnectionLetsAWaitingOneIn)
 {
     ServeProcess server({"--log-level", "warn"});
     auto present = std::make_unique<TestConsole>(server.endpoint());
@@ -231,7 +231,7 @@ TEST_F(ServeDescriptors, TheEndOfAConnectionMakesRoomForTheOneThatWaits)
     server.stop();
 }
 
-TEST_F(ServeDescriptors, AConnectionThatCannotBeKeptIsClosed)
+TEST_F(ServeDescriptors, AConnectionThatCannotBeServedIsClosed)
 {
     ServeProcess server({"--log-level", "warn"});
     DescriptorLimit limit(server.process().pid(), descriptorsFor(server, 1)); // the socket, but no wake-up
@@ -243,7 +243,7 @@ TEST_F(ServeDescriptors, AConnectionThatCannotBeKeptIsClosed)
     server.stop();
 }
 
-TEST_F(ServeDescriptors, APartitionThatCannotStartIsARefusedRequest)
+TEST_F(ServeDescriptors, APartitionThatCannotStartRefusesTheOpenRequest)
 {
     ServeProcess server({"--log-level", "error", "--partition", "1=echo hello; cat"});
     TestConsole console(server.endpoint());
@@ -258,7 +258,7 @@ TEST_F(ServeDescriptors, APartitionThatCannotStartIsARefusedRequest)
                 HasSubstr("partition 1: cannot open a pseudo-terminal: 24 (Too many open files)"));
 }
 
-TEST(ServeFaults, AConsoleThatSaysNothingIsClosed)
+TEST(ServeFaults, ASilentConsoleIsClosed)
 {
     ServeProcess server({"--handshake-timeout", "0.05", "--log-level", "warn"});
     TestConsole silent(server.endpoint());
@@ -282,7 +282,7 @@ TEST(ServeFaults, ManyConnectionsAtOnceAreServed)
     server.stop();
 }
 
-TEST(ServeFaults, AnEndpointThatIsTakenCannotBeListenedOn)
+TEST(ServeFaults, AnEndpointInUseIsRefused)
 {
     ServeProcess server;
     const auto second = runQel({"serve", "--plain", "--listen", server.endpoint()});
@@ -293,20 +293,21 @@ TEST(ServeFaults, AnEndpointThatIsTakenCannotBeListenedOn)
     server.stop();
 }
 
-TEST(ServeFaults, AServerThatCannotSayWhereItListensDoesNotServe)
+TEST(ServeFaults, ExitsWhenItCannotPrintItsEndpoint)
 {
     const auto result = run({"/bin/sh", "-c", "exec \"$0\" serve --plain > /dev/full", QEL_PROGRAM});
     EXPECT_EQ(result.exitStatus, 4);
     EXPECT_THAT(result.errors, HasSubstr("qel: cannot write to standard output\n"));
 }
 
-TEST(ServeFaults, ALogThatNobodyReadsDoesNotEndTheServer)
+TEST(ServeFaults, AClosedLogPipeDoesNotEndTheServer)
 {
-    // Standard error is a pipe whose reader goes at once; standard output stays the test's.
-    Process shell({"/bin/sh", "-c",
-                   "exec 3>&1; sh -c 'echo $$ >&3; exec \"$0\" serve --plain --log-level debug >&3 3>&-' \"$0\" 2>&1 "
-                   "| true",
-                   QEL_PROGRAM});
+    // Standard error is a pipe whose reader ends at once; standard output is that of the test.
+    Process shell(
+        {"/bin/sh", "-c",
+         "exec 3>&1; sh -c 'echo $$ >&3; exec \"$0\" serve --plain --max-consoles 2 --log-level debug >&3 3>&-' "
+         "\"$0\" 2>&1 | true",
+         QEL_PROGRAM});
     const pid_t server = std::stoi(shell.readLine());
     const std::string endpoint = shell.readLine();
     for (int i = 0; i < 5; ++i) {
@@ -315,7 +316,7 @@ TEST(ServeFaults, ALogThatNobodyReadsDoesNotEndTheServer)
         EXPECT_EQ(console.statusOf(QelMessageGetQelTodReq()), 0U);
         if (i == 4) break;
         console.reset();
-        // Each round must be over before the next: two consoles are all there can be.
+        // The next round needs a free place: wait for it with a call.
         ASSERT_TRUE(comesTrue([&] {
             const auto call = runQel(
                 {"call", "--connect", endpoint, "--plain", "--tool-id", std::to_string(i), "--tool-type", "5", "time"});

@@ -29,8 +29,9 @@ std::vector<std::string> qelCommand(const std::vector<std::string>& arguments)
 Process::Result runQel(const std::vector<std::string>& arguments) { return run(qelCommand(arguments)); }
 
 ServeProcess::ServeProcess(const std::vector<std::string>& options, const std::string& listen,
-                           const std::vector<std::string>& transport)
-    : mProcess(serveArguments(options, listen, transport)), mEndpoint(mProcess.readLine())
+                           const std::vector<std::string>& transport,
+                           const std::map<std::string, std::string>& environment)
+    : mProcess(serveArguments(options, listen, transport), environment), mEndpoint(mProcess.readLine())
 {}
 
 Process::Result ServeProcess::call(const std::vector<std::string>& arguments) const
@@ -139,6 +140,14 @@ bool TestConsole::keepData(const QelMessage& message)
     if (data == nullptr) return false;
     if (data->getSerialDataLength() > 0) mData.append(data->getSerialData(), data->getSerialDataLength());
     return true;
+}
+
+void awaitStuck(TestConsole& other, const std::string& toolId, std::uint32_t toolType)
+{
+    for (int refusals = 0; refusals < 1000;) {
+        const unsigned int status = other.statusOf(QelMessageDaxBroadcastReq(1, 1, toolType, toolId, "x"));
+        refusals = status == QelMessageStatusCmdFailed ? refusals + 1 : 0;
+    }
 }
 
 } // namespace qel::test

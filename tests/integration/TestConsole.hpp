@@ -8,24 +8,27 @@
 #include "support/Process.hpp"
 #include "tools/transport/Loopback.hpp"
 
+#include <map>
 #include <memory>
 #include <string>
 #include <vector>
 
 namespace qel::test {
 
-/// The program under test, with some arguments.
+/// The command line of the program under test.
 std::vector<std::string> qelCommand(const std::vector<std::string>& arguments);
 
-/// Runs the program to its end.
+/// Runs the program until it exits.
 Process::Result runQel(const std::vector<std::string>& arguments);
 
 /// "qel serve" on a port of its own.
 class ServeProcess {
 public:
     /// @param options  besides --listen and those of the transport
+    /// @param environment  added to that of the test
     explicit ServeProcess(const std::vector<std::string>& options = {}, const std::string& listen = "127.0.0.1:0",
-                          const std::vector<std::string>& transport = {"--plain"});
+                          const std::vector<std::string>& transport = {"--plain"},
+                          const std::map<std::string, std::string>& environment = {});
 
     Process& process() { return mProcess; }
     const std::string& endpoint() const { return mEndpoint; }
@@ -33,10 +36,10 @@ public:
     /// "qel call" to it, plain.
     Process::Result call(const std::vector<std::string>& arguments) const;
 
-    /// Asks it to stop and expects that it does so cleanly.
+    /// Stops it by a signal and expects exit status 0.
     Process::Result stop(int signal = SIGTERM);
 
-    /// The threads it has.
+    /// @return how many threads it has
     std::size_t threads() const;
 
 private:
@@ -44,7 +47,7 @@ private:
     std::string mEndpoint;
 };
 
-/// A console that talks to a server over its own connection, frame by frame. Reads have a deadline.
+/// A console with a connection of its own, driven frame by frame. Reads have a deadline.
 class TestConsole {
 public:
     explicit TestConsole(const std::string& endpoint);
@@ -52,10 +55,10 @@ public:
     LoopbackMessages& messages() { return *mMessages; }
     SocketStream& stream() { return *mStream; }
 
-    /// Sends a request, takes notices and data that come in between, and returns the status of the response.
+    /// Sends a request, keeps data and drops notices until the response. @return the status of the response
     unsigned int statusOf(const QelMessage& request);
 
-    /// The steps up to a virtual serial session, each expected to be granted.
+    /// The steps to an open virtual serial session; each expects status 0.
     void introduce(const std::string& toolId, std::uint32_t toolType = 5);
     void openSession(const std::string& toolId);
     void openSerial(std::uint16_t partition);
@@ -69,9 +72,9 @@ public:
     /// Takes messages until a session-closed notice. @return its reason
     unsigned int awaitClosed(std::uint16_t partition);
 
-    /// Cuts the connection without any farewell.
+    /// Closes the connection without a request to close the session.
     void vanish() { mStream.reset(); }
-    /// The same with a reset.
+    /// Closes it with a TCP reset.
     void reset();
 
 private:
@@ -80,7 +83,10 @@ private:
 
     std::unique_ptr<SocketStream> mStream;
     std::unique_ptr<LoopbackMessages> mMessages;
-    std::string mData; // serial data that nobody asked for yet
+    std::string mData; // serial data received and not yet returned
 };
+
+/// Waits until a console accepts nothing more: broadcasts to it are refused a thousand times in a row.
+void awaitStuck(TestConsole& other, const std::string& toolId, std::uint32_t toolType);
 
 } // namespace qel::test

@@ -1,6 +1,7 @@
 #pragma once
 
 #include <qel/common/QelMessageCast.hpp>
+#include <qel/common/QelMessageRegistry.hpp>
 
 #include "serve/ConsoleLink.hpp"
 
@@ -11,7 +12,7 @@
 
 namespace qel::test {
 
-/// The way to a console, as the hypervisor's logic sees it: keeps what is posted.
+/// A link to a console. Keeps what is posted, as the console would read it from the wire.
 class FakeConsole : public tool::ConsoleLink {
 public:
     bool room = true;       ///< for responses, notices and broadcasts
@@ -22,7 +23,7 @@ public:
     void post(std::unique_ptr<QelMessage> message) override
     {
         if (finished) throw std::logic_error("posted after finish()");
-        mPosted.push_back(std::move(message));
+        mPosted.push_back(mRegistry.deserialize(message->serialize(), message->msgLength()));
     }
     void postSerial(std::unique_ptr<QelMessage> message) override
     {
@@ -45,7 +46,7 @@ public:
 
     std::size_t posted() const { return mPosted.size(); }
 
-    /// The oldest message that was not taken yet.
+    /// The oldest posted message that has not been taken.
     std::unique_ptr<QelMessage> take()
     {
         if (mPosted.empty()) throw std::logic_error("nothing was posted");
@@ -54,7 +55,7 @@ public:
         return message;
     }
 
-    /// The same, as the class it must be of.
+    /// The same, as a T. @throws std::bad_cast  it is of another class
     template <typename T>
     std::unique_ptr<T> take()
     {
@@ -63,6 +64,7 @@ public:
     }
 
 private:
+    QelMessageRegistry mRegistry;
     std::deque<std::unique_ptr<QelMessage>> mPosted;
 };
 

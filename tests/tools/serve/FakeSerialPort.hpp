@@ -9,24 +9,26 @@
 #include <cerrno>
 #include <deque>
 #include <limits>
+#include <optional>
 #include <stdexcept>
 #include <string>
 
 namespace qel::test {
 
-/// A serial line that plays what the test wrote into it. Holds its user to the contract: no reading or writing while it
-/// is down.
+/// A serial line that plays a script. Checks the caller's side of the contract: no reading or writing while it is down.
 class FakeSerialPort : public tool::SerialPort {
 public:
     // The script.
     std::deque<std::string> output; ///< what comes out, one read() after the other
-    bool ended = false;             ///< the other side is gone once `output` is empty
+    bool ended = false;             ///< end of stream once `output` is empty
+    /// How the command ended; empty: it still runs.
+    std::optional<tool::CommandEnd> end = tool::CommandEnd{tool::CommandEnd::Kind::Exited, 0};
     /// Bytes of input that will be taken; may be set while other threads use the port.
     std::atomic<std::size_t> takes{std::numeric_limits<std::size_t>::max()};
     bool failsToStart = false;
     bool failsToWrite = false;
 
-    // What was asked.
+    // The calls.
     std::string input; ///< all that was taken
     unsigned started = 0;
     unsigned stopped = 0;
@@ -40,6 +42,7 @@ public:
     }
     bool isRunning() const override { return mRunning; }
     bool hasHungUp() const override { return ended; }
+    std::optional<tool::CommandEnd> commandEnd() override { return end; }
     ReadResult read(char* buffer, std::size_t length) override
     {
         requireRunning();

@@ -17,6 +17,14 @@
 
 namespace qel::test {
 
+/// A request of any identity.
+inline QelMessageGeneric request(unsigned short function, unsigned short operation, const std::string& payload = {})
+{
+    QelMessageGeneric message(4711, function, operation, MsgResponseExpected);
+    message.setData(payload.data(), static_cast<unsigned int>(payload.size()));
+    return message;
+}
+
 /// A hypervisor with two partitions, 1 and 2, and consoles that send it frames as they come from the wire.
 class HypervisorFixture : public ::testing::Test {
 protected:
@@ -27,6 +35,14 @@ protected:
     };
 
     HypervisorFixture() { makeHypervisor(tool::HypervisorSettings()); }
+
+    /// Starts over with a hypervisor that takes so many consoles.
+    void limitConsoles(std::uint8_t maxConsoles)
+    {
+        tool::HypervisorSettings settings;
+        settings.maxConsoles = maxConsoles;
+        makeHypervisor(settings);
+    }
 
     void makeHypervisor(const tool::HypervisorSettings& settings)
     {
@@ -47,7 +63,7 @@ protected:
     {
         return receive(peer, frame.data(), frame.size());
     }
-    /// Whoever waits for the lines must hear of it when there are others to wait for.
+    /// Checks too that a change of the watches comes with a wake-up.
     tool::ConsoleState receive(Peer& peer, const char* frame, std::size_t length)
     {
         const auto message = registry.deserialize(frame, static_cast<unsigned int>(length));
@@ -94,7 +110,7 @@ protected:
     {
         ASSERT_EQ(statusOf(peer, QelMessageVirtualSerialOpenReq(partition, 0, force)), 0U);
     }
-    /// Everything up to data that flows.
+    /// All steps until data flows.
     void setUpSerial(Peer& peer, const std::string& toolId, std::uint16_t partition)
     {
         openSession(peer, toolId);
@@ -106,7 +122,7 @@ protected:
         receive(peer, QelMessageVirtualSerialDataToOsAsync(partition, 0, static_cast<std::uint16_t>(data.size()),
                                                            data.data()));
     }
-    /// The partitions that are waited for.
+    /// The partitions that the serial thread waits for.
     std::vector<std::uint16_t> watched() const
     {
         std::vector<std::uint16_t> ids;
@@ -115,7 +131,7 @@ protected:
         return ids;
     }
 
-    /// The partitions that are waited for, each with what it is waited for.
+    /// The same with the poll events of each.
     std::vector<std::pair<std::uint16_t, short>> watchedEvents() const
     {
         std::vector<std::pair<std::uint16_t, short>> events;

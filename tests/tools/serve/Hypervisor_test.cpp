@@ -3,11 +3,8 @@
 
 #include "serve/Hypervisor.hpp"
 #include "support/RawFrame.hpp"
-#include "support/SettableClock.hpp"
 #include "tools/serve/HypervisorFixture.hpp"
 
-#include <chrono>
-#include <functional>
 #include <gmock/gmock.h>
 
 namespace qel::test {
@@ -16,7 +13,6 @@ namespace {
 
 using ::testing::ElementsAre;
 using ::testing::HasSubstr;
-using ::testing::IsEmpty;
 using tool::ConsoleState;
 using tool::HypervisorSettings;
 
@@ -25,19 +21,10 @@ using HypervisorTest = HypervisorFixture;
 constexpr unsigned int kInvalidOperation = 1;
 constexpr unsigned int kInvalidData = 3;
 constexpr unsigned int kInvalidCmdSequence = 4;
-constexpr unsigned int kCmdFailed = 6;
 constexpr unsigned int kInvalidFunction = 15;
 constexpr unsigned int kTooManyConnections = 18;
-constexpr unsigned int kConnectionNotAvailable = 19;
 constexpr unsigned int kSessionAlreadyOpen = 23;
 constexpr unsigned int kAlreadyConnected = 37;
-
-QelMessageGeneric request(unsigned short function, unsigned short operation, const std::string& payload = {})
-{
-    QelMessageGeneric message(4711, function, operation, MsgResponseExpected);
-    message.setData(payload.data(), static_cast<unsigned int>(payload.size()));
-    return message;
-}
 
 struct NamedRequest {
     const char* name;
@@ -166,7 +153,7 @@ TEST_F(HypervisorTest, AnEmptyToolIdIsAnIdentityLikeAnyOther)
     EXPECT_EQ(statusOf(second, versionRequest("", 7)), kAlreadyConnected);
 }
 
-TEST_F(HypervisorTest, AnIdentityOfNothingButZerosIsTakenByNobodyAtFirst)
+TEST_F(HypervisorTest, AnIdentityOfZerosIsFreeAtFirst)
 {
     Peer silent;
     Peer peer;
@@ -175,11 +162,9 @@ TEST_F(HypervisorTest, AnIdentityOfNothingButZerosIsTakenByNobodyAtFirst)
     EXPECT_EQ(statusOf(peer, versionRequest("", 0)), 0U);
 }
 
-TEST_F(HypervisorTest, AConsoleThatIsSentAwayGivesItsIdentityAndItsPlaceUpAtOnce)
+TEST_F(HypervisorTest, AConsoleBeingClosedFreesItsIdentityAndPlaceAtOnce)
 {
-    HypervisorSettings settings;
-    settings.maxConsoles = 1;
-    makeHypervisor(settings);
+    limitConsoles(1);
     Peer first;
     Peer second;
     identify(first, "a");
@@ -188,8 +173,9 @@ TEST_F(HypervisorTest, AConsoleThatIsSentAwayGivesItsIdentityAndItsPlaceUpAtOnce
     EXPECT_EQ(statusOf(second, versionRequest("a")), 0U);
 }
 
-TEST_F(HypervisorTest, OneConsoleMoreThanAllowedIsTurnedAwayAndClosed)
+TEST_F(HypervisorTest, AConsoleAboveTheMaximumIsRefusedAndClosed)
 {
+    limitConsoles(2);
     Peer first;
     Peer second;
     Peer third;
@@ -201,25 +187,39 @@ TEST_F(HypervisorTest, OneConsoleMoreThanAllowedIsTurnedAwayAndClosed)
     EXPECT_TRUE(third.link.finished);
 }
 
-TEST_F(HypervisorTest, WhatAConsoleSendsAfterItWasTurnedAwayIsNotLookedAt)
+TEST_F(HypervisorTest, TheDefaultMaximumIsSixteenConsoles)
 {
-    HypervisorSettings settings;
-    settings.maxConsoles = 1;
-    makeHypervisor(settings);
+    std::vector<std::unique_ptr<Peer>> peers;
+    for (int i = 0; i < 16; ++i) {
+        SCOPED_TRACE(i);
+        EXPECT_TRUE(hypervisor->takesConsoles());
+        peers.push_back(std::make_unique<Peer>());
+        identify(*peers.back(), "console " + std::to_string(i));
+    }
+    EXPECT_FALSE(hypervisor->takesConsoles());
+    Peer tooMany;
+    connect(tooMany);
+    EXPECT_EQ(statusOf(tooMany, versionRequest("console 16")), kTooManyConnections);
+}
+
+TEST_F(HypervisorTest, IgnoresWhatARefusedConsoleSends)
+{
+    limitConsoles(1);
     Peer first;
     Peer second;
     identify(first, "a");
     connect(second);
     receive(second, versionRequest("b"));
     second.link.take();
-    hypervisor->disconnect(first.id); // now there would be room
+    hypervisor->disconnect(first.id); // a place is free now
     EXPECT_EQ(receive(second, versionRequest("b")), ConsoleState::Closing);
     EXPECT_EQ(receive(second, QelMessageGetInterfaceLimitsReq()), ConsoleState::Closing);
     EXPECT_EQ(second.link.posted(), 0U);
 }
 
-TEST_F(HypervisorTest, AConnectionThatHasNotIntroducedItselfTakesNoPlace)
+TEST_F(HypervisorTest, AnUnidentifiedConnectionDoesNotCount)
 {
+    limitConsoles(2);
     Peer silent;
     Peer first;
     Peer second;
@@ -228,8 +228,9 @@ TEST_F(HypervisorTest, AConnectionThatHasNotIntroducedItselfTakesNoPlace)
     identify(second, "b");
 }
 
-TEST_F(HypervisorTest, TheSameIdentityIsNamedBeforeTheNumberOfConsoles)
+TEST_F(HypervisorTest, ADuplicateIdentityIsReportedBeforeTheMaximum)
 {
+    limitConsoles(2);
     Peer first;
     Peer second;
     Peer third;
@@ -240,8 +241,9 @@ TEST_F(HypervisorTest, TheSameIdentityIsNamedBeforeTheNumberOfConsoles)
     EXPECT_FALSE(third.link.finished);
 }
 
-TEST_F(HypervisorTest, ADisconnectedConsoleMakesRoomForItsIdentityAndItsPlace)
+TEST_F(HypervisorTest, ADisconnectedConsoleFreesItsIdentityAndPlace)
 {
+    limitConsoles(2);
     Peer first;
     Peer second;
     Peer third;
@@ -251,7 +253,7 @@ TEST_F(HypervisorTest, ADisconnectedConsoleMakesRoomForItsIdentityAndItsPlace)
     identify(third, "a");
 }
 
-// What is not known, or not understood.
+// Unknown and malformed messages.
 
 TEST_F(HypervisorTest, AnUnknownFunctionIsInvalid)
 {
@@ -289,7 +291,7 @@ TEST_F(HypervisorTest, ARequestThatDoesNotParseIsInvalidData)
     }
 }
 
-TEST_F(HypervisorTest, TheSequenceIsLookedAtBeforeTheData)
+TEST_F(HypervisorTest, TheSequenceIsCheckedBeforeTheData)
 {
     Peer peer;
     identify(peer, "a");
@@ -324,7 +326,7 @@ TEST_F(HypervisorTest, ARequestWithPaddingIsAnswered)
     EXPECT_EQ(peer.link.take()->getStatus(), 0U);
 }
 
-TEST_F(HypervisorTest, FlagsWithoutMeaningDoNotMatter)
+TEST_F(HypervisorTest, MeaninglessFlagsAreIgnored)
 {
     Peer peer;
     identify(peer, "a");
@@ -332,7 +334,7 @@ TEST_F(HypervisorTest, FlagsWithoutMeaningDoNotMatter)
     EXPECT_EQ(peer.link.take()->getStatus(), 0U);
 }
 
-TEST_F(HypervisorTest, ResponsesAndMessagesOfNoKindAreIgnoredWithAWarning)
+TEST_F(HypervisorTest, ResponsesAndMessagesWithBothFlagsAreIgnoredWithAWarning)
 {
     Peer peer;
     identify(peer, "a");
@@ -354,7 +356,7 @@ TEST_F(HypervisorTest, UnknownNoticesAreIgnoredWithAWarning)
     EXPECT_THAT(log.lines(), ElementsAre(HasSubstr("W: [qel] console 1: ignored [CID: 0x00000000, FN: 0x7000")));
 }
 
-TEST_F(HypervisorTest, NoticesThatGoTheOtherWayAreIgnoredWithAWarning)
+TEST_F(HypervisorTest, NoticesForConsolesAreIgnoredWithAWarning)
 {
     Peer peer;
     identify(peer, "a");
@@ -368,163 +370,6 @@ TEST_F(HypervisorTest, MessagesOfAnUnknownConnectionAreIgnored)
     EXPECT_EQ(hypervisor->receive(99, QelMessageGetQelTodReq()), ConsoleState::Closing);
     EXPECT_TRUE(hypervisor->mayReceive(99));
     hypervisor->disconnect(99);
-}
-
-// Requests that need no session.
-
-TEST_F(HypervisorTest, CapabilitiesAreTheIntersection)
-{
-    HypervisorSettings settings;
-    settings.capabilities = QelCapabilities("0110");
-    makeHypervisor(settings);
-    Peer peer;
-    identify(peer, "a");
-    receive(peer, QelMessageExchIntCapabilitiesReq(QelCapabilities("1100")));
-    const auto response = peer.link.take<QelMessageExchIntCapabilitiesRsp>();
-    EXPECT_EQ(response->getCapabilityLen(), 4U);
-    EXPECT_EQ(response->getCapabilities(), QelCapabilities("0100"));
-}
-
-TEST_F(HypervisorTest, CapabilitiesMayBeOfferedInAnyLength)
-{
-    HypervisorSettings settings;
-    settings.capabilities = QelCapabilities(std::string(32, '1'));
-    makeHypervisor(settings);
-    Peer peer;
-    identify(peer, "a");
-    receive(peer, request(0x6003, 0x0104, std::string("\0\0\0\0", 4)));
-    EXPECT_EQ(peer.link.take<QelMessageExchIntCapabilitiesRsp>()->getCapabilities(), QelCapabilities());
-    receive(peer, request(0x6003, 0x0104, std::string("\0\0\0\x08\x40\0\0\0\xFF\xFF\xFF\xFF", 12)));
-    EXPECT_EQ(peer.link.take<QelMessageExchIntCapabilitiesRsp>()->getCapabilities(), QelCapabilities("01"));
-}
-
-TEST_F(HypervisorTest, LimitsAreThoseOfTheProtocol)
-{
-    Peer peer;
-    identify(peer, "a");
-    const auto response = ask(peer, QelMessageGetInterfaceLimitsReq());
-    EXPECT_EQ(std::string(response->getData(), response->dataLength()),
-              std::string("\x40\0\x10\0\x3F\xB2\0\0\x02\0\0\0\0\0\0\0", 16));
-}
-
-TEST_F(HypervisorTest, LimitsSayHowManyConsolesAreReallyServed)
-{
-    HypervisorSettings settings;
-    settings.maxConsoles = 255;
-    makeHypervisor(settings);
-    Peer peer;
-    identify(peer, "a");
-    const auto response = ask(peer, QelMessageGetInterfaceLimitsReq());
-    EXPECT_EQ(std::string(response->getData(), response->dataLength()),
-              std::string("\x40\0\x10\0\x3F\xB2\0\0\xFF\0\0\0\0\0\0\0", 16));
-}
-
-TEST_F(HypervisorTest, TheTimeOfDayIsThatOfTheClock)
-{
-    SettableClock clock;
-    clock.setSystem(std::chrono::system_clock::from_time_t(1709618828)); // 2024-03-05 06:07:08
-    Peer peer;
-    identify(peer, "a");
-    const auto response = ask(peer, QelMessageGetQelTodReq());
-    EXPECT_EQ(std::string(response->getData(), response->dataLength()),
-              std::string("\x20\x24\x03\x05\x06\x07\x08\0", 8));
-}
-
-TEST_F(HypervisorTest, TheModeIsWhatWasSetLast)
-{
-    Peer setter;
-    Peer getter;
-    identify(setter, "a");
-    identify(getter, "b");
-    receive(getter, QelMessageGetGlobalModeAttributeReq());
-    const auto before = getter.link.take<QelMessageGetGlobalModeAttributeRsp>();
-    EXPECT_EQ(before->getMode(), 0U);
-    EXPECT_EQ(before->getMTMS(), "");
-
-    EXPECT_EQ(statusOf(setter, QelMessageSetGlobalModeAttributeReq(9, "type*serial")), 0U);
-    receive(getter, QelMessageGetGlobalModeAttributeReq());
-    const auto after = getter.link.take<QelMessageGetGlobalModeAttributeRsp>();
-    EXPECT_EQ(after->getMode(), 9U);
-    EXPECT_EQ(after->getMTMS(), "type*serial");
-}
-
-TEST_F(HypervisorTest, SettingTheModeIsAnsweredWithABareResponse)
-{
-    Peer peer;
-    identify(peer, "a");
-    const auto response = ask(peer, QelMessageSetGlobalModeAttributeReq(9, "m"));
-    EXPECT_EQ(response->getStatus(), 0U);
-    EXPECT_EQ(response->dataLength(), 0U);
-}
-
-TEST_F(HypervisorTest, TheMetadataAreWhatWasSetLast)
-{
-    const std::string metadata("a\0b\xFF", 4);
-    Peer peer;
-    identify(peer, "a");
-    receive(peer, QelMessageGetGlobalSaveAreaMetadataReq());
-    EXPECT_EQ(peer.link.take<QelMessageGetGlobalSaveAreaMetadataRsp>()->getMetadata(), "");
-    receive(peer, QelMessageSetGlobalSaveAreaMetadataReq(metadata));
-    EXPECT_EQ(peer.link.take<QelMessageSetGlobalSaveAreaMetadataRsp>()->getStatus(), 0U);
-    receive(peer, QelMessageGetGlobalSaveAreaMetadataReq());
-    EXPECT_EQ(peer.link.take<QelMessageGetGlobalSaveAreaMetadataRsp>()->getMetadata(), metadata);
-}
-
-TEST_F(HypervisorTest, TheLongestMetadataThatCanBeSetCanBeGot)
-{
-    const std::string metadata(16384 - 32 - 2, 'm');
-    Peer peer;
-    identify(peer, "a");
-    EXPECT_EQ(statusOf(peer, QelMessageSetGlobalSaveAreaMetadataReq(metadata)), 0U);
-    EXPECT_EQ(ask(peer, QelMessageGetGlobalSaveAreaMetadataReq())->msgLength(), 16384U);
-}
-
-// A frame with the old header has room for eight bytes more than one with the new header, which all answers have.
-
-/// A request with the old header, whose payload is the fixed fields and so many more bytes.
-std::vector<char> oldRequest(unsigned int operation, std::vector<char> fixed, std::size_t textLength)
-{
-    fixed.resize(fixed.size() + textLength, 'x');
-    return RawFrame::oldForm().function(0x6003).operation(operation).flags(0x80).payload(std::move(fixed)).bytes();
-}
-
-char high(std::size_t length) { return static_cast<char>(static_cast<unsigned char>(length >> 8)); }
-char low(std::size_t length) { return static_cast<char>(static_cast<unsigned char>(length)); }
-
-TEST_F(HypervisorTest, MetadataThatNoAnswerCouldCarryAreRefusedAndChangeNothing)
-{
-    const auto metadata = [](std::size_t length) { return oldRequest(0x010A, {high(length), low(length)}, length); };
-    Peer peer;
-    identify(peer, "a");
-    receive(peer, metadata(16350));
-    EXPECT_EQ(peer.link.take()->getStatus(), 0U);
-    for (const std::size_t length : {16351U, 16358U}) {
-        SCOPED_TRACE(length);
-        ASSERT_LE(metadata(length).size(), 16384U);
-        receive(peer, metadata(length));
-        EXPECT_EQ(peer.link.take()->getStatus(), kInvalidData);
-    }
-    EXPECT_EQ(ask(peer, QelMessageGetGlobalSaveAreaMetadataReq())->msgLength(), 16384U);
-}
-
-TEST_F(HypervisorTest, AModeWithATextThatNoAnswerCouldCarryIsRefusedAndChangesNothing)
-{
-    const auto mode = [](char number, std::size_t length) {
-        return oldRequest(0x0108, {number, '\0', high(length), low(length)}, length);
-    };
-    Peer peer;
-    identify(peer, "a");
-    receive(peer, mode(1, 16348));
-    EXPECT_EQ(peer.link.take()->getStatus(), 0U);
-    for (const std::size_t length : {16349U, 16356U}) {
-        SCOPED_TRACE(length);
-        ASSERT_LE(mode(2, length).size(), 16384U);
-        receive(peer, mode(2, length));
-        EXPECT_EQ(peer.link.take()->getStatus(), kInvalidData);
-    }
-    const auto answer = ask(peer, QelMessageGetGlobalModeAttributeReq());
-    EXPECT_EQ(answer->msgLength(), 16384U);
-    EXPECT_EQ(dynamic_cast<const QelMessageGetGlobalModeAttributeRsp&>(*answer).getMode(), 1U);
 }
 
 // The hypervisor session.
@@ -579,133 +424,7 @@ TEST_F(HypervisorTest, VirtualSerialRequestsNeedTheSession)
     expectAllRefused();
 }
 
-// Broadcasts.
-
-TEST_F(HypervisorTest, ABroadcastGoesToTheOtherConsolesWithTheSendersIdentity)
-{
-    HypervisorSettings settings;
-    settings.maxConsoles = 3;
-    makeHypervisor(settings);
-    Peer sender;
-    Peer first;
-    Peer second;
-    Peer silent;
-    identify(sender, "sender", 0x01020304);
-    identify(first, "a");
-    identify(second, "b");
-    connect(silent);
-    receive(sender, QelMessageDaxBroadcastReq(0, 5, 99, "ignored", "hel\0o"));
-    EXPECT_EQ(sender.link.take<QelMessageDaxBroadcastRsp>()->getStatus(), 0U);
-    EXPECT_EQ(sender.link.posted(), 0U);
-    EXPECT_EQ(silent.link.posted(), 0U);
-    for (Peer* other : {&first, &second}) {
-        const auto notice = other->link.take<QelMessageDaxBroadcastOutboundAsync>();
-        EXPECT_EQ(notice->getSenderToolType(), 0x01020304U);
-        EXPECT_EQ(notice->getSenderToolId(), "sender");
-        EXPECT_EQ(std::string(notice->getDaxPacket(), notice->getBroadcastMsgLen()), std::string("hel\0o", 5));
-        EXPECT_EQ(other->link.posted(), 0U);
-    }
-}
-
-TEST_F(HypervisorTest, EveryTypeButOneGoesToAll)
-{
-    Peer sender;
-    Peer other;
-    identify(sender, "a");
-    identify(other, "b");
-    for (const std::uint8_t type : std::vector<std::uint8_t>{0, 2, 255}) {
-        SCOPED_TRACE(static_cast<int>(type));
-        EXPECT_EQ(statusOf(sender, QelMessageDaxBroadcastReq(type, 1, 7, "nobody", "x")), 0U);
-        EXPECT_NE(other.link.take<QelMessageDaxBroadcastOutboundAsync>(), nullptr);
-    }
-}
-
-TEST_F(HypervisorTest, ABroadcastWithoutOtherConsolesIsDone)
-{
-    Peer sender;
-    identify(sender, "a");
-    EXPECT_EQ(statusOf(sender, QelMessageDaxBroadcastReq(0, 1, 0, "", "x")), 0U);
-}
-
-TEST_F(HypervisorTest, TypeOneGoesToTheAddressedToolAlone)
-{
-    HypervisorSettings settings;
-    settings.maxConsoles = 3;
-    makeHypervisor(settings);
-    Peer sender;
-    Peer addressed;
-    Peer other;
-    identify(sender, "a", 1);
-    identify(addressed, "b", 2);
-    identify(other, "b", 3);
-    EXPECT_EQ(statusOf(sender, QelMessageDaxBroadcastReq(1, 1, 2, "b", "x")), 0U);
-    EXPECT_NE(addressed.link.take<QelMessageDaxBroadcastOutboundAsync>(), nullptr);
-    EXPECT_EQ(other.link.posted(), 0U);
-}
-
-TEST_F(HypervisorTest, TypeOneToAToolThatIsNotThereIsRefused)
-{
-    Peer sender;
-    Peer other;
-    identify(sender, "a", 1);
-    identify(other, "b", 2);
-    EXPECT_EQ(statusOf(sender, QelMessageDaxBroadcastReq(1, 1, 3, "b", "x")), kConnectionNotAvailable);
-    EXPECT_EQ(statusOf(sender, QelMessageDaxBroadcastReq(1, 1, 2, "c", "x")), kConnectionNotAvailable);
-    EXPECT_EQ(statusOf(sender, QelMessageDaxBroadcastReq(1, 1, 1, "a", "x")), kConnectionNotAvailable); // itself
-    EXPECT_EQ(other.link.posted(), 0U);
-}
-
-TEST_F(HypervisorTest, AConsoleWithoutRoomMissesBroadcasts)
-{
-    Peer sender;
-    Peer slow;
-    identify(sender, "a", 1);
-    identify(slow, "b", 2);
-    slow.link.room = false;
-    EXPECT_EQ(statusOf(sender, QelMessageDaxBroadcastReq(0, 1, 0, "", "x")), 0U);
-    EXPECT_EQ(statusOf(sender, QelMessageDaxBroadcastReq(1, 1, 2, "b", "x")), kCmdFailed);
-    EXPECT_EQ(slow.link.posted(), 0U);
-    EXPECT_THAT(log.lines(), ElementsAre("W: [qel] console 2: too slow for a broadcast of console 1",
-                                         "W: [qel] console 2: too slow for a broadcast of console 1"));
-}
-
-TEST_F(HypervisorTest, TheLongestBroadcastThatComesInFitsAFrameGoingOut)
-{
-    const std::string text(16306, 'x');
-    Peer sender;
-    Peer other;
-    identify(sender, std::string(32, 'a'));
-    identify(other, "b");
-    EXPECT_EQ(statusOf(sender, QelMessageDaxBroadcastReq(0, 16306, 0, "", text.data())), 0U);
-    EXPECT_EQ(other.link.take()->msgLength(), 16380U);
-}
-
-TEST_F(HypervisorTest, ABroadcastLongerThanTheLimitsSayIsRefusedAndGoesToNobody)
-{
-    const auto broadcast = [](std::size_t length) {
-        std::vector<char> fixed(46, '\0');
-        fixed[1] = 46;
-        fixed[4] = high(length);
-        fixed[5] = low(length);
-        return oldRequest(0x0106, std::move(fixed), length);
-    };
-    Peer sender;
-    Peer other;
-    identify(sender, "a");
-    identify(other, "b");
-    for (const std::size_t length : {16307U, 16314U}) {
-        SCOPED_TRACE(length);
-        ASSERT_LE(broadcast(length).size(), 16384U);
-        receive(sender, broadcast(length));
-        EXPECT_EQ(sender.link.take()->getStatus(), kInvalidData);
-        EXPECT_EQ(other.link.posted(), 0U);
-    }
-    receive(sender, broadcast(16306));
-    EXPECT_EQ(sender.link.take()->getStatus(), 0U);
-    EXPECT_EQ(other.link.take()->msgLength(), 16380U);
-}
-
-// Reading on.
+// Holding back.
 
 TEST_F(HypervisorTest, AConsoleWithoutRoomIsNotReadFrom)
 {
@@ -718,7 +437,7 @@ TEST_F(HypervisorTest, AConsoleWithoutRoomIsNotReadFrom)
 
 // The end.
 
-TEST_F(HypervisorTest, OnShutdownEveryConsoleIsToldAndClosed)
+TEST_F(HypervisorTest, OnShutdownEveryConsoleGetsANoticeAndIsClosed)
 {
     Peer introduced;
     Peer silent;
@@ -751,7 +470,7 @@ TEST_F(HypervisorTest, OnShutdownSerialSessionsAreClosedBeforeTheConnection)
     EXPECT_EQ(port2->stopped, 1U);
 }
 
-TEST_F(HypervisorTest, ConnectionsThatComeAfterShutdownAreClosed)
+TEST_F(HypervisorTest, ConnectionsAfterShutdownAreClosed)
 {
     hypervisor->shutDown();
     Peer late;
@@ -761,7 +480,7 @@ TEST_F(HypervisorTest, ConnectionsThatComeAfterShutdownAreClosed)
     EXPECT_EQ(late.link.posted(), 0U);
 }
 
-TEST_F(HypervisorTest, ShuttingDownTwiceIsShuttingDownOnce)
+TEST_F(HypervisorTest, ASecondShutdownChangesNothing)
 {
     Peer peer;
     identify(peer, "a");
@@ -770,13 +489,11 @@ TEST_F(HypervisorTest, ShuttingDownTwiceIsShuttingDownOnce)
     EXPECT_EQ(peer.link.posted(), 1U);
 }
 
-// Before TLS.
+// Messages of the steps before TLS.
 
-TEST_F(HypervisorTest, ConsolesAreTakenUntilThereAreAsManyAsAllowed)
+TEST_F(HypervisorTest, TakesConsolesUpToTheMaximum)
 {
-    tool::HypervisorSettings settings;
-    settings.maxConsoles = 2;
-    makeHypervisor(settings);
+    limitConsoles(2);
     Peer first;
     Peer second;
     Peer unknown;
@@ -790,13 +507,13 @@ TEST_F(HypervisorTest, ConsolesAreTakenUntilThereAreAsManyAsAllowed)
     EXPECT_TRUE(hypervisor->takesConsoles());
 }
 
-TEST_F(HypervisorTest, AfterShutdownNoConsolesAreTaken)
+TEST_F(HypervisorTest, TakesNoConsolesAfterShutdown)
 {
     hypervisor->shutDown();
     EXPECT_FALSE(hypervisor->takesConsoles());
 }
 
-TEST_F(HypervisorTest, AConsoleThatAsksForTlsWhereThereIsNoneIsTurnedAway)
+TEST_F(HypervisorTest, ATlsRequestToAPlainServerIsAnsweredWithAbortAndClosed)
 {
     Peer peer;
     connect(peer);
@@ -809,7 +526,7 @@ TEST_F(HypervisorTest, AConsoleThatAsksForTlsWhereThereIsNoneIsTurnedAway)
     EXPECT_THAT(log.lines(), ElementsAre("W: [qel] console 1: closed, it asked for TLS, which is not done here"));
 }
 
-TEST_F(HypervisorTest, TheAbortMessageMeansNothingToTheHypervisor)
+TEST_F(HypervisorTest, IgnoresTheAbortMessage)
 {
     Peer peer;
     identify(peer, "a");

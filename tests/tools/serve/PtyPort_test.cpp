@@ -1,6 +1,7 @@
 #include <qel/common/util/PosixError.hpp>
 
 #include "serve/PtyPort.hpp"
+#include "support/ComesTrue.hpp"
 #include "tools/base/PtyFixture.hpp"
 
 #include <cerrno>
@@ -8,6 +9,7 @@
 #include <cstdlib>
 #include <fcntl.h>
 #include <gmock/gmock.h>
+#include <optional>
 
 namespace {
 
@@ -15,7 +17,7 @@ bool sNoTerminals = false; ///< posix_openpt() fails for want of descriptors
 
 } // namespace
 
-/// Takes the place of the system's, so that it can be made to fail.
+/// Replaces the function of the system, so that it can be made to fail.
 extern "C" int posix_openpt(int flags)
 {
     if (!sNoTerminals) return ::open("/dev/ptmx", flags);
@@ -31,11 +33,12 @@ using ::testing::HasSubstr;
 using ::testing::MatchesRegex;
 using ::testing::Not;
 using ::testing::ThrowsMessage;
+using tool::CommandEnd;
 using tool::PtyPort;
 
 using PtyPortTest = PtyFixture;
 
-TEST_F(PtyPortTest, BeforeTheStartItIsDown)
+TEST_F(PtyPortTest, IsDownBeforeStart)
 {
     PtyPort port("echo hello", reaper);
     EXPECT_FALSE(port.isRunning());
@@ -49,7 +52,7 @@ TEST_F(PtyPortTest, TheCommandsOutputIsRead)
     EXPECT_EQ(outputOf("echo hello; echo error >&2", reaper), "hello\r\nerror\r\n");
 }
 
-TEST_F(PtyPortTest, TheCommandIsOneForTheShell)
+TEST_F(PtyPortTest, TheShellRunsTheCommand)
 {
     EXPECT_EQ(outputOf("for i in 1 2; do echo \"$i\"; done | cat", reaper), "1\r\n2\r\n");
 }
@@ -67,7 +70,7 @@ TEST_F(PtyPortTest, TheCommandLeadsASessionOfItsOwn)
     EXPECT_EQ(outputOf("test \"$(cut -d ' ' -f 6 /proc/$$/stat)\" = $$ && echo leader", reaper), "leader\r\n");
 }
 
-TEST_F(PtyPortTest, TheCommandFindsSignalsAsUsual)
+TEST_F(PtyPortTest, TheCommandHasDefaultSignals)
 {
     sigset_t blocked;
     sigset_t before;
@@ -81,7 +84,7 @@ TEST_F(PtyPortTest, TheCommandFindsSignalsAsUsual)
     ::pthread_sigmask(SIG_SETMASK, &before, nullptr);
 }
 
-TEST_F(PtyPortTest, TheCommandSeesNoOtherPartitionsLine)
+TEST_F(PtyPortTest, TheCommandInheritsNoOtherTerminal)
 {
     PtyPort other("cat", reaper);
     other.start();
@@ -105,7 +108,7 @@ TEST_F(PtyPortTest, WithNothingToReadTheLineIsIdle)
     EXPECT_FALSE(port.hasHungUp());
 }
 
-TEST_F(PtyPortTest, ALineThatTakesNoMoreInputSaysSo)
+TEST_F(PtyPortTest, WriteReturnsZeroWhenTheTerminalIsFull)
 {
     PtyPort port("stty raw -echo; echo ready; exec sleep 1000", reaper);
     port.start();
@@ -119,11 +122,11 @@ TEST_F(PtyPortTest, ALineThatTakesNoMoreInputSaysSo)
     EXPECT_GT(taken, 0U);
 }
 
-TEST_F(PtyPortTest, AfterTheEndOfTheCommandItsOutputIsStillThere)
+TEST_F(PtyPortTest, OutputCanBeReadAfterTheCommandEnds)
 {
     PtyPort port("echo last", reaper);
     port.start();
-    const PollFd fd(port.descriptor(), PollEvents::Error); // the end alone
+    const PollFd fd(port.descriptor(), PollEvents::Error); // hang-up only
     ASSERT_TRUE(PollSet(fd).wait(std::chrono::seconds(20)).anyReady());
     EXPECT_TRUE(port.hasHungUp());
     EXPECT_TRUE(port.isRunning());
@@ -142,7 +145,7 @@ TEST_F(PtyPortTest, StartingARunningCommandChangesNothing)
     EXPECT_THAT(readUntil(port, "x\r\nx\r\n"), Not(HasSubstr("pid=")));
 }
 
-TEST_F(PtyPortTest, ACommandThatHasEndedIsStartedAfresh)
+TEST_F(PtyPortTest, AnEndedCommandIsStartedAgain)
 {
     PtyPort port("echo pid=$$; read line", reaper);
     port.start();
@@ -154,9 +157,9 @@ TEST_F(PtyPortTest, ACommandThatHasEndedIsStartedAfresh)
     EXPECT_NE(pidIn(readUntil(port, "\n")), first);
 }
 
-TEST_F(PtyPortTest, ItDoesNotMatterWhoReapsTheCommand)
+TEST_F(PtyPortTest, ACommandReapedByTheSystemIsStartedAgain)
 {
-    const auto before = std::signal(SIGCHLD, SIG_IGN); // the system does
+    const auto before = std::signal(SIGCHLD, SIG_IGN); // the system reaps children
     PtyPort port("echo pid=$$; read line", reaper);
     port.start();
     const pid_t first = pidIn(readUntil(port, "\n"));
@@ -182,7 +185,63 @@ TEST_F(PtyPortTest, AStoppedLineCanBeStartedAgain)
     readUntil(port, "hello");
 }
 
-TEST_F(PtyPortTest, WithoutDescriptorsItCannotStart)
+TEST_F(PtyPortTest, ReportsHowTheCommandEnded)
+{
+    struct Row {
+        const char* command;
+        CommandEnd::Kind kind;
+        unsigned int number;
+    };
+    const Row rows[] = {
+        {"exit 0", CommandEnd::Kind::Exited, 0},
+        {"exit 3", CommandEnd::Kind::Exited, 3},
+        {"exit 255", CommandEnd::Kind::Exited, 255},
+        {"kill -KILL $$", CommandEnd::Kind::Killed, SIGKILL},
+        {"kill -TERM $$", CommandEnd::Kind::Killed, SIGTERM},
+    };
+    for (const Row& row : rows) {
+        SCOPED_TRACE(row.command);
+        PtyPort port(row.command, reaper);
+        port.start();
+        EXPECT_EQ(readUntilEnd(port), "");
+        std::optional<CommandEnd> end;
+        ASSERT_TRUE(comesTrue([&] { return (end = port.commandEnd()).has_value(); }));
+        EXPECT_EQ(end->kind, row.kind);
+        EXPECT_EQ(end->number, row.number);
+        EXPECT_TRUE(port.commandEnd().has_value()); // asking does not reap it
+    }
+}
+
+TEST_F(PtyPortTest, ARunningCommandHasNotEnded)
+{
+    PtyPort port("echo ready; cat", reaper);
+    port.start();
+    readUntil(port, "ready");
+    EXPECT_FALSE(port.commandEnd().has_value());
+}
+
+TEST_F(PtyPortTest, TheEndOfACommandReapedByTheSystemIsUnknown)
+{
+    const auto before = std::signal(SIGCHLD, SIG_IGN);
+    PtyPort port("exit 3", reaper);
+    port.start();
+    readUntilEnd(port);
+    std::optional<CommandEnd> end;
+    EXPECT_TRUE(comesTrue([&] { return (end = port.commandEnd()).has_value(); }));
+    EXPECT_EQ(end->kind, CommandEnd::Kind::Unknown);
+    static_cast<void>(std::signal(SIGCHLD, before));
+}
+
+TEST_F(PtyPortTest, TheCommandHasTheGivenEnvironmentAndNothingElse)
+{
+    ::setenv("QEL_TEST_SECRET", "of the server", 1);
+    PtyPort port("tr '\\0' '\\n' </proc/$$/environ", reaper, {"A=1", "B=two words", "C="});
+    port.start();
+    EXPECT_EQ(readUntilEnd(port), "A=1\r\nB=two words\r\nC=\r\n");
+    ::unsetenv("QEL_TEST_SECRET");
+}
+
+TEST_F(PtyPortTest, StartWithoutDescriptorsThrows)
 {
     PtyPort port("echo hello", reaper);
     sNoTerminals = true;

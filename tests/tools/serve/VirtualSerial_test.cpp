@@ -1,10 +1,9 @@
-// The virtual serial sessions, through the hypervisor that keeps them.
+// Opening, setting up and closing virtual serial sessions.
 
-#include "tools/serve/HypervisorFixture.hpp"
+#include "tools/serve/VirtualSerialFixture.hpp"
 
 #include <functional>
 #include <gmock/gmock.h>
-#include <poll.h>
 
 namespace qel::test {
 
@@ -15,6 +14,8 @@ using ::testing::HasSubstr;
 using ::testing::IsEmpty;
 using tool::PartitionSet;
 
+using VirtualSerialTest = VirtualSerialFixture;
+
 constexpr unsigned int kInvalidCmdSequence = 4;
 constexpr unsigned int kCmdFailed = 6;
 constexpr unsigned int kInvalidConnectionNumber = 16;
@@ -22,41 +23,9 @@ constexpr unsigned int kConnectionNotAvailable = 19;
 constexpr unsigned int kConnectionClosureFailure = 20;
 constexpr unsigned int kInvalidLparId = 21;
 
-using ClosedNotice = QelMessageVirtualSerialSessionClosedAsync;
-
-class VirtualSerialTest : public HypervisorFixture {
-protected:
-    unsigned int open(Peer& peer, std::uint16_t partition, std::uint16_t number = 0, bool force = false)
-    {
-        return statusOf(peer, QelMessageVirtualSerialOpenReq(partition, number, force));
-    }
-    unsigned int close(Peer& peer, std::uint16_t partition, std::uint16_t number = 0, bool force = false)
-    {
-        return statusOf(peer, QelMessageVirtualSerialCloseReq(partition, number, force));
-    }
-    unsigned int setUp(Peer& peer, std::uint16_t partition, std::uint16_t number = 0)
-    {
-        return statusOf(peer, QelMessageVirtualSerialSetupSessionReq(partition, number));
-    }
-    static void expectClosed(Peer& peer, std::uint16_t partition, unsigned int reason)
-    {
-        const auto notice = peer.link.take<ClosedNotice>();
-        EXPECT_EQ(notice->getLpId(), partition);
-        EXPECT_EQ(notice->getVssConnectionNumber(), 0U);
-        EXPECT_EQ(notice->getCloseReason(), reason);
-    }
-    static std::string takeData(Peer& peer, std::uint16_t partition)
-    {
-        const auto data = peer.link.take<QelMessageVirtualSerialDataToDaxAsync>();
-        EXPECT_EQ(data->getLpId(), partition);
-        EXPECT_EQ(data->getVssConnectionNumber(), 0U);
-        return std::string(data->getSerialData(), data->getSerialDataLength());
-    }
-};
-
 // Opening.
 
-TEST_F(VirtualSerialTest, OpeningStartsThePartitionAndSaysWhatWasOpened)
+TEST_F(VirtualSerialTest, OpeningStartsTheCommandAndReturnsTheAddress)
 {
     Peer peer;
     openSession(peer, "a");
@@ -69,7 +38,7 @@ TEST_F(VirtualSerialTest, OpeningStartsThePartitionAndSaysWhatWasOpened)
     EXPECT_EQ(port2->started, 0U);
 }
 
-TEST_F(VirtualSerialTest, AnUnknownPartitionIsNamedBeforeAnUnknownConnectionNumber)
+TEST_F(VirtualSerialTest, AnUnknownPartitionIsReportedBeforeAnUnknownConnectionNumber)
 {
     Peer peer;
     openSession(peer, "a");
@@ -103,7 +72,7 @@ TEST_F(VirtualSerialTest, ASessionThatAnotherConsoleHoldsIsNotAvailable)
     EXPECT_EQ(open(other, 2), 0U);
 }
 
-TEST_F(VirtualSerialTest, ForcedOpeningTakesTheSessionAndTellsTheOldHolder)
+TEST_F(VirtualSerialTest, ForcedOpenTakesTheSessionAndNotifiesTheOldHolder)
 {
     Peer holder;
     Peer other;
@@ -112,7 +81,7 @@ TEST_F(VirtualSerialTest, ForcedOpeningTakesTheSessionAndTellsTheOldHolder)
     EXPECT_EQ(open(other, 1, 0, true), 0U);
     expectClosed(holder, 1, 2);
     EXPECT_EQ(holder.link.resumed, 1U);
-    EXPECT_EQ(port1->started, 1U); // it goes on running
+    EXPECT_EQ(port1->started, 1U); // it is still running
     EXPECT_EQ(port1->stopped, 0U);
 
     sendData(holder, 1, "from the old holder");
@@ -123,14 +92,14 @@ TEST_F(VirtualSerialTest, ForcedOpeningTakesTheSessionAndTellsTheOldHolder)
     EXPECT_EQ(port1->input, "from the new one");
 }
 
-TEST_F(VirtualSerialTest, ForcedOpeningOfAFreeSessionOpensIt)
+TEST_F(VirtualSerialTest, ForcedOpenOfAFreeSessionOpensIt)
 {
     Peer peer;
     openSession(peer, "a");
     EXPECT_EQ(open(peer, 1, 0, true), 0U);
 }
 
-TEST_F(VirtualSerialTest, AConsoleThatForcesItsOwnSessionHearsOfItsEndAndHasANewOne)
+TEST_F(VirtualSerialTest, ForcedOpenOfItsOwnSessionClosesAndReopensIt)
 {
     Peer peer;
     setUpSerial(peer, "a", 1);
@@ -200,293 +169,9 @@ TEST_F(VirtualSerialTest, BeforeTheSetUpNoDataFlows)
     EXPECT_EQ(takeData(peer, 1), "early"); // nothing was lost
 }
 
-// Data.
-
-TEST_F(VirtualSerialTest, DataFlowsBothWays)
-{
-    const std::string bytes("\0\xFF\r\n", 4);
-    Peer peer;
-    setUpSerial(peer, "a", 2);
-    sendData(peer, 2, bytes);
-    EXPECT_EQ(port2->input, bytes);
-    port2->output = {bytes};
-    hypervisor->serviceSerial(2);
-    EXPECT_EQ(takeData(peer, 2), bytes);
-    EXPECT_THAT(log.lines(), IsEmpty());
-}
-
-TEST_F(VirtualSerialTest, DataOfNoLengthIsNothingToWarnAbout)
-{
-    Peer peer;
-    setUpSerial(peer, "a", 1);
-    sendData(peer, 1, "");
-    EXPECT_EQ(port1->input, "");
-    EXPECT_THAT(log.lines(), IsEmpty());
-}
-
-TEST_F(VirtualSerialTest, DataForASessionThatIsNotHeldIsIgnoredWithAWarning)
-{
-    Peer holder;
-    Peer other;
-    setUpSerial(holder, "a", 1);
-    openSession(other, "b");
-    const std::vector<std::pair<std::uint16_t, std::uint16_t>> wrong{{1, 0}, {2, 0}, {3, 0}, {1, 1}};
-    for (const auto& address : wrong) {
-        SCOPED_TRACE(::testing::Message() << address.first << "/" << address.second);
-        log.clear();
-        receive(other, QelMessageVirtualSerialDataToOsAsync(address.first, address.second, 1, "x"));
-        EXPECT_THAT(log.lines(), ElementsAre(HasSubstr("W: [qel] console 2: ignored")));
-    }
-    receive(holder, QelMessageVirtualSerialDataToOsAsync(1, 1, 1, "x")); // the holder's, but not connection 0
-    EXPECT_EQ(port1->input, "");
-    EXPECT_EQ(other.link.posted(), 0U);
-}
-
-TEST_F(VirtualSerialTest, DataThatDoesNotParseIsIgnoredWithAWarning)
-{
-    Peer peer;
-    setUpSerial(peer, "a", 1);
-    QelMessageGeneric message(0, 0x6002, 0x0405, NoFlagSet);
-    message.setData("\0\1\0\0\0\5ab", 8); // says five bytes, has two
-    receive(peer, message);
-    EXPECT_EQ(port1->input, "");
-    EXPECT_THAT(log.lines(), ElementsAre(HasSubstr("W: [qel] console 1: ignored")));
-}
-
-TEST_F(VirtualSerialTest, OutputIsReadOneChunkAtATime)
-{
-    Peer peer;
-    setUpSerial(peer, "a", 1);
-    port1->output = {std::string(5000, 'x'), "rest"};
-    hypervisor->serviceSerial(1);
-    EXPECT_EQ(takeData(peer, 1), std::string(4096, 'x'));
-    EXPECT_EQ(peer.link.posted(), 0U);
-    hypervisor->serviceSerial(1);
-    EXPECT_EQ(takeData(peer, 1), std::string(904, 'x'));
-    hypervisor->serviceSerial(1);
-    EXPECT_EQ(takeData(peer, 1), "rest");
-    hypervisor->serviceSerial(1);
-    EXPECT_EQ(peer.link.posted(), 0U);
-}
-
-TEST_F(VirtualSerialTest, OutputIsNotReadWhileTheConsoleHasNoRoom)
-{
-    Peer slow;
-    Peer other;
-    setUpSerial(slow, "a", 1);
-    setUpSerial(other, "b", 2);
-    port1->output = {"one"};
-    port2->output = {"two"};
-    slow.link.serialRoom = false;
-    EXPECT_THAT(watched(), ElementsAre(2));
-    hypervisor->serviceSerial(1);
-    hypervisor->serviceSerial(2);
-    EXPECT_EQ(port1->reads, 0U);
-    EXPECT_EQ(takeData(other, 2), "two"); // the other one is not held up
-
-    slow.link.serialRoom = true;
-    const unsigned wakes = serialWakes;
-    hypervisor->outputDrained();
-    EXPECT_GT(serialWakes, wakes);
-    EXPECT_THAT(watched(), ElementsAre(1, 2));
-    hypervisor->serviceSerial(1);
-    EXPECT_EQ(takeData(slow, 1), "one");
-}
-
-TEST_F(VirtualSerialTest, OnlyWhatTouchesALineWakesTheThreadThatMovesSerialData)
-{
-    Peer peer;
-    Peer other;
-    setUpSerial(peer, "a", 1);
-    identify(other, "b");
-    unsigned wakes = serialWakes;
-    receive(peer, QelMessageGetQelTodReq());
-    receive(peer, QelMessageDaxBroadcastReq(0, 1, 0, "", "x"));
-    receive(other, QelMessageInterfaceCmpOpenKrogSessionReq());
-    receive(other, QelMessageInterfaceCmpCloseKrogSessionReq());
-    sendData(other, 1, "not the holder");
-    EXPECT_EQ(serialWakes, wakes);
-
-    const auto wakesOnce = [&](const char* what, const QelMessage& message) {
-        SCOPED_TRACE(what);
-        receive(peer, message);
-        EXPECT_EQ(serialWakes, wakes + 1);
-        wakes = serialWakes;
-    };
-    wakesOnce("input", QelMessageVirtualSerialDataToOsAsync(1, 0, 1, "x"));
-    wakesOnce("close", QelMessageVirtualSerialCloseReq(1, 0, false));
-    wakesOnce("open", QelMessageVirtualSerialOpenReq(1, 0, false));
-    wakesOnce("set up", QelMessageVirtualSerialSetupSessionReq(1, 0));
-    wakesOnce("end of the session", QelMessageInterfaceCmpCloseKrogSessionReq());
-    port2->failsToStart = true;
-    receive(peer, QelMessageInterfaceCmpOpenKrogSessionReq());
-    wakesOnce("a line that cannot be started", QelMessageVirtualSerialOpenReq(2, 0, false));
-}
-
-TEST_F(VirtualSerialTest, AConsoleWhoseSerialDataWaitsForRoomIsStillReadFrom)
-{
-    Peer peer;
-    setUpSerial(peer, "a", 1);
-    peer.link.serialRoom = false;
-    EXPECT_TRUE(hypervisor->mayReceive(peer.id));
-    EXPECT_EQ(statusOf(peer, QelMessageGetQelTodReq()), 0U);
-}
-
-TEST_F(VirtualSerialTest, InputThatIsNotTakenIsKeptAndDeliveredInOrder)
-{
-    Peer peer;
-    setUpSerial(peer, "a", 1);
-    port1->takes = 3;
-    sendData(peer, 1, "abcdef");
-    sendData(peer, 1, "ghi");
-    EXPECT_EQ(port1->input, "abc");
-    const auto watches = hypervisor->serialWatches();
-    ASSERT_EQ(watches.size(), 1U);
-    EXPECT_TRUE((watches[0].fd.mFd.events & POLLOUT) != 0);
-    EXPECT_EQ(watches[0].fd.mFd.fd, FakeSerialPort::kDescriptor);
-    port1->takes = 1000;
-    hypervisor->serviceSerial(1);
-    EXPECT_EQ(port1->input, "abcdefghi");
-    EXPECT_TRUE((hypervisor->serialWatches()[0].fd.mFd.events & POLLOUT) == 0);
-}
-
-TEST_F(VirtualSerialTest, AConsoleIsNotReadFromWhileItsPartitionIsBehindWithInput)
-{
-    Peer peer;
-    Peer other;
-    setUpSerial(peer, "a", 1);
-    setUpSerial(other, "b", 2);
-    port1->takes = 0;
-    sendData(peer, 1, std::string(PartitionSet::kInputLimit - 1, 'x'));
-    EXPECT_TRUE(hypervisor->mayReceive(peer.id));
-    sendData(peer, 1, "x");
-    EXPECT_FALSE(hypervisor->mayReceive(peer.id));
-    EXPECT_TRUE(hypervisor->mayReceive(other.id));
-
-    EXPECT_EQ(peer.link.resumed, 0U);
-    port1->takes = 1;
-    hypervisor->serviceSerial(1);
-    EXPECT_EQ(peer.link.resumed, 1U);
-    EXPECT_TRUE(hypervisor->mayReceive(peer.id));
-    port1->takes = 1;
-    hypervisor->serviceSerial(1);
-    EXPECT_EQ(peer.link.resumed, 1U); // only when it makes a difference
-}
-
-TEST_F(VirtualSerialTest, ALostSessionDoesNotKeepItsOldHolderFromBeingRead)
-{
-    Peer holder;
-    Peer other;
-    setUpSerial(holder, "a", 1);
-    openSession(other, "b");
-    port1->takes = 0;
-    sendData(holder, 1, std::string(60000, 'x'));
-    sendData(holder, 1, std::string(60000, 'x'));
-    EXPECT_FALSE(hypervisor->mayReceive(holder.id));
-    openSerial(other, 1, true);
-    EXPECT_TRUE(hypervisor->mayReceive(holder.id));
-    EXPECT_EQ(holder.link.resumed, 1U);
-}
-
-// The end of the command.
-
-TEST_F(VirtualSerialTest, WhenTheCommandEndsTheHolderHearsOfAReadFailure)
-{
-    Peer peer;
-    setUpSerial(peer, "a", 1);
-    port1->output = {"last words"};
-    port1->ended = true;
-    hypervisor->serviceSerial(1);
-    EXPECT_EQ(takeData(peer, 1), "last words");
-    EXPECT_EQ(peer.link.posted(), 0U);
-    hypervisor->serviceSerial(1);
-    expectClosed(peer, 1, 4);
-    EXPECT_EQ(port1->stopped, 1U);
-    EXPECT_THAT(watched(), IsEmpty());
-    sendData(peer, 1, "x");
-    EXPECT_THAT(log.lines(), ElementsAre(HasSubstr("W: [qel] console 1: ignored")));
-
-    port1->ended = false;
-    openSerial(peer, 1);
-    EXPECT_EQ(port1->started, 2U);
-}
-
-TEST_F(VirtualSerialTest, TheEndWaitsUntilTheHolderHasRoomForWhatCameBefore)
-{
-    Peer peer;
-    setUpSerial(peer, "a", 1);
-    peer.link.serialRoom = false;
-    port1->output = {"last words"};
-    port1->ended = true;
-    hypervisor->serviceSerial(1);
-    EXPECT_EQ(peer.link.posted(), 0U);
-    EXPECT_THAT(watched(), IsEmpty()); // a line that has hung up would be reported over and over
-    peer.link.serialRoom = true;
-    hypervisor->serviceSerial(1);
-    hypervisor->serviceSerial(1);
-    EXPECT_EQ(takeData(peer, 1), "last words");
-    expectClosed(peer, 1, 4);
-}
-
-TEST_F(VirtualSerialTest, InputForACommandThatHasEndedIsDroppedAndHoldsNobodyUp)
-{
-    Peer peer;
-    setUpSerial(peer, "a", 1);
-    port1->takes = 0;
-    sendData(peer, 1, std::string(60000, 'x'));
-    sendData(peer, 1, std::string(60000, 'x'));
-    EXPECT_FALSE(hypervisor->mayReceive(peer.id));
-    peer.link.serialRoom = false;
-    port1->ended = true;
-    hypervisor->serviceSerial(1);
-    EXPECT_EQ(peer.link.resumed, 1U);
-    EXPECT_THAT(watched(), IsEmpty());
-    peer.link.serialRoom = true;
-    EXPECT_TRUE(hypervisor->mayReceive(peer.id));
-}
-
-TEST_F(VirtualSerialTest, ACommandThatEndsWithoutASessionIsTakenDownQuietly)
-{
-    Peer peer;
-    setUpSerial(peer, "a", 1);
-    EXPECT_EQ(close(peer, 1), 0U);
-    EXPECT_THAT(watched(), ElementsAre(1)); // to notice the end
-    hypervisor->serviceSerial(1);
-    EXPECT_EQ(port1->reads, 0U); // but not to read
-    EXPECT_EQ(port1->stopped, 0U);
-    port1->ended = true;
-    hypervisor->serviceSerial(1);
-    EXPECT_EQ(port1->stopped, 1U);
-    EXPECT_EQ(peer.link.posted(), 0U);
-    EXPECT_THAT(watched(), IsEmpty());
-}
-
-TEST_F(VirtualSerialTest, ALineThatCannotBeWrittenToEndsTheSession)
-{
-    Peer peer;
-    setUpSerial(peer, "a", 1);
-    port1->failsToWrite = true;
-    sendData(peer, 1, "x");
-    expectClosed(peer, 1, 5);
-    EXPECT_EQ(port1->stopped, 1U);
-    EXPECT_THAT(log.lines(), ElementsAre("E: [qel] partition 1: write: 5 (Input/output error)"));
-    port1->failsToWrite = false;
-    openSerial(peer, 1);
-    EXPECT_EQ(port1->started, 2U);
-    hypervisor->serviceSerial(1);
-    EXPECT_EQ(port1->input, ""); // nothing of the old session comes through
-}
-
-TEST_F(VirtualSerialTest, ServingALineThatIsDownOrUnknownDoesNothing)
-{
-    hypervisor->serviceSerial(1);
-    hypervisor->serviceSerial(99);
-    EXPECT_EQ(port1->reads, 0U);
-}
-
 // Closing.
 
-TEST_F(VirtualSerialTest, TheHolderClosesItsSessionAndThePartitionGoesOn)
+TEST_F(VirtualSerialTest, ClosingTheSessionKeepsTheCommandRunning)
 {
     Peer peer;
     setUpSerial(peer, "a", 1);
@@ -502,7 +187,7 @@ TEST_F(VirtualSerialTest, TheHolderClosesItsSessionAndThePartitionGoesOn)
     EXPECT_EQ(port1->reads, 0U); // to be set up again
 }
 
-TEST_F(VirtualSerialTest, OutputThatCameWithoutASessionWaitsForTheNextOne)
+TEST_F(VirtualSerialTest, OutputWithoutASessionWaitsForTheNextOne)
 {
     Peer peer;
     setUpSerial(peer, "a", 1);
@@ -525,10 +210,10 @@ TEST_F(VirtualSerialTest, AnotherConsoleClosesASessionOnlyByForce)
     EXPECT_EQ(holder.link.posted(), 0U);
     EXPECT_EQ(close(other, 1, 0, true), 0U);
     expectClosed(holder, 1, 2);
-    EXPECT_EQ(close(other, 1, 0, true), kConnectionClosureFailure); // nobody holds it now
+    EXPECT_EQ(close(other, 1, 0, true), kConnectionClosureFailure); // it is free now
 }
 
-TEST_F(VirtualSerialTest, TheHolderMayForceToo)
+TEST_F(VirtualSerialTest, TheHolderMayCloseWithForce)
 {
     Peer peer;
     setUpSerial(peer, "a", 1);
@@ -545,12 +230,12 @@ TEST_F(VirtualSerialTest, ClosingTheHypervisorSessionReleasesAllSerialSessions)
     openSerial(peer, 1);
     openSerial(peer, 2);
     EXPECT_EQ(statusOf(peer, QelMessageInterfaceCmpCloseKrogSessionReq()), 0U);
-    EXPECT_EQ(peer.link.posted(), 0U); // it asked for it: no notices
+    EXPECT_EQ(peer.link.posted(), 0U); // no notices to the console that asked
     openSerial(other, 1);
     openSerial(other, 2);
 }
 
-TEST_F(VirtualSerialTest, AConsoleThatGoesReleasesItsSerialSessions)
+TEST_F(VirtualSerialTest, ADisconnectedConsoleReleasesItsSerialSessions)
 {
     Peer peer;
     Peer other;
@@ -563,7 +248,7 @@ TEST_F(VirtualSerialTest, AConsoleThatGoesReleasesItsSerialSessions)
     EXPECT_EQ(port1->started, 1U);
 }
 
-TEST_F(VirtualSerialTest, TheNextHolderHasToSetTheSessionUpItself)
+TEST_F(VirtualSerialTest, TheNextHolderMustSetTheSessionUp)
 {
     Peer gone;
     Peer closed;
@@ -588,7 +273,7 @@ TEST_F(VirtualSerialTest, TheNextHolderHasToSetTheSessionUpItself)
     EXPECT_THAT(watched(), IsEmpty());
 }
 
-TEST_F(VirtualSerialTest, WhateverAConsoleDoesTheSerialLinesAreLookedAtAgain)
+TEST_F(VirtualSerialTest, EveryChangeOfASessionWakesTheSerialThread)
 {
     Peer peer;
     const auto wakes = [this](const std::function<void()>& action) {
@@ -605,7 +290,7 @@ TEST_F(VirtualSerialTest, WhateverAConsoleDoesTheSerialLinesAreLookedAtAgain)
     EXPECT_TRUE(wakes([&] { hypervisor->shutDown(); }));
 }
 
-TEST_F(VirtualSerialTest, InputThatWasAcceptedIsDeliveredAfterItsConsoleHasGone)
+TEST_F(VirtualSerialTest, AcceptedInputIsDeliveredAfterItsConsoleDisconnects)
 {
     Peer peer;
     setUpSerial(peer, "a", 1);
@@ -618,7 +303,7 @@ TEST_F(VirtualSerialTest, InputThatWasAcceptedIsDeliveredAfterItsConsoleHasGone)
     EXPECT_EQ(port1->input, "last wish");
 }
 
-// How many.
+// The number of sessions.
 
 TEST_F(VirtualSerialTest, TheMaximumIsOneSystemAndItsPartitions)
 {
@@ -630,7 +315,7 @@ TEST_F(VirtualSerialTest, TheMaximumIsOneSystemAndItsPartitions)
     EXPECT_EQ(response->getMaxLpar(), 2U);
 }
 
-TEST_F(VirtualSerialTest, MorePartitionsThanTheResponseCanSayAreTheMostItCan)
+TEST_F(VirtualSerialTest, TheMaximumIsCappedAt255Partitions)
 {
     PartitionSet partitions;
     for (std::uint16_t id = 1; id <= 256; ++id)
@@ -642,7 +327,7 @@ TEST_F(VirtualSerialTest, MorePartitionsThanTheResponseCanSayAreTheMostItCan)
     EXPECT_EQ(peer.link.take<QelMessageVirtualSerialGetMaxSessionsRsp>()->getMaxLpar(), 255U);
 }
 
-TEST_F(VirtualSerialTest, APartitionIdCannotBeTwice)
+TEST_F(VirtualSerialTest, RefusesADuplicatePartitionId)
 {
     PartitionSet partitions;
     partitions.add(1, std::make_unique<FakeSerialPort>());

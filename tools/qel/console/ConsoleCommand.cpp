@@ -140,7 +140,7 @@ ExitStatus conclude(const ConsoleLoop::Outcome& outcome, const ConsoleSession& s
         return ExitStatus::Done;
     case ConsoleLoop::ExitReason::Ended:
         screen.output().flush();
-        screen.say(describe(session.getEnd()));
+        screen.say(session.describeEnd());
         return exitStatusOf(session.getEnd());
     default:
         screen.output().flush();

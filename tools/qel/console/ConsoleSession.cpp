@@ -124,6 +124,12 @@ void ConsoleSession::close()
     static_cast<void>(mConnection.require("close session", QelMessageInterfaceCmpCloseKrogSessionReq()));
 }
 
+std::string ConsoleSession::describeEnd() const
+{
+    if (mEnd != SessionEnd::CommandEnded) return describe(mEnd);
+    return "session closed: " + describe(mCommandEnd);
+}
+
 /// What the requests are about, for RequestRefused.
 std::string ConsoleSession::pSubject() const { return "partition " + std::to_string(mAddress.partition); }
 
@@ -166,6 +172,7 @@ void ConsoleSession::pEndSession(const QelMessageVirtualSerialSessionClosedAsync
         break;
     case Notice::CloseReasonReadFailure:
         mEnd = SessionEnd::CommandEnded;
+        mCommandEnd = commandEndFrom(notice.getStatusDetail());
         break;
     case Notice::CloseReasonWriteFailure:
         mEnd = SessionEnd::WriteFailure;

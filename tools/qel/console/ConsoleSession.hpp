@@ -5,6 +5,7 @@
 #include <qel/common/QelMessageVirtualSerial.hpp>
 #include <qel/common/util/Poll.hpp>
 
+#include "base/CommandEnd.hpp"
 #include "base/ExitStatus.hpp"
 #include "client/ClientConnection.hpp"
 
@@ -94,6 +95,9 @@ public:
     /// Why the session ended; None while it is open.
     SessionEnd getEnd() const noexcept { return mEnd; }
 
+    /// The same in words: describe(getEnd()), and how the command ended where the notice says so.
+    std::string describeEnd() const;
+
     /// Closes the virtual serial session and the hypervisor session, as far as they are open.
     /// @throws RequestRefused, and what ClientConnection::require() throws
     void close();
@@ -120,6 +124,7 @@ private:
     Receiver& mReceiver;
     bool mIsSerialOpen = false;
     SessionEnd mEnd = SessionEnd::None;
+    CommandEnd mCommandEnd; // with SessionEnd::CommandEnded
 };
 
 } // namespace qel::tool

@@ -17,7 +17,7 @@ namespace qel::tool {
 
 namespace {
 
-/// The broadcast type that goes to one tool alone.
+/// The broadcast type for a single addressee.
 constexpr std::uint8_t kUnicast = 1;
 
 /// Bytes of capability bits in an answer: one for every eight of the 32.
@@ -26,7 +26,7 @@ constexpr std::uint32_t kCapabilityBytes = QelCapabilities::size() / 8;
 /// Where the limits response says how many consoles are supported: offset from the first payload byte.
 constexpr std::size_t kConsolesSupportedOffset = 8;
 
-/// A response without payload: what a request gets that is refused, or that has no response of its own.
+/// A response without payload, for a refused request or one that has no response class.
 std::unique_ptr<QelMessage> bareResponse(const QelMessage& request, QelMessageStatusCodes status)
 {
     auto response = std::make_unique<QelMessageGeneric>(request.getCallerId(), request.getFunction(),
@@ -35,7 +35,7 @@ std::unique_ptr<QelMessage> bareResponse(const QelMessage& request, QelMessageSt
     return response;
 }
 
-/// The registry of this end does not know the message: it has its place before TLS alone.
+/// By identity: the registry of this end does not know the class, which belongs to the steps before TLS.
 bool isUpgrade(const QelMessage& message)
 {
     return std::make_tuple(static_cast<unsigned short>(message.getFunction()),
@@ -91,11 +91,11 @@ ConsoleState Hypervisor::receive(ConsoleId id, const QelMessage& message)
     case QelMessageClassification::Async:
         pHandleNotice(console, message);
         break;
-    default: // an answer to nothing that was asked, or no kind of message at all
+    default: // this end sends no requests, so a response answers none; or the flags contradict each other
         logLine(LogLevel::Warn, "console ", id, ": ignored ", message.getLogID());
         break;
     }
-    if (mPartitions.takeTouched()) mWakeSerial(); // most messages have nothing to do with serial data
+    if (mPartitions.takeChanged()) mWakeSerial();
     return console.state;
 }
 
@@ -157,7 +157,13 @@ void Hypervisor::serviceSerial(std::uint16_t partition)
     mPartitions.service(partition);
 }
 
-/// The entry of the table for requests of class T. A request that has T's identity but is no T did not parse.
+bool Hypervisor::serviceEndedLines()
+{
+    const MutexLock lock(mMutex);
+    return mPartitions.serviceEnded();
+}
+
+/// The entry of the table for requests of class T. A request that has T's identity and another class did not parse.
 template <typename T>
 Hypervisor::Rules::value_type Hypervisor::pRule(Reply (Hypervisor::*handler)(Console&, const T&), bool needsSession)
 {
@@ -223,7 +229,7 @@ void Hypervisor::pHandleNotice(Console& console, const QelMessage& notice)
     logLine(LogLevel::Warn, "console ", console.id, ": ignored ", notice.getLogID());
 }
 
-/// A console asks for TLS where there is none, or none any more: it would wait for the answer in vain.
+/// A console asks for TLS on a plain connection, or inside TLS. It waits for an answer, so it gets one.
 void Hypervisor::pRefuseUpgrade(Console& console)
 {
     logLine(LogLevel::Warn, "console ", console.id, ": closed, it asked for TLS, which is not done here");
@@ -231,12 +237,12 @@ void Hypervisor::pRefuseUpgrade(Console& console)
     pClose(console);
 }
 
-/// Everything that can be said about a request before it is looked into.
+/// The checks that are the same for all requests. @param rule  set when they pass
 QelMessageStatusCodes Hypervisor::pAdmit(const Console& console, const QelMessage& request, const Rule*& rule) const
 {
     const bool isVersion = isRequest<QelMessageGetEnclTypeAndInterfaceVersionReq>(request);
-    // The version request comes first and comes once. Until then it does not matter what else is asked, so that nobody
-    // learns what is known here without having said who it is.
+    // The version request comes first and comes once. Before it every other request gets the same status, so that an
+    // unidentified peer cannot find out which requests exist.
     if (isVersion != (console.state == ConsoleState::Connected)) return QelMessageStatusInvalidCmdSequence;
     if (!pKnowsFunction(request.getFunction())) return QelMessageStatusInvalidFunction;
     const auto found = pRules().find(RequestId(request.getFunction(), request.getOperation()));
@@ -285,7 +291,7 @@ Hypervisor::Reply Hypervisor::pLimits(Console&, const QelMessageGetInterfaceLimi
 {
     const QelMessageGetInterfaceLimitsRsp response(request.getCallerId());
     if (mSettings.maxConsoles == QelMessageGetInterfaceLimitsRsp::DAXS_SUPPORTED) return response.clone();
-    // The class always says what is usual; this server may have been told otherwise, and says so.
+    // The class writes the protocol's own number of consoles; the number that this server allows replaces it.
     std::string payload(response.getData(), response.dataLength());
     payload[kConsolesSupportedOffset] = static_cast<char>(mSettings.maxConsoles);
     auto changed = std::make_unique<QelMessageGeneric>(response);
@@ -321,11 +327,11 @@ Hypervisor::Reply Hypervisor::pTime(Console&, const QelMessageGetQelTodReq& requ
 
 Hypervisor::Reply Hypervisor::pSetMode(Console&, const QelMessageSetGlobalModeAttributeReq& request)
 {
-    // What cannot be told to whoever asks for it later would break that console's connection.
+    // A longer text would make a response that the console that reads the mode must not accept.
     if (request.getMTMSLen() > kMaxMtms) return bareResponse(request, QelMessageStatusInvalidData);
     mMode = request.getMode();
     mMtms = request.getMTMS();
-    return bareResponse(request, QelMessageStatusNoError); // the one request that has no response class
+    return bareResponse(request, QelMessageStatusNoError); // 0x0108 has no response class
 }
 
 Hypervisor::Reply Hypervisor::pGetMode(Console&, const QelMessageGetGlobalModeAttributeReq& request)
@@ -365,8 +371,8 @@ Hypervisor::Reply Hypervisor::pCloseSerial(Console& console, const QelMessageVir
 Hypervisor::Reply Hypervisor::pMaxSerialSessions(Console&, const QelMessageVirtualSerialGetMaxSessionsReq& request)
 {
     constexpr std::uint16_t kSystems = 1; // this one
-    constexpr std::size_t kMost = std::numeric_limits<std::uint8_t>::max();
-    const auto partitions = static_cast<std::uint8_t>(std::min(mPartitions.size(), kMost));
+    constexpr std::size_t kMax = std::numeric_limits<std::uint8_t>::max();
+    const auto partitions = static_cast<std::uint8_t>(std::min(mPartitions.size(), kMax));
     return std::make_unique<QelMessageVirtualSerialGetMaxSessionsRsp>(request.getCallerId(), kSystems, partitions);
 }
 
@@ -396,7 +402,7 @@ std::size_t Hypervisor::pCountIdentified() const
     return count;
 }
 
-/// @return false: the console does not take what it is sent fast enough, and did not get this
+/// @return false: the console's queue is full, and it did not get the broadcast
 bool Hypervisor::pSendBroadcast(Console& to, const Console& from, const QelMessageDaxBroadcastReq& request)
 {
     if (to.link.offer(std::make_unique<QelMessageDaxBroadcastOutboundAsync>(request, from.toolId, from.toolType))) {

@@ -19,7 +19,7 @@
 
 namespace qel::tool {
 
-/// What the hypervisor end says of itself, and how many consoles it takes.
+/// What the hypervisor end reports about itself, and how many consoles it takes.
 struct HypervisorSettings {
     char interfaceFamily = 'Q';
     std::uint16_t majorVersion = 1;
@@ -27,16 +27,16 @@ struct HypervisorSettings {
     std::string machineType = "QEL-SERVE"; ///< at most 16 bytes
     std::string serialNumber = "0000001";  ///< at most 16 bytes
     QelCapabilities capabilities;
-    std::uint8_t maxConsoles = QelMessageGetInterfaceLimitsRsp::DAXS_SUPPORTED;
+    std::uint8_t maxConsoles = 16; ///< identified at a time; more than 0
 };
 
-/// The hypervisor end of the protocol without any input or output: what it answers to whom, and who holds what.
-/// Messages come in through receive(), answers and notices go out through the consoles' links, serial data through the
-/// partitions' ports. docs/connection.md describes the rules.
+/// The logic of the hypervisor end, without input or output: which response each request gets, and which console holds
+/// which session. Messages come in through receive(); responses and notices go out through the consoles' links, serial
+/// data through the partitions' ports. docs/connection.md describes the rules.
 ///
-/// Thread safety: every operation may be called from any thread. One lock guards everything; links and ports are called
-/// with it held and wait for nothing, so that it is never held for long. Lock order: this lock first, then whatever a
-/// link or a port locks, then the logger's.
+/// Thread safety: any thread may call any operation. One lock guards everything. Links and ports are called with it
+/// held and do not block, so it is never held for long. Lock order: this lock, then the locks of links and ports, then
+/// the logger's.
 class Hypervisor {
 public:
     /// @param wakeSerial  called, with the lock held, when serialWatches() may have changed
@@ -45,44 +45,48 @@ public:
     Hypervisor(const Hypervisor&) = delete;
     Hypervisor& operator=(const Hypervisor&) = delete;
 
-    /// Takes a new connection in.
+    /// Adds a connection.
     /// @param link  borrowed until disconnect() has returned
-    /// @param peer  where it comes from, for the log
+    /// @param peer  the console's address, for the log
     ConsoleId connect(ConsoleLink& link, const std::string& peer);
 
     /// Acts on a message of a console.
-    /// @return how far the connection has come by now
+    /// @return the state of the connection afterwards
     ConsoleState receive(ConsoleId id, const QelMessage& message);
 
-    /// False while the next message of a console has to wait: it does not take its answers, or a partition does not
-    /// take its input. ConsoleLink::resumeReading() says when to look again.
+    /// False while the next message of a console has to wait: its responses wait for room, or too much input waits for
+    /// its partition. ConsoleLink::resumeReading() says when to ask again.
     bool mayReceive(ConsoleId id) const;
 
-    /// False when another console would be turned away: as many as allowed are there, or the hypervisor shuts down.
+    /// False when another console would be refused: the maximum is connected, or the hypervisor shuts down.
     bool takesConsoles() const;
 
     /// Forgets a connection; its sessions end. Its link is not called afterwards. Unknown ids are ignored.
     void disconnect(ConsoleId id);
 
-    /// A link that had no room has room again.
+    /// To be called when a link has room again.
     void outputDrained();
 
-    /// Tells every console that the hypervisor shuts down, ends their connections, and takes the partitions' lines
-    /// down. Connections that come later are ended at once.
+    /// Sends every console the notices of the shutdown, ends the connections, and takes the partitions' lines down.
+    /// Later connections are ended at once.
     void shutDown();
 
-    /// What the thread that moves serial data has to wait for.
+    /// What the serial thread has to wait for.
     std::vector<SerialWatch> serialWatches() const;
 
     /// Moves the serial data of one partition.
     void serviceSerial(std::uint16_t partition);
+
+    /// Takes down the lines whose commands have ended: see PartitionSet::serviceEnded().
+    /// @return true: call again soon
+    bool serviceEndedLines();
 
 private:
     using Reply = std::unique_ptr<QelMessage>;
     /// The identity of a request: function and operation.
     using RequestId = std::pair<unsigned short, unsigned short>;
 
-    /// What is known of a request before it is looked into.
+    /// How a request is handled.
     struct Rule {
         std::function<Reply(Hypervisor&, Console&, const QelMessage&)> handle;
         bool needsSession = false; ///< the hypervisor session must be open

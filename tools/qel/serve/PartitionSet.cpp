@@ -1,6 +1,8 @@
 #include "serve/PartitionSet.hpp"
 
+#include <qel/common/QelMessageGeneric.hpp>
 #include <qel/common/util/PosixError.hpp>
+#include <qel/common/util/TimeProvider.hpp>
 
 #include "base/Logging.hpp"
 
@@ -9,6 +11,21 @@
 #include <utility>
 
 namespace qel::tool {
+
+namespace {
+
+/// The notice that a session is closed. How the command ended, where that is known, is in the status detail of its
+/// header.
+std::unique_ptr<QelMessage> closedNotice(const QelMessageVirtualSerialSessionClosedAsync& notice, const CommandEnd& end)
+{
+    const std::uint16_t detail = toStatusDetail(end);
+    if (detail == 0) return notice.clone();
+    auto detailed = std::make_unique<QelMessageGeneric>(notice);
+    detailed->setStatus(QelMessageStatusNoError, detail);
+    return detailed;
+}
+
+} // namespace
 
 PartitionSet::PartitionSet() = default;
 PartitionSet::~PartitionSet() = default;
@@ -28,9 +45,9 @@ QelMessageStatusCodes PartitionSet::open(Console& console, std::uint16_t id, std
     const QelMessageStatusCodes found = pFindPartition(id, connection, partition);
     if (found != QelMessageStatusNoError) return found;
     if (partition->holder != nullptr && !force) return QelMessageStatusConnectionNotAvailable;
-    mTouched = true; // even by a line that cannot be started: what was left of it is taken down first
+    mChanged = true; // even when the command cannot be started: what is left of an ended one is taken down first
     if (!pStart(*partition)) return QelMessageStatusCmdFailed;
-    if (partition->holder != nullptr) pEnd(*partition, CloseReason::CloseReasonForceClose);
+    if (partition->holder != nullptr) pEndSession(*partition, CloseReason::CloseReasonForceClose);
     partition->holder = &console;
     return QelMessageStatusNoError;
 }
@@ -42,7 +59,7 @@ QelMessageStatusCodes PartitionSet::setUp(Console& console, std::uint16_t id, st
     if (found != QelMessageStatusNoError) return found;
     if (partition->holder != &console) return QelMessageStatusInvalidCmdSequence;
     partition->setUp = true;
-    mTouched = true;
+    mChanged = true;
     return QelMessageStatusNoError;
 }
 
@@ -54,11 +71,11 @@ QelMessageStatusCodes PartitionSet::close(Console& console, std::uint16_t id, st
     if (partition->holder == &console) {
         partition->holder = nullptr;
         partition->setUp = false;
-        mTouched = true;
+        mChanged = true;
         return QelMessageStatusNoError;
     }
     if (partition->holder == nullptr || !force) return QelMessageStatusConnectionClosureFailure;
-    pEnd(*partition, CloseReason::CloseReasonForceClose);
+    pEndSession(*partition, CloseReason::CloseReasonForceClose);
     return QelMessageStatusNoError;
 }
 
@@ -68,7 +85,7 @@ bool PartitionSet::feed(const Console& console, const QelMessageVirtualSerialDat
     if (partition == nullptr || data.getVssConnectionNumber() != kConnectionNumber) return false;
     if (partition->holder != &console || !partition->setUp) return false;
     if (data.getSerialDataLength() == 0) return true;
-    mTouched = true;
+    mChanged = true;
     partition->input.append(data.getSerialData(), data.getSerialDataLength());
     pPumpInput(*partition);
     return true;
@@ -81,14 +98,14 @@ void PartitionSet::release(const Console& console)
         if (partition.holder != &console) continue;
         partition.holder = nullptr;
         partition.setUp = false;
-        mTouched = true;
+        mChanged = true;
     }
 }
 
 void PartitionSet::shutDown()
 {
     for (auto& entry : mPartitions)
-        pBreak(entry.second, CloseReason::CloseReasonQelShutdown);
+        pTakeDown(entry.second, CloseReason::CloseReasonQelShutdown);
 }
 
 bool PartitionSet::hasInputRoom(const Console& console) const
@@ -104,11 +121,11 @@ std::vector<SerialWatch> PartitionSet::watches() const
     std::vector<SerialWatch> watches;
     for (const auto& entry : mPartitions) {
         const Partition& partition = entry.second;
-        if (!partition.port->isRunning()) continue;
+        if (!partition.port->isRunning() || pIsExiting(partition)) continue;
         const bool wantsInput = !partition.input.empty();
         const bool wantsOutput = pWantsOutput(partition);
         if (partition.holder != nullptr && !wantsInput && !wantsOutput) continue;
-        // Without a session nothing is read, but the end of the line is noticed: errors and hang-ups always are.
+        // Without a session nothing is read, but a hang-up is noticed: poll(2) always reports it.
         PollFd fd(partition.port->descriptor(), PollEvents::Error);
         if (wantsInput) fd.mFd.events |= static_cast<short>(PollEvents::Write);
         if (wantsOutput) fd.mFd.events |= static_cast<short>(PollEvents::Read);
@@ -117,19 +134,24 @@ std::vector<SerialWatch> PartitionSet::watches() const
     return watches;
 }
 
-bool PartitionSet::takeTouched() { return std::exchange(mTouched, false); }
+bool PartitionSet::takeChanged() { return std::exchange(mChanged, false); }
 
 void PartitionSet::service(std::uint16_t id)
 {
     Partition* const partition = pFind(id);
-    if (partition == nullptr || !partition->port->isRunning()) return;
-    if (partition->holder == nullptr && partition->port->hasHungUp()) {
-        logLine(LogLevel::Info, "partition ", id, ": the command ended while no console was connected");
-        pBreak(*partition, CloseReason::CloseReasonReadFailure);
-        return;
-    }
+    if (partition == nullptr || !partition->port->isRunning() || pIsExiting(*partition)) return;
+    if (partition->holder == nullptr && partition->port->hasHungUp()) return pBeginExit(*partition);
     pPumpInput(*partition);
     if (partition->port->isRunning() && pWantsOutput(*partition)) pPumpOutput(*partition);
+}
+
+bool PartitionSet::serviceEnded()
+{
+    bool anyLeft = false;
+    for (auto& entry : mPartitions) {
+        if (pIsExiting(entry.second) && !pFinishExit(entry.second)) anyLeft = true;
+    }
+    return anyLeft;
 }
 
 PartitionSet::Partition* PartitionSet::pFind(std::uint16_t id)
@@ -148,8 +170,10 @@ QelMessageStatusCodes PartitionSet::pFindPartition(std::uint16_t id, std::uint16
 
 bool PartitionSet::pStart(Partition& partition)
 {
+    if (pIsExiting(partition)) static_cast<void>(pFinishExit(partition));
     try {
         partition.port->start();
+        partition.exitDeadline = PollDeadline();
         return true;
     } catch (const PosixError& error) {
         logLine(LogLevel::Error, "partition ", partition.id, ": ", error.what());
@@ -157,25 +181,47 @@ bool PartitionSet::pStart(Partition& partition)
     }
 }
 
-/// Ends the session, if there is one, and tells the console that held it.
-void PartitionSet::pEnd(Partition& partition, CloseReason reason)
+/// Ends the session, if there is one, with a notice to the console that holds it.
+void PartitionSet::pEndSession(Partition& partition, CloseReason reason, const CommandEnd& end)
 {
     Console* const holder = partition.holder;
     if (holder == nullptr) return;
     partition.holder = nullptr;
     partition.setUp = false;
-    holder->link.post(
-        std::make_unique<QelMessageVirtualSerialSessionClosedAsync>(partition.id, kConnectionNumber, reason));
-    mTouched = true;
+    holder->link.post(closedNotice({partition.id, kConnectionNumber, reason}, end));
+    mChanged = true;
     holder->link.resumeReading(); // it may have waited for this partition to take its input
 }
 
-/// Ends the session and takes the line down.
-void PartitionSet::pBreak(Partition& partition, CloseReason reason)
+/// Ends the session, with a notice, and takes the line down.
+void PartitionSet::pTakeDown(Partition& partition, CloseReason reason, const CommandEnd& end)
 {
-    pEnd(partition, reason);
+    pEndSession(partition, reason, end);
     partition.input.clear();
+    partition.exitDeadline = PollDeadline();
     partition.port->stop();
+}
+
+/// The line has ended. Its command ends a moment later, unless it has only closed its terminal.
+void PartitionSet::pBeginExit(Partition& partition)
+{
+    partition.exitDeadline = TimeProvider::steady() + kExitTimeout;
+    static_cast<void>(pFinishExit(partition));
+}
+
+/// Takes the line of an ended command down. @return false: the command has not ended, and may take more time
+bool PartitionSet::pFinishExit(Partition& partition)
+{
+    std::optional<CommandEnd> end = partition.port->commandEnd();
+    if (!end) {
+        if (!partition.exitDeadline.isExpired(TimeProvider::steady())) return false;
+        end.emplace();
+        end->kind = CommandEnd::Kind::ClosedTerminal;
+    }
+    logLine(LogLevel::Info, "partition ", partition.id, ": ", describe(*end),
+            partition.holder == nullptr ? ", with no session open" : "");
+    pTakeDown(partition, CloseReason::CloseReasonReadFailure, *end);
+    return true;
 }
 
 void PartitionSet::pPumpInput(Partition& partition)
@@ -183,7 +229,7 @@ void PartitionSet::pPumpInput(Partition& partition)
     if (partition.input.empty()) return;
     const bool wasFull = partition.input.size() >= kInputLimit;
     try {
-        if (partition.port->hasHungUp()) partition.input.clear(); // nobody is left to take it
+        if (partition.port->hasHungUp()) partition.input.clear(); // nothing is left that reads it
         while (!partition.input.empty()) {
             const std::size_t taken = partition.port->write(partition.input.data(), partition.input.size());
             if (taken == 0) break;
@@ -191,7 +237,7 @@ void PartitionSet::pPumpInput(Partition& partition)
         }
     } catch (const PosixError& error) {
         logLine(LogLevel::Error, "partition ", partition.id, ": ", error.what());
-        pBreak(partition, CloseReason::CloseReasonWriteFailure);
+        pTakeDown(partition, CloseReason::CloseReasonWriteFailure);
         return;
     }
     const bool isFull = partition.input.size() >= kInputLimit;
@@ -206,8 +252,7 @@ void PartitionSet::pPumpOutput(Partition& partition)
     case SerialPort::LineState::Idle:
         return;
     case SerialPort::LineState::Ended:
-        logLine(LogLevel::Info, "partition ", partition.id, ": the command ended");
-        pBreak(partition, CloseReason::CloseReasonReadFailure);
+        pBeginExit(partition);
         return;
     case SerialPort::LineState::Data:
         partition.holder->link.postSerial(std::make_unique<QelMessageVirtualSerialDataToDaxAsync>(
@@ -215,6 +260,8 @@ void PartitionSet::pPumpOutput(Partition& partition)
         return;
     }
 }
+
+bool PartitionSet::pIsExiting(const Partition& partition) { return !partition.exitDeadline.isDisabled(); }
 
 bool PartitionSet::pWantsOutput(const Partition& partition)
 {

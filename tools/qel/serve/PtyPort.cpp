@@ -68,7 +68,7 @@ struct SpawnAttributes {
 
 void setTerminal(SpawnActions& actions, const std::string& terminal)
 {
-    // The leader of a new session that opens a terminal gets it as its controlling one.
+    // A terminal that the leader of a new session opens becomes its controlling terminal.
     constexpr const char* kFailure = "cannot prepare the terminal of a command";
     check(::posix_spawn_file_actions_addopen(&actions.value, STDIN_FILENO, terminal.c_str(), O_RDWR, 0), kFailure);
     check(::posix_spawn_file_actions_adddup2(&actions.value, STDIN_FILENO, STDOUT_FILENO), kFailure);
@@ -77,7 +77,7 @@ void setTerminal(SpawnActions& actions, const std::string& terminal)
 
 void setSignals(SpawnAttributes& attributes)
 {
-    // This program blocks and ignores signals that a command expects to find as usual.
+    // This program blocks and ignores signals for which a command expects the default action.
     constexpr const char* kFailure = "cannot prepare the signals of a command";
     constexpr int kFlags = POSIX_SPAWN_SETSID | POSIX_SPAWN_SETSIGMASK | POSIX_SPAWN_SETSIGDEF;
     sigset_t none;
@@ -89,9 +89,9 @@ void setSignals(SpawnAttributes& attributes)
     check(::posix_spawnattr_setflags(&attributes.value, static_cast<short>(kFlags)), kFailure);
 }
 
-/// Starts the command on a terminal; not by fork, after which the child would have a copy of all locks of this program
-/// but only one of its threads.
-pid_t spawn(const std::string& command, const std::string& terminal)
+/// Starts the command on a terminal. Not by fork: the child would inherit locks that other threads of this program
+/// hold, without the threads that release them.
+pid_t spawn(const std::string& command, std::vector<std::string> environment, const std::string& terminal)
 {
     SpawnActions actions;
     SpawnAttributes attributes;
@@ -101,8 +101,12 @@ pid_t spawn(const std::string& command, const std::string& terminal)
     std::string option = "-c";
     std::string text = command;
     std::array<char*, 4> arguments{shell.data(), option.data(), text.data(), nullptr};
+    std::vector<char*> variables;
+    for (std::string& variable : environment)
+        variables.push_back(variable.data());
+    variables.push_back(nullptr);
     pid_t pid = -1;
-    check(::posix_spawn(&pid, shell.c_str(), &actions.value, &attributes.value, arguments.data(), environ),
+    check(::posix_spawn(&pid, shell.c_str(), &actions.value, &attributes.value, arguments.data(), variables.data()),
           "cannot start a command");
     return pid;
 }
@@ -111,18 +115,20 @@ bool isTransient(int error) { return error == EAGAIN || error == EINTR; }
 
 } // namespace
 
-PtyPort::PtyPort(std::string command, ChildReaper& reaper) : mCommand(std::move(command)), mReaper(reaper) {}
+PtyPort::PtyPort(std::string command, ChildReaper& reaper, std::vector<std::string> environment)
+    : mCommand(std::move(command)), mEnvironment(std::move(environment)), mReaper(reaper)
+{}
 
 PtyPort::~PtyPort() { stop(); }
 
 void PtyPort::start()
 {
     if (isRunning()) {
-        if (!pHasCommandEnded()) return;
+        if (!commandEnd()) return;
         stop();
     }
     UniqueFd master = openMaster();
-    mLeader = spawn(mCommand, slaveName(master.get()));
+    mLeader = spawn(mCommand, mEnvironment, slaveName(master.get()));
     mMaster = std::move(master);
 }
 
@@ -130,13 +136,30 @@ bool PtyPort::isRunning() const { return mMaster.get() >= 0; }
 
 bool PtyPort::hasHungUp() const { return PollSet(PollFd(mMaster.get(), PollEvents::Error)).poll().anyReady(); }
 
+std::optional<CommandEnd> PtyPort::commandEnd()
+{
+    if (mLeader < 0) return CommandEnd();
+    siginfo_t info{};
+    // Without reaping it: while the process is there, its number cannot come to mean another process group, and stop()
+    // can end what the command has left in its group.
+    if (::waitid(P_PID, static_cast<id_t>(mLeader), &info, WEXITED | WNOHANG | WNOWAIT) != 0) {
+        mLeader = -1; // the system has reaped it, as where SIGCHLD is ignored
+        return CommandEnd();
+    }
+    if (info.si_pid == 0) return std::nullopt;
+    CommandEnd end;
+    end.kind = info.si_code == CLD_EXITED ? CommandEnd::Kind::Exited : CommandEnd::Kind::Killed;
+    end.number = static_cast<std::uint8_t>(info.si_status);
+    return end;
+}
+
 SerialPort::ReadResult PtyPort::read(char* buffer, std::size_t length)
 {
     const ssize_t count = ::read(mMaster.get(), buffer, length);
     const int error = errno;
     if (count > 0) return {LineState::Data, static_cast<std::size_t>(count)};
     if (count < 0 && isTransient(error)) return {LineState::Idle, 0};
-    return {LineState::Ended, 0}; // EIO once the other side is closed and empty
+    return {LineState::Ended, 0}; // EIO once the command's side is closed and all output is read
 }
 
 std::size_t PtyPort::write(const char* data, std::size_t length)
@@ -155,15 +178,6 @@ void PtyPort::stop()
     mMaster.reset(); // hangs up
     if (mLeader > 0) mReaper.adopt(mLeader);
     mLeader = -1;
-}
-
-bool PtyPort::pHasCommandEnded()
-{
-    if (mLeader < 0) return true;
-    // An error means that it is gone as well: the system has reaped it, as it does where SIGCHLD is ignored.
-    if (::waitpid(mLeader, nullptr, WNOHANG) == 0) return false;
-    mLeader = -1;
-    return true;
 }
 
 } // namespace qel::tool

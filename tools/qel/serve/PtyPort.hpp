@@ -5,18 +5,20 @@
 #include "serve/SerialPort.hpp"
 
 #include <string>
+#include <vector>
 
 namespace qel::tool {
 
-/// The serial line of a partition that is a command of this machine: a pseudo-terminal with the command on its other
-/// side. start() runs "/bin/sh -c COMMAND" in a session of its own with the terminal as its controlling one, 24 rows by
-/// 80 columns; stop() hangs up and hands the command to the reaper.
+/// The serial line of a partition whose command runs on this machine, on a pseudo-terminal of 24 rows by 80 columns.
+/// start() runs "/bin/sh -c COMMAND" in a session of its own, with the terminal as its controlling terminal; stop()
+/// hangs up and hands the command to the reaper.
 ///
 /// Sources: pty(7), posix_spawn(3), credentials(7).
 class PtyPort final : public SerialPort {
 public:
     /// @param reaper  borrowed; must outlive this object
-    PtyPort(std::string command, ChildReaper& reaper);
+    /// @param environment  the whole environment of the command, one "NAME=value" each
+    PtyPort(std::string command, ChildReaper& reaper, std::vector<std::string> environment = {});
     ~PtyPort() override;
     PtyPort(const PtyPort&) = delete;
     PtyPort& operator=(const PtyPort&) = delete;
@@ -24,18 +26,18 @@ public:
     void start() override;
     bool isRunning() const override;
     bool hasHungUp() const override;
+    std::optional<CommandEnd> commandEnd() override;
     ReadResult read(char* buffer, std::size_t length) override;
     std::size_t write(const char* data, std::size_t length) override;
     int descriptor() const override;
     void stop() override;
 
 private:
-    bool pHasCommandEnded();
-
     const std::string mCommand;
+    const std::vector<std::string> mEnvironment;
     ChildReaper& mReaper;
     UniqueFd mMaster;
-    pid_t mLeader = -1; ///< the command's shell; -1: none, or reaped
+    pid_t mLeader = -1; ///< the command's shell, not yet reaped; -1: none
 };
 
 } // namespace qel::tool

@@ -10,10 +10,13 @@ namespace qel::tool {
 
 namespace {
 
-/// How often to look after commands that have been asked to end.
+/// How often to look at commands that have been asked to end.
 constexpr std::chrono::milliseconds kReapInterval(50);
 
-/// Before the next try when even waiting fails.
+/// How often to look at commands whose line has ended, which end at any moment.
+constexpr std::chrono::milliseconds kExitInterval(5);
+
+/// The pause after a failure, before the next attempt.
 constexpr std::chrono::milliseconds kPauseAfterFailure(100);
 
 } // namespace
@@ -33,7 +36,7 @@ void SerialLoop::pRun() noexcept
 {
     while (!mStopping) {
         try {
-            pTurn();
+            pPollOnce();
         } catch (const std::exception& error) {
             logLine(LogLevel::Error, "serial lines: ", explain(error));
             std::this_thread::sleep_for(kPauseAfterFailure);
@@ -41,13 +44,18 @@ void SerialLoop::pRun() noexcept
     }
 }
 
-void SerialLoop::pTurn()
+void SerialLoop::pPollOnce()
 {
+    const bool linesEnding = mHypervisor.serviceEndedLines(); // first: it hands commands to the reaper
+    const bool commandsEnding = mReaper.reap();
+    std::chrono::milliseconds timeout = PollSet::TIMEOUT_INFINITE;
+    if (commandsEnding) timeout = kReapInterval;
+    if (linesEnding) timeout = kExitInterval;
     const std::vector<SerialWatch> watches = mHypervisor.serialWatches();
     PollSet set(mWake.getPollFd());
     for (const SerialWatch& watch : watches)
         set += watch.fd;
-    const PollResult result = set.wait(mReaper.reap() ? kReapInterval : PollSet::TIMEOUT_INFINITE);
+    const PollResult result = set.wait(timeout);
     if (result.contains(mWake.getPollFd())) mWake.eoi();
     for (const SerialWatch& watch : watches) {
         if (result.contains(watch.fd)) mHypervisor.serviceSerial(watch.partition);

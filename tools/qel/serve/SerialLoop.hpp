@@ -10,8 +10,8 @@
 
 namespace qel::tool {
 
-/// The one thread that moves the serial data of all partitions, and reaps the commands that have ended. It waits for
-/// what the hypervisor names, and for the wake-up that says that this has changed.
+/// The one thread that moves the serial data of all partitions and reaps the commands that have ended. It waits for
+/// the hypervisor's serial watches, and for a wake-up when they have changed.
 /// Thread safety: one thread owns it.
 class SerialLoop {
 public:
@@ -26,7 +26,7 @@ public:
 
 private:
     void pRun() noexcept;
-    void pTurn();
+    void pPollOnce();
 
     Hypervisor& mHypervisor;
     ChildReaper& mReaper;

@@ -9,13 +9,17 @@
 #include "base/SignalWatch.hpp"
 #include "base/WakeUp.hpp"
 #include "serve/ChildReaper.hpp"
+#include "serve/CommandEnvironment.hpp"
 #include "serve/Hypervisor.hpp"
 #include "serve/PtyPort.hpp"
 #include "serve/SerialLoop.hpp"
 #include "serve/Server.hpp"
 #include "transport/TransportOptions.hpp"
 
+#include <algorithm>
+#include <cctype>
 #include <csignal>
+#include <cstring>
 #include <initializer_list>
 #include <iostream>
 #include <map>
@@ -30,10 +34,9 @@ namespace qel::tool {
 namespace {
 
 constexpr int kBacklog = 64;
-constexpr std::size_t kMostPartitions = 255; // the maximum-sessions response has one byte for them
-constexpr std::size_t kLongestName = 16;
-
-constexpr std::size_t kLargestQueue = 1024 * 1024 * 1024;
+constexpr std::size_t kMaxPartitions = 255; // the maximum-sessions response has one byte for them
+constexpr std::size_t kMaxNameBytes = 16;
+constexpr std::size_t kMaxQueueBytes = 1024 * 1024 * 1024;
 
 constexpr std::initializer_list<int> kSignals{SIGTERM, SIGINT, SIGHUP, SIGUSR1};
 
@@ -41,6 +44,7 @@ struct ServeOptions {
     std::string endpoint = "127.0.0.1:0";
     TransportOptions transport;
     std::vector<std::string> partitions; ///< "ID=COMMAND"
+    std::string term = "vt220";
     std::uint32_t maxConsoles = 0;
     std::size_t queueBytes = ConnectionLimits().queueBytes;
     std::string family;
@@ -55,13 +59,22 @@ struct ServeOptions {
     throw CLI::ValidationError(option, reason);
 }
 
-/// @throws CLI::ValidationError
-std::uint16_t parseNumber(const std::string& text, std::uint64_t min, const std::string& option)
+/// An integer in [min, 65535]. @throws CLI::ValidationError
+std::uint16_t parseUint16(const std::string& text, std::uint64_t min, const std::string& option)
 {
     constexpr std::uint64_t kMax = 65535;
     const auto number = parseInteger(text);
     if (!number || *number < min || *number > kMax) refuse(option, notAnIntegerIn(text, min, kMax));
     return static_cast<std::uint16_t>(*number);
+}
+
+/// The characters that names of terminal types consist of: see term(7).
+std::string checkTerm(const std::string& name)
+{
+    const bool isName = !name.empty() && std::all_of(name.begin(), name.end(), [](unsigned char character) {
+        return std::isalnum(character) != 0 || std::strchr("+-._", character) != nullptr;
+    });
+    return isName ? std::string() : "\"" + name + "\" is not a terminal type, such as vt220";
 }
 
 std::map<std::uint16_t, std::string> parsePartitions(const std::vector<std::string>& texts)
@@ -70,12 +83,12 @@ std::map<std::uint16_t, std::string> parsePartitions(const std::vector<std::stri
     for (const std::string& text : texts) {
         const std::size_t equals = text.find('=');
         if (equals == std::string::npos || equals + 1 == text.size()) refuse("--partition", "takes ID=COMMAND");
-        const std::uint16_t id = parseNumber(text.substr(0, equals), 1, "--partition");
+        const std::uint16_t id = parseUint16(text.substr(0, equals), 1, "--partition");
         if (!commands.emplace(id, text.substr(equals + 1)).second) {
             refuse("--partition", "partition " + std::to_string(id) + " is given twice");
         }
     }
-    if (commands.size() > kMostPartitions) refuse("--partition", "more than 255 partitions");
+    if (commands.size() > kMaxPartitions) refuse("--partition", "more than 255 partitions");
     return commands;
 }
 
@@ -83,8 +96,8 @@ void parseVersion(const std::string& text, HypervisorSettings& settings)
 {
     const std::size_t dot = text.find('.');
     if (dot == std::string::npos) refuse("--interface-version", "takes MAJOR.MINOR");
-    settings.majorVersion = parseNumber(text.substr(0, dot), 0, "--interface-version");
-    settings.minorVersion = parseNumber(text.substr(dot + 1), 0, "--interface-version");
+    settings.majorVersion = parseUint16(text.substr(0, dot), 0, "--interface-version");
+    settings.minorVersion = parseUint16(text.substr(dot + 1), 0, "--interface-version");
 }
 
 HypervisorSettings parseSettings(const ServeOptions& options)
@@ -107,24 +120,26 @@ Socket openListener(const IPEndpoint& endpoint)
     }
 }
 
-PartitionSet makePartitions(const std::map<std::uint16_t, std::string>& commands, ChildReaper& reaper)
-{
-    PartitionSet partitions;
-    for (const auto& command : commands) {
-        partitions.add(command.first, std::make_unique<PtyPort>(command.second, reaper));
-    }
-    return partitions;
-}
-
-/// What the command line says, understood.
+/// The options, parsed.
 struct ServePlan {
     IPEndpoint endpoint;
     std::map<std::uint16_t, std::string> commands;
+    std::string term;
     HypervisorSettings settings;
     TransportOptions transport;
     std::size_t queueBytes = 0;
     LogOptions log;
 };
+
+PartitionSet makePartitions(const ServePlan& plan, ChildReaper& reaper)
+{
+    PartitionSet partitions;
+    for (const auto& command : plan.commands) {
+        const std::uint16_t id = command.first;
+        partitions.add(id, std::make_unique<PtyPort>(command.second, reaper, commandEnvironment(id, plan.term)));
+    }
+    return partitions;
+}
 
 ServePlan makePlan(const ServeOptions& options)
 {
@@ -133,13 +148,14 @@ ServePlan makePlan(const ServeOptions& options)
     plan.endpoint = IPEndpoint(options.endpoint);
     plan.transport = options.transport;
     plan.commands = parsePartitions(options.partitions);
+    plan.term = options.term;
     plan.settings = parseSettings(options);
     plan.queueBytes = options.queueBytes;
     plan.log = options.log;
     return plan;
 }
 
-/// SIGHUP: gives the connections to come the credentials that the files hold now.
+/// On SIGHUP: loads the credentials from their files again, for new connections.
 void reload(Server& server, const TransportOptions& transport)
 {
     if (transport.plain) return logLine(LogLevel::Info, "SIGHUP: connections are plain, there is nothing to load");
@@ -151,7 +167,7 @@ void reload(Server& server, const TransportOptions& transport)
     }
 }
 
-/// SIGUSR1, and the end: tells what is known about the queues.
+/// On SIGUSR1 and at the end: logs the statistics of the queues.
 void logStatistics(Server& server)
 {
     std::ostringstream text;
@@ -159,7 +175,7 @@ void logStatistics(Server& server)
     logLines(LogLevel::Info, text.str());
 }
 
-/// @return the signal that asks to stop
+/// @return the signal that ended it
 int serveUntilStopped(Server& server, SignalWatch& signals, const TransportOptions& transport)
 {
     for (;;) {
@@ -178,7 +194,8 @@ int serveUntilStopped(Server& server, SignalWatch& signals, const TransportOptio
 ExitStatus runServe(const ServePlan& plan)
 {
     startLogging(plan.log, "qel-serve.log");
-    static_cast<void>(std::signal(SIGPIPE, SIG_IGN)); // a log that nobody reads any more must not end the server
+    static_cast<void>(std::signal(SIGPIPE, SIG_IGN)); // a log pipe without a reader must not end the server
+    static_cast<void>(std::signal(SIGCHLD, SIG_DFL)); // ignored, as a parent may leave it, it hides how commands end
     SignalWatch signals(kSignals);
     auto context = makeServerContext(plan.transport);
     Socket listener = openListener(plan.endpoint);
@@ -186,7 +203,7 @@ ExitStatus runServe(const ServePlan& plan)
 
     ChildReaper reaper;
     WakeUp serialWake;
-    Hypervisor hypervisor(plan.settings, makePartitions(plan.commands, reaper), [&] { serialWake.interrupt(); });
+    Hypervisor hypervisor(plan.settings, makePartitions(plan, reaper), [&] { serialWake.interrupt(); });
     ConnectionLimits limits;
     limits.handshake = plan.transport.handshakeTimeout();
     limits.queueBytes = plan.queueBytes;
@@ -201,7 +218,7 @@ ExitStatus runServe(const ServePlan& plan)
     logLine(LogLevel::Info, "stopping: signal ", signal);
     logStatistics(server);
     for (const int number : kSignals)
-        static_cast<void>(std::signal(number, SIG_IGN)); // once is enough
+        static_cast<void>(std::signal(number, SIG_IGN)); // a second one must not cut the shutdown short
     hypervisor.shutDown();
     server.finish();
     return ExitStatus::Done;
@@ -209,20 +226,19 @@ ExitStatus runServe(const ServePlan& plan)
 
 void addIdentityOptions(CLI::App& command, ServeOptions& options)
 {
-    const CLI::Validator shortName = textUpTo(kLongestName);
+    const CLI::Validator shortName = textUpTo(kMaxNameBytes);
     command.add_option("--system-type", options.settings.machineType, "Machine type to report, at most 16 bytes")
         ->check(shortName)
         ->capture_default_str();
     command.add_option("--system-serial", options.settings.serialNumber, "Serial number to report, at most 16 bytes")
         ->check(shortName)
         ->capture_default_str();
-    command.add_option("--interface-family", options.family,
-                       "Interface family to report, one character; Q unless given");
-    command.add_option("--interface-version", options.version, "Interface version to report; 1.0 unless given")
+    command.add_option("--interface-family", options.family, "Interface family to report, one character; Q by default");
+    command.add_option("--interface-version", options.version, "Interface version to report; 1.0 by default")
         ->type_name("MAJOR.MINOR");
     command
         .add_option("--capabilities", options.capabilities,
-                    "Capabilities to offer, a 0 or 1 for each, bit 0 first; all 32 unless given")
+                    "Capabilities to offer, a 0 or 1 for each, bit 0 first; all 32 by default")
         ->type_name("BITS")
         ->check(capabilityValidator());
 }
@@ -231,7 +247,7 @@ void addIdentityOptions(CLI::App& command, ServeOptions& options)
 
 CLI::App& addServeCommand(CLI::App& parent, Action& action)
 {
-    CLI::App& command = addCommand(parent, "serve", "Be the hypervisor end: serve consoles until told to stop");
+    CLI::App& command = addCommand(parent, "serve", "Run the hypervisor end: serve consoles until a signal stops it");
     const auto options = std::make_shared<ServeOptions>();
     options->maxConsoles = options->settings.maxConsoles;
     command.add_option("--listen", options->endpoint, "Where to listen; port 0 lets the system choose one")
@@ -242,17 +258,21 @@ CLI::App& addServeCommand(CLI::App& parent, Action& action)
     command
         .add_option(
             "--partition", options->partitions,
-            "A partition: its id and the command behind its serial console, which starts when it is first opened")
+            "A partition: its id, and the shell command on its serial console, which starts when a console opens it")
         ->type_name("ID=COMMAND")
         ->allow_extra_args(false);
-    command.add_option("--max-consoles", options->maxConsoles, "Consoles served at a time")
+    command.add_option("--term", options->term, "Terminal type of the partitions' commands: their TERM")
+        ->type_name("NAME")
+        ->check(CLI::Validator(checkTerm, ""))
+        ->capture_default_str();
+    command.add_option("--max-consoles", options->maxConsoles, "Consoles that may be connected at a time, 1 to 255")
         ->transform(integerIn(1, 255))
         ->capture_default_str();
     command
         .add_option("--queue-limit", options->queueBytes,
-                    "Bytes that may be queued for a console before it has to wait; half of it for serial data")
+                    "Bytes that may be queued for a console, half of them serial data")
         ->type_name("BYTES")
-        ->transform(integerIn(1, kLargestQueue))
+        ->transform(integerIn(1, kMaxQueueBytes))
         ->capture_default_str();
     addIdentityOptions(command, *options);
     addLogOptions(command, options->log);
