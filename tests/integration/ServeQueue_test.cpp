@@ -141,7 +141,7 @@ TEST(ServeStatistics, FollowTheLogDirectoryAndTheLogLevel)
 
 TEST(ServeStatistics, RepeatedRequestsDoNotDisturbService)
 {
-    ServeProcess server(partition("1=stty raw -echo; echo go; read x; seq 1 50000; echo done"));
+    ServeProcess server({"--partition", "1=stty raw -echo; echo go; read x; seq 1 50000; echo done"});
     TestConsole console(server.endpoint());
     console.openSession("a");
     console.openSerial(1);
