@@ -42,8 +42,8 @@ json parse(const Process::Result& result)
     return json::parse(result.output);
 }
 
-/// Waits until the connections are there and the messages go; it says so when its log is asked for.
-void awaitStart(const Process& process) { process.awaitErrors("(I): [qel] 2 connections are there"); }
+/// Waits until the run begins; the log says so at Info.
+void awaitStart(const Process& process) { process.awaitErrors("(I): [qel] 2 connections are open; the run begins\n"); }
 
 std::uint64_t messagesIn(const json& histogram)
 {
