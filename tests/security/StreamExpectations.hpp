@@ -5,6 +5,7 @@
 #include "support/TlsKit.hpp"
 
 #include <functional>
+#include <gmock/gmock.h>
 #include <string>
 #include <thread>
 #include <vector>
