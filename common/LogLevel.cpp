@@ -6,9 +6,7 @@
 #include <ostream>
 #include <stdexcept>
 
-namespace qel {
-
-namespace LogLevel {
+namespace qel::LogLevel {
 
 namespace {
 
@@ -57,6 +55,4 @@ std::istream& operator>>(std::istream& is, Level& level)
 
 void setLogLevel(Level level) { QelLogger::get().setLevel(level); }
 
-} // namespace LogLevel
-
-} // namespace qel
+} // namespace qel::LogLevel

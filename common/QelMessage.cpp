@@ -120,7 +120,8 @@ QelMessage::QelMessage(unsigned int i_callerId, unsigned short i_function, unsig
     if (i_payloadLength.bytes() > kFrameLengthMaximum - headerLength) throw std::invalid_argument("length");
     const unsigned int dataLength = static_cast<unsigned int>(i_payloadLength.bytes());
 
-    mMessage.reset(new char[headerLength + dataLength]()); // zeros: fields that are not set below are sent as zero
+    mMessage =
+        std::make_unique<char[]>(headerLength + dataLength); // zeros: fields that are not set below are sent as zero
     CommonHeader* const header = pGetHeader();
     std::memcpy(header->mDesc, CommonHeader::DaxCmdDesc, sizeof(header->mDesc));
     header->mHeaderVersion = CommonHeader::MessageVersion32;

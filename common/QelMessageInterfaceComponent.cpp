@@ -14,7 +14,7 @@ namespace {
 
 constexpr const char* kPayloadTooShort = "dataLength smaller than minimum acceptable size";
 
-void copyText(char* field, const std::string& text) { std::memcpy(field, text.data(), text.size()); }
+void copyText(char* field, const std::string& text) { std::copy(text.begin(), text.end(), field); }
 
 // The checked...Length() functions check the arguments of a builder and return its payload length. They are evaluated
 // as constructor arguments, so that arguments that are refused allocate no frame and draw no caller id. The other

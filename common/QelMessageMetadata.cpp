@@ -1,9 +1,7 @@
 #include <qel/common/QelMessageMetadata.hpp>
 
-namespace qel {
-namespace detail {
+namespace qel::detail {
 
 void throwBadOperation() { throw QelMessageValidationException("bad operation"); }
 
-} // namespace detail
-} // namespace qel
+} // namespace qel::detail

@@ -12,9 +12,7 @@
 #include <sstream>
 #include <stdexcept>
 
-namespace qel {
-
-namespace Utilities {
+namespace qel::Utilities {
 
 namespace {
 
@@ -137,6 +135,4 @@ bool parseBool(const std::string& text)
     throw std::invalid_argument(text + " is not convertible to bool");
 }
 
-} // namespace Utilities
-
-} // namespace qel
+} // namespace qel::Utilities

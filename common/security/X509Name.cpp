@@ -22,7 +22,7 @@ std::string fieldName(const ASN1_OBJECT* object)
     const int length = OBJ_obj2txt(nullptr, 0, object, 1); // without the NUL that the second call adds
     checkSSL(length > 0);
     std::string numbers(static_cast<std::size_t>(length) + 1, '\0');
-    checkSSL(OBJ_obj2txt(&numbers[0], length + 1, object, 1) == length);
+    checkSSL(OBJ_obj2txt(numbers.data(), length + 1, object, 1) == length);
     numbers.pop_back();
     return numbers;
 }

@@ -8,7 +8,7 @@ namespace {
 // them runs (both objects are constant-initialised) and is never destroyed (a union does not destroy its member).
 union DefaultProviderStorage {
     constexpr DefaultProviderStorage() noexcept : provider() {}
-    ~DefaultProviderStorage() {}
+    ~DefaultProviderStorage() {} // NOLINT(modernize-use-equals-default): a defaulted one would be deleted
     DefaultTimeProvider provider;
 };
 

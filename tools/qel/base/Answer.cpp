@@ -85,7 +85,7 @@ nlohmann::ordered_json jsonHead(const std::string& request, QelMessageStatusCode
 std::string statusName(QelMessageStatusCodes status)
 {
     // The library prints a status as "0x00000004 (name)".
-    const std::string text = toString(status);
+    std::string text = toString(status);
     const std::size_t open = text.find('(');
     const std::size_t close = text.rfind(')');
     if (open == std::string::npos || close == std::string::npos || close < open) return text;

@@ -48,7 +48,7 @@ std::string numberOf(const ASN1_OBJECT* object)
     const int length = OBJ_obj2txt(nullptr, 0, object, kInDots); // without the NUL that the second call adds
     if (length <= 0) fail("cannot read the number of an attribute");
     std::string number(static_cast<std::size_t>(length) + 1, '\0');
-    OBJ_obj2txt(&number[0], length + 1, object, kInDots);
+    OBJ_obj2txt(number.data(), length + 1, object, kInDots);
     number.pop_back();
     return number;
 }

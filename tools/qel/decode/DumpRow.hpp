@@ -14,7 +14,7 @@ struct DumpRow {
 
 /// Reads a row that `xxd` prints: "00000000: deca ff20 0000 0028  ... ...(".
 /// @return none for a line of another form
-std::optional<DumpRow> parseXxdRow(const std::string& line);
+std::optional<DumpRow> parseXxdRow(const std::string& text);
 
 /// Reads a row that `hexdump -C` prints: "00000000  de ca ff 20 00 00 00 28  |... ...(|".
 /// @return none for a line of another form
@@ -22,6 +22,6 @@ std::optional<DumpRow> parseHexdumpRow(const std::string& line);
 
 /// Reads the last line that `hexdump -C` prints: the offset after the last byte, alone.
 /// @return none for a line of another form
-std::optional<std::uint64_t> parseHexdumpEnd(const std::string& line);
+std::optional<std::uint64_t> parseHexdumpEnd(const std::string& text);
 
 } // namespace qel::tool

@@ -199,7 +199,7 @@ bool TcpStream::pAppend(std::uint32_t sequence, const std::string& payload, std:
     if (ahead > 0) return false;
     const auto known = static_cast<std::size_t>(-static_cast<std::int64_t>(ahead));
     if (known >= payload.size()) return true; // sent again
-    data.append(payload, known, std::string::npos);
+    data += payload.substr(known);
     *mNext += static_cast<std::uint32_t>(payload.size() - known);
     return true;
 }

@@ -102,6 +102,7 @@ pid_t spawn(const std::string& command, std::vector<std::string> environment, co
     std::string text = command;
     std::array<char*, 4> arguments{shell.data(), option.data(), text.data(), nullptr};
     std::vector<char*> variables;
+    variables.reserve(environment.size() + 1);
     for (std::string& variable : environment)
         variables.push_back(variable.data());
     variables.push_back(nullptr);

@@ -68,8 +68,8 @@ private:
     endian_uint<T, 4321> mValue;
 };
 
-typedef bcd_uint<unsigned char> bcd_uint8_t;
-typedef bcd_uint<unsigned short> bcd_uint16_t;
+using bcd_uint8_t = bcd_uint<unsigned char>;
+using bcd_uint16_t = bcd_uint<unsigned short>;
 
 static_assert(sizeof(bcd_uint8_t) == 1 && alignof(bcd_uint8_t) == 1, "overlays the frame buffer");
 static_assert(sizeof(bcd_uint16_t) == 2 && alignof(bcd_uint16_t) == 1, "overlays the frame buffer");

@@ -65,8 +65,8 @@ private:
     unsigned char mValue[sizeof(T)]; // as on the wire: most significant byte first
 };
 
-typedef endian_uint<unsigned short, 4321> be_uint16_t;
-typedef endian_uint<unsigned int, 4321> be_uint32_t;
+using be_uint16_t = endian_uint<unsigned short, 4321>;
+using be_uint32_t = endian_uint<unsigned int, 4321>;
 
 static_assert(sizeof(endian_uint<unsigned char, 4321>) == 1 && alignof(endian_uint<unsigned char, 4321>) == 1,
               "overlays the frame buffer");

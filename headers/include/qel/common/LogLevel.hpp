@@ -10,9 +10,7 @@
 /// The severity scale of the log, its printed forms, and the parsing of level names.
 /// Thread safety: any thread may call every function.
 
-namespace qel {
-
-namespace LogLevel {
+namespace qel::LogLevel {
 
 /// The severity of a log line, from Debug up to Critical; also the threshold of loggers and back-ends.
 /// The numbers are part of the interface: thresholds are compared by number, and configurations may contain numbers.
@@ -57,6 +55,4 @@ QEL_EXPORT std::istream& operator>>(std::istream& is, Level& level);
 /// Sets the threshold of the root logger: QelLogger::get().setLevel(level).
 QEL_EXPORT void setLogLevel(Level level);
 
-} // namespace LogLevel
-
-} // namespace qel
+} // namespace qel::LogLevel

@@ -35,7 +35,8 @@ public:
     /// constructors.
     class CtorPasskey {
         friend class QelDebug;
-        CtorPasskey() {} // user-provided: with a defaulted one this would be an aggregate, which {} initialises
+        // User-provided: with a defaulted constructor this would be an aggregate, which {} initialises.
+        CtorPasskey() {} // NOLINT(modernize-use-equals-default)
     };
 
     /// The root logger; use get() instead.

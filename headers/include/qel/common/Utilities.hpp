@@ -6,13 +6,11 @@
 #include <type_traits>
 #include <vector>
 
-namespace qel {
-
 /// Functions on strings, paths and whole files.
 /// Thread safety: every function may be called from any thread.
 /// Each function that returns a string or a vector may throw std::bad_alloc; other exceptions are named at the
 /// function.
-namespace Utilities {
+namespace qel::Utilities {
 
 /// @return the text with each byte through the C library's tolower(3), that is by the process's C locale
 QEL_EXPORT std::string lowercase(const std::string& text);
@@ -87,6 +85,4 @@ typename std::remove_reference<T>::type& ref(T&& temporary) noexcept
     return temporary;
 }
 
-} // namespace Utilities
-
-} // namespace qel
+} // namespace qel::Utilities

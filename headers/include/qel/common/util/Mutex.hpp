@@ -86,7 +86,7 @@ public:
     /// Blocks until the calling thread holds the mutex.
     explicit UniqueMutexLock(Mutex& mutex) QEL_ACQUIRE(mutex) QEL_NO_THREAD_SAFETY_ANALYSIS : mLock(mutex) {}
     /// Releases the mutex if it is held.
-    ~UniqueMutexLock() QEL_RELEASE() QEL_NO_THREAD_SAFETY_ANALYSIS {}
+    ~UniqueMutexLock() QEL_RELEASE() QEL_NO_THREAD_SAFETY_ANALYSIS {} // NOLINT(modernize-use-equals-default)
     UniqueMutexLock(const UniqueMutexLock&) = delete;
     UniqueMutexLock& operator=(const UniqueMutexLock&) = delete;
 
