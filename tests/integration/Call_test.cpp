@@ -71,7 +71,7 @@ TEST_F(Call, Limits)
     expectText({"limits"}, "Largest command (bytes):            16384\n"
                            "Largest hypervisor command (bytes): 4096\n"
                            "Largest broadcast (bytes):          16306\n"
-                           "Consoles supported:                 2\n"
+                           "Consoles supported:                 16\n"
                            "Nonpersistent locks supported:      0\n"
                            "Persistent locks supported:         0\n");
     EXPECT_EQ(parse(server.call({"--json", "limits"}))["maxCommandSize"], 16384);
