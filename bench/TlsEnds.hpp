@@ -12,18 +12,18 @@
 
 /// @file
 /// TLS connections for the contests, ours and OpenSSL's own. All of them use the same certificates and the same
-/// settings: TLS 1.3, both ends present a certificate and verify the other's, no tickets, no cache.
+/// settings: TLS 1.3, mutual authentication, no tickets, no session cache.
 
 namespace qel::bench {
 
-/// Credentials of both ends, made when they are first asked for: that takes a second, which nobody else should pay.
+/// Credentials of both ends. They are made on first use, since that takes a second.
 const SSLCredentials& clientCredentials();
 const SSLCredentials& serverCredentials();
 
 /// Throws unless a call of OpenSSL has succeeded.
 void checkCall(bool succeeded, const char* call);
 
-/// A context made with OpenSSL alone that does the same as ours.
+/// A context made with OpenSSL alone, with the same settings as ours.
 SSL_CTX_PTR rawContext(const SSLCredentials& credentials);
 
 /// Runs the far end's part on a thread of its own, while the near end's runs here.

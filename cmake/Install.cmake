@@ -6,14 +6,24 @@ include(CMakePackageConfigHelpers)
 
 foreach(directory IN ITEMS CMAKE_INSTALL_INCLUDEDIR CMAKE_INSTALL_LIBDIR)
   if(IS_ABSOLUTE "${${directory}}")
-    message(FATAL_ERROR "${directory} must be relative to the prefix: the installed package is relocatable")
+    message(FATAL_ERROR "${directory} must be relative to the prefix: the installed package is relocatable "
+      "(QEL_INSTALL=OFF installs nothing of it)")
   endif()
 endforeach()
 
-# Two components: what programs need to run, and what is needed to build them.
+# Four components: what programs need to run (qel_runtime), what is needed to build them (qel_development), the program
+# qel (qel_program, beside its target) and the documents with the licence (qel_documentation).
 install(TARGETS qelcommon EXPORT qelTargets
   LIBRARY DESTINATION ${CMAKE_INSTALL_LIBDIR}
-    COMPONENT qel_runtime NAMELINK_COMPONENT qel_development)
+    COMPONENT qel_runtime NAMELINK_COMPONENT qel_development
+  ARCHIVE DESTINATION ${CMAKE_INSTALL_LIBDIR}
+    COMPONENT qel_development)
+install(FILES ${PROJECT_SOURCE_DIR}/LICENSE ${PROJECT_SOURCE_DIR}/README.md ${PROJECT_SOURCE_DIR}/CHANGELOG.md
+  DESTINATION ${CMAKE_INSTALL_DOCDIR}
+  COMPONENT qel_documentation)
+install(DIRECTORY ${PROJECT_SOURCE_DIR}/docs
+  DESTINATION ${CMAKE_INSTALL_DOCDIR}
+  COMPONENT qel_documentation)
 install(DIRECTORY
     ${PROJECT_SOURCE_DIR}/headers/include/qel
     ${PROJECT_BINARY_DIR}/headers/include/qel

@@ -20,3 +20,20 @@ function(qel_configure_target target)
     target_link_options(${target} PRIVATE --coverage)
   endif()
 endfunction()
+
+# What leaves this project, the library and the program, is built so that a mistake in it is hard to exploit: a guard value
+# on the stack, bounds checks in the C library's functions (these need optimisation), relocations that are read-only once
+# the program runs, and no executable stack. The sanitizers bring their own checks.
+function(qel_harden_target target)
+  if(NOT QEL_HARDENING)
+    return()
+  endif()
+  target_compile_options(${target} PRIVATE
+    -fstack-protector-strong
+    $<$<NOT:$<CONFIG:Debug>>:-U_FORTIFY_SOURCE>
+    $<$<NOT:$<CONFIG:Debug>>:-D_FORTIFY_SOURCE=2>)
+  get_target_property(type ${target} TYPE)
+  if(NOT type STREQUAL "STATIC_LIBRARY")
+    target_link_options(${target} PRIVATE -Wl,-z,relro -Wl,-z,now -Wl,-z,noexecstack)
+  endif()
+endfunction()

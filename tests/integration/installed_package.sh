@@ -1,7 +1,7 @@
 #!/bin/sh
-# What a user gets: installs the library to a scratch prefix, moves the installed tree to another place, builds and runs
-# the example project against it there, once found by CMake and once by pkg-config; likewise the lines that README.md
-# shows, with the includes of the example.
+# Installs the library to a scratch prefix, moves the installed tree to another place, and builds and runs the example
+# project against it there, once found by CMake and once by pkg-config; likewise the lines that README.md shows, with the
+# includes of the example. Also installs and runs the program.
 #
 #   installed_package.sh BUILD SOURCE VERSION
 #
@@ -59,7 +59,24 @@ soname=$("$readelf" -d "$library" | sed -n 's/.*SONAME.*\[\(.*\)\].*/\1/p')
 echo ./qel/common/QelVersion.hpp >>"$work/headers.unsorted"
 sort "$work/headers.unsorted" >"$work/headers.expected"
 (cd "$moved/include" && find . -type f) | sort >"$work/headers.installed"
-diff "$work/headers.expected" "$work/headers.installed" >&2 || fail "other headers are installed than there are"
+diff "$work/headers.expected" "$work/headers.installed" >&2 || fail "the installed headers are not those of the project"
+
+# --- the program and the documents are components of their own
+
+if [ -e "$build/tools/qel/qel" ]; then
+    quietly "$cmake" --install "$build" --prefix "$work/program" --component qel_runtime
+    quietly "$cmake" --install "$build" --prefix "$work/program" --component qel_program
+    mkdir "$work/apart"
+    mv "$work/program" "$work/apart/program"
+    [ "$("$work/apart/program/bin/qel" --version)" = "qel $version" ] || fail "the installed program does not run"
+    [ ! -e "$work/apart/program/include" ] || fail "the program's component brings headers"
+fi
+quietly "$cmake" --install "$build" --prefix "$work/documents" --component qel_documentation
+for file in LICENSE README.md CHANGELOG.md docs/tls.md docs/wire-format.md; do
+    found=$(find "$work/documents/share/doc" -path "*/$file")
+    [ -n "$found" ] || fail "$file was not installed"
+    diff "$source/$file" "$found" >&2 || fail "another $file was installed"
+done
 
 # Nothing leads back to where it was built or first installed, and our warnings stay ours.
 for place in "$source" "$build" "$work/first"; do
@@ -110,7 +127,7 @@ LD_LIBRARY_PATH="$libdir" "$work/by-pkg-config" >"$work/by-pkg-config.out" ||
 
 # --- the lines that README.md shows
 
-# shellcheck disable=SC2016 # these are no commands
+# shellcheck disable=SC2016 # the backquotes are text
 sed -n '/^```cpp$/,/^```$/p' "$source/README.md" | sed '/^```/d' >"$work/lines"
 [ -s "$work/lines" ] || fail "README.md shows no lines of code"
 {

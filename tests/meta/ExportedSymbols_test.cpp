@@ -1,32 +1,20 @@
 // What the shared library offers to the programs that link it: namespace qel and nothing else.
 
-#include <array>
-#include <cstdio>
+#include "meta/CommandOutput.hpp"
+
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <regex>
 #include <sstream>
-#include <stdexcept>
 #include <string>
 #include <vector>
 
+using qel::test::outputOf;
 using testing::Contains;
 using testing::ElementsAre;
 using testing::IsEmpty;
 
 namespace {
-
-std::string outputOf(const std::string& command)
-{
-    FILE* const pipe = ::popen(command.c_str(), "r");
-    if (pipe == nullptr) throw std::runtime_error("cannot run: " + command);
-    std::string output;
-    std::array<char, 4096> buffer;
-    while (const std::size_t count = std::fread(buffer.data(), 1, buffer.size(), pipe))
-        output.append(buffer.data(), count);
-    if (::pclose(pipe) != 0) throw std::runtime_error("failed: " + command);
-    return output;
-}
 
 // The names in the output of `nm -D --defined-only`: the last word of each line ("0000abcd T name", "name@@VERSION").
 std::vector<std::string> namesIn(const std::string& listing)

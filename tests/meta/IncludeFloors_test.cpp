@@ -45,7 +45,7 @@ FloorTable parseTable(std::istream& text)
         }
         const int floor = std::stoi(first);
         for (const std::string& room : rest)
-            if (!table.floors.emplace(room, floor).second) throw std::runtime_error("stands there twice: " + room);
+            if (!table.floors.emplace(room, floor).second) throw std::runtime_error("is listed twice: " + room);
     }
     return table;
 }
@@ -109,14 +109,14 @@ std::vector<Include> includesOf(const std::string& source)
 std::vector<std::string> violations(const FloorTable& table, const std::string& room, const std::string& source)
 {
     const auto own = table.floors.find(room);
-    if (own == table.floors.end()) return {room + " stands on no floor"};
+    if (own == table.floors.end()) return {room + " is not on any floor"};
 
     std::vector<std::string> result;
     for (const Include& include : includesOf(source)) {
         if (include.ours) {
             const auto other = table.floors.find(withoutEnding(include.name));
             if (other == table.floors.end()) {
-                result.push_back(room + " includes " + include.name + ", which stands on no floor");
+                result.push_back(room + " includes " + include.name + ", which is not on any floor");
             } else if (other->second > own->second) {
                 result.push_back(room + " (floor " + std::to_string(own->second) + ") includes " + include.name +
                                  " (floor " + std::to_string(other->second) + ")");
@@ -216,10 +216,10 @@ TEST(IncludeFloorsCheck, FindsAnIncludeThatClimbs)
 
 TEST(IncludeFloorsCheck, FindsAFileThatStandsOnNoFloor)
 {
-    EXPECT_THAT(violationsIn("stray", ""), ElementsAre("stray stands on no floor"));
+    EXPECT_THAT(violationsIn("stray", ""), ElementsAre("stray is not on any floor"));
     EXPECT_THAT(violationsIn("high", "#include <qel/common/stray.hpp>\n#include \"support/Fake.hpp\"\n"),
-                ElementsAre("high includes stray.hpp, which stands on no floor",
-                            "high includes support/Fake.hpp, which stands on no floor"));
+                ElementsAre("high includes stray.hpp, which is not on any floor",
+                            "high includes support/Fake.hpp, which is not on any floor"));
 }
 
 TEST(IncludeFloorsCheck, FindsASystemHeaderOutsideItsRooms)
@@ -235,12 +235,12 @@ TEST(IncludeFloorsCheck, FindsASystemHeaderOutsideItsRooms)
 TEST(IncludeFloorsCheck, RefusesATableThatContradictsItself)
 {
     EXPECT_THAT([] { parseTable("0 twice\n1 twice\n"); },
-                ThrowsMessage<std::runtime_error>(HasSubstr("stands there twice: twice")));
+                ThrowsMessage<std::runtime_error>(HasSubstr("is listed twice: twice")));
     EXPECT_THAT([] { parseTable("only poll.h\n"); }, ThrowsMessage<std::runtime_error>(HasSubstr("a room are needed")));
     EXPECT_THROW(parseTable("ground low\n"), std::invalid_argument);
 }
 
-// The program's rooms are its folders. What each may include beside itself stands in docs/architecture.md, in the rows
+// The program's rooms are its folders. What each may include besides itself is in docs/architecture.md, in the rows
 // of a table:  | `client/` | what is in it | `base`, `transport` |
 
 using Rooms = std::map<std::string, std::set<std::string>>;
@@ -314,7 +314,7 @@ TEST(ProgramRooms, NoFileOfTheProgramIncludesARoomThatItsOwnMayNot)
         const bool isSource = name.extension() == ".hpp" || name.extension() == ".cpp";
         if (!isSource || name == "main.cpp") continue; // it knows every command
         const std::string room = name.begin()->string();
-        ASSERT_EQ(programRooms().count(room), 1U) << name << " stands in no room";
+        ASSERT_EQ(programRooms().count(room), 1U) << name << " is not in any room";
         ++files[room];
         std::ifstream stream(entry.path());
         std::ostringstream text;
@@ -325,7 +325,7 @@ TEST(ProgramRooms, NoFileOfTheProgramIncludesARoomThatItsOwnMayNot)
     for (const auto& [room, allowed] : programRooms()) {
         EXPECT_GT(files[room], 2U) << room;
         for (const std::string& other : allowed)
-            EXPECT_EQ(programRooms().count(other), 1U) << other << " is no room";
+            EXPECT_EQ(programRooms().count(other), 1U) << other << " is not a room";
     }
 }
 
