@@ -359,7 +359,7 @@ void addTlsContests()
 
 } // namespace qel::bench
 
-/// Stands before the one of OpenSSL, for the library and for the calls above alike.
+/// Comes before the one of OpenSSL, for the library and for the calls above alike.
 extern "C" __attribute__((visibility("default"))) int RSA_generate_key_ex(RSA* key, int bits, BIGNUM* exponent,
                                                                           BN_GENCB* callback)
 {

@@ -106,7 +106,7 @@ void rawOneWay(benchmark::State& state, std::size_t length)
     }
 }
 
-/// The other ends of the pair's descriptors for Boost.Asio, which wants descriptors of its own.
+/// Duplicates of the pair's descriptors for Boost.Asio, which needs descriptors of its own.
 struct AsioPair {
     AsioPair()
         : near(context, boost::asio::ip::tcp::v4(), ::dup(pair.nearFd())),

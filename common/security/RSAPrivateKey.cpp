@@ -84,8 +84,7 @@ std::string RSAPrivateKey::getPEM() const
 }
 
 /// @return a counted reference to the RSA key inside the handle. EVP_PKEY_get0_RSA would need no counting, but its
-/// result,
-///         and the parameters that take it, are const in OpenSSL 3 and not in 1.1.1.
+///         result, and the parameters that take it, are const in OpenSSL 3 and not in 1.1.1.
 RSA_PTR RSAPrivateKey::pShareRSA() const
 {
     checkSSL(mKey != nullptr); // moved from

@@ -398,7 +398,7 @@ TEST_F(ConsoleTest, AnUnknownPartitionOrConnectionIsRefused)
     const auto connection = runConsole({"1", "--connection", "1"}, "");
     EXPECT_EQ(connection.exitStatus, 1);
     EXPECT_EQ(connection.errors,
-              "qel: partition 1 does not have this serial connection; --connection 0 is the first: 0x00000010 "
+              "qel: partition 1 does not have this serial connection; --connection 0 is the only one: 0x00000010 "
               "(QelMessageStatusInvalidConnectionNumber)\n");
 }
 

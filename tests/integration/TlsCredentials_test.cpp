@@ -65,7 +65,7 @@ TEST_F(Tls, AServerOfAnotherRootIsRefused)
     EXPECT_THAT(result.errors,
                 AllOf(StartsWith(prefix(server->endpoint()) + "the peer's certificate is refused: "),
                       EndsWith("certificate in certificate chain\n"))); // versions spell "self-signed" differently
-    EXPECT_THAT(server->stop().errors, HasSubstr(": not let in: the peer closed the connection in the TLS handshake, "
+    EXPECT_THAT(server->stop().errors, HasSubstr(": refused: the peer closed the connection in the TLS handshake, "
                                                  "perhaps because it refuses this end's certificate: EOF\n"));
 }
 
@@ -83,7 +83,7 @@ TEST_F(Tls, AClientOfAnotherRootIsRefused)
     EXPECT_THAT(server->stop().errors,
                 AllOf(HasSubstr("(E): SSL peer certificate verification failed: unable to get local issuer "
                                 "certificate\n"),
-                      HasSubstr(": not let in: the peer's certificate is refused: unable to get local "
+                      HasSubstr(": refused: the peer's certificate is refused: unable to get local "
                                 "issuer certificate\n"),
                       Not(HasSubstr("console 2 connected"))));
 }
@@ -112,7 +112,7 @@ TEST_F(Tls, TheServerRefusesAClientWhoseCertificateIsExpired)
     ASSERT_EQ(console.takeAnswer(), kUpgrade);
     EXPECT_THROW(console.startTls(expiredCredentials(Authority::trusted().clientRequest())), StreamIOException);
     EXPECT_THAT(server->stop().errors,
-                HasSubstr(": not let in: the peer's certificate is refused: certificate has expired\n"));
+                HasSubstr(": refused: the peer's certificate is refused: certificate has expired\n"));
 }
 
 TEST_F(Tls, TheServerRefusesAClientWhoseCertificateIsNotYetValid)
@@ -135,7 +135,7 @@ TEST_F(Tls, RefusesAClientWithoutACertificate)
     anonymous.handshake(); // succeeds: the refusal comes later
     EXPECT_EQ(anonymous.read(1), "");
     EXPECT_THAT(server->stop().errors, AllOf(HasSubstr("peer did not return a certificate"),
-                                             HasSubstr(": not let in: the TLS handshake failed: SSL error 1\n")));
+                                             HasSubstr(": refused: the TLS handshake failed: SSL error 1\n")));
 }
 
 TEST_F(Tls, RefusesAClientWithTls12)
@@ -150,7 +150,7 @@ TEST_F(Tls, RefusesAClientWithTls12)
     options.minimumVersion = options.maximumVersion = TLS1_2_VERSION;
     RawTlsPeer old(RawTlsPeer::Client, options, console.takeStream());
     EXPECT_FALSE(old.handshake());
-    EXPECT_THAT(server->stop().errors, HasSubstr(": not let in: the TLS handshake failed: SSL error 1\n"));
+    EXPECT_THAT(server->stop().errors, HasSubstr(": refused: the TLS handshake failed: SSL error 1\n"));
 }
 
 // Own credentials that cannot be used.

@@ -36,7 +36,7 @@ TEST_F(Tls, APlainConsoleReportsThatTheServerRequiresTls)
     EXPECT_EQ(result.errors,
               "qel: the server refused the connection: it accepts only TLS; give credentials instead of --plain\n");
     EXPECT_THAT(server->stop().errors,
-                AllOf(HasSubstr(": not let in: the peer did not ask for TLS but sent something else: [CID: "),
+                AllOf(HasSubstr(": refused: the peer did not ask for TLS but sent something else: [CID: "),
                       Not(HasSubstr("console 1 connected"))));
 }
 
@@ -73,7 +73,7 @@ TEST_F(Tls, IgnoresMessagesInTheClearInsteadOfTls)
     ASSERT_EQ(console.takeAnswer(), kUpgrade);
     console.sendBytes(frameOf(QelMessageGetEnclTypeAndInterfaceVersionReq(1, 1, 1, 0, "a")));
     EXPECT_TRUE(console.isClosed());
-    EXPECT_THAT(server->stop().errors, AllOf(HasSubstr(": not let in: the TLS handshake failed: SSL error 1\n"),
+    EXPECT_THAT(server->stop().errors, AllOf(HasSubstr(": refused: the TLS handshake failed: SSL error 1\n"),
                                              Not(HasSubstr("console 1 connected"))));
 }
 
@@ -83,7 +83,7 @@ TEST_F(Tls, IgnoresMessagesInTheClearAfterTheRequestForTls)
     TlsConsole console(server->endpoint());
     console.sendBytes(frameOf(QelMessageUpgradeConnectionAsync()) +
                       frameOf(QelMessageGetEnclTypeAndInterfaceVersionReq(1, 1, 1, 0, "a")));
-    server->process().awaitErrors(": not let in: the peer sent data too early in the handshake\n");
+    server->process().awaitErrors(": refused: the peer sent data too early in the handshake\n");
     EXPECT_THAT(server->stop().errors, Not(HasSubstr("console 1 connected")));
 }
 
@@ -92,7 +92,7 @@ TEST_F(Tls, RefusesTlsWithoutARequest)
     const auto server = serve();
     TlsConsole console(server->endpoint());
     EXPECT_THROW(console.startTls(Authority::trusted().clientCredentials()), StreamIOException);
-    EXPECT_THAT(server->stop().errors, HasSubstr(": not let in: the peer did not ask for TLS but sent something "
+    EXPECT_THAT(server->stop().errors, HasSubstr(": refused: the peer did not ask for TLS but sent something "
                                                  "else: Invalid length\n"));
 }
 
@@ -111,7 +111,7 @@ TEST_F(TlsDeadline, EndsASilentConsole)
     const auto server = impatient("0.1");
     TlsConsole console(server->endpoint());
     EXPECT_TRUE(console.isClosed());
-    EXPECT_THAT(server->stop().errors, HasSubstr(": not let in: the peer did not ask for TLS in time\n"));
+    EXPECT_THAT(server->stop().errors, HasSubstr(": refused: the peer did not ask for TLS in time\n"));
 }
 
 TEST_F(TlsDeadline, EndsAConsoleThatIsSilentAfterItsRequest)
@@ -121,7 +121,7 @@ TEST_F(TlsDeadline, EndsAConsoleThatIsSilentAfterItsRequest)
     console.ask();
     EXPECT_EQ(console.takeAnswer(), kUpgrade);
     EXPECT_TRUE(console.isClosed());
-    EXPECT_THAT(server->stop().errors, HasSubstr(": not let in: the TLS handshake did not finish in time\n"));
+    EXPECT_THAT(server->stop().errors, HasSubstr(": refused: the TLS handshake did not finish in time\n"));
 }
 
 TEST_F(TlsDeadline, EndsAConsoleThatIsSilentInsideTls)
@@ -177,7 +177,7 @@ TEST_F(Tls, AStoppingServerRefusesConsolesInTheirHandshake)
     EXPECT_EQ(silent.takeAnswer(), kAbort);
     EXPECT_TRUE(silent.isClosed());
     EXPECT_TRUE(stalled.isClosed());
-    EXPECT_THAT(server->stop().errors, HasSubstr(": not let in: the server stops\n"));
+    EXPECT_THAT(server->stop().errors, HasSubstr(": refused: the server stops\n"));
 }
 
 TEST_F(Tls, RefusesTooManyConsolesBeforeTls)
@@ -190,7 +190,7 @@ TEST_F(Tls, RefusesTooManyConsolesBeforeTls)
     EXPECT_EQ(result.errors,
               prefix(server->endpoint()) +
                   "the server refused this console: it admits no more consoles, is stopping, or does not use TLS\n");
-    EXPECT_THAT(server->stop().errors, HasSubstr(": not let in: no more consoles are taken\n"));
+    EXPECT_THAT(server->stop().errors, HasSubstr(": refused: no more consoles are taken\n"));
 }
 
 // Servers that go wrong before TLS.

@@ -161,7 +161,7 @@ TEST_F(Tls, ServeChecksThePinsOfConsoles)
         result.errors,
         StartsWith("qel: the server closed the connection right after the TLS handshake; it may not accept this "
                    "console's certificate: "));
-    EXPECT_THAT(server->stop().errors, HasSubstr(": not let in: wrong peer: the name "
+    EXPECT_THAT(server->stop().errors, HasSubstr(": refused: wrong peer: the name "
                                                  "\"server\" does not match --peer-name\n"));
 }
 

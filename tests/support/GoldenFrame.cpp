@@ -14,7 +14,7 @@ namespace {
 
 constexpr std::size_t kBytesColumn = 6;    // "0000  "
 constexpr std::size_t kCommentColumn = 31; // "# field"
-constexpr std::size_t kMostBytesInARow = 8;
+constexpr std::size_t kMaxBytesInARow = 8;
 constexpr std::size_t kOldHeaderLength = 24;
 constexpr std::size_t kNewHeaderLength = 32;
 
@@ -230,7 +230,7 @@ private:
         std::string cells = line.substr(kBytesColumn, kCommentColumn - kBytesColumn);
         cells.erase(cells.find_last_not_of(' ') + 1);
         std::string bytes;
-        if (!readBytes(cells, bytes) || bytes.size() > kMostBytesInARow) pFailLine("not one to eight bytes");
+        if (!readBytes(cells, bytes) || bytes.size() > kMaxBytesInARow) pFailLine("not one to eight bytes");
 
         const std::string comment = line.substr(kCommentColumn + 2);
         pAddRow(comment.substr(0, comment.find(':')), bytes);

@@ -138,6 +138,12 @@ TEST_F(CredentialFilesTest, AKeyThatOthersMayReadOrWriteIsRefused)
     }
 }
 
+TEST_F(CredentialFilesTest, ACertificateGivenAsAKeyIsNotRefusedForItsPermissions)
+{
+    const std::string pem = "-----BEGIN CERTIFICATE-----\nAAAA\n-----END CERTIFICATE-----\n";
+    EXPECT_EQ(tool::readKeyFile(write("c", pem, 0644), KeyPermissions::OwnerOnly), pem);
+}
+
 TEST_F(CredentialFilesTest, ThePermissionsOfALinkedKeyAreThoseOfItsTarget)
 {
     const std::string key = write("target", "key", 0644);

@@ -130,7 +130,7 @@ TEST_F(FrameDecoderTest, HandshakeMessageWithWrongFlagsIsUnknown)
 
 TEST_F(FrameDecoderTest, ReportsABadEyecatcher)
 {
-    EXPECT_THAT(decode("this is no frame at all, whatever comes behind it"), ElementsAre("0: i_buffer bad eyecatcher"));
+    EXPECT_THAT(decode("this is not a frame, and neither is what follows"), ElementsAre("0: i_buffer bad eyecatcher"));
     EXPECT_THAT(decode("x"), ElementsAre("0: i_buffer bad eyecatcher"));
     EXPECT_THAT(decode(text(frameOf(32)) + "x" + text(frameOf(32))),
                 ElementsAre("0 QelMessage", "32: i_buffer bad eyecatcher"));

@@ -48,7 +48,7 @@ protected:
     {
         awaitEnd();
         EXPECT_EQ(admission->release().stream, nullptr);
-        EXPECT_THAT(log.lines(), Contains("W: [qel] the test: not let in: " + reason));
+        EXPECT_THAT(log.lines(), Contains("W: [qel] the test: refused: " + reason));
     }
 
     void send(const QelMessage& message) { QelMessageStream(*loopback.near, internal()).write(message); }
@@ -174,7 +174,7 @@ TEST_F(AdmissionTest, AConsoleThatDoesNotAskForTlsIsRefused)
     expectClosed();
     awaitEnd();
     EXPECT_EQ(admission->release().stream, nullptr);
-    EXPECT_THAT(log.lines(), Contains(HasSubstr("the test: not let in: the peer did not ask for TLS but sent "
+    EXPECT_THAT(log.lines(), Contains(HasSubstr("the test: refused: the peer did not ask for TLS but sent "
                                                 "something else: [CID: ")));
 }
 

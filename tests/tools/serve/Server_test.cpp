@@ -127,7 +127,7 @@ TEST_F(ServerTest, StopsWithoutWaitingForUnfinishedHandshakes)
     EXPECT_TRUE(isClosed(*silent));
     EXPECT_TRUE(isClosed(*stalled));
     EXPECT_TRUE(hasEnded());
-    EXPECT_THAT(log.lines(), Contains(EndsWith(": not let in: the server stops")));
+    EXPECT_THAT(log.lines(), Contains(EndsWith(": refused: the server stops")));
 }
 
 TEST_F(ServerTest, TheHandshakeDeadlineContinuesInsideTls)

@@ -196,7 +196,7 @@ TEST_F(VirtualSerialTest, OpeningAnEndedLineStartsTheCommandAgain)
     EXPECT_EQ(takeData(other, 1), "again");
 }
 
-TEST_F(VirtualSerialTest, OpeningAnEndedLineWhoseCommandRunsReadsTheEndAgain)
+TEST_F(VirtualSerialTest, OpeningAnEndedLineWhoseCommandRunsStartsTheCommandAgain)
 {
     Peer holder;
     Peer other;
@@ -206,15 +206,15 @@ TEST_F(VirtualSerialTest, OpeningAnEndedLineWhoseCommandRunsReadsTheEndAgain)
     port1->end.reset();
     hypervisor->serviceSerial(1);
     openSerial(other, 1, true);
-    expectClosed(holder, 1, 2);
+    expectClosed(holder, 1, 4, 0x0300);
+    EXPECT_EQ(port1->stopped, 1U);
+    EXPECT_EQ(port1->started, 2U);
+    port1->ended = false;
     EXPECT_FALSE(hypervisor->serviceEndedLines());
     EXPECT_EQ(setUp(other, 1), 0U);
-    EXPECT_THAT(watched(), ElementsAre(1));
+    port1->output = {"again"};
     hypervisor->serviceSerial(1);
-    EXPECT_TRUE(hypervisor->serviceEndedLines());
-    port1->end = CommandEnd{CommandEnd::Kind::Exited, 0};
-    EXPECT_FALSE(hypervisor->serviceEndedLines());
-    expectClosed(other, 1, 4, 0x0100);
+    EXPECT_EQ(takeData(other, 1), "again");
 }
 
 TEST_F(VirtualSerialTest, ALineThatCannotBeWrittenToEndsTheSession)

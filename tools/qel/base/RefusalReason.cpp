@@ -40,7 +40,7 @@ constexpr Row kReasons[] = {
      "this console does not hold $"},
     {kSerial, kAny, QelMessageStatusInvalidLparId, "the server does not have $"},
     {kSerial, kAny, QelMessageStatusInvalidConnectionNumber,
-     "$ does not have this serial connection; --connection 0 is the first"},
+     "$ does not have this serial connection; --connection 0 is the only one"},
 
     {kAny, kAny, QelMessageStatusInvalidFunction, "the server does not know this kind of request"},
     {kAny, kAny, QelMessageStatusInvalidOperation, "the server does not know this request"},

@@ -3,6 +3,7 @@
 #include <qel/common/util/PosixError.hpp>
 
 #include "base/Failures.hpp"
+#include "certificates/PemContent.hpp"
 
 #include <array>
 #include <cerrno>
@@ -17,15 +18,15 @@ namespace qel::tool {
 
 namespace {
 
-constexpr std::size_t kLongestName = 64;
-constexpr std::size_t kMostBytes = 1024 * 1024; // a certificate or a key has a few thousand
+constexpr std::size_t kMaxNameLength = 64;
+constexpr std::size_t kMaxBytes = 1024 * 1024; // a certificate or a key has a few thousand
 constexpr mode_t kOthersReadOrWrite = S_IRGRP | S_IWGRP | S_IROTH | S_IWOTH;
 constexpr const char* kNameStart = "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789";
 
 std::string checkName(std::string& name)
 {
     const std::string allowed = std::string(kNameStart) + "._-";
-    const bool isName = !name.empty() && name.size() <= kLongestName &&
+    const bool isName = !name.empty() && name.size() <= kMaxNameLength &&
                         name.find_first_not_of(allowed) == std::string::npos &&
                         std::string(kNameStart).find(name.front()) != std::string::npos;
     if (isName) return {};
@@ -63,7 +64,7 @@ std::string readAll(const UniqueFd& fd, const std::string& path)
         if (count < 0 && error == EINTR) continue;
         if (count < 0) throw FileIOError(error, "cannot read " + path);
         content.append(buffer.data(), static_cast<std::size_t>(count));
-        if (content.size() > kMostBytes) throw CommandFailure(ExitStatus::Refused, path + " is larger than 1 MiB");
+        if (content.size() > kMaxBytes) throw CommandFailure(ExitStatus::Refused, path + " is larger than 1 MiB");
     }
 }
 
@@ -145,13 +146,15 @@ std::string readKeyFile(const std::string& path, KeyPermissions permissions)
 {
     struct stat status;
     const UniqueFd fd = openFile(path, status);
-    const bool isOpenToOthers = (status.st_mode & kOthersReadOrWrite) != 0;
+    std::string content = readAll(fd, path);
+    // A certificate given as a key is nothing to hide; it is refused by its kind when it is parsed.
+    const bool isOpenToOthers = (status.st_mode & kOthersReadOrWrite) != 0 && !holdsNoKey(content);
     if (isOpenToOthers && permissions == KeyPermissions::OwnerOnly) {
         throw CommandFailure(ExitStatus::Refused, "others may read or write the private key " + path + " (mode " +
                                                       octal(status.st_mode) +
                                                       "): use chmod 600, or --insecure-permissions to allow it");
     }
-    return readAll(fd, path);
+    return content;
 }
 
 CredentialPaths credentialPaths(const std::string& directory, const std::string& name)

@@ -5,8 +5,10 @@
 #include "base/Failures.hpp"
 #include "certificates/CertificateView.hpp"
 
+#include <algorithm>
 #include <array>
 #include <string_view>
+#include <vector>
 
 namespace qel::tool {
 
@@ -37,6 +39,8 @@ constexpr std::array<Label, 11> kLabels{{
     {"RSA PUBLIC KEY", kPublicKey},
 }};
 
+constexpr std::string_view kBegin = "-----BEGIN ";
+
 bool contains(const std::string& text, const std::string& part) { return text.find(part) != std::string::npos; }
 
 bool holds(const std::string& pem, std::string_view kind)
@@ -46,6 +50,35 @@ bool holds(const std::string& pem, std::string_view kind)
     }
     return false;
 }
+
+/// The kind of the PEM block that begins at a position; empty for another label or a label that does not end.
+std::string_view kindOfBlock(const std::string& pem, std::size_t start)
+{
+    const std::size_t labelStart = start + kBegin.size();
+    const std::size_t labelEnd = pem.find("-----", labelStart);
+    if (labelEnd == std::string::npos) return {};
+    const std::string_view text = std::string_view(pem).substr(labelStart, labelEnd - labelStart);
+    for (const Label& label : kLabels) {
+        if (text != label.text) continue;
+        const std::string_view block = std::string_view(pem).substr(start, pem.find(kBegin, labelEnd) - start);
+        const bool isEncrypted = label.kind == kKey && block.find("Proc-Type: 4,ENCRYPTED") != std::string_view::npos;
+        return isEncrypted ? kEncryptedKey : label.kind;
+    }
+    return {};
+}
+
+/// The kinds of all blocks, in their order.
+std::vector<std::string_view> kindsIn(const std::string& pem)
+{
+    std::vector<std::string_view> kinds;
+    for (std::size_t at = pem.find(kBegin); at != std::string::npos; at = pem.find(kBegin, at + kBegin.size())) {
+        const std::string_view kind = kindOfBlock(pem, at);
+        if (!kind.empty()) kinds.push_back(kind);
+    }
+    return kinds;
+}
+
+bool isKey(std::string_view kind) { return kind == kKey || kind == kEncryptedKey; }
 
 [[noreturn]] void refuse(const std::string& reason) { throw CommandFailure(ExitStatus::Refused, reason); }
 
@@ -85,7 +118,9 @@ RSAPrivateKey parseKey(const std::string& path, const std::string& pem)
     try {
         return RSAPrivateKey(pem);
     } catch (const SSLException& error) {
-        if (describePem(pem) == kEncryptedKey) {
+        const std::vector<std::string_view> kinds = kindsIn(pem);
+        const auto firstKey = std::find_if(kinds.begin(), kinds.end(), isKey);
+        if (firstKey != kinds.end() && *firstKey == kEncryptedKey) {
             refuse(path + " holds an encrypted private key: keys are stored without a pass phrase");
         }
         const std::string type = privateKeyType(pem);
@@ -98,20 +133,16 @@ bool holdsCertificate(const std::string& pem) { return holds(pem, kCertificate);
 
 bool holdsRequest(const std::string& pem) { return holds(pem, kRequest); }
 
+bool holdsNoKey(const std::string& pem)
+{
+    const std::vector<std::string_view> kinds = kindsIn(pem);
+    return !kinds.empty() && std::none_of(kinds.begin(), kinds.end(), isKey);
+}
+
 std::string describePem(const std::string& pem)
 {
-    const std::string begin = "-----BEGIN ";
-    const std::size_t start = pem.find(begin);
-    if (start == std::string::npos) return {};
-    const std::size_t end = pem.find("-----", start + begin.size());
-    if (end == std::string::npos) return {};
-    const std::string text = pem.substr(start + begin.size(), end - start - begin.size());
-    for (const Label& label : kLabels) {
-        if (text != label.text) continue;
-        const bool isEncrypted = label.kind == kKey && contains(pem, "Proc-Type: 4,ENCRYPTED");
-        return std::string(isEncrypted ? kEncryptedKey : label.kind);
-    }
-    return {};
+    const std::vector<std::string_view> kinds = kindsIn(pem);
+    return kinds.empty() ? std::string() : std::string(kinds.front());
 }
 
 } // namespace qel::tool

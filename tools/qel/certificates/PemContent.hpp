@@ -33,7 +33,11 @@ bool holdsCertificate(const std::string& pem);
 /// Whether a PEM text holds a certificate request, which need not be well-formed.
 bool holdsRequest(const std::string& pem);
 
-/// The kind of the first object of a PEM text, such as "a private key", "an encrypted private key" or "a certificate".
+/// Whether a PEM text holds objects of known kinds, and none of them is a private key.
+bool holdsNoKey(const std::string& pem);
+
+/// The kind of the first object of a known kind in a PEM text, such as "a private key", "an encrypted private key" or
+/// "a certificate".
 /// @return empty for a text without a PEM object of a known kind
 std::string describePem(const std::string& pem);
 

@@ -54,7 +54,7 @@ void Admission::pRun() noexcept
     try {
         pShakeHands();
     } catch (const CommandFailure& failure) {
-        logLine(LogLevel::Warn, mPeer, ": not let in: ", failure.what());
+        logLine(LogLevel::Warn, mPeer, ": refused: ", failure.what());
     } catch (const std::exception& error) {
         logLine(LogLevel::Error, mPeer, ": ", explain(error));
     }

@@ -25,6 +25,8 @@ std::unique_ptr<QelMessage> closedNotice(const QelMessageVirtualSerialSessionClo
     return detailed;
 }
 
+constexpr CommandEnd kClosedTerminal{CommandEnd::Kind::ClosedTerminal, 0};
+
 } // namespace
 
 PartitionSet::PartitionSet() = default;
@@ -170,10 +172,9 @@ QelMessageStatusCodes PartitionSet::pFindPartition(std::uint16_t id, std::uint16
 
 bool PartitionSet::pStart(Partition& partition)
 {
-    if (pIsExiting(partition)) static_cast<void>(pFinishExit(partition));
+    if (pIsExiting(partition)) pEndLine(partition, partition.port->commandEnd().value_or(kClosedTerminal));
     try {
         partition.port->start();
-        partition.exitDeadline = PollDeadline();
         return true;
     } catch (const PosixError& error) {
         logLine(LogLevel::Error, "partition ", partition.id, ": ", error.what());
@@ -215,13 +216,18 @@ bool PartitionSet::pFinishExit(Partition& partition)
     std::optional<CommandEnd> end = partition.port->commandEnd();
     if (!end) {
         if (!partition.exitDeadline.isExpired(TimeProvider::steady())) return false;
-        end.emplace();
-        end->kind = CommandEnd::Kind::ClosedTerminal;
+        end = kClosedTerminal;
     }
-    logLine(LogLevel::Info, "partition ", partition.id, ": ", describe(*end),
-            partition.holder == nullptr ? ", with no session open" : "");
-    pTakeDown(partition, CloseReason::CloseReasonReadFailure, *end);
+    pEndLine(partition, *end);
     return true;
+}
+
+/// Takes the line of a command down, logs how it ended, and ends the session.
+void PartitionSet::pEndLine(Partition& partition, const CommandEnd& end)
+{
+    logLine(LogLevel::Info, "partition ", partition.id, ": ", describe(end),
+            partition.holder == nullptr ? ", with no session open" : "");
+    pTakeDown(partition, CloseReason::CloseReasonReadFailure, end);
 }
 
 void PartitionSet::pPumpInput(Partition& partition)

@@ -115,6 +115,7 @@ private:
     void pTakeDown(Partition& partition, CloseReason reason, const CommandEnd& end = {});
     void pBeginExit(Partition& partition);
     bool pFinishExit(Partition& partition);
+    void pEndLine(Partition& partition, const CommandEnd& end);
     void pPumpInput(Partition& partition);
     void pPumpOutput(Partition& partition);
     static bool pIsExiting(const Partition& partition);

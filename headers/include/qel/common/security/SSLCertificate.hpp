@@ -55,9 +55,8 @@ public:
 
     /// Makes a self-signed root with a new key (getPrivateKey()) and a random serial number, signed with SHA-256 and
     /// RSA. An empty subject is allowed.
-    /// @throws SSLException  "An SSL error occurred at ...": also when a field or value is not accepted, or a
-    /// certificate
-    ///                       cannot express the period
+    /// @throws SSLException  "An SSL error occurred at ...": also when a field or value is not accepted, or the
+    ///                       period does not fit a certificate
     SSLCertificate(const SSLSubject& subject, const SSLValidityPeriod& validity);
 
     /// Starts the certificate to be issued for a request: carries a copy of the request's key, if it has one, and is
@@ -105,9 +104,8 @@ public:
     /// @throws SSLException  "An SSL error occurred at ...": a value is not a text
     SSLSubject getIssuer() const;
 
-    /// @return the serial number in upper-case hexadecimal, two digits a byte ("0" for the number 0), with a leading
-    /// "-"
-    ///         when it is negative. An authority uses each number once, so issuer and number identify a certificate.
+    /// @return the serial number in upper-case hexadecimal, two digits a byte ("0" for the number 0), after a "-" when
+    ///         it is negative. An authority uses each number once, so issuer and number identify a certificate.
     /// @throws SSLException  "An SSL error occurred at ..."
     std::string getSerialNumber() const;
 

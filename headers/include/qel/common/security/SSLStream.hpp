@@ -95,9 +95,8 @@ public:
     /// If invalid or closing TLS records follow good data and the buffer has room for more than that data, the
     /// exception discards the data. A reader that requests exactly the bytes it expects is not affected.
     /// @param buffer  receives up to length bytes; undefined after an exception
-    /// @return the number of bytes read; 0 at the end of the underlying stream, and for length 0. The end does not
-    /// change
-    ///         the status.
+    /// @return the number of bytes read; 0 at the end of the underlying stream, and for length 0. The end keeps the
+    ///         status as it is.
     /// @throws StreamIOException  "Invalid state for SSL stream operation": no handshake yet, or closed; the stream is
     ///                            unchanged. "SSL error " and a number: 6 when the peer closed TLS, 1 for invalid
     ///                            records. "SSL stream peer attempted renegotiation". "BIO_write failed". Exceptions of
@@ -106,9 +105,8 @@ public:
 
     /// Encrypts and writes all bytes. For length 0, sends nothing.
     /// @param buffer  length bytes, borrowed for the call
-    /// @throws StreamIOException  "Invalid state for SSL stream operation", as read(). "SSL error " and a number, for
-    /// example
-    ///                            5 when the reader has met a fatal error meanwhile.
+    /// @throws StreamIOException  "Invalid state for SSL stream operation", as read(). "SSL error " and a
+    ///                            number, such as 5 when the reader has met a fatal error meanwhile.
     ///                            "SSL stream peer attempted renegotiation". "BIO_read failed". Exceptions of the
     ///                            underlying stream propagate unchanged. All but the first close the stream.
     void write(const char* buffer, std::size_t length) override;
