@@ -3,23 +3,31 @@
 #include <qel/common/util/PosixError.hpp>
 
 #include "base/Logging.hpp"
+#include "base/UniqueFd.hpp"
+#include "support/Allocations.hpp"
 #include "support/CapturedLog.hpp"
 #include "support/TemporaryDirectory.hpp"
 
+#include <array>
+#include <fcntl.h>
+#include <future>
 #include <gmock/gmock.h>
 #include <sys/stat.h>
+#include <unistd.h>
 
 namespace qel::test {
 
 namespace {
 
 using ::testing::ElementsAre;
+using ::testing::EndsWith;
 using ::testing::HasSubstr;
 using ::testing::IsEmpty;
 using ::testing::Not;
 using ::testing::StrEq;
 using ::testing::ThrowsMessage;
 using tool::LogOptions;
+using tool::UniqueFd;
 
 class LoggingTest : public ::testing::Test {
 protected:
@@ -82,6 +90,59 @@ TEST_F(LoggingTest, WithoutADirectoryTheLogIsStandardError)
     const std::string text = ::testing::internal::GetCapturedStderr();
     EXPECT_THAT(text, HasSubstr("(E): [qel] to be seen\n"));
     EXPECT_THAT(text, Not(HasSubstr("not to be seen")));
+}
+
+TEST_F(LoggingTest, WithoutMemoryALineToStandardErrorIsStillWritten)
+{
+    QEL_TEST_NEEDS_ALLOCATIONS();
+    LogOptions options;
+    options.level = "info";
+    tool::startLogging(options, "name.log");
+    ::testing::internal::CaptureStderr();
+    const std::string line(1000, 'x');
+    QelLogger& logger = tool::programLogger();
+    Allocations allocations;
+    allocations.failAll();
+    EXPECT_NO_THROW(logger.send(LogLevel::Info, line)); // what throws here ends the process in practice
+    EXPECT_EQ(allocations.count(), 0U);
+    allocations.succeedAgain();
+    EXPECT_EQ(::testing::internal::GetCapturedStderr(), line + "\n");
+}
+
+TEST_F(LoggingTest, ALineLongerThanAPipeIsWrittenWhole)
+{
+    std::array<int, 2> pipe{};
+    ASSERT_EQ(::pipe(pipe.data()), 0);
+    const UniqueFd readEnd(pipe[0]);
+    ASSERT_NE(::fcntl(pipe[1], F_SETPIPE_SZ, 4096), -1);
+    LogOptions options;
+    options.level = "info";
+    tool::startLogging(options, "name.log");
+    const UniqueFd before(::dup(STDERR_FILENO));
+    ASSERT_EQ(::dup2(pipe[1], STDERR_FILENO), STDERR_FILENO);
+    ::close(pipe[1]);
+    const std::string text(20000, 'x');
+    auto written = std::async(std::launch::async, [&] {
+        tool::logLine(LogLevel::Info, text);
+        ::dup2(before.get(), STDERR_FILENO); // ends the pipe
+    });
+    std::string read;
+    std::array<char, 512> part{};
+    for (ssize_t count = 0; (count = ::read(readEnd.get(), part.data(), part.size())) > 0;)
+        read.append(part.data(), static_cast<std::size_t>(count));
+    written.get();
+    EXPECT_THAT(read, EndsWith("[qel] " + text + "\n"));
+}
+
+TEST_F(LoggingTest, ALineToAClosedStandardErrorIsDropped)
+{
+    LogOptions options;
+    options.level = "info";
+    tool::startLogging(options, "name.log");
+    const UniqueFd before(::dup(STDERR_FILENO));
+    ::close(STDERR_FILENO);
+    EXPECT_NO_THROW(tool::programLogger().send(LogLevel::Info, "to nobody"));
+    ASSERT_EQ(::dup2(before.get(), STDERR_FILENO), STDERR_FILENO);
 }
 
 struct Case {

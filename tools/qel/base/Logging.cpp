@@ -10,14 +10,17 @@
 #include "base/Text.hpp"
 #include "base/UniqueFd.hpp"
 
+#include <algorithm>
+#include <array>
 #include <cctype>
 #include <cerrno>
-#include <cstdio>
+#include <cstring>
 #include <exception>
 #include <fcntl.h>
 #include <filesystem>
 #include <memory>
 #include <sstream>
+#include <sys/uio.h>
 #include <system_error>
 #include <unistd.h>
 
@@ -25,17 +28,35 @@ namespace qel::tool {
 
 namespace {
 
-/// Lines to standard error: standard output belongs to what the commands print.
+/// Lines to standard error: standard output belongs to what the commands print. Output errors are ignored. It allocates
+/// nothing, since an exception in a back-end ends the process.
 class LogBackendStderr final : public LogBackendFiltered {
 public:
     LogBackendStderr() : LogBackendFiltered(LogLevel::Inherit) {}
 
 private:
-    void pLog(const std::string& line) override
+    void pLog(const std::string& line) noexcept override
     {
+        const char* const lineEnd = lineEndOf(STDERR_FILENO);
         // One call for each line, so that lines of several processes on a terminal do not mix.
-        const std::string whole = line + lineEndOf(STDERR_FILENO);
-        static_cast<void>(std::fwrite(whole.data(), 1, whole.size(), stderr));
+        std::array<iovec, 2> pieces{
+            {{const_cast<char*>(line.data()), line.size()}, {const_cast<char*>(lineEnd), std::strlen(lineEnd)}}};
+        while (pieces.back().iov_len > 0) {
+            const ssize_t written = ::writev(STDERR_FILENO, pieces.data(), static_cast<int>(pieces.size()));
+            if (written < 0 && errno != EINTR) return;
+            if (written > 0) pSkip(pieces, static_cast<std::size_t>(written));
+        }
+    }
+
+    /// Leaves what has not been written: a full pipe takes a part of a line.
+    static void pSkip(std::array<iovec, 2>& pieces, std::size_t written) noexcept
+    {
+        for (iovec& piece : pieces) {
+            const std::size_t taken = std::min(written, piece.iov_len);
+            piece.iov_base = static_cast<char*>(piece.iov_base) + taken;
+            piece.iov_len -= taken;
+            written -= taken;
+        }
     }
 };
 

@@ -140,4 +140,11 @@ bool isLoopback(const IPAddress& address)
     return ipv6.str() == "::1";
 }
 
+void describeOption(CLI::App& command, const std::string& name, const std::string& description)
+{
+    for (CLI::Option* option : command.get_options()) {
+        if (option->get_name() == name) option->description(description);
+    }
+}
+
 } // namespace qel::tool

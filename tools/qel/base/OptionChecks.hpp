@@ -43,4 +43,9 @@ CLI::Validator fileValidator();
 /// True for 127.0.0.0/8, ::1, and 127.0.0.0/8 as IPv4-mapped IPv6 addresses.
 bool isLoopback(const IPAddress& address);
 
+/// Replaces the description of an option that others have added. CLI::App::get_option() would end the process for want
+/// of memory.
+/// @param name  with its dashes, such as "--timeout"; an option of the command
+void describeOption(CLI::App& command, const std::string& name, const std::string& description);
+
 } // namespace qel::tool

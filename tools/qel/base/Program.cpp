@@ -8,6 +8,7 @@
 #include <exception>
 #include <fcntl.h>
 #include <iostream>
+#include <new>
 #include <string>
 #include <unistd.h>
 
@@ -15,16 +16,30 @@ namespace qel::tool {
 
 namespace {
 
+constexpr const char* kName = "qel";
+constexpr const char* kDescription = "Server and console of the QEL management protocol";
 constexpr const char* kVersionText = "qel " QEL_PROGRAM_VERSION;
 
-ExitStatus report(const std::exception& error)
+ExitStatus report(const std::exception& error) noexcept
 {
-    std::cerr << "qel: " << userMessage(error) << std::endl;
-    return exitStatusOf(error);
+    if (dynamic_cast<const std::bad_alloc*>(&error) == nullptr) {
+        try {
+            std::cerr << "qel: " << userMessage(error) << std::endl;
+            return exitStatusOf(error);
+        } catch (const std::exception&) { // no memory for the reason
+        }
+    }
+    static_cast<void>(std::fputs("qel: out of memory\n", stderr)); // allocates nothing
+    return ExitStatus::Failed;
 }
 
-ExitStatus parseAndRun(CLI::App& app, Action& action, int argc, const char* const* argv)
+ExitStatus parseAndRun(AddCommands addCommands, int argc, const char* const* argv)
 {
+    CLI::App app(kDescription, kName);
+    Action action;
+    addStandardFlags(app);
+    app.require_subcommand(1);
+    addCommands(app, action);
     try {
         app.parse(argc, argv);
     } catch (const CLI::ParseError& error) {
@@ -61,12 +76,12 @@ CLI::App& addCommand(CLI::App& parent, const char* name, const char* description
     return *command;
 }
 
-int runProgram(CLI::App& app, Action& action, int argc, const char* const* argv) noexcept
+int runProgram(AddCommands addCommands, int argc, const char* const* argv) noexcept
 {
     reserveStandardDescriptors();
     ExitStatus status = ExitStatus::Failed;
     try {
-        status = parseAndRun(app, action, argc, argv);
+        status = parseAndRun(addCommands, argc, argv);
     } catch (const std::exception& error) {
         status = report(error);
     }

@@ -20,10 +20,14 @@ void addJsonOption(CLI::App& app, bool& json);
 /// @return the subcommand, owned by `parent`
 CLI::App& addCommand(CLI::App& parent, const char* name, const char* description);
 
-/// Parses the command line, runs the chosen action, and reports failures on standard error as "qel: reason".
-/// @param action  set by the subcommands of `app` during parsing
+/// Adds the subcommands to the command line.
+/// @param action  set by the subcommands during parsing
+using AddCommands = void (*)(CLI::App& app, Action& action);
+
+/// Builds and parses the command line, runs the chosen action, and reports failures on standard error as "qel: reason".
+/// A want of memory is reported too, at whatever step it occurs.
 /// @return the exit status of the process
-int runProgram(CLI::App& app, Action& action, int argc, const char* const* argv) noexcept;
+int runProgram(AddCommands addCommands, int argc, const char* const* argv) noexcept;
 
 /// Opens /dev/null for each standard descriptor that was closed when this process started. Otherwise a socket could get
 /// its number, and be read as standard input or receive messages for the user. runProgram() calls it first.

@@ -178,11 +178,10 @@ CLI::App& addBenchCommand(CLI::App& parent, Action& action)
     CLI::App& command = addCommand(parent, "bench", "Put load on a server and measure its latency");
     const auto options = std::make_shared<BenchOptions>();
     addConnectOptions(command, options->connect);
-    command.get_option("--timeout")
-        ->description("Timeout in seconds: for each connection to be made, then for each message");
-    command.get_option("--tool-id")
-        ->description("Prefix of the consoles' tool ids, at most 28 bytes; a dash and a number follow (default: "
-                      "qel-<process id>)");
+    describeOption(command, "--timeout", "Timeout in seconds: for each connection to be made, then for each message");
+    describeOption(command, "--tool-id",
+                   "Prefix of the consoles' tool ids, at most 28 bytes; a dash and a number follow (default: "
+                   "qel-<process id>)");
     addLoadOptions(command, *options);
     addJsonOption(command, options->json);
     options->log.usual = LogLevel::Warn;

@@ -205,9 +205,9 @@ CLI::App& addConsoleCommand(CLI::App& parent, Action& action)
         ->type_name("PARTITION")
         ->transform(integerIn(0, 65535));
     addConnectOptions(command, options->connect);
-    command.get_option("--timeout")
-        ->description("Timeout in seconds: one for connecting and opening the session, then one for each response and "
-                      "for each message once it has begun");
+    describeOption(command, "--timeout",
+                   "Timeout in seconds: one for connecting and opening the session, then one for each response and "
+                   "for each message once it has begun");
     command.add_option("--connection", options->address.connection, "Serial connection of the partition")
         ->type_name("N")
         ->transform(integerIn(0, 65535))

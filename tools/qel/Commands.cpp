@@ -1,0 +1,22 @@
+#include "Commands.hpp"
+
+#include "bench/BenchCommand.hpp"
+#include "certificates/CaCommand.hpp"
+#include "client/CallCommand.hpp"
+#include "console/ConsoleCommand.hpp"
+#include "decode/DecodeCommand.hpp"
+#include "serve/ServeCommand.hpp"
+
+namespace qel::tool {
+
+void addCommands(CLI::App& app, Action& action)
+{
+    addServeCommand(app, action);
+    addCallCommand(app, action);
+    addConsoleCommand(app, action);
+    addBenchCommand(app, action);
+    addDecodeCommand(app, action);
+    addCaCommand(app, action);
+}
+
+} // namespace qel::tool
