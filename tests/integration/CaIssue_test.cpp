@@ -1,11 +1,11 @@
 // Making roots, requests and certificates with "qel ca", and what it refuses to sign.
 
+#include <qel/common/security/CertificateFacts.hpp>
 #include <qel/common/security/RSAPrivateKey.hpp>
 #include <qel/common/security/SSLCertificate.hpp>
 #include <qel/common/security/SSLCertificateRequest.hpp>
+#include <qel/protocol/CertificateState.hpp>
 
-#include "certificates/CertificateState.hpp"
-#include "certificates/CertificateView.hpp"
 #include "integration/CaKit.hpp"
 #include "support/ForeignKey.hpp"
 #include "support/MemoryBio.hpp"
@@ -42,10 +42,10 @@ TEST_F(Ca, InitMakesARootThatSignsItself)
     EXPECT_EQ(result.errors, "");
     const SSLCertificate root(read("root.crt"),
                               RSAPrivateKey(read("root.key"))); // which looks whether they belong together
-    const auto facts = tool::factsOf(root);
+    const auto facts = factsOf(root);
     EXPECT_EQ(result.output, "key file:         " + file("root.key") + "\n" + "certificate file: " + file("root.crt") +
                                  "\n" + "subject:          CN=Our root,O=Example\n" +
-                                 "valid until:      " + tool::isoTime(facts.validity.getNotAfter()) + "\n" +
+                                 "valid until:      " + protocol::isoTime(facts.validity.getNotAfter()) + "\n" +
                                  "SHA-256:          " + facts.fingerprint + "\n");
     EXPECT_THAT(names(), ElementsAre("root.crt", "root.key"));
     EXPECT_EQ(root.getSubject(), (SSLSubject{{"CN", "Our root"}, {"O", "Example"}}));
@@ -72,7 +72,7 @@ TEST_F(Ca, RequestMakesAKeyAndARequest)
                                  "\n" + "subject:      CN=console,O=a\\,b\n");
     EXPECT_THAT(names(), ElementsAre("console.csr", "console.key"));
     const SSLCertificateRequest request(read("console.csr"), RSAPrivateKey(read("console.key")));
-    EXPECT_TRUE(tool::isSignatureValid(request));
+    EXPECT_TRUE(isSignatureValid(request));
 }
 
 TEST_F(Ca, SignIssuesACertificateForTheRequest)
@@ -84,9 +84,9 @@ TEST_F(Ca, SignIssuesACertificateForTheRequest)
     EXPECT_EQ(result.exitStatus, 0);
     EXPECT_EQ(result.errors, "");
     const SSLCertificate issued = certificate("server.crt");
-    const auto facts = tool::factsOf(issued);
+    const auto facts = factsOf(issued);
     EXPECT_EQ(result.output, "certificate file: " + file("server.crt") + "\n" + "subject:          CN=server\n" +
-                                 "valid until:      " + tool::isoTime(facts.validity.getNotAfter()) + "\n" +
+                                 "valid until:      " + protocol::isoTime(facts.validity.getNotAfter()) + "\n" +
                                  "SHA-256:          " + facts.fingerprint + "\n");
     EXPECT_EQ(issued.getSubject(), (SSLSubject{{"CN", "server"}}));
     EXPECT_EQ(issued.getIssuer(), certificate("root.crt").getSubject());
@@ -107,11 +107,11 @@ TEST_F(Ca, IssueMakesKeyRequestAndCertificate)
     const RSAPrivateKey key(read("console.key"));
     const SSLCertificate issued(read("console.crt"), key);
     EXPECT_NO_THROW(SSLCertificateRequest(read("console.csr"), key));
-    const auto facts = tool::factsOf(issued);
+    const auto facts = factsOf(issued);
     EXPECT_EQ(result.output, "key file:         " + file("console.key") + "\n" +
                                  "request file:     " + file("console.csr") + "\n" +
                                  "certificate file: " + file("console.crt") + "\n" + "subject:          CN=console\n" +
-                                 "valid until:      " + tool::isoTime(facts.validity.getNotAfter()) + "\n" +
+                                 "valid until:      " + protocol::isoTime(facts.validity.getNotAfter()) + "\n" +
                                  "SHA-256:          " + facts.fingerprint + "\n");
     EXPECT_EQ(facts.validity.getNotAfter() - facts.validity.getNotBefore(), hours(366 * 24));
 }
@@ -242,7 +242,7 @@ TEST_F(Ca, SignTakesRsaKeysFrom2048Bits)
     for (const int bits : {2048, 3072}) {
         write("foreign.csr", foreignRequest(foreignKey(EVP_PKEY_RSA, bits)));
         EXPECT_EQ(runCa({"sign", path(), "foreign", "--force"}).exitStatus, 0) << bits;
-        EXPECT_EQ(tool::factsOf(certificate("foreign.crt")).key.bits, bits);
+        EXPECT_EQ(factsOf(certificate("foreign.crt")).key.bits, bits);
     }
 }
 
@@ -297,7 +297,7 @@ TEST_F(Ca, ARootThatHasExpiredSignsNothing)
     write("root.crt", root.getPEM());
     const auto result = runCa({"sign", path(), "server"});
     EXPECT_EQ(result.exitStatus, 1);
-    EXPECT_EQ(result.errors, "qel: the root expired at " + tool::isoTime(root.getValidityPeriod().getNotAfter()) +
+    EXPECT_EQ(result.errors, "qel: the root expired at " + protocol::isoTime(root.getValidityPeriod().getNotAfter()) +
                                  ": no peer would accept the certificate\n");
     EXPECT_THAT(names(), ElementsAre("root.crt", "root.key", "server.csr"));
 }
@@ -308,7 +308,7 @@ TEST_F(Ca, WarnsAboutACertificateThatOutlivesTheRoot)
     const auto result = runCa({"sign", path(), "server", "--days", "3651"});
     EXPECT_EQ(result.exitStatus, 0);
     EXPECT_EQ(result.errors, "qel: note: the root expires first, at " +
-                                 tool::isoTime(certificate("root.crt").getValidityPeriod().getNotAfter()) + "\n");
+                                 protocol::isoTime(certificate("root.crt").getValidityPeriod().getNotAfter()) + "\n");
     EXPECT_EQ(runCa({"sign", path(), "server", "--days", "3649", "--force"}).errors, "");
 }
 

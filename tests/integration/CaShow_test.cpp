@@ -1,11 +1,11 @@
 // Reading certificates and requests with "qel ca show" and "qel ca check".
 
+#include <qel/common/security/CertificateFacts.hpp>
 #include <qel/common/security/RSAPrivateKey.hpp>
 #include <qel/common/security/SSLCertificate.hpp>
 #include <qel/common/security/SSLCertificateRequest.hpp>
+#include <qel/protocol/CertificateState.hpp>
 
-#include "certificates/CertificateState.hpp"
-#include "certificates/CertificateView.hpp"
 #include "integration/CaKit.hpp"
 
 #include <filesystem>
@@ -33,7 +33,7 @@ TEST_F(Ca, ShowPrintsACertificate)
 {
     const std::string name = shared() + "/server.crt";
     const SSLCertificate server(readShared("server.crt"));
-    const auto facts = tool::factsOf(server);
+    const auto facts = factsOf(server);
     const auto result = runCa({"show", name});
     EXPECT_EQ(result.exitStatus, 0);
     EXPECT_EQ(result.errors, "");
@@ -42,8 +42,8 @@ TEST_F(Ca, ShowPrintsACertificate)
                              "issuer:      CN=Our root,O=Example\n"
                              "serial:      " +
                                  server.getSerialNumber() + "\n" +
-                                 "valid from:  " + tool::isoTime(facts.validity.getNotBefore()) + "\n" +
-                                 "valid until: " + tool::isoTime(facts.validity.getNotAfter()) + "\n" +
+                                 "valid from:  " + protocol::isoTime(facts.validity.getNotBefore()) + "\n" +
+                                 "valid until: " + protocol::isoTime(facts.validity.getNotAfter()) + "\n" +
                                  "key type:    RSA\n"
                                  "key bits:    2048\n"
                                  "SHA-256:     " +
@@ -55,7 +55,7 @@ TEST_F(Ca, ShowPrintsACertificate)
 TEST_F(Ca, ShowPrintsACertificateAsJson)
 {
     const SSLCertificate server(readShared("server.crt"));
-    const auto facts = tool::factsOf(server);
+    const auto facts = factsOf(server);
     const auto result = runCa({"show", "--json", shared() + "/server.crt"});
     EXPECT_EQ(result.exitStatus, 0);
     const Json expected{
@@ -65,8 +65,8 @@ TEST_F(Ca, ShowPrintsACertificateAsJson)
         {"issuer", "CN=Our root,O=Example"},
         {"issuerFields", Json::array({{{"name", "CN"}, {"value", "Our root"}}, {{"name", "O"}, {"value", "Example"}}})},
         {"serial", server.getSerialNumber()},
-        {"notBefore", tool::isoTime(facts.validity.getNotBefore())},
-        {"notAfter", tool::isoTime(facts.validity.getNotAfter())},
+        {"notBefore", protocol::isoTime(facts.validity.getNotBefore())},
+        {"notAfter", protocol::isoTime(facts.validity.getNotAfter())},
         {"keyType", "RSA"},
         {"keyBits", 2048},
         {"sha256", facts.fingerprint},
@@ -85,7 +85,7 @@ TEST_F(Ca, ShowPrintsARequest)
                              "key type:  RSA\n"
                              "key bits:  2048\n"
                              "SHA-256:   " +
-                                 tool::factsOf(request).fingerprint + "\n");
+                                 factsOf(request).fingerprint + "\n");
 
     SSLCertificateRequest changed(request);
     const RSAPrivateKey root(readShared("root.key"));
@@ -175,8 +175,8 @@ TEST_F(Ca, CheckReportsByExitStatus)
         EXPECT_EQ(result.exitStatus, row.status);
         EXPECT_EQ(result.errors, "");
         EXPECT_EQ(result.output, std::string("state:       ") + row.state + "\n" +
-                                     "valid from:  " + tool::isoTime(row.from) + "\n" +
-                                     "valid until: " + tool::isoTime(row.until) + "\n");
+                                     "valid from:  " + protocol::isoTime(row.from) + "\n" +
+                                     "valid until: " + protocol::isoTime(row.until) + "\n");
     }
 }
 
@@ -191,8 +191,8 @@ TEST_F(Ca, CheckPrintsJson)
     const auto json = Json::parse(result.output);
     ASSERT_EQ(json.size(), 4U);
     EXPECT_EQ(json["state"], "due");
-    EXPECT_EQ(json["notBefore"], tool::isoTime(now - hours(24)));
-    EXPECT_EQ(json["notAfter"], tool::isoTime(until));
+    EXPECT_EQ(json["notBefore"], protocol::isoTime(now - hours(24)));
+    EXPECT_EQ(json["notAfter"], protocol::isoTime(until));
     EXPECT_LE(json["secondsLeft"].get<long long>(), 24 * 3600);
     EXPECT_GE(json["secondsLeft"].get<long long>(), (until - after).count());
 }

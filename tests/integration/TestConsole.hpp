@@ -5,8 +5,8 @@
 #include <qel/common/QelMessageVirtualSerial.hpp>
 #include <qel/common/net/SocketStream.hpp>
 
+#include "support/LoopbackEnds.hpp"
 #include "support/Process.hpp"
-#include "tools/transport/Loopback.hpp"
 
 #include <map>
 #include <memory>

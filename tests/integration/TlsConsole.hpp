@@ -4,7 +4,7 @@
 #include <qel/common/security/SSLContext.hpp>
 #include <qel/common/security/SSLStream.hpp>
 
-#include "tools/transport/Loopback.hpp"
+#include "support/LoopbackEnds.hpp"
 
 #include <memory>
 #include <string>

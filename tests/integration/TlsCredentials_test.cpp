@@ -5,8 +5,8 @@
 #include <qel/common/QelMessageVirtualSerial.hpp>
 #include <qel/common/Utilities.hpp>
 #include <qel/common/io/StreamIOException.hpp>
+#include <qel/common/security/CertificateFacts.hpp>
 
-#include "certificates/CertificateView.hpp"
 #include "integration/TlsConsole.hpp"
 #include "integration/TlsTest.hpp"
 #include "integration/WrongServer.hpp"
@@ -235,7 +235,7 @@ TEST_F(Tls, SighupLoadsTheCredentialsForNewConnections)
 
     const Authority& authority = Authority::trusted();
     const SSLCertificate fresh = authority.issue(authority.serverRequest(), SSLValidityPeriod::days(1));
-    const Arguments pin{"--peer-fingerprint", tool::fingerprintOf(fresh)};
+    const Arguments pin{"--peer-fingerprint", fingerprintOf(fresh)};
     directory.put("server", authority.credentialsOf(fresh));
     EXPECT_EQ(call(*server, pin).exitStatus, 1) << "before SIGHUP";
     server->process().signal(SIGHUP);
@@ -245,7 +245,7 @@ TEST_F(Tls, SighupLoadsTheCredentialsForNewConnections)
     EXPECT_EQ(result.exitStatus, 0) << result.errors;
 
     EXPECT_EQ(old.messages().ask(QelMessageGetQelTodReq())->getStatus(), 0U);
-    EXPECT_EQ(tool::fingerprintOf(*old.tls().getPeerCertificate()), tool::fingerprintOf(authority.server()));
+    EXPECT_EQ(fingerprintOf(*old.tls().getPeerCertificate()), fingerprintOf(authority.server()));
     server->stop();
 }
 
@@ -277,7 +277,7 @@ TEST_F(Tls, SighupKeepsTheOldCredentialsWhenTheNewOnesCannotBeUsed)
     ASSERT_EQ(::unlink(directory.file("server.crt").c_str()), 0);
     server->process().signal(SIGHUP);
     server->process().awaitErrors(line + "cannot open " + directory.file("server.crt"));
-    const Arguments pin{"--peer-fingerprint", tool::fingerprintOf(Authority::trusted().server())};
+    const Arguments pin{"--peer-fingerprint", fingerprintOf(Authority::trusted().server())};
     EXPECT_EQ(call(*server, pin).exitStatus, 0);
     EXPECT_EQ(old.messages().ask(QelMessageGetQelTodReq())->getStatus(), 0U);
     server->stop();

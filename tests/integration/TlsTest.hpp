@@ -2,8 +2,8 @@
 
 #include <qel/common/QelMessage.hpp>
 #include <qel/common/Utilities.hpp>
+#include <qel/protocol/CertificateState.hpp>
 
-#include "certificates/CertificateState.hpp"
 #include "integration/TestConsole.hpp"
 #include "support/CredentialDirectory.hpp"
 
@@ -58,8 +58,8 @@ protected:
     }
 
     /// The first and the last second of a certificate in the directory, as messages print it.
-    std::string startOf(const std::string& file) const { return tool::isoTime(validityOf(file).getNotBefore()); }
-    std::string endOf(const std::string& file) const { return tool::isoTime(validityOf(file).getNotAfter()); }
+    std::string startOf(const std::string& file) const { return protocol::isoTime(validityOf(file).getNotBefore()); }
+    std::string endOf(const std::string& file) const { return protocol::isoTime(validityOf(file).getNotAfter()); }
 
     SSLValidityPeriod validityOf(const std::string& file) const
     {

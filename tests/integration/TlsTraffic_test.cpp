@@ -1,6 +1,7 @@
 // The program at both ends of a TLS connection: traffic, and pins.
 
-#include "certificates/CertificateView.hpp"
+#include <qel/common/security/CertificateFacts.hpp>
+
 #include "integration/TlsTest.hpp"
 
 #include <cctype>
@@ -24,7 +25,7 @@ TEST_F(Tls, CallWorksOverTls)
     EXPECT_EQ(result.errors, "");
     EXPECT_THAT(server->stop().errors, AllOf(HasSubstr("(I): SSLStream protocol init complete: TLSv1.3 "),
                                              HasSubstr(": over TLS: \"CN=client\", SHA-256 " +
-                                                       tool::fingerprintOf(Authority::trusted().client()) + "\n")));
+                                                       fingerprintOf(Authority::trusted().client()) + "\n")));
 }
 
 TEST_F(Tls, ReadsCredentialsFromThreeFiles)
@@ -116,7 +117,7 @@ TEST_F(Tls, AKilledServerEndsTheConsole)
 TEST_F(Tls, CallChecksThePinsOfTheServer)
 {
     const auto server = serve({"--log-level", "warn"});
-    const std::string fingerprint = tool::fingerprintOf(Authority::trusted().server());
+    const std::string fingerprint = fingerprintOf(Authority::trusted().server());
     std::string bare;
     for (const char character : fingerprint) {
         if (character != ':') bare += static_cast<char>(std::tolower(static_cast<unsigned char>(character)));
@@ -162,7 +163,7 @@ TEST_F(Tls, ServeChecksThePinsOfConsoles)
         StartsWith("qel: the server closed the connection right after the TLS handshake; it may not accept this "
                    "console's certificate: "));
     EXPECT_THAT(server->stop().errors, HasSubstr(": refused: wrong peer: the name "
-                                                 "\"server\" does not match --peer-name\n"));
+                                                 "\"server\" does not match the pinned names\n"));
 }
 
 } // namespace

@@ -1,8 +1,8 @@
 #include <qel/common/util/PosixError.hpp>
+#include <qel/common/util/UniqueFd.hpp>
 
 #include "base/DescriptorOutput.hpp"
 #include "base/TerminalMode.hpp"
-#include "base/UniqueFd.hpp"
 #include "support/Pty.hpp"
 #include "support/TemporaryDirectory.hpp"
 
@@ -24,7 +24,6 @@ using ::testing::StrEq;
 using ::testing::ThrowsMessage;
 using tool::DescriptorOutput;
 using tool::TerminalMode;
-using tool::UniqueFd;
 
 /// A pipe with room for so many bytes.
 struct Pipe {

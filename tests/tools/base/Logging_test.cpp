@@ -1,9 +1,9 @@
 #include <qel/common/QelDebug.hpp>
 #include <qel/common/Utilities.hpp>
 #include <qel/common/util/PosixError.hpp>
+#include <qel/common/util/UniqueFd.hpp>
 
 #include "base/Logging.hpp"
-#include "base/UniqueFd.hpp"
 #include "support/Allocations.hpp"
 #include "support/CapturedLog.hpp"
 #include "support/TemporaryDirectory.hpp"
@@ -27,7 +27,6 @@ using ::testing::Not;
 using ::testing::StrEq;
 using ::testing::ThrowsMessage;
 using tool::LogOptions;
-using tool::UniqueFd;
 
 class LoggingTest : public ::testing::Test {
 protected:
@@ -100,7 +99,7 @@ TEST_F(LoggingTest, WithoutMemoryALineToStandardErrorIsStillWritten)
     tool::startLogging(options, "name.log");
     ::testing::internal::CaptureStderr();
     const std::string line(1000, 'x');
-    QelLogger& logger = tool::programLogger();
+    QelLogger& logger = protocol::logger();
     Allocations allocations;
     allocations.failAll();
     EXPECT_NO_THROW(logger.send(LogLevel::Info, line)); // what throws here ends the process in practice
@@ -141,7 +140,7 @@ TEST_F(LoggingTest, ALineToAClosedStandardErrorIsDropped)
     tool::startLogging(options, "name.log");
     const UniqueFd before(::dup(STDERR_FILENO));
     ::close(STDERR_FILENO);
-    EXPECT_NO_THROW(tool::programLogger().send(LogLevel::Info, "to nobody"));
+    EXPECT_NO_THROW(protocol::logger().send(LogLevel::Info, "to nobody"));
     ASSERT_EQ(::dup2(before.get(), STDERR_FILENO), STDERR_FILENO);
 }
 

@@ -2,8 +2,8 @@
 
 #include "base/Failures.hpp"
 #include "bench/BenchRun.hpp"
+#include "support/LoopbackEnds.hpp"
 #include "tools/bench/FakeBenchPair.hpp"
-#include "tools/transport/Loopback.hpp"
 
 #include <array>
 #include <atomic>

@@ -89,18 +89,6 @@ auto refused(const std::string& text)
         AllOf(Property(&Exception::what, StrEq(text)), Property(&Exception::getExitStatus, ExitStatus::Refused)));
 }
 
-TEST_F(CredentialFilesTest, LieInADirectoryByName)
-{
-    const auto paths = tool::credentialPaths("/etc/qel", "server");
-    EXPECT_EQ(paths.certificate, "/etc/qel/server.crt");
-    EXPECT_EQ(paths.key, "/etc/qel/server.key");
-    EXPECT_EQ(paths.root, "/etc/qel/root.crt");
-    EXPECT_EQ(tool::requestFile("server"), "server.csr");
-    EXPECT_EQ(tool::credentialPaths("dir/", "x").key, "dir/x.key");
-    EXPECT_EQ(tool::credentialPaths("/", "x").key, "/x.key");
-    EXPECT_EQ(tool::credentialPaths("", "x").key, "x.key");
-}
-
 TEST_F(CredentialFilesTest, ANameIsAPlainFileName)
 {
     const auto check = [](std::string name) { return tool::credentialNameValidator()(name); };
@@ -117,87 +105,6 @@ TEST_F(CredentialFilesTest, ANameIsAPlainFileName)
                       "' is not a name for credentials: 1 to 64 letters, digits, '.', '_' and '-', the first a letter "
                       "or a digit");
     }
-}
-
-TEST_F(CredentialFilesTest, AKeyThatOthersMayReadOrWriteIsRefused)
-{
-    for (const mode_t mode : {0600U, 0400U, 0700U, 0200U, 0711U}) {
-        SCOPED_TRACE(mode);
-        if ((mode & 0400U) == 0 && ::geteuid() != 0) continue; // only the superuser reads it then
-        EXPECT_EQ(tool::readKeyFile(write("k", "key", mode), KeyPermissions::OwnerOnly), "key");
-    }
-    for (const mode_t mode : {0640U, 0604U, 0620U, 0602U, 0644U, 0666U, 0777U}) {
-        char text[8];
-        std::snprintf(text, sizeof(text), "%04o", mode);
-        SCOPED_TRACE(text);
-        const std::string key = write("k", "key", mode);
-        EXPECT_THAT([&] { tool::readKeyFile(key, KeyPermissions::OwnerOnly); },
-                    refused<CommandFailure>("others may read or write the private key " + key + " (mode " + text +
-                                            "): use chmod 600, or --insecure-permissions to allow it"));
-        EXPECT_EQ(tool::readKeyFile(key, KeyPermissions::Any), "key");
-    }
-}
-
-TEST_F(CredentialFilesTest, ACertificateGivenAsAKeyIsNotRefusedForItsPermissions)
-{
-    const std::string pem = "-----BEGIN CERTIFICATE-----\nAAAA\n-----END CERTIFICATE-----\n";
-    EXPECT_EQ(tool::readKeyFile(write("c", pem, 0644), KeyPermissions::OwnerOnly), pem);
-}
-
-TEST_F(CredentialFilesTest, ThePermissionsOfALinkedKeyAreThoseOfItsTarget)
-{
-    const std::string key = write("target", "key", 0644);
-    fs::create_symlink(key, file("link"));
-    EXPECT_THROW(tool::readKeyFile(file("link"), KeyPermissions::OwnerOnly), CommandFailure);
-    write("target", "key", 0600);
-    EXPECT_EQ(tool::readKeyFile(file("link"), KeyPermissions::OwnerOnly), "key");
-}
-
-TEST_F(CredentialFilesTest, CertificatesMayBeReadByEverybody)
-{
-    EXPECT_EQ(tool::readPemFile(write("c", "certificate", 0644)), "certificate");
-    EXPECT_EQ(tool::readPemFile(write("e", "", 0644)), "");
-}
-
-TEST_F(CredentialFilesTest, OnlyRegularFilesAreRead)
-{
-    ASSERT_EQ(::mkfifo(file("fifo").c_str(), 0600), 0);
-    for (const std::string& name : {file("fifo"), path(), std::string("/dev/zero")}) {
-        EXPECT_THAT([&] { tool::readPemFile(name); }, refused<CommandFailure>(name + " is not a regular file"));
-        EXPECT_THAT([&] { tool::readKeyFile(name, KeyPermissions::OwnerOnly); },
-                    refused<CommandFailure>(name + " is not a regular file"));
-    }
-}
-
-TEST_F(CredentialFilesTest, AtMostAMebibyteIsRead)
-{
-    const std::string most(1024 * 1024, 'x');
-    EXPECT_EQ(tool::readPemFile(write("most", most)), most);
-    const std::string over = write("over", most + "x");
-    EXPECT_THAT([&] { tool::readPemFile(over); }, refused<CommandFailure>(over + " is larger than 1 MiB"));
-}
-
-TEST_F(CredentialFilesTest, AFileThatIsMissingIsNamed)
-{
-    EXPECT_THAT(
-        [&] { tool::readPemFile(file("missing")); },
-        ThrowsMessage<FileIOError>(StrEq("cannot open " + file("missing") + ": 2 (No such file or directory)")));
-}
-
-TEST_F(CredentialFilesTest, AllThreeAreReadUnchanged)
-{
-    write("server.crt", "certificate");
-    write("server.key", "key");
-    write("root.crt", "root");
-    const auto credentials = tool::readCredentials(tool::credentialPaths(path(), "server"), KeyPermissions::OwnerOnly);
-    EXPECT_EQ(credentials.mCert, "certificate");
-    EXPECT_EQ(credentials.mKey, "key");
-    EXPECT_EQ(credentials.mRootCA, "root");
-
-    write("server.key", "key", 0644);
-    const auto paths = tool::credentialPaths(path(), "server");
-    EXPECT_THROW(tool::readCredentials(paths, KeyPermissions::OwnerOnly), CommandFailure);
-    EXPECT_EQ(tool::readCredentials(paths, KeyPermissions::Any).mKey, "key");
 }
 
 TEST_F(CredentialFilesTest, ADirectoryIsMadeForItsOwnerOnly)
@@ -355,7 +262,7 @@ TEST_F(NewFilesTest, NeedADirectory)
 
 TEST_F(NewFilesTest, KeepTheDirectoryLocked)
 {
-    const tool::UniqueFd other(::open(path().c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+    const UniqueFd other(::open(path().c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
     ASSERT_GE(other.get(), 0);
     {
         const NewFiles files(path(), Existing::Keep);

@@ -1,3 +1,5 @@
+#include <qel/protocol/NameText.hpp>
+
 #include "certificates/SubjectText.hpp"
 
 #include <gmock/gmock.h>
@@ -7,9 +9,9 @@ namespace qel::test {
 
 namespace {
 
+using protocol::nameText;
 using testing::StrEq;
 using testing::ThrowsMessage;
-using tool::nameText;
 using tool::parseSubject;
 
 TEST(SubjectText, FieldsAreSeparatedByCommas)

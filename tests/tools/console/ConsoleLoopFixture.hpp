@@ -42,12 +42,12 @@ protected:
         connection = std::make_unique<tool::ClientConnection>(std::move(owned), end->descriptor());
     }
 
-    static void makePipe(tool::UniqueFd& readEnd, tool::UniqueFd& writeEnd)
+    static void makePipe(UniqueFd& readEnd, UniqueFd& writeEnd)
     {
         std::array<int, 2> ends{};
         if (::pipe2(ends.data(), O_CLOEXEC) != 0) throw std::runtime_error("pipe2");
-        readEnd = tool::UniqueFd(ends[0]);
-        writeEnd = tool::UniqueFd(ends[1]);
+        readEnd = UniqueFd(ends[0]);
+        writeEnd = UniqueFd(ends[1]);
     }
 
     /// Opens the session; `onInput` is then told all bytes that have been sent, after each message.
@@ -135,7 +135,7 @@ protected:
     };
 
     CapturedLog log{LogLevel::Warn};
-    tool::UniqueFd inputRead, inputWrite, outputRead, outputWrite;
+    UniqueFd inputRead, inputWrite, outputRead, outputWrite;
     std::ostringstream errors;
     tool::ConsoleScreen* current = nullptr;
     Forward receiver{current};

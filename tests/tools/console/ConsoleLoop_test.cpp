@@ -13,7 +13,6 @@ using tool::ConsoleLoop;
 using tool::ConsoleSession;
 using tool::InputOptions;
 using tool::SessionEnd;
-using tool::UniqueFd;
 using ExitReason = ConsoleLoop::ExitReason;
 
 using ClosedNotice = QelMessageVirtualSerialSessionClosedAsync;

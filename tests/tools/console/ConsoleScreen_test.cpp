@@ -1,4 +1,5 @@
-#include "base/UniqueFd.hpp"
+#include <qel/common/util/UniqueFd.hpp>
+
 #include "console/ConsoleScreen.hpp"
 #include "support/Pty.hpp"
 #include "support/TemporaryDirectory.hpp"
@@ -14,7 +15,6 @@ namespace {
 
 using tool::ConsoleScreen;
 using tool::TerminalMode;
-using tool::UniqueFd;
 
 void show(ConsoleScreen& screen, const std::string& text) { screen.onOutput(text.data(), text.size()); }
 

@@ -3,6 +3,7 @@
 
 #include "base/Failures.hpp"
 #include "support/CredentialDirectory.hpp"
+#include "support/Errors.hpp"
 #include "transport/TransportOptions.hpp"
 
 #include <gmock/gmock.h>
@@ -12,16 +13,11 @@ namespace qel::test {
 
 namespace {
 
-using ::testing::AllOf;
 using ::testing::ElementsAre;
 using ::testing::HasSubstr;
 using ::testing::IsEmpty;
-using ::testing::Property;
 using ::testing::StrEq;
-using ::testing::Throws;
 using ::testing::ThrowsMessage;
-using tool::CommandFailure;
-using tool::ExitStatus;
 using tool::KeyPermissions;
 using tool::TransportOptions;
 
@@ -156,11 +152,7 @@ protected:
         return options;
     }
 
-    static auto refusal(const std::string& text)
-    {
-        return Throws<CommandFailure>(AllOf(Property("status", &CommandFailure::getExitStatus, ExitStatus::Refused),
-                                            Property("text", &CommandFailure::what, HasSubstr(text))));
-    }
+    static auto refusal(const std::string& text) { return failsWith<protocol::CredentialsUnusable>(HasSubstr(text)); }
 
     void overwrite(const std::string& name, const std::string& content) const
     {
@@ -172,46 +164,45 @@ protected:
 
 TEST_F(TransportCredentials, MakeContextsForBothEnds)
 {
-    EXPECT_NE(tool::makeServerContext(optionsOf("server")), nullptr);
-    EXPECT_NE(tool::makeClientContext(optionsOf("client")), nullptr);
+    EXPECT_NE(tool::loadCredentials(optionsOf("server"))->makeServerContext(), nullptr);
+    EXPECT_NE(tool::loadCredentials(optionsOf("client"))->makeClientContext(), nullptr);
     TransportOptions files;
     files.files = tool::credentialPaths(directory.path(), "client");
-    EXPECT_NE(tool::makeClientContext(files), nullptr);
+    EXPECT_TRUE(tool::loadCredentials(files).has_value());
 }
 
 TEST_F(TransportCredentials, AreNotNeededForAPlainConnection)
 {
     TransportOptions plain;
     plain.plain = true;
-    EXPECT_EQ(tool::makeServerContext(plain), nullptr);
-    EXPECT_EQ(tool::makeClientContext(plain), nullptr);
+    EXPECT_FALSE(tool::loadCredentials(plain).has_value());
 }
 
 TEST_F(TransportCredentials, ReportMissingFiles)
 {
-    EXPECT_THAT([&] { tool::makeServerContext(optionsOf("nobody")); },
+    EXPECT_THAT([&] { tool::loadCredentials(optionsOf("nobody")); },
                 ThrowsMessage<FileIOError>(HasSubstr("cannot open " + directory.file("nobody.crt"))));
 }
 
 TEST_F(TransportCredentials, ReportAFileWithTheWrongContent)
 {
     overwrite("root.crt", "nonsense");
-    EXPECT_THAT([&] { tool::makeServerContext(optionsOf("server")); },
+    EXPECT_THAT([&] { tool::loadCredentials(optionsOf("server")); },
                 refusal(directory.file("root.crt") + ": X509 certificate string is not in a supported format"));
     overwrite("root.crt", Authority::trusted().root().getPEM());
     overwrite("server.crt", "nonsense");
-    EXPECT_THAT([&] { tool::makeServerContext(optionsOf("server")); },
+    EXPECT_THAT([&] { tool::loadCredentials(optionsOf("server")); },
                 refusal(directory.file("server.crt") + ": X509 certificate string is not in a supported format"));
     overwrite("server.crt", Authority::trusted().server().getPEM());
     overwrite("server.key", "nonsense");
-    EXPECT_THAT([&] { tool::makeServerContext(optionsOf("server")); },
+    EXPECT_THAT([&] { tool::loadCredentials(optionsOf("server")); },
                 refusal(directory.file("server.key") + ": RSA private key string is not in a supported format"));
 }
 
 TEST_F(TransportCredentials, RefuseAKeyThatDoesNotMatch)
 {
     overwrite("server.crt", Authority::trusted().client().getPEM());
-    EXPECT_THAT([&] { tool::makeServerContext(optionsOf("server")); },
+    EXPECT_THAT([&] { tool::loadCredentials(optionsOf("server")); },
                 refusal(directory.file("server.crt") + " and " + directory.file("server.key") +
                         " cannot be used: they do not belong together"));
 }
@@ -219,24 +210,24 @@ TEST_F(TransportCredentials, RefuseAKeyThatDoesNotMatch)
 TEST_F(TransportCredentials, ReportTheKindOfObjectInTheWrongFile)
 {
     overwrite("server.crt", Authority::trusted().server().getPrivateKey()->getPEM());
-    EXPECT_THAT([&] { tool::makeServerContext(optionsOf("server")); },
+    EXPECT_THAT([&] { tool::loadCredentials(optionsOf("server")); },
                 refusal(directory.file("server.crt") + " holds a private key, not a certificate"));
     overwrite("client.key", Authority::trusted().client().getPEM());
-    EXPECT_THAT([&] { tool::makeClientContext(optionsOf("client")); },
+    EXPECT_THAT([&] { tool::loadCredentials(optionsOf("client")); },
                 refusal(directory.file("client.key") + " holds a certificate, not a private key"));
 }
 
 TEST_F(TransportCredentials, AreRefusedOutsideTheirValidity)
 {
     directory.put("old", expiredCredentials(Authority::trusted().serverRequest()));
-    EXPECT_THAT([&] { tool::makeServerContext(optionsOf("old")); },
+    EXPECT_THAT([&] { tool::loadCredentials(optionsOf("old")); },
                 refusal("own certificate " + directory.file("old.crt") + " expired at "));
-    EXPECT_THAT([&] { tool::makeClientContext(optionsOf("old")); },
+    EXPECT_THAT([&] { tool::loadCredentials(optionsOf("old")); },
                 refusal("own certificate " + directory.file("old.crt") + " expired at "));
     directory.put("young", futureCredentials(Authority::trusted().serverRequest()));
-    EXPECT_THAT([&] { tool::makeServerContext(optionsOf("young")); },
+    EXPECT_THAT([&] { tool::loadCredentials(optionsOf("young")); },
                 refusal("own certificate " + directory.file("young.crt") + " is not valid before "));
-    EXPECT_THAT([&] { tool::makeClientContext(optionsOf("young")); },
+    EXPECT_THAT([&] { tool::loadCredentials(optionsOf("young")); },
                 refusal("own certificate " + directory.file("young.crt") + " is not valid before "));
 }
 
@@ -246,7 +237,7 @@ TEST_F(TransportCredentials, AreRefusedWithAnExpiredRoot)
     const SSLCertificate root(SSLSubject{{"CN", "old root"}},
                               SSLValidityPeriod(now - std::chrono::hours(48), now - std::chrono::hours(24)));
     overwrite("root.crt", root.getPEM());
-    EXPECT_THAT([&] { tool::makeClientContext(optionsOf("client")); },
+    EXPECT_THAT([&] { tool::loadCredentials(optionsOf("client")); },
                 refusal("root certificate " + directory.file("root.crt") + " expired at "));
 }
 
@@ -254,10 +245,10 @@ TEST_F(TransportCredentials, RefusesAKeyThatOthersMayReadUnlessAllowed)
 {
     ASSERT_EQ(::chmod(directory.file("server.key").c_str(), 0644), 0);
     TransportOptions options = optionsOf("server");
-    EXPECT_THAT([&] { tool::makeServerContext(options); },
+    EXPECT_THAT([&] { tool::loadCredentials(options); },
                 refusal("others may read or write the private key " + directory.file("server.key") + " (mode 0644)"));
     options.permissions = KeyPermissions::Any;
-    EXPECT_NE(tool::makeServerContext(options), nullptr);
+    EXPECT_TRUE(tool::loadCredentials(options).has_value());
 }
 
 } // namespace

@@ -1,8 +1,9 @@
 #include "base/Answer.hpp"
 
 #include <qel/common/StreamFormatters.hpp>
+#include <qel/protocol/Text.hpp>
 
-#include "base/Text.hpp"
+#include "base/Library.hpp"
 
 #include <algorithm>
 #include <array>

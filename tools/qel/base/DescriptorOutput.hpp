@@ -1,8 +1,7 @@
 #pragma once
 
 #include <qel/common/util/Poll.hpp>
-
-#include "base/UniqueFd.hpp"
+#include <qel/common/util/UniqueFd.hpp>
 
 #include <cstddef>
 #include <string>

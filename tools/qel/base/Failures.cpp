@@ -6,30 +6,62 @@
 #include <qel/common/util/PosixError.hpp>
 
 #include "base/RefusalReason.hpp"
+#include "base/StreamFailure.hpp"
 
-#include <cerrno>
 #include <cstring>
 
 namespace qel::tool {
 
 namespace {
 
-// A stream reports a passed deadline in two ways: with this text when the deadline passed before the wait began, and
-// with the system's EAGAIN as the cause when it passed during the wait.
-constexpr const char* kDeadlineText = "I/O deadline";
-
-bool isDeadline(const StreamIOException& error)
+template <typename T>
+bool is(const std::exception& error)
 {
-    if (std::strcmp(error.what(), kDeadlineText) == 0) return true;
-    try {
-        std::rethrow_if_nested(error);
-    } catch (const PosixError& cause) {
-        const int code = cause.getErrorCode().getCode();
-        return code == EAGAIN || code == EWOULDBLOCK;
-    } catch (...) {
-        return false;
+    return dynamic_cast<const T*>(&error) != nullptr;
+}
+
+/// The exit status of each error of the library.
+struct Row {
+    bool (*applies)(const std::exception&);
+    ExitStatus status;
+};
+constexpr Row kStatuses[] = {
+    {is<NameNotResolved>, ExitStatus::CannotConnect}, {is<CannotConnect>, ExitStatus::CannotConnect},
+    {is<CannotListen>, ExitStatus::CannotConnect},    {is<TurnedAway>, ExitStatus::Refused},
+    {is<CredentialsUnusable>, ExitStatus::Refused},   {is<StatusError>, ExitStatus::Refused},
+    {is<DeadlinePassed>, ExitStatus::DeadlinePassed}, {is<ClosedByPeer>, ExitStatus::ClosedByPeer},
+    {is<ProtocolBroken>, ExitStatus::ProtocolBroken},
+};
+
+/// When the peer does not accept our certificate, all that happens is that it closes the connection.
+ExitStatus exitStatusOf(const CertificateRejected& error)
+{
+    const bool isOurs = error.getReason() == CertificateRejected::Reason::OursByThem;
+    return isOurs ? ExitStatus::ClosedByPeer : ExitStatus::Refused;
+}
+
+/// How the library ends the texts about things for which this program has options.
+struct Wording {
+    const char* library;
+    const char* program;
+};
+constexpr Wording kWordings[] = {
+    {"does not match the pinned names", "does not match --peer-name"},
+    {"does not match the pinned fingerprints", "does not match --peer-fingerprint"},
+    {": use chmod 600", ": use chmod 600, or --insecure-permissions to allow it"},
+    {": make it a file of this user", ": make it a file of this user, or --insecure-permissions to allow it"},
+};
+
+/// The text of an error of the library, in terms of the options of this program.
+std::string wordingOf(const Error& error)
+{
+    std::string text = error.what();
+    for (const Wording& wording : kWordings) {
+        const std::size_t length = std::strlen(wording.library);
+        if (text.size() < length || text.compare(text.size() - length, length, wording.library) != 0) continue;
+        text.replace(text.size() - length, length, wording.program);
     }
-    return false;
+    return text;
 }
 
 std::string refusalText(const std::string& step, const QelMessage& response, const std::string& subject)
@@ -56,29 +88,21 @@ RequestRefused::~RequestRefused() = default;
 ExitStatus exitStatusOf(const std::exception& error)
 {
     if (const auto* failure = dynamic_cast<const CommandFailure*>(&error)) return failure->getExitStatus();
-    if (dynamic_cast<const QelMessageValidationException*>(&error) != nullptr) return ExitStatus::ProtocolBroken;
+    if (const auto* rejected = dynamic_cast<const CertificateRejected*>(&error)) return exitStatusOf(*rejected);
+    for (const Row& row : kStatuses) {
+        if (row.applies(error)) return row.status;
+    }
+    if (is<QelMessageValidationException>(error)) return ExitStatus::ProtocolBroken;
     if (const auto* stream = dynamic_cast<const StreamIOException*>(&error)) {
         return isDeadline(*stream) ? ExitStatus::DeadlinePassed : ExitStatus::ClosedByPeer;
     }
     return ExitStatus::Failed;
 }
 
-std::string explain(const std::exception& error)
-{
-    std::string text = error.what();
-    try {
-        std::rethrow_if_nested(error);
-    } catch (const std::exception& cause) {
-        text += ": " + explain(cause);
-    } catch (...) {
-        text += ": unknown cause";
-    }
-    return text;
-}
-
 std::string userMessage(const std::exception& error)
 {
-    if (dynamic_cast<const CommandFailure*>(&error) != nullptr) return explain(error);
+    if (const auto* ours = dynamic_cast<const Error*>(&error)) return wordingOf(*ours);
+    if (is<CommandFailure>(error)) return explain(error);
     switch (exitStatusOf(error)) {
     case ExitStatus::ProtocolBroken:
         return "the peer broke the protocol: " + explain(error);

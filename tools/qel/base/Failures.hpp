@@ -1,8 +1,10 @@
 #pragma once
 
 #include <qel/common/QelMessage.hpp>
+#include <qel/protocol/Error.hpp>
 
 #include "base/ExitStatus.hpp"
+#include "base/Library.hpp"
 
 #include <exception>
 #include <stdexcept>
@@ -43,15 +45,14 @@ private:
     unsigned short mStatusDetail;
 };
 
-/// The exit status for an exception: CommandFailure has its own; QelMessageValidationException is ProtocolBroken;
-/// StreamIOException is DeadlinePassed when a deadline passed, else ClosedByPeer; everything else is Failed.
+/// The exit status for an exception: CommandFailure has its own; each error of the library has one in a table;
+/// QelMessageValidationException is ProtocolBroken; StreamIOException is DeadlinePassed when a deadline passed, else
+/// ClosedByPeer; everything else is Failed.
 ExitStatus exitStatusOf(const std::exception& error);
 
-/// The exception and its nested causes in one line: "outer: inner".
-std::string explain(const std::exception& error);
-
 /// The line that the user reads. The library's phrase about a connection is short, such as "EOF", so what it means for
-/// the command comes first: "connection lost: EOF". A CommandFailure is complete as it is.
+/// the command comes first: "connection lost: EOF". A CommandFailure is complete as it is; an error of the library gets
+/// the option that it is about.
 std::string userMessage(const std::exception& error);
 
 } // namespace qel::tool

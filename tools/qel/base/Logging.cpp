@@ -4,11 +4,12 @@
 #include <qel/common/LogBackendRotating.hpp>
 #include <qel/common/Utilities.hpp>
 #include <qel/common/util/PosixError.hpp>
+#include <qel/common/util/UniqueFd.hpp>
+#include <qel/protocol/Text.hpp>
 
+#include "base/Library.hpp"
 #include "base/OptionChecks.hpp"
 #include "base/TerminalMode.hpp"
-#include "base/Text.hpp"
-#include "base/UniqueFd.hpp"
 
 #include <algorithm>
 #include <array>
@@ -127,20 +128,6 @@ void startLogging(const LogOptions& options, const std::string& name)
             std::make_shared<LogBackendRotating>(LogLevel::Inherit, options.directory, name, options.fileBytes));
         requireWritable(options.directory + "/" + name);
     }
-}
-
-void logLines(LogLevel::Level level, const std::string& text)
-{
-    std::istringstream lines(text);
-    for (std::string line; std::getline(lines, line);)
-        logLine(level, line);
-}
-
-QelLogger& programLogger()
-{
-    // Loggers live as long as the process; looking this one up by name each time would take the registry's lock.
-    static QelLogger& logger = QelLogger::get("qel");
-    return logger;
 }
 
 } // namespace qel::tool

@@ -1,8 +1,9 @@
 #pragma once
 
 #include <qel/common/LogLevel.hpp>
-#include <qel/common/QelDebugContext.hpp>
-#include <qel/common/QelLogger.hpp>
+#include <qel/protocol/Logging.hpp>
+
+#include "base/Library.hpp"
 
 #include <CLI/CLI.hpp>
 #include <cstddef>
@@ -27,22 +28,5 @@ void addLogOptions(CLI::App& app, LogOptions& options);
 /// @param name  of the log file within the directory
 /// @throws FileIOError  the log file cannot be written; later failures go to the system log
 void startLogging(const LogOptions& options, const std::string& name);
-
-/// The logger of this program, whose lines begin with "[qel] ".
-/// Thread safety: any thread.
-QelLogger& programLogger();
-
-/// Logs one line if the level is enabled.
-template <typename... Parts>
-void logLine(LogLevel::Level level, const Parts&... parts)
-{
-    QelLogger& logger = programLogger();
-    if (!logger.isLevelEnabled(level)) return;
-    QelDebugContext line(logger, level);
-    (line << ... << parts);
-}
-
-/// Logs each line of a text separately.
-void logLines(LogLevel::Level level, const std::string& text);
 
 } // namespace qel::tool

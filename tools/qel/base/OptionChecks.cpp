@@ -2,8 +2,9 @@
 
 #include <qel/common/QelCapabilities.hpp>
 #include <qel/common/net/IPEndpoint.hpp>
+#include <qel/protocol/Text.hpp>
 
-#include "base/Text.hpp"
+#include "base/Library.hpp"
 
 #include <charconv>
 #include <exception>
@@ -130,15 +131,6 @@ CLI::Validator endpointValidator() { return CLI::Validator(checkEndpoint, ""); }
 CLI::Validator capabilityValidator() { return CLI::Validator(checkCapabilities, ""); }
 
 CLI::Validator fileValidator() { return CLI::Validator(checkFile, ""); }
-
-bool isLoopback(const IPAddress& address)
-{
-    constexpr unsigned char kLoopbackNet = 127;
-    if (address.getFamily() == IPFamily::IPv4) return address.getIPv4().bytes()[0] == kLoopbackNet;
-    const IPv6Address& ipv6 = address.getIPv6();
-    if (ipv6.isIPv4Mapped()) return ipv6.bytes()[12] == kLoopbackNet;
-    return ipv6.str() == "::1";
-}
 
 void describeOption(CLI::App& command, const std::string& name, const std::string& description)
 {

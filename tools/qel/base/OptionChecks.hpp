@@ -1,6 +1,8 @@
 #pragma once
 
-#include <qel/common/net/IPAddress.hpp>
+#include <qel/protocol/ServerAddress.hpp>
+
+#include "base/Library.hpp"
 
 #include <CLI/CLI.hpp>
 #include <cstdint>
@@ -39,9 +41,6 @@ CLI::Validator capabilityValidator();
 /// Accepts the name of an existing file. A file that exists but cannot be read is not a usage error: opening it fails
 /// later, with the reason.
 CLI::Validator fileValidator();
-
-/// True for 127.0.0.0/8, ::1, and 127.0.0.0/8 as IPv4-mapped IPv6 addresses.
-bool isLoopback(const IPAddress& address);
 
 /// Replaces the description of an option that others have added. CLI::App::get_option() would end the process for want
 /// of memory.

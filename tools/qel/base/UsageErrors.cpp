@@ -1,6 +1,8 @@
 #include "base/UsageErrors.hpp"
 
-#include "base/Text.hpp"
+#include <qel/protocol/Text.hpp>
+
+#include "base/Library.hpp"
 
 #include <algorithm>
 #include <regex>

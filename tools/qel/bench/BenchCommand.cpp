@@ -1,11 +1,13 @@
 #include "bench/BenchCommand.hpp"
 
+#include <qel/protocol/Text.hpp>
+
 #include "base/Answer.hpp"
 #include "base/Failures.hpp"
+#include "base/Library.hpp"
 #include "base/Logging.hpp"
 #include "base/OptionChecks.hpp"
 #include "base/SignalWatch.hpp"
-#include "base/Text.hpp"
 #include "bench/BenchReport.hpp"
 #include "bench/BenchRun.hpp"
 #include "bench/ProgressBar.hpp"
@@ -71,10 +73,12 @@ BenchConsole connectNumber(const BenchOptions& options, unsigned int number)
     own.identity.toolId += "-" + std::to_string(number);
     try {
         return {own.identity, connectConsole(own)};
-    } catch (const CommandFailure& failure) {
-        if (failure.getExitStatus() != ExitStatus::Refused) throw;
+    } catch (const CredentialsUnusable&) {
+        throw; // the same for every connection
+    } catch (const std::exception& error) {
+        if (exitStatusOf(error) != ExitStatus::Refused) throw;
         throw CommandFailure(ExitStatus::Refused, "connection " + std::to_string(number) + " of " +
-                                                      std::to_string(options.connections) + ": " + failure.what());
+                                                      std::to_string(options.connections) + ": " + userMessage(error));
     }
 }
 

@@ -3,8 +3,9 @@
 #include <qel/common/util/ConditionVariable.hpp>
 #include <qel/common/util/Mutex.hpp>
 #include <qel/common/util/Poll.hpp>
+#include <qel/protocol/WakeUp.hpp>
 
-#include "base/WakeUp.hpp"
+#include "base/Library.hpp"
 #include "bench/BenchLoad.hpp"
 #include "bench/BenchPair.hpp"
 

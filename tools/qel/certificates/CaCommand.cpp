@@ -1,16 +1,19 @@
 #include "certificates/CaCommand.hpp"
 
+#include <qel/common/security/CertificateFacts.hpp>
 #include <qel/common/security/RSAPrivateKey.hpp>
 #include <qel/common/security/SSLException.hpp>
+#include <qel/protocol/CertificateState.hpp>
+#include <qel/protocol/NameText.hpp>
+#include <qel/protocol/PemContent.hpp>
 
 #include "base/Answer.hpp"
 #include "base/Failures.hpp"
+#include "base/Library.hpp"
 #include "base/Logging.hpp"
 #include "base/OptionChecks.hpp"
-#include "certificates/CertificateState.hpp"
-#include "certificates/CertificateView.hpp"
 #include "certificates/CredentialFiles.hpp"
-#include "certificates/PemContent.hpp"
+#include "certificates/PeriodText.hpp"
 #include "certificates/SubjectText.hpp"
 
 #include <csignal>

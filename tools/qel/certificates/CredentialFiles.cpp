@@ -1,9 +1,10 @@
 #include "certificates/CredentialFiles.hpp"
 
 #include <qel/common/util/PosixError.hpp>
+#include <qel/protocol/PemContent.hpp>
 
 #include "base/Failures.hpp"
-#include "certificates/PemContent.hpp"
+#include "base/Library.hpp"
 
 #include <array>
 #include <cerrno>
@@ -19,8 +20,6 @@ namespace qel::tool {
 namespace {
 
 constexpr std::size_t kMaxNameLength = 64;
-constexpr std::size_t kMaxBytes = 1024 * 1024; // a certificate or a key has a few thousand
-constexpr mode_t kOthersReadOrWrite = S_IRGRP | S_IWGRP | S_IROTH | S_IWOTH;
 constexpr const char* kNameStart = "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789";
 
 std::string checkName(std::string& name)
@@ -32,40 +31,6 @@ std::string checkName(std::string& name)
     if (isName) return {};
     return "'" + name +
            "' is not a name for credentials: 1 to 64 letters, digits, '.', '_' and '-', the first a letter or a digit";
-}
-
-std::string octal(mode_t mode)
-{
-    std::array<char, 16> text{};
-    std::snprintf(text.data(), text.size(), "%04o", static_cast<unsigned int>(mode & 07777U));
-    return text.data();
-}
-
-/// Opens a regular file; anything else could wait for ever or never end.
-UniqueFd openFile(const std::string& path, struct stat& status)
-{
-    UniqueFd fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK | O_NOCTTY));
-    if (fd.get() < 0 || ::fstat(fd.get(), &status) != 0) {
-        const int error = errno;
-        throw FileIOError(error, "cannot open " + path);
-    }
-    if (!S_ISREG(status.st_mode)) throw CommandFailure(ExitStatus::Refused, path + " is not a regular file");
-    return fd;
-}
-
-std::string readAll(const UniqueFd& fd, const std::string& path)
-{
-    std::string content;
-    std::array<char, 16 * 1024> buffer;
-    for (;;) {
-        const ssize_t count = ::read(fd.get(), buffer.data(), buffer.size());
-        const int error = errno;
-        if (count == 0) return content;
-        if (count < 0 && error == EINTR) continue;
-        if (count < 0) throw FileIOError(error, "cannot read " + path);
-        content.append(buffer.data(), static_cast<std::size_t>(count));
-        if (content.size() > kMaxBytes) throw CommandFailure(ExitStatus::Refused, path + " is larger than 1 MiB");
-    }
 }
 
 void writeAll(int fd, const std::string& content, const std::string& path)
@@ -114,18 +79,6 @@ int renameToFreeName(int directory, const char* from, const char* to)
 
 } // namespace
 
-std::string certificateFile(const std::string& name) { return name + ".crt"; }
-
-std::string keyFile(const std::string& name) { return name + ".key"; }
-
-std::string requestFile(const std::string& name) { return name + ".csr"; }
-
-std::string pathIn(const std::string& directory, const std::string& file)
-{
-    const bool needsSeparator = !directory.empty() && directory.back() != '/';
-    return directory + (needsSeparator ? "/" : "") + file;
-}
-
 CLI::Validator credentialNameValidator() { return CLI::Validator(checkName, ""); }
 
 void addKeyPermissionsOption(CLI::App& app, KeyPermissions& permissions)
@@ -133,43 +86,6 @@ void addKeyPermissionsOption(CLI::App& app, KeyPermissions& permissions)
     app.add_flag_callback(
         "--insecure-permissions", [&permissions] { permissions = KeyPermissions::Any; },
         "Use a private key although others than its owner may read or write its file");
-}
-
-std::string readPemFile(const std::string& path)
-{
-    struct stat status;
-    const UniqueFd fd = openFile(path, status);
-    return readAll(fd, path);
-}
-
-std::string readKeyFile(const std::string& path, KeyPermissions permissions)
-{
-    struct stat status;
-    const UniqueFd fd = openFile(path, status);
-    std::string content = readAll(fd, path);
-    // A certificate given as a key is nothing to hide; it is refused by its kind when it is parsed.
-    const bool isOpenToOthers = (status.st_mode & kOthersReadOrWrite) != 0 && !holdsNoKey(content);
-    if (isOpenToOthers && permissions == KeyPermissions::OwnerOnly) {
-        throw CommandFailure(ExitStatus::Refused, "others may read or write the private key " + path + " (mode " +
-                                                      octal(status.st_mode) +
-                                                      "): use chmod 600, or --insecure-permissions to allow it");
-    }
-    return content;
-}
-
-CredentialPaths credentialPaths(const std::string& directory, const std::string& name)
-{
-    return {pathIn(directory, certificateFile(name)), pathIn(directory, keyFile(name)),
-            pathIn(directory, certificateFile(kRootName))};
-}
-
-SSLCredentials readCredentials(const CredentialPaths& paths, KeyPermissions permissions)
-{
-    SSLCredentials credentials;
-    credentials.mCert = readPemFile(paths.certificate);
-    credentials.mKey = readKeyFile(paths.key, permissions);
-    credentials.mRootCA = readPemFile(paths.root);
-    return credentials;
 }
 
 void makeDirectory(const std::string& path)

@@ -1,8 +1,9 @@
 #pragma once
 
-#include <qel/common/security/SSLCredentials.hpp>
+#include <qel/common/util/UniqueFd.hpp>
+#include <qel/protocol/CredentialFiles.hpp>
 
-#include "base/UniqueFd.hpp"
+#include "base/Library.hpp"
 
 #include <CLI/CLI.hpp>
 #include <csignal>
@@ -12,56 +13,17 @@
 #include <vector>
 
 /// @file
-/// The files of certificates, keys and requests: their names, reading and writing.
-///
-/// In a directory, NAME.crt is the certificate of NAME, NAME.key its private key, NAME.csr its request. The name "root"
-/// belongs to the authority: every end needs root.crt, the authority alone needs root.key.
+/// The files of certificates, keys and requests: options for them, and writing them. CredentialFiles.hpp of the
+/// library names and reads them.
 
 namespace qel::tool {
-
-/// The name of the authority in a directory of credentials.
-inline constexpr const char* kRootName = "root";
-
-std::string certificateFile(const std::string& name);
-std::string keyFile(const std::string& name);
-std::string requestFile(const std::string& name);
-
-/// The path of a file in a directory.
-std::string pathIn(const std::string& directory, const std::string& file);
 
 /// Accepts a name for credentials: 1 to 64 letters, digits, '.', '_' and '-', the first a letter or a digit. Such a
 /// name can be neither a path nor an option. "root" is accepted too.
 CLI::Validator credentialNameValidator();
 
-/// Whether a private key may come from a file that users other than the owner may read or write.
-enum class KeyPermissions { OwnerOnly, Any };
-
 /// Adds --insecure-permissions.
 void addKeyPermissionsOption(CLI::App& app, KeyPermissions& permissions);
-
-/// Reads a certificate or a request: a regular file of at most 1 MiB.
-/// @throws FileIOError  it cannot be read
-/// @throws CommandFailure  Refused: it is not a regular file, or too large
-std::string readPemFile(const std::string& path);
-
-/// Reads a private key.
-/// @throws FileIOError, CommandFailure  as readPemFile(). Refused also because of its permissions, access control lists
-///                                      included: the group bits show what they grant, see acl(5)
-std::string readKeyFile(const std::string& path, KeyPermissions permissions);
-
-/// The files that one end of a connection needs.
-struct CredentialPaths {
-    std::string certificate;
-    std::string key;
-    std::string root; ///< the certificate of the authority
-};
-
-/// The paths of a name's credentials in a directory. Accesses no file.
-CredentialPaths credentialPaths(const std::string& directory, const std::string& name);
-
-/// Reads the three files without checking their content; SSLContext::setCredentials() checks it.
-/// @throws FileIOError, CommandFailure  as readPemFile() and readKeyFile()
-SSLCredentials readCredentials(const CredentialPaths& paths, KeyPermissions permissions);
 
 /// Makes a directory for its owner only. An existing directory stays as it is.
 /// @throws FileIOError  it cannot be made

@@ -1,8 +1,9 @@
 #include "certificates/SubjectText.hpp"
 
 #include <qel/common/Utilities.hpp>
+#include <qel/protocol/Text.hpp>
 
-#include "base/Text.hpp"
+#include "base/Library.hpp"
 
 #include <algorithm>
 #include <stdexcept>
@@ -59,16 +60,6 @@ void addField(SSLSubject& subject, const std::string& field)
     if (!subject.emplace(name, value).second) refuse(name + " is given twice");
 }
 
-std::string escaped(const std::string& value)
-{
-    std::string text;
-    for (const char c : value) {
-        if (c == ',' || c == '\\') text += '\\';
-        text += isPrintable(c) ? std::string(1, c) : "\\x" + hexDigits(std::string(1, c));
-    }
-    return text;
-}
-
 } // namespace
 
 SSLSubject parseSubject(const std::string& text)
@@ -77,16 +68,6 @@ SSLSubject parseSubject(const std::string& text)
     for (const std::string& field : splitFields(text))
         addField(subject, field);
     return subject;
-}
-
-std::string nameText(const NameFields& fields)
-{
-    std::string text;
-    for (const NameField& field : fields) {
-        if (!text.empty()) text += ',';
-        text += field.name + '=' + escaped(field.value);
-    }
-    return text;
 }
 
 } // namespace qel::tool

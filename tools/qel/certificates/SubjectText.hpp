@@ -1,14 +1,13 @@
 #pragma once
 
+#include <qel/common/security/CertificateFacts.hpp>
 #include <qel/common/security/SSLCertificate.hpp>
-
-#include "certificates/CertificateView.hpp"
 
 #include <string>
 
 /// @file
-/// Names of certificates as text: "CN=console,O=Example". Fields are separated by commas; a comma in a value is written
-/// "\,", a backslash "\\".
+/// Names of certificates from text: "CN=console,O=Example", as qel::protocol::nameText() writes them. Fields are
+/// separated by commas; a comma in a value is written "\,", a backslash "\\".
 
 namespace qel::tool {
 
@@ -19,9 +18,5 @@ namespace qel::tool {
 /// @throws std::invalid_argument  says what is wrong: no field, a field that is unknown, given twice or without value,
 ///                                or a value that the field cannot have
 SSLSubject parseSubject(const std::string& text);
-
-/// The text of a name, as parseSubject() takes it; empty for an empty name. What is not printable ASCII is written as
-/// "\xHH", a byte each, so that the text is safe to print on a terminal.
-std::string nameText(const NameFields& fields);
 
 } // namespace qel::tool

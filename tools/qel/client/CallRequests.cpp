@@ -6,8 +6,9 @@
 #include <qel/common/QelMessageExceptions.hpp>
 #include <qel/common/QelMessageInterfaceComponent.hpp>
 #include <qel/common/QelMessageVirtualSerial.hpp>
+#include <qel/protocol/Text.hpp>
 
-#include "base/Text.hpp"
+#include "base/Library.hpp"
 
 #include <algorithm>
 #include <cstddef>

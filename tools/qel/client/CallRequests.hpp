@@ -2,9 +2,10 @@
 
 #include <qel/common/QelCapabilities.hpp>
 #include <qel/common/QelMessage.hpp>
+#include <qel/protocol/FrameLimits.hpp>
 
 #include "base/Answer.hpp"
-#include "base/FrameLimits.hpp"
+#include "base/Library.hpp"
 
 #include <cstdint>
 #include <functional>

@@ -8,11 +8,12 @@
 #include <qel/common/net/SocketStream.hpp>
 #include <qel/common/util/PosixError.hpp>
 #include <qel/common/util/TimeProvider.hpp>
+#include <qel/protocol/Handshake.hpp>
+#include <qel/protocol/MessageRegistry.hpp>
 
 #include "base/Failures.hpp"
+#include "base/Library.hpp"
 #include "base/Logging.hpp"
-#include "base/MessageRegistry.hpp"
-#include "transport/Handshake.hpp"
 
 #include <algorithm>
 #include <array>
@@ -62,12 +63,13 @@ std::unique_ptr<Stream> protect(std::unique_ptr<Stream> stream, int descriptor, 
         requestUpgrade(*stream, descriptor);
         auto tls = std::make_unique<SSLStream>(context, std::move(stream));
         startTls(*tls);
-        checkPeer(*tls, options.transport.pins);
-        logLine(LogLevel::Info, "connected over TLS to ", describePeer(*tls));
+        const PeerIdentity peer = identityOf(*tls);
+        checkPeer(peer, options.transport.pins);
+        logLine(LogLevel::Info, "connected over TLS to ", describePeer(peer));
         return tls;
-    } catch (const CommandFailure& failure) {
-        throw CommandFailure(failure.getExitStatus(),
-                             "no protected connection to " + options.endpoint + ": " + failure.what());
+    } catch (Error& error) {
+        error.addContext("no protected connection to " + options.endpoint + ": ", options.endpoint);
+        throw;
     }
 }
 
@@ -91,7 +93,8 @@ ClientConnection::~ClientConnection() = default;
 std::unique_ptr<ClientConnection> ClientConnection::connect(const ConnectOptions& options)
 {
     const IPEndpoint endpoint(options.endpoint);
-    const auto context = makeClientContext(options.transport);
+    const auto credentials = loadCredentials(options.transport);
+    const auto context = credentials ? credentials->makeClientContext() : nullptr;
     const TimePoint end = TimeProvider::steady() + options.timeout();
     auto socket = tuneSocket(connectSocket(endpoint, options.timeout()), endpoint);
     const TimePoint handshakeEnd = std::min(end, TimeProvider::steady() + options.transport.handshakeTimeout());

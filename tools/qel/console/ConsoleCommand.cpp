@@ -1,13 +1,14 @@
 #include "console/ConsoleCommand.hpp"
 
 #include <qel/common/io/StreamIOException.hpp>
+#include <qel/protocol/Text.hpp>
 
 #include "base/Failures.hpp"
+#include "base/Library.hpp"
 #include "base/Logging.hpp"
 #include "base/OptionChecks.hpp"
 #include "base/SignalWatch.hpp"
 #include "base/TerminalMode.hpp"
-#include "base/Text.hpp"
 #include "client/ClientConnection.hpp"
 #include "client/ConnectOptions.hpp"
 #include "console/ConsoleLoop.hpp"

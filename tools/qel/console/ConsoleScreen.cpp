@@ -1,6 +1,8 @@
 #include "console/ConsoleScreen.hpp"
 
-#include "base/Text.hpp"
+#include <qel/protocol/Text.hpp>
+
+#include "base/Library.hpp"
 
 #include <unistd.h>
 

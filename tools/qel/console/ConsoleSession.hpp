@@ -4,9 +4,10 @@
 #include <qel/common/QelMessageDax.hpp>
 #include <qel/common/QelMessageVirtualSerial.hpp>
 #include <qel/common/util/Poll.hpp>
+#include <qel/protocol/CommandEnd.hpp>
 
-#include "base/CommandEnd.hpp"
 #include "base/ExitStatus.hpp"
+#include "base/Library.hpp"
 #include "client/ClientConnection.hpp"
 
 #include <chrono>

@@ -1,6 +1,8 @@
 #include "console/EscapeFilter.hpp"
 
-#include "base/Text.hpp"
+#include <qel/protocol/Text.hpp>
+
+#include "base/Library.hpp"
 
 namespace qel::tool {
 

@@ -3,12 +3,13 @@
 #include <qel/common/StreamFormatters.hpp>
 #include <qel/common/TypeInfo.hpp>
 #include <qel/common/util/PosixError.hpp>
+#include <qel/protocol/Text.hpp>
 
 #include "base/Answer.hpp"
 #include "base/Failures.hpp"
+#include "base/Library.hpp"
 #include "base/Logging.hpp"
 #include "base/OptionChecks.hpp"
-#include "base/Text.hpp"
 #include "decode/CaptureDecoder.hpp"
 #include "decode/FrameDecoder.hpp"
 #include "decode/HexText.hpp"

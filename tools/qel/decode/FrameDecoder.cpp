@@ -4,8 +4,9 @@
 #include <qel/common/QelMessageExceptions.hpp>
 #include <qel/common/QelMessageRegistry.hpp>
 #include <qel/common/io/QelMessageStream.hpp>
+#include <qel/protocol/MessageRegistry.hpp>
 
-#include "base/MessageRegistry.hpp"
+#include "base/Library.hpp"
 
 #include <algorithm>
 #include <cstring>

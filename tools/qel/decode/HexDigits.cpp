@@ -1,7 +1,9 @@
 #include "decode/HexDigits.hpp"
 
+#include <qel/protocol/Text.hpp>
+
 #include "base/Failures.hpp"
-#include "base/Text.hpp"
+#include "base/Library.hpp"
 
 #include <cctype>
 

@@ -2,18 +2,19 @@
 
 #include <qel/common/net/Listen.hpp>
 #include <qel/common/util/PosixError.hpp>
+#include <qel/protocol/WakeUp.hpp>
 
 #include "base/Failures.hpp"
+#include "base/Library.hpp"
 #include "base/Logging.hpp"
 #include "base/OptionChecks.hpp"
 #include "base/SignalWatch.hpp"
-#include "base/WakeUp.hpp"
-#include "serve/ChildReaper.hpp"
-#include "serve/CommandEnvironment.hpp"
-#include "serve/Hypervisor.hpp"
-#include "serve/PtyPort.hpp"
-#include "serve/SerialLoop.hpp"
-#include "serve/Server.hpp"
+#include "hypervisor/ChildReaper.hpp"
+#include "hypervisor/CommandEnvironment.hpp"
+#include "hypervisor/HypervisorEngine.hpp"
+#include "hypervisor/PtyPort.hpp"
+#include "server/SerialLoop.hpp"
+#include "server/Server.hpp"
 #include "transport/TransportOptions.hpp"
 
 #include <algorithm>
@@ -160,10 +161,10 @@ void reload(Server& server, const TransportOptions& transport)
 {
     if (transport.plain) return logLine(LogLevel::Info, "SIGHUP: connections are plain, there is nothing to load");
     try {
-        server.setContext(makeServerContext(transport));
+        server.setContext(loadCredentials(transport)->makeServerContext());
         logLine(LogLevel::Info, "SIGHUP: loaded ", transport.paths().certificate, " for new connections");
     } catch (const std::exception& error) {
-        logLine(LogLevel::Error, "SIGHUP: the credentials stay as they were: ", explain(error));
+        logLine(LogLevel::Error, "SIGHUP: the credentials stay as they were: ", userMessage(error));
     }
 }
 
@@ -197,13 +198,14 @@ ExitStatus runServe(const ServePlan& plan)
     static_cast<void>(std::signal(SIGPIPE, SIG_IGN)); // a log pipe without a reader must not end the server
     static_cast<void>(std::signal(SIGCHLD, SIG_DFL)); // ignored, as a parent may leave it, it hides how commands end
     SignalWatch signals(kSignals);
-    auto context = makeServerContext(plan.transport);
+    const auto credentials = loadCredentials(plan.transport);
+    auto context = credentials ? credentials->makeServerContext() : nullptr;
     Socket listener = openListener(plan.endpoint);
     const IPEndpoint listening = listener.getSocketName();
 
     ChildReaper reaper;
     WakeUp serialWake;
-    Hypervisor hypervisor(plan.settings, makePartitions(plan, reaper), [&] { serialWake.interrupt(); });
+    HypervisorEngine hypervisor(plan.settings, makePartitions(plan, reaper), [&] { serialWake.interrupt(); });
     ConnectionLimits limits;
     limits.handshake = plan.transport.handshakeTimeout();
     limits.queueBytes = plan.queueBytes;

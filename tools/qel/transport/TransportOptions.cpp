@@ -1,12 +1,10 @@
 #include "transport/TransportOptions.hpp"
 
 #include <qel/common/net/IPEndpoint.hpp>
-#include <qel/common/security/SSLException.hpp>
 
 #include "base/Failures.hpp"
+#include "base/Library.hpp"
 #include "base/OptionChecks.hpp"
-#include "certificates/PemContent.hpp"
-#include "transport/OwnCertificate.hpp"
 
 namespace qel::tool {
 
@@ -64,29 +62,6 @@ void addPeerOptions(CLI::App& app, TransportOptions& options, CLI::Option* plain
         ->excludes(plain);
 }
 
-template <typename Context>
-std::unique_ptr<Context> makeContext(const TransportOptions& options)
-{
-    if (options.plain) return nullptr;
-    const CredentialPaths paths = options.paths();
-    const SSLCredentials credentials = readCredentials(paths, options.permissions);
-    // Checked one by one first: the context's exception does not say which of the three is wrong.
-    const SSLCertificate root = parseCertificate(paths.root, credentials.mRootCA);
-    const SSLCertificate own = parseCertificate(paths.certificate, credentials.mCert);
-    parseKey(paths.key, credentials.mKey);
-    auto context = std::make_unique<Context>();
-    try {
-        context->setCredentials(credentials);
-    } catch (const SSLException&) {
-        throw CommandFailure(ExitStatus::Refused, paths.certificate + " and " + paths.key +
-                                                      " cannot be used: they do not belong together, or are too weak");
-    }
-    const auto now = SSLValidityPeriod::Clock::now();
-    checkOwnCertificate("own certificate", paths.certificate, own, now);
-    checkOwnCertificate("root certificate", paths.root, root, now);
-    return context;
-}
-
 } // namespace
 
 std::chrono::milliseconds TransportOptions::handshakeTimeout() const
@@ -121,14 +96,10 @@ void checkTransport(const TransportOptions& options, const std::string& endpoint
     }
 }
 
-std::unique_ptr<SSLClientContext> makeClientContext(const TransportOptions& options)
+std::optional<Credentials> loadCredentials(const TransportOptions& options)
 {
-    return makeContext<SSLClientContext>(options);
-}
-
-std::unique_ptr<SSLServerContext> makeServerContext(const TransportOptions& options)
-{
-    return makeContext<SSLServerContext>(options);
+    if (options.plain) return std::nullopt;
+    return Credentials::fromFiles(options.paths(), options.permissions);
 }
 
 } // namespace qel::tool

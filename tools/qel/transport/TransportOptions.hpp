@@ -1,13 +1,14 @@
 #pragma once
 
-#include <qel/common/security/SSLContext.hpp>
+#include <qel/protocol/Credentials.hpp>
+#include <qel/protocol/PeerPins.hpp>
 
+#include "base/Library.hpp"
 #include "certificates/CredentialFiles.hpp"
-#include "transport/PeerPins.hpp"
 
 #include <CLI/CLI.hpp>
 #include <chrono>
-#include <memory>
+#include <optional>
 #include <string>
 
 /// @file
@@ -40,12 +41,9 @@ void addTransportOptions(CLI::App& app, TransportOptions& options);
 /// @throws CLI::ValidationError
 void checkTransport(const TransportOptions& options, const std::string& endpoint);
 
-/// Makes a TLS configuration from the current content of the credential files.
-/// @return null for a plain connection
-/// @throws FileIOError  a file cannot be read
-/// @throws CommandFailure  Refused: a file does not hold what it should; others may read the key; the certificate and
-///                         the key do not belong together; the certificate or the root is expired or not yet valid
-std::unique_ptr<SSLClientContext> makeClientContext(const TransportOptions& options);
-std::unique_ptr<SSLServerContext> makeServerContext(const TransportOptions& options);
+/// Reads the credentials from their files as they are now.
+/// @return none for a plain connection
+/// @throws FileIOError, CredentialsUnusable  as Credentials::fromFiles()
+std::optional<Credentials> loadCredentials(const TransportOptions& options);
 
 } // namespace qel::tool

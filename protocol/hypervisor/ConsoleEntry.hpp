@@ -1,0 +1,34 @@
+#pragma once
+
+#include "hypervisor/ConsoleLink.hpp"
+
+#include <cstdint>
+#include <string>
+#include <utility>
+
+namespace qel::protocol {
+
+/// Numbers the connections of a server in the order of connecting, from 1. No number is used twice.
+using ConsoleId = std::uint64_t;
+
+/// The state of a connection. docs/connection.md has the table of what is answered in which state.
+enum class ConsoleState {
+    Connected,  ///< not identified yet
+    Identified, ///< its version request was granted
+    Closing     ///< its connection is being closed: further messages are ignored
+};
+
+/// The hypervisor's entry for one connection. The hypervisor owns it and guards it with its lock.
+struct Console {
+    Console(ConsoleId number, std::string from, ConsoleLink& to) : id(number), peer(std::move(from)), link(to) {}
+
+    ConsoleId id;
+    std::string peer;  ///< its address, for the log
+    ConsoleLink& link; ///< outlives the entry: see HypervisorEngine::connect()
+    ConsoleState state = ConsoleState::Connected;
+    std::uint32_t toolType = 0; ///< this and the members below: valid once it is identified
+    std::string toolId;
+    bool sessionOpen = false; ///< the hypervisor session
+};
+
+} // namespace qel::protocol

@@ -1,0 +1,428 @@
+#include "hypervisor/HypervisorEngine.hpp"
+
+#include <qel/common/QelInternalMessageRegistry.hpp>
+#include <qel/common/QelMessageDax.hpp>
+#include <qel/common/QelMessageGeneric.hpp>
+#include <qel/common/util/TimeProvider.hpp>
+#include <qel/protocol/FrameLimits.hpp>
+#include <qel/protocol/Logging.hpp>
+
+#include <algorithm>
+#include <chrono>
+#include <limits>
+#include <utility>
+
+namespace qel::protocol {
+
+namespace {
+
+/// The broadcast type for a single addressee.
+constexpr std::uint8_t kUnicast = 1;
+
+/// Bytes of capability bits in an answer: one for every eight of the 32.
+constexpr std::uint32_t kCapabilityBytes = QelCapabilities::size() / 8;
+
+/// Where the limits response says how many consoles are supported: offset from the first payload byte.
+constexpr std::size_t kConsolesSupportedOffset = 8;
+
+/// A response without payload, for a refused request or one that has no response class.
+std::unique_ptr<QelMessage> bareResponse(const QelMessage& request, QelMessageStatusCodes status)
+{
+    auto response = std::make_unique<QelMessageGeneric>(request.getCallerId(), request.getFunction(),
+                                                        request.getOperation(), MsgResponse);
+    response->setStatus(status);
+    return response;
+}
+
+/// By identity: the registry of this end does not know the class, which belongs to the steps before TLS.
+bool isUpgrade(const QelMessage& message)
+{
+    return std::make_tuple(static_cast<unsigned short>(message.getFunction()),
+                           static_cast<unsigned short>(message.getOperation()),
+                           message.getClassification()) == QelMessageUpgradeConnectionAsync::getMessageID();
+}
+
+template <typename T>
+bool isRequest(const QelMessage& message)
+{
+    const auto identity = T::getMessageID();
+    return message.getFunction() == std::get<0>(identity) && message.getOperation() == std::get<1>(identity);
+}
+
+QelCapabilities intersection(const QelCapabilities& left, const QelCapabilities& right)
+{
+    QelCapabilities both;
+    for (std::size_t i = 0; i < QelCapabilities::size(); ++i) {
+        if (left[i] && right[i]) both.set(i);
+    }
+    return both;
+}
+
+} // namespace
+
+HypervisorEngine::HypervisorEngine(HypervisorSettings settings, PartitionSet partitions,
+                                   std::function<void()> wakeSerial)
+    : mSettings(std::move(settings)), mWakeSerial(std::move(wakeSerial)), mPartitions(std::move(partitions))
+{}
+
+HypervisorEngine::~HypervisorEngine() = default;
+
+ConsoleId HypervisorEngine::connect(ConsoleLink& link, const std::string& peer)
+{
+    const MutexLock lock(mMutex);
+    const ConsoleId id = ++mLastConsoleId;
+    Console& console = mConsoles.emplace(id, Console(id, peer, link)).first->second;
+    logLine(LogLevel::Info, "console ", id, " connected from ", peer);
+    if (mShutDown) pClose(console);
+    return id;
+}
+
+ConsoleState HypervisorEngine::receive(ConsoleId id, const QelMessage& message)
+{
+    const MutexLock lock(mMutex);
+    const auto found = mConsoles.find(id);
+    if (found == mConsoles.end()) return ConsoleState::Closing;
+    Console& console = found->second;
+    if (console.state == ConsoleState::Closing) return console.state;
+    switch (message.getClassification()) {
+    case QelMessageClassification::Request:
+        pHandleRequest(console, message);
+        break;
+    case QelMessageClassification::Async:
+        pHandleNotice(console, message);
+        break;
+    default: // this end sends no requests, so a response answers none; or the flags contradict each other
+        logLine(LogLevel::Warn, "console ", id, ": ignored ", message.getLogID());
+        break;
+    }
+    if (mPartitions.takeChanged()) mWakeSerial();
+    return console.state;
+}
+
+bool HypervisorEngine::mayReceive(ConsoleId id) const
+{
+    const MutexLock lock(mMutex);
+    const auto found = mConsoles.find(id);
+    if (found == mConsoles.end()) return true;
+    return found->second.link.hasRoom() && mPartitions.hasInputRoom(found->second);
+}
+
+bool HypervisorEngine::takesConsoles() const
+{
+    const MutexLock lock(mMutex);
+    return !mShutDown && pCountIdentified() < mSettings.maxConsoles;
+}
+
+void HypervisorEngine::disconnect(ConsoleId id)
+{
+    const MutexLock lock(mMutex);
+    const auto found = mConsoles.find(id);
+    if (found == mConsoles.end()) return;
+    mPartitions.release(found->second);
+    mConsoles.erase(found);
+    logLine(LogLevel::Info, "console ", id, " disconnected");
+    mWakeSerial();
+}
+
+void HypervisorEngine::outputDrained()
+{
+    const MutexLock lock(mMutex);
+    mWakeSerial();
+}
+
+void HypervisorEngine::shutDown()
+{
+    const MutexLock lock(mMutex);
+    mShutDown = true;
+    mPartitions.shutDown();
+    for (auto& entry : mConsoles) {
+        Console& console = entry.second;
+        if (console.state == ConsoleState::Identified) {
+            console.link.post(std::make_unique<QelMessageKrogConnectionClosedAsync>());
+        }
+        if (console.state != ConsoleState::Closing) pClose(console);
+    }
+    mWakeSerial();
+}
+
+std::vector<SerialWatch> HypervisorEngine::serialWatches() const
+{
+    const MutexLock lock(mMutex);
+    return mPartitions.watches();
+}
+
+void HypervisorEngine::serviceSerial(std::uint16_t partition)
+{
+    const MutexLock lock(mMutex);
+    mPartitions.service(partition);
+}
+
+bool HypervisorEngine::serviceEndedLines()
+{
+    const MutexLock lock(mMutex);
+    return mPartitions.serviceEnded();
+}
+
+/// The entry of the table for requests of class T. A request that has T's identity and another class did not parse.
+template <typename T>
+HypervisorEngine::Rules::value_type HypervisorEngine::pRule(Reply (HypervisorEngine::*handler)(Console&, const T&),
+                                                            bool needsSession)
+{
+    const auto identity = T::getMessageID();
+    Rule rule;
+    rule.needsSession = needsSession;
+    rule.handle = [handler](HypervisorEngine& self, Console& console, const QelMessage& message) -> Reply {
+        const auto* request = dynamic_cast<const T*>(&message);
+        if (request == nullptr) return bareResponse(message, QelMessageStatusInvalidData);
+        return (self.*handler)(console, *request);
+    };
+    return {RequestId(std::get<0>(identity), std::get<1>(identity)), rule};
+}
+
+const HypervisorEngine::Rules& HypervisorEngine::pRules()
+{
+    constexpr bool kNeedsSession = true;
+    static const Rules rules{
+        pRule(&HypervisorEngine::pVersion),
+        pRule(&HypervisorEngine::pOpenSession),
+        pRule(&HypervisorEngine::pCloseSession),
+        pRule(&HypervisorEngine::pCapabilities),
+        pRule(&HypervisorEngine::pLimits),
+        pRule(&HypervisorEngine::pBroadcast),
+        pRule(&HypervisorEngine::pTime),
+        pRule(&HypervisorEngine::pSetMode),
+        pRule(&HypervisorEngine::pGetMode),
+        pRule(&HypervisorEngine::pSetMetadata),
+        pRule(&HypervisorEngine::pGetMetadata),
+        pRule(&HypervisorEngine::pOpenSerial, kNeedsSession),
+        pRule(&HypervisorEngine::pCloseSerial, kNeedsSession),
+        pRule(&HypervisorEngine::pMaxSerialSessions, kNeedsSession),
+        pRule(&HypervisorEngine::pSetUpSerial, kNeedsSession),
+    };
+    return rules;
+}
+
+bool HypervisorEngine::pKnowsFunction(unsigned short function)
+{
+    const auto first = pRules().lower_bound(RequestId(function, static_cast<unsigned short>(0)));
+    return first != pRules().end() && first->first.first == function;
+}
+
+void HypervisorEngine::pHandleRequest(Console& console, const QelMessage& request)
+{
+    const Rule* rule = nullptr;
+    const QelMessageStatusCodes refusal = pAdmit(console, request, rule);
+    Reply reply =
+        refusal == QelMessageStatusNoError ? rule->handle(*this, console, request) : bareResponse(request, refusal);
+    const QelMessageStatusCodes status = reply->getStatus();
+    if (status != QelMessageStatusNoError) {
+        logLine(LogLevel::Info, "console ", console.id, ": refused ", request.getLogID(), ": ", status);
+    }
+    console.link.post(std::move(reply));
+    if (status == QelMessageStatusTooManyConnections) pClose(console);
+}
+
+void HypervisorEngine::pHandleNotice(Console& console, const QelMessage& notice)
+{
+    const auto* data = dynamic_cast<const QelMessageVirtualSerialDataToOsAsync*>(&notice);
+    if (data != nullptr && mPartitions.feed(console, *data)) return;
+    if (isUpgrade(notice)) return pRefuseUpgrade(console);
+    logLine(LogLevel::Warn, "console ", console.id, ": ignored ", notice.getLogID());
+}
+
+/// A console asks for TLS on a plain connection, or inside TLS. It waits for an answer, so it gets one.
+void HypervisorEngine::pRefuseUpgrade(Console& console)
+{
+    logLine(LogLevel::Warn, "console ", console.id, ": closed, it asked for TLS, which is not done here");
+    console.link.post(std::make_unique<QelMessageAbortHandshakeAsync>());
+    pClose(console);
+}
+
+/// The checks that are the same for all requests. @param rule  set when they pass
+QelMessageStatusCodes HypervisorEngine::pAdmit(const Console& console, const QelMessage& request,
+                                               const Rule*& rule) const
+{
+    const bool isVersion = isRequest<QelMessageGetEnclTypeAndInterfaceVersionReq>(request);
+    // The version request comes first and comes once. Before it every other request gets the same status, so that an
+    // unidentified peer cannot find out which requests exist.
+    if (isVersion != (console.state == ConsoleState::Connected)) return QelMessageStatusInvalidCmdSequence;
+    if (!pKnowsFunction(request.getFunction())) return QelMessageStatusInvalidFunction;
+    const auto found = pRules().find(RequestId(request.getFunction(), request.getOperation()));
+    if (found == pRules().end()) return QelMessageStatusInvalidOperation;
+    if (found->second.needsSession && !console.sessionOpen) return QelMessageStatusInvalidCmdSequence;
+    rule = &found->second;
+    return QelMessageStatusNoError;
+}
+
+HypervisorEngine::Reply HypervisorEngine::pVersion(Console& console,
+                                                   const QelMessageGetEnclTypeAndInterfaceVersionReq& request)
+{
+    if (pFindIdentified(request.getToolType(), request.getToolId()) != nullptr) {
+        return bareResponse(request, QelMessageStatusDaxAlreadyConnected);
+    }
+    if (pCountIdentified() >= mSettings.maxConsoles) return bareResponse(request, QelMessageStatusTooManyConnections);
+    console.state = ConsoleState::Identified;
+    console.toolType = request.getToolType();
+    console.toolId = request.getToolId();
+    return std::make_unique<QelMessageGetEnclTypeAndInterfaceVersionRsp>(
+        request.getCallerId(), mSettings.interfaceFamily, mSettings.majorVersion, mSettings.minorVersion,
+        mSettings.machineType, mSettings.serialNumber);
+}
+
+HypervisorEngine::Reply HypervisorEngine::pOpenSession(Console& console,
+                                                       const QelMessageInterfaceCmpOpenKrogSessionReq& request)
+{
+    if (console.sessionOpen) return bareResponse(request, QelMessageStatusKrogSessionAlreadyOpen);
+    console.sessionOpen = true;
+    return std::make_unique<QelMessageInterfaceCmpOpenKrogSessionRsp>(request.getCallerId());
+}
+
+HypervisorEngine::Reply HypervisorEngine::pCloseSession(Console& console,
+                                                        const QelMessageInterfaceCmpCloseKrogSessionReq& request)
+{
+    if (!console.sessionOpen) return bareResponse(request, QelMessageStatusInvalidCmdSequence);
+    console.sessionOpen = false;
+    mPartitions.release(console);
+    return std::make_unique<QelMessageInterfaceCmpCloseKrogSessionRsp>(request.getCallerId());
+}
+
+HypervisorEngine::Reply HypervisorEngine::pCapabilities(Console&, const QelMessageExchIntCapabilitiesReq& request)
+{
+    return std::make_unique<QelMessageExchIntCapabilitiesRsp>(
+        request.getCallerId(), kCapabilityBytes, intersection(request.getCapabilities(), mSettings.capabilities));
+}
+
+HypervisorEngine::Reply HypervisorEngine::pLimits(Console&, const QelMessageGetInterfaceLimitsReq& request)
+{
+    const QelMessageGetInterfaceLimitsRsp response(request.getCallerId());
+    if (mSettings.maxConsoles == QelMessageGetInterfaceLimitsRsp::DAXS_SUPPORTED) return response.clone();
+    // The class writes the protocol's own number of consoles; the number that this server allows replaces it.
+    std::string payload(response.getData(), response.dataLength());
+    payload[kConsolesSupportedOffset] = static_cast<char>(mSettings.maxConsoles);
+    auto changed = std::make_unique<QelMessageGeneric>(response);
+    changed->setData(payload.data(), static_cast<unsigned int>(payload.size()));
+    return changed;
+}
+
+HypervisorEngine::Reply HypervisorEngine::pBroadcast(Console& console, const QelMessageDaxBroadcastReq& request)
+{
+    if (request.getBroadcastMsgLen() > kMaxBroadcast) return bareResponse(request, QelMessageStatusInvalidData);
+    if (request.getBroadcastMode() == kUnicast) {
+        Console* const addressee = pFindIdentified(request.getToolType(), request.getToolId());
+        if (addressee == nullptr || addressee == &console) {
+            return bareResponse(request, QelMessageStatusConnectionNotAvailable);
+        }
+        if (!pSendBroadcast(*addressee, console, request)) return bareResponse(request, QelMessageStatusCmdFailed);
+    } else {
+        for (auto& entry : mConsoles) {
+            Console& other = entry.second;
+            if (&other != &console && other.state == ConsoleState::Identified) {
+                static_cast<void>(pSendBroadcast(other, console, request));
+            }
+        }
+    }
+    return std::make_unique<QelMessageDaxBroadcastRsp>(request.getCallerId());
+}
+
+HypervisorEngine::Reply HypervisorEngine::pTime(Console&, const QelMessageGetQelTodReq& request)
+{
+    const std::time_t now = std::chrono::system_clock::to_time_t(TimeProvider::system());
+    return std::make_unique<QelMessageGetQelTodRsp>(request.getCallerId(), now);
+}
+
+HypervisorEngine::Reply HypervisorEngine::pSetMode(Console&, const QelMessageSetGlobalModeAttributeReq& request)
+{
+    // A longer text would make a response that the console that reads the mode must not accept.
+    if (request.getMTMSLen() > kMaxMtms) return bareResponse(request, QelMessageStatusInvalidData);
+    mMode = request.getMode();
+    mMtms = request.getMTMS();
+    return bareResponse(request, QelMessageStatusNoError); // 0x0108 has no response class
+}
+
+HypervisorEngine::Reply HypervisorEngine::pGetMode(Console&, const QelMessageGetGlobalModeAttributeReq& request)
+{
+    return std::make_unique<QelMessageGetGlobalModeAttributeRsp>(request.getCallerId(), mMode, mMtms);
+}
+
+HypervisorEngine::Reply HypervisorEngine::pSetMetadata(Console&, const QelMessageSetGlobalSaveAreaMetadataReq& request)
+{
+    if (request.getMetadataLen() > kMaxMetadata) return bareResponse(request, QelMessageStatusInvalidData);
+    mMetadata = request.getMetadata();
+    return std::make_unique<QelMessageSetGlobalSaveAreaMetadataRsp>(request.getCallerId());
+}
+
+HypervisorEngine::Reply HypervisorEngine::pGetMetadata(Console&, const QelMessageGetGlobalSaveAreaMetadataReq& request)
+{
+    return std::make_unique<QelMessageGetGlobalSaveAreaMetadataRsp>(request.getCallerId(), mMetadata);
+}
+
+HypervisorEngine::Reply HypervisorEngine::pOpenSerial(Console& console, const QelMessageVirtualSerialOpenReq& request)
+{
+    const auto status =
+        mPartitions.open(console, request.getLpId(), request.getVssConnectionNumber(), request.isForceOpen());
+    if (status != QelMessageStatusNoError) return bareResponse(request, status);
+    return std::make_unique<QelMessageVirtualSerialOpenRsp>(request.getCallerId(), request.getLpId(),
+                                                            request.getVssConnectionNumber());
+}
+
+HypervisorEngine::Reply HypervisorEngine::pCloseSerial(Console& console, const QelMessageVirtualSerialCloseReq& request)
+{
+    const auto status =
+        mPartitions.close(console, request.getLpId(), request.getVssConnectionNumber(), request.isForceClose());
+    if (status != QelMessageStatusNoError) return bareResponse(request, status);
+    return std::make_unique<QelMessageVirtualSerialCloseRsp>(request.getCallerId());
+}
+
+HypervisorEngine::Reply HypervisorEngine::pMaxSerialSessions(Console&,
+                                                             const QelMessageVirtualSerialGetMaxSessionsReq& request)
+{
+    constexpr std::uint16_t kSystems = 1; // this one
+    constexpr std::size_t kMax = std::numeric_limits<std::uint8_t>::max();
+    const auto partitions = static_cast<std::uint8_t>(std::min(mPartitions.size(), kMax));
+    return std::make_unique<QelMessageVirtualSerialGetMaxSessionsRsp>(request.getCallerId(), kSystems, partitions);
+}
+
+HypervisorEngine::Reply HypervisorEngine::pSetUpSerial(Console& console,
+                                                       const QelMessageVirtualSerialSetupSessionReq& request)
+{
+    const auto status = mPartitions.setUp(console, request.getLpId(), request.getVssConnectionNumber());
+    if (status != QelMessageStatusNoError) return bareResponse(request, status);
+    return std::make_unique<QelMessageVirtualSerialSetupSessionRsp>(request.getCallerId());
+}
+
+Console* HypervisorEngine::pFindIdentified(std::uint32_t toolType, const std::string& toolId)
+{
+    for (auto& entry : mConsoles) {
+        Console& console = entry.second;
+        if (console.state != ConsoleState::Identified) continue;
+        if (console.toolType == toolType && console.toolId == toolId) return &console;
+    }
+    return nullptr;
+}
+
+std::size_t HypervisorEngine::pCountIdentified() const
+{
+    std::size_t count = 0;
+    for (const auto& entry : mConsoles) {
+        if (entry.second.state == ConsoleState::Identified) ++count;
+    }
+    return count;
+}
+
+/// @return false: the console's queue is full, and it did not get the broadcast
+bool HypervisorEngine::pSendBroadcast(Console& to, const Console& from, const QelMessageDaxBroadcastReq& request)
+{
+    if (to.link.offer(std::make_unique<QelMessageDaxBroadcastOutboundAsync>(request, from.toolId, from.toolType))) {
+        return true;
+    }
+    logLine(LogLevel::Warn, "console ", to.id, ": too slow for a broadcast of console ", from.id);
+    return false;
+}
+
+void HypervisorEngine::pClose(Console& console)
+{
+    console.state = ConsoleState::Closing;
+    console.link.finish();
+}
+
+} // namespace qel::protocol

@@ -1,0 +1,65 @@
+#include "server/SerialLoop.hpp"
+
+#include <qel/protocol/Error.hpp>
+#include <qel/protocol/Logging.hpp>
+
+#include <chrono>
+#include <vector>
+
+namespace qel::protocol {
+
+namespace {
+
+/// How often to look at commands that have been asked to end.
+constexpr std::chrono::milliseconds kReapInterval(50);
+
+/// How often to look at commands whose line has ended, which end at any moment.
+constexpr std::chrono::milliseconds kExitInterval(5);
+
+/// The pause after a failure, before the next attempt.
+constexpr std::chrono::milliseconds kPauseAfterFailure(100);
+
+} // namespace
+
+SerialLoop::SerialLoop(HypervisorEngine& hypervisor, ChildReaper& reaper, PollInterrupt& wake)
+    : mHypervisor(hypervisor), mReaper(reaper), mWake(wake), mThread([this] { pRun(); })
+{}
+
+SerialLoop::~SerialLoop()
+{
+    mStopping = true;
+    mWake.interrupt();
+    mThread.join();
+}
+
+void SerialLoop::pRun() noexcept
+{
+    while (!mStopping) {
+        try {
+            pPollOnce();
+        } catch (const std::exception& error) {
+            logLine(LogLevel::Error, "serial lines: ", explain(error));
+            std::this_thread::sleep_for(kPauseAfterFailure);
+        }
+    }
+}
+
+void SerialLoop::pPollOnce()
+{
+    const bool linesEnding = mHypervisor.serviceEndedLines(); // first: it hands commands to the reaper
+    const bool commandsEnding = mReaper.reap();
+    std::chrono::milliseconds timeout = PollSet::TIMEOUT_INFINITE;
+    if (commandsEnding) timeout = kReapInterval;
+    if (linesEnding) timeout = kExitInterval;
+    const std::vector<SerialWatch> watches = mHypervisor.serialWatches();
+    PollSet set(mWake.getPollFd());
+    for (const SerialWatch& watch : watches)
+        set += watch.fd;
+    const PollResult result = set.wait(timeout);
+    if (result.contains(mWake.getPollFd())) mWake.eoi();
+    for (const SerialWatch& watch : watches) {
+        if (result.contains(watch.fd)) mHypervisor.serviceSerial(watch.partition);
+    }
+}
+
+} // namespace qel::protocol

@@ -1,0 +1,38 @@
+#pragma once
+
+#include <qel/common/util/Poll.hpp>
+
+#include "hypervisor/ChildReaper.hpp"
+#include "hypervisor/HypervisorEngine.hpp"
+
+#include <atomic>
+#include <thread>
+
+namespace qel::protocol {
+
+/// The one thread that moves the serial data of all partitions and reaps the commands that have ended. It waits for
+/// the hypervisor's serial watches, and for a wake-up when they have changed.
+/// Thread safety: one thread owns it.
+class SerialLoop {
+public:
+    /// Starts the thread. @param hypervisor, reaper, wake  borrowed; must outlive this object
+    SerialLoop(HypervisorEngine& hypervisor, ChildReaper& reaper, PollInterrupt& wake);
+
+    /// Stops the thread and waits for it.
+    ~SerialLoop();
+
+    SerialLoop(const SerialLoop&) = delete;
+    SerialLoop& operator=(const SerialLoop&) = delete;
+
+private:
+    void pRun() noexcept;
+    void pPollOnce();
+
+    HypervisorEngine& mHypervisor;
+    ChildReaper& mReaper;
+    PollInterrupt& mWake;
+    std::atomic<bool> mStopping{false};
+    std::thread mThread;
+};
+
+} // namespace qel::protocol

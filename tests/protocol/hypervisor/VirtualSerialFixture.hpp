@@ -1,0 +1,43 @@
+#pragma once
+
+#include "protocol/hypervisor/HypervisorFixture.hpp"
+
+#include <string>
+
+namespace qel::test {
+
+/// Virtual serial sessions, through the hypervisor that keeps them.
+class VirtualSerialFixture : public HypervisorFixture {
+protected:
+    unsigned int open(Peer& peer, std::uint16_t partition, std::uint16_t number = 0, bool force = false)
+    {
+        return statusOf(peer, QelMessageVirtualSerialOpenReq(partition, number, force));
+    }
+    unsigned int close(Peer& peer, std::uint16_t partition, std::uint16_t number = 0, bool force = false)
+    {
+        return statusOf(peer, QelMessageVirtualSerialCloseReq(partition, number, force));
+    }
+    unsigned int setUp(Peer& peer, std::uint16_t partition, std::uint16_t number = 0)
+    {
+        return statusOf(peer, QelMessageVirtualSerialSetupSessionReq(partition, number));
+    }
+    /// Takes the session-closed notice. @param statusDetail  how the command ended, where the notice says so
+    static void expectClosed(Peer& peer, std::uint16_t partition, unsigned int reason, unsigned int statusDetail = 0)
+    {
+        const auto notice = peer.link.take<QelMessageVirtualSerialSessionClosedAsync>();
+        EXPECT_EQ(notice->getLpId(), partition);
+        EXPECT_EQ(notice->getVssConnectionNumber(), 0U);
+        EXPECT_EQ(notice->getCloseReason(), reason);
+        EXPECT_EQ(notice->getStatus(), 0U);
+        EXPECT_EQ(notice->getStatusDetail(), statusDetail);
+    }
+    static std::string takeData(Peer& peer, std::uint16_t partition)
+    {
+        const auto data = peer.link.take<QelMessageVirtualSerialDataToDaxAsync>();
+        EXPECT_EQ(data->getLpId(), partition);
+        EXPECT_EQ(data->getVssConnectionNumber(), 0U);
+        return std::string(data->getSerialData(), data->getSerialDataLength());
+    }
+};
+
+} // namespace qel::test

@@ -1,0 +1,311 @@
+#include <qel/common/QelInternalMessageRegistry.hpp>
+#include <qel/common/QelMessageCast.hpp>
+#include <qel/common/io/StreamIOException.hpp>
+#include <qel/common/util/TimeProvider.hpp>
+
+#include "protocol/hypervisor/HypervisorFixture.hpp"
+#include "server/Admission.hpp"
+#include "support/CredentialDirectory.hpp"
+#include "support/LoopbackEnds.hpp"
+
+#include <future>
+#include <gmock/gmock.h>
+
+namespace qel::test {
+
+namespace {
+
+using protocol::Admission;
+using protocol::PeerPins;
+using ::testing::Contains;
+using ::testing::HasSubstr;
+using ::testing::IsEmpty;
+
+/// The hypervisor end admits a console; the test plays the console.
+class AdmissionTest : public HypervisorFixture {
+protected:
+    AdmissionTest()
+    {
+        serverContext.setCredentials(Authority::trusted().serverCredentials());
+        clientContext.setCredentials(Authority::trusted().clientCredentials());
+    }
+
+    void start(std::chrono::milliseconds time = Loopback::kDeadline, PeerPins pins = {})
+    {
+        admission =
+            std::make_unique<Admission>(*hypervisor, std::move(loopback.far), "the test", serverContext,
+                                        std::move(pins), TimeProvider::steady() + time, [this] { ended.set_value(); });
+        admission->start();
+    }
+
+    void awaitEnd()
+    {
+        ASSERT_EQ(ended.get_future().wait_for(Loopback::kDeadline), std::future_status::ready);
+        EXPECT_TRUE(admission->hasEnded());
+    }
+
+    void expectRefusal(const std::string& reason)
+    {
+        awaitEnd();
+        EXPECT_EQ(admission->release().stream, nullptr);
+        EXPECT_THAT(log.lines(), Contains("W: [qel] the test: refused: " + reason));
+    }
+
+    void send(const QelMessage& message) { QelMessageStream(*loopback.near, internal()).write(message); }
+
+    static QelInternalMessageRegistry& internal() { return QelInternalMessageRegistry::getInstance(); }
+
+    /// Reads a message in the clear and expects a T.
+    template <typename T>
+    void expect()
+    {
+        const auto message = QelMessageStream(*loopback.near, internal()).read();
+        EXPECT_NE(dynamic_cast<const T*>(message.get()), nullptr) << message->getLogID();
+    }
+
+    void expectClosed()
+    {
+        char byte = 0;
+        EXPECT_EQ(loopback.near->read(&byte, 1), 0U);
+    }
+
+    /// Runs the console's steps up to TLS. @return its stream
+    std::unique_ptr<SSLStream> startTls()
+    {
+        send(QelMessageUpgradeConnectionAsync());
+        expect<QelMessageUpgradeConnectionAsync>();
+        auto tls = std::make_unique<SSLStream>(clientContext, std::move(loopback.near));
+        tls->handshake();
+        return tls;
+    }
+
+    Loopback loopback;
+    SSLServerContext serverContext;
+    SSLClientContext clientContext;
+    std::promise<void> ended;
+    std::unique_ptr<Admission> admission; // destroyed before what it borrows
+};
+
+TEST_F(AdmissionTest, AConsoleThatAsksForTlsIsAdmitted)
+{
+    start();
+    const auto console = startTls();
+    awaitEnd();
+    Admission::Admitted admitted = admission->release();
+    ASSERT_NE(admitted.stream, nullptr);
+    EXPECT_EQ(admitted.peer, "the test");
+    EXPECT_GT(admitted.timeLeft, std::chrono::milliseconds(0));
+    EXPECT_LE(admitted.timeLeft, Loopback::kDeadline);
+    admission.reset(); // the stream outlives it
+    console->write("to the server", 13);
+    std::string text(13, '\0');
+    admitted.stream->fill(&text[0], text.size());
+    EXPECT_EQ(text, "to the server");
+    EXPECT_TRUE(PollSet(PollFd(admitted.descriptor, PollEvents::Write)).poll().anyReady());
+    EXPECT_THAT(log.lines(), IsEmpty());
+}
+
+TEST_F(AdmissionTest, TheWriteDeadlineEndsWithTheHandshake)
+{
+    start();
+    const auto console = startTls();
+    awaitEnd();
+    const Admission::Admitted admitted = admission->release();
+    timeval timeout{};
+    socklen_t length = sizeof(timeout);
+    admitted.stream->write("x", 1); // the next transfer passes the changed deadline to the kernel
+    ASSERT_EQ(::getsockopt(admitted.descriptor, SOL_SOCKET, SO_SNDTIMEO, &timeout, &length), 0);
+    EXPECT_EQ(timeout.tv_sec, 0);
+    EXPECT_EQ(timeout.tv_usec, 0);
+}
+
+TEST_F(AdmissionTest, ASilentConsoleIsClosedAtTheDeadline)
+{
+    start(std::chrono::milliseconds(20));
+    expectClosed();
+    expectRefusal("the peer did not ask for TLS in time");
+}
+
+TEST_F(AdmissionTest, APartialRequestIsClosedAtTheDeadline)
+{
+    start(std::chrono::milliseconds(50));
+    const QelMessageUpgradeConnectionAsync request;
+    loopback.near->write(request.serialize(), request.msgLength() - 1);
+    expectClosed();
+    expectRefusal("the peer did not ask for TLS in time");
+}
+
+TEST_F(AdmissionTest, AConsoleSilentAfterItsRequestIsClosedAtTheDeadline)
+{
+    start(std::chrono::milliseconds(500)); // enough for the response
+    send(QelMessageUpgradeConnectionAsync());
+    expect<QelMessageUpgradeConnectionAsync>();
+    expectClosed();
+    expectRefusal("the TLS handshake did not finish in time");
+}
+
+TEST_F(AdmissionTest, OneDeadlineCoversAllSteps)
+{
+    // Each byte comes well before the deadline, all of them together do not.
+    start(std::chrono::milliseconds(200));
+    const QelMessageUpgradeConnectionAsync request;
+    unsigned sent = 0;
+    auto end = ended.get_future();
+    for (; sent + 1 < request.msgLength(); ++sent) {
+        loopback.near->write(request.serialize() + sent, 1);
+        if (end.wait_for(std::chrono::milliseconds(20)) == std::future_status::ready) break;
+    }
+    EXPECT_LT(sent + 1, request.msgLength()) << "it was never closed";
+    EXPECT_EQ(admission->release().stream, nullptr);
+}
+
+TEST_F(AdmissionTest, AConsoleThatDisconnectsEndsTheAdmission)
+{
+    start();
+    loopback.near.reset();
+    expectRefusal("the peer did not ask for TLS but ended the connection: EOF");
+}
+
+TEST_F(AdmissionTest, AConsoleThatDoesNotAskForTlsIsRefused)
+{
+    start();
+    send(versionRequest("a"));
+    expect<QelMessageAbortHandshakeAsync>();
+    expectClosed();
+    awaitEnd();
+    EXPECT_EQ(admission->release().stream, nullptr);
+    EXPECT_THAT(log.lines(), Contains(HasSubstr("the test: refused: the peer did not ask for TLS but sent "
+                                                "something else: [CID: ")));
+}
+
+TEST_F(AdmissionTest, TlsWithoutARequestIsAMalformedMessage)
+{
+    start();
+    const std::string hello("\x16\x03\x01\x02\x00\x01\x00\x01\xfc\x03\x03", 11);
+    loopback.near->write(hello.data(), hello.size());
+    expectRefusal("the peer did not ask for TLS but sent something else: Invalid length");
+}
+
+TEST_F(AdmissionTest, BytesInTheClearAfterTheRequestAreRefused)
+{
+    const QelMessageUpgradeConnectionAsync request;
+    const auto version = versionRequest("a");
+    const std::string both =
+        std::string(request.serialize(), request.msgLength()) + std::string(version.serialize(), version.msgLength());
+    loopback.near->write(both.data(), both.size());
+    start();
+    expectRefusal("the peer sent data too early in the handshake");
+}
+
+TEST_F(AdmissionTest, MessagesInsteadOfTlsAreRefused)
+{
+    start();
+    send(QelMessageUpgradeConnectionAsync());
+    expect<QelMessageUpgradeConnectionAsync>();
+    send(versionRequest("a"));
+    expectRefusal("the TLS handshake failed: SSL error 1");
+    Peer other;
+    identify(other, "a"); // the identity is free
+}
+
+TEST_F(AdmissionTest, AtTheMaximumOfConsolesTheAnswerIsAbort)
+{
+    protocol::HypervisorSettings settings;
+    settings.maxConsoles = 1;
+    makeHypervisor(settings);
+    Peer first;
+    identify(first, "first");
+    start();
+    send(QelMessageUpgradeConnectionAsync());
+    expect<QelMessageAbortHandshakeAsync>();
+    expectClosed();
+    expectRefusal("no more consoles are taken");
+}
+
+TEST_F(AdmissionTest, UnidentifiedConsolesDoNotCount)
+{
+    protocol::HypervisorSettings settings;
+    settings.maxConsoles = 1;
+    makeHypervisor(settings);
+    Peer first;
+    connect(first);
+    start();
+    EXPECT_NE(startTls(), nullptr);
+}
+
+TEST_F(AdmissionTest, DuringShutdownTheAnswerIsAbort)
+{
+    hypervisor->shutDown();
+    start();
+    send(QelMessageUpgradeConnectionAsync());
+    expect<QelMessageAbortHandshakeAsync>();
+    expectRefusal("no more consoles are taken");
+}
+
+TEST_F(AdmissionTest, StopSendsAbortToAConsoleThatHasNotAsked)
+{
+    start();
+    admission->stop();
+    expect<QelMessageAbortHandshakeAsync>();
+    expectClosed();
+    expectRefusal("the server stops");
+}
+
+TEST_F(AdmissionTest, StopCutsAConsoleInTheTlsHandshake)
+{
+    start();
+    send(QelMessageUpgradeConnectionAsync());
+    expect<QelMessageUpgradeConnectionAsync>();
+    admission->stop();
+    expectClosed();
+    awaitEnd();
+    EXPECT_EQ(admission->release().stream, nullptr);
+}
+
+TEST_F(AdmissionTest, CanBeDestroyedAtAnyTime)
+{
+    start();
+    send(QelMessageUpgradeConnectionAsync());
+    expect<QelMessageUpgradeConnectionAsync>();
+    admission.reset();
+    expectClosed();
+}
+
+TEST_F(AdmissionTest, CanBeDestroyedWithoutAStart)
+{
+    admission = std::make_unique<Admission>(*hypervisor, std::move(loopback.far), "the test", serverContext, PeerPins(),
+                                            TimeProvider::steady(), [] {});
+    admission.reset();
+    expectClosed();
+}
+
+TEST_F(AdmissionTest, AConsoleWithACertificateOfAnotherRootIsRefused)
+{
+    SSLCredentials stranger = Authority::stranger().clientCredentials();
+    stranger.mRootCA = Authority::trusted().root().getPEM();
+    clientContext.setCredentials(stranger);
+    start();
+    EXPECT_THROW(startTls(), StreamIOException);
+    expectRefusal("the peer's certificate is refused: unable to get local issuer certificate");
+}
+
+TEST_F(AdmissionTest, AConsoleThatIsNotPinnedIsRefused)
+{
+    start(Loopback::kDeadline, {{"server"}, {}});
+    const auto console = startTls(); // for the console TLS is done
+    char byte = 0;
+    EXPECT_EQ(console->read(&byte, 1), 0U);
+    expectRefusal("wrong peer: the name \"client\" does not match the pinned names");
+}
+
+TEST_F(AdmissionTest, APinnedConsoleIsAdmitted)
+{
+    start(Loopback::kDeadline, {{"client"}, {}});
+    const auto console = startTls();
+    awaitEnd();
+    EXPECT_NE(admission->release().stream, nullptr);
+}
+
+} // namespace
+
+} // namespace qel::test

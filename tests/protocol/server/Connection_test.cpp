@@ -1,0 +1,427 @@
+#include <qel/common/QelInternalMessageRegistry.hpp>
+#include <qel/common/QelMessageDax.hpp>
+#include <qel/common/io/StreamIOException.hpp>
+
+#include "protocol/hypervisor/HypervisorFixture.hpp"
+#include "server/Connection.hpp"
+#include "support/LoopbackEnds.hpp"
+
+#include <future>
+#include <gmock/gmock.h>
+#include <sstream>
+#include <thread>
+
+namespace qel::test {
+
+namespace {
+
+using protocol::Connection;
+using protocol::ConnectionLimits;
+using ::testing::Contains;
+using ::testing::HasSubstr;
+using ::testing::StartsWith;
+
+class ConnectionTest : public HypervisorFixture {
+protected:
+    void start(ConnectionLimits limits = {})
+    {
+        const int descriptor = loopback.far->getSocket().getFd();
+        connection = std::make_unique<Connection>(*hypervisor, std::move(loopback.far), descriptor, "the test", limits,
+                                                  [this] { ended.set_value(); });
+        connection->start();
+    }
+
+    void identify() { ASSERT_EQ(messages.ask(versionRequest("a"))->getStatus(), 0U); }
+
+    void expectEnd()
+    {
+        ASSERT_EQ(ended.get_future().wait_for(Loopback::kDeadline), std::future_status::ready);
+        EXPECT_TRUE(connection->hasEnded());
+    }
+
+    /// Sends requests without reading responses until the server stops reading. @return how many it sent
+    unsigned sendUntilStuck(const QelMessage& request)
+    {
+        loopback.near->setWriteDeadline(std::chrono::milliseconds(300));
+        unsigned sent = 0;
+        try {
+            for (;; ++sent)
+                messages.send(request);
+        } catch (const StreamIOException&) {
+            return sent;
+        }
+    }
+
+    /// Opens partition 1 and lets it print, while the console reads nothing, until the partition is held back.
+    /// @return how many pieces of 4 KiB it has printed
+    unsigned printUntilHeldBack()
+    {
+        messages.ask(QelMessageInterfaceCmpOpenKrogSessionReq());
+        messages.ask(QelMessageVirtualSerialOpenReq(1, 0, false));
+        messages.ask(QelMessageVirtualSerialSetupSessionReq(1, 0));
+        unsigned chunks = 0;
+        for (unsigned full = 0; full < 50; full = hypervisor->serialWatches().empty() ? full + 1 : 0) {
+            if (full > 0) {
+                std::this_thread::sleep_for(std::chrono::milliseconds(1)); // the system's buffers may still be filling
+                continue;
+            }
+            port1->output = {std::string(4096, static_cast<char>('a' + ++chunks % 26))};
+            hypervisor->serviceSerial(1);
+        }
+        return chunks;
+    }
+
+    Loopback loopback;
+    /// Sends many requests before it reads the first response.
+    void expectAnswersInOrder()
+    {
+        std::vector<unsigned int> asked;
+        for (int i = 0; i < 100; ++i) {
+            const QelMessageGetInterfaceLimitsReq request;
+            asked.push_back(request.getCallerId());
+            messages.send(request);
+        }
+        for (const unsigned int callerId : asked)
+            EXPECT_EQ(messages.receive()->getCallerId(), callerId);
+    }
+
+    LoopbackMessages messages{*loopback.near};
+    std::promise<void> ended;
+    std::unique_ptr<Connection> connection; // destroyed before what it borrows
+};
+
+TEST_F(ConnectionTest, RequestsAreAnsweredInOrder)
+{
+    start();
+    identify();
+    expectAnswersInOrder();
+}
+
+TEST_F(ConnectionTest, EndsWhenTheConsoleDisconnects)
+{
+    start();
+    identify();
+    loopback.near.reset();
+    expectEnd();
+    FakeConsole other;
+    const auto id = hypervisor->connect(other, "other");
+    hypervisor->receive(id, versionRequest("a"));
+    EXPECT_EQ(other.take()->getStatus(), 0U); // the identity is free again
+}
+
+TEST_F(ConnectionTest, AHalfClosedConsoleStillGetsItsResponses)
+{
+    start();
+    identify();
+    const QelMessageGetInterfaceLimitsReq request;
+    messages.send(request);
+    ASSERT_EQ(::shutdown(loopback.near->getSocket().getFd(), SHUT_WR), 0);
+    EXPECT_EQ(messages.receive()->getCallerId(), request.getCallerId());
+    EXPECT_TRUE(messages.isClosed());
+    expectEnd();
+}
+
+TEST_F(ConnectionTest, AMalformedFrameEndsTheConnection)
+{
+    struct Case {
+        const char* name;
+        std::string bytes;
+        const char* reason;
+    };
+    const std::vector<Case> cases{
+        {"length 0", std::string("\xDE\xCA\xFF\x20\0\0\0\0", 8), "Invalid length"},
+        {"length 16385", std::string("\xDE\xCA\xFF\x20\0\0\x40\x01", 8), "Invalid length"},
+        {"length 9", std::string("\xDE\xCA\xFF\x20\0\0\0\x09x", 9), "length"},
+        {"eyecatcher", std::string("XXXX\0\0\0\x20", 8) + std::string(24, '\0'), "i_buffer bad eyecatcher"},
+        {"version", std::string("\xDE\xCA\xFF\x10\0\0\0\x20", 8) + std::string(24, '\0'),
+         "i_buffer bad header version"},
+    };
+    for (const Case& entry : cases) {
+        SCOPED_TRACE(entry.name);
+        log.clear();
+        Loopback own;
+        LoopbackMessages frames(*own.near);
+        const int descriptor = own.far->getSocket().getFd();
+        std::promise<void> end;
+        Connection broken(*hypervisor, std::move(own.far), descriptor, "the test", {}, [&] { end.set_value(); });
+        broken.start();
+        EXPECT_EQ(frames.ask(versionRequest("a"))->getStatus(), 0U); // free again each time
+        frames.sendBytes(entry.bytes);
+        EXPECT_TRUE(frames.isClosed());
+        ASSERT_EQ(end.get_future().wait_for(Loopback::kDeadline), std::future_status::ready);
+        EXPECT_THAT(log.lines(), Contains(HasSubstr(std::string(": closed for a malformed frame: ") + entry.reason)));
+    }
+}
+
+TEST_F(ConnectionTest, ResponsesFromBeforeAMalformedFrameAreStillSent)
+{
+    start();
+    identify();
+    const QelMessageGetInterfaceLimitsReq request;
+    messages.sendBytes(std::string(request.serialize(), request.msgLength()) + std::string(8, 'x'));
+    EXPECT_EQ(messages.receive()->getCallerId(), request.getCallerId());
+    EXPECT_TRUE(messages.isClosed());
+}
+
+TEST_F(ConnectionTest, ASilentConsoleIsClosed)
+{
+    ConnectionLimits limits;
+    limits.handshake = std::chrono::milliseconds(20);
+    start(limits);
+    EXPECT_TRUE(messages.isClosed());
+    expectEnd();
+    EXPECT_THAT(log.lines(), Contains("W: [qel] console 1: closed, it did not introduce itself in time"));
+}
+
+TEST_F(ConnectionTest, AConsoleThatAsksWithoutIdentifyingItselfIsClosed)
+{
+    ConnectionLimits limits;
+    limits.handshake = std::chrono::milliseconds(50);
+    start(limits);
+    EXPECT_THROW(
+        {
+            for (;;)
+                EXPECT_EQ(messages.ask(QelMessageGetQelTodReq())->getStatus(), 4U);
+        },
+        StreamIOException);
+    expectEnd();
+}
+
+TEST_F(ConnectionTest, AConsoleThatNeitherReadsNorIdentifiesItselfIsClosed)
+{
+    ConnectionLimits limits;
+    limits.handshake = std::chrono::milliseconds(400);
+    limits.linger = std::chrono::milliseconds(20);
+    start(limits);
+    sendUntilStuck(QelMessageGetQelTodReq());
+    expectEnd();
+}
+
+TEST_F(ConnectionTest, AnIdentifiedConsoleHasNoReadDeadline)
+{
+    ConnectionLimits limits;
+    limits.handshake = std::chrono::milliseconds(1000);
+    start(limits);
+    identify();
+    EXPECT_EQ(ended.get_future().wait_for(std::chrono::milliseconds(1200)), std::future_status::timeout);
+    EXPECT_EQ(messages.ask(QelMessageGetQelTodReq())->getStatus(), 0U);
+}
+
+TEST_F(ConnectionTest, AnIdentifiedConsoleMayBeHeldBackBeyondTheHandshakeTimeout)
+{
+    ConnectionLimits limits;
+    limits.handshake = std::chrono::milliseconds(1000);
+    start(limits);
+    identify();
+    messages.ask(QelMessageInterfaceCmpOpenKrogSessionReq());
+    messages.ask(QelMessageVirtualSerialOpenReq(1, 0, false));
+    messages.ask(QelMessageVirtualSerialSetupSessionReq(1, 0));
+    port1->takes = 0;
+    const std::string data(16000, 'x');
+    for (int i = 0; i < 5; ++i) // more than the 64 KiB that the server keeps
+        messages.send(QelMessageVirtualSerialDataToOsAsync(1, 0, 16000, data.data()));
+    EXPECT_EQ(ended.get_future().wait_for(std::chrono::milliseconds(1200)), std::future_status::timeout);
+    EXPECT_FALSE(hypervisor->mayReceive(1));
+}
+
+TEST_F(ConnectionTest, AConsoleThatDoesNotReadItsResponsesIsNotReadAndLosesNothing)
+{
+    start();
+    identify();
+    messages.ask(QelMessageSetGlobalSaveAreaMetadataReq(std::string(16000, 'm')));
+    const QelMessageGetGlobalSaveAreaMetadataReq request;
+    const unsigned sent = sendUntilStuck(request); // a request of 32 bytes gets 16 KiB
+    EXPECT_GT(sent, 10U);
+    EXPECT_FALSE(hypervisor->mayReceive(1));
+    for (unsigned i = 0; i < sent; ++i) {
+        const auto response = messages.receive();
+        ASSERT_EQ(response->getCallerId(), request.getCallerId());
+        ASSERT_EQ(response->dataLength(), 16002U);
+    }
+}
+
+TEST_F(ConnectionTest, AConsoleThatDoesNotReadDelaysNoOther)
+{
+    start();
+    identify();
+    messages.ask(QelMessageSetGlobalSaveAreaMetadataReq(std::string(16000, 'm')));
+    sendUntilStuck(QelMessageGetGlobalSaveAreaMetadataReq());
+
+    Loopback other;
+    LoopbackMessages frames(*other.near);
+    const int descriptor = other.far->getSocket().getFd();
+    Connection second(*hypervisor, std::move(other.far), descriptor, "other", {}, [] {});
+    second.start();
+    EXPECT_EQ(frames.ask(versionRequest("b"))->getStatus(), 0U);
+    EXPECT_EQ(frames.ask(QelMessageDaxBroadcastReq(0, 1, 0, "", "x"))->getStatus(), 0U);
+}
+
+TEST_F(ConnectionTest, APartitionThatPrintsWithoutEndLeavesRoomForResponses)
+{
+    start();
+    identify();
+    const unsigned chunks = printUntilHeldBack();
+    EXPECT_TRUE(hypervisor->mayReceive(1));
+    const QelMessageGetQelTodReq request;
+    messages.send(request);
+
+    // The queue holds at most half of the limit and one message, and one message waits for room. The rest must be in
+    // the buffers of the system.
+    std::ostringstream text;
+    connection->dumpStatistics(text);
+    EXPECT_THAT(text.str(), HasSubstr("\n  Limits:         131072/262144\n"));
+    EXPECT_THAT(text.str(), HasSubstr("\n  Max Size (HWM): 13")); // 131072 to 135211
+    for (unsigned i = 1; i <= chunks; ++i) {
+        const auto data = messages.receive<QelMessageVirtualSerialDataToDaxAsync>();
+        ASSERT_EQ(data->getSerialDataLength(), 4096);
+        ASSERT_EQ(data->getSerialData()[0], static_cast<char>('a' + i % 26)) << i;
+    }
+    EXPECT_EQ(messages.receive()->getCallerId(), request.getCallerId());
+}
+
+TEST_F(ConnectionTest, TheStatisticsNameTheConsole)
+{
+    ConnectionLimits limits;
+    limits.queueBytes = 1001;
+    start(limits);
+    identify();
+    std::ostringstream text;
+    connection->dumpStatistics(text);
+    EXPECT_THAT(text.str(), StartsWith("Queue of console 1, the test:\n"
+                                       "  Limits:         501/1001\n"
+                                       "  Max Size (HWM): 80 B\n"
+                                       "  Pending:        0 (0 B)\n"
+                                       "  Dropped:        0 (0 B)\n"
+                                       "  Completed:      1 (80 B)\n"));
+}
+
+TEST_F(ConnectionTest, TheSmallestQueueHoldsOneMessage)
+{
+    ConnectionLimits limits;
+    limits.queueBytes = 1;
+    start(limits);
+    identify();
+    expectAnswersInOrder();
+}
+
+TEST_F(ConnectionTest, NoticesADisconnectWhileItDoesNotRead)
+{
+    start();
+    identify();
+    messages.ask(QelMessageInterfaceCmpOpenKrogSessionReq());
+    messages.ask(QelMessageVirtualSerialOpenReq(1, 0, false));
+    messages.ask(QelMessageVirtualSerialSetupSessionReq(1, 0));
+    port1->takes = 0;
+    const std::string data(16000, 'x');
+    // Five stop the reader; what follows stays unread in the buffers of the system.
+    for (int i = 0; i < 5; ++i)
+        messages.send(QelMessageVirtualSerialDataToOsAsync(1, 0, 16000, data.data()));
+    messages.send(QelMessageGetQelTodReq());
+    loopback.near.reset();
+    expectEnd();
+}
+
+TEST_F(ConnectionTest, ReadingResumesWhenThePartitionTakesItsInput)
+{
+    start();
+    identify();
+    messages.ask(QelMessageInterfaceCmpOpenKrogSessionReq());
+    messages.ask(QelMessageVirtualSerialOpenReq(1, 0, false));
+    messages.ask(QelMessageVirtualSerialSetupSessionReq(1, 0));
+    port1->takes = 0;
+    const std::string data(16000, 'x');
+    for (int i = 0; i < 10; ++i)
+        messages.send(QelMessageVirtualSerialDataToOsAsync(1, 0, 16000, data.data()));
+    const QelMessageGetQelTodReq request;
+    messages.send(request);
+    std::promise<unsigned int> answered;
+    std::thread reader([&] { answered.set_value(messages.receive()->getCallerId()); });
+    auto answer = answered.get_future();
+    EXPECT_EQ(answer.wait_for(std::chrono::milliseconds(100)), std::future_status::timeout);
+    do {
+        port1->takes = 1000 * 1000;
+        hypervisor->serviceSerial(1);
+    } while (answer.wait_for(std::chrono::milliseconds(1)) != std::future_status::ready);
+    reader.join();
+    EXPECT_EQ(answer.get(), request.getCallerId());
+}
+
+TEST_F(ConnectionTest, ARefusedConsoleGetsItsResponseAndIsClosed)
+{
+    protocol::HypervisorSettings settings;
+    settings.maxConsoles = 1;
+    makeHypervisor(settings);
+    Peer first;
+    HypervisorFixture::identify(first, "first");
+    start();
+    EXPECT_EQ(messages.ask(versionRequest("a"))->getStatus(), 18U);
+    EXPECT_TRUE(messages.isClosed());
+    expectEnd();
+}
+
+TEST_F(ConnectionTest, OnShutdownTheNoticeIsSentAndTheConnectionEnds)
+{
+    start();
+    identify();
+    hypervisor->shutDown();
+    EXPECT_NE(messages.receive<QelMessageKrogConnectionClosedAsync>(), nullptr);
+    EXPECT_TRUE(messages.isClosed());
+    expectEnd();
+}
+
+TEST_F(ConnectionTest, AbortEndsTheConnectionWhateverTheConsoleDoes)
+{
+    start();
+    identify();
+    messages.ask(QelMessageSetGlobalSaveAreaMetadataReq(std::string(16000, 'm')));
+    sendUntilStuck(QelMessageGetGlobalSaveAreaMetadataReq());
+    connection->abort();
+    expectEnd();
+}
+
+TEST_F(ConnectionTest, ARefusedConsoleThatDoesNotReadIsCut)
+{
+    ConnectionLimits limits;
+    limits.linger = std::chrono::milliseconds(20);
+    start(limits);
+    identify();
+    printUntilHeldBack();
+    messages.send(QelMessageUpgradeConnectionAsync());
+    expectEnd();
+}
+
+TEST_F(ConnectionTest, ARefusedConsoleThatReadsGetsEverythingQueued)
+{
+    start();
+    identify();
+    const unsigned chunks = printUntilHeldBack();
+    messages.send(QelMessageUpgradeConnectionAsync());
+    for (unsigned i = 1; i <= chunks; ++i)
+        ASSERT_NE(messages.receive<QelMessageVirtualSerialDataToDaxAsync>(), nullptr) << i;
+    const auto last = messages.receive();
+    EXPECT_EQ(last->getFunction(), 0x6001);
+    EXPECT_EQ(last->getOperation(), 0x0002);
+    EXPECT_TRUE(messages.isClosed());
+    expectEnd();
+}
+
+TEST_F(ConnectionTest, CanBeDestroyedAtAnyTime)
+{
+    start();
+    identify();
+    connection.reset();
+    EXPECT_TRUE(messages.isClosed());
+}
+
+TEST_F(ConnectionTest, CanBeDestroyedWithoutAStart)
+{
+    const int descriptor = loopback.far->getSocket().getFd();
+    connection =
+        std::make_unique<Connection>(*hypervisor, std::move(loopback.far), descriptor, "x", ConnectionLimits(), [] {});
+    connection.reset();
+    EXPECT_TRUE(messages.isClosed());
+}
+
+} // namespace
+
+} // namespace qel::test
