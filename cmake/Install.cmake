@@ -1,5 +1,5 @@
-# What `cmake --install` puts under the prefix: the library, its headers, and the two ways in which other projects find
-# them, a CMake package and a pkg-config file. Nothing installed contains the prefix, so the tree may be moved; for
+# What `cmake --install` puts under the prefix: the libraries, their headers, and the two ways in which other projects find
+# them, a CMake package and pkg-config files. Nothing installed contains the prefix, so the tree may be moved; for
 # that the directories have to be relative to it.
 
 include(CMakePackageConfigHelpers)
@@ -14,6 +14,11 @@ endforeach()
 # Four components: what programs need to run (qel_runtime), what is needed to build them (qel_development), the program
 # qel (qel_program, beside its target) and the documents with the licence (qel_documentation).
 install(TARGETS qelcommon EXPORT qelTargets
+  LIBRARY DESTINATION ${CMAKE_INSTALL_LIBDIR}
+    COMPONENT qel_runtime NAMELINK_COMPONENT qel_development
+  ARCHIVE DESTINATION ${CMAKE_INSTALL_LIBDIR}
+    COMPONENT qel_development)
+install(TARGETS qelprotocol EXPORT qelProtocolTargets
   LIBRARY DESTINATION ${CMAKE_INSTALL_LIBDIR}
     COMPONENT qel_runtime NAMELINK_COMPONENT qel_development
   ARCHIVE DESTINATION ${CMAKE_INSTALL_LIBDIR}
@@ -38,6 +43,7 @@ configure_package_config_file(
 write_basic_package_version_file(${PROJECT_BINARY_DIR}/packaging/qelConfigVersion.cmake
   COMPATIBILITY SameMajorVersion)
 install(EXPORT qelTargets NAMESPACE qel:: DESTINATION ${qel_package_dir} COMPONENT qel_development)
+install(EXPORT qelProtocolTargets NAMESPACE qel:: DESTINATION ${qel_package_dir} COMPONENT qel_development)
 install(FILES
     ${PROJECT_BINARY_DIR}/packaging/qelConfig.cmake
     ${PROJECT_BINARY_DIR}/packaging/qelConfigVersion.cmake
@@ -46,7 +52,9 @@ install(FILES
 
 file(RELATIVE_PATH qel_pc_to_prefix /${CMAKE_INSTALL_LIBDIR}/pkgconfig /)
 string(REGEX REPLACE "/$" "" qel_pc_to_prefix "${qel_pc_to_prefix}")
-configure_file(${PROJECT_SOURCE_DIR}/packaging/qel.pc.in ${PROJECT_BINARY_DIR}/packaging/qel.pc @ONLY)
-install(FILES ${PROJECT_BINARY_DIR}/packaging/qel.pc
+foreach(package IN ITEMS qel qelprotocol)
+  configure_file(${PROJECT_SOURCE_DIR}/packaging/${package}.pc.in ${PROJECT_BINARY_DIR}/packaging/${package}.pc @ONLY)
+endforeach()
+install(FILES ${PROJECT_BINARY_DIR}/packaging/qel.pc ${PROJECT_BINARY_DIR}/packaging/qelprotocol.pc
   DESTINATION ${CMAKE_INSTALL_LIBDIR}/pkgconfig
   COMPONENT qel_development)

@@ -11,8 +11,10 @@
 
 using qel::test::outputOf;
 using testing::Contains;
+using testing::Each;
 using testing::ElementsAre;
 using testing::IsEmpty;
+using testing::ResultOf;
 
 namespace {
 
@@ -30,9 +32,17 @@ std::vector<std::string> namesIn(const std::string& listing)
 
 // Functions and data of the namespace, and what the compiler makes of its classes: type information, tables of virtual
 // functions, thunks, guards.
+const std::string kSpecial = "_Z(T[ISVT]|TC|GV|Thn?[0-9]+_|Tvn?[0-9]+_n?[0-9]+_)?NK?";
+
 bool isOurs(const std::string& name)
 {
-    static const std::regex ours("_Z(T[ISVT]|TC|GV|Thn?[0-9]+_|Tvn?[0-9]+_n?[0-9]+_)?NK?3qel.*");
+    static const std::regex ours(kSpecial + "3qel.*");
+    return std::regex_match(name, ours);
+}
+
+bool isOfProtocol(const std::string& name)
+{
+    static const std::regex ours(kSpecial + "3qel8protocol.*");
     return std::regex_match(name, ours);
 }
 
@@ -44,22 +54,33 @@ std::vector<std::string> foreign(const std::vector<std::string>& names)
     return result;
 }
 
-std::vector<std::string> exportedNames()
+std::vector<std::string> exportedNames(const std::string& library)
 {
-    return namesIn(outputOf(std::string(QEL_NM) + " -D --defined-only '" + QEL_LIBRARY_FILE + "'"));
+    return namesIn(outputOf(std::string(QEL_NM) + " -D --defined-only '" + library + "'"));
 }
 
-TEST(ExportedSymbols, AreAllOfOurNamespace) { EXPECT_THAT(foreign(exportedNames()), IsEmpty()); }
+TEST(ExportedSymbols, AreAllOfOurNamespace) { EXPECT_THAT(foreign(exportedNames(QEL_LIBRARY_FILE)), IsEmpty()); }
 
 TEST(ExportedSymbols, IncludeWhatUsersCallCatchAndDeriveFrom)
 {
-    const std::vector<std::string> names = exportedNames();
+    const std::vector<std::string> names = exportedNames(QEL_LIBRARY_FILE);
     EXPECT_THAT(names, Contains("_ZN3qel7versionEv"));                              // a free function
     EXPECT_THAT(names, Contains("_ZTIN3qel17StreamIOExceptionE"));                  // an exception
     EXPECT_THAT(names, Contains("_ZTVN3qel6StreamE"));                              // a base class
     EXPECT_THAT(names, Contains("_ZTTN3qel6StreamE"));                              // with a virtual base
     EXPECT_THAT(names, Contains("_ZN3qel16QelMessageStream4readEv"));               // a member function
     EXPECT_THAT(names, Contains("_ZNK3qel18QelMessageRegistry11deserializeEPKcj")); // a const one
+}
+
+TEST(ExportedSymbols, OfTheProtocolLibraryAreAllOfItsNamespace)
+{
+    const std::vector<std::string> names = exportedNames(QEL_PROTOCOL_FILE);
+    EXPECT_THAT(names, Each(ResultOf("is of qel::protocol", isOfProtocol, true)));
+    EXPECT_THAT(names, Contains("_ZTIN3qel8protocol11StatusErrorE")); // an exception
+    EXPECT_THAT(
+        names,
+        Contains("_ZN3qel8protocol7resolveERKNS0_13ServerAddressE" // a free function
+                 "NSt6chrono10time_pointINS4_3_V212steady_clockENS4_8durationIlSt5ratioILl1ELl1000000000EEEEEE"));
 }
 
 // The check itself can fail.
@@ -74,6 +95,7 @@ TEST(ExportedSymbolsCheck, FindsNamesOfOthers)
                                                 "qel_version",
                                                 "_init"};
     EXPECT_EQ(foreign(strangers), strangers);
+    EXPECT_FALSE(isOfProtocol("_ZN3qel7versionEv"));
 }
 
 TEST(ExportedSymbolsCheck, KnowsItsOwn)

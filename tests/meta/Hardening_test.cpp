@@ -48,7 +48,11 @@ std::vector<std::string> lacking(const ElfView& view)
     return result;
 }
 
-TEST(Hardening, ProtectsTheLibrary) { EXPECT_THAT(lacking(viewOf(QEL_LIBRARY_FILE)), IsEmpty()); }
+TEST(Hardening, ProtectsTheLibraries)
+{
+    EXPECT_THAT(lacking(viewOf(QEL_LIBRARY_FILE)), IsEmpty());
+    EXPECT_THAT(lacking(viewOf(QEL_PROTOCOL_FILE)), IsEmpty());
+}
 
 #ifdef QEL_PROGRAM
 TEST(Hardening, ProtectsTheProgram) { EXPECT_THAT(lacking(viewOf(QEL_PROGRAM)), IsEmpty()); }
