@@ -1,9 +1,10 @@
 #pragma once
 
+#include <qel/protocol/Peer.hpp>
+
 #include "hypervisor/ConsoleLink.hpp"
 
 #include <cstdint>
-#include <string>
 #include <utility>
 
 namespace qel::protocol {
@@ -19,15 +20,12 @@ enum class ConsoleState {
 };
 
 /// The hypervisor's entry for one connection. The hypervisor owns it and guards it with its lock.
-struct Console {
-    Console(ConsoleId number, std::string from, ConsoleLink& to) : id(number), peer(std::move(from)), link(to) {}
+struct ConsoleEntry {
+    ConsoleEntry(Peer from, ConsoleLink& to) : peer(std::move(from)), link(to) {}
 
-    ConsoleId id;
-    std::string peer;  ///< its address, for the log
+    Peer peer;         ///< its tool type and id are granted once it is identified
     ConsoleLink& link; ///< outlives the entry: see HypervisorEngine::connect()
     ConsoleState state = ConsoleState::Connected;
-    std::uint32_t toolType = 0; ///< this and the members below: valid once it is identified
-    std::string toolId;
     bool sessionOpen = false; ///< the hypervisor session
 };
 

@@ -7,6 +7,8 @@
 #include <qel/protocol/FrameLimits.hpp>
 #include <qel/protocol/Logging.hpp>
 
+#include "base/MessageKind.hpp"
+
 #include <algorithm>
 #include <chrono>
 #include <limits>
@@ -34,21 +36,6 @@ std::unique_ptr<QelMessage> bareResponse(const QelMessage& request, QelMessageSt
     return response;
 }
 
-/// By identity: the registry of this end does not know the class, which belongs to the steps before TLS.
-bool isUpgrade(const QelMessage& message)
-{
-    return std::make_tuple(static_cast<unsigned short>(message.getFunction()),
-                           static_cast<unsigned short>(message.getOperation()),
-                           message.getClassification()) == QelMessageUpgradeConnectionAsync::getMessageID();
-}
-
-template <typename T>
-bool isRequest(const QelMessage& message)
-{
-    const auto identity = T::getMessageID();
-    return message.getFunction() == std::get<0>(identity) && message.getOperation() == std::get<1>(identity);
-}
-
 QelCapabilities intersection(const QelCapabilities& left, const QelCapabilities& right)
 {
     QelCapabilities both;
@@ -67,23 +54,24 @@ HypervisorEngine::HypervisorEngine(HypervisorSettings settings, PartitionSet par
 
 HypervisorEngine::~HypervisorEngine() = default;
 
-ConsoleId HypervisorEngine::connect(ConsoleLink& link, const std::string& peer)
+ConsoleId HypervisorEngine::connect(ConsoleLink& link, Peer peer)
 {
     const MutexLock lock(mMutex);
     const ConsoleId id = ++mLastConsoleId;
-    Console& console = mConsoles.emplace(id, Console(id, peer, link)).first->second;
-    logLine(LogLevel::Info, "console ", id, " connected from ", peer);
+    peer.id = id;
+    ConsoleEntry& console = mConsoles.emplace(id, ConsoleEntry(std::move(peer), link)).first->second;
+    logLine(LogLevel::Info, "console ", id, " connected from ", console.peer.address);
     if (mShutDown) pClose(console);
     return id;
 }
 
-ConsoleState HypervisorEngine::receive(ConsoleId id, const QelMessage& message)
+Received HypervisorEngine::receive(ConsoleId id, const QelMessage& message)
 {
     const MutexLock lock(mMutex);
     const auto found = mConsoles.find(id);
-    if (found == mConsoles.end()) return ConsoleState::Closing;
-    Console& console = found->second;
-    if (console.state == ConsoleState::Closing) return console.state;
+    if (found == mConsoles.end()) return {ConsoleState::Closing, true};
+    ConsoleEntry& console = found->second;
+    if (console.state == ConsoleState::Closing) return {console.state, pMayReceive(console)};
     switch (message.getClassification()) {
     case QelMessageClassification::Request:
         pHandleRequest(console, message);
@@ -96,15 +84,14 @@ ConsoleState HypervisorEngine::receive(ConsoleId id, const QelMessage& message)
         break;
     }
     if (mPartitions.takeChanged()) mWakeSerial();
-    return console.state;
+    return {console.state, pMayReceive(console)};
 }
 
 bool HypervisorEngine::mayReceive(ConsoleId id) const
 {
     const MutexLock lock(mMutex);
     const auto found = mConsoles.find(id);
-    if (found == mConsoles.end()) return true;
-    return found->second.link.hasRoom() && mPartitions.hasInputRoom(found->second);
+    return found == mConsoles.end() || pMayReceive(found->second);
 }
 
 bool HypervisorEngine::takesConsoles() const
@@ -136,7 +123,7 @@ void HypervisorEngine::shutDown()
     mShutDown = true;
     mPartitions.shutDown();
     for (auto& entry : mConsoles) {
-        Console& console = entry.second;
+        ConsoleEntry& console = entry.second;
         if (console.state == ConsoleState::Identified) {
             console.link.post(std::make_unique<QelMessageKrogConnectionClosedAsync>());
         }
@@ -165,13 +152,13 @@ bool HypervisorEngine::serviceEndedLines()
 
 /// The entry of the table for requests of class T. A request that has T's identity and another class did not parse.
 template <typename T>
-HypervisorEngine::Rules::value_type HypervisorEngine::pRule(Reply (HypervisorEngine::*handler)(Console&, const T&),
+HypervisorEngine::Rules::value_type HypervisorEngine::pRule(Reply (HypervisorEngine::*handler)(ConsoleEntry&, const T&),
                                                             bool needsSession)
 {
     const auto identity = T::getMessageID();
     Rule rule;
     rule.needsSession = needsSession;
-    rule.handle = [handler](HypervisorEngine& self, Console& console, const QelMessage& message) -> Reply {
+    rule.handle = [handler](HypervisorEngine& self, ConsoleEntry& console, const QelMessage& message) -> Reply {
         const auto* request = dynamic_cast<const T*>(&message);
         if (request == nullptr) return bareResponse(message, QelMessageStatusInvalidData);
         return (self.*handler)(console, *request);
@@ -208,7 +195,12 @@ bool HypervisorEngine::pKnowsFunction(unsigned short function)
     return first != pRules().end() && first->first.first == function;
 }
 
-void HypervisorEngine::pHandleRequest(Console& console, const QelMessage& request)
+bool HypervisorEngine::pMayReceive(const ConsoleEntry& console) const
+{
+    return console.link.hasRoom() && mPartitions.hasInputRoom(console);
+}
+
+void HypervisorEngine::pHandleRequest(ConsoleEntry& console, const QelMessage& request)
 {
     const Rule* rule = nullptr;
     const QelMessageStatusCodes refusal = pAdmit(console, request, rule);
@@ -216,33 +208,33 @@ void HypervisorEngine::pHandleRequest(Console& console, const QelMessage& reques
         refusal == QelMessageStatusNoError ? rule->handle(*this, console, request) : bareResponse(request, refusal);
     const QelMessageStatusCodes status = reply->getStatus();
     if (status != QelMessageStatusNoError) {
-        logLine(LogLevel::Info, "console ", console.id, ": refused ", request.getLogID(), ": ", status);
+        logLine(LogLevel::Info, "console ", console.peer.id, ": refused ", request.getLogID(), ": ", status);
     }
     console.link.post(std::move(reply));
     if (status == QelMessageStatusTooManyConnections) pClose(console);
 }
 
-void HypervisorEngine::pHandleNotice(Console& console, const QelMessage& notice)
+void HypervisorEngine::pHandleNotice(ConsoleEntry& console, const QelMessage& notice)
 {
     const auto* data = dynamic_cast<const QelMessageVirtualSerialDataToOsAsync*>(&notice);
     if (data != nullptr && mPartitions.feed(console, *data)) return;
-    if (isUpgrade(notice)) return pRefuseUpgrade(console);
-    logLine(LogLevel::Warn, "console ", console.id, ": ignored ", notice.getLogID());
+    if (isKind<QelMessageUpgradeConnectionAsync>(notice)) return pRefuseUpgrade(console);
+    logLine(LogLevel::Warn, "console ", console.peer.id, ": ignored ", notice.getLogID());
 }
 
 /// A console asks for TLS on a plain connection, or inside TLS. It waits for an answer, so it gets one.
-void HypervisorEngine::pRefuseUpgrade(Console& console)
+void HypervisorEngine::pRefuseUpgrade(ConsoleEntry& console)
 {
-    logLine(LogLevel::Warn, "console ", console.id, ": closed, it asked for TLS, which is not done here");
+    logLine(LogLevel::Warn, "console ", console.peer.id, ": closed, it asked for TLS, which is not done here");
     console.link.post(std::make_unique<QelMessageAbortHandshakeAsync>());
     pClose(console);
 }
 
 /// The checks that are the same for all requests. @param rule  set when they pass
-QelMessageStatusCodes HypervisorEngine::pAdmit(const Console& console, const QelMessage& request,
+QelMessageStatusCodes HypervisorEngine::pAdmit(const ConsoleEntry& console, const QelMessage& request,
                                                const Rule*& rule) const
 {
-    const bool isVersion = isRequest<QelMessageGetEnclTypeAndInterfaceVersionReq>(request);
+    const bool isVersion = isKind<QelMessageGetEnclTypeAndInterfaceVersionReq>(request);
     // The version request comes first and comes once. Before it every other request gets the same status, so that an
     // unidentified peer cannot find out which requests exist.
     if (isVersion != (console.state == ConsoleState::Connected)) return QelMessageStatusInvalidCmdSequence;
@@ -254,7 +246,7 @@ QelMessageStatusCodes HypervisorEngine::pAdmit(const Console& console, const Qel
     return QelMessageStatusNoError;
 }
 
-HypervisorEngine::Reply HypervisorEngine::pVersion(Console& console,
+HypervisorEngine::Reply HypervisorEngine::pVersion(ConsoleEntry& console,
                                                    const QelMessageGetEnclTypeAndInterfaceVersionReq& request)
 {
     if (pFindIdentified(request.getToolType(), request.getToolId()) != nullptr) {
@@ -262,14 +254,14 @@ HypervisorEngine::Reply HypervisorEngine::pVersion(Console& console,
     }
     if (pCountIdentified() >= mSettings.maxConsoles) return bareResponse(request, QelMessageStatusTooManyConnections);
     console.state = ConsoleState::Identified;
-    console.toolType = request.getToolType();
-    console.toolId = request.getToolId();
+    console.peer.toolType = request.getToolType();
+    console.peer.toolId = request.getToolId();
     return std::make_unique<QelMessageGetEnclTypeAndInterfaceVersionRsp>(
         request.getCallerId(), mSettings.interfaceFamily, mSettings.majorVersion, mSettings.minorVersion,
         mSettings.machineType, mSettings.serialNumber);
 }
 
-HypervisorEngine::Reply HypervisorEngine::pOpenSession(Console& console,
+HypervisorEngine::Reply HypervisorEngine::pOpenSession(ConsoleEntry& console,
                                                        const QelMessageInterfaceCmpOpenKrogSessionReq& request)
 {
     if (console.sessionOpen) return bareResponse(request, QelMessageStatusKrogSessionAlreadyOpen);
@@ -277,7 +269,7 @@ HypervisorEngine::Reply HypervisorEngine::pOpenSession(Console& console,
     return std::make_unique<QelMessageInterfaceCmpOpenKrogSessionRsp>(request.getCallerId());
 }
 
-HypervisorEngine::Reply HypervisorEngine::pCloseSession(Console& console,
+HypervisorEngine::Reply HypervisorEngine::pCloseSession(ConsoleEntry& console,
                                                         const QelMessageInterfaceCmpCloseKrogSessionReq& request)
 {
     if (!console.sessionOpen) return bareResponse(request, QelMessageStatusInvalidCmdSequence);
@@ -286,13 +278,13 @@ HypervisorEngine::Reply HypervisorEngine::pCloseSession(Console& console,
     return std::make_unique<QelMessageInterfaceCmpCloseKrogSessionRsp>(request.getCallerId());
 }
 
-HypervisorEngine::Reply HypervisorEngine::pCapabilities(Console&, const QelMessageExchIntCapabilitiesReq& request)
+HypervisorEngine::Reply HypervisorEngine::pCapabilities(ConsoleEntry&, const QelMessageExchIntCapabilitiesReq& request)
 {
     return std::make_unique<QelMessageExchIntCapabilitiesRsp>(
         request.getCallerId(), kCapabilityBytes, intersection(request.getCapabilities(), mSettings.capabilities));
 }
 
-HypervisorEngine::Reply HypervisorEngine::pLimits(Console&, const QelMessageGetInterfaceLimitsReq& request)
+HypervisorEngine::Reply HypervisorEngine::pLimits(ConsoleEntry&, const QelMessageGetInterfaceLimitsReq& request)
 {
     const QelMessageGetInterfaceLimitsRsp response(request.getCallerId());
     if (mSettings.maxConsoles == QelMessageGetInterfaceLimitsRsp::DAXS_SUPPORTED) return response.clone();
@@ -304,18 +296,18 @@ HypervisorEngine::Reply HypervisorEngine::pLimits(Console&, const QelMessageGetI
     return changed;
 }
 
-HypervisorEngine::Reply HypervisorEngine::pBroadcast(Console& console, const QelMessageDaxBroadcastReq& request)
+HypervisorEngine::Reply HypervisorEngine::pBroadcast(ConsoleEntry& console, const QelMessageDaxBroadcastReq& request)
 {
     if (request.getBroadcastMsgLen() > kMaxBroadcast) return bareResponse(request, QelMessageStatusInvalidData);
     if (request.getBroadcastMode() == kUnicast) {
-        Console* const addressee = pFindIdentified(request.getToolType(), request.getToolId());
+        ConsoleEntry* const addressee = pFindIdentified(request.getToolType(), request.getToolId());
         if (addressee == nullptr || addressee == &console) {
             return bareResponse(request, QelMessageStatusConnectionNotAvailable);
         }
         if (!pSendBroadcast(*addressee, console, request)) return bareResponse(request, QelMessageStatusCmdFailed);
     } else {
         for (auto& entry : mConsoles) {
-            Console& other = entry.second;
+            ConsoleEntry& other = entry.second;
             if (&other != &console && other.state == ConsoleState::Identified) {
                 static_cast<void>(pSendBroadcast(other, console, request));
             }
@@ -324,13 +316,13 @@ HypervisorEngine::Reply HypervisorEngine::pBroadcast(Console& console, const Qel
     return std::make_unique<QelMessageDaxBroadcastRsp>(request.getCallerId());
 }
 
-HypervisorEngine::Reply HypervisorEngine::pTime(Console&, const QelMessageGetQelTodReq& request)
+HypervisorEngine::Reply HypervisorEngine::pTime(ConsoleEntry&, const QelMessageGetQelTodReq& request)
 {
     const std::time_t now = std::chrono::system_clock::to_time_t(TimeProvider::system());
     return std::make_unique<QelMessageGetQelTodRsp>(request.getCallerId(), now);
 }
 
-HypervisorEngine::Reply HypervisorEngine::pSetMode(Console&, const QelMessageSetGlobalModeAttributeReq& request)
+HypervisorEngine::Reply HypervisorEngine::pSetMode(ConsoleEntry&, const QelMessageSetGlobalModeAttributeReq& request)
 {
     // A longer text would make a response that the console that reads the mode must not accept.
     if (request.getMTMSLen() > kMaxMtms) return bareResponse(request, QelMessageStatusInvalidData);
@@ -339,24 +331,27 @@ HypervisorEngine::Reply HypervisorEngine::pSetMode(Console&, const QelMessageSet
     return bareResponse(request, QelMessageStatusNoError); // 0x0108 has no response class
 }
 
-HypervisorEngine::Reply HypervisorEngine::pGetMode(Console&, const QelMessageGetGlobalModeAttributeReq& request)
+HypervisorEngine::Reply HypervisorEngine::pGetMode(ConsoleEntry&, const QelMessageGetGlobalModeAttributeReq& request)
 {
     return std::make_unique<QelMessageGetGlobalModeAttributeRsp>(request.getCallerId(), mMode, mMtms);
 }
 
-HypervisorEngine::Reply HypervisorEngine::pSetMetadata(Console&, const QelMessageSetGlobalSaveAreaMetadataReq& request)
+HypervisorEngine::Reply HypervisorEngine::pSetMetadata(ConsoleEntry&,
+                                                       const QelMessageSetGlobalSaveAreaMetadataReq& request)
 {
     if (request.getMetadataLen() > kMaxMetadata) return bareResponse(request, QelMessageStatusInvalidData);
     mMetadata = request.getMetadata();
     return std::make_unique<QelMessageSetGlobalSaveAreaMetadataRsp>(request.getCallerId());
 }
 
-HypervisorEngine::Reply HypervisorEngine::pGetMetadata(Console&, const QelMessageGetGlobalSaveAreaMetadataReq& request)
+HypervisorEngine::Reply HypervisorEngine::pGetMetadata(ConsoleEntry&,
+                                                       const QelMessageGetGlobalSaveAreaMetadataReq& request)
 {
     return std::make_unique<QelMessageGetGlobalSaveAreaMetadataRsp>(request.getCallerId(), mMetadata);
 }
 
-HypervisorEngine::Reply HypervisorEngine::pOpenSerial(Console& console, const QelMessageVirtualSerialOpenReq& request)
+HypervisorEngine::Reply HypervisorEngine::pOpenSerial(ConsoleEntry& console,
+                                                      const QelMessageVirtualSerialOpenReq& request)
 {
     const auto status =
         mPartitions.open(console, request.getLpId(), request.getVssConnectionNumber(), request.isForceOpen());
@@ -365,7 +360,8 @@ HypervisorEngine::Reply HypervisorEngine::pOpenSerial(Console& console, const Qe
                                                             request.getVssConnectionNumber());
 }
 
-HypervisorEngine::Reply HypervisorEngine::pCloseSerial(Console& console, const QelMessageVirtualSerialCloseReq& request)
+HypervisorEngine::Reply HypervisorEngine::pCloseSerial(ConsoleEntry& console,
+                                                       const QelMessageVirtualSerialCloseReq& request)
 {
     const auto status =
         mPartitions.close(console, request.getLpId(), request.getVssConnectionNumber(), request.isForceClose());
@@ -373,7 +369,7 @@ HypervisorEngine::Reply HypervisorEngine::pCloseSerial(Console& console, const Q
     return std::make_unique<QelMessageVirtualSerialCloseRsp>(request.getCallerId());
 }
 
-HypervisorEngine::Reply HypervisorEngine::pMaxSerialSessions(Console&,
+HypervisorEngine::Reply HypervisorEngine::pMaxSerialSessions(ConsoleEntry&,
                                                              const QelMessageVirtualSerialGetMaxSessionsReq& request)
 {
     constexpr std::uint16_t kSystems = 1; // this one
@@ -382,7 +378,7 @@ HypervisorEngine::Reply HypervisorEngine::pMaxSerialSessions(Console&,
     return std::make_unique<QelMessageVirtualSerialGetMaxSessionsRsp>(request.getCallerId(), kSystems, partitions);
 }
 
-HypervisorEngine::Reply HypervisorEngine::pSetUpSerial(Console& console,
+HypervisorEngine::Reply HypervisorEngine::pSetUpSerial(ConsoleEntry& console,
                                                        const QelMessageVirtualSerialSetupSessionReq& request)
 {
     const auto status = mPartitions.setUp(console, request.getLpId(), request.getVssConnectionNumber());
@@ -390,12 +386,12 @@ HypervisorEngine::Reply HypervisorEngine::pSetUpSerial(Console& console,
     return std::make_unique<QelMessageVirtualSerialSetupSessionRsp>(request.getCallerId());
 }
 
-Console* HypervisorEngine::pFindIdentified(std::uint32_t toolType, const std::string& toolId)
+ConsoleEntry* HypervisorEngine::pFindIdentified(std::uint32_t toolType, const std::string& toolId)
 {
     for (auto& entry : mConsoles) {
-        Console& console = entry.second;
+        ConsoleEntry& console = entry.second;
         if (console.state != ConsoleState::Identified) continue;
-        if (console.toolType == toolType && console.toolId == toolId) return &console;
+        if (console.peer.toolType == toolType && console.peer.toolId == toolId) return &console;
     }
     return nullptr;
 }
@@ -410,16 +406,18 @@ std::size_t HypervisorEngine::pCountIdentified() const
 }
 
 /// @return false: the console's queue is full, and it did not get the broadcast
-bool HypervisorEngine::pSendBroadcast(Console& to, const Console& from, const QelMessageDaxBroadcastReq& request)
+bool HypervisorEngine::pSendBroadcast(ConsoleEntry& to, const ConsoleEntry& from,
+                                      const QelMessageDaxBroadcastReq& request)
 {
-    if (to.link.offer(std::make_unique<QelMessageDaxBroadcastOutboundAsync>(request, from.toolId, from.toolType))) {
+    if (to.link.offer(
+            std::make_unique<QelMessageDaxBroadcastOutboundAsync>(request, from.peer.toolId, from.peer.toolType))) {
         return true;
     }
-    logLine(LogLevel::Warn, "console ", to.id, ": too slow for a broadcast of console ", from.id);
+    logLine(LogLevel::Warn, "console ", to.peer.id, ": too slow for a broadcast of console ", from.peer.id);
     return false;
 }
 
-void HypervisorEngine::pClose(Console& console)
+void HypervisorEngine::pClose(ConsoleEntry& console)
 {
     console.state = ConsoleState::Closing;
     console.link.finish();

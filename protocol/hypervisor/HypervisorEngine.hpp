@@ -30,6 +30,14 @@ struct HypervisorSettings {
     std::uint8_t maxConsoles = 16; ///< identified at a time; more than 0
 };
 
+/// What follows from a message for the reader of its connection.
+struct Received {
+    ConsoleState state; ///< of the connection
+    /// False while the next message has to wait: the console's responses wait for room, or too much input waits for its
+    /// partition.
+    bool mayReadNext;
+};
+
 /// The logic of the hypervisor end, without input or output: which response each request gets, and which console holds
 /// which session. Messages come in through receive(); responses and notices go out through the consoles' links, serial
 /// data through the partitions' ports. docs/connection.md describes the rules.
@@ -47,15 +55,15 @@ public:
 
     /// Adds a connection.
     /// @param link  borrowed until disconnect() has returned
-    /// @param peer  the console's address, for the log
-    ConsoleId connect(ConsoleLink& link, const std::string& peer);
+    /// @param peer  address, certificate and protection of the connection; the id is assigned here
+    ConsoleId connect(ConsoleLink& link, Peer peer);
 
     /// Acts on a message of a console.
-    /// @return the state of the connection afterwards
-    ConsoleState receive(ConsoleId id, const QelMessage& message);
+    /// @return what follows for the reader of the connection
+    Received receive(ConsoleId id, const QelMessage& message);
 
-    /// False while the next message of a console has to wait: its responses wait for room, or too much input waits for
-    /// its partition. ConsoleLink::resumeReading() says when to ask again.
+    /// Whether the next message of a console may be read, for a reader that waits because receive() has said no.
+    /// ConsoleLink::resumeReading() says when to ask again.
     bool mayReceive(ConsoleId id) const;
 
     /// False when another console would be refused: the maximum is connected, or the hypervisor shuts down.
@@ -88,50 +96,53 @@ private:
 
     /// How a request is handled.
     struct Rule {
-        std::function<Reply(HypervisorEngine&, Console&, const QelMessage&)> handle;
+        std::function<Reply(HypervisorEngine&, ConsoleEntry&, const QelMessage&)> handle;
         bool needsSession = false; ///< the hypervisor session must be open
     };
     using Rules = std::map<RequestId, Rule>;
 
     template <typename T>
-    static Rules::value_type pRule(Reply (HypervisorEngine::*handler)(Console&, const T&), bool needsSession = false);
+    static Rules::value_type pRule(Reply (HypervisorEngine::*handler)(ConsoleEntry&, const T&),
+                                   bool needsSession = false);
     static const Rules& pRules();
     static bool pKnowsFunction(unsigned short function);
 
-    void pHandleRequest(Console& console, const QelMessage& request) QEL_REQUIRES(mMutex);
-    void pHandleNotice(Console& console, const QelMessage& notice) QEL_REQUIRES(mMutex);
-    QelMessageStatusCodes pAdmit(const Console& console, const QelMessage& request, const Rule*& rule) const
+    bool pMayReceive(const ConsoleEntry& console) const QEL_REQUIRES(mMutex);
+    void pHandleRequest(ConsoleEntry& console, const QelMessage& request) QEL_REQUIRES(mMutex);
+    void pHandleNotice(ConsoleEntry& console, const QelMessage& notice) QEL_REQUIRES(mMutex);
+    QelMessageStatusCodes pAdmit(const ConsoleEntry& console, const QelMessage& request, const Rule*& rule) const
         QEL_REQUIRES(mMutex);
 
     // One operation for each request; they return the response.
-    Reply pVersion(Console&, const QelMessageGetEnclTypeAndInterfaceVersionReq&) QEL_REQUIRES(mMutex);
-    Reply pOpenSession(Console&, const QelMessageInterfaceCmpOpenKrogSessionReq&) QEL_REQUIRES(mMutex);
-    Reply pCloseSession(Console&, const QelMessageInterfaceCmpCloseKrogSessionReq&) QEL_REQUIRES(mMutex);
-    Reply pCapabilities(Console&, const QelMessageExchIntCapabilitiesReq&) QEL_REQUIRES(mMutex);
-    Reply pLimits(Console&, const QelMessageGetInterfaceLimitsReq&) QEL_REQUIRES(mMutex);
-    Reply pBroadcast(Console&, const QelMessageDaxBroadcastReq&) QEL_REQUIRES(mMutex);
-    Reply pTime(Console&, const QelMessageGetQelTodReq&) QEL_REQUIRES(mMutex);
-    Reply pSetMode(Console&, const QelMessageSetGlobalModeAttributeReq&) QEL_REQUIRES(mMutex);
-    Reply pGetMode(Console&, const QelMessageGetGlobalModeAttributeReq&) QEL_REQUIRES(mMutex);
-    Reply pSetMetadata(Console&, const QelMessageSetGlobalSaveAreaMetadataReq&) QEL_REQUIRES(mMutex);
-    Reply pGetMetadata(Console&, const QelMessageGetGlobalSaveAreaMetadataReq&) QEL_REQUIRES(mMutex);
-    Reply pOpenSerial(Console&, const QelMessageVirtualSerialOpenReq&) QEL_REQUIRES(mMutex);
-    Reply pCloseSerial(Console&, const QelMessageVirtualSerialCloseReq&) QEL_REQUIRES(mMutex);
-    Reply pMaxSerialSessions(Console&, const QelMessageVirtualSerialGetMaxSessionsReq&) QEL_REQUIRES(mMutex);
-    Reply pSetUpSerial(Console&, const QelMessageVirtualSerialSetupSessionReq&) QEL_REQUIRES(mMutex);
+    Reply pVersion(ConsoleEntry&, const QelMessageGetEnclTypeAndInterfaceVersionReq&) QEL_REQUIRES(mMutex);
+    Reply pOpenSession(ConsoleEntry&, const QelMessageInterfaceCmpOpenKrogSessionReq&) QEL_REQUIRES(mMutex);
+    Reply pCloseSession(ConsoleEntry&, const QelMessageInterfaceCmpCloseKrogSessionReq&) QEL_REQUIRES(mMutex);
+    Reply pCapabilities(ConsoleEntry&, const QelMessageExchIntCapabilitiesReq&) QEL_REQUIRES(mMutex);
+    Reply pLimits(ConsoleEntry&, const QelMessageGetInterfaceLimitsReq&) QEL_REQUIRES(mMutex);
+    Reply pBroadcast(ConsoleEntry&, const QelMessageDaxBroadcastReq&) QEL_REQUIRES(mMutex);
+    Reply pTime(ConsoleEntry&, const QelMessageGetQelTodReq&) QEL_REQUIRES(mMutex);
+    Reply pSetMode(ConsoleEntry&, const QelMessageSetGlobalModeAttributeReq&) QEL_REQUIRES(mMutex);
+    Reply pGetMode(ConsoleEntry&, const QelMessageGetGlobalModeAttributeReq&) QEL_REQUIRES(mMutex);
+    Reply pSetMetadata(ConsoleEntry&, const QelMessageSetGlobalSaveAreaMetadataReq&) QEL_REQUIRES(mMutex);
+    Reply pGetMetadata(ConsoleEntry&, const QelMessageGetGlobalSaveAreaMetadataReq&) QEL_REQUIRES(mMutex);
+    Reply pOpenSerial(ConsoleEntry&, const QelMessageVirtualSerialOpenReq&) QEL_REQUIRES(mMutex);
+    Reply pCloseSerial(ConsoleEntry&, const QelMessageVirtualSerialCloseReq&) QEL_REQUIRES(mMutex);
+    Reply pMaxSerialSessions(ConsoleEntry&, const QelMessageVirtualSerialGetMaxSessionsReq&) QEL_REQUIRES(mMutex);
+    Reply pSetUpSerial(ConsoleEntry&, const QelMessageVirtualSerialSetupSessionReq&) QEL_REQUIRES(mMutex);
 
-    Console* pFindIdentified(std::uint32_t toolType, const std::string& toolId) QEL_REQUIRES(mMutex);
+    ConsoleEntry* pFindIdentified(std::uint32_t toolType, const std::string& toolId) QEL_REQUIRES(mMutex);
     std::size_t pCountIdentified() const QEL_REQUIRES(mMutex);
-    bool pSendBroadcast(Console& to, const Console& from, const QelMessageDaxBroadcastReq&) QEL_REQUIRES(mMutex);
-    void pRefuseUpgrade(Console& console) QEL_REQUIRES(mMutex);
-    void pClose(Console& console) QEL_REQUIRES(mMutex);
+    bool pSendBroadcast(ConsoleEntry& to, const ConsoleEntry& from, const QelMessageDaxBroadcastReq&)
+        QEL_REQUIRES(mMutex);
+    void pRefuseUpgrade(ConsoleEntry& console) QEL_REQUIRES(mMutex);
+    void pClose(ConsoleEntry& console) QEL_REQUIRES(mMutex);
 
     const HypervisorSettings mSettings;
     const std::function<void()> mWakeSerial;
 
     mutable Mutex mMutex;
     PartitionSet mPartitions QEL_GUARDED_BY(mMutex);
-    std::map<ConsoleId, Console> mConsoles QEL_GUARDED_BY(mMutex);
+    std::map<ConsoleId, ConsoleEntry> mConsoles QEL_GUARDED_BY(mMutex);
     ConsoleId mLastConsoleId QEL_GUARDED_BY(mMutex) = 0;
     bool mShutDown QEL_GUARDED_BY(mMutex) = false;
     std::uint8_t mMode QEL_GUARDED_BY(mMutex) = 0; // the global mode attribute

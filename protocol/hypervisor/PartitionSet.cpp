@@ -40,7 +40,7 @@ void PartitionSet::add(std::uint16_t id, std::unique_ptr<SerialLine> port)
     partition.port = std::move(port);
 }
 
-QelMessageStatusCodes PartitionSet::open(Console& console, std::uint16_t id, std::uint16_t connection, bool force)
+QelMessageStatusCodes PartitionSet::open(ConsoleEntry& console, std::uint16_t id, std::uint16_t connection, bool force)
 {
     Partition* partition = nullptr;
     const QelMessageStatusCodes found = pFindPartition(id, connection, partition);
@@ -53,7 +53,7 @@ QelMessageStatusCodes PartitionSet::open(Console& console, std::uint16_t id, std
     return QelMessageStatusNoError;
 }
 
-QelMessageStatusCodes PartitionSet::setUp(Console& console, std::uint16_t id, std::uint16_t connection)
+QelMessageStatusCodes PartitionSet::setUp(ConsoleEntry& console, std::uint16_t id, std::uint16_t connection)
 {
     Partition* partition = nullptr;
     const QelMessageStatusCodes found = pFindPartition(id, connection, partition);
@@ -64,7 +64,7 @@ QelMessageStatusCodes PartitionSet::setUp(Console& console, std::uint16_t id, st
     return QelMessageStatusNoError;
 }
 
-QelMessageStatusCodes PartitionSet::close(Console& console, std::uint16_t id, std::uint16_t connection, bool force)
+QelMessageStatusCodes PartitionSet::close(ConsoleEntry& console, std::uint16_t id, std::uint16_t connection, bool force)
 {
     Partition* partition = nullptr;
     const QelMessageStatusCodes found = pFindPartition(id, connection, partition);
@@ -80,7 +80,7 @@ QelMessageStatusCodes PartitionSet::close(Console& console, std::uint16_t id, st
     return QelMessageStatusNoError;
 }
 
-bool PartitionSet::feed(const Console& console, const QelMessageVirtualSerialDataToOsAsync& data)
+bool PartitionSet::feed(const ConsoleEntry& console, const QelMessageVirtualSerialDataToOsAsync& data)
 {
     Partition* const partition = pFind(data.getLpId());
     if (partition == nullptr || data.getVssConnectionNumber() != kConnectionNumber) return false;
@@ -92,7 +92,7 @@ bool PartitionSet::feed(const Console& console, const QelMessageVirtualSerialDat
     return true;
 }
 
-void PartitionSet::release(const Console& console)
+void PartitionSet::release(const ConsoleEntry& console)
 {
     for (auto& entry : mPartitions) {
         Partition& partition = entry.second;
@@ -109,7 +109,7 @@ void PartitionSet::shutDown()
         pTakeDown(entry.second, CloseReason::CloseReasonQelShutdown);
 }
 
-bool PartitionSet::hasInputRoom(const Console& console) const
+bool PartitionSet::hasInputRoom(const ConsoleEntry& console) const
 {
     for (const auto& entry : mPartitions) {
         if (entry.second.holder == &console && entry.second.input.size() >= kInputLimit) return false;
@@ -184,7 +184,7 @@ bool PartitionSet::pStart(Partition& partition)
 /// Ends the session, if there is one, with a notice to the console that holds it.
 void PartitionSet::pEndSession(Partition& partition, CloseReason reason, const CommandEnd& end)
 {
-    Console* const holder = partition.holder;
+    ConsoleEntry* const holder = partition.holder;
     if (holder == nullptr) return;
     partition.holder = nullptr;
     partition.setUp = false;

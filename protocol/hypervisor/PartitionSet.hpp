@@ -56,30 +56,30 @@ public:
     /// @param force  take the session from the console that holds it; that console gets a notice
     /// @return NoError; InvalidLparId, InvalidConnectionNumber, ConnectionNotAvailable (held, and no force) or
     ///         CmdFailed (the command cannot be started), in this order, and no session changes
-    QelMessageStatusCodes open(Console& console, std::uint16_t id, std::uint16_t connection, bool force);
+    QelMessageStatusCodes open(ConsoleEntry& console, std::uint16_t id, std::uint16_t connection, bool force);
 
     /// Lets the data of an open session flow. Setting up twice changes nothing.
     /// @return NoError; InvalidLparId, InvalidConnectionNumber or InvalidCmdSequence (the console does not hold it)
-    QelMessageStatusCodes setUp(Console& console, std::uint16_t id, std::uint16_t connection);
+    QelMessageStatusCodes setUp(ConsoleEntry& console, std::uint16_t id, std::uint16_t connection);
 
     /// Ends a session; the partition's command goes on.
     /// @param force  end it even if another console holds it; that console gets a notice
     /// @return NoError; InvalidLparId, InvalidConnectionNumber or ConnectionClosureFailure (the session is free, or
     ///         another console holds it and force is not set)
-    QelMessageStatusCodes close(Console& console, std::uint16_t id, std::uint16_t connection, bool force);
+    QelMessageStatusCodes close(ConsoleEntry& console, std::uint16_t id, std::uint16_t connection, bool force);
 
     /// Hands console input to a partition.
     /// @return false: the console does not hold the session, or has not set it up; the data is dropped
-    bool feed(const Console& console, const QelMessageVirtualSerialDataToOsAsync& data);
+    bool feed(const ConsoleEntry& console, const QelMessageVirtualSerialDataToOsAsync& data);
 
     /// Ends all sessions of a console, without notices.
-    void release(const Console& console);
+    void release(const ConsoleEntry& console);
 
     /// Ends all sessions with the notice that the hypervisor shuts down, and takes all lines down.
     void shutDown();
 
     /// False while a partition whose session the console holds has kInputLimit bytes of input waiting.
-    bool hasInputRoom(const Console& console) const;
+    bool hasInputRoom(const ConsoleEntry& console) const;
 
     /// What to wait for. Leaves out lines that have nothing to do: a line that has hung up would otherwise be reported
     /// without end.
@@ -102,10 +102,10 @@ private:
     struct Partition {
         std::uint16_t id = 0;
         std::unique_ptr<SerialLine> port;
-        Console* holder = nullptr; ///< of the session; null: the session is free
-        bool setUp = false;        ///< data may flow
-        std::string input;         ///< from consoles, not yet taken by the line
-        PollDeadline exitDeadline; ///< of a line that has ended, for its command to end; disabled: the line is up
+        ConsoleEntry* holder = nullptr; ///< of the session; null: the session is free
+        bool setUp = false;             ///< data may flow
+        std::string input;              ///< from consoles, not yet taken by the line
+        PollDeadline exitDeadline;      ///< of a line that has ended, for its command to end; disabled: the line is up
     };
 
     Partition* pFind(std::uint16_t id);

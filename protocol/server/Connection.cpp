@@ -44,7 +44,9 @@ void Connection::start()
 {
     mHandshake = TimeProvider::steady() + mLimits.handshake;
     mStream->setReadDeadline(mLimits.handshake);
-    mId = mHypervisor.connect(*this, mPeer);
+    Peer peer;
+    peer.address = mPeer;
+    mId = mHypervisor.connect(*this, std::move(peer));
     try {
         mWriter = std::thread([this] { pWrite(); });
         mFeeder = std::thread([this] { pFeed(); });
@@ -100,9 +102,12 @@ void Connection::pRead() noexcept
 void Connection::pReceiveAll()
 {
     bool identified = false;
-    while (pAwaitReceive()) {
+    bool mayRead = true;
+    while (mayRead || pAwaitReceive()) {
         const std::unique_ptr<QelMessage> message = mMessages.read();
-        const ConsoleState state = mHypervisor.receive(mId, *message);
+        const Received received = mHypervisor.receive(mId, *message);
+        const ConsoleState state = received.state;
+        mayRead = received.mayReadNext;
         // The hypervisor closes the connection and ignores further messages. The console may still take what is queued
         // for it, within the linger time.
         if (state == ConsoleState::Closing && !mOutbox.waitUntilWritten(mLimits.linger)) abort();

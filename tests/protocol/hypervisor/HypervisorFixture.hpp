@@ -53,7 +53,12 @@ protected:
             std::make_unique<protocol::HypervisorEngine>(settings, std::move(partitions), [this] { ++serialWakes; });
     }
 
-    void connect(Peer& peer) { peer.id = hypervisor->connect(peer.link, "127.0.0.1:9"); }
+    void connect(Peer& peer)
+    {
+        protocol::Peer from;
+        from.address = "127.0.0.1:9";
+        peer.id = hypervisor->connect(peer.link, std::move(from));
+    }
 
     /// Hands the hypervisor the bytes of a message.
     protocol::ConsoleState receive(Peer& peer, const QelMessage& message)
@@ -64,17 +69,18 @@ protected:
     {
         return receive(peer, frame.data(), frame.size());
     }
-    /// Checks too that a change of the watches comes with a wake-up.
+    /// Checks too that a change of the watches comes with a wake-up, and that the reader is told whether it may go on.
     protocol::ConsoleState receive(Peer& peer, const char* frame, std::size_t length)
     {
         const auto message = registry.deserialize(frame, static_cast<unsigned int>(length));
         const auto watchedBefore = watchedEvents();
         const unsigned wakesBefore = serialWakes;
-        const protocol::ConsoleState state = hypervisor->receive(peer.id, *message);
+        const protocol::Received received = hypervisor->receive(peer.id, *message);
+        EXPECT_EQ(received.mayReadNext, hypervisor->mayReceive(peer.id)) << message->getLogID();
         if (watchedEvents() != watchedBefore) {
             EXPECT_GT(serialWakes, wakesBefore) << message->getLogID();
         }
-        return state;
+        return received.state;
     }
 
     /// Sends a request and takes the one message that answers it.

@@ -13,6 +13,7 @@ namespace {
 
 using protocol::ConsoleState;
 using protocol::HypervisorSettings;
+using protocol::Received;
 using ::testing::ElementsAre;
 using ::testing::HasSubstr;
 
@@ -367,7 +368,9 @@ TEST_F(HypervisorTest, NoticesForConsolesAreIgnoredWithAWarning)
 
 TEST_F(HypervisorTest, MessagesOfAnUnknownConnectionAreIgnored)
 {
-    EXPECT_EQ(hypervisor->receive(99, QelMessageGetQelTodReq()), ConsoleState::Closing);
+    const Received received = hypervisor->receive(99, QelMessageGetQelTodReq());
+    EXPECT_EQ(received.state, ConsoleState::Closing);
+    EXPECT_TRUE(received.mayReadNext);
     EXPECT_TRUE(hypervisor->mayReceive(99));
     hypervisor->disconnect(99);
 }
@@ -433,6 +436,27 @@ TEST_F(HypervisorTest, AConsoleWithoutRoomIsNotReadFrom)
     EXPECT_TRUE(hypervisor->mayReceive(peer.id));
     peer.link.room = false;
     EXPECT_FALSE(hypervisor->mayReceive(peer.id));
+}
+
+TEST_F(HypervisorTest, TheReaderIsToldWithEachMessageWhetherToReadTheNext)
+{
+    Peer peer;
+    identify(peer, "a");
+    EXPECT_TRUE(hypervisor->receive(peer.id, QelMessageGetInterfaceLimitsReq()).mayReadNext);
+    peer.link.room = false;
+    EXPECT_FALSE(hypervisor->receive(peer.id, QelMessageGetInterfaceLimitsReq()).mayReadNext);
+    hypervisor->shutDown();
+    EXPECT_FALSE(hypervisor->receive(peer.id, QelMessageGetInterfaceLimitsReq()).mayReadNext);
+}
+
+TEST_F(HypervisorTest, ConnectionsAreNumberedInTheOrderOfConnecting)
+{
+    FakeConsole first;
+    FakeConsole second;
+    protocol::Peer from;
+    from.id = 17; // the numbers are the hypervisor's
+    EXPECT_EQ(hypervisor->connect(first, from), 1U);
+    EXPECT_EQ(hypervisor->connect(second, from), 2U);
 }
 
 // The end.

@@ -104,7 +104,7 @@ TEST_F(ConnectionTest, EndsWhenTheConsoleDisconnects)
     loopback.near.reset();
     expectEnd();
     FakeConsole other;
-    const auto id = hypervisor->connect(other, "other");
+    const auto id = hypervisor->connect(other, protocol::Peer());
     hypervisor->receive(id, versionRequest("a"));
     EXPECT_EQ(other.take()->getStatus(), 0U); // the identity is free again
 }
