@@ -24,6 +24,11 @@ namespace {
 /// end of the clock's range.
 constexpr std::chrono::hours kMaxWait{24 * 365 * 100};
 
+bool isLowPriority(MessageQueuingOptions options) noexcept
+{
+    return (options & MessageQueuingOptions::LOW_PRIORITY) != MessageQueuingOptions::DEFAULT;
+}
+
 } // namespace
 
 QelMessageQueue::QelMessageQueue(std::size_t sizeLimit)
@@ -39,8 +44,7 @@ std::uint64_t QelMessageQueue::pGetLowPrioritySize(std::size_t size) noexcept
 
 QelMessageQueue::RateLimiter& QelMessageQueue::pGetRateLimiter(MessageQueuingOptions options) noexcept
 {
-    const bool lowPriority = (options & MessageQueuingOptions::LOW_PRIORITY) != MessageQueuingOptions::DEFAULT;
-    return lowPriority ? mLowPriorityLimiter : mNormalPriorityLimiter;
+    return isLowPriority(options) ? mLowPriorityLimiter : mNormalPriorityLimiter;
 }
 
 void QelMessageQueue::RateLimiter::wait(UniqueMutexLock& lock)
@@ -100,6 +104,13 @@ QelMessageQueue::ReturnCode QelMessageQueue::pEnqueueLocked(UniqueMutexLock& loc
     entry.mMessage = std::move(message);
     entry.mStartTime = startTime;
     return OK;
+}
+
+bool QelMessageQueue::hasRoom(MessageQueuingOptions options) const
+{
+    const MutexLock lock(mLock);
+    const RateLimiter& limiter = isLowPriority(options) ? mLowPriorityLimiter : mNormalPriorityLimiter;
+    return limiter.canEnqueue(mStats.getPending().mBytes);
 }
 
 std::unique_ptr<QelMessage> QelMessageQueue::waitForMsg(const std::chrono::milliseconds& timeout)

@@ -111,7 +111,9 @@ bool admits(std::size_t sizeLimit, unsigned int pendingBytes, MessageQueuingOpti
     if (pendingBytes != 0) {
         EXPECT_EQ(queue.enqueue(sized(pendingBytes)), QelMessageQueue::OK);
     }
+    const bool hasRoom = queue.hasRoom(options);
     const auto result = queue.enqueue(sized(length), options);
+    EXPECT_EQ(hasRoom, result == QelMessageQueue::OK);
     if (result == QelMessageQueue::OK) {
         EXPECT_EQ(figure(queue, "Dropped"), "0 (0 B)");
         return true;

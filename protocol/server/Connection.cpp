@@ -27,16 +27,14 @@ PollFd hangUpOf(int descriptor)
 
 Connection::Connection(HypervisorEngine& hypervisor, std::unique_ptr<Stream> stream, int descriptor, std::string peer,
                        ConnectionLimits limits, std::function<void()> onEnd)
-    : mHypervisor(hypervisor), mStream(std::move(stream)), mHangUp(hangUpOf(descriptor)), mPeer(std::move(peer)),
-      mLimits(limits), mOnEnd(std::move(onEnd)), mMessages(*mStream, messageRegistry()),
-      mOutbox([this] { pOnRoom(); }, limits.queueBytes)
+    : Outbox(limits.queueBytes), mHypervisor(hypervisor), mStream(std::move(stream)), mHangUp(hangUpOf(descriptor)),
+      mPeer(std::move(peer)), mLimits(limits), mOnEnd(std::move(onEnd)), mMessages(*mStream, messageRegistry())
 {}
 
 Connection::~Connection()
 {
     if (!mEnded) abort();
     if (mReader.joinable()) mReader.join();
-    if (mFeeder.joinable()) mFeeder.join();
     if (mWriter.joinable()) mWriter.join();
 }
 
@@ -49,11 +47,10 @@ void Connection::start()
     mId = mHypervisor.connect(*this, std::move(peer));
     try {
         mWriter = std::thread([this] { pWrite(); });
-        mFeeder = std::thread([this] { pFeed(); });
         mReader = std::thread([this] { pRead(); });
     } catch (...) {
         mHypervisor.disconnect(mId);
-        mOutbox.abandon();
+        abandon();
         mEnded = true;
         throw;
     }
@@ -61,29 +58,17 @@ void Connection::start()
 
 void Connection::abort()
 {
-    mOutbox.abandon();
+    abandon();
     pCloseStream();
 }
 
 void Connection::dumpStatistics(std::ostream& os) const
 {
     os << "Queue of console " << mId << ", " << mPeer << ":\n";
-    mOutbox.dumpStatistics(os, Indent(2, ' '));
+    Outbox::dumpStatistics(os, Indent(2, ' '));
 }
 
-void Connection::post(std::unique_ptr<QelMessage> message) { mOutbox.post(std::move(message)); }
-
-void Connection::postSerial(std::unique_ptr<QelMessage> message) { mOutbox.postSerial(std::move(message)); }
-
-bool Connection::offer(std::unique_ptr<QelMessage> message) { return mOutbox.offer(std::move(message)); }
-
-bool Connection::hasRoom() const { return mOutbox.hasRoom(); }
-
-bool Connection::hasSerialRoom() const { return mOutbox.hasSerialRoom(); }
-
 void Connection::resumeReading() { mWake.interrupt(); }
-
-void Connection::finish() { mOutbox.finish(); }
 
 void Connection::pRead() noexcept
 {
@@ -110,7 +95,7 @@ void Connection::pReceiveAll()
         mayRead = received.mayReadNext;
         // The hypervisor closes the connection and ignores further messages. The console may still take what is queued
         // for it, within the linger time.
-        if (state == ConsoleState::Closing && !mOutbox.waitUntilWritten(mLimits.linger)) abort();
+        if (state == ConsoleState::Closing && !waitUntilWritten(mLimits.linger)) abort();
         if (!identified && state == ConsoleState::Identified) {
             identified = true;
             mHandshake = PollDeadline();
@@ -137,8 +122,8 @@ bool Connection::pAwaitReceive()
 void Connection::pFinish()
 {
     mHypervisor.disconnect(mId);
-    mOutbox.finish();
-    if (!mOutbox.waitUntilWritten(mLimits.linger)) abort();
+    finish();
+    if (!waitUntilWritten(mLimits.linger)) abort();
     mEnded = true;
     mOnEnd();
 }
@@ -149,16 +134,6 @@ void Connection::pReport(const StreamIOException& error) const
         logLine(LogLevel::Warn, "console ", mId, ": closed, it did not introduce itself in time");
     } else {
         logLine(LogLevel::Info, "console ", mId, ": ", explain(error));
-    }
-}
-
-void Connection::pFeed() noexcept
-{
-    try {
-        mOutbox.feed();
-    } catch (const std::exception& error) {
-        logLine(LogLevel::Error, "console ", mId, ": ", explain(error));
-        abort(); // the message it was moving is lost
     }
 }
 
@@ -178,14 +153,14 @@ void Connection::pWrite() noexcept
     } catch (const std::exception& error) {
         logLine(LogLevel::Error, "console ", mId, ": ", explain(error));
     }
-    mOutbox.abandon();
+    abandon();
     pCloseStream(); // wakes the reader
-    mOutbox.setWritten();
+    setWritten();
 }
 
 void Connection::pSendAll()
 {
-    while (const std::unique_ptr<QelMessage> message = mOutbox.take())
+    while (const std::unique_ptr<QelMessage> message = take())
         mMessages.write(*message);
 }
 

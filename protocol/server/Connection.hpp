@@ -6,7 +6,6 @@
 #include <qel/common/util/Poll.hpp>
 #include <qel/protocol/WakeUp.hpp>
 
-#include "hypervisor/ConsoleLink.hpp"
 #include "hypervisor/HypervisorEngine.hpp"
 #include "server/Outbox.hpp"
 
@@ -27,15 +26,14 @@ struct ConnectionLimits {
     std::size_t queueBytes = Outbox::kDefaultLimit; ///< queue limit, in bytes of frames; more than 0
 };
 
-/// One connection of the hypervisor end, with three threads: the reader hands received messages to the hypervisor, the
-/// writer sends the queued messages, and the feeder waits for room in the queue, so that no other thread has to. None
-/// of them waits for another connection.
+/// One connection of the hypervisor end, and the hypervisor's link to its console, with two threads: the reader hands
+/// received messages to the hypervisor, and the writer sends the queued messages. Neither waits for another connection.
 ///
 /// While HypervisorEngine::mayReceive() is false the reader does not read. It watches for the console to hang up
 /// instead, so that a console that has disconnected does not hold its sessions.
 ///
 /// Thread safety: one thread owns it (constructor, start(), destructor); any thread may call the other operations.
-class Connection final : private ConsoleLink {
+class Connection final : private Outbox {
 public:
     /// @param hypervisor  borrowed; must outlive this object
     /// @param stream  connected; not null
@@ -62,17 +60,10 @@ public:
     void dumpStatistics(std::ostream& os) const;
 
 private:
-    void post(std::unique_ptr<QelMessage> message) override;
-    void postSerial(std::unique_ptr<QelMessage> message) override;
-    bool offer(std::unique_ptr<QelMessage> message) override;
-    bool hasRoom() const override;
-    bool hasSerialRoom() const override;
     void resumeReading() override;
-    void finish() override;
+    void pOnRoom() override;
 
     void pRead() noexcept;
-    void pFeed() noexcept;
-    void pOnRoom();
     void pWrite() noexcept;
     void pReceiveAll();
     bool pAwaitReceive();
@@ -88,13 +79,11 @@ private:
     const ConnectionLimits mLimits;
     const std::function<void()> mOnEnd;
     QelMessageStream mMessages;
-    Outbox mOutbox;
     WakeUp mWake;      // for the reader while mayReceive() is false
     ConsoleId mId = 0; // set before the threads start
     PollDeadline mHandshake;
     std::atomic<bool> mEnded{false};
     std::thread mReader;
-    std::thread mFeeder;
     std::thread mWriter;
 };
 

@@ -1,5 +1,8 @@
 #include "server/Outbox.hpp"
 
+#include <qel/common/stats/QelMessageStatisticsTypes.hpp>
+#include <qel/common/util/TimeProvider.hpp>
+
 #include <algorithm>
 #include <utility>
 
@@ -12,9 +15,9 @@ constexpr MessageQueuingOptions kSerial = MessageQueuingOptions::LOW_PRIORITY;
 
 } // namespace
 
-Outbox::Outbox(std::function<void()> onRoom, std::size_t limitBytes)
-    : mOnRoom(std::move(onRoom)), mLimitBytes(limitBytes), mQueue(limitBytes)
-{}
+Outbox::Outbox(std::size_t limitBytes) : mQueue(limitBytes) {}
+
+Outbox::~Outbox() = default;
 
 void Outbox::post(std::unique_ptr<QelMessage> message) { pPost(std::move(message), kNormal); }
 
@@ -22,11 +25,9 @@ void Outbox::postSerial(std::unique_ptr<QelMessage> message) { pPost(std::move(m
 
 bool Outbox::offer(std::unique_ptr<QelMessage> message)
 {
-    QelMessageCount offered;
-    offered += *message;
     const MutexLock lock(mMutex);
     const QelMessageQueue::ReturnCode result = mQueue.enqueue(std::move(message), kNormal);
-    if (result == QelMessageQueue::OK) mQueued += offered;
+    if (result == QelMessageQueue::OK) ++mQueued;
     return result != QelMessageQueue::DROPPED;
 }
 
@@ -49,7 +50,6 @@ void Outbox::finish()
     const MutexLock lock(mMutex);
     mFinished = true;
     pShutDownWhenDoneLocked();
-    mChanged.notifyAll();
 }
 
 void Outbox::abandon()
@@ -57,39 +57,26 @@ void Outbox::abandon()
     const MutexLock lock(mMutex);
     mFinished = true;
     mQueue.shutdown();
-    mChanged.notifyAll();
 }
 
-void Outbox::dumpStatistics(std::ostream& os, const Indent& indent) const { mQueue.dumpStatistics(os, indent); }
-
-void Outbox::feed()
+void Outbox::dumpStatistics(std::ostream& os, const Indent& indent) const
 {
-    UniqueMutexLock lock(mMutex);
-    while (pAwaitWaitingLocked(lock)) {
-        // Its entry stays in the list until it is in the queue, so that nothing posted meanwhile overtakes it.
-        Waiting& next = mWaiting.front();
-        const MessageQueuingOptions priority = next.priority;
-        std::unique_ptr<QelMessage> message = std::move(next.message);
-        mQueued += *message;
-        lock.unlock();
-        const auto result = mQueue.enqueue(std::move(message), priority | MessageQueuingOptions::BLOCKING);
-        if (result != QelMessageQueue::OK) return; // abandoned
-        lock.lock();
-        mWaiting.pop_front();
-        pShutDownWhenDoneLocked();
-        lock.unlock();
-        mOnRoom();
-        lock.lock();
+    {
+        const MutexLock lock(mMutex);
+        QelMessageCount waiting;
+        for (const Waiting& entry : mWaiting)
+            waiting += *entry.message;
+        os << indent << "In Front:       " << waiting << '\n'
+           << indent << "Waited:         " << decFormat(mHaveWaited) << ", at most "
+           << decFormat(std::chrono::duration_cast<std::chrono::microseconds>(mLongestWait).count()) << " us\n";
     }
+    mQueue.dumpStatistics(os, indent);
 }
 
 std::unique_ptr<QelMessage> Outbox::take()
 {
     std::unique_ptr<QelMessage> message = mQueue.waitForMsg(std::chrono::milliseconds::max());
-    if (message == nullptr) return nullptr;
-    const MutexLock lock(mMutex);
-    mQueued -= *message;
-    pShutDownWhenDoneLocked();
+    if (message != nullptr && pMoveWaiting()) pOnRoom();
     return message;
 }
 
@@ -114,42 +101,42 @@ void Outbox::pPost(std::unique_ptr<QelMessage> message, MessageQueuingOptions pr
 {
     const MutexLock lock(mMutex);
     if (mFinished) return;
-    if (pFindsRoomLocked(priority)) {
+    if (mWaiting.empty() && mQueue.hasRoom(priority)) {
         pEnqueueLocked(std::move(message), priority);
     } else {
-        mWaiting.push_back({std::move(message), priority});
-        mChanged.notifyAll();
+        mWaiting.push_back({std::move(message), priority, TimeProvider::steady()});
     }
 }
 
-/// The queue's own rule, applied to a count that is never below the queue's: the queue will admit the message.
-bool Outbox::pFindsRoomLocked(MessageQueuingOptions priority) const
-{
-    const std::size_t limit = priority == kSerial ? mLimitBytes - mLimitBytes / 2 : mLimitBytes;
-    return mWaiting.empty() && mQueued.mBytes < limit;
-}
-
+/// Only with room in the queue. @post the message is in it, unless the queue was shut down
 void Outbox::pEnqueueLocked(std::unique_ptr<QelMessage> message, MessageQueuingOptions priority)
 {
-    QelMessageCount added;
-    added += *message;
     // Not BLOCKING: it would not block here, but nothing may under this lock and those of the callers.
-    static_cast<void>(mQueue.enqueue(std::move(message), priority));
-    mQueued += added;
+    if (mQueue.enqueue(std::move(message), priority) == QelMessageQueue::OK) ++mQueued;
 }
 
-/// Waits for a message without room. @return false: there will be no more
-bool Outbox::pAwaitWaitingLocked(UniqueMutexLock& lock)
+/// The writer has taken a message. @return whether a message that waited has entered
+bool Outbox::pMoveWaiting()
 {
-    while (mWaiting.empty() && !mFinished)
-        mChanged.wait(lock);
-    return !mWaiting.empty() && !mQueue.isShutdown();
+    const MutexLock lock(mMutex);
+    --mQueued;
+    bool moved = false;
+    while (!mWaiting.empty() && mQueue.hasRoom(mWaiting.front().priority)) {
+        Waiting next = std::move(mWaiting.front());
+        mWaiting.pop_front();
+        mLongestWait = std::max<std::chrono::nanoseconds>(mLongestWait, TimeProvider::steady() - next.since);
+        ++mHaveWaited;
+        pEnqueueLocked(std::move(next.message), next.priority);
+        moved = true;
+    }
+    pShutDownWhenDoneLocked();
+    return moved;
 }
 
 /// Only when the queue is empty: after its shutdown it returns no messages.
 void Outbox::pShutDownWhenDoneLocked()
 {
-    if (mFinished && mWaiting.empty() && mQueued.mCount == 0) mQueue.shutdown();
+    if (mFinished && mWaiting.empty() && mQueued == 0) mQueue.shutdown();
 }
 
 } // namespace qel::protocol

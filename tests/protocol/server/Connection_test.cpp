@@ -288,6 +288,8 @@ TEST_F(ConnectionTest, TheStatisticsNameTheConsole)
     std::ostringstream text;
     connection->dumpStatistics(text);
     EXPECT_THAT(text.str(), StartsWith("Queue of console 1, the test:\n"
+                                       "  In Front:       0 (0 B)\n"
+                                       "  Waited:         0, at most 0 us\n"
                                        "  Limits:         501/1001\n"
                                        "  Max Size (HWM): 80 B\n"
                                        "  Pending:        0 (0 B)\n"

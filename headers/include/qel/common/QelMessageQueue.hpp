@@ -66,6 +66,11 @@ public:
     ReturnCode enqueue(std::unique_ptr<QelMessage> message,
                        MessageQueuingOptions options = MessageQueuingOptions::DEFAULT);
 
+    /// @param options  BLOCKING changes nothing here
+    /// @return whether enqueue() would admit a message of this priority now, of whatever length. The answer stays true
+    ///         until a message is added, and stays false until one is taken
+    bool hasRoom(MessageQueuingOptions options = MessageQueuingOptions::DEFAULT) const;
+
     /// Takes the first message, and waits for one if the queue is empty.
     /// @param timeout  how long to wait; zero or less: does not wait; milliseconds::max(), and any timeout of more than
     ///                 a hundred years: no limit
