@@ -69,6 +69,8 @@ unsigned long bytesIn(const std::string& statistics, const std::string& label)
 
 /// A whole dump of an empty queue through which one message has passed.
 const char* const kDump = "Queue of console 1, 127\\.0\\.0\\.1:[0-9]+:\n"
+                          "  In Front:       0 \\(0 B\\)\n"
+                          "  Waited:         0, at most 0 us\n"
                           "  Limits:         131072/262144\n"
                           "  Max Size \\(HWM\\): 8[0-9] B\n"
                           "  Pending:        0 \\(0 B\\)\n"
