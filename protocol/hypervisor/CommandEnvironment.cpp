@@ -1,5 +1,6 @@
 #include "hypervisor/CommandEnvironment.hpp"
 
+#include <algorithm>
 #include <cerrno>
 #include <pwd.h>
 #include <unistd.h>
@@ -38,16 +39,27 @@ Account currentAccount()
 
 } // namespace
 
-std::vector<std::string> commandEnvironment(std::uint16_t partition, const std::string& term)
+void setVariable(std::vector<std::string>& environment, const std::string& variable)
+{
+    const std::string start = variable.substr(0, variable.find('=') + 1);
+    const auto found = std::find_if(environment.begin(), environment.end(),
+                                    [&start](const std::string& entry) { return entry.rfind(start, 0) == 0; });
+    if (found == environment.end()) {
+        environment.push_back(variable);
+    } else {
+        *found = variable;
+    }
+}
+
+std::vector<std::string> commandEnvironment(const std::string& term, const std::vector<std::string>& more)
 {
     const Account account = currentAccount();
-    return {"TERM=" + term,
-            "HOME=" + account.home,
-            std::string("PATH=") + kPath,
-            "USER=" + account.user,
-            "SHELL=" + account.shell,
-            std::string("LANG=") + kLanguage,
-            "QEL_PARTITION=" + std::to_string(partition)};
+    std::vector<std::string> environment{
+        "TERM=" + term,         "HOME=" + account.home,   std::string("PATH=") + kPath,
+        "USER=" + account.user, "SHELL=" + account.shell, std::string("LANG=") + kLanguage};
+    for (const std::string& variable : more)
+        setVariable(environment, variable);
+    return environment;
 }
 
 } // namespace qel::protocol

@@ -23,10 +23,11 @@ enum class ConsoleState {
 struct ConsoleEntry {
     ConsoleEntry(Peer from, ConsoleLink& to) : peer(std::move(from)), link(to) {}
 
-    Peer peer;         ///< its tool type and id are granted once it is identified
+    Peer peer;         ///< its tool type and id are taken once it is identified
     ConsoleLink& link; ///< outlives the entry: see HypervisorEngine::connect()
     ConsoleState state = ConsoleState::Connected;
     bool sessionOpen = false; ///< the hypervisor session
+    bool announced = false;   ///< Hypervisor::onConnected() has been called
 };
 
 } // namespace qel::protocol

@@ -3,15 +3,18 @@
 #include <qel/common/QelInternalMessageRegistry.hpp>
 #include <qel/common/QelMessageDax.hpp>
 #include <qel/common/QelMessageGeneric.hpp>
-#include <qel/common/util/TimeProvider.hpp>
 #include <qel/protocol/FrameLimits.hpp>
 #include <qel/protocol/Logging.hpp>
 
+#include "base/Guard.hpp"
 #include "base/MessageKind.hpp"
+#include "hypervisor/HypervisorImpl.hpp"
 
 #include <algorithm>
 #include <chrono>
 #include <limits>
+#include <stdexcept>
+#include <type_traits>
 #include <utility>
 
 namespace qel::protocol {
@@ -47,12 +50,16 @@ QelCapabilities intersection(const QelCapabilities& left, const QelCapabilities&
 
 } // namespace
 
-HypervisorEngine::HypervisorEngine(HypervisorSettings settings, PartitionSet partitions,
-                                   std::function<void()> wakeSerial)
-    : mSettings(std::move(settings)), mWakeSerial(std::move(wakeSerial)), mPartitions(std::move(partitions))
-{}
+HypervisorEngine::HypervisorEngine(Hypervisor& machine, std::uint8_t maxConsoles, std::function<void()> wakeSerial)
+    : mMachine(machine), mMaxConsoles(maxConsoles), mWakeSerial(std::move(wakeSerial))
+{
+    const MutexLock lock(mMutex);
+    for (const auto& entry : mMachine.mImpl->lines)
+        mPartitions.add(entry.first, *entry.second);
+    if (mMachine.mImpl->served.exchange(true)) throw std::logic_error("a server serves this hypervisor");
+}
 
-HypervisorEngine::~HypervisorEngine() = default;
+HypervisorEngine::~HypervisorEngine() { mMachine.mImpl->served = false; }
 
 ConsoleId HypervisorEngine::connect(ConsoleLink& link, Peer peer)
 {
@@ -97,7 +104,7 @@ bool HypervisorEngine::mayReceive(ConsoleId id) const
 bool HypervisorEngine::takesConsoles() const
 {
     const MutexLock lock(mMutex);
-    return !mShutDown && pCountIdentified() < mSettings.maxConsoles;
+    return !mShutDown && pCountIdentified() < mMaxConsoles;
 }
 
 void HypervisorEngine::disconnect(ConsoleId id)
@@ -105,7 +112,11 @@ void HypervisorEngine::disconnect(ConsoleId id)
     const MutexLock lock(mMutex);
     const auto found = mConsoles.find(id);
     if (found == mConsoles.end()) return;
-    mPartitions.release(found->second);
+    ConsoleEntry& console = found->second;
+    mPartitions.release(console);
+    if (console.announced) {
+        static_cast<void>(runGuarded([&] { mMachine.onDisconnected(console.peer); }, "console ", id));
+    }
     mConsoles.erase(found);
     logLine(LogLevel::Info, "console ", id, " disconnected");
     mWakeSerial();
@@ -150,41 +161,33 @@ bool HypervisorEngine::serviceEndedLines()
     return mPartitions.serviceEnded();
 }
 
-/// The entry of the table for requests of class T. A request that has T's identity and another class did not parse.
-template <typename T>
-HypervisorEngine::Rules::value_type HypervisorEngine::pRule(Reply (HypervisorEngine::*handler)(ConsoleEntry&, const T&),
-                                                            bool needsSession)
+template <typename T, HypervisorEngine::Handler<T> kHandler>
+HypervisorEngine::Rules::value_type HypervisorEngine::pRule(bool needsSession)
 {
     const auto identity = T::getMessageID();
-    Rule rule;
-    rule.needsSession = needsSession;
-    rule.handle = [handler](HypervisorEngine& self, ConsoleEntry& console, const QelMessage& message) -> Reply {
-        const auto* request = dynamic_cast<const T*>(&message);
-        if (request == nullptr) return bareResponse(message, QelMessageStatusInvalidData);
-        return (self.*handler)(console, *request);
-    };
-    return {RequestId(std::get<0>(identity), std::get<1>(identity)), rule};
+    return {RequestId(std::get<0>(identity), std::get<1>(identity)),
+            {&HypervisorEngine::pServe<T, kHandler>, needsSession}};
 }
 
 const HypervisorEngine::Rules& HypervisorEngine::pRules()
 {
     constexpr bool kNeedsSession = true;
     static const Rules rules{
-        pRule(&HypervisorEngine::pVersion),
-        pRule(&HypervisorEngine::pOpenSession),
-        pRule(&HypervisorEngine::pCloseSession),
-        pRule(&HypervisorEngine::pCapabilities),
-        pRule(&HypervisorEngine::pLimits),
-        pRule(&HypervisorEngine::pBroadcast),
-        pRule(&HypervisorEngine::pTime),
-        pRule(&HypervisorEngine::pSetMode),
-        pRule(&HypervisorEngine::pGetMode),
-        pRule(&HypervisorEngine::pSetMetadata),
-        pRule(&HypervisorEngine::pGetMetadata),
-        pRule(&HypervisorEngine::pOpenSerial, kNeedsSession),
-        pRule(&HypervisorEngine::pCloseSerial, kNeedsSession),
-        pRule(&HypervisorEngine::pMaxSerialSessions, kNeedsSession),
-        pRule(&HypervisorEngine::pSetUpSerial, kNeedsSession),
+        pRule<QelMessageGetEnclTypeAndInterfaceVersionReq, &HypervisorEngine::pVersion>(),
+        pRule<QelMessageInterfaceCmpOpenKrogSessionReq, &HypervisorEngine::pOpenSession>(),
+        pRule<QelMessageInterfaceCmpCloseKrogSessionReq, &HypervisorEngine::pCloseSession>(),
+        pRule<QelMessageExchIntCapabilitiesReq, &HypervisorEngine::pCapabilities>(),
+        pRule<QelMessageGetInterfaceLimitsReq, &HypervisorEngine::pLimits>(),
+        pRule<QelMessageDaxBroadcastReq, &HypervisorEngine::pBroadcast>(),
+        pRule<QelMessageGetQelTodReq, &HypervisorEngine::pTime>(),
+        pRule<QelMessageSetGlobalModeAttributeReq, &HypervisorEngine::pSetMode>(),
+        pRule<QelMessageGetGlobalModeAttributeReq, &HypervisorEngine::pGetMode>(),
+        pRule<QelMessageSetGlobalSaveAreaMetadataReq, &HypervisorEngine::pSetMetadata>(),
+        pRule<QelMessageGetGlobalSaveAreaMetadataReq, &HypervisorEngine::pGetMetadata>(),
+        pRule<QelMessageVirtualSerialOpenReq, &HypervisorEngine::pOpenSerial>(kNeedsSession),
+        pRule<QelMessageVirtualSerialCloseReq, &HypervisorEngine::pCloseSerial>(kNeedsSession),
+        pRule<QelMessageVirtualSerialGetMaxSessionsReq, &HypervisorEngine::pMaxSerialSessions>(kNeedsSession),
+        pRule<QelMessageVirtualSerialSetupSessionReq, &HypervisorEngine::pSetUpSerial>(kNeedsSession),
     };
     return rules;
 }
@@ -202,16 +205,35 @@ bool HypervisorEngine::pMayReceive(const ConsoleEntry& console) const
 
 void HypervisorEngine::pHandleRequest(ConsoleEntry& console, const QelMessage& request)
 {
-    const Rule* rule = nullptr;
-    const QelMessageStatusCodes refusal = pAdmit(console, request, rule);
-    Reply reply =
-        refusal == QelMessageStatusNoError ? rule->handle(*this, console, request) : bareResponse(request, refusal);
+    Reply reply = pAnswer(console, request);
     const QelMessageStatusCodes status = reply->getStatus();
     if (status != QelMessageStatusNoError) {
         logLine(LogLevel::Info, "console ", console.peer.id, ": refused ", request.getLogID(), ": ", status);
     }
     console.link.post(std::move(reply));
+    if (console.state == ConsoleState::Identified) return pAnnounce(console);
     if (status == QelMessageStatusTooManyConnections) pClose(console);
+}
+
+/// The response to a request, whatever the operations of the user's object throw.
+HypervisorEngine::Reply HypervisorEngine::pAnswer(ConsoleEntry& console, const QelMessage& request)
+{
+    try {
+        const Rule* rule = nullptr;
+        const QelMessageStatusCodes refusal = pAdmit(console, request, rule);
+        if (refusal != QelMessageStatusNoError) return bareResponse(request, refusal);
+        return (this->*rule->serve)(console, request);
+    } catch (...) {
+        logCurrent("console ", console.peer.id, ": cannot serve ", request.getLogID());
+        return bareResponse(request, QelMessageStatusCmdFailed);
+    }
+}
+
+/// Tells the user's object once that a console is there.
+void HypervisorEngine::pAnnounce(ConsoleEntry& console)
+{
+    if (std::exchange(console.announced, true)) return;
+    static_cast<void>(runGuarded([&] { mMachine.onConnected(console.peer); }, "console ", console.peer.id));
 }
 
 void HypervisorEngine::pHandleNotice(ConsoleEntry& console, const QelMessage& notice)
@@ -246,19 +268,34 @@ QelMessageStatusCodes HypervisorEngine::pAdmit(const ConsoleEntry& console, cons
     return QelMessageStatusNoError;
 }
 
+/// Serves a request of class T. One that has T's identity and another class did not parse.
+template <typename T, HypervisorEngine::Handler<T> kHandler>
+HypervisorEngine::Reply HypervisorEngine::pServe(ConsoleEntry& console, const QelMessage& message)
+{
+    const auto* request = dynamic_cast<const T*>(&message);
+    if (request == nullptr) return bareResponse(message, QelMessageStatusInvalidData);
+    if constexpr (std::is_same_v<T, QelMessageGetEnclTypeAndInterfaceVersionReq>) {
+        console.peer.toolType = request->getToolType();
+        console.peer.toolId = request->getToolId();
+    }
+    const QelMessageStatusCodes decision = mMachine.mayRequest(console.peer, *request);
+    if (decision != QelMessageStatusNoError) return bareResponse(message, decision);
+    return (this->*kHandler)(console, *request);
+}
+
 HypervisorEngine::Reply HypervisorEngine::pVersion(ConsoleEntry& console,
                                                    const QelMessageGetEnclTypeAndInterfaceVersionReq& request)
 {
     if (pFindIdentified(request.getToolType(), request.getToolId()) != nullptr) {
         return bareResponse(request, QelMessageStatusDaxAlreadyConnected);
     }
-    if (pCountIdentified() >= mSettings.maxConsoles) return bareResponse(request, QelMessageStatusTooManyConnections);
+    if (pCountIdentified() >= mMaxConsoles) return bareResponse(request, QelMessageStatusTooManyConnections);
+    const MachineInfo machine = mMachine.machine();
+    auto response = std::make_unique<QelMessageGetEnclTypeAndInterfaceVersionRsp>(
+        request.getCallerId(), machine.interfaceFamily, machine.majorVersion, machine.minorVersion, machine.machineType,
+        machine.serialNumber);
     console.state = ConsoleState::Identified;
-    console.peer.toolType = request.getToolType();
-    console.peer.toolId = request.getToolId();
-    return std::make_unique<QelMessageGetEnclTypeAndInterfaceVersionRsp>(
-        request.getCallerId(), mSettings.interfaceFamily, mSettings.majorVersion, mSettings.minorVersion,
-        mSettings.machineType, mSettings.serialNumber);
+    return response;
 }
 
 HypervisorEngine::Reply HypervisorEngine::pOpenSession(ConsoleEntry& console,
@@ -281,16 +318,16 @@ HypervisorEngine::Reply HypervisorEngine::pCloseSession(ConsoleEntry& console,
 HypervisorEngine::Reply HypervisorEngine::pCapabilities(ConsoleEntry&, const QelMessageExchIntCapabilitiesReq& request)
 {
     return std::make_unique<QelMessageExchIntCapabilitiesRsp>(
-        request.getCallerId(), kCapabilityBytes, intersection(request.getCapabilities(), mSettings.capabilities));
+        request.getCallerId(), kCapabilityBytes, intersection(request.getCapabilities(), mMachine.capabilities()));
 }
 
 HypervisorEngine::Reply HypervisorEngine::pLimits(ConsoleEntry&, const QelMessageGetInterfaceLimitsReq& request)
 {
     const QelMessageGetInterfaceLimitsRsp response(request.getCallerId());
-    if (mSettings.maxConsoles == QelMessageGetInterfaceLimitsRsp::DAXS_SUPPORTED) return response.clone();
+    if (mMaxConsoles == QelMessageGetInterfaceLimitsRsp::DAXS_SUPPORTED) return response.clone();
     // The class writes the protocol's own number of consoles; the number that this server allows replaces it.
     std::string payload(response.getData(), response.dataLength());
-    payload[kConsolesSupportedOffset] = static_cast<char>(mSettings.maxConsoles);
+    payload[kConsolesSupportedOffset] = static_cast<char>(mMaxConsoles);
     auto changed = std::make_unique<QelMessageGeneric>(response);
     changed->setData(payload.data(), static_cast<unsigned int>(payload.size()));
     return changed;
@@ -318,43 +355,63 @@ HypervisorEngine::Reply HypervisorEngine::pBroadcast(ConsoleEntry& console, cons
 
 HypervisorEngine::Reply HypervisorEngine::pTime(ConsoleEntry&, const QelMessageGetQelTodReq& request)
 {
-    const std::time_t now = std::chrono::system_clock::to_time_t(TimeProvider::system());
+    const std::time_t now = std::chrono::system_clock::to_time_t(mMachine.currentTime());
     return std::make_unique<QelMessageGetQelTodRsp>(request.getCallerId(), now);
 }
 
-HypervisorEngine::Reply HypervisorEngine::pSetMode(ConsoleEntry&, const QelMessageSetGlobalModeAttributeReq& request)
+HypervisorEngine::Reply HypervisorEngine::pSetMode(ConsoleEntry& console,
+                                                   const QelMessageSetGlobalModeAttributeReq& request)
 {
     // A longer text would make a response that the console that reads the mode must not accept.
     if (request.getMTMSLen() > kMaxMtms) return bareResponse(request, QelMessageStatusInvalidData);
-    mMode = request.getMode();
-    mMtms = request.getMTMS();
+    mMachine.setMode(console.peer, {request.getMode(), request.getMTMS()});
     return bareResponse(request, QelMessageStatusNoError); // 0x0108 has no response class
 }
 
 HypervisorEngine::Reply HypervisorEngine::pGetMode(ConsoleEntry&, const QelMessageGetGlobalModeAttributeReq& request)
 {
-    return std::make_unique<QelMessageGetGlobalModeAttributeRsp>(request.getCallerId(), mMode, mMtms);
+    const GlobalMode mode = mMachine.getMode();
+    if (mode.mtms.size() > kMaxMtms) throw std::length_error("the text of the mode does not fit a response");
+    return std::make_unique<QelMessageGetGlobalModeAttributeRsp>(request.getCallerId(), mode.mode, mode.mtms);
 }
 
-HypervisorEngine::Reply HypervisorEngine::pSetMetadata(ConsoleEntry&,
+HypervisorEngine::Reply HypervisorEngine::pSetMetadata(ConsoleEntry& console,
                                                        const QelMessageSetGlobalSaveAreaMetadataReq& request)
 {
     if (request.getMetadataLen() > kMaxMetadata) return bareResponse(request, QelMessageStatusInvalidData);
-    mMetadata = request.getMetadata();
+    mMachine.setMetadata(console.peer, request.getMetadata());
     return std::make_unique<QelMessageSetGlobalSaveAreaMetadataRsp>(request.getCallerId());
 }
 
 HypervisorEngine::Reply HypervisorEngine::pGetMetadata(ConsoleEntry&,
                                                        const QelMessageGetGlobalSaveAreaMetadataReq& request)
 {
-    return std::make_unique<QelMessageGetGlobalSaveAreaMetadataRsp>(request.getCallerId(), mMetadata);
+    const std::string metadata = mMachine.getMetadata();
+    if (metadata.size() > kMaxMetadata) throw std::length_error("the metadata do not fit a response");
+    return std::make_unique<QelMessageGetGlobalSaveAreaMetadataRsp>(request.getCallerId(), metadata);
+}
+
+/// Whether a console may use a partition. For one that may not, the partition does not exist.
+QelMessageStatusCodes HypervisorEngine::pMayUse(const ConsoleEntry& console, std::uint16_t partition)
+{
+    const bool mayUse = mPartitions.has(partition) && mMachine.mayOpen(console.peer, partition);
+    return mayUse ? QelMessageStatusNoError : QelMessageStatusInvalidLparId;
+}
+
+/// The same for a session that may be open: a console that holds it is not asked about again.
+QelMessageStatusCodes HypervisorEngine::pMayReach(const ConsoleEntry& console, std::uint16_t partition)
+{
+    if (mPartitions.isHeldBy(console, partition)) return QelMessageStatusNoError;
+    return pMayUse(console, partition);
 }
 
 HypervisorEngine::Reply HypervisorEngine::pOpenSerial(ConsoleEntry& console,
                                                       const QelMessageVirtualSerialOpenReq& request)
 {
-    const auto status =
-        mPartitions.open(console, request.getLpId(), request.getVssConnectionNumber(), request.isForceOpen());
+    auto status = pMayUse(console, request.getLpId());
+    if (status == QelMessageStatusNoError) {
+        status = mPartitions.open(console, request.getLpId(), request.getVssConnectionNumber(), request.isForceOpen());
+    }
     if (status != QelMessageStatusNoError) return bareResponse(request, status);
     return std::make_unique<QelMessageVirtualSerialOpenRsp>(request.getCallerId(), request.getLpId(),
                                                             request.getVssConnectionNumber());
@@ -363,8 +420,11 @@ HypervisorEngine::Reply HypervisorEngine::pOpenSerial(ConsoleEntry& console,
 HypervisorEngine::Reply HypervisorEngine::pCloseSerial(ConsoleEntry& console,
                                                        const QelMessageVirtualSerialCloseReq& request)
 {
-    const auto status =
-        mPartitions.close(console, request.getLpId(), request.getVssConnectionNumber(), request.isForceClose());
+    auto status = pMayReach(console, request.getLpId());
+    if (status == QelMessageStatusNoError) {
+        status =
+            mPartitions.close(console, request.getLpId(), request.getVssConnectionNumber(), request.isForceClose());
+    }
     if (status != QelMessageStatusNoError) return bareResponse(request, status);
     return std::make_unique<QelMessageVirtualSerialCloseRsp>(request.getCallerId());
 }
@@ -381,7 +441,10 @@ HypervisorEngine::Reply HypervisorEngine::pMaxSerialSessions(ConsoleEntry&,
 HypervisorEngine::Reply HypervisorEngine::pSetUpSerial(ConsoleEntry& console,
                                                        const QelMessageVirtualSerialSetupSessionReq& request)
 {
-    const auto status = mPartitions.setUp(console, request.getLpId(), request.getVssConnectionNumber());
+    auto status = pMayReach(console, request.getLpId());
+    if (status == QelMessageStatusNoError) {
+        status = mPartitions.setUp(console, request.getLpId(), request.getVssConnectionNumber());
+    }
     if (status != QelMessageStatusNoError) return bareResponse(request, status);
     return std::make_unique<QelMessageVirtualSerialSetupSessionRsp>(request.getCallerId());
 }

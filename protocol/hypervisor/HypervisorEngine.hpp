@@ -1,10 +1,10 @@
 #pragma once
 
-#include <qel/common/QelCapabilities.hpp>
 #include <qel/common/QelMessage.hpp>
 #include <qel/common/QelMessageInterfaceComponent.hpp>
 #include <qel/common/QelMessageVirtualSerial.hpp>
 #include <qel/common/util/Mutex.hpp>
+#include <qel/protocol/Hypervisor.hpp>
 
 #include "hypervisor/ConsoleEntry.hpp"
 #include "hypervisor/PartitionSet.hpp"
@@ -19,17 +19,6 @@
 
 namespace qel::protocol {
 
-/// What the hypervisor end reports about itself, and how many consoles it takes.
-struct HypervisorSettings {
-    char interfaceFamily = 'Q';
-    std::uint16_t majorVersion = 1;
-    std::uint16_t minorVersion = 0;
-    std::string machineType = "QEL-SERVE"; ///< at most 16 bytes
-    std::string serialNumber = "0000001";  ///< at most 16 bytes
-    QelCapabilities capabilities;
-    std::uint8_t maxConsoles = 16; ///< identified at a time; more than 0
-};
-
 /// What follows from a message for the reader of its connection.
 struct Received {
     ConsoleState state; ///< of the connection
@@ -40,15 +29,24 @@ struct Received {
 
 /// The logic of the hypervisor end, without input or output: which response each request gets, and which console holds
 /// which session. Messages come in through receive(); responses and notices go out through the consoles' links, serial
-/// data through the partitions' ports. docs/connection.md describes the rules.
+/// data through the partitions' lines. What is specific to a machine it asks the user's Hypervisor; what that throws is
+/// logged, and the request is answered with status 6. docs/connection.md describes the rules.
 ///
-/// Thread safety: any thread may call any operation. One lock guards everything. Links and ports are called with it
-/// held and do not block, so it is never held for long. Lock order: this lock, then the locks of links and ports, then
-/// the logger's.
+/// Thread safety: any thread may call any operation. One lock guards everything. The user's object, links and lines are
+/// called with it held and do not block, so it is never held for long. Lock order: this lock, then the locks of links,
+/// lines and the user's object, then the logger's.
 class HypervisorEngine {
 public:
+    /// The default maximum of consoles.
+    static constexpr std::uint8_t kDefaultMaxConsoles = 16;
+
+    /// @param machine  borrowed; must outlive this object
+    /// @param maxConsoles  identified at a time; more than 0
     /// @param wakeSerial  called, with the lock held, when serialWatches() may have changed
-    HypervisorEngine(HypervisorSettings settings, PartitionSet partitions, std::function<void()> wakeSerial);
+    /// @throws std::logic_error  another engine serves the machine
+    HypervisorEngine(Hypervisor& machine, std::uint8_t maxConsoles, std::function<void()> wakeSerial);
+
+    /// Takes the partitions' lines down. All connections must have been disconnected.
     ~HypervisorEngine();
     HypervisorEngine(const HypervisorEngine&) = delete;
     HypervisorEngine& operator=(const HypervisorEngine&) = delete;
@@ -94,24 +92,32 @@ private:
     /// The identity of a request: function and operation.
     using RequestId = std::pair<unsigned short, unsigned short>;
 
+    template <typename T>
+    using Handler = Reply (HypervisorEngine::*)(ConsoleEntry&, const T&);
+
     /// How a request is handled.
     struct Rule {
-        std::function<Reply(HypervisorEngine&, ConsoleEntry&, const QelMessage&)> handle;
+        Handler<QelMessage> serve = nullptr;
         bool needsSession = false; ///< the hypervisor session must be open
     };
     using Rules = std::map<RequestId, Rule>;
 
-    template <typename T>
-    static Rules::value_type pRule(Reply (HypervisorEngine::*handler)(ConsoleEntry&, const T&),
-                                   bool needsSession = false);
+    template <typename T, Handler<T> kHandler>
+    static Rules::value_type pRule(bool needsSession = false);
     static const Rules& pRules();
     static bool pKnowsFunction(unsigned short function);
 
     bool pMayReceive(const ConsoleEntry& console) const QEL_REQUIRES(mMutex);
     void pHandleRequest(ConsoleEntry& console, const QelMessage& request) QEL_REQUIRES(mMutex);
     void pHandleNotice(ConsoleEntry& console, const QelMessage& notice) QEL_REQUIRES(mMutex);
+    Reply pAnswer(ConsoleEntry& console, const QelMessage& request) QEL_REQUIRES(mMutex);
     QelMessageStatusCodes pAdmit(const ConsoleEntry& console, const QelMessage& request, const Rule*& rule) const
         QEL_REQUIRES(mMutex);
+    template <typename T, Handler<T> kHandler>
+    Reply pServe(ConsoleEntry& console, const QelMessage& message) QEL_REQUIRES(mMutex);
+    void pAnnounce(ConsoleEntry& console) QEL_REQUIRES(mMutex);
+    QelMessageStatusCodes pMayUse(const ConsoleEntry& console, std::uint16_t partition) QEL_REQUIRES(mMutex);
+    QelMessageStatusCodes pMayReach(const ConsoleEntry& console, std::uint16_t partition) QEL_REQUIRES(mMutex);
 
     // One operation for each request; they return the response.
     Reply pVersion(ConsoleEntry&, const QelMessageGetEnclTypeAndInterfaceVersionReq&) QEL_REQUIRES(mMutex);
@@ -137,7 +143,8 @@ private:
     void pRefuseUpgrade(ConsoleEntry& console) QEL_REQUIRES(mMutex);
     void pClose(ConsoleEntry& console) QEL_REQUIRES(mMutex);
 
-    const HypervisorSettings mSettings;
+    Hypervisor& mMachine;
+    const std::uint8_t mMaxConsoles;
     const std::function<void()> mWakeSerial;
 
     mutable Mutex mMutex;
@@ -145,9 +152,6 @@ private:
     std::map<ConsoleId, ConsoleEntry> mConsoles QEL_GUARDED_BY(mMutex);
     ConsoleId mLastConsoleId QEL_GUARDED_BY(mMutex) = 0;
     bool mShutDown QEL_GUARDED_BY(mMutex) = false;
-    std::uint8_t mMode QEL_GUARDED_BY(mMutex) = 0; // the global mode attribute
-    std::string mMtms QEL_GUARDED_BY(mMutex);      // and the machine it names
-    std::string mMetadata QEL_GUARDED_BY(mMutex);  // of the global save area
 };
 
 } // namespace qel::protocol

@@ -1,12 +1,11 @@
 #include "hypervisor/PartitionSet.hpp"
 
 #include <qel/common/QelMessageGeneric.hpp>
-#include <qel/common/util/PosixError.hpp>
 #include <qel/common/util/TimeProvider.hpp>
 #include <qel/protocol/Logging.hpp>
 
 #include <array>
-#include <stdexcept>
+#include <optional>
 #include <utility>
 
 namespace qel::protocol {
@@ -29,15 +28,20 @@ constexpr CommandEnd kClosedTerminal{CommandEnd::Kind::ClosedTerminal, 0};
 } // namespace
 
 PartitionSet::PartitionSet() = default;
-PartitionSet::~PartitionSet() = default;
-PartitionSet::PartitionSet(PartitionSet&&) noexcept = default;
 
-void PartitionSet::add(std::uint16_t id, std::unique_ptr<SerialLine> port)
+PartitionSet::~PartitionSet()
 {
-    if (mPartitions.count(id) != 0) throw std::invalid_argument("partition");
-    Partition& partition = mPartitions[id];
-    partition.id = id;
-    partition.port = std::move(port);
+    for (auto& entry : mPartitions) {
+        if (entry.second.isUp) entry.second.line.stop();
+    }
+}
+
+void PartitionSet::add(std::uint16_t id, SerialLine& line) { mPartitions.emplace(id, Partition(id, line)); }
+
+bool PartitionSet::isHeldBy(const ConsoleEntry& console, std::uint16_t id) const
+{
+    const auto found = mPartitions.find(id);
+    return found != mPartitions.end() && found->second.holder == &console;
 }
 
 QelMessageStatusCodes PartitionSet::open(ConsoleEntry& console, std::uint16_t id, std::uint16_t connection, bool force)
@@ -122,12 +126,12 @@ std::vector<SerialWatch> PartitionSet::watches() const
     std::vector<SerialWatch> watches;
     for (const auto& entry : mPartitions) {
         const Partition& partition = entry.second;
-        if (!partition.port->isRunning() || pIsExiting(partition)) continue;
+        if (!partition.isUp || pIsExiting(partition)) continue;
         const bool wantsInput = !partition.input.empty();
         const bool wantsOutput = pWantsOutput(partition);
         if (partition.holder != nullptr && !wantsInput && !wantsOutput) continue;
         // Without a session nothing is read, but a hang-up is noticed: poll(2) always reports it.
-        PollFd fd(partition.port->descriptor(), PollEvents::Error);
+        PollFd fd(partition.line.descriptor(), PollEvents::Error);
         if (wantsInput) fd.mFd.events |= static_cast<short>(PollEvents::Write);
         if (wantsOutput) fd.mFd.events |= static_cast<short>(PollEvents::Read);
         watches.push_back({partition.id, fd});
@@ -140,10 +144,10 @@ bool PartitionSet::takeChanged() { return std::exchange(mChanged, false); }
 void PartitionSet::service(std::uint16_t id)
 {
     Partition* const partition = pFind(id);
-    if (partition == nullptr || !partition->port->isRunning() || pIsExiting(*partition)) return;
-    if (partition->holder == nullptr && partition->port->hasHungUp()) return pBeginExit(*partition);
+    if (partition == nullptr || !partition->isUp || pIsExiting(*partition)) return;
+    if (partition->holder == nullptr && partition->line.hasHungUp()) return pBeginExit(*partition);
     pPumpInput(*partition);
-    if (partition->port->isRunning() && pWantsOutput(*partition)) pPumpOutput(*partition);
+    if (partition->isUp && pWantsOutput(*partition)) pPumpOutput(*partition);
 }
 
 bool PartitionSet::serviceEnded()
@@ -171,14 +175,14 @@ QelMessageStatusCodes PartitionSet::pFindPartition(std::uint16_t id, std::uint16
 
 bool PartitionSet::pStart(Partition& partition)
 {
-    if (pIsExiting(partition)) pEndLine(partition, partition.port->commandEnd().value_or(kClosedTerminal));
-    try {
-        partition.port->start();
+    if (pIsExiting(partition)) pEndLine(partition, partition.line.commandEnd().value_or(kClosedTerminal));
+    if (partition.line.start()) {
+        partition.isUp = true;
         return true;
-    } catch (const PosixError& error) {
-        logLine(LogLevel::Error, "partition ", partition.id, ": ", error.what());
-        return false;
     }
+    // What had ended on the line could not be started again.
+    if (partition.isUp && partition.line.descriptor() < 0) pTakeDown(partition, CloseReason::CloseReasonReadFailure);
+    return false;
 }
 
 /// Ends the session, if there is one, with a notice to the console that holds it.
@@ -199,7 +203,8 @@ void PartitionSet::pTakeDown(Partition& partition, CloseReason reason, const Com
     pEndSession(partition, reason, end);
     partition.input.clear();
     partition.exitDeadline = PollDeadline();
-    partition.port->stop();
+    partition.isUp = false;
+    partition.line.stop();
 }
 
 /// The line has ended. Its command ends a moment later, unless it has only closed its terminal.
@@ -212,7 +217,7 @@ void PartitionSet::pBeginExit(Partition& partition)
 /// Takes the line of an ended command down. @return false: the command has not ended, and may take more time
 bool PartitionSet::pFinishExit(Partition& partition)
 {
-    std::optional<CommandEnd> end = partition.port->commandEnd();
+    std::optional<CommandEnd> end = partition.line.commandEnd();
     if (!end) {
         if (!partition.exitDeadline.isExpired(TimeProvider::steady())) return false;
         end = kClosedTerminal;
@@ -233,17 +238,12 @@ void PartitionSet::pPumpInput(Partition& partition)
 {
     if (partition.input.empty()) return;
     const bool wasFull = partition.input.size() >= kInputLimit;
-    try {
-        if (partition.port->hasHungUp()) partition.input.clear(); // nothing is left that reads it
-        while (!partition.input.empty()) {
-            const std::size_t taken = partition.port->write(partition.input.data(), partition.input.size());
-            if (taken == 0) break;
-            partition.input.erase(0, taken);
-        }
-    } catch (const PosixError& error) {
-        logLine(LogLevel::Error, "partition ", partition.id, ": ", error.what());
-        pTakeDown(partition, CloseReason::CloseReasonWriteFailure);
-        return;
+    if (partition.line.hasHungUp()) partition.input.clear(); // nothing is left that reads it
+    while (!partition.input.empty()) {
+        const std::optional<std::size_t> taken = partition.line.write(partition.input.data(), partition.input.size());
+        if (!taken) return pTakeDown(partition, CloseReason::CloseReasonWriteFailure);
+        if (*taken == 0) break;
+        partition.input.erase(0, *taken);
     }
     const bool isFull = partition.input.size() >= kInputLimit;
     if (wasFull && !isFull && partition.holder != nullptr) partition.holder->link.resumeReading();
@@ -252,7 +252,7 @@ void PartitionSet::pPumpInput(Partition& partition)
 void PartitionSet::pPumpOutput(Partition& partition)
 {
     std::array<char, kOutputChunk> buffer;
-    const SerialLine::ReadResult result = partition.port->read(buffer.data(), buffer.size());
+    const SerialLine::ReadResult result = partition.line.read(buffer.data(), buffer.size());
     switch (result.state) {
     case SerialLine::LineState::Idle:
         return;

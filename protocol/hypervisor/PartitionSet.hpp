@@ -4,9 +4,9 @@
 #include <qel/common/QelMessageVirtualSerial.hpp>
 #include <qel/common/util/Poll.hpp>
 #include <qel/protocol/CommandEnd.hpp>
-#include <qel/protocol/SerialLine.hpp>
 
 #include "hypervisor/ConsoleEntry.hpp"
+#include "hypervisor/GuardedLine.hpp"
 
 #include <chrono>
 #include <cstddef>
@@ -30,7 +30,7 @@ struct SerialWatch {
 /// console that holds its session has room for it, so that nothing is lost and memory stays bounded. Input that a
 /// partition does not take is kept; hasInputRoom() says when to accept no more of it.
 ///
-/// Ownership: owns the ports, borrows the consoles: release() must come before a console is destroyed.
+/// Ownership: borrows the lines and the consoles: release() must come before a console is destroyed.
 /// Thread safety: none of its own; the hypervisor guards it with its lock.
 class PartitionSet {
 public:
@@ -44,13 +44,24 @@ public:
     static constexpr std::chrono::milliseconds kExitTimeout{1000};
 
     PartitionSet();
-    ~PartitionSet();
-    PartitionSet(PartitionSet&&) noexcept;
 
-    /// @throws std::invalid_argument  "partition": the id is taken
-    void add(std::uint16_t id, std::unique_ptr<SerialLine> port);
+    /// Takes the lines down.
+    ~PartitionSet();
+
+    PartitionSet(const PartitionSet&) = delete;
+    PartitionSet& operator=(const PartitionSet&) = delete;
+
+    /// @param id  not taken
+    /// @param line  borrowed
+    void add(std::uint16_t id, SerialLine& line);
 
     std::size_t size() const noexcept { return mPartitions.size(); }
+
+    /// Whether the partition exists.
+    bool has(std::uint16_t id) const { return mPartitions.count(id) != 0; }
+
+    /// Whether a console holds the session of a partition.
+    bool isHeldBy(const ConsoleEntry& console, std::uint16_t id) const;
 
     /// Opens the session of a partition for a console and starts the partition's command if it does not run.
     /// @param force  take the session from the console that holds it; that console gets a notice
@@ -100,8 +111,11 @@ private:
     using CloseReason = QelMessageVirtualSerialSessionClosedAsync::CloseReason;
 
     struct Partition {
-        std::uint16_t id = 0;
-        std::unique_ptr<SerialLine> port;
+        Partition(std::uint16_t number, SerialLine& itsLine) : id(number), line(number, itsLine) {}
+
+        std::uint16_t id;
+        GuardedLine line;
+        bool isUp = false;              ///< the line, from its start to its stop, even after its command has ended
         ConsoleEntry* holder = nullptr; ///< of the session; null: the session is free
         bool setUp = false;             ///< data may flow
         std::string input;              ///< from consoles, not yet taken by the line

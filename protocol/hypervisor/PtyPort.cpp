@@ -1,7 +1,8 @@
 #include "hypervisor/PtyPort.hpp"
 
-#include <qel/common/util/Poll.hpp>
 #include <qel/common/util/PosixError.hpp>
+
+#include "hypervisor/CommandEnvironment.hpp"
 
 #include <array>
 #include <cerrno>
@@ -116,26 +117,24 @@ bool isTransient(int error) { return error == EAGAIN || error == EINTR; }
 
 } // namespace
 
-PtyPort::PtyPort(std::string command, ChildReaper& reaper, std::vector<std::string> environment)
-    : mCommand(std::move(command)), mEnvironment(std::move(environment)), mReaper(reaper)
+PtyPort::PtyPort(std::string command, std::shared_ptr<ChildReaper> reaper, std::vector<std::string> environment)
+    : mCommand(std::move(command)), mEnvironment(std::move(environment)), mReaper(std::move(reaper))
 {}
 
 PtyPort::~PtyPort() { stop(); }
 
-void PtyPort::start()
+void PtyPort::start(std::uint16_t partition)
 {
-    if (isRunning()) {
+    if (mMaster.get() >= 0) {
         if (!commandEnd()) return;
         stop();
     }
     UniqueFd master = openMaster();
-    mLeader = spawn(mCommand, mEnvironment, slaveName(master.get()));
+    std::vector<std::string> environment = mEnvironment;
+    setVariable(environment, "QEL_PARTITION=" + std::to_string(partition));
+    mLeader = spawn(mCommand, std::move(environment), slaveName(master.get()));
     mMaster = std::move(master);
 }
-
-bool PtyPort::isRunning() const { return mMaster.get() >= 0; }
-
-bool PtyPort::hasHungUp() const { return PollSet(PollFd(mMaster.get(), PollEvents::Error)).poll().anyReady(); }
 
 std::optional<CommandEnd> PtyPort::commandEnd()
 {
@@ -177,7 +176,7 @@ int PtyPort::descriptor() const { return mMaster.get(); }
 void PtyPort::stop()
 {
     mMaster.reset(); // hangs up
-    if (mLeader > 0) mReaper.adopt(mLeader);
+    if (mLeader > 0) mReaper->adopt(mLeader);
     mLeader = -1;
 }
 

@@ -5,6 +5,8 @@
 
 #include "hypervisor/ChildReaper.hpp"
 
+#include <cstdint>
+#include <memory>
 #include <string>
 #include <vector>
 
@@ -17,26 +19,24 @@ namespace qel::protocol {
 /// Sources: pty(7), posix_spawn(3), credentials(7).
 class PtyPort final : public SerialLine {
 public:
-    /// @param reaper  borrowed; must outlive this object
-    /// @param environment  the whole environment of the command, one "NAME=value" each
-    PtyPort(std::string command, ChildReaper& reaper, std::vector<std::string> environment = {});
+    /// @param reaper  ends and reaps the command; not null
+    /// @param environment  the environment of the command, one "NAME=value" each; QEL_PARTITION is added
+    PtyPort(std::string command, std::shared_ptr<ChildReaper> reaper, std::vector<std::string> environment = {});
     ~PtyPort() override;
     PtyPort(const PtyPort&) = delete;
     PtyPort& operator=(const PtyPort&) = delete;
 
-    void start() override;
-    bool isRunning() const override;
-    bool hasHungUp() const override;
-    std::optional<CommandEnd> commandEnd() override;
+    void start(std::uint16_t partition) override;
+    void stop() override;
     ReadResult read(char* buffer, std::size_t length) override;
     std::size_t write(const char* data, std::size_t length) override;
     int descriptor() const override;
-    void stop() override;
+    std::optional<CommandEnd> commandEnd() override;
 
 private:
     const std::string mCommand;
     const std::vector<std::string> mEnvironment;
-    ChildReaper& mReaper;
+    const std::shared_ptr<ChildReaper> mReaper;
     UniqueFd mMaster;
     pid_t mLeader = -1; ///< the command's shell, not yet reaped; -1: none
 };

@@ -10,9 +10,6 @@ namespace qel::protocol {
 
 namespace {
 
-/// How often to look at commands that have been asked to end.
-constexpr std::chrono::milliseconds kReapInterval(50);
-
 /// How often to look at commands whose line has ended, which end at any moment.
 constexpr std::chrono::milliseconds kExitInterval(5);
 
@@ -21,8 +18,8 @@ constexpr std::chrono::milliseconds kPauseAfterFailure(100);
 
 } // namespace
 
-SerialLoop::SerialLoop(HypervisorEngine& hypervisor, ChildReaper& reaper, PollInterrupt& wake)
-    : mHypervisor(hypervisor), mReaper(reaper), mWake(wake), mThread([this] { pRun(); })
+SerialLoop::SerialLoop(HypervisorEngine& hypervisor, PollInterrupt& wake)
+    : mHypervisor(hypervisor), mWake(wake), mThread([this] { pRun(); })
 {}
 
 SerialLoop::~SerialLoop()
@@ -46,10 +43,8 @@ void SerialLoop::pRun() noexcept
 
 void SerialLoop::pPollOnce()
 {
-    const bool linesEnding = mHypervisor.serviceEndedLines(); // first: it hands commands to the reaper
-    const bool commandsEnding = mReaper.reap();
+    const bool linesEnding = mHypervisor.serviceEndedLines();
     std::chrono::milliseconds timeout = PollSet::TIMEOUT_INFINITE;
-    if (commandsEnding) timeout = kReapInterval;
     if (linesEnding) timeout = kExitInterval;
     const std::vector<SerialWatch> watches = mHypervisor.serialWatches();
     PollSet set(mWake.getPollFd());

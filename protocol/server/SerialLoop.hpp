@@ -2,7 +2,6 @@
 
 #include <qel/common/util/Poll.hpp>
 
-#include "hypervisor/ChildReaper.hpp"
 #include "hypervisor/HypervisorEngine.hpp"
 
 #include <atomic>
@@ -10,13 +9,13 @@
 
 namespace qel::protocol {
 
-/// The one thread that moves the serial data of all partitions and reaps the commands that have ended. It waits for
+/// The one thread that moves the serial data of all partitions. It waits for
 /// the hypervisor's serial watches, and for a wake-up when they have changed.
 /// Thread safety: one thread owns it.
 class SerialLoop {
 public:
-    /// Starts the thread. @param hypervisor, reaper, wake  borrowed; must outlive this object
-    SerialLoop(HypervisorEngine& hypervisor, ChildReaper& reaper, PollInterrupt& wake);
+    /// Starts the thread. @param hypervisor, wake  borrowed; must outlive this object
+    SerialLoop(HypervisorEngine& hypervisor, PollInterrupt& wake);
 
     /// Stops the thread and waits for it.
     ~SerialLoop();
@@ -29,7 +28,6 @@ private:
     void pPollOnce();
 
     HypervisorEngine& mHypervisor;
-    ChildReaper& mReaper;
     PollInterrupt& mWake;
     std::atomic<bool> mStopping{false};
     std::thread mThread;

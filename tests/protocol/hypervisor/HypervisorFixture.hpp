@@ -6,7 +6,7 @@
 
 #include "hypervisor/HypervisorEngine.hpp"
 #include "protocol/hypervisor/FakeConsole.hpp"
-#include "protocol/hypervisor/FakeSerialPort.hpp"
+#include "protocol/hypervisor/FakeSerialLine.hpp"
 #include "support/CapturedLog.hpp"
 
 #include <gtest/gtest.h>
@@ -34,23 +34,20 @@ protected:
         protocol::ConsoleId id = 0;
     };
 
-    HypervisorFixture() { makeHypervisor(protocol::HypervisorSettings()); }
+    HypervisorFixture() { serve(std::make_unique<protocol::Hypervisor>()); }
 
     /// Starts over with a hypervisor that takes so many consoles.
-    void limitConsoles(std::uint8_t maxConsoles)
-    {
-        protocol::HypervisorSettings settings;
-        settings.maxConsoles = maxConsoles;
-        makeHypervisor(settings);
-    }
+    void limitConsoles(std::uint8_t maxConsoles) { serve(std::make_unique<protocol::Hypervisor>(), maxConsoles); }
 
-    void makeHypervisor(const protocol::HypervisorSettings& settings)
+    /// Starts over with a machine, and gives it the two partitions.
+    void serve(std::unique_ptr<protocol::Hypervisor> served,
+               std::uint8_t maxConsoles = protocol::HypervisorEngine::kDefaultMaxConsoles)
     {
-        protocol::PartitionSet partitions;
-        partitions.add(1, makePort(port1));
-        partitions.add(2, makePort(port2));
-        hypervisor =
-            std::make_unique<protocol::HypervisorEngine>(settings, std::move(partitions), [this] { ++serialWakes; });
+        hypervisor.reset();
+        machine = std::move(served);
+        machine->addPartition(1, makeLine(port1));
+        machine->addPartition(2, makeLine(port2));
+        hypervisor = std::make_unique<protocol::HypervisorEngine>(*machine, maxConsoles, [this] { ++serialWakes; });
     }
 
     void connect(Peer& peer)
@@ -149,17 +146,18 @@ protected:
 
     CapturedLog log{LogLevel::Warn};
     QelMessageRegistry registry;
-    FakeSerialPort* port1 = nullptr; // owned by the hypervisor
-    FakeSerialPort* port2 = nullptr;
+    FakeSerialLine* port1 = nullptr; // owned by the machine
+    FakeSerialLine* port2 = nullptr;
     unsigned serialWakes = 0;
-    std::unique_ptr<protocol::HypervisorEngine> hypervisor;
+    std::unique_ptr<protocol::Hypervisor> machine;
+    std::unique_ptr<protocol::HypervisorEngine> hypervisor; // of the machine
 
 private:
-    static std::unique_ptr<FakeSerialPort> makePort(FakeSerialPort*& borrowed)
+    static std::unique_ptr<FakeSerialLine> makeLine(FakeSerialLine*& borrowed)
     {
-        auto port = std::make_unique<FakeSerialPort>();
-        borrowed = port.get();
-        return port;
+        auto line = std::make_unique<FakeSerialLine>();
+        borrowed = line.get();
+        return line;
     }
 };
 

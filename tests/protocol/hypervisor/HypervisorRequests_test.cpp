@@ -13,7 +13,8 @@ namespace qel::test {
 
 namespace {
 
-using protocol::HypervisorSettings;
+using protocol::Hypervisor;
+using protocol::MachineInfo;
 using ::testing::ElementsAre;
 
 using HypervisorTest = HypervisorFixture;
@@ -24,9 +25,7 @@ constexpr unsigned int kConnectionNotAvailable = 19;
 
 TEST_F(HypervisorTest, CapabilitiesAreTheIntersection)
 {
-    HypervisorSettings settings;
-    settings.capabilities = QelCapabilities("0110");
-    makeHypervisor(settings);
+    serve(std::make_unique<Hypervisor>(MachineInfo(), QelCapabilities("0110")));
     Peer peer;
     identify(peer, "a");
     receive(peer, QelMessageExchIntCapabilitiesReq(QelCapabilities("1100")));
@@ -37,9 +36,7 @@ TEST_F(HypervisorTest, CapabilitiesAreTheIntersection)
 
 TEST_F(HypervisorTest, CapabilitiesMayBeOfferedInAnyLength)
 {
-    HypervisorSettings settings;
-    settings.capabilities = QelCapabilities(std::string(32, '1'));
-    makeHypervisor(settings);
+    serve(std::make_unique<Hypervisor>(MachineInfo(), QelCapabilities(std::string(32, '1'))));
     Peer peer;
     identify(peer, "a");
     receive(peer, request(0x6003, 0x0104, std::string("\0\0\0\0", 4)));

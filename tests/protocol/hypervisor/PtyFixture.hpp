@@ -7,7 +7,9 @@
 
 #include <array>
 #include <chrono>
+#include <cstdint>
 #include <gtest/gtest.h>
+#include <memory>
 #include <string>
 
 namespace qel::test {
@@ -17,14 +19,16 @@ class PtyFixture : public ::testing::Test {
 protected:
     using LineState = protocol::SerialLine::LineState;
 
-    static void await(protocol::PtyPort& port)
+    static constexpr std::uint16_t kPartition = 7;
+
+    static void await(protocol::SerialLine& port)
     {
         const PollFd fd(port.descriptor(), PollEvents::Read);
         ASSERT_TRUE(PollSet(fd).wait(std::chrono::seconds(20)).anyReady()) << "nothing came";
     }
 
     /// Reads until the text has come. @return all that was read
-    static std::string readUntil(protocol::PtyPort& port, const std::string& text)
+    static std::string readUntil(protocol::SerialLine& port, const std::string& text)
     {
         std::string all;
         while (all.find(text) == std::string::npos) {
@@ -36,7 +40,7 @@ protected:
         return all;
     }
 
-    static std::string readUntilEnd(protocol::PtyPort& port)
+    static std::string readUntilEnd(protocol::SerialLine& port)
     {
         std::string all;
         while (readSome(port, all) != LineState::Ended)
@@ -44,17 +48,17 @@ protected:
         return all;
     }
 
-    static std::string outputOf(const std::string& command, protocol::ChildReaper& reaper)
+    std::string outputOf(const std::string& command)
     {
         protocol::PtyPort port(command, reaper);
-        port.start();
+        port.start(kPartition);
         return readUntilEnd(port);
     }
 
     /// The process id in a line like "pid=42".
     static pid_t pidIn(const std::string& text) { return std::stoi(text.substr(text.find("pid=") + 4)); }
 
-    static LineState readSome(protocol::PtyPort& port, std::string& all)
+    static LineState readSome(protocol::SerialLine& port, std::string& all)
     {
         await(port);
         if (HasFatalFailure()) return LineState::Ended;
@@ -64,7 +68,8 @@ protected:
         return result.state;
     }
 
-    protocol::ChildReaper reaper{std::chrono::milliseconds(50)};
+    const std::shared_ptr<protocol::ChildReaper> reaper =
+        std::make_shared<protocol::ChildReaper>(std::chrono::milliseconds(50));
 };
 
 } // namespace qel::test

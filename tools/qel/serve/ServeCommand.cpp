@@ -2,6 +2,8 @@
 
 #include <qel/common/net/Listen.hpp>
 #include <qel/common/util/PosixError.hpp>
+#include <qel/protocol/CommandLine.hpp>
+#include <qel/protocol/Hypervisor.hpp>
 #include <qel/protocol/WakeUp.hpp>
 
 #include "base/Failures.hpp"
@@ -9,10 +11,7 @@
 #include "base/Logging.hpp"
 #include "base/OptionChecks.hpp"
 #include "base/SignalWatch.hpp"
-#include "hypervisor/ChildReaper.hpp"
-#include "hypervisor/CommandEnvironment.hpp"
 #include "hypervisor/HypervisorEngine.hpp"
-#include "hypervisor/PtyPort.hpp"
 #include "server/SerialLoop.hpp"
 #include "server/Server.hpp"
 #include "transport/TransportOptions.hpp"
@@ -46,12 +45,12 @@ struct ServeOptions {
     TransportOptions transport;
     std::vector<std::string> partitions; ///< "ID=COMMAND"
     std::string term = "vt220";
-    std::uint32_t maxConsoles = 0;
+    std::uint32_t maxConsoles = HypervisorEngine::kDefaultMaxConsoles;
     std::size_t queueBytes = ConnectionLimits().queueBytes;
     std::string family;
     std::string version;
     std::string capabilities = std::string(QelCapabilities::size(), '1');
-    HypervisorSettings settings;
+    MachineInfo machine{'Q', 1, 0, "QEL-SERVE", "0000001"};
     LogOptions log;
 };
 
@@ -93,23 +92,21 @@ std::map<std::uint16_t, std::string> parsePartitions(const std::vector<std::stri
     return commands;
 }
 
-void parseVersion(const std::string& text, HypervisorSettings& settings)
+void parseVersion(const std::string& text, MachineInfo& machine)
 {
     const std::size_t dot = text.find('.');
     if (dot == std::string::npos) refuse("--interface-version", "takes MAJOR.MINOR");
-    settings.majorVersion = parseUint16(text.substr(0, dot), 0, "--interface-version");
-    settings.minorVersion = parseUint16(text.substr(dot + 1), 0, "--interface-version");
+    machine.majorVersion = parseUint16(text.substr(0, dot), 0, "--interface-version");
+    machine.minorVersion = parseUint16(text.substr(dot + 1), 0, "--interface-version");
 }
 
-HypervisorSettings parseSettings(const ServeOptions& options)
+MachineInfo parseMachine(const ServeOptions& options)
 {
-    HypervisorSettings settings = options.settings;
+    MachineInfo machine = options.machine;
     if (options.family.size() > 1) refuse("--interface-family", "takes one character");
-    if (!options.family.empty()) settings.interfaceFamily = options.family.front();
-    if (!options.version.empty()) parseVersion(options.version, settings);
-    settings.capabilities = QelCapabilities(options.capabilities);
-    settings.maxConsoles = static_cast<std::uint8_t>(options.maxConsoles);
-    return settings;
+    if (!options.family.empty()) machine.interfaceFamily = options.family.front();
+    if (!options.version.empty()) parseVersion(options.version, machine);
+    return machine;
 }
 
 Socket openListener(const IPEndpoint& endpoint)
@@ -126,20 +123,18 @@ struct ServePlan {
     IPEndpoint endpoint;
     std::map<std::uint16_t, std::string> commands;
     std::string term;
-    HypervisorSettings settings;
+    MachineInfo machine;
+    QelCapabilities capabilities;
+    std::uint8_t maxConsoles = 0;
     TransportOptions transport;
     std::size_t queueBytes = 0;
     LogOptions log;
 };
 
-PartitionSet makePartitions(const ServePlan& plan, ChildReaper& reaper)
+void addPartitions(Hypervisor& machine, const ServePlan& plan)
 {
-    PartitionSet partitions;
-    for (const auto& command : plan.commands) {
-        const std::uint16_t id = command.first;
-        partitions.add(id, std::make_unique<PtyPort>(command.second, reaper, commandEnvironment(id, plan.term)));
-    }
-    return partitions;
+    for (const auto& command : plan.commands)
+        machine.addPartition(command.first, commandLine(command.second, {plan.term, {}}));
 }
 
 ServePlan makePlan(const ServeOptions& options)
@@ -150,7 +145,9 @@ ServePlan makePlan(const ServeOptions& options)
     plan.transport = options.transport;
     plan.commands = parsePartitions(options.partitions);
     plan.term = options.term;
-    plan.settings = parseSettings(options);
+    plan.machine = parseMachine(options);
+    plan.capabilities = QelCapabilities(options.capabilities);
+    plan.maxConsoles = static_cast<std::uint8_t>(options.maxConsoles);
     plan.queueBytes = options.queueBytes;
     plan.log = options.log;
     return plan;
@@ -203,14 +200,15 @@ ExitStatus runServe(const ServePlan& plan)
     Socket listener = openListener(plan.endpoint);
     const IPEndpoint listening = listener.getSocketName();
 
-    ChildReaper reaper;
+    Hypervisor machine(plan.machine, plan.capabilities);
+    addPartitions(machine, plan);
     WakeUp serialWake;
-    HypervisorEngine hypervisor(plan.settings, makePartitions(plan, reaper), [&] { serialWake.interrupt(); });
+    HypervisorEngine hypervisor(machine, plan.maxConsoles, [&] { serialWake.interrupt(); });
     ConnectionLimits limits;
     limits.handshake = plan.transport.handshakeTimeout();
     limits.queueBytes = plan.queueBytes;
     Server server(hypervisor, std::move(listener), limits, std::move(context), plan.transport.pins);
-    SerialLoop serial(hypervisor, reaper, serialWake);
+    SerialLoop serial(hypervisor, serialWake);
 
     std::cout << listening << std::endl;
     flushOutput();
@@ -229,10 +227,10 @@ ExitStatus runServe(const ServePlan& plan)
 void addIdentityOptions(CLI::App& command, ServeOptions& options)
 {
     const CLI::Validator shortName = textUpTo(kMaxNameBytes);
-    command.add_option("--system-type", options.settings.machineType, "Machine type to report, at most 16 bytes")
+    command.add_option("--system-type", options.machine.machineType, "Machine type to report, at most 16 bytes")
         ->check(shortName)
         ->capture_default_str();
-    command.add_option("--system-serial", options.settings.serialNumber, "Serial number to report, at most 16 bytes")
+    command.add_option("--system-serial", options.machine.serialNumber, "Serial number to report, at most 16 bytes")
         ->check(shortName)
         ->capture_default_str();
     command.add_option("--interface-family", options.family, "Interface family to report, one character; Q by default");
@@ -251,7 +249,6 @@ CLI::App& addServeCommand(CLI::App& parent, Action& action)
 {
     CLI::App& command = addCommand(parent, "serve", "Run the hypervisor end: serve consoles until a signal stops it");
     const auto options = std::make_shared<ServeOptions>();
-    options->maxConsoles = options->settings.maxConsoles;
     command.add_option("--listen", options->endpoint, "Where to listen; port 0 lets the system choose one")
         ->type_name("ENDPOINT")
         ->check(endpointValidator())

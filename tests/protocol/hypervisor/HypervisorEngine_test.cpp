@@ -3,6 +3,7 @@
 
 #include "hypervisor/HypervisorEngine.hpp"
 #include "protocol/hypervisor/HypervisorFixture.hpp"
+#include "protocol/hypervisor/NamedRequests.hpp"
 #include "support/RawFrame.hpp"
 
 #include <gmock/gmock.h>
@@ -12,7 +13,8 @@ namespace qel::test {
 namespace {
 
 using protocol::ConsoleState;
-using protocol::HypervisorSettings;
+using protocol::Hypervisor;
+using protocol::MachineInfo;
 using protocol::Received;
 using ::testing::ElementsAre;
 using ::testing::HasSubstr;
@@ -27,54 +29,11 @@ constexpr unsigned int kTooManyConnections = 18;
 constexpr unsigned int kSessionAlreadyOpen = 23;
 constexpr unsigned int kAlreadyConnected = 37;
 
-struct NamedRequest {
-    const char* name;
-    QelMessageGeneric message;
-};
-
-/// One well-formed request of each kind but the version request.
-std::vector<NamedRequest> otherRequests()
-{
-    return {
-        {"open session", QelMessageInterfaceCmpOpenKrogSessionReq()},
-        {"close session", QelMessageInterfaceCmpCloseKrogSessionReq()},
-        {"capabilities", QelMessageExchIntCapabilitiesReq(QelCapabilities("1"))},
-        {"limits", QelMessageGetInterfaceLimitsReq()},
-        {"broadcast", QelMessageDaxBroadcastReq(0, 1, 0, "", "x")},
-        {"time", QelMessageGetQelTodReq()},
-        {"set mode", QelMessageSetGlobalModeAttributeReq(1, "m")},
-        {"get mode", QelMessageGetGlobalModeAttributeReq()},
-        {"set metadata", QelMessageSetGlobalSaveAreaMetadataReq("m")},
-        {"get metadata", QelMessageGetGlobalSaveAreaMetadataReq()},
-        {"open serial", QelMessageVirtualSerialOpenReq(1, 0, false)},
-        {"close serial", QelMessageVirtualSerialCloseReq(1, 0, false)},
-        {"max sessions", QelMessageVirtualSerialGetMaxSessionsReq()},
-        {"set up serial", QelMessageVirtualSerialSetupSessionReq(1, 0)},
-    };
-}
-
-/// The requests that have a payload, with one that is too short.
-std::vector<NamedRequest> unparsableRequests()
-{
-    return {
-        {"capabilities", request(0x6003, 0x0104, "abc")},  {"broadcast", request(0x6003, 0x0106, "abc")},
-        {"set mode", request(0x6003, 0x0108, "abc")},      {"set metadata", request(0x6003, 0x010A, "a")},
-        {"open serial", request(0x6002, 0x0402, "abc")},   {"close serial", request(0x6002, 0x0403, "abc")},
-        {"set up serial", request(0x6002, 0x0406, "abc")},
-    };
-}
-
 // The version request.
 
-TEST_F(HypervisorTest, TheVersionResponseCarriesTheSettings)
+TEST_F(HypervisorTest, TheVersionResponseSaysWhatTheMachineIs)
 {
-    HypervisorSettings settings;
-    settings.interfaceFamily = 'Z';
-    settings.majorVersion = 4;
-    settings.minorVersion = 5;
-    settings.machineType = "0123456789abcdef";
-    settings.serialNumber = "serial";
-    makeHypervisor(settings);
+    serve(std::make_unique<Hypervisor>(MachineInfo{'Z', 4, 5, "0123456789abcdef", "serial"}));
     Peer peer;
     connect(peer);
     const auto asked = versionRequest("a");

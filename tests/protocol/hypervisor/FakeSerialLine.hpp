@@ -6,7 +6,9 @@
 #include <algorithm>
 #include <atomic>
 #include <cerrno>
+#include <cstdint>
 #include <deque>
+#include <functional>
 #include <limits>
 #include <optional>
 #include <stdexcept>
@@ -15,7 +17,7 @@
 namespace qel::test {
 
 /// A serial line that plays a script. Checks the caller's side of the contract: no reading or writing while it is down.
-class FakeSerialPort : public protocol::SerialLine {
+class FakeSerialLine : public protocol::SerialLine {
 public:
     // The script.
     std::deque<std::string> output; ///< what comes out, one read() after the other
@@ -25,27 +27,47 @@ public:
     /// Bytes of input that will be taken; may be set while other threads use the port.
     std::atomic<std::size_t> takes{std::numeric_limits<std::size_t>::max()};
     bool failsToStart = false;
+    bool goesDownWhenItFailsToStart = false;
     bool failsToWrite = false;
+    std::function<void(const std::string& operation)> onCall; ///< called first by each operation; may throw
+    std::optional<std::size_t> saysRead;                      ///< what read() returns, be it true or not
+    std::optional<std::size_t> saysTaken;                     ///< what write() returns, be it true or not
 
     // The calls.
-    std::string input; ///< all that was taken
+    std::string input;           ///< all that was taken
+    std::uint16_t partition = 0; ///< that it was started for
     unsigned started = 0;
     unsigned stopped = 0;
     unsigned reads = 0;
 
-    void start() override
+    void start(std::uint16_t id) override
     {
-        if (failsToStart) throw PosixError(EMFILE, "start");
+        called("start");
+        partition = id;
+        if (failsToStart) {
+            if (goesDownWhenItFailsToStart) mRunning = false;
+            throw PosixError(EMFILE, "start");
+        }
         if (!mRunning) ++started;
         mRunning = true;
     }
-    bool isRunning() const override { return mRunning; }
-    bool hasHungUp() const override { return ended; }
-    std::optional<protocol::CommandEnd> commandEnd() override { return end; }
+    bool hasHungUp() const override
+    {
+        called("hasHungUp");
+        requireRunning();
+        return ended;
+    }
+    std::optional<protocol::CommandEnd> commandEnd() override
+    {
+        called("commandEnd");
+        return end;
+    }
     ReadResult read(char* buffer, std::size_t length) override
     {
+        called("read");
         requireRunning();
         ++reads;
+        if (saysRead) return {LineState::Data, *saysRead};
         if (output.empty()) return {ended ? LineState::Ended : LineState::Idle, 0};
         const std::string chunk = output.front().substr(0, length);
         output.front().erase(0, chunk.size());
@@ -55,8 +77,10 @@ public:
     }
     std::size_t write(const char* data, std::size_t length) override
     {
+        called("write");
         requireRunning();
         if (failsToWrite) throw PosixError(EIO, "write");
+        if (saysTaken) return *saysTaken;
         const std::size_t taken = std::min(length, takes.load());
         takes -= taken;
         input.append(data, taken);
@@ -64,11 +88,12 @@ public:
     }
     int descriptor() const override
     {
-        requireRunning();
-        return kDescriptor;
+        called("descriptor");
+        return mRunning ? kDescriptor : -1;
     }
     void stop() override
     {
+        called("stop");
         if (mRunning) ++stopped;
         mRunning = false;
     }
@@ -76,6 +101,10 @@ public:
     static constexpr int kDescriptor = 1000;
 
 private:
+    void called(const char* operation) const
+    {
+        if (onCall) onCall(operation);
+    }
     void requireRunning() const
     {
         if (!mRunning) throw std::logic_error("the line is down");

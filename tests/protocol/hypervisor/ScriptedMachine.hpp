@@ -1,0 +1,90 @@
+#pragma once
+
+#include <qel/protocol/Hypervisor.hpp>
+
+#include <functional>
+#include <gtest/gtest.h>
+#include <stdexcept>
+#include <string>
+#include <vector>
+
+namespace qel::test {
+
+/// A user's hypervisor that overrides every operation, records the calls, and fails where the test says.
+class ScriptedMachine : public protocol::Hypervisor {
+public:
+    enum class Failure { None, Standard, Other };
+
+    // The script.
+    std::string failing; ///< the operation that fails
+    Failure failure = Failure::None;
+    protocol::MachineInfo info{'Z', 4, 5, "type", "serial"};
+    std::chrono::system_clock::time_point time = std::chrono::system_clock::from_time_t(1709618828);
+    protocol::GlobalMode mode{9, "mtms"};
+    std::string metadata = "kept";
+    std::function<QelMessageStatusCodes(const protocol::Peer&, const QelMessage&)> decide;
+    std::function<bool(const protocol::Peer&, std::uint16_t)> decideOpen;
+
+    std::vector<std::string> calls; ///< the operations, and what they were called with
+
+    QelMessageStatusCodes mayRequest(const protocol::Peer& peer, const QelMessage& request) override
+    {
+        pCalled("mayRequest", " " + peer.toolId);
+        return decide ? decide(peer, request) : QelMessageStatusNoError;
+    }
+    bool mayOpen(const protocol::Peer& peer, std::uint16_t partition) override
+    {
+        pCalled("mayOpen", " " + peer.toolId + " " + std::to_string(partition));
+        return !decideOpen || decideOpen(peer, partition);
+    }
+    protocol::MachineInfo machine() override
+    {
+        pCalled("machine");
+        return info;
+    }
+    QelCapabilities capabilities() override
+    {
+        pCalled("capabilities");
+        return QelCapabilities("011");
+    }
+    std::chrono::system_clock::time_point currentTime() override
+    {
+        pCalled("currentTime");
+        return time;
+    }
+    protocol::GlobalMode getMode() override
+    {
+        pCalled("getMode");
+        return mode;
+    }
+    void setMode(const protocol::Peer& peer, const protocol::GlobalMode& to) override
+    {
+        pCalled("setMode", " " + peer.toolId + " " + std::to_string(to.mode) + " " + to.mtms);
+        mode = to;
+    }
+    std::string getMetadata() override
+    {
+        pCalled("getMetadata");
+        return metadata;
+    }
+    void setMetadata(const protocol::Peer& peer, const std::string& to) override
+    {
+        pCalled("setMetadata", " " + peer.toolId + " " + to);
+        metadata = to;
+    }
+    void onConnected(const protocol::Peer& peer) override { pCalled("onConnected", " " + peer.toolId); }
+    void onDisconnected(const protocol::Peer& peer) override { pCalled("onDisconnected", " " + peer.toolId); }
+
+    std::vector<std::string> takeCalls() { return std::exchange(calls, {}); }
+
+private:
+    void pCalled(const std::string& operation, const std::string& arguments = {})
+    {
+        calls.push_back(operation + arguments);
+        if (operation != failing) return;
+        if (failure == Failure::Standard) throw std::runtime_error("out of order");
+        if (failure == Failure::Other) throw 42;
+    }
+};
+
+} // namespace qel::test
