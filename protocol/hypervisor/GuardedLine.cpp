@@ -19,9 +19,12 @@ void require(bool condition, const char* what)
 template <typename Result, typename Operation>
 Result GuardedLine::pCall(const Result& failed, Operation&& operation) const noexcept
 {
-    Result result = failed;
-    static_cast<void>(runGuarded([&] { result = operation(); }, "partition ", mPartition));
-    return result;
+    try {
+        return operation();
+    } catch (...) {
+        logCurrent("partition ", mPartition);
+        return failed;
+    }
 }
 
 bool GuardedLine::start() noexcept

@@ -9,8 +9,8 @@
 
 namespace qel::protocol {
 
-/// The one thread that moves the serial data of all partitions. It waits for
-/// the hypervisor's serial watches, and for a wake-up when they have changed.
+/// The one thread that moves the serial data of all partitions. It waits for the hypervisor's serial watches, and for a
+/// wake-up when they have changed.
 /// Thread safety: one thread owns it.
 class SerialLoop {
 public:

@@ -47,6 +47,12 @@ protected:
         machine = std::move(served);
         machine->addPartition(1, makeLine(port1));
         machine->addPartition(2, makeLine(port2));
+        startEngine(maxConsoles);
+    }
+
+    /// Starts an engine for the machine.
+    void startEngine(std::uint8_t maxConsoles)
+    {
         hypervisor = std::make_unique<protocol::HypervisorEngine>(*machine, maxConsoles, [this] { ++serialWakes; });
     }
 

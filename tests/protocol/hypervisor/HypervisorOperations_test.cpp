@@ -106,7 +106,7 @@ TEST_F(HypervisorOperationsTest, AnEngineTakesItsLinesDownAndAnotherOneCanFollow
     hypervisor.reset();
     EXPECT_EQ(port1->stopped, 1U);
     EXPECT_EQ(port2->stopped, 0U); // it was never up
-    hypervisor = std::make_unique<HypervisorEngine>(*machine, 1, [] {});
+    startEngine(1);
     Peer next;
     setUpSerial(next, "a", 1);
     EXPECT_EQ(port1->started, 2U);
@@ -278,15 +278,6 @@ TEST_F(HypervisorOperationsTest, AttributesThatDoNotFitAResponseFailTheRequest)
                                          EndsWith(": the metadata do not fit a response")));
 }
 
-TEST_F(HypervisorOperationsTest, ATimeThatDoesNotFitTheResponseFailsTheRequest)
-{
-    Peer peer;
-    identify(peer, "a");
-    user->time = std::chrono::system_clock::from_time_t(-62167219201); // the last second before the year 0
-    EXPECT_EQ(statusOf(peer, QelMessageGetQelTodReq()), kCmdFailed);
-    EXPECT_EQ(log.lines().size(), 1U);
-}
-
 // The events.
 
 TEST_F(HypervisorOperationsTest, TheMachineHearsOfIdentifiedConsolesOnce)
@@ -313,19 +304,6 @@ TEST_F(HypervisorOperationsTest, TheMachineHearsOfTheEndOfAConsoleThatWasClosedF
     user->calls.clear();
     hypervisor->disconnect(peer.id);
     EXPECT_THAT(user->calls, ElementsAre("onDisconnected a"));
-}
-
-TEST_F(HypervisorOperationsTest, TheMachineHearsOfAConsoleAfterItsVersionResponse)
-{
-    Peer peer;
-    connect(peer);
-    std::size_t postedBefore = 0;
-    user->failing = "onConnected"; // a failure would show as status 6 if the response came later
-    user->failure = ScriptedMachine::Failure::Standard;
-    receive(peer, versionRequest("a"));
-    postedBefore = peer.link.posted();
-    EXPECT_EQ(postedBefore, 1U);
-    EXPECT_EQ(peer.link.take()->getStatus(), 0U);
 }
 
 } // namespace

@@ -157,7 +157,7 @@ TEST_F(VirtualSerialTest, InputThatIsNotTakenIsKeptAndDeliveredInOrder)
     const auto watches = hypervisor->serialWatches();
     ASSERT_EQ(watches.size(), 1U);
     EXPECT_TRUE((watches[0].fd.mFd.events & POLLOUT) != 0);
-    EXPECT_EQ(watches[0].fd.mFd.fd, FakeSerialPort::kDescriptor);
+    EXPECT_EQ(watches[0].fd.mFd.fd, FakeSerialLine::kDescriptor);
     port1->takes = 1000;
     hypervisor->serviceSerial(1);
     EXPECT_EQ(port1->input, "abcdefghi");

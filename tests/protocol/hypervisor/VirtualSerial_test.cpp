@@ -9,7 +9,6 @@ namespace qel::test {
 
 namespace {
 
-using protocol::PartitionSet;
 using ::testing::ElementsAre;
 using ::testing::HasSubstr;
 using ::testing::IsEmpty;
@@ -317,23 +316,14 @@ TEST_F(VirtualSerialTest, TheMaximumIsOneSystemAndItsPartitions)
 
 TEST_F(VirtualSerialTest, TheMaximumIsCappedAt255Partitions)
 {
-    PartitionSet partitions;
-    for (std::uint16_t id = 1; id <= 256; ++id)
-        partitions.add(id, std::make_unique<FakeSerialPort>());
-    hypervisor =
-        std::make_unique<protocol::HypervisorEngine>(protocol::HypervisorSettings(), std::move(partitions), [] {});
+    auto large = std::make_unique<protocol::Hypervisor>();
+    for (std::uint16_t id = 3; id <= 256; ++id) // 1 and 2 are added below
+        large->addPartition(id, std::make_unique<FakeSerialLine>());
+    serve(std::move(large));
     Peer peer;
     openSession(peer, "a");
     receive(peer, QelMessageVirtualSerialGetMaxSessionsReq());
     EXPECT_EQ(peer.link.take<QelMessageVirtualSerialGetMaxSessionsRsp>()->getMaxLpar(), 255U);
-}
-
-TEST_F(VirtualSerialTest, RefusesADuplicatePartitionId)
-{
-    PartitionSet partitions;
-    partitions.add(1, std::make_unique<FakeSerialPort>());
-    EXPECT_THAT([&] { partitions.add(1, std::make_unique<FakeSerialPort>()); },
-                ::testing::ThrowsMessage<std::invalid_argument>("partition"));
 }
 
 } // namespace

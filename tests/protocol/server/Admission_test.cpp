@@ -210,9 +210,7 @@ TEST_F(AdmissionTest, MessagesInsteadOfTlsAreRefused)
 
 TEST_F(AdmissionTest, AtTheMaximumOfConsolesTheAnswerIsAbort)
 {
-    protocol::HypervisorSettings settings;
-    settings.maxConsoles = 1;
-    makeHypervisor(settings);
+    limitConsoles(1);
     Peer first;
     identify(first, "first");
     start();
@@ -224,9 +222,7 @@ TEST_F(AdmissionTest, AtTheMaximumOfConsolesTheAnswerIsAbort)
 
 TEST_F(AdmissionTest, UnidentifiedConsolesDoNotCount)
 {
-    protocol::HypervisorSettings settings;
-    settings.maxConsoles = 1;
-    makeHypervisor(settings);
+    limitConsoles(1);
     Peer first;
     connect(first);
     start();

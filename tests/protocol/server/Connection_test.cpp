@@ -350,9 +350,7 @@ TEST_F(ConnectionTest, ReadingResumesWhenThePartitionTakesItsInput)
 
 TEST_F(ConnectionTest, ARefusedConsoleGetsItsResponseAndIsClosed)
 {
-    protocol::HypervisorSettings settings;
-    settings.maxConsoles = 1;
-    makeHypervisor(settings);
+    limitConsoles(1);
     Peer first;
     HypervisorFixture::identify(first, "first");
     start();
