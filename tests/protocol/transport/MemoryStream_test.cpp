@@ -29,7 +29,9 @@ void write(Stream& stream, const std::string& bytes) { stream.write(bytes.data()
 
 TEST(MemoryStream, EachReadsWhatTheOtherWrites)
 {
-    const auto [one, other] = makeMemoryStreams();
+    const auto streams = makeMemoryStreams();
+    const auto& one = streams.first;
+    const auto& other = streams.second;
     write(*one, "there");
     write(*other, "back");
     EXPECT_EQ(readSome(*other), "there");
@@ -38,7 +40,9 @@ TEST(MemoryStream, EachReadsWhatTheOtherWrites)
 
 TEST(MemoryStream, ReadsAtMostWhatWasAskedForAndKeepsTheRest)
 {
-    const auto [one, other] = makeMemoryStreams();
+    const auto streams = makeMemoryStreams();
+    const auto& one = streams.first;
+    const auto& other = streams.second;
     write(*one, "abcdef");
     EXPECT_EQ(readSome(*other, 4), "abcd");
     write(*one, "gh");
@@ -49,7 +53,9 @@ TEST(MemoryStream, ReadsAtMostWhatWasAskedForAndKeepsTheRest)
 
 TEST(MemoryStream, AReaderWaitsForBytes)
 {
-    const auto [one, other] = makeMemoryStreams();
+    const auto streams = makeMemoryStreams();
+    const auto& one = streams.first;
+    const auto& other = streams.second;
     std::thread writer([stream = one.get()] { write(*stream, "late"); });
     EXPECT_EQ(readSome(*other), "late");
     writer.join();
@@ -57,7 +63,9 @@ TEST(MemoryStream, AReaderWaitsForBytes)
 
 TEST(MemoryStream, AWriterWaitsForRoomAndLosesNothing)
 {
-    const auto [one, other] = makeMemoryStreams(3);
+    const auto streams = makeMemoryStreams(3);
+    const auto& one = streams.first;
+    const auto& other = streams.second;
     std::string sent(1000, '\0');
     std::iota(sent.begin(), sent.end(), '\0');
     std::thread writer([stream = one.get(), &sent] { write(*stream, sent); });
@@ -73,7 +81,9 @@ TEST(MemoryStream, AWriterWaitsForRoomAndLosesNothing)
 
 TEST(MemoryStream, ADeadlineThatPassesLeavesTheStreamUsable)
 {
-    const auto [one, other] = makeMemoryStreams(4);
+    const auto streams = makeMemoryStreams(4);
+    const auto& one = streams.first;
+    const auto& other = streams.second;
     one->setReadDeadline(kShort);
     EXPECT_THAT([&] { readSome(*one); }, ThrowsMessage<StreamIOException>(StrEq("I/O deadline")));
     one->setWriteDeadline(kShort);
@@ -86,7 +96,9 @@ TEST(MemoryStream, ADeadlineThatPassesLeavesTheStreamUsable)
 
 TEST(MemoryStream, ClosingLetsTheRestBeReadAndEndsBothDirections)
 {
-    const auto [one, other] = makeMemoryStreams();
+    const auto streams = makeMemoryStreams();
+    const auto& one = streams.first;
+    const auto& other = streams.second;
     write(*one, "last");
     write(*other, "also");
     one->close();
@@ -100,7 +112,9 @@ TEST(MemoryStream, ClosingLetsTheRestBeReadAndEndsBothDirections)
 
 TEST(MemoryStream, ClosingWakesAReaderAndAWriter)
 {
-    const auto [one, other] = makeMemoryStreams(1);
+    const auto streams = makeMemoryStreams(1);
+    const auto& one = streams.first;
+    const auto& other = streams.second;
     std::thread reader([stream = one.get()] { EXPECT_EQ(readSome(*stream), ""); });
     std::thread writer([stream = one.get()] { EXPECT_THROW(write(*stream, "xy"), StreamIOException); });
     other->close();
