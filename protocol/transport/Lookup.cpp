@@ -5,6 +5,8 @@
 #include <qel/common/util/PosixError.hpp>
 #include <qel/protocol/Error.hpp>
 
+#include "base/Threads.hpp"
+
 #include <cerrno>
 #include <cstring>
 #include <memory>
@@ -12,7 +14,6 @@
 #include <netinet/in.h>
 #include <optional>
 #include <sys/socket.h>
-#include <thread>
 #include <utility>
 
 namespace qel::protocol {
@@ -81,7 +82,7 @@ std::vector<IPEndpoint> lookUp(const std::string& host, std::uint16_t port,
 {
     const std::string name = host + ":" + std::to_string(port);
     const auto lookup = std::make_shared<Lookup>();
-    std::thread([lookup, host, port, resolver = std::move(resolver)] {
+    startThread([lookup, host, port, resolver = std::move(resolver)] {
         LookupResult result = callSafely(resolver, host, port);
         const MutexLock lock(lookup->mutex);
         lookup->result = std::move(result);
