@@ -37,13 +37,13 @@ TEST(CommandEnvironment, DoesNotDependOnTheEnvironmentOfTheServer)
 TEST(CommandEnvironment, FurtherVariablesAreAddedOrReplaceThoseOfTheSameName)
 {
     const auto plain = commandEnvironment("vt220");
-    const auto more = commandEnvironment("vt220", {"LANG=C", "A=1", "TERMINAL=x", "A=2=3"});
+    const auto more = commandEnvironment("vt220", {"LANG=C", "A=1", "TER=x", "A=2=3"});
     ASSERT_EQ(more.size(), 8U);
     EXPECT_EQ(std::vector<std::string>(more.begin(), more.begin() + 5),
               std::vector<std::string>(plain.begin(), plain.begin() + 5));
     EXPECT_EQ(more[5], "LANG=C");
     EXPECT_EQ(more[6], "A=2=3");
-    EXPECT_EQ(more[7], "TERMINAL=x");
+    EXPECT_EQ(more[7], "TER=x");
 }
 
 } // namespace
