@@ -5,7 +5,6 @@
 
 #include "protocol/hypervisor/NamedRequests.hpp"
 #include "protocol/hypervisor/ScriptedMachine.hpp"
-#include "protocol/hypervisor/VirtualSerialFixture.hpp"
 #include "support/RawFrame.hpp"
 
 #include <gmock/gmock.h>
@@ -25,15 +24,8 @@ constexpr unsigned int kInvalidConnectionNumber = 16;
 constexpr unsigned int kNotAvailable = 19;
 constexpr unsigned int kClosureFailure = 20;
 
-class HypervisorDecisionsTest : public VirtualSerialFixture {
+class HypervisorDecisionsTest : public ScriptedMachineFixture {
 protected:
-    HypervisorDecisionsTest()
-    {
-        auto scripted = std::make_unique<ScriptedMachine>();
-        user = scripted.get();
-        serve(std::move(scripted));
-    }
-
     /// Connects a console that has a certificate.
     void connectAs(Peer& peer, const std::string& commonName)
     {
@@ -58,8 +50,6 @@ protected:
     {
         user->decide = [status](const protocol::Peer&, const QelMessage&) { return status; };
     }
-
-    ScriptedMachine* user = nullptr; // owned by the fixture
 };
 
 // mayRequest()

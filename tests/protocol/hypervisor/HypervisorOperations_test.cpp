@@ -1,6 +1,5 @@
 // The operations of the user's hypervisor: which request asks for which, and what becomes of what they throw.
 
-#include "protocol/hypervisor/HypervisorFixture.hpp"
 #include "protocol/hypervisor/ScriptedMachine.hpp"
 #include "support/SettableClock.hpp"
 
@@ -22,17 +21,7 @@ using ::testing::ThrowsMessage;
 
 constexpr unsigned int kCmdFailed = 6;
 
-class HypervisorOperationsTest : public HypervisorFixture {
-protected:
-    HypervisorOperationsTest()
-    {
-        auto scripted = std::make_unique<ScriptedMachine>();
-        user = scripted.get();
-        serve(std::move(scripted));
-    }
-
-    ScriptedMachine* user = nullptr; // owned by the fixture
-};
+using HypervisorOperationsTest = ScriptedMachineFixture;
 
 TEST(HypervisorDefaults, SayWhatTheConstructorWasGiven)
 {

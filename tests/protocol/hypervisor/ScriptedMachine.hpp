@@ -2,10 +2,13 @@
 
 #include <qel/protocol/Hypervisor.hpp>
 
+#include "protocol/hypervisor/VirtualSerialFixture.hpp"
+
 #include <functional>
-#include <gtest/gtest.h>
+#include <memory>
 #include <stdexcept>
 #include <string>
+#include <utility>
 #include <vector>
 
 namespace qel::test {
@@ -85,6 +88,19 @@ private:
         if (failure == Failure::Standard) throw std::runtime_error("out of order");
         if (failure == Failure::Other) throw 42;
     }
+};
+
+/// An engine that serves a scripted machine.
+class ScriptedMachineFixture : public VirtualSerialFixture {
+protected:
+    ScriptedMachineFixture()
+    {
+        auto scripted = std::make_unique<ScriptedMachine>();
+        user = scripted.get();
+        serve(std::move(scripted));
+    }
+
+    ScriptedMachine* user = nullptr; // owned by the fixture
 };
 
 } // namespace qel::test
