@@ -45,7 +45,7 @@ public:
     /// @param capabilities  what capabilities() returns; none by default
     explicit Hypervisor(MachineInfo machine = MachineInfo(), const QelCapabilities& capabilities = QelCapabilities());
 
-    /// Takes the partitions' lines down and destroys them.
+    /// Takes the partitions' lines down and destroys them; those of commands wait until the commands have ended.
     virtual ~Hypervisor();
 
     Hypervisor(const Hypervisor&) = delete;
