@@ -1,0 +1,20 @@
+#include "console/BackoffDelays.hpp"
+
+#include <algorithm>
+
+namespace qel::protocol {
+
+BackoffDelays::BackoffDelays(const Backoff& backoff, unsigned int seed)
+    : mNominal(static_cast<double>(backoff.first.count())), mLongest(static_cast<double>(backoff.longest.count())),
+      mFactor(backoff.factor), mRandom(seed)
+{}
+
+std::chrono::milliseconds BackoffDelays::next()
+{
+    mNominal = std::min(mNominal, mLongest);
+    const double wait = std::uniform_real_distribution<double>(mNominal / 2, mNominal)(mRandom);
+    mNominal *= mFactor;
+    return std::chrono::milliseconds(static_cast<std::chrono::milliseconds::rep>(wait + 0.5));
+}
+
+} // namespace qel::protocol

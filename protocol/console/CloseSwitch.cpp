@@ -1,0 +1,50 @@
+#include "console/CloseSwitch.hpp"
+
+#include <qel/protocol/Error.hpp>
+#include <qel/protocol/Logging.hpp>
+
+#include <exception>
+
+namespace qel::protocol {
+
+void CloseSwitch::close() noexcept
+{
+    const MutexLock lock(mMutex);
+    mClosed = true;
+    pCloseLocked();
+    mChanged.notifyAll();
+}
+
+bool CloseSwitch::isClosed() const
+{
+    const MutexLock lock(mMutex);
+    return mClosed;
+}
+
+void CloseSwitch::watch(StreamBase* stream) noexcept
+{
+    const MutexLock lock(mMutex);
+    mStream = stream;
+    if (mClosed) pCloseLocked();
+}
+
+bool CloseSwitch::sleepUntil(std::chrono::steady_clock::time_point time)
+{
+    UniqueMutexLock lock(mMutex);
+    while (!mClosed) {
+        if (!mChanged.waitUntil(lock, time)) break;
+    }
+    return !mClosed;
+}
+
+void CloseSwitch::pCloseLocked() noexcept
+{
+    if (mStream == nullptr) return;
+    try {
+        mStream->close();
+    } catch (const std::exception& error) {
+        logLine(LogLevel::Debug, "while closing: ", explain(error));
+    }
+}
+
+} // namespace qel::protocol

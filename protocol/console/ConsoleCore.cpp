@@ -1,0 +1,479 @@
+#include "console/ConsoleCore.hpp"
+
+#include <qel/common/QelInternalMessageRegistry.hpp>
+#include <qel/common/QelMessageDax.hpp>
+#include <qel/common/StreamFormatters.hpp>
+#include <qel/common/io/StreamIOException.hpp>
+#include <qel/common/util/TimeProvider.hpp>
+#include <qel/protocol/Error.hpp>
+#include <qel/protocol/Logging.hpp>
+
+#include "console/BackoffDelays.hpp"
+
+#include <algorithm>
+#include <random>
+#include <sstream>
+#include <stdexcept>
+#include <tuple>
+#include <unistd.h>
+#include <utility>
+
+namespace qel::protocol {
+
+namespace {
+
+using std::chrono::milliseconds;
+
+// The versions that this console reports. The hypervisor does not check them.
+constexpr std::uint32_t kInterfaceVersion = 1;
+constexpr std::uint16_t kMajorVersion = 1;
+constexpr std::uint16_t kMinorVersion = 0;
+
+constexpr milliseconds kLongestAttempt = std::chrono::hours(20 * 24); // poll(2) takes an int
+
+QelMessageRegistry::Identifier identityOf(const QelMessage& message)
+{
+    return {static_cast<unsigned short>(message.getFunction()), static_cast<unsigned short>(message.getOperation()),
+            message.getClassification()};
+}
+
+template <typename T>
+bool is(const QelMessage& message)
+{
+    return identityOf(message) == T::getMessageID();
+}
+
+template <typename T>
+bool isA(const std::exception& error)
+{
+    return dynamic_cast<const T*>(&error) != nullptr;
+}
+
+/// True when waiting may help.
+bool isTemporary(const Error& error, bool isProtected)
+{
+    if (const auto* refusal = dynamic_cast<const StatusError*>(&error)) {
+        return refusal->getStatus() == QelMessageStatusTooManyConnections ||
+               refusal->getStatus() == QelMessageStatusDaxAlreadyConnected;
+    }
+    if (isA<TurnedAway>(error)) return isProtected; // otherwise the server accepts only TLS
+    return isA<NameNotResolved>(error) || isA<CannotConnect>(error) || isA<ClosedByPeer>(error) ||
+           isA<DeadlinePassed>(error);
+}
+
+/// What the stream said about a lost connection; empty when the connection was not lost.
+std::string lossOf(const Error& error)
+{
+    try {
+        std::rethrow_if_nested(error);
+    } catch (const StreamIOException& cause) {
+        return explain(cause);
+    } catch (...) {
+        return {};
+    }
+    return {};
+}
+
+std::string noResponseText(const Exchange& exchange)
+{
+    std::ostringstream text;
+    text << "the peer did not answer in time: no response to request " << hexFormat(exchange.function) << '/'
+         << hexFormat(exchange.operation);
+    return text.str();
+}
+
+void requireSendable(const QelMessage& message, bool isRequest, const char* name)
+{
+    const bool isRightKind = (message.getClassification() == QelMessageClassification::Request) == isRequest;
+    if (!isRightKind || message.getClassification() == QelMessageClassification::Response) {
+        throw std::invalid_argument(std::string(name) + ": the message is not a " + name);
+    }
+    if (message.msgLength() > QelMessage::MtuMax) {
+        throw std::invalid_argument(std::string(name) + ": longer than a frame may be");
+    }
+}
+
+} // namespace
+
+Identity completeIdentity(const Identity& identity)
+{
+    Identity complete = identity;
+    if (complete.toolId.empty()) complete.toolId = "qel-" + std::to_string(::getpid());
+    return complete;
+}
+
+ConsoleCore::ConsoleCore(const ConsoleOptions& options, bool needsAddress)
+    : mServer(options.server), mIdentity(completeIdentity(options.identity)), mRequestTimeout(options.requestTimeout),
+      mFrameTimeout(options.frameTimeout), mHandshakeTimeout(options.handshakeTimeout), mRetry(options.retry),
+      mIsConnector(needsAddress), mConnector(options, needsAddress)
+{}
+
+void ConsoleCore::connect(TimePoint end)
+{
+    BackoffDelays delays(mRetry.value_or(Backoff()), std::random_device()());
+    for (unsigned int attempt = 1;; ++attempt) {
+        TimePoint next;
+        try {
+            return pConnectOnce(end);
+        } catch (const Error& error) {
+            if (mCloseSwitch.isClosed()) break;
+            const bool isLast =
+                !mRetry || attempt == mRetry->attempts || !isTemporary(error, mConnector.isProtecting());
+            const milliseconds wait = delays.next();
+            next = TimeProvider::steady() + wait;
+            if (isLast || next >= end) throw;
+            logLine(LogLevel::Info, error.what(), "; next attempt in ", decFormat(wait.count()), " ms");
+        }
+        if (!mCloseSwitch.sleepUntil(next)) break;
+    }
+    throw Error("this console is closed", mServer);
+}
+
+void ConsoleCore::adopt(std::unique_ptr<Stream> stream, int descriptor, TimePoint end)
+{
+    TimePoint handshakeEnd;
+    pUse(mConnector.adopt(std::move(stream), descriptor, end, mCloseSwitch, handshakeEnd), handshakeEnd);
+}
+
+void ConsoleCore::reconnect(TimePoint end)
+{
+    if (!mIsConnector) throw std::logic_error("reconnect: the stream was given to the console");
+    if (mCloseSwitch.isClosed()) throw Error("this console is closed", mServer);
+    if (mLink != nullptr && mLink->isUsable()) mLink->leave();
+    pDisconnect(std::make_exception_ptr(ClosedByPeer("the connection has been replaced by another one", mServer)));
+    for (const auto& serial : mSerials)
+        serial->finish(SessionEnd::ConnectionClosed);
+    mSerials.clear();
+    try {
+        connect(end);
+    } catch (...) {
+        mUnusable = std::current_exception();
+        throw;
+    }
+}
+
+void ConsoleCore::leave() noexcept
+{
+    if (mLink != nullptr) mLink->leave();
+}
+
+void ConsoleCore::dispose() noexcept
+{
+    mCloseSwitch.close();
+    pDisconnect(std::make_exception_ptr(Error("this console is closed", mServer)));
+}
+
+const QelMessageGetEnclTypeAndInterfaceVersionRsp& ConsoleCore::version() const
+{
+    using Response = QelMessageGetEnclTypeAndInterfaceVersionRsp;
+    const auto* const typed = dynamic_cast<const Response*>(mVersion.get());
+    if (typed == nullptr) detail::throwMalformedResponse(*mVersion, typeid(Response).name(), mServer);
+    return *typed;
+}
+
+PollFd ConsoleCore::getPollFd(PollEvents events) const
+{
+    return mLink == nullptr ? PollFd::Ignore : mLink->getPollFd(events);
+}
+
+std::unique_ptr<QelMessage> ConsoleCore::exchange(const QelMessage& request, TimePoint end)
+{
+    const std::shared_ptr<Exchange> exchange = start(request, end);
+    try {
+        return finish(*exchange, end);
+    } catch (...) {
+        exchange->isAbandoned = true;
+        throw;
+    }
+}
+
+std::unique_ptr<QelMessage> ConsoleCore::require(const QelMessage& request, TimePoint end)
+{
+    std::unique_ptr<QelMessage> response = exchange(request, end);
+    if (response->getStatus() != QelMessageStatusNoError) throw StatusError(*response, mServer);
+    return response;
+}
+
+std::shared_ptr<Exchange> ConsoleCore::start(const QelMessage& request, TimePoint end)
+{
+    requireSendable(request, true, "request");
+    if (mExchanges.isFull()) throw Error("too many requests are under way without a response", mServer);
+    auto exchange = std::make_shared<Exchange>(request);
+    const bool isAlone = mExchanges.isEmpty();
+    mExchanges.add(exchange);
+    try {
+        if (isAlone) { // the peer has nothing to answer, so it takes the request
+            pLink().send(request, end);
+        } else {
+            sendAmongOthers(request, end, [] { return true; });
+        }
+    } catch (...) {
+        mExchanges.remove(*exchange);
+        throw;
+    }
+    return exchange;
+}
+
+std::unique_ptr<QelMessage> ConsoleCore::finish(Exchange& exchange, TimePoint end)
+{
+    while (!exchange.isDone()) {
+        if (!receiveOne(end, end)) throw DeadlinePassed(noResponseText(exchange), mServer);
+    }
+    if (exchange.failure) std::rethrow_exception(exchange.failure);
+    if (exchange.isTaken) throw std::logic_error("the response has been taken");
+    exchange.isTaken = true;
+    return std::move(exchange.response);
+}
+
+void ConsoleCore::send(const QelMessage& notice, TimePoint end)
+{
+    requireSendable(notice, false, "notice");
+    pLink().send(notice, end);
+}
+
+bool ConsoleCore::sendAmongOthers(const QelMessage& message, TimePoint end, const std::function<bool()>& isWanted)
+{
+    while (isWanted()) {
+        const FrameLink::Ready ready = pLink().await(pFullSerial() == nullptr, end);
+        if (ready.send) {
+            pLink().send(message, end);
+            return true;
+        }
+        if (!ready.receive) throw DeadlinePassed("the peer did not take a message in time", mServer);
+        receiveOne(end, TimePoint::max());
+    }
+    return false;
+}
+
+bool ConsoleCore::receiveOne(TimePoint begin, TimePoint end)
+{
+    if (const SerialState* const full = pFullSerial()) {
+        throw Error("the session of partition " + std::to_string(full->partition) + " holds " +
+                        std::to_string(full->unreadBytes()) + " bytes of output that nobody reads",
+                    mServer);
+    }
+    std::unique_ptr<QelMessage> message = pLink().receive(begin, end);
+    if (message == nullptr) return false;
+    if (message->getClassification() != QelMessageClassification::Response) {
+        pHandleNotice(*message);
+    } else if (const char* const mistake = mExchanges.deliver(std::move(message))) {
+        pBreak(mistake);
+    }
+    return true;
+}
+
+void ConsoleCore::onNotice(const QelMessageRegistry::Identifier& identity, TypedHandler handler)
+{
+    if (!handler) {
+        mHandlers.erase(identity);
+    } else {
+        mHandlers[identity] = std::make_shared<const TypedHandler>(std::move(handler));
+    }
+}
+
+void ConsoleCore::onOtherNotice(Console::NoticeHandler handler)
+{
+    mOtherHandler = handler ? std::make_shared<const Console::NoticeHandler>(std::move(handler)) : nullptr;
+}
+
+void ConsoleCore::openSession(TimePoint end)
+{
+    if (mIsSessionOpen) return;
+    static_cast<void>(require(QelMessageInterfaceCmpOpenKrogSessionReq(), end));
+    mIsSessionOpen = true;
+}
+
+void ConsoleCore::closeSession(TimePoint end)
+{
+    if (!mIsSessionOpen) return;
+    static_cast<void>(require(QelMessageInterfaceCmpCloseKrogSessionReq(), end));
+    mIsSessionOpen = false;
+    for (const auto& serial : mSerials)
+        serial->finish(SessionEnd::Closed);
+    mSerials.clear();
+}
+
+std::shared_ptr<SerialState> ConsoleCore::openSerial(std::uint16_t partition, const SerialOptions& options,
+                                                     TimePoint end)
+{
+    openSession(end);
+    auto state = std::make_shared<SerialState>(partition, options.connection, options.maxUnread);
+    mSerials.push_back(state);
+    try {
+        static_cast<void>(require(QelMessageVirtualSerialOpenReq(partition, options.connection, options.force), end));
+        state->isOpen = true; // notices before the response are about an earlier session
+        static_cast<void>(require(QelMessageVirtualSerialSetupSessionReq(partition, options.connection), end));
+    } catch (...) {
+        dropSerial(state);
+        throw;
+    }
+    return state;
+}
+
+void ConsoleCore::closeSerial(const std::shared_ptr<SerialState>& state, TimePoint end)
+{
+    if (state->end != SessionEnd::None) return;
+    const auto response = exchange(QelMessageVirtualSerialCloseReq(state->partition, state->connection, false), end);
+    // The session may have ended while the request was on its way; its notice then came before the response.
+    if (state->isOpen && response->getStatus() != QelMessageStatusNoError) throw StatusError(*response, mServer);
+    state->finish(SessionEnd::Closed);
+    pForget(*state);
+}
+
+void ConsoleCore::dropSerial(const std::shared_ptr<SerialState>& state) noexcept
+{
+    try {
+        if (state->isOpen && mLink != nullptr && mLink->isUsable() && !mExchanges.isFull() &&
+            mLink->await(false, TimeProvider::steady()).send) {
+            const QelMessageVirtualSerialCloseReq request(state->partition, state->connection, false);
+            auto exchange = std::make_shared<Exchange>(request);
+            exchange->isAbandoned = true;
+            mExchanges.add(exchange);
+            mLink->send(request, deadlineIn(mRequestTimeout));
+        }
+    } catch (const std::exception& error) {
+        logLine(LogLevel::Debug, "while dropping a session: ", explain(error));
+    }
+    state->finish(SessionEnd::Closed);
+    pForget(*state);
+}
+
+void ConsoleCore::pConnectOnce(TimePoint end)
+{
+    const TimePoint now = TimeProvider::steady();
+    const TimePoint attemptEnd = std::min(end, now + (mRetry ? mHandshakeTimeout : kLongestAttempt));
+    TimePoint handshakeEnd;
+    ConnectedStream connected = mConnector.connect(attemptEnd, mCloseSwitch, handshakeEnd);
+    handshakeEnd = std::min(end, handshakeEnd);
+    pUse(std::move(connected), handshakeEnd);
+}
+
+void ConsoleCore::pUse(ConnectedStream connected, TimePoint handshakeEnd)
+{
+    mPeer = connected.peer;
+    mLink = std::make_unique<FrameLink>(std::move(connected), mServer, mFrameTimeout, mCloseSwitch);
+    mIsProtected = mLink->isProtected();
+    try {
+        pIntroduce(handshakeEnd);
+    } catch (...) {
+        pDisconnect(std::current_exception());
+        throw;
+    }
+}
+
+/// Sends the version request, which completes the handshake.
+void ConsoleCore::pIntroduce(TimePoint end)
+{
+    const QelMessageGetEnclTypeAndInterfaceVersionReq request(kInterfaceVersion, mIdentity.toolType, kMajorVersion,
+                                                              kMinorVersion, mIdentity.toolId);
+    try {
+        mVersion = require(request, end);
+    } catch (const ClosedByPeer& error) {
+        const std::string loss = lossOf(error);
+        if (!mIsProtected || loss.empty()) throw;
+        std::throw_with_nested(CertificateRejected(CertificateRejected::Reason::OursByThem,
+                                                   "the server closed the connection right after the TLS handshake; it "
+                                                   "may not accept this console's certificate: " +
+                                                       loss,
+                                                   mServer));
+    }
+}
+
+/// Ends the connection at once. What depends on it fails.
+void ConsoleCore::pDisconnect(const std::exception_ptr& failure) noexcept
+{
+    mLink.reset();
+    mUnusable = failure;
+    mExchanges.failAll(failure);
+    mIsSessionOpen = false;
+    for (const auto& serial : mSerials)
+        serial->isOpen = false;
+}
+
+FrameLink& ConsoleCore::pLink()
+{
+    if (mLink == nullptr) std::rethrow_exception(mUnusable);
+    return *mLink;
+}
+
+/// @return whether the notice was for a session
+bool ConsoleCore::pHandleSerial(const QelMessage& message)
+{
+    using DataNotice = QelMessageVirtualSerialDataToDaxAsync;
+    using ClosedNotice = QelMessageVirtualSerialSessionClosedAsync;
+    if (mSerials.empty() || (!is<DataNotice>(message) && !is<ClosedNotice>(message))) return false;
+    const auto* const data = dynamic_cast<const DataNotice*>(&message);
+    const auto* const closed = dynamic_cast<const ClosedNotice*>(&message);
+    if (data == nullptr && closed == nullptr) pBreak("malformed notice " + toString(message.getLogID()));
+    for (const auto& serial : mSerials) {
+        if (data != nullptr && serial->isMeant(*data)) {
+            serial->append(data->getSerialData(), data->getSerialDataLength());
+            return true;
+        }
+        if (closed != nullptr && serial->isMeant(*closed)) {
+            serial->finish(*closed);
+            pForget(*serial);
+            return true;
+        }
+    }
+    return false;
+}
+
+/// @return whether there was a handler for the class
+bool ConsoleCore::pHandleTyped(const QelMessage& message)
+{
+    const auto found = mHandlers.find(identityOf(message));
+    if (found == mHandlers.end()) return false;
+    const std::shared_ptr<const TypedHandler> handler = found->second; // it may replace itself
+    if (!(*handler)(message)) pBreak("malformed notice " + toString(message.getLogID()));
+    return true;
+}
+
+void ConsoleCore::pHandleNotice(const QelMessage& message)
+{
+    if (pHandleSerial(message)) return;
+    const bool isHandled = pHandleTyped(message);
+    pHandleEnd(message);
+    if (isHandled) return;
+    const std::shared_ptr<const Console::NoticeHandler> handler = mOtherHandler;
+    if (handler != nullptr) return (*handler)(message);
+    logLine(LogLevel::Debug, "ignored ", message.getLogID());
+}
+
+/// The notices that end the connection.
+void ConsoleCore::pHandleEnd(const QelMessage& message)
+{
+    if (is<QelMessageKrogConnectionClosedAsync>(message)) {
+        for (const auto& serial : mSerials)
+            serial->finish(SessionEnd::ConnectionClosed);
+        mSerials.clear();
+        pLink().fail(std::make_exception_ptr(ClosedByPeer("the server closed the connection", mServer)));
+    }
+    if (is<QelMessageAbortHandshakeAsync>(message)) {
+        pLink().fail(
+            std::make_exception_ptr(TurnedAway("the server refused the connection: it accepts only TLS", mServer)));
+    }
+}
+
+void ConsoleCore::pBreak(const std::string& reason)
+{
+    pLink().fail(std::make_exception_ptr(ProtocolBroken("the peer broke the protocol: " + reason, mServer)));
+}
+
+void ConsoleCore::pForget(const SerialState& state) noexcept
+{
+    const auto found =
+        std::find_if(mSerials.begin(), mSerials.end(), [&](const auto& serial) { return serial.get() == &state; });
+    if (found != mSerials.end()) mSerials.erase(found);
+}
+
+/// A session that can take no more output; null: there is none.
+const SerialState* ConsoleCore::pFullSerial() const noexcept
+{
+    for (const auto& serial : mSerials) {
+        if (serial->isOpen && serial->isFull()) return serial.get();
+    }
+    return nullptr;
+}
+
+} // namespace qel::protocol

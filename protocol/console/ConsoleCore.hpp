@@ -1,0 +1,127 @@
+#pragma once
+
+#include <qel/common/QelMessage.hpp>
+#include <qel/common/QelMessageInterfaceComponent.hpp>
+#include <qel/common/QelMessageRegistry.hpp>
+#include <qel/protocol/Console.hpp>
+#include <qel/protocol/ConsoleOptions.hpp>
+
+#include "console/CloseSwitch.hpp"
+#include "console/Connector.hpp"
+#include "console/Exchange.hpp"
+#include "console/FrameLink.hpp"
+#include "console/SerialState.hpp"
+#include "console/TimeLeft.hpp"
+
+#include <chrono>
+#include <functional>
+#include <map>
+#include <memory>
+#include <optional>
+#include <string>
+#include <vector>
+
+namespace qel::protocol {
+
+/// What a Console does; shared by the console, its sessions and its pending responses. See Console for the rules.
+/// Thread safety: one thread, except close().
+class ConsoleCore {
+public:
+    using TypedHandler = std::function<bool(const QelMessage&)>; ///< false: the notice is malformed
+
+    /// Checks the options; connects nothing.
+    /// @param needsAddress  the options must name a server to connect to
+    ConsoleCore(const ConsoleOptions& options, bool needsAddress);
+
+    // Connections.
+
+    /// Connects and introduces this console, again and again if the options say so.
+    void connect(TimePoint end);
+    /// The same over a given stream, once.
+    void adopt(std::unique_ptr<Stream> stream, int descriptor, TimePoint end);
+    void reconnect(TimePoint end);
+    void leave() noexcept;
+    /// Any thread.
+    void close() noexcept { mCloseSwitch.close(); }
+    /// The console is destroyed: closes the connection for good.
+    void dispose() noexcept;
+
+    // What is known.
+
+    const std::string& server() const noexcept { return mServer; }
+    std::chrono::milliseconds requestTimeout() const noexcept { return mRequestTimeout; }
+    const PeerIdentity& peer() const noexcept { return mPeer; }
+    bool isProtected() const noexcept { return mIsProtected; }
+    const QelMessageGetEnclTypeAndInterfaceVersionRsp& version() const;
+    PollFd getPollFd(PollEvents events) const;
+    bool hasPending() const { return mLink != nullptr && mLink->hasPending(); }
+
+    // Messages.
+
+    /// Sends a request and waits for its response, whatever its status. A request whose wait fails is abandoned.
+    std::unique_ptr<QelMessage> exchange(const QelMessage& request, TimePoint end);
+    /// exchange() for a request that must be granted. @throws StatusError
+    std::unique_ptr<QelMessage> require(const QelMessage& request, TimePoint end);
+    /// Sends a request.
+    std::shared_ptr<Exchange> start(const QelMessage& request, TimePoint end);
+    /// Waits for the response to a request.
+    std::unique_ptr<QelMessage> finish(Exchange& exchange, TimePoint end);
+    void send(const QelMessage& notice, TimePoint end);
+    /// Sends a message; receives others while the peer takes nothing.
+    /// @param isWanted  asked before each wait
+    /// @return false: the message was not wanted any more
+    bool sendAmongOthers(const QelMessage& message, TimePoint end, const std::function<bool()>& isWanted);
+
+    /// Receives and handles one message. @return false: none began in time
+    bool receiveOne(TimePoint begin, TimePoint end);
+
+    void onNotice(const QelMessageRegistry::Identifier& identity, TypedHandler handler);
+    void onOtherNotice(Console::NoticeHandler handler);
+
+    // Sessions.
+
+    void openSession(TimePoint end);
+    void closeSession(TimePoint end);
+    std::shared_ptr<SerialState> openSerial(std::uint16_t partition, const SerialOptions& options, TimePoint end);
+    void closeSerial(const std::shared_ptr<SerialState>& state, TimePoint end);
+    /// Closes the session without waiting, and forgets it.
+    void dropSerial(const std::shared_ptr<SerialState>& state) noexcept;
+
+private:
+    void pConnectOnce(TimePoint end);
+    void pUse(ConnectedStream connected, TimePoint handshakeEnd);
+    void pIntroduce(TimePoint end);
+    void pDisconnect(const std::exception_ptr& failure) noexcept;
+    FrameLink& pLink();
+
+    bool pHandleSerial(const QelMessage& message);
+    bool pHandleTyped(const QelMessage& message);
+    void pHandleNotice(const QelMessage& message);
+    void pHandleEnd(const QelMessage& message);
+    [[noreturn]] void pBreak(const std::string& reason);
+    void pForget(const SerialState& state) noexcept;
+    const SerialState* pFullSerial() const noexcept;
+
+    const std::string mServer;
+    const Identity mIdentity;
+    const std::chrono::milliseconds mRequestTimeout;
+    const std::chrono::milliseconds mFrameTimeout;
+    const std::chrono::milliseconds mHandshakeTimeout;
+    const std::optional<Backoff> mRetry;
+    const bool mIsConnector; // false: the stream was given
+    Connector mConnector;
+    CloseSwitch mCloseSwitch;
+
+    std::unique_ptr<FrameLink> mLink; // null: not connected
+    std::exception_ptr mUnusable;     // why there is no connection
+    PeerIdentity mPeer;
+    bool mIsProtected = false;
+    std::unique_ptr<QelMessage> mVersion; // the response; null only before the first introduction
+    Exchanges mExchanges;
+    std::map<QelMessageRegistry::Identifier, std::shared_ptr<const TypedHandler>> mHandlers;
+    std::shared_ptr<const Console::NoticeHandler> mOtherHandler;
+    std::vector<std::shared_ptr<SerialState>> mSerials;
+    bool mIsSessionOpen = false; // the hypervisor session
+};
+
+} // namespace qel::protocol

@@ -1,0 +1,113 @@
+#pragma once
+
+#include <qel/common/QelMessage.hpp>
+#include <qel/common/io/QelMessageStream.hpp>
+#include <qel/common/io/Stream.hpp>
+#include <qel/common/io/StreamIOException.hpp>
+#include <qel/common/security/SSLStream.hpp>
+#include <qel/common/util/Poll.hpp>
+
+#include "console/CloseSwitch.hpp"
+#include "console/Connector.hpp"
+#include "console/TimeLeft.hpp"
+
+#include <chrono>
+#include <exception>
+#include <memory>
+#include <string>
+
+namespace qel::protocol {
+
+/// Sends and receives the messages of one connection, with deadlines, and remembers what made it unusable.
+///
+/// A deadline that passes before a message has begun does no harm, except over TLS on a stream without a descriptor:
+/// TLS cannot go on after a read that a deadline has ended, so one must not begin before there is something to read.
+/// Thread safety: one thread.
+class FrameLink {
+public:
+    /// @param connected    the connection; the deadlines of its stream are set by every call here
+    /// @param server       for exceptions
+    /// @param frameTimeout  for one message, from its first byte to its last
+    /// @param closeSwitch  tells whether this end closed the connection; must outlive this
+    FrameLink(ConnectedStream connected, const std::string& server, std::chrono::milliseconds frameTimeout,
+              CloseSwitch& closeSwitch);
+    ~FrameLink();
+    FrameLink(const FrameLink&) = delete;
+    FrameLink& operator=(const FrameLink&) = delete;
+
+    /// Sends one message; waits for room for it until `end`, and for at most the frame timeout.
+    /// @throws DeadlinePassed, ClosedByPeer, or Error when this end has closed the connection. Sending fails from then
+    /// on;
+    ///         over TLS receiving too
+    void send(const QelMessage& message, TimePoint end);
+
+    /// Receives one message.
+    /// @param begin  by when it must have begun
+    /// @param end    by when it must have ended; it has at most the frame timeout
+    /// @return null: none has begun in time
+    /// @throws DeadlinePassed, ClosedByPeer, ProtocolBroken, or Error when this end has closed the connection. Sending
+    ///         and receiving fail from then on
+    std::unique_ptr<QelMessage> receive(TimePoint begin, TimePoint end);
+
+    /// What can be done without waiting.
+    struct Ready {
+        bool send = false;
+        bool receive = false;
+    };
+    /// Waits until a message can be sent or, if wanted, received. Without a descriptor a send can always be tried.
+    /// @return neither: not by the deadline
+    Ready await(bool wantsToReceive, TimePoint end);
+
+    /// Makes the connection unusable: sending and receiving throw this from now on.
+    /// @throws the failure
+    [[noreturn]] void fail(std::exception_ptr failure);
+    /// False after any failure.
+    bool isUsable() const noexcept { return mSendFailure == nullptr && mReceiveFailure == nullptr; }
+
+    PollFd getPollFd(PollEvents events) const;
+    bool hasPending() const { return mTls != nullptr && mTls->hasPending(); }
+    bool isProtected() const noexcept { return mTls != nullptr; }
+
+    /// As Console::leave(). Sending and receiving fail from then on.
+    void leave() noexcept;
+
+private:
+    /// Limits the first byte of a message by one deadline and the rest by another, and knows whether a message has
+    /// begun.
+    class Input : public Stream {
+    public:
+        explicit Input(Stream& stream) : mStream(stream) {}
+
+        void begin(std::chrono::milliseconds frameTimeout);
+        bool hasBegun() const noexcept { return mHasBegun; }
+
+        std::size_t read(char* buffer, std::size_t length) override;
+        void write(const char* buffer, std::size_t length) override { mStream.write(buffer, length); }
+        void close() override { mStream.close(); }
+
+    private:
+        Stream& mStream;
+        std::chrono::milliseconds mFrameTimeout{0};
+        bool mHasBegun = false;
+    };
+
+    std::chrono::milliseconds pFrameTime(TimePoint end) const;
+    bool pMustPoll() const { return mTls != nullptr && mDescriptor >= 0; }
+    bool pAwaitInput(TimePoint end) const;
+    void pAwaitEnd();
+    [[noreturn]] void pFailSending(const StreamIOException& error);
+    std::exception_ptr pFailure(const StreamIOException& error) const;
+
+    const std::unique_ptr<Stream> mStream;
+    SSLStream* const mTls; // points to *mStream; null for a plain connection
+    const int mDescriptor;
+    const std::string mServer;
+    const std::chrono::milliseconds mFrameTimeout;
+    CloseSwitch& mCloseSwitch;
+    Input mInput;
+    QelMessageStream mMessages;
+    std::exception_ptr mSendFailure;    // set: sending throws it
+    std::exception_ptr mReceiveFailure; // set: receiving throws it
+};
+
+} // namespace qel::protocol

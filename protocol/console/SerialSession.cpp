@@ -1,0 +1,130 @@
+#include <qel/common/QelMessage.hpp>
+#include <qel/common/QelMessageVirtualSerial.hpp>
+#include <qel/protocol/Error.hpp>
+#include <qel/protocol/SerialSession.hpp>
+
+#include "console/ConsoleCore.hpp"
+
+#include <algorithm>
+#include <stdexcept>
+#include <utility>
+
+namespace qel::protocol {
+
+using std::chrono::milliseconds;
+
+static_assert(SerialSession::kMaxData ==
+                  QelMessage::MtuMax - QelMessage::MaxHeaderSize - sizeof(QelMessageVirtualSerialDataToOsAsync::Data),
+              "what the longest frame has room for");
+
+namespace {
+
+/// Does a step that receives messages. The notice that the connection closes is no failure for a session: it has ended.
+/// @return false: the session has ended by that
+template <typename F>
+bool doStep(const SerialState& state, F step)
+{
+    try {
+        step();
+        return true;
+    } catch (const ClosedByPeer&) {
+        if (state.end == SessionEnd::None) throw;
+        return false;
+    }
+}
+
+QelMessageVirtualSerialDataToOsAsync dataMessage(const SerialState& state, const char* data, std::size_t length)
+{
+    return QelMessageVirtualSerialDataToOsAsync(state.partition, state.connection, static_cast<std::uint16_t>(length),
+                                                data);
+}
+
+} // namespace
+
+SerialSession::SerialSession(std::shared_ptr<ConsoleCore> core, std::shared_ptr<SerialState> state) noexcept
+    : mCore(std::move(core)), mState(std::move(state))
+{}
+
+SerialSession::SerialSession(SerialSession&& other) noexcept = default;
+
+SerialSession& SerialSession::operator=(SerialSession&& other) noexcept
+{
+    if (this == &other) return *this;
+    pRelease();
+    mCore = std::move(other.mCore);
+    mState = std::move(other.mState);
+    return *this;
+}
+
+SerialSession::~SerialSession() { pRelease(); }
+
+std::uint16_t SerialSession::getPartition() const noexcept { return mState->partition; }
+
+std::uint16_t SerialSession::getConnection() const noexcept { return mState->connection; }
+
+std::size_t SerialSession::read(char* buffer, std::size_t length) { return read(buffer, length, milliseconds(-1)); }
+
+std::size_t SerialSession::read(char* buffer, std::size_t length, milliseconds timeout)
+{
+    if (length == 0) throw std::invalid_argument("length: zero");
+    const TimePoint end = deadlineIn(timeout);
+    while (mState->unreadBytes() == 0 && mState->end == SessionEnd::None) {
+        doStep(*mState, [&] {
+            if (mCore->receiveOne(end, TimePoint::max())) return;
+            throw DeadlinePassed("partition " + std::to_string(mState->partition) + " sent nothing in time",
+                                 mCore->server());
+        });
+    }
+    return readAvailable(buffer, length);
+}
+
+std::size_t SerialSession::readAvailable(char* buffer, std::size_t length) noexcept
+{
+    return mState->take(buffer, length);
+}
+
+std::size_t SerialSession::getAvailable() const noexcept { return mState->unreadBytes(); }
+
+std::size_t SerialSession::write(const char* data, std::size_t length)
+{
+    const auto isWanted = [this] { return mState->end == SessionEnd::None; };
+    std::size_t sent = 0;
+    while (sent < length && isWanted()) {
+        const std::size_t count = std::min(length - sent, kMaxData);
+        const auto message = dataMessage(*mState, data + sent, count);
+        bool isSent = false;
+        doStep(*mState,
+               [&] { isSent = mCore->sendAmongOthers(message, deadlineIn(mCore->requestTimeout()), isWanted); });
+        if (isSent) sent += count;
+    }
+    return sent;
+}
+
+void SerialSession::writeSome(std::string& data)
+{
+    if (mState->end != SessionEnd::None) return data.clear();
+    const std::size_t count = std::min(data.size(), kMaxData);
+    mCore->send(dataMessage(*mState, data.data(), count), deadlineIn(mCore->requestTimeout()));
+    data.erase(0, count);
+}
+
+SessionEnd SerialSession::getEnd() const noexcept { return mState->end; }
+
+CommandEnd SerialSession::getCommandEnd() const noexcept { return mState->commandEnd; }
+
+std::string SerialSession::describeEnd() const
+{
+    if (mState->end != SessionEnd::CommandEnded) return describe(mState->end);
+    return "session closed: " + describe(mState->commandEnd);
+}
+
+void SerialSession::close() { close(mCore->requestTimeout()); }
+
+void SerialSession::close(milliseconds timeout) { mCore->closeSerial(mState, deadlineIn(timeout)); }
+
+void SerialSession::pRelease() noexcept
+{
+    if (mState != nullptr && mState->end == SessionEnd::None) mCore->dropSerial(mState);
+}
+
+} // namespace qel::protocol

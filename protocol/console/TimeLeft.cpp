@@ -1,0 +1,34 @@
+#include "console/TimeLeft.hpp"
+
+#include <qel/common/util/TimeProvider.hpp>
+
+#include <algorithm>
+
+namespace qel::protocol {
+
+namespace {
+
+using std::chrono::milliseconds;
+
+constexpr milliseconds kLongest = std::chrono::hours(20 * 24);
+constexpr milliseconds kNoLimit(-1);
+
+} // namespace
+
+TimePoint deadlineIn(milliseconds timeout)
+{
+    if (timeout < milliseconds::zero()) return TimePoint::max();
+    const TimePoint now = TimeProvider::steady();
+    const auto room = std::chrono::duration_cast<milliseconds>(TimePoint::max() - now);
+    return timeout >= room ? TimePoint::max() : now + timeout;
+}
+
+milliseconds timeLeft(TimePoint deadline)
+{
+    if (deadline == TimePoint::max()) return kNoLimit;
+    const TimePoint now = TimeProvider::steady();
+    if (deadline <= now) return milliseconds::zero();
+    return std::min(std::chrono::ceil<milliseconds>(deadline - now), kLongest);
+}
+
+} // namespace qel::protocol

@@ -1,0 +1,20 @@
+#pragma once
+
+#include <chrono>
+
+/// @file
+/// Deadlines of calls. TimePoint::max() means none.
+
+namespace qel::protocol {
+
+using TimePoint = std::chrono::steady_clock::time_point;
+
+/// The deadline of a call that begins now.
+/// @param timeout  negative: no limit
+TimePoint deadlineIn(std::chrono::milliseconds timeout);
+
+/// For poll(2) and for the deadlines of streams: rounded up, so that a wait does not end early; 0 at and after the
+/// deadline, -1 without one. At most 20 days, since poll(2) takes an int.
+std::chrono::milliseconds timeLeft(TimePoint deadline);
+
+} // namespace qel::protocol
