@@ -17,7 +17,7 @@ namespace {
 
 using tool::CommandFailure;
 using tool::ExitStatus;
-using tool::RequestRefused;
+using tool::StatusError;
 
 /// Throws the way the stream layer does: what the system said, nested in what the stream says.
 [[noreturn]] void throwStreamFailure(int error)
@@ -46,7 +46,7 @@ TEST(Failures, EachKindOfFailureHasItsExitStatus)
 {
     const std::vector<Case> cases{
         {"own", [] { throw CommandFailure(ExitStatus::CannotConnect, "x"); }, ExitStatus::CannotConnect},
-        {"refused", [] { throw RequestRefused("x", refusal()); }, ExitStatus::Refused},
+        {"refused", [] { throw StatusError(refusal()); }, ExitStatus::Refused},
         {"broken frame", [] { throw QelMessageValidationException("x"); }, ExitStatus::ProtocolBroken},
         {"of another class", [] { throw QelMessageCastException(QelMessageGeneric(), "T"); },
          ExitStatus::ProtocolBroken},
@@ -81,16 +81,6 @@ TEST(Failures, ExitStatusesHaveTheDocumentedNumbers)
     EXPECT_EQ(static_cast<int>(ExitStatus::ClosedByPeer), 7);
 }
 
-TEST(Failures, RefusalWithoutATextNamesTheStepAndTheStatus)
-{
-    const RequestRefused refused("open session", refusal());
-    EXPECT_STREQ(refused.what(), "open session refused: 0x00000012 (QelMessageStatusTooManyConnections)")
-        << "only the version request has a text for this status";
-    EXPECT_EQ(refused.getStep(), "open session");
-    EXPECT_EQ(refused.getStatus(), QelMessageStatusTooManyConnections);
-    EXPECT_EQ(refused.getStatusDetail(), 0xABU);
-}
-
 TEST(Failures, ExplanationIncludesTheNestedCauses)
 {
     try {
@@ -110,8 +100,7 @@ TEST(Failures, UserMessageExplainsTheLibrarysPhrase)
     };
     for (const Row& row : {
              Row{[] { throw CommandFailure(ExitStatus::ClosedByPeer, "own words"); }, "own words"},
-             Row{[] { throw RequestRefused("x", refusal()); },
-                 "x refused: 0x00000012 (QelMessageStatusTooManyConnections)"},
+             Row{[] { throw StatusError(refusal()); }, "time refused: 0x00000012 (QelMessageStatusTooManyConnections)"},
              Row{[] { throw QelMessageValidationException("Invalid length"); },
                  "the peer broke the protocol: Invalid length"},
              Row{[] { throw StreamIOException("I/O deadline"); }, "the peer did not answer in time: I/O deadline"},

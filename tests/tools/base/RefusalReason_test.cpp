@@ -67,9 +67,48 @@ TEST(RefusalReason, NamesThePartitionWithoutASubject)
 
 TEST(RefusalReason, ComesBeforeTheStatusInTheMessageOfARefusal)
 {
-    const tool::RequestRefused refused("open serial session", response(0x6002, 0x0402, 19), "partition 3");
-    EXPECT_STREQ(refused.what(), "partition 3 is held by another console; --force takes it: 0x00000013 "
-                                 "(QelMessageStatusConnectionNotAvailable)");
+    EXPECT_EQ(tool::refusalText(response(0x6002, 0x0402, 19), "partition 3"),
+              "partition 3 is held by another console; --force takes it: 0x00000013 "
+              "(QelMessageStatusConnectionNotAvailable)");
+}
+
+TEST(RefusalText, WithoutAReasonNamesTheRequest)
+{
+    EXPECT_EQ(tool::refusalText(response(0x6003, 0x0107, 18)),
+              "time refused: 0x00000012 (QelMessageStatusTooManyConnections)");
+    EXPECT_EQ(tool::refusalText(response(0x6003, 0x0102, 18)),
+              "open session refused: 0x00000012 (QelMessageStatusTooManyConnections)");
+    EXPECT_EQ(tool::refusalText(response(0x6003, 0x0999, 18)),
+              "the request was refused: 0x00000012 (QelMessageStatusTooManyConnections)");
+}
+
+TEST(RequestName, IsThatOfTheCommandOrOfTheStep)
+{
+    struct Row {
+        unsigned short function;
+        unsigned short operation;
+        const char* name;
+    };
+    const Row rows[] = {
+        {0x6003, 0x0101, "version request"},
+        {0x6003, 0x0102, "open session"},
+        {0x6003, 0x0103, "close session"},
+        {0x6003, 0x0104, "capabilities"},
+        {0x6003, 0x0105, "limits"},
+        {0x6003, 0x0106, "broadcast"},
+        {0x6003, 0x0107, "time"},
+        {0x6003, 0x0108, "set-mode"},
+        {0x6003, 0x0109, "get-mode"},
+        {0x6003, 0x010A, "set-metadata"},
+        {0x6003, 0x010B, "get-metadata"},
+        {0x6002, 0x0402, "open serial session"},
+        {0x6002, 0x0403, "close serial session"},
+        {0x6002, 0x0404, "max-sessions"},
+        {0x6002, 0x0406, "set up serial session"},
+        {0x6002, 0x0107, ""},
+    };
+    for (const Row& row : rows)
+        EXPECT_EQ(tool::requestName(response(row.function, row.operation, 0)), row.name) << row.operation;
 }
 
 } // namespace

@@ -4,7 +4,7 @@
 #include <qel/common/QelMessageInterfaceComponent.hpp>
 
 #include "bench/BenchPair.hpp"
-#include "tools/client/FakeHypervisorEnd.hpp"
+#include "protocol/console/FakeHypervisorEnd.hpp"
 
 #include <memory>
 #include <string>
@@ -34,12 +34,10 @@ struct FakeBenchPair {
 private:
     static tool::BenchConsole makeConsole(FakeHypervisorEnd*& borrowed, const std::string& toolId)
     {
-        auto stream = std::make_unique<FakeHypervisorEnd>();
-        borrowed = stream.get();
-        tool::IdentityOptions identity;
-        identity.toolType = 9;
-        identity.toolId = toolId;
-        return {identity, std::make_unique<tool::ClientConnection>(std::move(stream))};
+        protocol::ConsoleOptions options = FakeHypervisorEnd::plainOptions();
+        options.identity.toolType = 9;
+        options.identity.toolId = toolId;
+        return {options.identity, FakeHypervisorEnd::makeConsole(borrowed, options)};
     }
 
     static void pass(const QelMessage& message, FakeHypervisorEnd& from, FakeHypervisorEnd& to, const std::string& name)

@@ -5,6 +5,7 @@
 #include <qel/common/QelMessageVirtualSerial.hpp>
 
 #include "client/CallRequests.hpp"
+#include "support/Errors.hpp"
 
 #include <functional>
 #include <gmock/gmock.h>
@@ -15,8 +16,6 @@ namespace qel::test {
 namespace {
 
 using ::testing::StartsWith;
-using ::testing::StrEq;
-using ::testing::ThrowsMessage;
 using tool::Answer;
 using tool::CallRequest;
 
@@ -114,7 +113,7 @@ TEST(CallRequests, ShortLimitsAreABrokenProtocol)
     for (const std::size_t length : {0U, 1U, 15U}) {
         SCOPED_TRACE(length);
         EXPECT_THAT([&] { asJson(tool::limitsRequest(), response(0x6003, 0x0105, std::string(length, '\0'))); },
-                    ThrowsMessage<QelMessageValidationException>(StrEq("the response is too short")));
+                    failsWith<tool::ProtocolBroken>("the peer broke the protocol: the response is too short"));
     }
     EXPECT_NO_THROW(asJson(tool::limitsRequest(), response(0x6003, 0x0105, std::string(17, '\0'))));
 }
@@ -132,7 +131,7 @@ TEST(CallRequests, AShortTimeIsABrokenProtocol)
     for (const std::size_t length : {0U, 7U}) {
         SCOPED_TRACE(length);
         EXPECT_THAT([&] { asJson(tool::timeRequest(), response(0x6003, 0x0107, std::string(length, '\0'))); },
-                    ThrowsMessage<QelMessageValidationException>(StrEq("the response is too short")));
+                    failsWith<tool::ProtocolBroken>("the peer broke the protocol: the response is too short"));
     }
     EXPECT_NO_THROW(asJson(tool::timeRequest(), response(0x6003, 0x0107, std::string(9, '\0'))));
 }
@@ -147,7 +146,8 @@ TEST(CallRequests, ATimeWithADigitAbove9IsABrokenProtocol)
         char& byte = bad[digit / 2];
         byte = static_cast<char>(digit % 2 == 0 ? 0xA0 | (byte & 0x0F) : (byte & 0xF0) | 0x0A);
         EXPECT_THAT([&] { asJson(tool::timeRequest(), response(0x6003, 0x0107, bad)); },
-                    ThrowsMessage<QelMessageValidationException>(StartsWith("the time of day has digits above 9: ")));
+                    failsWith<tool::ProtocolBroken>(
+                        StartsWith("the peer broke the protocol: the time of day has digits above 9: ")));
     }
 }
 

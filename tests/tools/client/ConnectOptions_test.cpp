@@ -2,22 +2,11 @@
 
 #include <gtest/gtest.h>
 #include <string>
-#include <unistd.h>
 #include <vector>
 
 namespace qel::test {
 
 namespace {
-
-TEST(ConnectOptions, TheToolIdDefaultsToTheProcessId)
-{
-    tool::IdentityOptions options;
-    EXPECT_EQ(tool::completeIdentity(options).toolId, "qel-" + std::to_string(::getpid()));
-    options.toolId = "mine";
-    options.toolType = 9;
-    EXPECT_EQ(tool::completeIdentity(options).toolId, "mine");
-    EXPECT_EQ(tool::completeIdentity(options).toolType, 9U);
-}
 
 struct Parsed {
     tool::ConnectOptions options;
@@ -42,7 +31,7 @@ TEST(ConnectOptions, ConnectOptionsAreRead)
     const Parsed parsed = parse({"--connect", "[::1]:80", "--plain", "--timeout", "0.25", "--tool-type", "0xFFFFFFFF",
                                  "--tool-id", std::string(32, 'x')});
     EXPECT_EQ(parsed.status, 0);
-    EXPECT_EQ(parsed.options.endpoint, "[::1]:80");
+    EXPECT_EQ(parsed.options.server, "[::1]:80");
     EXPECT_TRUE(parsed.options.transport.plain);
     EXPECT_EQ(parsed.options.timeout(), std::chrono::milliseconds(250));
     EXPECT_EQ(parsed.options.identity.toolType, 0xFFFFFFFFU);
@@ -59,7 +48,10 @@ TEST(ConnectOptions, BadConnectOptionsAreRefused)
     const std::vector<std::vector<std::string>> bad{
         {},
         {"--connect"},
-        {"--connect", "localhost:80"},
+        {"--connect", "localhost"},
+        {"--connect", "local host:80"},
+        {"--connect", "localhost:0"},
+        {"--connect", ":80"},
         {"--connect", "127.0.0.1"},
         {"--connect", "127.0.0.1:65536"},
         {"--connect", "::1:80"},

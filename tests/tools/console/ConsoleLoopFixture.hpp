@@ -1,15 +1,17 @@
 #pragma once
 
 #include <qel/common/QelMessageCast.hpp>
+#include <qel/common/QelMessageDax.hpp>
+#include <qel/common/QelMessageVirtualSerial.hpp>
 #include <qel/common/util/PosixError.hpp>
 
 #include "base/Failures.hpp"
 #include "console/ConsoleLoop.hpp"
+#include "protocol/console/FakeHypervisorEnd.hpp"
 #include "support/CapturedLog.hpp"
 #include "support/Pty.hpp"
 #include "support/SettableClock.hpp"
 #include "support/TemporaryDirectory.hpp"
-#include "tools/client/FakeHypervisorEnd.hpp"
 
 #include <array>
 #include <atomic>
@@ -18,7 +20,7 @@
 #include <fstream>
 #include <functional>
 #include <gtest/gtest.h>
-#include <memory>
+#include <optional>
 #include <sstream>
 #include <string>
 #include <sys/ioctl.h>
@@ -37,9 +39,11 @@ protected:
     {
         makePipe(inputRead, inputWrite);
         makePipe(outputRead, outputWrite);
-        auto owned = std::make_unique<FakeHypervisorEnd>();
-        end = owned.get();
-        connection = std::make_unique<tool::ClientConnection>(std::move(owned), end->descriptor());
+    }
+
+    ~ConsoleLoopTest() override
+    {
+        end->onMessage = [](const QelMessage&) {}; // the session is closed when it is destroyed
     }
 
     static void makePipe(UniqueFd& readEnd, UniqueFd& writeEnd)
@@ -53,7 +57,7 @@ protected:
     /// Opens the session; `onInput` is then told all bytes that have been sent, after each message.
     void open(std::function<void(const std::string&)> onInput)
     {
-        session->open(false);
+        session.emplace(console.openSerial(kPartition));
         end->onMessage = [this, onInput = std::move(onInput)](const QelMessage& message) {
             const auto* data = dynamic_cast<const QelMessageVirtualSerialDataToOsAsync*>(&message);
             ASSERT_NE(data, nullptr);
@@ -71,11 +75,10 @@ protected:
         const int input = pty == nullptr ? inputRead.get() : pty->slave();
         tool::TerminalMode mode(input);
         tool::ConsoleScreen screen(pty == nullptr ? outputWrite.get() : pty->slave(), errors, pty != nullptr, mode);
-        current = &screen;
-        tool::ConsoleLoop loop(*session, screen, input, mode, signals, options);
-        const tool::ConsoleLoop::Outcome outcome = loop.run();
-        current = nullptr;
-        return outcome;
+        console.onNotice<QelMessageDaxBroadcastOutboundAsync>(
+            [&](const QelMessageDaxBroadcastOutboundAsync& broadcast) { screen.showBroadcast(broadcast); });
+        tool::ConsoleLoop loop(console, *session, screen, input, mode, signals, options);
+        return loop.run();
     }
 
     void typeAll(const std::string& text)
@@ -126,31 +129,15 @@ protected:
         return bytes;
     }
 
-    /// Hands on to the screen of the moment.
-    struct Forward : tool::ConsoleSession::Receiver {
-        explicit Forward(tool::ConsoleScreen*& to) : screen(to) {}
-        void onOutput(const char* data, std::size_t length) override { screen->onOutput(data, length); }
-        void onBroadcast(const QelMessageDaxBroadcastOutboundAsync& message) override { screen->onBroadcast(message); }
-        tool::ConsoleScreen*& screen;
-    };
-
     CapturedLog log{LogLevel::Warn};
     UniqueFd inputRead, inputWrite, outputRead, outputWrite;
     std::ostringstream errors;
-    tool::ConsoleScreen* current = nullptr;
-    Forward receiver{current};
-    FakeHypervisorEnd* end = nullptr; // owned by the connection
-    std::unique_ptr<tool::ClientConnection> connection;
-    std::unique_ptr<tool::ConsoleSession> session;
+    FakeHypervisorEnd* end = nullptr; // owned by the console
+    protocol::Console console = FakeHypervisorEnd::makeConsole(end, FakeHypervisorEnd::plainOptions(), true);
+    std::optional<protocol::SerialSession> session;
     std::string sent; // serial data
     std::atomic<bool> hasSent{false};
     unsigned int dataMessages = 0;
-
-    void SetUp() override
-    {
-        session = std::make_unique<tool::ConsoleSession>(*connection, tool::ConsoleSession::Address{kPartition, 0},
-                                                         std::chrono::seconds(10), receiver);
-    }
 };
 
 } // namespace qel::test

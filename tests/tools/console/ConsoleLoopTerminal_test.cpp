@@ -159,7 +159,7 @@ TEST_F(ConsoleLoopTest, AnExceptionRestoresTheTerminal)
     const termios before = pty.attributes();
     open([](const std::string&) {});
     end->end();
-    EXPECT_THROW(run(InputOptions(), &pty), StreamIOException);
+    EXPECT_THROW(run(InputOptions(), &pty), tool::ClosedByPeer);
     EXPECT_TRUE(pty.attributes() == before);
 }
 

@@ -1,3 +1,4 @@
+#include "support/Errors.hpp"
 #include "tools/console/ConsoleLoopFixture.hpp"
 
 #include <gmock/gmock.h>
@@ -8,10 +9,9 @@ namespace {
 
 using ::testing::StrEq;
 using ::testing::ThrowsMessage;
-using tool::CommandFailure;
 using tool::ConsoleLoop;
-using tool::ConsoleSession;
 using tool::InputOptions;
+using tool::SerialSession;
 using tool::SessionEnd;
 using ExitReason = ConsoleLoop::ExitReason;
 
@@ -264,7 +264,7 @@ TEST_F(ConsoleLoopTest, StopsReadingInputWhileNothingIsSent)
         EXPECT_EQ(readOutput(1), "a");
         output("b");
         EXPECT_EQ(readOutput(1), "b"); // the loop has gone round several times
-        EXPECT_EQ(::lseek(inputRead.get(), 0, SEEK_CUR), static_cast<off_t>(ConsoleSession::kMaxData));
+        EXPECT_EQ(::lseek(inputRead.get(), 0, SEEK_CUR), static_cast<off_t>(SerialSession::kMaxData));
         end->takeAgain();
     });
     EXPECT_EQ(run().reason, ExitReason::Ended);
@@ -300,7 +300,7 @@ TEST_F(ConsoleLoopTest, StopsReceivingWhileTheOutputBufferIsFull)
     // A file is ready at all times: each turn of the loop sends one message, and takes one while there is room.
     const TemporaryDirectory directory;
     const std::string path = directory.file("input");
-    std::ofstream(path) << std::string(15 * ConsoleSession::kMaxData, 'i');
+    std::ofstream(path) << std::string(15 * SerialSession::kMaxData, 'i');
     inputRead = UniqueFd(::open(path.c_str(), O_RDONLY | O_CLOEXEC));
 
     std::thread reader;
@@ -326,7 +326,7 @@ TEST_F(ConsoleLoopTest, WritesOutputReceivedBeforeTheConnectionBroke)
     open([](const std::string&) {});
     output("last words");
     end->end();
-    EXPECT_THAT([&] { run(); }, ThrowsMessage<StreamIOException>(StrEq("EOF")));
+    EXPECT_THAT([&] { run(); }, failsWith<tool::ClosedByPeer>("connection lost: EOF"));
     EXPECT_EQ(written(), "last words");
 }
 
@@ -335,8 +335,8 @@ TEST_F(ConsoleLoopTest, ThrowsOnABrokenProtocol)
     open([](const std::string&) {});
     output("before");
     end->push(QelMessageGeneric(1, 0x6003, 0x0107, MsgResponse));
-    EXPECT_THAT([&] { run(); }, ThrowsMessage<CommandFailure>(
-                                    StrEq("the peer broke the protocol: a response to a request that was not sent")));
+    EXPECT_THAT([&] { run(); }, failsWith<tool::ProtocolBroken>(
+                                    "the peer broke the protocol: a response to a request that was not sent"));
     EXPECT_EQ(written(), "before");
 }
 
@@ -387,7 +387,7 @@ TEST_F(ConsoleLoopTest, ThrowsWhenSendingFailedAndNoReasonFollows)
         throw StreamIOException("socket stream send failure");
     });
     typeAll("x");
-    EXPECT_THAT([&] { run(); }, ThrowsMessage<StreamIOException>(StrEq("EOF")));
+    EXPECT_THAT([&] { run(); }, failsWith<tool::ClosedByPeer>("connection lost: EOF"));
 }
 
 TEST_F(ConsoleLoopTest, ThrowsWhenSendingTimesOut)
@@ -395,7 +395,7 @@ TEST_F(ConsoleLoopTest, ThrowsWhenSendingTimesOut)
     open([](const std::string&) {});
     end->failWrites([] { throw StreamIOException("I/O deadline"); });
     typeAll("x");
-    EXPECT_THAT([&] { run(); }, ThrowsMessage<StreamIOException>(StrEq("I/O deadline")));
+    EXPECT_THAT([&] { run(); }, failsWith<tool::DeadlinePassed>("the peer did not answer in time: I/O deadline"));
 }
 
 TEST_F(ConsoleLoopTest, EndOfTheConnectionEndsTheSession)

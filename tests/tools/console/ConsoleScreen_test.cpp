@@ -16,11 +16,11 @@ namespace {
 using tool::ConsoleScreen;
 using tool::TerminalMode;
 
-void show(ConsoleScreen& screen, const std::string& text) { screen.onOutput(text.data(), text.size()); }
+void show(ConsoleScreen& screen, const std::string& text) { screen.output().append(text.data(), text.size()); }
 
 void broadcast(ConsoleScreen& screen, std::uint32_t type, const std::string& id, const std::string& text)
 {
-    screen.onBroadcast(
+    screen.showBroadcast(
         QelMessageDaxBroadcastOutboundAsync(static_cast<std::uint16_t>(text.size()), type, id, text.data()));
 }
 

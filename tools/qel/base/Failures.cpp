@@ -1,7 +1,6 @@
 #include "base/Failures.hpp"
 
 #include <qel/common/QelMessageExceptions.hpp>
-#include <qel/common/StreamFormatters.hpp>
 #include <qel/common/io/StreamIOException.hpp>
 #include <qel/common/util/PosixError.hpp>
 
@@ -48,6 +47,7 @@ struct Wording {
 constexpr Wording kWordings[] = {
     {"does not match the pinned names", "does not match --peer-name"},
     {"does not match the pinned fingerprints", "does not match --peer-fingerprint"},
+    {": it accepts only TLS", ": it accepts only TLS; give credentials instead of --plain"},
     {": use chmod 600", ": use chmod 600, or --insecure-permissions to allow it"},
     {": make it a file of this user", ": make it a file of this user, or --insecure-permissions to allow it"},
 };
@@ -64,12 +64,6 @@ std::string wordingOf(const Error& error)
     return text;
 }
 
-std::string refusalText(const std::string& step, const QelMessage& response, const std::string& subject)
-{
-    const std::string reason = refusalReason(response, subject);
-    return (reason.empty() ? step + " refused" : reason) + ": " + toString(response.getStatus());
-}
-
 } // namespace
 
 CommandFailure::CommandFailure(ExitStatus status, const std::string& reason)
@@ -77,13 +71,6 @@ CommandFailure::CommandFailure(ExitStatus status, const std::string& reason)
 {}
 
 CommandFailure::~CommandFailure() = default;
-
-RequestRefused::RequestRefused(const std::string& step, const QelMessage& response, const std::string& subject)
-    : CommandFailure(ExitStatus::Refused, refusalText(step, response, subject)), mStep(step),
-      mStatus(response.getStatus()), mStatusDetail(response.getStatusDetail())
-{}
-
-RequestRefused::~RequestRefused() = default;
 
 ExitStatus exitStatusOf(const std::exception& error)
 {
@@ -101,6 +88,7 @@ ExitStatus exitStatusOf(const std::exception& error)
 
 std::string userMessage(const std::exception& error)
 {
+    if (const auto* refusal = dynamic_cast<const StatusError*>(&error)) return refusalText(refusal->getResponse());
     if (const auto* ours = dynamic_cast<const Error*>(&error)) return wordingOf(*ours);
     if (is<CommandFailure>(error)) return explain(error);
     switch (exitStatusOf(error)) {

@@ -1,6 +1,5 @@
 #pragma once
 
-#include <qel/common/QelMessage.hpp>
 #include <qel/protocol/Error.hpp>
 
 #include "base/ExitStatus.hpp"
@@ -24,27 +23,6 @@ private:
     ExitStatus mStatus;
 };
 
-/// The peer answered a request with a status other than zero. Ends a command with ExitStatus::Refused.
-/// what() is the reason in words, then the status: "partition 3 is held by another console; --force takes it:
-/// 0x00000013 (QelMessageStatusConnectionNotAvailable)". See refusalReason().
-class RequestRefused : public CommandFailure {
-public:
-    /// @param step  the name of the request, such as "open session"; part of what() only for an unknown status
-    /// @param response  borrowed for the call; its status and status detail are kept
-    /// @param subject  what the request is about, as refusalReason() takes it
-    RequestRefused(const std::string& step, const QelMessage& response, const std::string& subject = {});
-    ~RequestRefused() override;
-
-    const std::string& getStep() const noexcept { return mStep; }
-    QelMessageStatusCodes getStatus() const noexcept { return mStatus; }
-    unsigned short getStatusDetail() const noexcept { return mStatusDetail; }
-
-private:
-    std::string mStep;
-    QelMessageStatusCodes mStatus;
-    unsigned short mStatusDetail;
-};
-
 /// The exit status for an exception: CommandFailure has its own; each error of the library has one in a table;
 /// QelMessageValidationException is ProtocolBroken; StreamIOException is DeadlinePassed when a deadline passed, else
 /// ClosedByPeer; everything else is Failed.
@@ -52,7 +30,7 @@ ExitStatus exitStatusOf(const std::exception& error);
 
 /// The line that the user reads. The library's phrase about a connection is short, such as "EOF", so what it means for
 /// the command comes first: "connection lost: EOF". A CommandFailure is complete as it is; an error of the library gets
-/// the option that it is about.
+/// the option that it is about, and a StatusError the words of refusalText().
 std::string userMessage(const std::exception& error);
 
 } // namespace qel::tool

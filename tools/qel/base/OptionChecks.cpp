@@ -2,6 +2,7 @@
 
 #include <qel/common/QelCapabilities.hpp>
 #include <qel/common/net/IPEndpoint.hpp>
+#include <qel/protocol/ServerAddress.hpp>
 #include <qel/protocol/Text.hpp>
 
 #include "base/Library.hpp"
@@ -12,6 +13,7 @@
 #include <iomanip>
 #include <limits>
 #include <sstream>
+#include <stdexcept>
 #include <string>
 #include <system_error>
 
@@ -48,6 +50,18 @@ std::string checkEndpoint(std::string& text)
 {
     if (isEndpoint(text)) return {};
     return tool::quoted(text) + " is not an endpoint such as 127.0.0.1:4711 or [::1]:4711: " + endpointProblem(text);
+}
+
+std::string checkServer(std::string& text)
+{
+    try {
+        static_cast<void>(ServerAddress::parse(text));
+        return {};
+    } catch (const std::invalid_argument& error) {
+        const std::string prefix = "server: "; // the parser names the option itself
+        const std::string reason = error.what();
+        return reason.compare(0, prefix.size(), prefix) == 0 ? reason.substr(prefix.size()) : reason;
+    }
 }
 
 std::string checkCapabilities(std::string& text)
@@ -127,6 +141,8 @@ CLI::Validator textUpTo(std::size_t bytes)
 }
 
 CLI::Validator endpointValidator() { return CLI::Validator(checkEndpoint, ""); }
+
+CLI::Validator serverValidator() { return CLI::Validator(checkServer, ""); }
 
 CLI::Validator capabilityValidator() { return CLI::Validator(checkCapabilities, ""); }
 

@@ -35,6 +35,9 @@ CLI::Validator textUpTo(std::size_t bytes);
 /// Accepts an IP address and port: "127.0.0.1:4711", "[::1]:4711".
 CLI::Validator endpointValidator();
 
+/// Accepts where a server can be reached, as ServerAddress::parse() does: "hypervisor.example:4711", "127.0.0.1:4711".
+CLI::Validator serverValidator();
+
 /// Accepts a capability set as QelCapabilities does: up to 32 characters, each 0 or 1.
 CLI::Validator capabilityValidator();
 

@@ -1,5 +1,7 @@
 #include "base/RefusalReason.hpp"
 
+#include <qel/common/StreamFormatters.hpp>
+
 #include <cstdint>
 
 namespace qel::tool {
@@ -54,6 +56,30 @@ constexpr Row kReasons[] = {
     {kAny, kAny, QelMessageStatusHypervisorGenericError, "the hypervisor failed; its log may say why"},
 };
 
+struct Name {
+    std::uint16_t function;
+    std::uint16_t operation;
+    const char* name;
+};
+
+constexpr Name kNames[] = {
+    {kConnection, QelMessageOpGetEnclTypeAndInterfaceVersion, "version request"},
+    {kConnection, QelMessageOpOpenKrogSession, "open session"},
+    {kConnection, QelMessageOpCloseKrogSession, "close session"},
+    {kConnection, QelMessageOpExchIntCapabilities, "capabilities"},
+    {kConnection, QelMessageOpGetInterfaceImplementationLimits, "limits"},
+    {kConnection, QelMessageOpDaxBroadcast, "broadcast"},
+    {kConnection, QelMessageOpGetQelTod, "time"},
+    {kConnection, QelMessageOpSetGlobalModeAttribute, "set-mode"},
+    {kConnection, QelMessageOpGetGlobalModeAttribute, "get-mode"},
+    {kConnection, QelMessageOpSetGlobalSaveAreaMetadata, "set-metadata"},
+    {kConnection, QelMessageOpGetGlobalSaveAreaMetadata, "get-metadata"},
+    {kSerial, QelMessageOpOpenVirtualSerialSession, "open serial session"},
+    {kSerial, QelMessageOpCloseVirtualSerialSession, "close serial session"},
+    {kSerial, QelMessageOpGetMaxVirtualSerialSessions, "max-sessions"},
+    {kSerial, QelMessageOpSetupVirtualSerialSession, "set up serial session"},
+};
+
 bool fits(const Row& row, const QelMessage& response)
 {
     return (row.function == kAny || row.function == response.getFunction()) &&
@@ -72,6 +98,24 @@ std::string refusalReason(const QelMessage& response, const std::string& subject
         return text;
     }
     return {};
+}
+
+std::string requestName(const QelMessage& response)
+{
+    for (const Name& entry : kNames) {
+        if (entry.function == response.getFunction() && entry.operation == response.getOperation()) return entry.name;
+    }
+    return {};
+}
+
+std::string refusalText(const QelMessage& response, const std::string& subject)
+{
+    std::string reason = refusalReason(response, subject);
+    if (reason.empty()) {
+        const std::string name = requestName(response);
+        reason = (name.empty() ? "the request was" : name) + " refused";
+    }
+    return reason + ": " + toString(response.getStatus());
 }
 
 } // namespace qel::tool

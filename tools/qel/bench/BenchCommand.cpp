@@ -134,9 +134,9 @@ ExitStatus runBench(const BenchOptions& options, const BenchLoad& load)
     watchRun(run, load, signals);
     const BenchFigures figures = run.finish();
     if (options.json) {
-        printJson(std::cout, reportJson(options.connect.endpoint, load, figures));
+        printJson(std::cout, reportJson(options.connect.server, load, figures));
     } else {
-        printReport(std::cout, options.connect.endpoint, load, figures);
+        printReport(std::cout, options.connect.server, load, figures);
     }
     flushOutput();
     while (signals.take() != 0)
@@ -192,7 +192,7 @@ CLI::App& addBenchCommand(CLI::App& parent, Action& action)
     options->log.quiet = true;
     addLogOptions(command, options->log);
     command.callback([&action, options] {
-        checkTransport(options->connect.transport, options->connect.endpoint);
+        checkConnect(options->connect);
         if (options->connect.identity.toolId.size() > kMaxToolId) {
             throw CLI::ValidationError("--tool-id", "longer than 28 bytes: each connection adds its number");
         }

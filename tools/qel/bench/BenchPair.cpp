@@ -2,8 +2,11 @@
 
 #include <qel/common/QelMessageDax.hpp>
 #include <qel/common/QelMessageInterfaceComponent.hpp>
+#include <qel/common/util/TimeProvider.hpp>
+#include <qel/protocol/Error.hpp>
 
 #include "base/Failures.hpp"
+#include "client/ConnectOptions.hpp"
 
 #include <cstdint>
 #include <utility>
@@ -15,7 +18,7 @@ namespace {
 /// The broadcast type for a single addressee.
 constexpr std::uint8_t kUnicast = 1;
 
-bool isFrom(const QelMessageDaxBroadcastOutboundAsync& notice, const IdentityOptions& sender)
+bool isFrom(const QelMessageDaxBroadcastOutboundAsync& notice, const Identity& sender)
 {
     return notice.getSenderToolType() == sender.toolType && notice.getSenderToolId() == sender.toolId;
 }
@@ -24,47 +27,56 @@ bool isFrom(const QelMessageDaxBroadcastOutboundAsync& notice, const IdentityOpt
 
 BenchPair::BenchPair(BenchConsole first, BenchConsole second, std::size_t bytes, std::chrono::milliseconds timeout)
     : mConsoles{std::move(first), std::move(second)}, mPayload(bytes, 'q'), mTimeout(timeout)
-{}
+{
+    for (std::size_t i = 0; i < mConsoles.size(); ++i) {
+        mConsoles[i].console.onNotice<QelMessageDaxBroadcastOutboundAsync>(
+            [this, sender = &mConsoles[1 - i]](const auto& notice) { pTake(*sender, notice); });
+    }
+}
 
 void BenchPair::exchange()
 {
     BenchConsole& sender = mConsoles[mSender];
     BenchConsole& addressee = mConsoles[1 - mSender];
     mSender = 1 - mSender;
-    sender.connection->setDeadline(mTimeout);
-    addressee.connection->setDeadline(mTimeout);
-    static_cast<void>(sender.connection->require(
-        "broadcast",
+    mHasArrived = false;
+    static_cast<void>(sender.console.request(
         QelMessageDaxBroadcastReq(kUnicast, static_cast<std::uint16_t>(mPayload.size()), addressee.identity.toolType,
-                                  addressee.identity.toolId, mPayload.data())));
-    pAwait(sender, addressee);
+                                  addressee.identity.toolId, mPayload.data()),
+        mTimeout));
+    pAwait(addressee);
 }
 
 void BenchPair::leave() noexcept
 {
-    for (BenchConsole& console : mConsoles)
-        console.connection->leave();
+    for (BenchConsole& entry : mConsoles)
+        entry.console.leave();
 }
 
 void BenchPair::cut()
 {
-    for (BenchConsole& console : mConsoles)
-        console.connection->close();
+    for (BenchConsole& entry : mConsoles)
+        entry.console.close();
 }
 
-/// Receives at the addressee until the message arrives; broadcasts of other consoles are skipped.
-void BenchPair::pAwait(const BenchConsole& sender, BenchConsole& addressee) const
+void BenchPair::pAwait(BenchConsole& addressee)
 {
-    for (;;) {
-        const std::unique_ptr<QelMessage> message = addressee.connection->receive();
-        if (dynamic_cast<const QelMessageKrogConnectionClosedAsync*>(message.get()) != nullptr) {
-            throw CommandFailure(ExitStatus::ClosedByPeer, "the server closed the connection");
+    const auto end = TimeProvider::steady() + mTimeout;
+    while (!mHasArrived) {
+        if (!addressee.console.process(timeLeft(end))) {
+            throw DeadlinePassed("the peer did not answer in time: a message has not arrived",
+                                 addressee.console.getServer());
         }
-        const auto* notice = dynamic_cast<const QelMessageDaxBroadcastOutboundAsync*>(message.get());
-        if (notice == nullptr || !isFrom(*notice, sender.identity)) continue;
-        if (std::string(notice->getDaxPacket(), notice->getBroadcastMsgLen()) == mPayload) return;
-        throw CommandFailure(ExitStatus::ProtocolBroken, "the server broke the protocol: a message arrived changed");
     }
+}
+
+/// Receives a broadcast; those of other consoles are skipped.
+void BenchPair::pTake(const BenchConsole& sender, const QelMessageDaxBroadcastOutboundAsync& notice)
+{
+    if (!isFrom(notice, sender.identity)) return;
+    mHasArrived = std::string(notice.getDaxPacket(), notice.getBroadcastMsgLen()) == mPayload;
+    if (mHasArrived) return;
+    throw CommandFailure(ExitStatus::ProtocolBroken, "the server broke the protocol: a message arrived changed");
 }
 
 } // namespace qel::tool

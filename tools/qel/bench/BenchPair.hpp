@@ -1,21 +1,22 @@
 #pragma once
 
-#include "bench/BenchLoad.hpp"
-#include "client/ClientConnection.hpp"
-#include "client/ConnectOptions.hpp"
+#include <qel/common/QelMessageDax.hpp>
+#include <qel/protocol/Console.hpp>
+#include <qel/protocol/ConsoleOptions.hpp>
+
+#include "base/Library.hpp"
 
 #include <array>
 #include <chrono>
 #include <cstddef>
-#include <memory>
 #include <string>
 
 namespace qel::tool {
 
 /// A console of a benchmark, after the version request.
 struct BenchConsole {
-    IdentityOptions identity; ///< complete
-    std::unique_ptr<ClientConnection> connection;
+    Identity identity; ///< complete
+    Console console;
 };
 
 /// Two consoles that alternately send each other messages. A message is a broadcast addressed to the other console: the
@@ -26,27 +27,30 @@ public:
     /// @param bytes  of payload, 1 to kMaxBroadcast
     /// @param timeout  for each message
     BenchPair(BenchConsole first, BenchConsole second, std::size_t bytes, std::chrono::milliseconds timeout);
+    BenchPair(const BenchPair&) = delete;
+    BenchPair& operator=(const BenchPair&) = delete;
 
     /// Sends one message; returns when the sender has the response and the addressee has the message.
-    /// @throws RequestRefused  the hypervisor could not send it on
-    /// @throws CommandFailure  ClosedByPeer: the hypervisor closes the connection; ProtocolBroken: what arrived is not
-    ///         what was sent
-    /// @throws StreamIOException, QelMessageValidationException  as ClientConnection does
+    /// @throws StatusError  the hypervisor could not send it on
+    /// @throws CommandFailure  ProtocolBroken: what arrived is not what was sent
+    /// @throws Error  as Console::request() does
     void exchange();
 
-    /// Ends both connections gracefully: ClientConnection::leave().
+    /// Ends both connections gracefully: Console::leave().
     void leave() noexcept;
 
     /// Ends both connections at once; an exchange() on another thread throws.
     void cut();
 
 private:
-    void pAwait(const BenchConsole& sender, BenchConsole& addressee) const;
+    void pAwait(BenchConsole& addressee);
+    void pTake(const BenchConsole& sender, const QelMessageDaxBroadcastOutboundAsync& notice);
 
     std::array<BenchConsole, 2> mConsoles;
     const std::string mPayload;
     const std::chrono::milliseconds mTimeout;
     unsigned int mSender = 0; // index of the console that sends next
+    bool mHasArrived = false; // the message on its way
 };
 
 } // namespace qel::tool

@@ -1,16 +1,22 @@
 #include "client/CallCommand.hpp"
 
+#include <qel/common/util/TimeProvider.hpp>
+#include <qel/protocol/Console.hpp>
+#include <qel/protocol/Error.hpp>
+
 #include "base/Failures.hpp"
 #include "base/Logging.hpp"
 #include "base/OptionChecks.hpp"
+#include "base/RefusalReason.hpp"
 #include "client/CallRequests.hpp"
-#include "client/ClientConnection.hpp"
 #include "client/ConnectOptions.hpp"
 
+#include <chrono>
 #include <functional>
 #include <iostream>
 #include <limits>
 #include <memory>
+#include <optional>
 #include <string>
 #include <utility>
 
@@ -40,6 +46,7 @@ struct Call {
     RequestArguments arguments;
 };
 
+using TimePoint = std::chrono::steady_clock::time_point;
 using RequestMaker = std::function<CallRequest(const RequestArguments&)>;
 
 void print(const CallOptions& options, const CallRequest& request, const QelMessage& response)
@@ -56,34 +63,38 @@ void print(const CallOptions& options, const CallRequest& request, const QelMess
     }
 }
 
-void printRefusal(const CallRequest& request, const RequestRefused& refusal)
+void printRefusal(const CallRequest& request, const QelMessage& response)
 {
-    auto document = jsonHead(request.name, refusal.getStatus(), refusal.getStatusDetail());
-    document["refused"] = refusal.getStep();
+    auto document = jsonHead(request.name, response.getStatus(), response.getStatusDetail());
+    document["refused"] = requestName(response);
     printJson(std::cout, document);
 }
 
-std::unique_ptr<QelMessage> callRequest(ClientConnection& connection, const IdentityOptions& identity,
-                                        const CallRequest& request)
+/// Sends the request and leaves.
+/// @param end  for all of it
+std::unique_ptr<QelMessage> callRequest(Console& console, const CallRequest& request, TimePoint end)
 {
-    std::unique_ptr<QelMessage> version = introduce(connection, identity);
-    if (request.message == nullptr) return version;
-    if (request.needsSession) openHypervisorSession(connection);
-    return connection.require(request.name, *request.message);
+    if (request.message == nullptr) return console.version().clone();
+    if (request.needsSession) console.openSession(timeLeft(end));
+    auto response = console.exchange(*request.message, timeLeft(end));
+    if (response->getStatus() != QelMessageStatusNoError) throw StatusError(*response, console.getServer());
+    return response;
 }
 
 ExitStatus runCall(const CallOptions& options, const CallRequest& request)
 {
     startLogging(options.log, "qel-call.log");
-    const auto connection = ClientConnection::connect(options.connect);
+    const TimePoint end = TimeProvider::steady() + options.connect.timeout();
+    std::optional<Console> console;
     try {
-        const auto response = callRequest(*connection, options.connect.identity, request);
-        connection->leave();
+        console.emplace(connectConsole(options.connect));
+        const auto response = callRequest(*console, request, end);
+        console->leave();
         print(options, request, *response);
         return ExitStatus::Done;
-    } catch (const RequestRefused& refusal) {
-        connection->leave();
-        if (options.json) printRefusal(request, refusal);
+    } catch (const StatusError& refusal) {
+        if (console) console->leave();
+        if (options.json) printRefusal(request, refusal.getResponse());
         flushOutput();
         throw;
     }
@@ -96,7 +107,7 @@ CLI::App& addRequest(CLI::App& command, Action& action, const std::shared_ptr<Ca
     request.fallthrough(); // accept the options of "call" after the request too
     request.footer("The options of \"qel call\", such as --connect and --json, are accepted here too.");
     request.callback([&action, call, make = std::move(make)] {
-        checkTransport(call->options.connect.transport, call->options.connect.endpoint);
+        checkConnect(call->options.connect);
         action = [call, make] { return runCall(call->options, make(call->arguments)); };
     });
     return request;

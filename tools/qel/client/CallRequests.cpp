@@ -1,59 +1,19 @@
 #include "client/CallRequests.hpp"
 
-#include <qel/common/BCDExtensions.hpp>
-#include <qel/common/EndianExtensions.hpp>
 #include <qel/common/QelMessageCast.hpp>
-#include <qel/common/QelMessageExceptions.hpp>
 #include <qel/common/QelMessageInterfaceComponent.hpp>
 #include <qel/common/QelMessageVirtualSerial.hpp>
+#include <qel/protocol/ResponseOf.hpp>
 #include <qel/protocol/Text.hpp>
 
 #include "base/Library.hpp"
 
-#include <algorithm>
-#include <cstddef>
 #include <cstdio>
 #include <cstring>
 
 namespace qel::tool {
 
 namespace {
-
-// The payloads of the two responses for which the registry has no class. Offsets are from the first payload byte.
-
-struct LimitsPayload {
-    be_uint16_t maxCommandSize;     //  0  bytes
-    be_uint16_t maxKrogCommandSize; //  2  bytes
-    be_uint16_t broadcastSize;      //  4  bytes
-    char reserved1[2];              //  6
-    unsigned char daxsSupported;    //  8
-    char reserved2[3];              //  9
-    be_uint16_t nonpersistentLocks; // 12
-    be_uint16_t persistentLocks;    // 14
-};
-static_assert(sizeof(LimitsPayload) == 16 && alignof(LimitsPayload) == 1, "copied from the frame buffer");
-
-struct TimePayload {
-    bcd_uint16_t year;    // 0
-    bcd_uint8_t month;    // 2
-    bcd_uint8_t day;      // 3
-    bcd_uint8_t hour;     // 4
-    bcd_uint8_t minute;   // 5
-    bcd_uint8_t second;   // 6
-    bcd_uint8_t reserved; // 7
-};
-static_assert(sizeof(TimePayload) == 8 && alignof(TimePayload) == 1, "copied from the frame buffer");
-
-template <typename Payload>
-Payload payloadOf(const QelMessage& message)
-{
-    if (message.dataLength() < sizeof(Payload)) {
-        throw QelMessageValidationException("the response is too short");
-    }
-    Payload payload;
-    std::memcpy(&payload, message.getData(), sizeof(payload));
-    return payload;
-}
 
 Answer describeVersion(const QelMessage& message)
 {
@@ -78,41 +38,29 @@ Answer describeCapabilities(const QelMessage& message)
 
 Answer describeLimits(const QelMessage& message)
 {
-    const auto limits = payloadOf<LimitsPayload>(message);
+    const auto response = readResponse<QelMessageGetInterfaceLimitsRsp>(message.clone());
+    const InterfaceLimits limits = limitsOf(*response);
     Answer answer;
-    answer.add("maxCommandSize", "Largest command (bytes)", limits.maxCommandSize.value());
-    answer.add("maxHypervisorCommandSize", "Largest hypervisor command (bytes)", limits.maxKrogCommandSize.value());
-    answer.add("broadcastPacketSize", "Largest broadcast (bytes)", limits.broadcastSize.value());
-    answer.add("consolesSupported", "Consoles supported", limits.daxsSupported);
-    answer.add("nonpersistentLocksSupported", "Nonpersistent locks supported", limits.nonpersistentLocks.value());
-    answer.add("persistentLocksSupported", "Persistent locks supported", limits.persistentLocks.value());
+    answer.add("maxCommandSize", "Largest command (bytes)", limits.largestCommand);
+    answer.add("maxHypervisorCommandSize", "Largest hypervisor command (bytes)", limits.largestHypervisorCommand);
+    answer.add("broadcastPacketSize", "Largest broadcast (bytes)", limits.largestBroadcast);
+    answer.add("consolesSupported", "Consoles supported", limits.consoles);
+    answer.add("nonpersistentLocksSupported", "Nonpersistent locks supported", limits.nonpersistentLocks);
+    answer.add("persistentLocksSupported", "Persistent locks supported", limits.persistentLocks);
     return answer;
 }
 
-/// BCD has a decimal digit in each half byte.
-void requireDecimalDigits(const QelMessage& message)
-{
-    constexpr std::size_t kDigitBytes = offsetof(TimePayload, reserved);
-    const char* const bytes = message.getData();
-    const bool isDecimal = std::all_of(bytes, bytes + kDigitBytes, [](char c) {
-        const auto byte = static_cast<unsigned char>(c);
-        return (byte >> 4) <= 9 && (byte & 0x0F) <= 9;
-    });
-    if (!isDecimal) {
-        const std::string hex = hexDigits(std::string(bytes, kDigitBytes));
-        throw QelMessageValidationException("the time of day has digits above 9: " + hex);
-    }
-}
-
+/// Prints what the server says, leap seconds included, so it does not go through a time_t.
 Answer describeTime(const QelMessage& message)
 {
-    const auto time = payloadOf<TimePayload>(message);
-    requireDecimalDigits(message);
+    const auto response = readResponse<QelMessageGetQelTodRsp>(message.clone());
+    QelMessageGetQelTodRsp::Data time;
+    std::memcpy(&time, response->getData(), sizeof(time));
     char text[64];
-    std::snprintf(text, sizeof(text), "%04u-%02u-%02uT%02u:%02u:%02uZ", static_cast<unsigned>(time.year.value()),
-                  static_cast<unsigned>(time.month.value()), static_cast<unsigned>(time.day.value()),
-                  static_cast<unsigned>(time.hour.value()), static_cast<unsigned>(time.minute.value()),
-                  static_cast<unsigned>(time.second.value()));
+    std::snprintf(text, sizeof(text), "%04u-%02u-%02uT%02u:%02u:%02uZ", static_cast<unsigned>(time.mYear.value()),
+                  static_cast<unsigned>(time.mMonth.value()), static_cast<unsigned>(time.mDay.value()),
+                  static_cast<unsigned>(time.mHour.value()), static_cast<unsigned>(time.mMinute.value()),
+                  static_cast<unsigned>(time.mSecond.value()));
     Answer answer;
     answer.add("time", "Time of day (UTC)", text);
     return answer;

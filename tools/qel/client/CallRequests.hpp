@@ -24,7 +24,7 @@ struct CallRequest {
     bool needsSession = false;           ///< the hypervisor session must be open
 
     /// Reads a response with status zero.
-    /// @throws QelMessageValidationException  the payload is malformed
+    /// @throws QelMessageValidationException, ProtocolBroken  the payload is malformed
     std::function<Answer(const QelMessage&)> describe;
 };
 

@@ -1,10 +1,16 @@
 #include "client/ConnectOptions.hpp"
 
+#include <qel/common/net/IPEndpoint.hpp>
+#include <qel/common/util/TimeProvider.hpp>
+#include <qel/protocol/ServerAddress.hpp>
+
+#include "base/Failures.hpp"
 #include "base/OptionChecks.hpp"
 
+#include <algorithm>
 #include <cstddef>
 #include <limits>
-#include <unistd.h>
+#include <stdexcept>
 
 namespace qel::tool {
 
@@ -13,6 +19,17 @@ namespace {
 constexpr std::size_t kToolIdBytes = 32;
 constexpr double kMinTimeout = 0.001;
 constexpr double kMaxTimeout = 24 * 60 * 60;
+
+/// True when the host has to be looked up.
+bool isHostName(const std::string& server)
+{
+    try {
+        static_cast<void>(IPEndpoint(server));
+        return false;
+    } catch (const std::exception&) {
+        return true;
+    }
+}
 
 } // namespace
 
@@ -23,10 +40,10 @@ std::chrono::milliseconds ConnectOptions::timeout() const
 
 void addConnectOptions(CLI::App& app, ConnectOptions& options)
 {
-    app.add_option("--connect", options.endpoint, "Server to connect to: 127.0.0.1:PORT or [::1]:PORT")
+    app.add_option("--connect", options.server, "Server to connect to: NAME:PORT, 127.0.0.1:PORT or [::1]:PORT")
         ->required()
-        ->type_name("ENDPOINT")
-        ->check(endpointValidator());
+        ->type_name("SERVER")
+        ->check(serverValidator());
     addTransportOptions(app, options.transport);
     app.add_option("--timeout", options.timeoutSeconds, "Timeout in seconds for connecting and all responses together")
         ->type_name("SECONDS")
@@ -40,11 +57,33 @@ void addConnectOptions(CLI::App& app, ConnectOptions& options)
         ->check(textUpTo(kToolIdBytes));
 }
 
-IdentityOptions completeIdentity(const IdentityOptions& options)
+void checkConnect(const ConnectOptions& options)
 {
-    IdentityOptions identity = options;
-    if (identity.toolId.empty()) identity.toolId = "qel-" + std::to_string(::getpid());
-    return identity;
+    checkCredentials(options.transport);
+    if (!isHostName(options.server)) checkPlain(options.transport, options.server);
+}
+
+std::chrono::milliseconds timeLeft(std::chrono::steady_clock::time_point end)
+{
+    const auto left = std::chrono::duration_cast<std::chrono::milliseconds>(end - TimeProvider::steady());
+    return std::max(left, std::chrono::milliseconds(0));
+}
+
+Console connectConsole(const ConnectOptions& options)
+{
+    ConsoleOptions library(options.server);
+    library.credentials = loadCredentials(options.transport);
+    library.plain = options.transport.plain;
+    library.pins = options.transport.pins;
+    library.identity = options.identity;
+    library.handshakeTimeout = options.transport.handshakeTimeout();
+    library.requestTimeout = options.timeout();
+    library.frameTimeout = options.timeout();
+    try {
+        return Console(library, options.timeout());
+    } catch (const std::invalid_argument&) { // the one mistake that the parser cannot see
+        throw CommandFailure(ExitStatus::Usage, plainRefusal(options.server));
+    }
 }
 
 } // namespace qel::tool

@@ -1,26 +1,23 @@
 #pragma once
 
+#include <qel/protocol/Console.hpp>
+#include <qel/protocol/ConsoleOptions.hpp>
+
+#include "base/Library.hpp"
 #include "transport/TransportOptions.hpp"
 
 #include <CLI/CLI.hpp>
 #include <chrono>
-#include <cstdint>
 #include <string>
 
 namespace qel::tool {
 
-/// The identity of this console. A hypervisor refuses a second console with the same type and id.
-struct IdentityOptions {
-    std::uint32_t toolType = 1;
-    std::string toolId; ///< at most 32 bytes; empty: "qel-" and the process id
-};
-
 /// How to reach the server.
 struct ConnectOptions {
-    std::string endpoint; ///< as IPEndpoint takes it
+    std::string server; ///< as ServerAddress::parse() takes it
     TransportOptions transport;
     double timeoutSeconds = 10; ///< for connecting and all responses together
-    IdentityOptions identity;
+    Identity identity;
 
     std::chrono::milliseconds timeout() const;
 };
@@ -28,7 +25,18 @@ struct ConnectOptions {
 /// Adds --connect, --timeout, --tool-type, --tool-id and the options of the transport.
 void addConnectOptions(CLI::App& app, ConnectOptions& options);
 
-/// The identity with the defaults filled in.
-IdentityOptions completeIdentity(const IdentityOptions& options);
+/// Checks that the options select TLS or --plain, and --plain for a loopback address only. The addresses of a host name
+/// are checked when it is looked up. Call it in the parser's callback, where its exception becomes a usage error.
+/// @throws CLI::ValidationError
+void checkConnect(const ConnectOptions& options);
+
+/// Connects within the timeout. Each request and each message of the console has the timeout too.
+/// @throws CommandFailure  Usage: --plain, and the host name has an address that is not a loopback address
+/// @throws FileIOError, CredentialsUnusable  the credentials cannot be used
+/// @throws Error  as the constructor of Console
+Console connectConsole(const ConnectOptions& options);
+
+/// The rest of a timeout for several steps together; 0 when it has passed.
+std::chrono::milliseconds timeLeft(std::chrono::steady_clock::time_point end);
 
 } // namespace qel::tool

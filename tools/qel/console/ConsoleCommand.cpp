@@ -1,22 +1,27 @@
 #include "console/ConsoleCommand.hpp"
 
-#include <qel/common/io/StreamIOException.hpp>
+#include <qel/common/QelMessageDax.hpp>
+#include <qel/common/util/TimeProvider.hpp>
+#include <qel/protocol/Console.hpp>
+#include <qel/protocol/Error.hpp>
+#include <qel/protocol/SerialSession.hpp>
 #include <qel/protocol/Text.hpp>
 
 #include "base/Failures.hpp"
 #include "base/Library.hpp"
 #include "base/Logging.hpp"
 #include "base/OptionChecks.hpp"
+#include "base/RefusalReason.hpp"
 #include "base/SignalWatch.hpp"
 #include "base/TerminalMode.hpp"
-#include "client/ClientConnection.hpp"
 #include "client/ConnectOptions.hpp"
 #include "console/ConsoleLoop.hpp"
 #include "console/ConsoleScreen.hpp"
-#include "console/ConsoleSession.hpp"
 #include "console/EscapeFilter.hpp"
 
+#include <chrono>
 #include <csignal>
+#include <cstdint>
 #include <initializer_list>
 #include <iostream>
 #include <memory>
@@ -44,11 +49,11 @@ Exit status: 0 the command ended, or you left; 1 a request was refused, the serv
 console took the session; 2 usage error; 3 cannot connect; 4 failure on this machine; 5 the server broke the protocol;
 6 timeout; 7 the server shut down or the connection was lost.)";
 
-struct ConsoleOptions {
+struct CommandOptions {
     ConnectOptions connect;
     LogOptions log;
-    ConsoleSession::Address address;
-    bool force = false;
+    std::uint16_t partition = 0;
+    SerialOptions serial;
     bool noEof = false;
     std::string escape = "~";
     std::optional<double> lingerSeconds;
@@ -83,7 +88,7 @@ std::string checkEscape(std::string& text)
     return {};
 }
 
-InputOptions ConsoleOptions::inputOptions() const
+InputOptions CommandOptions::inputOptions() const
 {
     InputOptions options;
     options.escape = parseEscape(escape);
@@ -95,30 +100,37 @@ InputOptions ConsoleOptions::inputOptions() const
     return options;
 }
 
-ConsoleLoop::Outcome join(ConsoleSession& session, ConsoleScreen& screen, TerminalMode& mode,
+ConsoleLoop::Outcome join(Console& console, SerialSession& session, ConsoleScreen& screen, TerminalMode& mode,
                           const InputOptions& options)
 {
     // Signals are watched only while the terminal may have to be restored. At all other times they end this process at
     // once.
     SignalWatch signals(kSignals);
-    ConsoleLoop loop(session, screen, STDIN_FILENO, mode, signals, options);
+    ConsoleLoop loop(console, session, screen, STDIN_FILENO, mode, signals, options);
     return loop.run();
 }
 
-/// Runs the session from opening to closing.
-ConsoleLoop::Outcome runSession(ClientConnection& connection, ConsoleSession& session, ConsoleScreen& screen,
-                                TerminalMode& mode, const ConsoleOptions& options)
+/// Closes the serial session and the hypervisor session, as far as they are open.
+void close(Console& console, SerialSession& session, ConsoleScreen& screen)
 {
-    try {
-        session.open(options.force);
-        const ConsoleLoop::Outcome outcome = join(session, screen, mode, options.inputOptions());
-        // After a signal the process ends without further requests; the hypervisor closes its sessions.
-        if (outcome.reason != ConsoleLoop::ExitReason::Signal) session.close();
-        connection.leave();
-        return outcome;
-    } catch (...) {
-        connection.leave();
-        throw;
+    session.close();
+    screen.showOutput(session);
+    if (session.getEnd() == SessionEnd::ShutDown || session.getEnd() == SessionEnd::ConnectionClosed) return;
+    console.closeSession();
+}
+
+/// The exit status of this command when its session ended this way.
+ExitStatus exitStatusOf(SessionEnd end)
+{
+    switch (end) {
+    case SessionEnd::None:
+    case SessionEnd::Closed:
+    case SessionEnd::CommandEnded:
+        return ExitStatus::Done;
+    case SessionEnd::Taken:
+        return ExitStatus::Refused;
+    default:
+        return ExitStatus::ClosedByPeer;
     }
 }
 
@@ -129,20 +141,20 @@ ConsoleLoop::Outcome runSession(ClientConnection& connection, ConsoleSession& se
     throw CommandFailure(ExitStatus::Failed, "signal " + std::to_string(signal) + " did not end this process");
 }
 
-ExitStatus conclude(const ConsoleLoop::Outcome& outcome, const ConsoleSession& session, ConsoleScreen& screen,
-                    const TerminalMode& mode)
+ExitStatus conclude(const ConsoleLoop::Outcome& outcome, SessionEnd end, const std::string& endText,
+                    const CommandOptions& options, ConsoleScreen& screen, const TerminalMode& mode)
 {
     switch (outcome.reason) {
     case ConsoleLoop::ExitReason::Signal:
         endBy(outcome.signal);
     case ConsoleLoop::ExitReason::Left:
         screen.output().writeSome();
-        if (mode.isTerminal()) screen.say("left partition " + std::to_string(session.getAddress().partition));
+        if (mode.isTerminal()) screen.say("left partition " + std::to_string(options.partition));
         return ExitStatus::Done;
     case ConsoleLoop::ExitReason::Ended:
         screen.output().flush();
-        screen.say(session.describeEnd());
-        return exitStatusOf(session.getEnd());
+        screen.say(endText);
+        return exitStatusOf(end);
     default:
         screen.output().flush();
         return ExitStatus::Done;
@@ -156,24 +168,48 @@ std::string timeoutText(const ConnectOptions& options)
     return text.str();
 }
 
-ExitStatus runConsole(const ConsoleOptions& options)
+/// Runs the session from opening to closing.
+/// @param openEnd  by when it must be open
+ExitStatus runSession(Console& console, ConsoleScreen& screen, TerminalMode& mode, const CommandOptions& options,
+                      std::chrono::steady_clock::time_point openEnd)
+{
+    SerialSession session = console.openSerial(options.partition, options.serial, timeLeft(openEnd));
+    const ConsoleLoop::Outcome outcome = join(console, session, screen, mode, options.inputOptions());
+    const SessionEnd end = session.getEnd();
+    const std::string endText = session.describeEnd();
+    // After a signal the process ends without further requests; the hypervisor closes its sessions.
+    if (outcome.reason != ConsoleLoop::ExitReason::Signal) close(console, session, screen);
+    console.leave();
+    return conclude(outcome, end, endText, options, screen, mode);
+}
+
+ExitStatus runConsole(const CommandOptions& options)
 {
     startLogging(options.log, "qel-console.log");
     static_cast<void>(std::signal(SIGPIPE, SIG_IGN)); // the terminal must be restored even when the output is closed
     TerminalMode mode(STDIN_FILENO);
     ConsoleScreen screen(STDOUT_FILENO, std::cerr, ::isatty(STDERR_FILENO) == 1, mode);
-    const auto connection = connectConsole(options.connect);
+    const auto openEnd = TimeProvider::steady() + options.connect.timeout();
+    Console console = connectConsole(options.connect);
+    console.onNotice<QelMessageDaxBroadcastOutboundAsync>(
+        [&screen](const QelMessageDaxBroadcastOutboundAsync& broadcast) { screen.showBroadcast(broadcast); });
+    console.onOtherNotice([](const QelMessage& notice) { logLine(LogLevel::Warn, "ignored ", notice.getLogID()); });
     try {
-        ConsoleSession session(*connection, options.address, options.connect.timeout(), screen);
-        const ConsoleLoop::Outcome outcome = runSession(*connection, session, screen, mode, options);
-        return conclude(outcome, session, screen, mode);
-    } catch (const StreamIOException& error) {
-        if (exitStatusOf(error) != ExitStatus::DeadlinePassed) throw;
-        throw CommandFailure(ExitStatus::DeadlinePassed, timeoutText(options.connect) + explain(error));
+        return runSession(console, screen, mode, options, openEnd);
+    } catch (const StatusError& refusal) {
+        console.leave();
+        throw CommandFailure(ExitStatus::Refused,
+                             refusalText(refusal.getResponse(), "partition " + std::to_string(options.partition)));
+    } catch (const DeadlinePassed& error) {
+        console.leave();
+        throw CommandFailure(ExitStatus::DeadlinePassed, timeoutText(options.connect) + error.what());
+    } catch (...) {
+        console.leave();
+        throw;
     }
 }
 
-void addEscape(CLI::App& command, ConsoleOptions& options)
+void addEscape(CLI::App& command, CommandOptions& options)
 {
     command
         .add_option("--escape", options.escape,
@@ -184,7 +220,7 @@ void addEscape(CLI::App& command, ConsoleOptions& options)
         ->capture_default_str();
 }
 
-void addInputOptions(CLI::App& command, ConsoleOptions& options)
+void addInputOptions(CLI::App& command, CommandOptions& options)
 {
     command.add_flag("--no-eof", options.noEof, "Do not send an end-of-file character at the end of the input");
     command
@@ -200,8 +236,8 @@ void addInputOptions(CLI::App& command, ConsoleOptions& options)
 CLI::App& addConsoleCommand(CLI::App& parent, Action& action)
 {
     CLI::App& command = addCommand(parent, "console", "Connect the terminal to the serial console of a partition");
-    const auto options = std::make_shared<ConsoleOptions>();
-    command.add_option("partition", options->address.partition, "Partition id")
+    const auto options = std::make_shared<CommandOptions>();
+    command.add_option("partition", options->partition, "Partition id")
         ->required()
         ->type_name("PARTITION")
         ->transform(integerIn(0, 65535));
@@ -209,11 +245,11 @@ CLI::App& addConsoleCommand(CLI::App& parent, Action& action)
     describeOption(command, "--timeout",
                    "Timeout in seconds: one for connecting and opening the session, then one for each response and "
                    "for each message once it has begun");
-    command.add_option("--connection", options->address.connection, "Serial connection of the partition")
+    command.add_option("--connection", options->serial.connection, "Serial connection of the partition")
         ->type_name("N")
         ->transform(integerIn(0, 65535))
         ->capture_default_str();
-    command.add_flag("--force", options->force, "Take the session from the console that holds it");
+    command.add_flag("--force", options->serial.force, "Take the session from the console that holds it");
     addEscape(command, *options);
     addInputOptions(command, *options);
     options->log.usual = LogLevel::Warn;
@@ -221,7 +257,7 @@ CLI::App& addConsoleCommand(CLI::App& parent, Action& action)
     addLogOptions(command, options->log);
     command.footer(kFooter);
     command.callback([&action, options] {
-        checkTransport(options->connect.transport, options->connect.endpoint);
+        checkConnect(options->connect);
         action = [options] { return runConsole(*options); };
     });
     return command;

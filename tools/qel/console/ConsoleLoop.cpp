@@ -1,10 +1,8 @@
 #include "console/ConsoleLoop.hpp"
 
-#include <qel/common/io/StreamIOException.hpp>
 #include <qel/common/util/PosixError.hpp>
 #include <qel/common/util/TimeProvider.hpp>
-
-#include "base/Failures.hpp"
+#include <qel/protocol/Error.hpp>
 
 #include <array>
 #include <cerrno>
@@ -52,10 +50,10 @@ void stop()
 
 } // namespace
 
-ConsoleLoop::ConsoleLoop(ConsoleSession& session, ConsoleScreen& screen, int input, TerminalMode& mode,
+ConsoleLoop::ConsoleLoop(Console& console, SerialSession& session, ConsoleScreen& screen, int input, TerminalMode& mode,
                          SignalWatch& signals, const InputOptions& options)
-    : mSession(session), mScreen(screen), mInput(input), mMode(mode), mSignals(signals), mInputOptions(options),
-      mEscape(options.escape)
+    : mConsole(console), mSession(session), mScreen(screen), mInput(input), mMode(mode), mSignals(signals),
+      mInputOptions(options), mEscape(options.escape)
 {}
 
 ConsoleLoop::Outcome ConsoleLoop::run()
@@ -65,6 +63,7 @@ ConsoleLoop::Outcome ConsoleLoop::run()
         mScreen.say("connected; " + characterName(*mInputOptions.escape) +
                     "? at the start of a line lists the commands");
     }
+    mScreen.showOutput(mSession);
     while (!pIsDone())
         pPollOnce();
     if (mFailure && mOutcome.reason == ExitReason::Ended) std::rethrow_exception(mFailure);
@@ -103,8 +102,8 @@ PollDeadline ConsoleLoop::pDeadline() const
 void ConsoleLoop::pPollOnce()
 {
     const PollFd input(mInput, PollEvents::Read);
-    const PollFd messages = mSession.getPollFd(PollEvents::Read);
-    const PollFd sending = mSession.getPollFd(PollEvents::Write);
+    const PollFd messages = mConsole.getPollFd(PollEvents::Read);
+    const PollFd sending = mConsole.getPollFd(PollEvents::Write);
     const PollFd output = mScreen.output().getPollFd();
 
     // Poll only for events that are handled now. An event that is left unhandled would make this a busy loop.
@@ -114,7 +113,7 @@ void ConsoleLoop::pPollOnce()
     if (pWantsToSend()) set += sending;
     if (!mScreen.output().isEmpty()) set += output;
     // TLS may hold received bytes while the socket has none.
-    const bool isPending = pWantsMessages() && mSession.hasPending();
+    const bool isPending = pWantsMessages() && mConsole.hasPending();
     const auto timeout = pDeadline().getTimeout(TimeProvider::steady());
     const PollResult ready = isPending ? set.poll() : set.wait(timeout);
 
@@ -152,11 +151,12 @@ void ConsoleLoop::pWriteOutput()
 void ConsoleLoop::pReceive()
 {
     try {
-        mSession.receive();
+        static_cast<void>(mConsole.process());
     } catch (...) {
-        mFailure = std::current_exception();
+        if (mSession.getEnd() == SessionEnd::None) mFailure = std::current_exception();
         pExit(ExitReason::Ended);
     }
+    mScreen.showOutput(mSession);
     if (mSession.getEnd() != SessionEnd::None) pExit(ExitReason::Ended);
 }
 
@@ -166,13 +166,13 @@ void ConsoleLoop::pSend()
 {
     try {
         mQuietSince = TimeProvider::steady();
-        mSession.send(mPending);
-    } catch (const StreamIOException& error) {
+        mSession.writeSome(mPending);
+    } catch (const Error& error) {
         // A hypervisor that closes the connection may have sent the reason. Without TLS it can still be read.
         mPending.clear();
         mInputOpen = false;
         mSendBroken = true;
-        if (exitStatusOf(error) != ExitStatus::DeadlinePassed && mSession.outlivesFailedSend()) return;
+        if (dynamic_cast<const DeadlinePassed*>(&error) == nullptr && !mConsole.isProtected()) return;
         mFailure = std::current_exception();
         pExit(ExitReason::Ended);
     }
@@ -180,7 +180,7 @@ void ConsoleLoop::pSend()
 
 void ConsoleLoop::pReadInput()
 {
-    std::array<char, ConsoleSession::kMaxData> buffer;
+    std::array<char, SerialSession::kMaxData> buffer;
     const ssize_t count = ::read(mInput, buffer.data(), buffer.size());
     const int error = errno;
     if (count > 0) return pTakeTyped(buffer.data(), static_cast<std::size_t>(count));
@@ -212,7 +212,7 @@ void ConsoleLoop::pExecute(EscapeFilter::Command command)
         break;
     }
     // Characters typed before the command still go to the partition if it takes them at once.
-    if (!mPending.empty() && PollSet(mSession.getPollFd(PollEvents::Write)).poll().anyReady()) pSend();
+    if (!mPending.empty() && PollSet(mConsole.getPollFd(PollEvents::Write)).poll().anyReady()) pSend();
     pExit(ExitReason::Left);
 }
 

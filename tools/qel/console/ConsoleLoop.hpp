@@ -1,11 +1,13 @@
 #pragma once
 
 #include <qel/common/util/Poll.hpp>
+#include <qel/protocol/Console.hpp>
+#include <qel/protocol/SerialSession.hpp>
 
+#include "base/Library.hpp"
 #include "base/SignalWatch.hpp"
 #include "base/TerminalMode.hpp"
 #include "console/ConsoleScreen.hpp"
-#include "console/ConsoleSession.hpp"
 #include "console/EscapeFilter.hpp"
 
 #include <chrono>
@@ -50,7 +52,7 @@ public:
         None,     ///< still running
         Left,     ///< the user left, or the terminal hung up
         Lingered, ///< the linger time passed
-        Ended,    ///< the session ended: see ConsoleSession::getEnd()
+        Ended,    ///< the session ended: see SerialSession::getEnd()
         Signal,   ///< a termination signal arrived
     };
     struct Outcome {
@@ -61,17 +63,17 @@ public:
     /// Time without output after which the end-of-file character is repeated.
     static constexpr std::chrono::milliseconds kEndRepeat{1000};
 
+    /// @param console  that of the session; its notices go to the handlers that it has
     /// @param input  descriptor to read from
     /// @param mode  the terminal mode of `input`
     /// @param signals  watches the termination signals, SIGTSTP and SIGCONT. Signals that the process inherited as
     ///        ignored stay ignored.
-    ConsoleLoop(ConsoleSession& session, ConsoleScreen& screen, int input, TerminalMode& mode, SignalWatch& signals,
-                const InputOptions& options);
+    ConsoleLoop(Console& console, SerialSession& session, ConsoleScreen& screen, int input, TerminalMode& mode,
+                SignalWatch& signals, const InputOptions& options);
 
     /// Moves bytes until there is a reason to exit. On return the terminal is restored and all output has been written.
     /// After ExitReason::Left and Signal some output may be dropped, since these do not wait for the screen.
-    /// @throws CommandFailure, StreamIOException, QelMessageValidationException  the session failed; output received
-    ///         before the failure has been written
+    /// @throws Error  the session failed; output received before the failure has been written
     /// @throws PosixError  reading the input or writing the output failed
     Outcome run();
 
@@ -95,7 +97,8 @@ private:
     void pCheckTimers();
     void pExit(ExitReason reason);
 
-    ConsoleSession& mSession;
+    Console& mConsole;
+    SerialSession& mSession;
     ConsoleScreen& mScreen;
     const int mInput;
     TerminalMode& mMode;

@@ -4,6 +4,8 @@
 
 #include "base/Library.hpp"
 
+#include <array>
+#include <cstddef>
 #include <unistd.h>
 
 namespace qel::tool {
@@ -22,9 +24,14 @@ void ConsoleScreen::say(const std::string& text)
 
 const char* ConsoleScreen::lineEnd() const { return mErrorsOnTerminal && mMode.isRaw() ? "\r\n" : "\n"; }
 
-void ConsoleScreen::onOutput(const char* data, std::size_t length) { mOutput.append(data, length); }
+void ConsoleScreen::showOutput(SerialSession& session)
+{
+    std::array<char, SerialSession::kMaxData> buffer;
+    while (const std::size_t count = session.readAvailable(buffer.data(), buffer.size()))
+        mOutput.append(buffer.data(), count);
+}
 
-void ConsoleScreen::onBroadcast(const QelMessageDaxBroadcastOutboundAsync& broadcast)
+void ConsoleScreen::showBroadcast(const QelMessageDaxBroadcastOutboundAsync& broadcast)
 {
     const std::string text(broadcast.getDaxPacket(), broadcast.getBroadcastMsgLen());
     say("broadcast from tool type " + std::to_string(broadcast.getSenderToolType()) + ", " +

@@ -1,8 +1,11 @@
 #pragma once
 
+#include <qel/common/QelMessageDax.hpp>
+#include <qel/protocol/SerialSession.hpp>
+
 #include "base/DescriptorOutput.hpp"
+#include "base/Library.hpp"
 #include "base/TerminalMode.hpp"
-#include "console/ConsoleSession.hpp"
 
 #include <ostream>
 #include <string>
@@ -12,7 +15,7 @@ namespace qel::tool {
 /// What the user of a console sees: the partition's output unchanged, and the messages of this program, each on a line
 /// of its own.
 /// Thread safety: one thread.
-class ConsoleScreen final : public ConsoleSession::Receiver {
+class ConsoleScreen {
 public:
     /// Borrows its arguments.
     /// @param output  descriptor for the partition's output
@@ -29,11 +32,11 @@ public:
     /// The buffer of the partition's output.
     DescriptorOutput& output() noexcept { return mOutput; }
 
-    /// Appends the data to output().
-    void onOutput(const char* data, std::size_t length) override;
+    /// Appends to output() what the session has received.
+    void showOutput(SerialSession& session);
 
-    /// Prints sender and text, with control characters escaped.
-    void onBroadcast(const QelMessageDaxBroadcastOutboundAsync& broadcast) override;
+    /// Prints sender and text of a broadcast of another console, with control characters escaped.
+    void showBroadcast(const QelMessageDaxBroadcastOutboundAsync& broadcast);
 
 private:
     DescriptorOutput mOutput;

@@ -86,14 +86,28 @@ void addTransportOptions(CLI::App& app, TransportOptions& options)
 
 void checkTransport(const TransportOptions& options, const std::string& endpoint)
 {
+    checkCredentials(options);
+    checkPlain(options, endpoint);
+}
+
+void checkCredentials(const TransportOptions& options)
+{
     const bool hasCredentials = !options.directory.empty() || !options.files.certificate.empty();
     if (!options.plain && !hasCredentials) {
         throw CLI::ValidationError("credentials are missing: give --credentials DIR --name NAME, or --cert, --key and "
                                    "--root, or --plain for a loopback address");
     }
-    if (options.plain && !isLoopback(IPEndpoint(endpoint).getAddress())) {
-        throw CLI::ValidationError("--plain is refused for " + endpoint + ": it is not a loopback address");
-    }
+}
+
+void checkPlain(const TransportOptions& options, const std::string& endpoint)
+{
+    if (!options.plain || isLoopback(IPEndpoint(endpoint).getAddress())) return;
+    throw CLI::ValidationError(plainRefusal(endpoint));
+}
+
+std::string plainRefusal(const std::string& server)
+{
+    return "--plain is refused for " + server + ": it is not a loopback address";
 }
 
 std::optional<Credentials> loadCredentials(const TransportOptions& options)

@@ -41,6 +41,13 @@ void addTransportOptions(CLI::App& app, TransportOptions& options);
 /// @throws CLI::ValidationError
 void checkTransport(const TransportOptions& options, const std::string& endpoint);
 
+/// The two parts of it.
+void checkCredentials(const TransportOptions& options);
+void checkPlain(const TransportOptions& options, const std::string& endpoint);
+
+/// The line for the user when --plain is refused.
+std::string plainRefusal(const std::string& server);
+
 /// Reads the credentials from their files as they are now.
 /// @return none for a plain connection
 /// @throws FileIOError, CredentialsUnusable  as Credentials::fromFiles()
