@@ -3,10 +3,14 @@
 #include <qel/common/QelMessageExceptions.hpp>
 #include <qel/common/util/TimeProvider.hpp>
 #include <qel/protocol/Error.hpp>
+#include <qel/protocol/Handshake.hpp>
 #include <qel/protocol/Logging.hpp>
 #include <qel/protocol/MessageRegistry.hpp>
 
+#include "base/Guard.hpp"
 #include "base/StreamFailure.hpp"
+#include "base/Threads.hpp"
+#include "server/QuietLog.hpp"
 
 #include <poll.h>
 #include <utility>
@@ -23,91 +27,173 @@ PollFd hangUpOf(int descriptor)
     return fd;
 }
 
+std::unique_ptr<Stream> protect(std::unique_ptr<Stream> stream, SSLServerContext* context)
+{
+    if (context == nullptr) return stream;
+    return std::make_unique<SSLStream>(*context, std::move(stream));
+}
+
 } // namespace
 
-Connection::Connection(HypervisorEngine& hypervisor, std::unique_ptr<Stream> stream, int descriptor, std::string peer,
-                       ConnectionLimits limits, std::function<void()> onEnd)
-    : Outbox(limits.queueBytes), mHypervisor(hypervisor), mStream(std::move(stream)), mHangUp(hangUpOf(descriptor)),
-      mPeer(std::move(peer)), mLimits(limits), mOnEnd(std::move(onEnd)), mMessages(*mStream, messageRegistry())
-{}
+Connection::Connection(const ConnectionServices& services, ServedStream stream, SSLServerContext* context,
+                       HandshakePlaces::Place place)
+    : Outbox(services.limits.queueBytes), mServices(services), mAddress(std::move(stream.address)),
+      mSource(std::move(stream.source)), mHangUp(hangUpOf(stream.descriptor)), mPlace(std::move(place)),
+      mClear(*stream.stream), mStream(protect(std::move(stream.stream), context)),
+      mFrames(*mStream, context == nullptr ? FrameStream::ReadAhead::Yes : FrameStream::ReadAhead::No),
+      mMessages(mFrames, messageRegistry()), mName(mAddress)
+{
+    if (context == nullptr) return;
+    auto& tls = static_cast<SSLStream&>(*mStream);
+    mAdmission.emplace(mServices.hypervisor, mClear, stream.descriptor, tls, mWake, mServices.pins);
+}
 
 Connection::~Connection()
 {
     if (!mEnded) abort();
-    if (mReader.joinable()) mReader.join();
+    // The thread that is joined may start the next one, so they are joined in the order in which they start.
+    pJoinHandshake();
+    std::thread reader;
+    {
+        const MutexLock lock(mThreadsMutex);
+        reader.swap(mReader);
+    }
+    if (reader.joinable()) reader.join();
     if (mWriter.joinable()) mWriter.join();
 }
 
 void Connection::start()
 {
-    mHandshake = TimeProvider::steady() + mLimits.handshake;
-    mStream->setReadDeadline(mLimits.handshake);
-    Peer peer;
-    peer.address = mPeer;
-    mId = mHypervisor.connect(*this, std::move(peer));
+    mHandshake = TimeProvider::steady() + mServices.limits.handshake;
+    LogThrottle::Scope scope(mServices.throttle, mSource);
     try {
-        mWriter = std::thread([this] { pWrite(); });
-        mReader = std::thread([this] { pRead(); });
+        if (mAdmission) {
+            const MutexLock lock(mThreadsMutex);
+            mHandshaker = startThread([this] { pHandshake(); });
+        } else {
+            pConnect({}); // here, so that connections are numbered in the order in which they came
+            pStartReader();
+        }
     } catch (...) {
-        mHypervisor.disconnect(mId);
-        abandon();
-        mEnded = true;
+        pFinish();
         throw;
     }
 }
 
-void Connection::abort()
+void Connection::stop()
 {
-    abandon();
-    pCloseStream();
+    if (mAdmission) mAdmission->stop();
 }
 
-void Connection::dumpStatistics(std::ostream& os) const
+void Connection::abort() noexcept
 {
-    os << "Queue of console " << mId << ", " << mPeer << ":\n";
+    abandon();
+    pClose();
+}
+
+bool Connection::dumpStatistics(std::ostream& os) const
+{
+    const ConsoleId id = mId;
+    if (id == 0) return false;
+    os << "Queue of console " << id << ", " << mAddress << ":\n";
     Outbox::dumpStatistics(os, Indent(2, ' '));
+    return true;
 }
 
 void Connection::resumeReading() { mWake.interrupt(); }
 
+void Connection::pConnect(const PeerIdentity& identity)
+{
+    Peer peer;
+    static_cast<PeerIdentity&>(peer) = identity;
+    peer.address = mAddress;
+    peer.isProtected = mAdmission.has_value();
+    mId = mServices.hypervisor.connect(*this, std::move(peer));
+    mName = "console " + std::to_string(mId);
+}
+
+void Connection::pHandshake() noexcept
+{
+    const LogThrottle::Scope scope(mServices.throttle, mSource);
+    try {
+        pAdmit();
+        pStartReader();
+    } catch (...) {
+        pReportFailure();
+        pFinish();
+    }
+}
+
+void Connection::pAdmit()
+{
+    const PeerIdentity identity = mAdmission->run(mHandshake);
+    logLine(LogLevel::Info, mAddress, ": over TLS: ", describePeer(identity));
+    pConnect(identity);
+}
+
+void Connection::pStartReader()
+{
+    const MutexLock lock(mThreadsMutex);
+    mReader = startThread([this] { pRead(); });
+}
+
+/// Frees the stack of the handshake, as soon as there is a reader to do so.
+void Connection::pJoinHandshake() noexcept
+{
+    std::thread handshaker;
+    {
+        const MutexLock lock(mThreadsMutex);
+        handshaker.swap(mHandshaker);
+    }
+    if (handshaker.joinable()) handshaker.join();
+}
+
 void Connection::pRead() noexcept
 {
+    LogThrottle::Scope scope(mServices.throttle, mSource);
+    pJoinHandshake();
     try {
-        pReceiveAll();
-    } catch (const QelMessageValidationException& error) {
-        logLine(LogLevel::Warn, "console ", mId, ": closed for a malformed frame: ", error.what());
-    } catch (const StreamIOException& error) {
-        pReport(error);
-    } catch (const std::exception& error) {
-        logLine(LogLevel::Error, "console ", mId, ": ", explain(error));
+        mWriter = startThread([this] { pWrite(); });
+        limitTo(*mStream, mHandshake);
+        mStream->clearWriteDeadline();
+        pReceiveAll(scope);
+    } catch (...) {
+        pReportFailure();
     }
+    scope.setPeer(mSource);
     pFinish();
 }
 
-void Connection::pReceiveAll()
+void Connection::pReceiveAll(LogThrottle::Scope& scope)
 {
-    bool identified = false;
     bool mayRead = true;
     while (mayRead || pAwaitReceive()) {
+        mFrames.beginFrame();
         const std::unique_ptr<QelMessage> message = mMessages.read();
-        const Received received = mHypervisor.receive(mId, *message);
-        const ConsoleState state = received.state;
+        const Received received = mServices.hypervisor.receive(mId, *message);
         mayRead = received.mayReadNext;
         // The hypervisor closes the connection and ignores further messages. The console may still take what is queued
         // for it, within the linger time.
-        if (state == ConsoleState::Closing && !waitUntilWritten(mLimits.linger)) abort();
-        if (!identified && state == ConsoleState::Identified) {
-            identified = true;
-            mHandshake = PollDeadline();
-            mStream->clearReadDeadline();
+        if (received.state == ConsoleState::Closing && !waitUntilWritten(mServices.limits.linger)) abort();
+        if (received.state == ConsoleState::Identified && !mHandshake.isDisabled()) {
+            pOnIdentified();
+            scope.setPeer(mName);
         }
     }
+}
+
+void Connection::pOnIdentified()
+{
+    mHandshake = PollDeadline();
+    mPlace.release();
+    mFrames.limitFrames(mServices.limits.frame);
 }
 
 /// Waits until the hypervisor takes another message. @return false: the console has hung up
 bool Connection::pAwaitReceive()
 {
-    while (!mHypervisor.mayReceive(mId)) {
+    while (!mServices.hypervisor.mayReceive(mId)) {
+        if (mClosed) return false;
         const PollSet set{mWake.getPollFd(), mHangUp};
         const auto now = TimeProvider::steady();
         if (mHandshake.isExpired(now)) throw StreamIOException("I/O deadline");
@@ -119,42 +205,63 @@ bool Connection::pAwaitReceive()
 }
 
 /// The end of the reader: the hypervisor forgets the console, and the queued messages go out within the linger time.
-void Connection::pFinish()
+void Connection::pFinish() noexcept
 {
-    mHypervisor.disconnect(mId);
-    finish();
-    if (!waitUntilWritten(mLimits.linger)) abort();
+    mPlace.release();
+    if (mId != 0) {
+        runGuarded([this] { mServices.hypervisor.disconnect(mId); }, mName);
+    }
+    if (mWriter.joinable()) {
+        finish();
+        if (!waitUntilWritten(mServices.limits.linger)) abort();
+    } else {
+        abort();
+    }
     mEnded = true;
-    mOnEnd();
+    mServices.ended.interrupt();
 }
 
-void Connection::pReport(const StreamIOException& error) const
+/// Logs the exception that is being handled.
+void Connection::pReportFailure() const noexcept
 {
-    if (isDeadline(error)) {
-        logLine(LogLevel::Warn, "console ", mId, ": closed, it did not introduce itself in time");
-    } else {
-        logLine(LogLevel::Info, "console ", mId, ": ", explain(error));
+    try {
+        throw;
+    } catch (const QelMessageValidationException& error) {
+        logQuietly(LogLevel::Warn, mName, ": closed for a malformed frame: ", error.what());
+    } catch (const StreamIOException& error) {
+        pReport(error);
+    } catch (const Error& error) {
+        logQuietly(LogLevel::Warn, mName, ": refused: ", error.what());
+    } catch (...) {
+        logCurrent(mName);
     }
+}
+
+void Connection::pReport(const StreamIOException& error) const noexcept
+{
+    if (!isDeadline(error)) return logQuietly(LogLevel::Info, mName, ": ", Explained{error});
+    logQuietly(LogLevel::Warn, mName, ": closed, it did not ",
+               mHandshake.isDisabled() ? "finish a message" : "introduce itself", " in time");
 }
 
 /// A message that waited for room is in the queue: the reader and the serial thread may have held back for it.
 void Connection::pOnRoom()
 {
     resumeReading();
-    mHypervisor.outputDrained();
+    mServices.hypervisor.outputDrained();
 }
 
 void Connection::pWrite() noexcept
 {
+    const LogThrottle::Scope scope(mServices.throttle, mSource);
     try {
         pSendAll();
     } catch (const StreamIOException& error) {
-        logLine(LogLevel::Info, "console ", mId, ": ", explain(error));
-    } catch (const std::exception& error) {
-        logLine(LogLevel::Error, "console ", mId, ": ", explain(error));
+        logQuietly(LogLevel::Info, mName, ": ", Explained{error});
+    } catch (...) {
+        logCurrent(mName);
     }
-    abandon();
-    pCloseStream(); // wakes the reader
+    abort(); // wakes the reader
     setWritten();
 }
 
@@ -164,13 +271,15 @@ void Connection::pSendAll()
         mMessages.write(*message);
 }
 
-void Connection::pCloseStream() noexcept
+void Connection::pClose() noexcept
 {
+    mClosed = true;
     try {
         mStream->close();
     } catch (const std::exception& error) {
-        logLine(LogLevel::Warn, "console ", mId, ": cannot close: ", explain(error));
+        logQuietly(LogLevel::Warn, mName, ": cannot close: ", Explained{error});
     }
+    runGuarded([this] { mWake.interrupt(); }, mName);
 }
 
 } // namespace qel::protocol

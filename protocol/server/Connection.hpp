@@ -3,16 +3,24 @@
 #include <qel/common/io/QelMessageStream.hpp>
 #include <qel/common/io/Stream.hpp>
 #include <qel/common/io/StreamIOException.hpp>
+#include <qel/common/security/SSLContext.hpp>
+#include <qel/common/security/SSLStream.hpp>
 #include <qel/common/util/Poll.hpp>
+#include <qel/protocol/PeerPins.hpp>
 #include <qel/protocol/WakeUp.hpp>
 
 #include "hypervisor/HypervisorEngine.hpp"
+#include "server/Admission.hpp"
+#include "server/FrameStream.hpp"
+#include "server/HandshakePlaces.hpp"
+#include "server/LogThrottle.hpp"
 #include "server/Outbox.hpp"
 
 #include <atomic>
 #include <chrono>
-#include <functional>
+#include <cstddef>
 #include <memory>
+#include <optional>
 #include <ostream>
 #include <string>
 #include <thread>
@@ -22,27 +30,43 @@ namespace qel::protocol {
 /// The limits of one connection.
 struct ConnectionLimits {
     std::chrono::milliseconds handshake{10000};     ///< from connecting to a granted version request
+    std::chrono::milliseconds frame{10000};         ///< for a message, once it has begun; from the granted request on
     std::chrono::milliseconds linger{2000};         ///< for the queued messages to go out when the connection ends
     std::size_t queueBytes = Outbox::kDefaultLimit; ///< queue limit, in bytes of frames; more than 0
 };
 
-/// One connection of the hypervisor end, and the hypervisor's link to its console, with two threads: the reader hands
-/// received messages to the hypervisor, and the writer sends the queued messages. Neither waits for another connection.
+/// What the connections of one server share. Borrowed by each of them.
+struct ConnectionServices {
+    HypervisorEngine& hypervisor;
+    const PeerPins& pins; ///< which consoles are admitted over TLS
+    ConnectionLimits limits;
+    LogThrottle& throttle;
+    PollInterrupt& ended; ///< interrupted when a connection has ended
+};
+
+/// A stream to a console, before anything has been transferred.
+struct ServedStream {
+    std::unique_ptr<Stream> stream; ///< not null
+    int descriptor;                 ///< of its socket; -1: it has none, and a hang-up is noticed only by reading
+    std::string address;            ///< of the console, for the log
+    std::string source;             ///< as sourceOf() names it, for the log
+};
+
+/// One connection of the hypervisor end, and the hypervisor's link to its console, with two threads: the reader
+/// protects the connection and hands received messages to the hypervisor, and the writer sends the queued messages.
+/// Neither waits for another connection.
 ///
-/// While HypervisorEngine::mayReceive() is false the reader does not read. It watches for the console to hang up
-/// instead, so that a console that has disconnected does not hold its sessions.
+/// While the hypervisor takes no message, the reader does not read. It watches for the console to hang up instead, so
+/// that a console that has disconnected does not hold its sessions.
 ///
 /// Thread safety: one thread owns it (constructor, start(), destructor); any thread may call the other operations.
 class Connection final : private Outbox {
 public:
-    /// @param hypervisor  borrowed; must outlive this object
-    /// @param stream  connected; not null
-    /// @param descriptor  of the stream's socket, watched for a hang-up; -1: none
-    /// @param peer  the console's address, for the log
-    /// @param onEnd  called once, on a thread of this connection, when hasEnded() has become true
-    /// @throws PosixError  there is no descriptor for the reader's wake-up
-    Connection(HypervisorEngine& hypervisor, std::unique_ptr<Stream> stream, int descriptor, std::string peer,
-               ConnectionLimits limits, std::function<void()> onEnd);
+    /// @param services  what it refers to is borrowed
+    /// @param context  the server's credentials, borrowed for the call; null: the connection is plain
+    /// @throws PosixError, SSLException, std::bad_alloc  something has run out
+    Connection(const ConnectionServices& services, ServedStream stream, SSLServerContext* context,
+               HandshakePlaces::Place place = {});
 
     /// Aborts the connection unless it has ended, and waits for its threads.
     ~Connection() override;
@@ -50,41 +74,64 @@ public:
     /// Starts the threads. @throws std::system_error  the system allows no more threads; the connection has ended
     void start();
 
+    /// For the end of the server, which also ends the connection at the hypervisor's side: a handshake is ended.
+    void stop();
+
     /// Cuts both directions at once; queued messages are lost.
-    void abort();
+    void abort() noexcept;
 
     /// True once the threads have nothing left to do.
     bool hasEnded() const noexcept { return mEnded; }
 
-    /// Prints a line that names the console, and the statistics of its queue, indented.
-    void dumpStatistics(std::ostream& os) const;
+    /// Prints a line that names the console, and the statistics of its queue, indented; nothing in the handshake.
+    /// @return whether something was printed
+    bool dumpStatistics(std::ostream& os) const;
 
 private:
     void resumeReading() override;
     void pOnRoom() override;
 
+    void pConnect(const PeerIdentity& identity);
+    void pHandshake() noexcept;
+    void pAdmit();
+    void pStartReader();
+    void pJoinHandshake() noexcept;
     void pRead() noexcept;
-    void pWrite() noexcept;
-    void pReceiveAll();
+    void pReceiveAll(LogThrottle::Scope& scope);
+    void pOnIdentified();
     bool pAwaitReceive();
-    void pSendAll();
-    void pFinish();
-    void pReport(const StreamIOException& error) const;
-    void pCloseStream() noexcept;
+    void pFinish() noexcept;
+    void pReportFailure() const noexcept;
+    void pReport(const StreamIOException& error) const noexcept;
 
-    HypervisorEngine& mHypervisor;
+    void pWrite() noexcept;
+    void pSendAll();
+    void pClose() noexcept;
+
+    const ConnectionServices mServices;
+    const std::string mAddress;
+    const std::string mSource;
+    const PollFd mHangUp;
+    HandshakePlaces::Place mPlace; // until the console has identified itself; of the reader
+    WakeUp mWake;                  // for the reader while it does not read
+
+    Stream& mClear; // the stream without TLS; owned by mStream
     const std::unique_ptr<Stream> mStream;
-    PollFd mHangUp;
-    const std::string mPeer;
-    const ConnectionLimits mLimits;
-    const std::function<void()> mOnEnd;
-    QelMessageStream mMessages;
-    WakeUp mWake;      // for the reader while mayReceive() is false
-    ConsoleId mId = 0; // set before the threads start
-    PollDeadline mHandshake;
+    std::optional<Admission> mAdmission; // to TLS; empty: plain
+    FrameStream mFrames;                 // over mStream
+    QelMessageStream mMessages;          // over mFrames
+
+    PollDeadline mHandshake;          // disabled: the console has identified itself; of the reader
+    std::atomic<ConsoleId> mId{0};    // 0: in the handshake
+    std::string mName;                // for the log, of the two threads: the address, later "console 1"
+    std::atomic<bool> mClosed{false}; // the stream is of no use any more
     std::atomic<bool> mEnded{false};
-    std::thread mReader;
-    std::thread mWriter;
+
+    // Guards the thread objects while threads start and join each other.
+    Mutex mThreadsMutex;
+    std::thread mHandshaker QEL_GUARDED_BY(mThreadsMutex); // joined by the reader, if it comes to that
+    std::thread mReader QEL_GUARDED_BY(mThreadsMutex);     // started by the handshaker or by start()
+    std::thread mWriter;                                   // started by the reader
 };
 
 } // namespace qel::protocol

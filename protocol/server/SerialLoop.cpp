@@ -1,7 +1,7 @@
 #include "server/SerialLoop.hpp"
 
-#include <qel/protocol/Error.hpp>
-#include <qel/protocol/Logging.hpp>
+#include "base/Guard.hpp"
+#include "base/Threads.hpp"
 
 #include <chrono>
 #include <vector>
@@ -19,7 +19,7 @@ constexpr std::chrono::milliseconds kPauseAfterFailure(100);
 } // namespace
 
 SerialLoop::SerialLoop(HypervisorEngine& hypervisor, PollInterrupt& wake)
-    : mHypervisor(hypervisor), mWake(wake), mThread([this] { pRun(); })
+    : mHypervisor(hypervisor), mWake(wake), mThread(startThread([this] { pRun(); }))
 {}
 
 SerialLoop::~SerialLoop()
@@ -34,8 +34,8 @@ void SerialLoop::pRun() noexcept
     while (!mStopping) {
         try {
             pPollOnce();
-        } catch (const std::exception& error) {
-            logLine(LogLevel::Error, "serial lines: ", explain(error));
+        } catch (...) {
+            logCurrent("serial lines");
             std::this_thread::sleep_for(kPauseAfterFailure);
         }
     }

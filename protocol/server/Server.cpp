@@ -1,174 +1,295 @@
-#include "server/Server.hpp"
-
 #include <qel/common/net/SocketStream.hpp>
+#include <qel/common/util/Mutex.hpp>
 #include <qel/common/util/PosixError.hpp>
 #include <qel/common/util/TimeProvider.hpp>
 #include <qel/protocol/Error.hpp>
+#include <qel/protocol/Handshake.hpp>
 #include <qel/protocol/Logging.hpp>
+#include <qel/protocol/Server.hpp>
+#include <qel/protocol/WakeUp.hpp>
 
-#include <cerrno>
-#include <fcntl.h>
+#include "base/Guard.hpp"
+#include "hypervisor/HypervisorEngine.hpp"
+#include "server/CheckedOptions.hpp"
+#include "server/Connection.hpp"
+#include "server/HandshakePlaces.hpp"
+#include "server/KeepAlive.hpp"
+#include "server/Listener.hpp"
+#include "server/LogThrottle.hpp"
+#include "server/QuietLog.hpp"
+#include "server/SerialLoop.hpp"
+
+#include <algorithm>
+#include <list>
+#include <optional>
+#include <sstream>
+#include <stdexcept>
+#include <thread>
 #include <utility>
 
 namespace qel::protocol {
 
 namespace {
 
-/// Before the next attempt when a connection could not be accepted for want of descriptors or memory. The end of
-/// another connection ends the pause early.
-constexpr std::chrono::milliseconds kPause(1000);
+/// The pause of run() after a failure, before the next attempt.
+constexpr std::chrono::milliseconds kPauseAfterFailure(100);
 
-/// Failures of accept() that concern one connection only, or none: see accept(2).
-bool isTransient(int error)
+/// What a console may take to read the abort message that it did not ask for; it fits the buffer of any fresh
+/// connection.
+constexpr std::chrono::milliseconds kRefusalTime(10);
+
+/// Of streams that are not sockets of this server's own.
+constexpr int kNoDescriptor = -1;
+
+ConnectionLimits limitsOf(const ServerOptions& options)
 {
-    switch (error) {
-    case EAGAIN:
-    case EINTR:
-    case ECONNABORTED:
-    case EPROTO:
-    case ENETDOWN:
-    case ENOPROTOOPT:
-    case EHOSTDOWN:
-    case ENONET:
-    case EHOSTUNREACH:
-    case ENETUNREACH:
-        return true;
-    default:
-        return false;
-    }
+    return {options.handshakeTimeout, options.frameTimeout, options.linger, options.queueBytes};
+}
+
+std::unique_ptr<SSLServerContext> contextOf(const ServerOptions& options)
+{
+    return options.credentials ? options.credentials->makeServerContext() : nullptr;
 }
 
 } // namespace
 
-Server::Server(HypervisorEngine& hypervisor, Socket listener, ConnectionLimits limits,
-               std::unique_ptr<SSLServerContext> context, PeerPins pins)
-    : mHypervisor(hypervisor), mListener(std::move(listener)), mLimits(limits), mContext(std::move(context)),
-      mPins(std::move(pins))
-{
-    // A connection may vanish between poll() and accept(), which must not block until the next one then.
-    mListener.setFlags(mListener.getFlags() | O_NONBLOCK);
-}
+struct Server::Impl {
+    Impl(Hypervisor& hypervisor, const ServerOptions& options);
+    ~Impl() { finish(); }
 
-Server::~Server() = default;
+    const std::vector<IPEndpoint>& endpoints() const noexcept { return mEndpoints; }
+    void run(const PollFd& stop);
+    void serve(ServedStream stream, HandshakePlaces::Place place);
+    void setCredentials(const Credentials& credentials);
+    void dumpStatistics(std::ostream& os);
+    void finish() noexcept;
 
-void Server::run(const PollFd& stop)
+private:
+    using Connections = std::list<std::unique_ptr<Connection>>;
+
+    bool pRunOnce(const PollFd& stop);
+    void pAccept(const PollResult& ready);
+    void pServe(Socket socket);
+    void pRefuse(Stream& stream, const ServedStream& served, const char* reason);
+    void pAwaitEnd();
+    bool pDropEnded();
+
+    const std::vector<IPEndpoint> mListenAt;
+    const std::chrono::seconds mKeepAlive;
+    const PeerPins mPins;
+    const bool mIsPlain;
+
+    WakeUp mWake;       // for run() and finish(): a connection has ended, or log lines were held back
+    WakeUp mSerialWake; // for the serial loop
+    LogThrottle mThrottle{[this] { mWake.interrupt(); }};
+    HandshakePlaces mPlaces;
+    HypervisorEngine mEngine;
+    const ConnectionServices mServices;
+
+    Mutex mMutex;
+    std::unique_ptr<SSLServerContext> mContext QEL_GUARDED_BY(mMutex); // null: connections are plain
+    Connections mConnections QEL_GUARDED_BY(mMutex);
+    bool mFinished QEL_GUARDED_BY(mMutex) = false;
+
+    std::optional<Listener> mListener; // empty after finish()
+    const std::vector<IPEndpoint> mEndpoints;
+    SerialLoop mSerialLoop;
+};
+
+Server::Impl::Impl(Hypervisor& hypervisor, const ServerOptions& options)
+    : mListenAt(checkOptions(options)), mKeepAlive(options.keepAlive), mPins(options.pins), mIsPlain(options.plain),
+      mPlaces(options.maxHandshakes, options.maxHandshakesPerAddress),
+      mEngine(hypervisor, options.maxConsoles, [this] { mSerialWake.interrupt(); }), mServices{mEngine, mPins,
+                                                                                               limitsOf(options),
+                                                                                               mThrottle, mWake},
+      mContext(contextOf(options)), mListener(std::in_place, mListenAt), mEndpoints(mListener->endpoints()),
+      mSerialLoop(mEngine, mSerialWake)
+{}
+
+void Server::Impl::run(const PollFd& stop)
 {
-    for (;;) {
-        const auto now = TimeProvider::steady();
-        if (mPausedUntil.isExpired(now)) mPausedUntil = PollDeadline();
-        PollSet set{stop, mConnectionEnded.getPollFd()};
-        const PollFd listener = mListener.getPollFd(PollEvents::Read);
-        if (mPausedUntil.isDisabled()) set += listener;
-        const PollResult result = set.wait(mPausedUntil.getTimeout(now));
-        if (result.contains(stop)) return;
-        if (result.contains(mConnectionEnded.getPollFd())) pDropEnded();
-        if (result.contains(listener)) pAccept();
+    while (mListener) {
+        try {
+            if (pRunOnce(stop)) return;
+        } catch (...) {
+            logCurrent("the server");
+            std::this_thread::sleep_for(kPauseAfterFailure);
+        }
     }
 }
 
-void Server::dumpStatistics(std::ostream& os)
+/// @return true: `stop` is readable
+bool Server::Impl::pRunOnce(const PollFd& stop)
 {
-    pDropEnded();
-    if (mConnections.empty()) os << "No console is connected.\n";
-    for (const auto& connection : mConnections)
-        connection->dumpStatistics(os);
-}
-
-void Server::finish()
-{
-    mListener = Socket(-1);
-    mStopping = true;
-    for (const auto& admission : mAdmissions)
-        admission->stop();
-    const PollDeadline deadline(TimeProvider::steady() + mLimits.linger);
-    for (;;) {
-        pDropEnded();
-        const auto now = TimeProvider::steady();
-        if ((mAdmissions.empty() && mConnections.empty()) || deadline.isExpired(now)) break;
-        static_cast<void>(PollSet(mConnectionEnded.getPollFd()).wait(deadline.getTimeout(now)));
+    const auto now = TimeProvider::steady();
+    if (mListener->pausedUntil().isExpired(now)) mListener->resume();
+    PollSet set{stop, mWake.getPollFd()};
+    mListener->addTo(set);
+    const PollDeadline next = std::min(mListener->pausedUntil(), PollDeadline(mThrottle.getNextReport()));
+    const PollResult result = set.wait(next.getTimeout(now));
+    if (result.contains(stop)) return true;
+    if (result.contains(mWake.getPollFd())) {
+        mWake.eoi();
+        if (pDropEnded()) mListener->resume(); // descriptors are free again
     }
-    for (const auto& connection : mConnections)
-        connection->abort();
-    mConnections.clear();
-    mAdmissions.clear();
+    mThrottle.report();
+    pAccept(result);
+    return false;
 }
 
-void Server::pAccept()
+void Server::Impl::pAccept(const PollResult& ready)
 {
     try {
-        pServe(mListener.accept());
-    } catch (const PosixError& error) {
-        if (!isTransient(error.getErrorCode().getCode())) pPause(error);
+        std::optional<Socket> socket = mListener->accept(ready);
+        if (socket) pServe(std::move(*socket));
     } catch (const std::exception& error) {
-        pPause(error);
+        logQuietly(LogLevel::Error, "cannot accept a connection: ", Explained{error});
+        mListener->pause();
     }
 }
 
-void Server::pServe(Socket socket)
+void Server::Impl::pServe(Socket socket)
 {
-    std::string peer;
+    ServedStream served;
     std::unique_ptr<SocketStream> stream;
     try {
-        peer = socket.getPeerName().str();
+        const IPEndpoint peer = socket.getPeerName();
+        served.address = peer.str();
+        served.source = sourceOf(peer.getAddress());
         stream = std::make_unique<SocketStream>(std::move(socket));
+        setKeepAlive(stream->getSocket(), mKeepAlive);
     } catch (const PosixError& error) {
         logLine(LogLevel::Info, "a connection ended before it was served: ", error.what());
         return;
     }
-    const int descriptor = stream->getSocket().getFd();
-    if (mContext != nullptr) return pAdmit(std::move(stream), peer);
-    pConnect(std::move(stream), descriptor, peer, mLimits);
+    HandshakePlaces::Place place = mPlaces.take(served.source);
+    if (!place) return pRefuse(*stream, served, place.getRefusal());
+    served.descriptor = stream->getSocket().getFd();
+    served.stream = std::move(stream);
+    serve(std::move(served), std::move(place));
 }
 
-void Server::pAdmit(std::unique_ptr<SocketStream> stream, const std::string& peer)
+/// Closes a connection that finds no place. A console that uses TLS learns that it is turned away.
+void Server::Impl::pRefuse(Stream& stream, const ServedStream& served, const char* reason)
 {
-    auto admission = std::make_unique<Admission>(mHypervisor, std::move(stream), peer, *mContext, mPins,
-                                                 TimeProvider::steady() + mLimits.handshake,
-                                                 [this] { mConnectionEnded.interrupt(); });
-    admission->start();
-    mAdmissions.push_back(std::move(admission));
+    const LogThrottle::Scope scope(mThrottle, served.source);
+    logLine(LogLevel::Warn, served.address, ": refused: ", reason);
+    if (mIsPlain) return;
+    try {
+        limitTo(stream, TimeProvider::steady() + kRefusalTime);
+        abortHandshake(stream);
+    } catch (const Error&) { // NOLINT(bugprone-empty-catch): it is gone already
+    }
 }
 
-void Server::pConnect(std::unique_ptr<Stream> stream, int descriptor, const std::string& peer, ConnectionLimits limits)
+void Server::Impl::serve(ServedStream stream, HandshakePlaces::Place place)
 {
-    auto connection = std::make_unique<Connection>(mHypervisor, std::move(stream), descriptor, peer, limits,
-                                                   [this] { mConnectionEnded.interrupt(); });
+    static_cast<void>(pDropEnded()); // without run() nothing else does
+    const MutexLock lock(mMutex);
+    if (mFinished) return;
+    auto connection = std::make_unique<Connection>(mServices, std::move(stream), mContext.get(), std::move(place));
     connection->start();
     mConnections.push_back(std::move(connection));
 }
 
-void Server::pPause(const std::exception& reason)
+void Server::Impl::setCredentials(const Credentials& credentials)
 {
-    logLine(LogLevel::Error, "cannot accept a connection: ", explain(reason));
-    mPausedUntil = TimeProvider::steady() + kPause;
+    if (mIsPlain) throw std::logic_error("connections are plain");
+    auto context = credentials.makeServerContext();
+    const MutexLock lock(mMutex);
+    mContext.swap(context);
 }
 
-void Server::pDropEnded()
+void Server::Impl::dumpStatistics(std::ostream& os)
 {
-    mConnectionEnded.eoi();
-    const std::size_t before = mConnections.size() + mAdmissions.size();
-    mConnections.remove_if([](const std::unique_ptr<Connection>& connection) { return connection->hasEnded(); });
-    std::vector<Admission::Admitted> ended;
-    mAdmissions.remove_if([&ended](const std::unique_ptr<Admission>& admission) {
-        if (!admission->hasEnded()) return false;
-        ended.push_back(admission->release());
-        return true;
-    });
-    for (Admission::Admitted& admitted : ended)
-        pOnAdmitted(std::move(admitted));
-    if (mConnections.size() + mAdmissions.size() < before) mPausedUntil = PollDeadline(); // descriptors are free again
+    static_cast<void>(pDropEnded());
+    std::ostringstream text; // the stream may be slow, and consoles wait for the lock
+    {
+        const MutexLock lock(mMutex);
+        bool any = false;
+        for (const auto& connection : mConnections)
+            any |= connection->dumpStatistics(text);
+        if (!any) text << "No console is connected.\n";
+    }
+    os << text.str();
 }
 
-void Server::pOnAdmitted(Admission::Admitted admitted)
+void Server::Impl::finish() noexcept
 {
-    if (admitted.stream == nullptr || mStopping) return;
-    ConnectionLimits limits = mLimits;
-    limits.handshake = admitted.timeLeft;
-    try {
-        pConnect(std::move(admitted.stream), admitted.descriptor, admitted.peer, limits);
-    } catch (const std::exception& error) {
-        pPause(error);
+    {
+        const MutexLock lock(mMutex);
+        if (std::exchange(mFinished, true)) return; // from here on no connection is added
+    }
+    mListener.reset();
+    runGuarded([this] { mEngine.shutDown(); }, "the end of the server");
+    runGuarded([this] { pAwaitEnd(); }, "the end of the server");
+    Connections left;
+    {
+        const MutexLock lock(mMutex);
+        left.swap(mConnections);
+    }
+    for (const auto& connection : left)
+        connection->abort();
+    left.clear();
+    runGuarded([this] { mThrottle.reportAll(); }, "the end of the server");
+}
+
+/// Waits for the connections to end, for the linger time.
+void Server::Impl::pAwaitEnd()
+{
+    {
+        const MutexLock lock(mMutex);
+        for (const auto& connection : mConnections)
+            connection->stop();
+    }
+    const PollDeadline deadline(TimeProvider::steady() + mServices.limits.linger);
+    for (;;) {
+        mWake.eoi();
+        static_cast<void>(pDropEnded());
+        {
+            const MutexLock lock(mMutex);
+            if (mConnections.empty()) return;
+        }
+        const auto now = TimeProvider::steady();
+        if (deadline.isExpired(now)) return;
+        static_cast<void>(PollSet(mWake.getPollFd()).wait(deadline.getTimeout(now)));
     }
 }
+
+/// Destroys the connections that have ended. @return whether there were any
+bool Server::Impl::pDropEnded()
+{
+    Connections ended;
+    {
+        const MutexLock lock(mMutex);
+        for (auto next = mConnections.begin(); next != mConnections.end();) {
+            const auto connection = next++;
+            if ((*connection)->hasEnded()) ended.splice(ended.end(), mConnections, connection);
+        }
+    }
+    return !ended.empty(); // destroyed without the lock
+}
+
+Server::Server(Hypervisor& hypervisor, const ServerOptions& options)
+    : mImpl(std::make_unique<Impl>(hypervisor, options))
+{}
+
+Server::~Server() = default;
+
+std::vector<IPEndpoint> Server::endpoints() const { return mImpl->endpoints(); }
+
+void Server::run(const PollFd& stop) { mImpl->run(stop); }
+
+void Server::serve(std::unique_ptr<Stream> stream, const std::string& address)
+{
+    if (stream == nullptr) throw std::invalid_argument("stream");
+    mImpl->serve({std::move(stream), kNoDescriptor, address, address}, {});
+}
+
+void Server::setCredentials(const Credentials& credentials) { mImpl->setCredentials(credentials); }
+
+void Server::dumpStatistics(std::ostream& os) { mImpl->dumpStatistics(os); }
+
+void Server::finish() noexcept { mImpl->finish(); }
 
 } // namespace qel::protocol

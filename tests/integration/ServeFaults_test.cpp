@@ -27,6 +27,20 @@ std::size_t count(const std::string& text, const std::string& part)
     return found;
 }
 
+/// The same of lines, with those that the log counts instead of repeating them.
+std::size_t told(const std::string& log, const std::string& part)
+{
+    const std::string sum = " more lines like this one: ";
+    std::size_t found = 0;
+    std::istringstream lines(log);
+    for (std::string line; std::getline(lines, line);) {
+        if (line.find(part) == std::string::npos) continue;
+        const std::size_t end = line.find(sum);
+        found += end == std::string::npos ? 1 : std::stoul(line.substr(line.rfind(' ', end - 1) + 1));
+    }
+    return found;
+}
+
 /// @return how many children a process has, zombies included
 std::size_t childrenOf(pid_t parent)
 {
@@ -97,7 +111,8 @@ TEST(ServeFaults, GarbageEndsItsOwnConnectionOnly)
         good.readUntil(1, line + "\r\n" + line + "\r\n");
     }
     const auto result = server.stop();
-    EXPECT_EQ(count(result.errors, "closed for a malformed frame: Invalid length"), 50U);
+    EXPECT_EQ(told(result.errors, "closed for a malformed frame: Invalid length"), 50U);
+    EXPECT_LT(count(result.errors, "closed for a malformed frame: Invalid length"), 50U); // they do not fill the log
 }
 
 TEST(ServeFaults, AFrameTruncatedAtAnyByteEndsOnlyItsConnection)

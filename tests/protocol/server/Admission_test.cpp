@@ -1,28 +1,37 @@
 #include <qel/common/QelInternalMessageRegistry.hpp>
 #include <qel/common/QelMessageCast.hpp>
 #include <qel/common/io/StreamIOException.hpp>
-#include <qel/common/util/TimeProvider.hpp>
+#include <qel/common/security/CertificateFacts.hpp>
 
-#include "protocol/hypervisor/HypervisorFixture.hpp"
-#include "server/Admission.hpp"
+#include "protocol/server/ServedFixture.hpp"
 #include "support/CredentialDirectory.hpp"
 #include "support/LoopbackEnds.hpp"
 
-#include <future>
 #include <gmock/gmock.h>
 
 namespace qel::test {
 
 namespace {
 
-using protocol::Admission;
+using protocol::Connection;
+using protocol::ConnectionLimits;
 using protocol::PeerPins;
 using ::testing::Contains;
 using ::testing::HasSubstr;
 using ::testing::IsEmpty;
 
+/// Keeps the consoles that have connected.
+class RecordingMachine : public protocol::Hypervisor {
+public:
+    explicit RecordingMachine(std::vector<protocol::Peer>& peers) : mPeers(peers) {}
+    void onConnected(const protocol::Peer& peer) override { mPeers.push_back(peer); }
+
+private:
+    std::vector<protocol::Peer>& mPeers;
+};
+
 /// The hypervisor end admits a console; the test plays the console.
-class AdmissionTest : public HypervisorFixture {
+class AdmissionTest : public ServedFixture {
 protected:
     AdmissionTest()
     {
@@ -30,26 +39,26 @@ protected:
         clientContext.setCredentials(Authority::trusted().clientCredentials());
     }
 
-    void start(std::chrono::milliseconds time = Loopback::kDeadline, PeerPins pins = {})
+    void start(std::chrono::milliseconds time = Loopback::kDeadline, PeerPins accepted = {})
     {
-        admission =
-            std::make_unique<Admission>(*hypervisor, std::move(loopback.far), "the test", serverContext,
-                                        std::move(pins), TimeProvider::steady() + time, [this] { ended.set_value(); });
-        admission->start();
+        pins = std::move(accepted);
+        ConnectionLimits limits;
+        limits.handshake = time;
+        descriptor = loopback.far->getSocket().getFd();
+        connection = ServedFixture::serve(loopback, limits, &serverContext);
+        connection->start();
     }
 
-    void awaitEnd()
-    {
-        ASSERT_EQ(ended.get_future().wait_for(Loopback::kDeadline), std::future_status::ready);
-        EXPECT_TRUE(admission->hasEnded());
-    }
+    void expectEnd() { awaitEnd(*connection); }
 
     void expectRefusal(const std::string& reason)
     {
-        awaitEnd();
-        EXPECT_EQ(admission->release().stream, nullptr);
+        expectEnd();
         EXPECT_THAT(log.lines(), Contains("W: [qel] the test: refused: " + reason));
     }
+
+    /// Introduces a console inside TLS. @return the status of the response
+    unsigned int introduce(SSLStream& tls) const { return LoopbackMessages(tls).ask(versionRequest("a"))->getStatus(); }
 
     void send(const QelMessage& message) { QelMessageStream(*loopback.near, internal()).write(message); }
 
@@ -82,41 +91,52 @@ protected:
     Loopback loopback;
     SSLServerContext serverContext;
     SSLClientContext clientContext;
-    std::promise<void> ended;
-    std::unique_ptr<Admission> admission; // destroyed before what it borrows
+    int descriptor = -1;                    // of the connection
+    std::unique_ptr<Connection> connection; // destroyed before what it borrows
 };
 
 TEST_F(AdmissionTest, AConsoleThatAsksForTlsIsAdmitted)
 {
     start();
     const auto console = startTls();
-    awaitEnd();
-    Admission::Admitted admitted = admission->release();
-    ASSERT_NE(admitted.stream, nullptr);
-    EXPECT_EQ(admitted.peer, "the test");
-    EXPECT_GT(admitted.timeLeft, std::chrono::milliseconds(0));
-    EXPECT_LE(admitted.timeLeft, Loopback::kDeadline);
-    admission.reset(); // the stream outlives it
-    console->write("to the server", 13);
-    std::string text(13, '\0');
-    admitted.stream->fill(&text[0], text.size());
-    EXPECT_EQ(text, "to the server");
-    EXPECT_TRUE(PollSet(PollFd(admitted.descriptor, PollEvents::Write)).poll().anyReady());
+    EXPECT_EQ(introduce(*console), 0U);
     EXPECT_THAT(log.lines(), IsEmpty());
+}
+
+TEST_F(AdmissionTest, TheHypervisorLearnsWhoTheConsoleIs)
+{
+    std::vector<protocol::Peer> peers;
+    HypervisorFixture::serve(std::make_unique<RecordingMachine>(peers));
+    start();
+    const auto console = startTls();
+    EXPECT_EQ(introduce(*console), 0U);
+    ASSERT_THAT(peers, ::testing::SizeIs(1));
+    EXPECT_EQ(peers.front().commonName, "client");
+    EXPECT_EQ(peers.front().fingerprint, fingerprintOf(Authority::trusted().client()));
+    EXPECT_EQ(peers.front().address, "the test");
+    EXPECT_TRUE(peers.front().isProtected);
 }
 
 TEST_F(AdmissionTest, TheWriteDeadlineEndsWithTheHandshake)
 {
     start();
     const auto console = startTls();
-    awaitEnd();
-    const Admission::Admitted admitted = admission->release();
+    EXPECT_EQ(introduce(*console), 0U); // the response passes the changed deadline to the kernel
     timeval timeout{};
     socklen_t length = sizeof(timeout);
-    admitted.stream->write("x", 1); // the next transfer passes the changed deadline to the kernel
-    ASSERT_EQ(::getsockopt(admitted.descriptor, SOL_SOCKET, SO_SNDTIMEO, &timeout, &length), 0);
+    ASSERT_EQ(::getsockopt(descriptor, SOL_SOCKET, SO_SNDTIMEO, &timeout, &length), 0);
     EXPECT_EQ(timeout.tv_sec, 0);
     EXPECT_EQ(timeout.tv_usec, 0);
+}
+
+TEST_F(AdmissionTest, ASilentConsoleInsideTlsIsClosedAtTheDeadline)
+{
+    start(std::chrono::milliseconds(500));
+    const auto console = startTls();
+    char byte = 0;
+    EXPECT_EQ(console->read(&byte, 1), 0U);
+    expectEnd();
+    EXPECT_THAT(log.lines(), Contains("W: [qel] console 1: closed, it did not introduce itself in time"));
 }
 
 TEST_F(AdmissionTest, ASilentConsoleIsClosedAtTheDeadline)
@@ -150,13 +170,11 @@ TEST_F(AdmissionTest, OneDeadlineCoversAllSteps)
     start(std::chrono::milliseconds(200));
     const QelMessageUpgradeConnectionAsync request;
     unsigned sent = 0;
-    auto end = ended.get_future();
     for (; sent + 1 < request.msgLength(); ++sent) {
         loopback.near->write(request.serialize() + sent, 1);
-        if (end.wait_for(std::chrono::milliseconds(20)) == std::future_status::ready) break;
+        if (PollSet(ended.getPollFd()).wait(std::chrono::milliseconds(20)).anyReady()) break;
     }
     EXPECT_LT(sent + 1, request.msgLength()) << "it was never closed";
-    EXPECT_EQ(admission->release().stream, nullptr);
 }
 
 TEST_F(AdmissionTest, AConsoleThatDisconnectsEndsTheAdmission)
@@ -172,8 +190,7 @@ TEST_F(AdmissionTest, AConsoleThatDoesNotAskForTlsIsRefused)
     send(versionRequest("a"));
     expect<QelMessageAbortHandshakeAsync>();
     expectClosed();
-    awaitEnd();
-    EXPECT_EQ(admission->release().stream, nullptr);
+    expectEnd();
     EXPECT_THAT(log.lines(), Contains(HasSubstr("the test: refused: the peer did not ask for TLS but sent "
                                                 "something else: [CID: ")));
 }
@@ -241,7 +258,7 @@ TEST_F(AdmissionTest, DuringShutdownTheAnswerIsAbort)
 TEST_F(AdmissionTest, StopSendsAbortToAConsoleThatHasNotAsked)
 {
     start();
-    admission->stop();
+    connection->stop();
     expect<QelMessageAbortHandshakeAsync>();
     expectClosed();
     expectRefusal("the server stops");
@@ -252,10 +269,9 @@ TEST_F(AdmissionTest, StopCutsAConsoleInTheTlsHandshake)
     start();
     send(QelMessageUpgradeConnectionAsync());
     expect<QelMessageUpgradeConnectionAsync>();
-    admission->stop();
+    connection->stop();
     expectClosed();
-    awaitEnd();
-    EXPECT_EQ(admission->release().stream, nullptr);
+    expectEnd();
 }
 
 TEST_F(AdmissionTest, CanBeDestroyedAtAnyTime)
@@ -263,15 +279,14 @@ TEST_F(AdmissionTest, CanBeDestroyedAtAnyTime)
     start();
     send(QelMessageUpgradeConnectionAsync());
     expect<QelMessageUpgradeConnectionAsync>();
-    admission.reset();
+    connection.reset();
     expectClosed();
 }
 
 TEST_F(AdmissionTest, CanBeDestroyedWithoutAStart)
 {
-    admission = std::make_unique<Admission>(*hypervisor, std::move(loopback.far), "the test", serverContext, PeerPins(),
-                                            TimeProvider::steady(), [] {});
-    admission.reset();
+    connection = ServedFixture::serve(loopback, {}, &serverContext);
+    connection.reset();
     expectClosed();
 }
 
@@ -298,8 +313,7 @@ TEST_F(AdmissionTest, APinnedConsoleIsAdmitted)
 {
     start(Loopback::kDeadline, {{"client"}, {}});
     const auto console = startTls();
-    awaitEnd();
-    EXPECT_NE(admission->release().stream, nullptr);
+    EXPECT_EQ(introduce(*console), 0U);
 }
 
 } // namespace

@@ -1,9 +1,9 @@
 #include <qel/common/QelInternalMessageRegistry.hpp>
 #include <qel/common/QelMessageDax.hpp>
 #include <qel/common/io/StreamIOException.hpp>
+#include <qel/protocol/MemoryStream.hpp>
 
-#include "protocol/hypervisor/HypervisorFixture.hpp"
-#include "server/Connection.hpp"
+#include "protocol/server/ServedFixture.hpp"
 #include "support/LoopbackEnds.hpp"
 
 #include <future>
@@ -21,23 +21,19 @@ using ::testing::Contains;
 using ::testing::HasSubstr;
 using ::testing::StartsWith;
 
-class ConnectionTest : public HypervisorFixture {
+class ConnectionTest : public ServedFixture {
 protected:
     void start(ConnectionLimits limits = {})
     {
-        const int descriptor = loopback.far->getSocket().getFd();
-        connection = std::make_unique<Connection>(*hypervisor, std::move(loopback.far), descriptor, "the test", limits,
-                                                  [this] { ended.set_value(); });
+        connection = ServedFixture::serve(loopback, limits);
         connection->start();
     }
 
     void identify() { ASSERT_EQ(messages.ask(versionRequest("a"))->getStatus(), 0U); }
 
-    void expectEnd()
-    {
-        ASSERT_EQ(ended.get_future().wait_for(Loopback::kDeadline), std::future_status::ready);
-        EXPECT_TRUE(connection->hasEnded());
-    }
+    void expectEnd() { awaitEnd(*connection); }
+
+    bool endsWithin(std::chrono::milliseconds time) const { return PollSet(ended.getPollFd()).wait(time).anyReady(); }
 
     /// Sends requests without reading responses until the server stops reading. @return how many it sent
     unsigned sendUntilStuck(const QelMessage& request)
@@ -86,7 +82,6 @@ protected:
     }
 
     LoopbackMessages messages{*loopback.near};
-    std::promise<void> ended;
     std::unique_ptr<Connection> connection; // destroyed before what it borrows
 };
 
@@ -141,14 +136,13 @@ TEST_F(ConnectionTest, AMalformedFrameEndsTheConnection)
         log.clear();
         Loopback own;
         LoopbackMessages frames(*own.near);
-        const int descriptor = own.far->getSocket().getFd();
-        std::promise<void> end;
-        Connection broken(*hypervisor, std::move(own.far), descriptor, "the test", {}, [&] { end.set_value(); });
-        broken.start();
+        ended.eoi();
+        const auto broken = ServedFixture::serve(own);
+        broken->start();
         EXPECT_EQ(frames.ask(versionRequest("a"))->getStatus(), 0U); // free again each time
         frames.sendBytes(entry.bytes);
         EXPECT_TRUE(frames.isClosed());
-        ASSERT_EQ(end.get_future().wait_for(Loopback::kDeadline), std::future_status::ready);
+        awaitEnd(*broken);
         EXPECT_THAT(log.lines(), Contains(HasSubstr(std::string(": closed for a malformed frame: ") + entry.reason)));
     }
 }
@@ -203,7 +197,7 @@ TEST_F(ConnectionTest, AnIdentifiedConsoleHasNoReadDeadline)
     limits.handshake = std::chrono::milliseconds(1000);
     start(limits);
     identify();
-    EXPECT_EQ(ended.get_future().wait_for(std::chrono::milliseconds(1200)), std::future_status::timeout);
+    EXPECT_FALSE(endsWithin(std::chrono::milliseconds(1200)));
     EXPECT_EQ(messages.ask(QelMessageGetQelTodReq())->getStatus(), 0U);
 }
 
@@ -220,7 +214,7 @@ TEST_F(ConnectionTest, AnIdentifiedConsoleMayBeHeldBackBeyondTheHandshakeTimeout
     const std::string data(16000, 'x');
     for (int i = 0; i < 5; ++i) // more than the 64 KiB that the server keeps
         messages.send(QelMessageVirtualSerialDataToOsAsync(1, 0, 16000, data.data()));
-    EXPECT_EQ(ended.get_future().wait_for(std::chrono::milliseconds(1200)), std::future_status::timeout);
+    EXPECT_FALSE(endsWithin(std::chrono::milliseconds(1200)));
     EXPECT_FALSE(hypervisor->mayReceive(1));
 }
 
@@ -249,9 +243,8 @@ TEST_F(ConnectionTest, AConsoleThatDoesNotReadDelaysNoOther)
 
     Loopback other;
     LoopbackMessages frames(*other.near);
-    const int descriptor = other.far->getSocket().getFd();
-    Connection second(*hypervisor, std::move(other.far), descriptor, "other", {}, [] {});
-    second.start();
+    const auto second = ServedFixture::serve(other);
+    second->start();
     EXPECT_EQ(frames.ask(versionRequest("b"))->getStatus(), 0U);
     EXPECT_EQ(frames.ask(QelMessageDaxBroadcastReq(0, 1, 0, "", "x"))->getStatus(), 0U);
 }
@@ -405,6 +398,114 @@ TEST_F(ConnectionTest, ARefusedConsoleThatReadsGetsEverythingQueued)
     expectEnd();
 }
 
+/// A connection over streams in memory.
+class FrameTimeoutTest : public ConnectionTest {
+protected:
+    static constexpr std::chrono::milliseconds kFrame{60};
+
+    FrameTimeoutTest()
+    {
+        ConnectionLimits limits;
+        limits.frame = kFrame;
+        auto ends = protocol::makeMemoryStreams();
+        console = std::move(ends.first);
+        console->setReadDeadline(Loopback::kDeadline);
+        connection = ServedFixture::serve(std::move(ends.second), -1, limits);
+        connection->start();
+        frames = std::make_unique<LoopbackMessages>(*console);
+        EXPECT_EQ(frames->ask(versionRequest("a"))->getStatus(), 0U);
+    }
+    ~FrameTimeoutTest() override { connection.reset(); }
+
+    void send(std::size_t begin, std::size_t end)
+    {
+        frames->sendBytes(std::string(request.serialize(), request.msgLength()).substr(begin, end - begin));
+    }
+
+    const QelMessageGetInterfaceLimitsReq request;
+    std::unique_ptr<Stream> console;
+    std::unique_ptr<LoopbackMessages> frames;
+};
+
+/// The bytes of a frame after which it stops.
+class StoppedFrameTest : public FrameTimeoutTest, public ::testing::WithParamInterface<std::size_t> {};
+
+TEST_P(StoppedFrameTest, EndsTheConnection)
+{
+    send(0, GetParam());
+    EXPECT_TRUE(frames->isClosed());
+    expectEnd();
+    EXPECT_THAT(log.lines(), Contains("W: [qel] console 1: closed, it did not finish a message in time"));
+}
+
+INSTANTIATE_TEST_SUITE_P(Bytes, StoppedFrameTest, ::testing::Values(1, 7, 8, 9, 31));
+
+TEST_F(FrameTimeoutTest, AFrameThatStopsAfterAWholeOneEndsTheConnection)
+{
+    const std::string bytes(request.serialize(), request.msgLength());
+    frames->sendBytes(bytes + bytes.substr(0, 20));
+    EXPECT_EQ(frames->receive()->getCallerId(), request.getCallerId());
+    EXPECT_TRUE(frames->isClosed());
+    expectEnd();
+}
+
+TEST_F(FrameTimeoutTest, BetweenFramesTheTimeIsNotLimited)
+{
+    EXPECT_FALSE(endsWithin(3 * kFrame));
+    EXPECT_EQ(frames->ask(request)->getStatus(), 0U);
+    EXPECT_FALSE(endsWithin(3 * kFrame));
+    EXPECT_EQ(frames->ask(request)->getStatus(), 0U);
+}
+
+TEST_F(FrameTimeoutTest, EachFrameHasTheTimeAnew)
+{
+    for (int frame = 0; frame < 6; ++frame) {
+        send(0, 9);
+        EXPECT_FALSE(endsWithin(kFrame / 3)); // together they take longer than one may
+        send(9, request.msgLength());
+        EXPECT_EQ(frames->receive()->getCallerId(), request.getCallerId());
+    }
+}
+
+TEST_F(FrameTimeoutTest, AByteNowAndThenGivesNoMoreTime)
+{
+    for (std::size_t sent = 0; sent + 1 < request.msgLength(); ++sent) {
+        send(sent, sent + 1);
+        if (endsWithin(kFrame / 4)) return;
+    }
+    FAIL() << "it was never closed";
+}
+
+TEST_F(FrameTimeoutTest, AConsoleThatIsHeldBackWithinAFrameIsNotClosed)
+{
+    frames->ask(QelMessageInterfaceCmpOpenKrogSessionReq());
+    frames->ask(QelMessageVirtualSerialOpenReq(1, 0, false));
+    frames->ask(QelMessageVirtualSerialSetupSessionReq(1, 0));
+    port1->takes = 0;
+    const std::string data(16000, 'x');
+    for (int i = 0; i < 5; ++i) // more than the 64 KiB that the server keeps
+        frames->send(QelMessageVirtualSerialDataToOsAsync(1, 0, 16000, data.data()));
+    send(0, 9);
+    EXPECT_FALSE(endsWithin(3 * kFrame));
+    send(9, request.msgLength());
+    port1->takes = 1000 * 1000;
+    hypervisor->serviceSerial(1);
+    EXPECT_EQ(frames->receive()->getCallerId(), request.getCallerId());
+}
+
+TEST_F(FrameTimeoutTest, AnAbortedConnectionInMemoryEndsThoughItIsHeldBack)
+{
+    frames->ask(QelMessageInterfaceCmpOpenKrogSessionReq());
+    frames->ask(QelMessageVirtualSerialOpenReq(1, 0, false));
+    frames->ask(QelMessageVirtualSerialSetupSessionReq(1, 0));
+    port1->takes = 0;
+    const std::string data(16000, 'x');
+    for (int i = 0; i < 5; ++i)
+        frames->send(QelMessageVirtualSerialDataToOsAsync(1, 0, 16000, data.data()));
+    connection->abort();
+    expectEnd();
+}
+
 TEST_F(ConnectionTest, CanBeDestroyedAtAnyTime)
 {
     start();
@@ -415,9 +516,7 @@ TEST_F(ConnectionTest, CanBeDestroyedAtAnyTime)
 
 TEST_F(ConnectionTest, CanBeDestroyedWithoutAStart)
 {
-    const int descriptor = loopback.far->getSocket().getFd();
-    connection =
-        std::make_unique<Connection>(*hypervisor, std::move(loopback.far), descriptor, "x", ConnectionLimits(), [] {});
+    connection = ServedFixture::serve(loopback);
     connection.reset();
     EXPECT_TRUE(messages.isClosed());
 }

@@ -1,127 +1,53 @@
-// The server and its connections in one process; tests/integration runs it as a process of its own.
-
-#include <qel/common/LogBackend.hpp>
 #include <qel/common/QelInternalMessageRegistry.hpp>
-#include <qel/common/QelLogger.hpp>
-#include <qel/common/io/QelMessageStream.hpp>
-#include <qel/common/net/Listen.hpp>
-#include <qel/common/net/SocketStream.hpp>
-#include <qel/common/security/SSLContext.hpp>
-#include <qel/common/security/SSLStream.hpp>
-#include <qel/protocol/WakeUp.hpp>
+#include <qel/common/QelMessageDax.hpp>
+#include <qel/common/QelMessageGeneric.hpp>
+#include <qel/common/QelMessageInterfaceComponent.hpp>
+#include <qel/common/io/StreamIOException.hpp>
 
-#include "protocol/hypervisor/HypervisorFixture.hpp"
-#include "server/Server.hpp"
-#include "support/Authority.hpp"
-#include "support/LoopbackEnds.hpp"
+#include "protocol/server/ServerFixture.hpp"
+#include "support/ComesTrue.hpp"
+#include "support/RecordingLogBackend.hpp"
 #include "support/SettableClock.hpp"
 
-#include <chrono>
-#include <functional>
-#include <future>
 #include <gmock/gmock.h>
+#include <netinet/in.h>
+#include <netinet/tcp.h>
+#include <sstream>
 
 namespace qel::test {
 
 namespace {
 
-using protocol::ConnectionLimits;
 using protocol::Server;
+using protocol::ServerOptions;
 using ::testing::Contains;
 using ::testing::EndsWith;
-
-/// Runs a function when a line with a given part is logged.
-class OnLine : public LogBackend {
-public:
-    OnLine(std::string part, std::function<void()> work) : mPart(std::move(part)), mWork(std::move(work)) {}
-    void log(LogLevel::Level, const std::string& line) override
-    {
-        if (line.find(mPart) != std::string::npos) mWork();
-    }
-
-private:
-    const std::string mPart;
-    const std::function<void()> mWork;
-};
+using ::testing::HasSubstr;
+using ::testing::Not;
+using ::testing::StartsWith;
 
 /// A server with timeouts of an hour: nothing ends by a timeout unless the test moves the clock.
-class ServerTest : public HypervisorFixture {
+class PatientServerTest : public ServerFixture {
 protected:
     static constexpr std::chrono::hours kTime{1};
 
-    ServerTest()
+    PatientServerTest()
     {
-        Socket listener = listenOn(IPEndpoint("127.0.0.1:0"), 8);
-        mEndpoint = listener.getSocketName();
-        ConnectionLimits limits;
-        limits.handshake = kTime;
-        limits.linger = kTime;
-        auto context = std::make_unique<SSLServerContext>();
-        context->setCredentials(Authority::trusted().serverCredentials());
-        mServer = std::make_unique<Server>(*hypervisor, std::move(listener), limits, std::move(context));
-    }
-
-    /// The consoles of the test are destroyed by now, so the server can end even after a failure.
-    void TearDown() override { stop(); }
-
-    /// Serves on a thread of its own until stop(), and then ends as the program does.
-    void serve()
-    {
-        mServed = std::async(std::launch::async, [this] {
-            mServer->run(mStop.getPollFd());
-            hypervisor->shutDown();
-            mServer->finish();
-        });
-    }
-    void stop() { mStop.interrupt(); }
-    bool hasEnded() const { return mServed.wait_for(Loopback::kDeadline) == std::future_status::ready; }
-
-    /// A connection that has sent nothing yet. Its reads have a deadline, on the server's clock.
-    std::unique_ptr<SocketStream> connect() const
-    {
-        Socket socket(IPFamily::IPv4, SOCK_STREAM | SOCK_CLOEXEC, 0);
-        socket.connect(mEndpoint, Loopback::kDeadline);
-        auto stream = std::make_unique<SocketStream>(std::move(socket));
-        stream->setReadDeadline(Loopback::kDeadline);
-        return stream;
-    }
-
-    /// Reads a message in the clear and expects a T.
-    template <typename T>
-    static void expect(Stream& stream)
-    {
-        const auto message = QelMessageStream(stream, QelInternalMessageRegistry::getInstance()).read();
-        EXPECT_NE(dynamic_cast<const T*>(message.get()), nullptr) << message->getLogID();
-    }
-
-    /// Asks for TLS and expects it to be granted.
-    static void ask(Stream& stream)
-    {
-        QelMessageStream(stream, QelInternalMessageRegistry::getInstance()).write(QelMessageUpgradeConnectionAsync());
-        expect<QelMessageUpgradeConnectionAsync>(stream);
-    }
-
-    static bool isClosed(Stream& stream)
-    {
-        char byte = 0;
-        return stream.read(&byte, 1) == 0;
+        ServerOptions options = tlsOptions();
+        options.handshakeTimeout = kTime;
+        options.linger = kTime;
+        make(options);
     }
 
     SettableClock clock;
-
-private:
-    IPEndpoint mEndpoint;
-    protocol::WakeUp mStop;
-    std::unique_ptr<Server> mServer;
-    std::future<void> mServed; // destroyed first; waits for the thread
 };
 
-TEST_F(ServerTest, StopsWithoutWaitingForUnfinishedHandshakes)
+TEST_F(PatientServerTest, StopsWithoutWaitingForUnfinishedHandshakes)
 {
-    serve();
+    run();
     const auto silent = connect();
     const auto stalled = connect();
-    ask(*stalled); // the other connection came first, so it is accepted too
+    askForTls(*stalled); // the other connection came first, so it is accepted too
     stop();
     expect<QelMessageAbortHandshakeAsync>(*silent);
     EXPECT_TRUE(isClosed(*silent));
@@ -130,17 +56,15 @@ TEST_F(ServerTest, StopsWithoutWaitingForUnfinishedHandshakes)
     EXPECT_THAT(log.lines(), Contains(EndsWith(": refused: the server stops")));
 }
 
-TEST_F(ServerTest, TheHandshakeDeadlineContinuesInsideTls)
+TEST_F(PatientServerTest, TheHandshakeDeadlineContinuesInsideTls)
 {
     QelLogger::get().setLevel(LogLevel::Info);
     QelLogger::get().addBackend(std::make_shared<OnLine>(": over TLS: ", [this] { clock.advance(kTime); }));
-    SSLClientContext context;
-    context.setCredentials(Authority::trusted().clientCredentials());
-    serve();
+    run();
     auto socket = connect();
-    ask(*socket);
+    askForTls(*socket);
     socket->clearReadDeadline(); // the test moves the clock
-    SSLStream console(context, std::move(socket));
+    SSLStream console(clientContext(), std::move(socket));
     console.handshake();
     // It sends nothing more, and the deadline has passed.
     auto closed = std::async(std::launch::async, [&console] { return isClosed(console); });
@@ -150,6 +74,266 @@ TEST_F(ServerTest, TheHandshakeDeadlineContinuesInsideTls)
     stop();
     EXPECT_TRUE(hasEnded());
     EXPECT_THAT(log.lines(), Contains("W: [qel] console 1: closed, it did not introduce itself in time"));
+}
+
+class ServerTest : public ServerFixture {};
+
+TEST_F(ServerTest, ListensOnSeveralEndpoints)
+{
+    ServerOptions options = plainOptions();
+    options.listen = {"127.0.0.1:0", "[::1]:0", "127.0.0.2:0"};
+    make(options);
+    const std::vector<IPEndpoint> endpoints = server->endpoints();
+    ASSERT_EQ(endpoints.size(), 3U);
+    EXPECT_THAT(endpoints[0].str(), StartsWith("127.0.0.1:"));
+    EXPECT_THAT(endpoints[1].str(), StartsWith("[::1]:"));
+    EXPECT_THAT(endpoints[2].str(), StartsWith("127.0.0.2:"));
+    run();
+    unsigned number = 0;
+    for (const IPEndpoint& endpoint : endpoints) {
+        const auto console = connect(endpoint);
+        EXPECT_EQ(introduce(*console, std::to_string(++number)), 0U) << endpoint;
+    }
+}
+
+TEST_F(ServerTest, RunsAgainAfterAStop)
+{
+    make(plainOptions());
+    for (int round = 0; round < 3; ++round) {
+        run();
+        const auto console = connect();
+        EXPECT_EQ(introduce(*console, std::to_string(round)), 0U);
+        pause();
+        EXPECT_EQ(LoopbackMessages(*console).ask(QelMessageGetQelTodReq())->getStatus(), 0U); // served on
+    }
+}
+
+TEST_F(ServerTest, ServesAStreamInMemoryWithoutBeingRun)
+{
+    ServerOptions options = plainOptions();
+    options.listen = {};
+    make(options);
+    EXPECT_TRUE(server->endpoints().empty());
+    const auto console = connectInMemory("a test");
+    EXPECT_EQ(introduce(*console, "x"), 0U);
+    std::ostringstream text;
+    server->dumpStatistics(text);
+    EXPECT_THAT(text.str(), StartsWith("Queue of console 1, a test:\n"));
+}
+
+TEST_F(ServerTest, ServesAStreamInMemoryOverTls)
+{
+    ServerOptions options = tlsOptions();
+    options.listen = {};
+    make(options);
+    auto clear = connectInMemory("a test");
+    askForTls(*clear);
+    SSLStream console(clientContext(), std::move(clear));
+    console.handshake();
+    EXPECT_EQ(introduce(console, "x"), 0U);
+    server->finish();
+    LoopbackMessages messages(console);
+    EXPECT_NE(messages.receive<QelMessageKrogConnectionClosedAsync>(), nullptr);
+    EXPECT_TRUE(messages.isClosed());
+}
+
+TEST_F(ServerTest, AStreamInMemoryThatDoesNotAskForTlsIsClosedAtTheEnd)
+{
+    ServerOptions options = tlsOptions();
+    options.listen = {};
+    make(options);
+    const auto console = connectInMemory("a test");
+    server->finish();
+    EXPECT_TRUE(isClosed(*console, true)); // after the abort message, if it had not begun to wait
+}
+
+TEST_F(ServerTest, RefusesANullStream)
+{
+    make(plainOptions());
+    EXPECT_THROW(server->serve(nullptr, "x"), std::invalid_argument);
+}
+
+TEST_F(ServerTest, AfterTheEndNothingIsServed)
+{
+    make(plainOptions());
+    const IPEndpoint endpoint = server->endpoints().front();
+    server->finish();
+    server->finish();
+    const auto console = connectInMemory("late");
+    EXPECT_TRUE(isClosed(*console));
+    EXPECT_ANY_THROW(connect(endpoint));
+    server->run(stopFd()); // returns, though nothing stops it
+}
+
+TEST_F(ServerTest, TheEndSendsTheNoticeAndWaitsForItToBeTaken)
+{
+    make(plainOptions());
+    const auto console = connectInMemory("a test");
+    EXPECT_EQ(introduce(*console, "x"), 0U);
+    server->finish();
+    LoopbackMessages messages(*console);
+    EXPECT_NE(messages.receive<QelMessageKrogConnectionClosedAsync>(), nullptr);
+    EXPECT_TRUE(messages.isClosed());
+}
+
+TEST_F(ServerTest, AConsoleThatTakesNothingIsCutAfterTheLingerTime)
+{
+    ServerOptions options = plainOptions();
+    options.linger = std::chrono::milliseconds(30);
+    make(options);
+    auto ends = protocol::makeMemoryStreams(16); // the notice does not fit
+    server->serve(std::move(ends.second), "a test");
+    const QelMessageGetEnclTypeAndInterfaceVersionReq request(1, 1, 1, 1, "x");
+    ends.first->write(request.serialize(), request.msgLength());
+    std::vector<char> some(80);
+    ends.first->fill(some.data(), some.size()); // the response
+    const auto begin = std::chrono::steady_clock::now();
+    server->finish();
+    EXPECT_GE(std::chrono::steady_clock::now() - begin, options.linger);
+}
+
+TEST_F(ServerTest, WithoutConsolesTheStatisticsSaySo)
+{
+    make(plainOptions());
+    std::ostringstream text;
+    server->dumpStatistics(text);
+    EXPECT_EQ(text.str(), "No console is connected.\n");
+}
+
+TEST_F(ServerTest, NewCredentialsAreForNewConnections)
+{
+    make(tlsOptions());
+    run();
+    const auto before = connectTls();
+    server->setCredentials(protocol::Credentials::fromTexts(Authority::stranger().serverCredentials()));
+    EXPECT_EQ(introduce(*before, "x"), 0U);
+    EXPECT_THROW(connectTls(), StreamIOException); // of a root that the console does not trust
+}
+
+TEST_F(ServerTest, APlainServerTakesNoCredentials)
+{
+    make(plainOptions());
+    EXPECT_THROW(server->setCredentials(*tlsOptions().credentials), std::logic_error);
+}
+
+TEST_F(ServerTest, TooManyHandshakesAreRefusedUntilOneHasIdentifiedItself)
+{
+    ServerOptions options = plainOptions();
+    options.maxHandshakes = 2;
+    make(options);
+    run();
+    const auto first = connect();
+    const auto second = connect();
+    EXPECT_TRUE(isClosed(*connect()));
+    EXPECT_THAT(log.lines(), Contains(EndsWith(": refused: too many connections are in their handshake")));
+    EXPECT_EQ(introduce(*first, "first"), 0U);
+    EXPECT_TRUE(comesTrue([&] { return canIntroduce("later"); }));
+    EXPECT_EQ(introduce(*second, "second"), 0U); // it has kept its place
+}
+
+TEST_F(ServerTest, TooManyHandshakesFromOneAddressAreRefused)
+{
+    ServerOptions options = plainOptions();
+    options.listen = {"127.0.0.1:0", "[::1]:0"};
+    options.maxHandshakesPerAddress = 1;
+    make(options);
+    run();
+    const auto first = connect();
+    EXPECT_TRUE(isClosed(*connect()));
+    EXPECT_THAT(log.lines(),
+                Contains(EndsWith(": refused: too many connections from its address are in their handshake")));
+    const auto other = connect(server->endpoints()[1]); // of another address
+    EXPECT_EQ(introduce(*other, "other"), 0U);
+}
+
+TEST_F(ServerTest, AConnectionThatEndsInItsHandshakeGivesItsPlaceBack)
+{
+    for (const bool plain : {true, false}) {
+        ServerOptions options = plain ? plainOptions() : tlsOptions();
+        options.maxHandshakes = 1;
+        make(options);
+        run();
+        auto first = connect();
+        EXPECT_TRUE(isClosed(*connect(), true));
+        first.reset();
+        EXPECT_TRUE(comesTrue([&] {
+            const auto next = connect();
+            next->setReadDeadline(std::chrono::milliseconds(20));
+            try {
+                return !isClosed(*next, true);
+            } catch (const StreamIOException&) {
+                return true; // it is waited for
+            }
+        }));
+        stop();
+        EXPECT_TRUE(hasEnded());
+    }
+}
+
+TEST_F(ServerTest, AConsoleWithoutAPlaceLearnsThatItIsTurnedAway)
+{
+    ServerOptions options = tlsOptions();
+    options.maxHandshakes = 1;
+    make(options);
+    run();
+    const auto first = connect();
+    const auto second = connect();
+    expect<QelMessageAbortHandshakeAsync>(*second);
+    EXPECT_TRUE(isClosed(*second));
+}
+
+TEST_F(ServerTest, StreamsInMemoryNeedNoPlace)
+{
+    ServerOptions options = plainOptions();
+    options.maxHandshakes = 1;
+    make(options);
+    const auto first = connectInMemory("a");
+    const auto second = connectInMemory("b");
+    EXPECT_EQ(introduce(*second, "b"), 0U);
+    EXPECT_EQ(introduce(*first, "a"), 0U);
+}
+
+TEST_F(ServerTest, ItsConnectionsHaveTheKeepAliveOfTheOptions)
+{
+    ServerOptions options = plainOptions();
+    options.keepAlive = std::chrono::seconds(1234);
+    make(options);
+    run();
+    const auto console = connect();
+    EXPECT_EQ(introduce(*console, "x"), 0U);
+    const IPEndpoint from = console->getSocket().getSocketName();
+    int found = 0;
+    for (int fd = 0; fd < 1024; ++fd) {
+        sockaddr_in peer{};
+        socklen_t length = sizeof(peer);
+        if (::getpeername(fd, reinterpret_cast<sockaddr*>(&peer), &length) != 0 || peer.sin_family != AF_INET) continue;
+        if (ntohs(peer.sin_port) != from.getPort()) continue;
+        unsigned int timeout = 0;
+        length = sizeof(timeout);
+        ASSERT_EQ(::getsockopt(fd, IPPROTO_TCP, TCP_USER_TIMEOUT, &timeout, &length), 0);
+        EXPECT_EQ(timeout, 1234000U);
+        ++found;
+    }
+    EXPECT_EQ(found, 1);
+}
+
+TEST_F(ServerTest, TheLogOfAPeerThatRepeatsItselfIsSummedUp)
+{
+    auto throttled = std::make_shared<RecordingLogBackend>();
+    QelLogger::get().addBackend(std::make_shared<protocol::LogBackendThrottled>(throttled));
+    make(plainOptions());
+    run();
+    const auto console = connect();
+    EXPECT_EQ(introduce(*console, "x"), 0U);
+    LoopbackMessages messages(*console);
+    for (int i = 0; i < 1000; ++i)
+        messages.send(QelMessageGeneric(1, 0x7000, 0x0B0B, NoFlagSet));
+    EXPECT_EQ(messages.ask(QelMessageGetQelTodReq())->getStatus(), 0U);
+    EXPECT_TRUE(comesTrue([&] { // by run(), without further traffic
+        const auto lines = throttled->lines();
+        return !lines.empty() &&
+               lines.back().find("console 1: 990 more lines like this one: console 1: ignored ") != std::string::npos;
+    }));
 }
 
 } // namespace

@@ -5,6 +5,7 @@
 #include <qel/common/Utilities.hpp>
 #include <qel/common/util/PosixError.hpp>
 #include <qel/common/util/UniqueFd.hpp>
+#include <qel/protocol/LogBackendThrottled.hpp>
 #include <qel/protocol/Text.hpp>
 
 #include "base/Library.hpp"
@@ -24,6 +25,7 @@
 #include <sys/uio.h>
 #include <system_error>
 #include <unistd.h>
+#include <utility>
 
 namespace qel::tool {
 
@@ -100,6 +102,12 @@ void requireWritable(const std::string& path)
     if (file.get() < 0) throw FileIOError(error, "cannot write the log " + path);
 }
 
+/// No peer of "qel serve" may push the lines about the others out of the log.
+void registerThrottled(std::shared_ptr<LogBackend> backend)
+{
+    LogBackend::registerBackend(std::make_shared<LogBackendThrottled>(std::move(backend)));
+}
+
 } // namespace
 
 void addLogOptions(CLI::App& app, LogOptions& options)
@@ -122,9 +130,9 @@ void startLogging(const LogOptions& options, const std::string& name)
     if (options.quiet && options.directory.empty() && options.level.empty()) return;
     QelLogger::get().setLevel(options.level.empty() ? options.usual : LogLevel::parse(options.level));
     if (options.directory.empty()) {
-        LogBackend::registerBackend(std::make_shared<LogBackendStderr>());
+        registerThrottled(std::make_shared<LogBackendStderr>());
     } else {
-        LogBackend::registerBackend(
+        registerThrottled(
             std::make_shared<LogBackendRotating>(LogLevel::Inherit, options.directory, name, options.fileBytes));
         requireWritable(options.directory + "/" + name);
     }

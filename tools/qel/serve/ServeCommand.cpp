@@ -1,23 +1,19 @@
 #include "serve/ServeCommand.hpp"
 
-#include <qel/common/net/Listen.hpp>
-#include <qel/common/util/PosixError.hpp>
 #include <qel/protocol/CommandLine.hpp>
 #include <qel/protocol/Hypervisor.hpp>
-#include <qel/protocol/WakeUp.hpp>
+#include <qel/protocol/Server.hpp>
 
 #include "base/Failures.hpp"
 #include "base/Library.hpp"
 #include "base/Logging.hpp"
 #include "base/OptionChecks.hpp"
 #include "base/SignalWatch.hpp"
-#include "hypervisor/HypervisorEngine.hpp"
-#include "server/SerialLoop.hpp"
-#include "server/Server.hpp"
 #include "transport/TransportOptions.hpp"
 
 #include <algorithm>
 #include <cctype>
+#include <chrono>
 #include <csignal>
 #include <cstring>
 #include <initializer_list>
@@ -33,20 +29,24 @@ namespace qel::tool {
 
 namespace {
 
-constexpr int kBacklog = 64;
 constexpr std::size_t kMaxPartitions = 255; // the maximum-sessions response has one byte for them
 constexpr std::size_t kMaxNameBytes = 16;
 constexpr std::size_t kMaxQueueBytes = 1024 * 1024 * 1024;
+constexpr std::uint64_t kMaxHandshakes = 65535;
+constexpr double kMinFrameSeconds = 0.001;
+constexpr double kMaxFrameSeconds = 24 * 60 * 60;
+constexpr std::uint64_t kMaxKeepAliveSeconds = 32767; // of TCP
 
 constexpr std::initializer_list<int> kSignals{SIGTERM, SIGINT, SIGHUP, SIGUSR1};
 
 struct ServeOptions {
-    std::string endpoint = "127.0.0.1:0";
+    ServerOptions server;
     TransportOptions transport;
     std::vector<std::string> partitions; ///< "ID=COMMAND"
     std::string term = "vt220";
-    std::uint32_t maxConsoles = HypervisorEngine::kDefaultMaxConsoles;
-    std::size_t queueBytes = ConnectionLimits().queueBytes;
+    std::uint32_t maxConsoles = ServerOptions().maxConsoles;
+    double frameSeconds = std::chrono::duration<double>(ServerOptions().frameTimeout).count();
+    std::uint32_t keepAliveSeconds = static_cast<std::uint32_t>(ServerOptions().keepAlive.count());
     std::string family;
     std::string version;
     std::string capabilities = std::string(QelCapabilities::size(), '1');
@@ -109,25 +109,14 @@ MachineInfo parseMachine(const ServeOptions& options)
     return machine;
 }
 
-Socket openListener(const IPEndpoint& endpoint)
-{
-    try {
-        return listenOn(endpoint, kBacklog);
-    } catch (const PosixError& error) {
-        throw CommandFailure(ExitStatus::CannotConnect, "cannot listen on " + endpoint.str() + ": " + error.what());
-    }
-}
-
 /// The options, parsed.
 struct ServePlan {
-    IPEndpoint endpoint;
+    ServerOptions server; ///< without the credentials, which are loaded when it starts
     std::map<std::uint16_t, std::string> commands;
     std::string term;
     MachineInfo machine;
     QelCapabilities capabilities;
-    std::uint8_t maxConsoles = 0;
     TransportOptions transport;
-    std::size_t queueBytes = 0;
     LogOptions log;
 };
 
@@ -137,20 +126,51 @@ void addPartitions(Hypervisor& machine, const ServePlan& plan)
         machine.addPartition(command.first, commandLine(command.second, {plan.term, {}}));
 }
 
+ServerOptions parseServer(const ServeOptions& options)
+{
+    for (const std::string& endpoint : options.server.listen)
+        checkTransport(options.transport, endpoint);
+    ServerOptions server = options.server;
+    server.plain = options.transport.plain;
+    server.pins = options.transport.pins;
+    server.maxConsoles = static_cast<std::uint8_t>(options.maxConsoles);
+    server.handshakeTimeout = options.transport.handshakeTimeout();
+    server.frameTimeout =
+        std::chrono::duration_cast<std::chrono::milliseconds>(std::chrono::duration<double>(options.frameSeconds));
+    server.keepAlive = std::chrono::seconds(options.keepAliveSeconds);
+    return server;
+}
+
 ServePlan makePlan(const ServeOptions& options)
 {
     ServePlan plan;
-    checkTransport(options.transport, options.endpoint);
-    plan.endpoint = IPEndpoint(options.endpoint);
+    plan.server = parseServer(options);
     plan.transport = options.transport;
     plan.commands = parsePartitions(options.partitions);
     plan.term = options.term;
     plan.machine = parseMachine(options);
     plan.capabilities = QelCapabilities(options.capabilities);
-    plan.maxConsoles = static_cast<std::uint8_t>(options.maxConsoles);
-    plan.queueBytes = options.queueBytes;
     plan.log = options.log;
     return plan;
+}
+
+/// The key leaves the memory when the server has been made.
+std::unique_ptr<Server> makeServer(Hypervisor& machine, const ServePlan& plan)
+{
+    ServerOptions options = plan.server;
+    options.credentials = loadCredentials(plan.transport);
+    return std::make_unique<Server>(machine, options);
+}
+
+void announce(const Server& server)
+{
+    const std::vector<IPEndpoint> endpoints = server.endpoints();
+    for (const IPEndpoint& endpoint : endpoints)
+        std::cout << endpoint << '\n';
+    std::cout << std::flush;
+    flushOutput();
+    for (const IPEndpoint& endpoint : endpoints)
+        logLine(LogLevel::Info, "listening on ", endpoint);
 }
 
 /// On SIGHUP: loads the credentials from their files again, for new connections.
@@ -158,7 +178,7 @@ void reload(Server& server, const TransportOptions& transport)
 {
     if (transport.plain) return logLine(LogLevel::Info, "SIGHUP: connections are plain, there is nothing to load");
     try {
-        server.setContext(loadCredentials(transport)->makeServerContext());
+        server.setCredentials(*loadCredentials(transport));
         logLine(LogLevel::Info, "SIGHUP: loaded ", transport.paths().certificate, " for new connections");
     } catch (const std::exception& error) {
         logLine(LogLevel::Error, "SIGHUP: the credentials stay as they were: ", userMessage(error));
@@ -195,32 +215,17 @@ ExitStatus runServe(const ServePlan& plan)
     static_cast<void>(std::signal(SIGPIPE, SIG_IGN)); // a log pipe without a reader must not end the server
     static_cast<void>(std::signal(SIGCHLD, SIG_DFL)); // ignored, as a parent may leave it, it hides how commands end
     SignalWatch signals(kSignals);
-    const auto credentials = loadCredentials(plan.transport);
-    auto context = credentials ? credentials->makeServerContext() : nullptr;
-    Socket listener = openListener(plan.endpoint);
-    const IPEndpoint listening = listener.getSocketName();
-
     Hypervisor machine(plan.machine, plan.capabilities);
     addPartitions(machine, plan);
-    WakeUp serialWake;
-    HypervisorEngine hypervisor(machine, plan.maxConsoles, [&] { serialWake.interrupt(); });
-    ConnectionLimits limits;
-    limits.handshake = plan.transport.handshakeTimeout();
-    limits.queueBytes = plan.queueBytes;
-    Server server(hypervisor, std::move(listener), limits, std::move(context), plan.transport.pins);
-    SerialLoop serial(hypervisor, serialWake);
-
-    std::cout << listening << std::endl;
-    flushOutput();
-    logLine(LogLevel::Info, "listening on ", listening);
-    const int signal = serveUntilStopped(server, signals, plan.transport);
+    const auto server = makeServer(machine, plan);
+    announce(*server);
+    const int signal = serveUntilStopped(*server, signals, plan.transport);
 
     logLine(LogLevel::Info, "stopping: signal ", signal);
-    logStatistics(server);
+    logStatistics(*server);
     for (const int number : kSignals)
         static_cast<void>(std::signal(number, SIG_IGN)); // a second one must not cut the shutdown short
-    hypervisor.shutDown();
-    server.finish();
+    server->finish();
     return ExitStatus::Done;
 }
 
@@ -243,16 +248,50 @@ void addIdentityOptions(CLI::App& command, ServeOptions& options)
         ->check(capabilityValidator());
 }
 
+void addLimitOptions(CLI::App& command, ServeOptions& options)
+{
+    command.add_option("--max-consoles", options.maxConsoles, "Consoles that may be connected at a time, 1 to 255")
+        ->transform(integerIn(1, 255))
+        ->capture_default_str();
+    command
+        .add_option("--max-handshakes", options.server.maxHandshakes,
+                    "Connections that may be in their handshake at a time")
+        ->transform(integerIn(1, kMaxHandshakes))
+        ->capture_default_str();
+    command
+        .add_option("--max-handshakes-per-address", options.server.maxHandshakesPerAddress,
+                    "The same from one IPv4 address, or from one IPv6 network of 64 bits")
+        ->transform(integerIn(1, kMaxHandshakes))
+        ->capture_default_str();
+    command
+        .add_option("--queue-limit", options.server.queueBytes,
+                    "Bytes that may be queued for a console, half of them serial data")
+        ->type_name("BYTES")
+        ->transform(integerIn(1, kMaxQueueBytes))
+        ->capture_default_str();
+    command.add_option("--frame-timeout", options.frameSeconds, "Seconds from the first byte of a message to its last")
+        ->type_name("SECONDS")
+        ->check(numberIn(kMinFrameSeconds, kMaxFrameSeconds))
+        ->capture_default_str();
+    command.add_option("--keepalive", options.keepAliveSeconds, "Seconds until a peer that is gone is noticed")
+        ->type_name("SECONDS")
+        ->transform(integerIn(1, kMaxKeepAliveSeconds))
+        ->capture_default_str();
+}
+
 } // namespace
 
 CLI::App& addServeCommand(CLI::App& parent, Action& action)
 {
     CLI::App& command = addCommand(parent, "serve", "Run the hypervisor end: serve consoles until a signal stops it");
     const auto options = std::make_shared<ServeOptions>();
-    command.add_option("--listen", options->endpoint, "Where to listen; port 0 lets the system choose one")
+    command
+        .add_option("--listen", options->server.listen,
+                    "Where to listen; port 0 lets the system choose one; may be repeated")
         ->type_name("ENDPOINT")
+        ->allow_extra_args(false)
         ->check(endpointValidator())
-        ->capture_default_str();
+        ->default_str(options->server.listen.front());
     addTransportOptions(command, options->transport);
     command
         .add_option(
@@ -264,15 +303,7 @@ CLI::App& addServeCommand(CLI::App& parent, Action& action)
         ->type_name("NAME")
         ->check(CLI::Validator(checkTerm, ""))
         ->capture_default_str();
-    command.add_option("--max-consoles", options->maxConsoles, "Consoles that may be connected at a time, 1 to 255")
-        ->transform(integerIn(1, 255))
-        ->capture_default_str();
-    command
-        .add_option("--queue-limit", options->queueBytes,
-                    "Bytes that may be queued for a console, half of them serial data")
-        ->type_name("BYTES")
-        ->transform(integerIn(1, kMaxQueueBytes))
-        ->capture_default_str();
+    addLimitOptions(command, *options);
     addIdentityOptions(command, *options);
     addLogOptions(command, options->log);
     command.callback([&action, options] { action = [plan = makePlan(*options)] { return runServe(plan); }; });

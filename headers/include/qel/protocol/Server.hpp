@@ -1,0 +1,94 @@
+#pragma once
+
+#include <qel/common/io/Stream.hpp>
+#include <qel/common/net/IPEndpoint.hpp>
+#include <qel/common/util/Poll.hpp>
+#include <qel/protocol/Credentials.hpp>
+#include <qel/protocol/Hypervisor.hpp>
+#include <qel/protocol/ProtocolExport.hpp>
+#include <qel/protocol/ServerOptions.hpp>
+
+#include <memory>
+#include <ostream>
+#include <string>
+#include <vector>
+
+namespace qel::protocol {
+
+/// Serves consoles for a hypervisor: listens, admits, answers, moves serial data, and ends in order.
+///
+///     Hypervisor machine;
+///     machine.addPartition(1, commandLine("/bin/sh"));
+///     ServerOptions options;
+///     options.credentials = Credentials::fromDirectory("/etc/qel", "server");
+///     Server server(machine, options);
+///     server.run(stop.getPollFd()); // until another thread, or a signal, makes `stop` readable
+///     server.finish();
+///
+/// **Threads.** One for the serial lines of all partitions, and two for each console: one that protects the connection
+/// and reads, and one that writes. They take none of the program's signals. run() accepts connections on the thread
+/// that calls it. No console waits for another one.
+///
+/// **Failures.** What concerns one connection is logged, and ends at most that connection. A want of memory,
+/// descriptors or threads is logged, and run() tries again.
+///
+/// **Log.** Lines go to logger(). A peer can cause many: register a LogBackendThrottled.
+///
+/// A connection that breaks while a message is written must not end the process: ignore SIGPIPE if the log is a pipe.
+/// Sockets cause no SIGPIPE.
+///
+/// Lifetime: borrows the hypervisor, which must outlive this object. Thread safety: one thread owns it (constructor,
+/// run(), dumpStatistics(), finish(), destructor); endpoints(), setCredentials() and serve() from any thread.
+class QEL_PROTOCOL_EXPORT Server {
+public:
+    /// Listens. Connections are accepted in run(); until then they wait.
+    /// @throws std::invalid_argument  names the option: "listen" (not an endpoint), "credentials" (neither credentials
+    ///         nor plain), "plain" (also with credentials, or to listen on an address that is not a loopback address),
+    ///         "pins" (with plain), "maxConsoles", "maxHandshakes", "maxHandshakesPerAddress", "queueBytes",
+    ///         "handshakeTimeout", "frameTimeout", "keepAlive", "linger"
+    /// @throws CannotListen  "cannot listen on ENDPOINT: ..."
+    /// @throws SSLException  OpenSSL cannot use the credentials
+    /// @throws std::logic_error  another server serves the hypervisor
+    /// @throws PosixError, std::system_error  no descriptor or thread is left
+    Server(Hypervisor& hypervisor, const ServerOptions& options);
+
+    /// finish()
+    ~Server();
+
+    Server(const Server&) = delete;
+    Server& operator=(const Server&) = delete;
+
+    /// Where it listens, in the order of the options, with the ports that the system has chosen. Empty after finish().
+    std::vector<IPEndpoint> endpoints() const;
+
+    /// Accepts connections until `stop` becomes readable. Consoles are served meanwhile and afterwards, until finish().
+    /// May be called again. Returns at once after finish().
+    void run(const PollFd& stop);
+
+    /// Serves a console on a stream of one's own, such as one of makeMemoryStreams(): with TLS or plain, as the options
+    /// say. Needs no run(). The limits on handshakes do not apply.
+    /// @param stream  connected, not null; closed when the console is done with, and destroyed later
+    /// @param address  of the console, for Peer and the log: any text
+    /// @throws std::invalid_argument  "stream"
+    /// @throws PosixError, SSLException, std::system_error  no descriptor, memory or thread is left
+    void serve(std::unique_ptr<Stream> stream, const std::string& address);
+
+    /// Replaces the credentials for new connections; those that exist, also in their handshake, keep theirs.
+    /// @throws std::logic_error  connections are plain
+    /// @throws SSLException  OpenSSL cannot use them; nothing has changed
+    void setCredentials(const Credentials& credentials);
+
+    /// Prints the statistics of each console's queue, in the order of connecting. docs/connection.md explains them.
+    void dumpStatistics(std::ostream& os);
+
+    /// Ends in order: stops listening, sends the notices of the end, gives the consoles ServerOptions::linger to take
+    /// what is queued for them, and cuts those that have not. The partitions' lines are taken down. Does nothing the
+    /// second time.
+    void finish() noexcept;
+
+private:
+    struct Impl;
+    const std::unique_ptr<Impl> mImpl;
+};
+
+} // namespace qel::protocol

@@ -1,0 +1,77 @@
+#include "server/FrameStream.hpp"
+
+#include <algorithm>
+#include <cstring>
+
+namespace qel::protocol {
+
+namespace {
+
+/// Most frames fit and are read with one system call. An idle console keeps the memory, so it is not the longest frame.
+constexpr std::size_t kAheadBytes = 2048;
+
+} // namespace
+
+FrameStream::FrameStream(Stream& stream, ReadAhead readAhead)
+    : mStream(stream), mAhead(readAhead == ReadAhead::Yes ? new char[kAheadBytes] : nullptr) // not cleared: see read()
+{}
+
+FrameStream::~FrameStream() = default;
+
+void FrameStream::limitFrames(std::chrono::milliseconds timeout)
+{
+    mFrameTimeout = timeout;
+    mHasDeadline = true; // that of the stream below: the next frame begins without
+}
+
+std::size_t FrameStream::read(char* buffer, std::size_t length)
+{
+    if (length == 0) return 0;
+    if (mAheadBegin == mAheadEnd) {
+        if (mAhead == nullptr || length >= kAheadBytes) return pReceive(buffer, length);
+        mAheadBegin = 0;
+        mAheadEnd = 0;
+        mAheadEnd = pReceive(mAhead.get(), kAheadBytes);
+    }
+    return pTake(buffer, length);
+}
+
+void FrameStream::write(const char* buffer, std::size_t length) { mStream.write(buffer, length); }
+
+void FrameStream::close() { mStream.close(); }
+
+void FrameStream::setReadDeadline(std::chrono::milliseconds timeout) { mStream.setReadDeadline(timeout); }
+
+void FrameStream::setWriteDeadline(std::chrono::milliseconds timeout) { mStream.setWriteDeadline(timeout); }
+
+/// Reads from the stream below, with the deadline of the frame or without one. Changing a deadline may cost a system
+/// call, so it is changed only when there is something to wait for.
+std::size_t FrameStream::pReceive(char* buffer, std::size_t length)
+{
+    if (mFrameTimeout > std::chrono::milliseconds::zero()) {
+        if (mInFrame && !mIsTimed) {
+            mStream.setReadDeadline(mFrameTimeout);
+            mIsTimed = true;
+            mHasDeadline = true;
+        } else if (!mInFrame && mHasDeadline) {
+            mStream.clearReadDeadline();
+            mHasDeadline = false;
+        }
+    }
+    const std::size_t count = mStream.read(buffer, length);
+    if (count > 0) mInFrame = true;
+    return count;
+}
+
+/// Copies what was read ahead. The copy is cheaper than the system calls that it saves.
+std::size_t FrameStream::pTake(char* buffer, std::size_t length)
+{
+    const std::size_t count = std::min(length, mAheadEnd - mAheadBegin);
+    if (count == 0) return 0;
+    std::memcpy(buffer, mAhead.get() + mAheadBegin, count);
+    mAheadBegin += count;
+    mInFrame = true;
+    return count;
+}
+
+} // namespace qel::protocol

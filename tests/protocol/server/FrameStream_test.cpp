@@ -1,0 +1,209 @@
+#include <qel/common/io/StreamIOException.hpp>
+
+#include "server/FrameStream.hpp"
+
+#include <algorithm>
+#include <cstring>
+#include <deque>
+#include <gmock/gmock.h>
+#include <string>
+#include <vector>
+
+namespace qel::test {
+
+namespace {
+
+using protocol::FrameStream;
+using std::chrono::milliseconds;
+using ::testing::ElementsAre;
+using ::testing::IsEmpty;
+
+constexpr milliseconds kFrame(700);
+
+/// Delivers chunks, and records each read and each deadline that was in force then.
+class RecordingStream : public Stream {
+public:
+    std::deque<std::string> chunks;
+    std::vector<std::size_t> lengths;
+    std::vector<long> deadlines; ///< -1: none
+    std::vector<long> settings;  ///< of the deadline, in order
+    std::string written;
+    bool isClosed = false;
+
+    void close() override { isClosed = true; }
+    void setReadDeadline(milliseconds timeout) override
+    {
+        mDeadline = timeout.count();
+        settings.push_back(mDeadline);
+    }
+    void setWriteDeadline(milliseconds timeout) override { mWriteDeadline = timeout.count(); }
+    std::size_t read(char* buffer, std::size_t length) override
+    {
+        lengths.push_back(length);
+        deadlines.push_back(mDeadline);
+        if (chunks.empty()) return 0;
+        std::string& chunk = chunks.front();
+        const std::size_t count = std::min(length, chunk.size());
+        std::memcpy(buffer, chunk.data(), count);
+        chunk.erase(0, count);
+        if (chunk.empty()) chunks.pop_front();
+        return count;
+    }
+    void write(const char* buffer, std::size_t length) override { written.append(buffer, length); }
+
+    long writeDeadline() const { return mWriteDeadline; }
+
+private:
+    long mDeadline = 10000; // of the handshake
+    long mWriteDeadline = 0;
+};
+
+std::string take(FrameStream& stream, std::size_t length)
+{
+    std::string bytes(length, '\0');
+    stream.fill(&bytes[0], length);
+    return bytes;
+}
+
+TEST(FrameStream, ReadsAFrameThatHasArrivedWithOneCallAndNoDeadline)
+{
+    RecordingStream below;
+    below.chunks = {"headbody", "headbody"};
+    FrameStream stream(below, FrameStream::ReadAhead::Yes);
+    stream.limitFrames(kFrame);
+    for (int frame = 0; frame < 2; ++frame) {
+        stream.beginFrame();
+        EXPECT_EQ(take(stream, 4), "head");
+        EXPECT_EQ(take(stream, 4), "body");
+    }
+    EXPECT_THAT(below.deadlines, ElementsAre(-1, -1));
+}
+
+TEST(FrameStream, ReadsAheadSeveralFrames)
+{
+    RecordingStream below;
+    below.chunks = {"111122223333"};
+    FrameStream stream(below, FrameStream::ReadAhead::Yes);
+    EXPECT_EQ(take(stream, 4), "1111");
+    EXPECT_EQ(take(stream, 4), "2222");
+    EXPECT_EQ(take(stream, 4), "3333");
+    EXPECT_EQ(below.lengths.size(), 1U);
+}
+
+TEST(FrameStream, ALongRestIsReadWithoutACopy)
+{
+    RecordingStream below;
+    below.chunks = {"head" + std::string(4000, 'x'), std::string(12000, 'y')};
+    FrameStream stream(below, FrameStream::ReadAhead::Yes);
+    EXPECT_EQ(take(stream, 8), "headxxxx");
+    EXPECT_EQ(take(stream, 15996), std::string(3996, 'x') + std::string(12000, 'y'));
+    EXPECT_THAT(below.lengths, ElementsAre(2048, 15996 - 2040, 12000));
+}
+
+TEST(FrameStream, WithoutReadingAheadAsksForNoMoreThanItsReader)
+{
+    RecordingStream below;
+    below.chunks = {"headbodynext"};
+    FrameStream stream(below, FrameStream::ReadAhead::No);
+    EXPECT_EQ(take(stream, 4), "head");
+    EXPECT_EQ(take(stream, 4), "body");
+    EXPECT_THAT(below.lengths, ElementsAre(4, 4));
+}
+
+TEST(FrameStream, TheRestOfAFrameHasADeadlineAndTheNextFrameHasNone)
+{
+    for (const auto readAhead : {FrameStream::ReadAhead::No, FrameStream::ReadAhead::Yes}) {
+        RecordingStream below;
+        below.chunks = {"he", "ad", "b", "ody", "x"};
+        FrameStream stream(below, readAhead);
+        stream.limitFrames(kFrame);
+        stream.beginFrame();
+        EXPECT_EQ(take(stream, 4), "head");
+        EXPECT_EQ(take(stream, 4), "body");
+        EXPECT_TRUE(stream.isInFrame());
+        stream.beginFrame();
+        EXPECT_FALSE(stream.isInFrame());
+        EXPECT_EQ(take(stream, 1), "x");
+        EXPECT_THAT(below.deadlines, ElementsAre(-1, 700, 700, 700, -1));
+    }
+}
+
+TEST(FrameStream, ABeginningThatWasReadAheadIsWithinItsFrame)
+{
+    RecordingStream below;
+    below.chunks = {"headbodyhe", "ad"};
+    FrameStream stream(below, FrameStream::ReadAhead::Yes);
+    stream.limitFrames(kFrame);
+    stream.beginFrame();
+    EXPECT_EQ(take(stream, 8), "headbody");
+    stream.beginFrame();
+    EXPECT_EQ(take(stream, 4), "head");
+    EXPECT_THAT(below.deadlines, ElementsAre(-1, 700));
+}
+
+TEST(FrameStream, ABeginningThatWasReadAheadHasATimeOfItsOwn)
+{
+    RecordingStream below;
+    below.chunks = {"he", "adhe", "ad"};
+    FrameStream stream(below, FrameStream::ReadAhead::Yes);
+    stream.limitFrames(kFrame);
+    for (int frame = 0; frame < 2; ++frame) {
+        stream.beginFrame();
+        EXPECT_EQ(take(stream, 4), "head");
+    }
+    EXPECT_THAT(below.settings, ElementsAre(-1, 700, 700));
+}
+
+TEST(FrameStream, BeforeTheLimitTheDeadlinesBelowAreLeftAlone)
+{
+    RecordingStream below;
+    below.chunks = {"h", "e", "x"};
+    FrameStream stream(below, FrameStream::ReadAhead::Yes);
+    stream.beginFrame();
+    EXPECT_EQ(take(stream, 2), "he");
+    stream.limitFrames(kFrame);
+    stream.beginFrame();
+    EXPECT_EQ(take(stream, 1), "x");
+    EXPECT_THAT(below.deadlines, ElementsAre(10000, 10000, -1));
+}
+
+TEST(FrameStream, TheEndOfTheStreamIsItsEnd)
+{
+    for (const auto readAhead : {FrameStream::ReadAhead::No, FrameStream::ReadAhead::Yes}) {
+        RecordingStream below;
+        FrameStream stream(below, readAhead);
+        char byte = 0;
+        EXPECT_EQ(stream.read(&byte, 1), 0U);
+        EXPECT_EQ(stream.read(&byte, 1), 0U);
+        EXPECT_FALSE(stream.isInFrame());
+    }
+}
+
+TEST(FrameStream, ReadingNothingAsksForNothing)
+{
+    RecordingStream below;
+    FrameStream stream(below, FrameStream::ReadAhead::Yes);
+    char byte = 0;
+    EXPECT_EQ(stream.read(&byte, 0), 0U);
+    EXPECT_THAT(below.lengths, IsEmpty());
+}
+
+TEST(FrameStream, PassesTheRestThrough)
+{
+    RecordingStream below;
+    FrameStream stream(below, FrameStream::ReadAhead::Yes);
+    stream.write("out", 3);
+    stream.setWriteDeadline(milliseconds(5));
+    stream.setReadDeadline(milliseconds(6));
+    char byte = 0;
+    static_cast<void>(stream.read(&byte, 1));
+    stream.close();
+    EXPECT_EQ(below.written, "out");
+    EXPECT_EQ(below.writeDeadline(), 5);
+    EXPECT_THAT(below.deadlines, ElementsAre(6));
+    EXPECT_TRUE(below.isClosed);
+}
+
+} // namespace
+
+} // namespace qel::test
