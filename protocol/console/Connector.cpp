@@ -100,7 +100,7 @@ ConnectedStream Connector::adopt(std::unique_ptr<Stream> stream, int descriptor,
 {
     if (descriptor < 0) descriptor = descriptorOf(*stream);
     handshakeEnd = std::min(end, TimeProvider::steady() + mHandshakeTimeout);
-    ConnectedStream connected{std::move(stream), descriptor, {}};
+    ConnectedStream connected{std::move(stream), nullptr, descriptor, {}};
     closeSwitch.watch(connected.stream.get());
     try {
         if (mContext != nullptr) pProtect(connected, handshakeEnd, closeSwitch);
@@ -119,7 +119,9 @@ void Connector::pProtect(ConnectedStream& connected, TimePoint end, CloseSwitch&
         limitTo(*connected.stream, end);
         requestUpgrade(*connected.stream, connected.descriptor);
         closeSwitch.watch(nullptr); // the plain stream moves into the protected one
-        auto owned = std::make_unique<SSLStream>(*mContext, std::move(connected.stream));
+        auto readAhead = std::make_unique<ReadAhead>(std::move(connected.stream));
+        connected.readAhead = readAhead.get();
+        auto owned = std::make_unique<SSLStream>(*mContext, std::move(readAhead));
         SSLStream& tls = *owned;
         connected.stream = std::move(owned);
         closeSwitch.watch(&tls);

@@ -6,6 +6,7 @@
 #include <qel/protocol/PeerIdentity.hpp>
 
 #include "console/CloseSwitch.hpp"
+#include "console/ReadAhead.hpp"
 #include "console/TimeLeft.hpp"
 
 #include <chrono>
@@ -17,7 +18,8 @@ namespace qel::protocol {
 /// A connected stream, protected as the options say.
 struct ConnectedStream {
     std::unique_ptr<Stream> stream;
-    int descriptor = -1; ///< of the stream; -1: none
+    ReadAhead* readAhead = nullptr; ///< under the TLS of the stream; null: a plain connection
+    int descriptor = -1;            ///< of the stream; -1: none
     PeerIdentity peer;
 };
 

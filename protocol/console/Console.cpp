@@ -101,7 +101,9 @@ std::unique_ptr<QelMessage> Console::pRequest(const QelMessage& message, millise
 
 detail::PendingExchange Console::pStart(const QelMessage& message)
 {
-    return detail::PendingExchange(mCore, mCore->start(message, deadlineIn(mCore->requestTimeout())));
+    auto exchange = std::make_unique<Exchange>(message);
+    mCore->start(message, *exchange, deadlineIn(mCore->requestTimeout()));
+    return detail::PendingExchange(mCore, std::move(exchange));
 }
 
 void Console::pOnNotice(const QelMessageRegistry::Identifier& identity, std::function<bool(const QelMessage&)> handler)

@@ -178,11 +178,12 @@ PollFd ConsoleCore::getPollFd(PollEvents events) const
 
 std::unique_ptr<QelMessage> ConsoleCore::exchange(const QelMessage& request, TimePoint end)
 {
-    const std::shared_ptr<Exchange> exchange = start(request, end);
+    Exchange exchange(request);
+    start(request, exchange, end);
     try {
-        return finish(*exchange, end);
+        return finish(exchange, end);
     } catch (...) {
-        exchange->isAbandoned = true;
+        abandon(exchange);
         throw;
     }
 }
@@ -194,13 +195,12 @@ std::unique_ptr<QelMessage> ConsoleCore::require(const QelMessage& request, Time
     return response;
 }
 
-std::shared_ptr<Exchange> ConsoleCore::start(const QelMessage& request, TimePoint end)
+void ConsoleCore::start(const QelMessage& request, Exchange& exchange, TimePoint end)
 {
     requireSendable(request, true, "request");
     if (mExchanges.isFull()) throw Error("too many requests are under way without a response", mServer);
-    auto exchange = std::make_shared<Exchange>(request);
     const bool isAlone = mExchanges.isEmpty();
-    mExchanges.add(exchange);
+    mExchanges.add(request, &exchange);
     try {
         if (isAlone) { // the peer has nothing to answer, so it takes the request
             pLink().send(request, end);
@@ -208,10 +208,9 @@ std::shared_ptr<Exchange> ConsoleCore::start(const QelMessage& request, TimePoin
             sendAmongOthers(request, end, [] { return true; });
         }
     } catch (...) {
-        mExchanges.remove(*exchange);
+        mExchanges.removeLast(request);
         throw;
     }
-    return exchange;
 }
 
 std::unique_ptr<QelMessage> ConsoleCore::finish(Exchange& exchange, TimePoint end)
@@ -326,9 +325,7 @@ void ConsoleCore::dropSerial(const std::shared_ptr<SerialState>& state) noexcept
         if (state->isOpen && mLink != nullptr && mLink->isUsable() && !mExchanges.isFull() &&
             mLink->await(false, TimeProvider::steady()).send) {
             const QelMessageVirtualSerialCloseReq request(state->partition, state->connection, false);
-            auto exchange = std::make_shared<Exchange>(request);
-            exchange->isAbandoned = true;
-            mExchanges.add(exchange);
+            mExchanges.add(request, nullptr);
             mLink->send(request, deadlineIn(mRequestTimeout));
         }
     } catch (const std::exception& error) {

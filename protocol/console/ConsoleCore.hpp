@@ -63,9 +63,11 @@ public:
     /// exchange() for a request that must be granted. @throws StatusError
     std::unique_ptr<QelMessage> require(const QelMessage& request, TimePoint end);
     /// Sends a request.
-    std::shared_ptr<Exchange> start(const QelMessage& request, TimePoint end);
+    /// @param exchange  made for this request; borrowed until it is done or abandoned
+    void start(const QelMessage& request, Exchange& exchange, TimePoint end);
     /// Waits for the response to a request.
     std::unique_ptr<QelMessage> finish(Exchange& exchange, TimePoint end);
+    void abandon(const Exchange& exchange) noexcept { mExchanges.abandon(exchange); }
     void send(const QelMessage& notice, TimePoint end);
     /// Sends a message; receives others while the peer takes nothing.
     /// @param isWanted  asked before each wait

@@ -5,32 +5,45 @@
 
 namespace qel::protocol {
 
-void Exchanges::remove(const Exchange& exchange) noexcept
+void Exchanges::add(const QelMessage& request, Exchange* exchange)
 {
-    const auto found =
-        std::find_if(mExchanges.begin(), mExchanges.end(), [&](const auto& entry) { return entry.get() == &exchange; });
-    if (found != mExchanges.end()) mExchanges.erase(found);
+    mEntries.push_back({request.getCallerId(), static_cast<unsigned short>(request.getFunction()),
+                        static_cast<unsigned short>(request.getOperation()), exchange});
+}
+
+void Exchanges::removeLast(const QelMessage& request) noexcept
+{
+    const auto found = std::find_if(mEntries.rbegin(), mEntries.rend(),
+                                    [&](const Entry& entry) { return entry.callerId == request.getCallerId(); });
+    if (found != mEntries.rend()) mEntries.erase(std::next(found).base());
+}
+
+void Exchanges::abandon(const Exchange& exchange) noexcept
+{
+    for (Entry& entry : mEntries) {
+        if (entry.exchange == &exchange) entry.exchange = nullptr;
+    }
 }
 
 const char* Exchanges::deliver(std::unique_ptr<QelMessage> response)
 {
-    const auto found = std::find_if(mExchanges.begin(), mExchanges.end(),
-                                    [&](const auto& entry) { return entry->callerId == response->getCallerId(); });
-    if (found == mExchanges.end()) return "a response to a request that was not sent";
-    Exchange& exchange = **found;
-    if (exchange.function != response->getFunction() || exchange.operation != response->getOperation()) {
+    const auto found = std::find_if(mEntries.begin(), mEntries.end(),
+                                    [&](const Entry& entry) { return entry.callerId == response->getCallerId(); });
+    if (found == mEntries.end()) return "a response to a request that was not sent";
+    if (found->function != response->getFunction() || found->operation != response->getOperation()) {
         return "a response of another kind than its request";
     }
-    if (!exchange.isAbandoned) exchange.response = std::move(response);
-    mExchanges.erase(found);
+    if (found->exchange != nullptr) found->exchange->response = std::move(response);
+    mEntries.erase(found);
     return nullptr;
 }
 
 void Exchanges::failAll(const std::exception_ptr& failure) noexcept
 {
-    for (const auto& exchange : mExchanges)
-        exchange->failure = failure;
-    mExchanges.clear();
+    for (const Entry& entry : mEntries) {
+        if (entry.exchange != nullptr) entry.exchange->failure = failure;
+    }
+    mEntries.clear();
 }
 
 } // namespace qel::protocol

@@ -5,26 +5,23 @@
 #include <cstddef>
 #include <exception>
 #include <memory>
-#include <utility>
 #include <vector>
 
 namespace qel::protocol {
 
-/// A request under way, or its response. Thread safety: one thread.
+/// What came of a request. Thread safety: one thread.
 struct Exchange {
-    explicit Exchange(const QelMessage& request)
-        : callerId(request.getCallerId()), function(request.getFunction()), operation(request.getOperation())
-    {}
+    explicit Exchange(const QelMessage& request) : function(request.getFunction()), operation(request.getOperation()) {}
+    Exchange(const Exchange&) = delete;
+    Exchange& operator=(const Exchange&) = delete;
 
     bool isDone() const noexcept { return response != nullptr || failure != nullptr || isTaken; }
 
-    const unsigned int callerId;
     const unsigned short function;
     const unsigned short operation;
     std::unique_ptr<QelMessage> response;
     std::exception_ptr failure; ///< there will be no response
     bool isTaken = false;       ///< the response has been handed out
-    bool isAbandoned = false;   ///< nobody waits for the response; it is dropped
 };
 
 /// The requests under way of one connection, in the order in which they were sent. A hypervisor answers in this order,
@@ -36,14 +33,17 @@ public:
     /// memory of a console that goes on asking.
     static constexpr std::size_t kMost = 4096;
 
-    bool isFull() const noexcept { return mExchanges.size() >= kMost; }
-    bool isEmpty() const noexcept { return mExchanges.empty(); }
+    bool isFull() const noexcept { return mEntries.size() >= kMost; }
+    bool isEmpty() const noexcept { return mEntries.empty(); }
 
-    void add(std::shared_ptr<Exchange> exchange) { mExchanges.push_back(std::move(exchange)); }
-    /// Forgets a request that could not be sent.
-    void remove(const Exchange& exchange) noexcept;
+    /// @param exchange  gets the response; borrowed until then or until abandon(). Null: the response is dropped
+    void add(const QelMessage& request, Exchange* exchange);
+    /// Forgets the request that was added last: it could not be sent.
+    void removeLast(const QelMessage& request) noexcept;
+    /// Nobody waits for this response any more; it is dropped.
+    void abandon(const Exchange& exchange) noexcept;
 
-    /// Hands a response to its request, or drops it when that is abandoned.
+    /// Hands a response to its request.
     /// @return what is wrong with the response; null: nothing
     const char* deliver(std::unique_ptr<QelMessage> response);
 
@@ -51,7 +51,14 @@ public:
     void failAll(const std::exception_ptr& failure) noexcept;
 
 private:
-    std::vector<std::shared_ptr<Exchange>> mExchanges;
+    struct Entry {
+        unsigned int callerId;
+        unsigned short function;
+        unsigned short operation;
+        Exchange* exchange; // null: abandoned
+    };
+
+    std::vector<Entry> mEntries;
 };
 
 } // namespace qel::protocol

@@ -54,9 +54,10 @@ std::size_t FrameLink::Input::read(char* buffer, std::size_t length)
 
 FrameLink::FrameLink(ConnectedStream connected, const std::string& server, milliseconds frameTimeout,
                      CloseSwitch& closeSwitch)
-    : mStream(std::move(connected.stream)), mTls(dynamic_cast<SSLStream*>(mStream.get())),
-      mDescriptor(connected.descriptor), mServer(server), mFrameTimeout(frameTimeout), mCloseSwitch(closeSwitch),
-      mInput(*mStream), mMessages(mInput, messageRegistry())
+    : mStream(std::move(connected.stream)), mReadAhead(connected.readAhead),
+      mTls(mReadAhead == nullptr ? nullptr : static_cast<SSLStream*>(mStream.get())), mDescriptor(connected.descriptor),
+      mServer(server), mFrameTimeout(frameTimeout), mCloseSwitch(closeSwitch), mInput(*mStream),
+      mMessages(mInput, messageRegistry())
 {
     mCloseSwitch.watch(mStream.get());
 }
@@ -66,7 +67,7 @@ FrameLink::~FrameLink() { mCloseSwitch.watch(nullptr); }
 void FrameLink::send(const QelMessage& message, TimePoint end)
 {
     if (mSendFailure) std::rethrow_exception(mSendFailure);
-    mStream->setWriteDeadline(pFrameTime(end));
+    mStream->setWriteDeadline(pFrameTime(timeLeft(end)));
     try {
         mMessages.write(message);
     } catch (const StreamIOException& error) {
@@ -77,11 +78,16 @@ void FrameLink::send(const QelMessage& message, TimePoint end)
 std::unique_ptr<QelMessage> FrameLink::receive(TimePoint begin, TimePoint end)
 {
     if (mReceiveFailure) std::rethrow_exception(mReceiveFailure);
-    if (pMustPoll() && !pAwaitInput(begin)) return nullptr;
     try {
-        const milliseconds frameTime = pFrameTime(end);
+        const milliseconds left = timeLeft(begin);
+        const milliseconds frameTime = pFrameTime(begin == end ? left : timeLeft(end));
         mInput.begin(frameTime);
-        mStream->setReadDeadline(pMustPoll() ? frameTime : timeLeft(begin));
+        if (mTls == nullptr) {
+            mStream->setReadDeadline(left);
+        } else {
+            if (!mTls->hasPending() && !mReadAhead->awaitBytes(left)) return nullptr;
+            mStream->setReadDeadline(frameTime);
+        }
         return mMessages.read();
     } catch (const StreamIOException& error) {
         if (mTls == nullptr && !mInput.hasBegun() && isDeadline(error)) return nullptr;
@@ -143,22 +149,11 @@ void FrameLink::pAwaitEnd()
         continue;
 }
 
-/// How long a message may take that must have ended by then.
-milliseconds FrameLink::pFrameTime(TimePoint end) const
+/// How long a message may take when so much time is left for it.
+milliseconds FrameLink::pFrameTime(milliseconds left) const
 {
-    const milliseconds left = timeLeft(end);
     if (left < milliseconds::zero()) return mFrameTimeout;
     return std::max(std::min(left, mFrameTimeout), kShortestWait);
-}
-
-bool FrameLink::pAwaitInput(TimePoint end) const
-{
-    const PollSet set(PollFd(mDescriptor, PollEvents::Read));
-    while (!hasPending()) {
-        if (set.wait(timeLeft(end)).anyReady()) return true;
-        if (TimeProvider::steady() >= end) return false;
-    }
-    return true;
 }
 
 /// The frame may have been sent in part.

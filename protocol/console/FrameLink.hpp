@@ -65,7 +65,7 @@ public:
     bool isUsable() const noexcept { return mSendFailure == nullptr && mReceiveFailure == nullptr; }
 
     PollFd getPollFd(PollEvents events) const;
-    bool hasPending() const { return mTls != nullptr && mTls->hasPending(); }
+    bool hasPending() const { return mTls != nullptr && (mReadAhead->hasBytes() || mTls->hasPending()); }
     bool isProtected() const noexcept { return mTls != nullptr; }
 
     /// As Console::leave(). Sending and receiving fail from then on.
@@ -91,15 +91,14 @@ private:
         bool mHasBegun = false;
     };
 
-    std::chrono::milliseconds pFrameTime(TimePoint end) const;
-    bool pMustPoll() const { return mTls != nullptr && mDescriptor >= 0; }
-    bool pAwaitInput(TimePoint end) const;
+    std::chrono::milliseconds pFrameTime(std::chrono::milliseconds left) const;
     void pAwaitEnd();
     [[noreturn]] void pFailSending(const StreamIOException& error);
     std::exception_ptr pFailure(const StreamIOException& error) const;
 
     const std::unique_ptr<Stream> mStream;
-    SSLStream* const mTls; // points to *mStream; null for a plain connection
+    ReadAhead* const mReadAhead; // under mTls; null for a plain connection
+    SSLStream* const mTls;       // points to *mStream; null for a plain connection
     const int mDescriptor;
     const std::string mServer;
     const std::chrono::milliseconds mFrameTimeout;

@@ -7,7 +7,7 @@
 
 namespace qel::protocol::detail {
 
-PendingExchange::PendingExchange(std::shared_ptr<ConsoleCore> core, std::shared_ptr<Exchange> exchange) noexcept
+PendingExchange::PendingExchange(std::shared_ptr<ConsoleCore> core, std::unique_ptr<Exchange> exchange) noexcept
     : mCore(std::move(core)), mExchange(std::move(exchange))
 {}
 
@@ -39,7 +39,7 @@ const std::string& PendingExchange::peer() const noexcept { return mCore->server
 
 void PendingExchange::pAbandon() noexcept
 {
-    if (mExchange != nullptr) mExchange->isAbandoned = true;
+    if (mExchange != nullptr) mCore->abandon(*mExchange);
 }
 
 } // namespace qel::protocol::detail

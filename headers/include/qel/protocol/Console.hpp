@@ -42,9 +42,8 @@ namespace qel::protocol {
 ///
 /// **Deadlines.** Every call that waits has a timeout; a negative one means no limit. A timeout that passes throws
 /// DeadlinePassed. When no part of a message had been transferred by then, the console stays usable, and a response
-/// that comes later is dropped. Otherwise the connection is of no use any more. (Over TLS on a stream without a
-/// descriptor, every passed deadline ends the connection.) Independently of that, a message has
-/// ConsoleOptions::frameTimeout from its first byte to its last.
+/// that comes later is dropped. Otherwise the connection is of no use any more. Independently of that, a
+/// message has ConsoleOptions::frameTimeout from its first byte to its last.
 ///
 /// **Failures.** What the calls throw: StatusError, a response with a status other than zero; DeadlinePassed;
 /// ClosedByPeer, the connection broke or the hypervisor closed it, with or without its notice; TurnedAway, the
@@ -86,7 +85,7 @@ public:
     /// The same over a stream of one's own, such as one end of makeMemoryStreams(); it is protected as the options say.
     /// Here a plain connection is not limited to loopback addresses, and the server of the options is only the name for
     /// texts. Cannot reconnect().
-    /// @param stream  connected, not null, with deadlines, and close() from any thread
+    /// @param stream  connected, not yet protected, not null, with deadlines, and close() from any thread
     /// @param descriptor  of the stream, to wait on; -1: none. That of a SocketStream need not be given
     Console(std::unique_ptr<Stream> stream, const ConsoleOptions& options,
             std::chrono::milliseconds timeout = std::chrono::seconds(10), int descriptor = -1);
@@ -187,7 +186,7 @@ public:
     /// @return PollFd::Ignore for a stream without a descriptor. Valid until reconnect().
     PollFd getPollFd(PollEvents events) const;
 
-    /// True when process() has bytes to read although the descriptor is not readable: TLS holds them.
+    /// True when process() may have bytes to read although the descriptor is not readable: they were read for TLS.
     bool hasPending() const;
 
     /// Receives and handles one message.

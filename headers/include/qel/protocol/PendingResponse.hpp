@@ -18,7 +18,7 @@ namespace detail {
 /// A request under way, whatever the class of its response. Use PendingResponse.
 class QEL_PROTOCOL_EXPORT PendingExchange {
 public:
-    PendingExchange(std::shared_ptr<ConsoleCore> core, std::shared_ptr<Exchange> exchange) noexcept;
+    PendingExchange(std::shared_ptr<ConsoleCore> core, std::unique_ptr<Exchange> exchange) noexcept;
     PendingExchange(PendingExchange&& other) noexcept;
     PendingExchange& operator=(PendingExchange&& other) noexcept;
     ~PendingExchange();
@@ -32,7 +32,7 @@ private:
     void pAbandon() noexcept;
 
     std::shared_ptr<ConsoleCore> mCore;
-    std::shared_ptr<Exchange> mExchange;
+    std::unique_ptr<Exchange> mExchange; // null when moved from
 };
 
 } // namespace detail
