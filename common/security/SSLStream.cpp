@@ -121,6 +121,13 @@ bool SSLStream::hasPending() const
     return BIO_ctrl_pending(SSL_get_rbio(mSSL.get())) > 0 || SSL_has_pending(mSSL.get()) == 1;
 }
 
+std::size_t SSLStream::getReadableBytes() const
+{
+    const MutexLock lock(mLock);
+    if (mStatus != STATUS_ENCRYPTED) return 0;
+    return static_cast<std::size_t>(SSL_pending(mSSL.get()));
+}
+
 std::string SSLStream::getVerificationFailure() const
 {
     const MutexLock lock(mLock);

@@ -42,8 +42,9 @@ class SSLContext;
 /// to wake only when the descriptor is closed, so destroy streams promptly.
 ///
 /// Thread safety: one reader thread and one writer thread, also at the same time; each deadline setter belongs to the
-/// thread of its direction. Any thread may call close(), getStatus(), getPeerCertificate(), getCipher(), hasPending()
-/// and getVerificationFailure() at any time; they do not wait for a thread that waits in the underlying stream.
+/// thread of its direction. Any thread may call close(), getStatus(), getPeerCertificate(), getCipher(), hasPending(),
+/// getReadableBytes() and getVerificationFailure() at any time; they do not wait for a thread that waits in the
+/// underlying stream.
 class QEL_EXPORT SSLStream : public Stream {
 public:
     enum Status : unsigned int {
@@ -131,6 +132,11 @@ public:
     /// the next read() waits for the rest.
     /// @return false unless the status is STATUS_ENCRYPTED
     bool hasPending() const;
+
+    /// How many bytes of data the next reads return without a wait: they are decrypted and not read yet. Data that is
+    /// still encrypted does not count, so hasPending() may be true while this is 0.
+    /// @return bytes; 0 unless the status is STATUS_ENCRYPTED
+    std::size_t getReadableBytes() const;
 
     /// Why the peer's certificate was refused, such as "certificate has expired". Remains available after the stream
     /// was closed, to explain a failed handshake().
