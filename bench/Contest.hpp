@@ -55,6 +55,7 @@ void addFrameContests();
 void addLoggingContests(const std::string& memoryFolder, const std::string& diskFolder);
 void addTransportContests();
 void addTlsContests();
+void addBufferedContests();
 void addQueueContests();
 
 /// Keeps the calling thread, and those it starts from now on, on one core: work that is passed between threads is then

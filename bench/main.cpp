@@ -118,6 +118,7 @@ int main(int argc, char** argv)
     qel::bench::addLoggingContests(memory, disk);
     qel::bench::addTransportContests();
     qel::bench::addTlsContests();
+    qel::bench::addBufferedContests();
     qel::bench::addQueueContests();
 
     RoundCollector rounds;

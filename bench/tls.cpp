@@ -5,12 +5,11 @@
 #include <qel/common/security/SSLCertificateRequest.hpp>
 #include <qel/common/security/SSLValidityPeriod.hpp>
 
+#include "AsioTlsConnection.hpp"
 #include "Contest.hpp"
 #include "Loopback.hpp"
 #include "TlsEnds.hpp"
 
-#include <boost/asio.hpp>
-#include <boost/asio/ssl.hpp>
 #include <cstddef>
 #include <ctime>
 #include <dlfcn.h>
@@ -18,7 +17,6 @@
 #include <openssl/rsa.h>
 #include <openssl/x509.h>
 #include <string>
-#include <unistd.h>
 #include <vector>
 
 namespace qel::bench {
@@ -62,33 +60,6 @@ struct RawConnection {
     TcpPair pair;
     RawTlsPair tls;
     std::vector<char> buffer;
-};
-
-/// Boost.Asio over descriptors of its own, with contexts that are set up as the others.
-struct AsioConnection {
-    using Socket = boost::asio::ip::tcp::socket;
-    using Stream = boost::asio::ssl::stream<Socket>;
-
-    AsioConnection()
-        : clientContext(rawContext(clientCredentials()).release()),
-          serverContext(rawContext(serverCredentials()).release()),
-          near(Socket(context, boost::asio::ip::tcp::v4(), ::dup(pair.nearFd())), clientContext),
-          far(Socket(context, boost::asio::ip::tcp::v4(), ::dup(pair.farFd())), serverContext)
-    {
-        bothEnds([this] { near.handshake(Stream::client); }, [this] { far.handshake(Stream::server); });
-    }
-
-    static void write(Stream& stream, const QelMessage& message)
-    {
-        boost::asio::write(stream, boost::asio::buffer(message.serialize(), message.msgLength()));
-    }
-
-    TcpPair pair;
-    boost::asio::io_context context{1};
-    boost::asio::ssl::context clientContext;
-    boost::asio::ssl::context serverContext;
-    Stream near;
-    Stream far;
 };
 
 /// One frame over: one write and two reads.

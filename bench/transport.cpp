@@ -6,6 +6,7 @@
 
 #include "Contest.hpp"
 #include "Loopback.hpp"
+#include "ZmqPair.hpp"
 
 #include <boost/asio.hpp>
 #include <cstddef>
@@ -15,7 +16,6 @@
 #include <sys/socket.h>
 #include <unistd.h>
 #include <vector>
-#include <zmq.h>
 
 namespace qel::bench {
 
@@ -127,48 +127,6 @@ void asioOneWay(benchmark::State& state, std::size_t length)
         boost::asio::write(pair.near, boost::asio::buffer(message->serialize(), message->msgLength()));
         benchmark::DoNotOptimize(asioRead(pair.far));
     }
-}
-
-/// Two connected ZeroMQ sockets of the given kinds over loopback, with one I/O thread between them.
-class ZmqPair {
-public:
-    ZmqPair(int nearKind, int farKind) : context(::zmq_ctx_new())
-    {
-        far = ::zmq_socket(context, farKind);
-        near = ::zmq_socket(context, nearKind);
-        char endpoint[64];
-        std::size_t length = sizeof(endpoint);
-        if (::zmq_bind(far, "tcp://127.0.0.1:*") != 0 ||
-            ::zmq_getsockopt(far, ZMQ_LAST_ENDPOINT, endpoint, &length) != 0 || ::zmq_connect(near, endpoint) != 0) {
-            throw std::runtime_error("zmq");
-        }
-    }
-    ~ZmqPair()
-    {
-        ::zmq_close(near);
-        ::zmq_close(far);
-        ::zmq_ctx_term(context);
-    }
-    ZmqPair(const ZmqPair&) = delete;
-    ZmqPair& operator=(const ZmqPair&) = delete;
-
-    void* context;
-    void* near;
-    void* far;
-};
-
-void zmqReceive(void* socket)
-{
-    zmq_msg_t received;
-    ::zmq_msg_init(&received);
-    if (::zmq_msg_recv(&received, socket, 0) < 0) throw std::runtime_error("zmq_msg_recv");
-    benchmark::DoNotOptimize(::zmq_msg_data(&received));
-    ::zmq_msg_close(&received);
-}
-
-void zmqSend(void* socket, const QelMessage& message)
-{
-    if (::zmq_send(socket, message.serialize(), message.msgLength(), 0) < 0) throw std::runtime_error("zmq_send");
 }
 
 void zmqOneWay(benchmark::State& state, std::size_t length)
