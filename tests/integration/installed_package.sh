@@ -125,10 +125,10 @@ LD_LIBRARY_PATH="$libdir" "$work/by-pkg-config" >"$work/by-pkg-config.out" ||
     fail "the example built with pkg-config ended with an error"
 "$readelf" -d "$work/by-pkg-config" | grep NEEDED | grep -qF "[$soname]" || fail "the example does not need $soname"
 
-# --- the lines that README.md shows
+# --- the first lines that README.md shows; protocol_package.sh has the others
 
 # shellcheck disable=SC2016 # the backquotes are text
-sed -n '/^```cpp$/,/^```$/p' "$source/README.md" | sed '/^```/d' >"$work/lines"
+sed -n '/^```cpp$/,/^```$/{p;/^```$/q}' "$source/README.md" | sed '/^```/d' >"$work/lines"
 [ -s "$work/lines" ] || fail "README.md shows no lines of code"
 {
     grep '^#include' "$source/examples/send_receive.cpp"

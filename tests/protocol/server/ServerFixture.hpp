@@ -173,7 +173,7 @@ protected:
 
 private:
     protocol::WakeUp mStop;
-    bool mEnds = true; // set before the thread starts and before it is stopped
+    std::atomic<bool> mEnds = true; // set before the thread starts and before it is stopped
     std::unique_ptr<SSLClientContext> mClientContext;
     std::future<void> mServed; // destroyed first; waits for the thread
 };

@@ -1,11 +1,8 @@
 #include "base/Failures.hpp"
 
 #include <qel/common/QelMessageExceptions.hpp>
-#include <qel/common/io/StreamIOException.hpp>
-#include <qel/common/util/PosixError.hpp>
 
 #include "base/RefusalReason.hpp"
-#include "base/StreamFailure.hpp"
 
 #include <cstring>
 
@@ -80,9 +77,6 @@ ExitStatus exitStatusOf(const std::exception& error)
         if (row.applies(error)) return row.status;
     }
     if (is<QelMessageValidationException>(error)) return ExitStatus::ProtocolBroken;
-    if (const auto* stream = dynamic_cast<const StreamIOException*>(&error)) {
-        return isDeadline(*stream) ? ExitStatus::DeadlinePassed : ExitStatus::ClosedByPeer;
-    }
     return ExitStatus::Failed;
 }
 
@@ -90,17 +84,9 @@ std::string userMessage(const std::exception& error)
 {
     if (const auto* refusal = dynamic_cast<const StatusError*>(&error)) return refusalText(refusal->getResponse());
     if (const auto* ours = dynamic_cast<const Error*>(&error)) return wordingOf(*ours);
-    if (is<CommandFailure>(error)) return explain(error);
-    switch (exitStatusOf(error)) {
-    case ExitStatus::ProtocolBroken:
-        return "the peer broke the protocol: " + explain(error);
-    case ExitStatus::DeadlinePassed:
-        return "the peer did not answer in time: " + explain(error);
-    case ExitStatus::ClosedByPeer:
-        return "connection lost: " + explain(error);
-    default:
-        return explain(error);
-    }
+    // What a response holds is read here, so its exceptions are the common library's.
+    const std::string prefix = is<QelMessageValidationException>(error) ? "the peer broke the protocol: " : "";
+    return prefix + explain(error);
 }
 
 } // namespace qel::tool

@@ -24,8 +24,7 @@ private:
 };
 
 /// The exit status for an exception: CommandFailure has its own; each error of the library has one in a table;
-/// QelMessageValidationException is ProtocolBroken; StreamIOException is DeadlinePassed when a deadline passed, else
-/// ClosedByPeer; everything else is Failed.
+/// QelMessageValidationException is ProtocolBroken; everything else is Failed.
 ExitStatus exitStatusOf(const std::exception& error);
 
 /// The line that the user reads. The library's phrase about a connection is short, such as "EOF", so what it means for
