@@ -1,6 +1,7 @@
 #include <qel/common/StreamFormatters.hpp>
 #include <qel/common/TypeInfo.hpp>
 
+#include <algorithm>
 #include <csignal>
 #include <cstring>
 #include <iomanip>
@@ -30,6 +31,34 @@ const char* signalDescription(int number) noexcept
 }
 
 } // namespace
+
+// The stream's own way to print a number goes through its locale and costs twice as much.
+bool HexFormatterBase::pPrintPlainly(std::ostream& os, std::uint64_t value, std::size_t width) const
+{
+    constexpr std::size_t kMostDigits = 2 * sizeof(value);
+    constexpr std::size_t kMostPrefix = 2;
+    if ((os.flags() & (std::ios_base::showbase | std::ios_base::left)) != 0 || os.width() != 0 || !os.good())
+        return false;
+    if (width > kMostDigits || os.getloc() != std::locale::classic()) return false;
+
+    char text[kMostPrefix + kMostDigits];
+    char* const end = text + sizeof(text);
+    char* first = end;
+    for (; value != 0; value >>= 4)
+        *--first = "0123456789ABCDEF"[value & 0xF];
+    while (end - first < static_cast<std::ptrdiff_t>(std::max<std::size_t>(width, 1)))
+        *--first = '0';
+    // By its first character: each program and library has a literal of its own, at another address.
+    if (*mPrefix != '\0') {
+        *--first = PREFIX[1];
+        *--first = PREFIX[0];
+    }
+    os.setf(std::ios_base::hex, std::ios_base::basefield);
+    os.setf(std::ios_base::uppercase);
+    os.fill('0');
+    os.write(first, end - first);
+    return true;
+}
 
 std::ostream& operator<<(std::ostream& os, const HexStringFormatter& formatter)
 {

@@ -465,6 +465,21 @@ TEST(QelMessageRegistry, HasNoFactoryForAnUnknownIdentity)
     EXPECT_EQ(registry.findFactory(Identifier(0x800B, 0x0005, Classification::Request)), nullptr);
 }
 
+TEST(QelMessageRegistry, TellsIdentitiesApartByEachPart)
+{
+    const auto largest = static_cast<Classification::Value>(0xFFFFFFFF);
+    const auto build = QelMessageRegistry::Entry<Example>().second;
+    const Identifier all[] = {{1, 0, {}},      {0, 1, {}},      {0, 0, Classification::Request},
+                              {0xFFFF, 0, {}}, {0, 0xFFFF, {}}, {0, 0, largest},
+                              {1, 1, largest}};
+    const QelMessageRegistry registry(
+        {{all[0], build}, {all[1], build}, {all[2], build}, {all[3], build}, {all[4], build}, {all[5], build}});
+    std::set<const void*> found;
+    for (const Identifier& identifier : all)
+        found.insert(registry.findFactory(identifier));
+    EXPECT_EQ(found.size(), 7U) << "six entries, and null for the last";
+}
+
 TEST(QelMessageRegistry, FactoryThrowsTheReasonOfARefusal)
 {
     const QelMessageRegistry registry;

@@ -9,8 +9,10 @@
 #include <cstdio>
 #include <gtest/gtest.h>
 #include <iomanip>
+#include <locale>
 #include <memory>
 #include <sstream>
+#include <streambuf>
 #include <string>
 #include <vector>
 
@@ -19,6 +21,10 @@ namespace qel {
 enum FormatterTestCode : unsigned short { FormatterTestCodeFive = 5 };
 template <>
 struct HexWidth<FormatterTestCode> : std::integral_constant<std::size_t, 8> {};
+
+enum FormatterTestWideCode : unsigned short { kFormatterTestWideCode = 10 };
+template <>
+struct HexWidth<FormatterTestWideCode> : std::integral_constant<std::size_t, 24> {};
 
 namespace {
 
@@ -131,6 +137,130 @@ TEST(HexFormat, AGroupingLocaleOfTheStreamAppliesToTheDigits)
     const test::GroupingLocale grouping;
     EXPECT_EQ(printed(hexFormat(std::uint16_t(0x6003))), "0x6.003");
     EXPECT_EQ(toString(hexFormat(std::uint16_t(0x6003))), "0x6003");
+}
+
+// What hexFormat() is defined as: the prefix, the settings, then the number as the stream prints it.
+template <typename T>
+void printByTheStream(std::ostream& os, T value)
+{
+    os << "0x";
+    os.setf(std::ios_base::hex, std::ios_base::basefield);
+    os.setf(std::ios_base::uppercase);
+    os.fill('0');
+    os.width(2 * sizeof(T));
+    os << value;
+}
+
+template <typename T>
+void expectSameAsTheStream(const std::ios_base::fmtflags flags, int width, char fill, T value)
+{
+    std::ostringstream expected;
+    std::ostringstream found;
+    for (std::ostringstream* os : {&expected, &found}) {
+        os->flags(flags);
+        os->width(width);
+        os->fill(fill);
+    }
+    printByTheStream(expected, value);
+    found << hexFormat(value);
+    EXPECT_EQ(found.str(), expected.str());
+    EXPECT_EQ(found.flags(), expected.flags());
+    EXPECT_EQ(found.width(), expected.width());
+    EXPECT_EQ(found.fill(), expected.fill());
+}
+
+TEST(HexFormat, IsTheNumberAsTheStreamPrintsItWithAnySettings)
+{
+    using Ios = std::ios_base;
+    const Ios::fmtflags settings[] = {Ios::dec,
+                                      Ios::fmtflags(),
+                                      Ios::dec | Ios::left,
+                                      Ios::dec | Ios::right,
+                                      Ios::hex | Ios::internal,
+                                      Ios::showbase,
+                                      Ios::showpos,
+                                      Ios::unitbuf,
+                                      Ios::left | Ios::right,
+                                      Ios::left | Ios::showbase,
+                                      Ios::oct | Ios::showbase | Ios::internal};
+    for (const Ios::fmtflags flags : settings) {
+        for (const int width : {0, 1, 7, 30}) {
+            SCOPED_TRACE(std::to_string(static_cast<int>(flags)) + ", " + std::to_string(width));
+            for (const unsigned int value : {0U, 1U, 0xABCDU, 0x89ABCDEFU, UINT_MAX}) {
+                expectSameAsTheStream(flags, width, '*', value);
+                expectSameAsTheStream(flags, width, '0', static_cast<int>(value));
+                expectSameAsTheStream(flags, width, ' ', static_cast<std::uint16_t>(value));
+                expectSameAsTheStream(flags, width, ' ', static_cast<short>(value));
+                expectSameAsTheStream(flags, width, ' ', static_cast<std::uint64_t>(value) << 31);
+                expectSameAsTheStream(flags, width, ' ', -static_cast<long long>(value));
+            }
+        }
+    }
+}
+
+TEST(HexFormat, WritesWhatFitsAndMarksAStreamThatIsFull)
+{
+    for (std::streamsize room = 0; room <= 11; ++room) {
+        SCOPED_TRACE(room);
+        std::string texts[2];
+        std::ios_base::iostate states[2];
+        for (int i = 0; i < 2; ++i) {
+            char memory[16] = {};
+            struct : std::streambuf {
+                using std::streambuf::setp;
+            } full;
+            full.setp(memory, memory + room);
+            std::ostream os(&full);
+            if (i == 0) {
+                printByTheStream(os, 0x89ABCDEFU);
+            } else {
+                os << hexFormat(0x89ABCDEFU);
+            }
+            os << 'x';
+            texts[i] = memory;
+            states[i] = os.rdstate();
+        }
+        EXPECT_EQ(texts[1], texts[0]);
+        EXPECT_EQ(states[1], states[0]);
+    }
+}
+
+TEST(HexFormat, PrintsNothingOntoAStreamThatHasFailed)
+{
+    for (const std::ios_base::iostate state : {std::ios_base::badbit, std::ios_base::failbit, std::ios_base::eofbit}) {
+        std::ostringstream expected;
+        std::ostringstream found;
+        expected.setstate(state);
+        found.setstate(state);
+        printByTheStream(expected, 1);
+        found << hexFormat(1);
+        EXPECT_EQ(found.str(), "");
+        EXPECT_EQ(found.rdstate(), expected.rdstate());
+        EXPECT_EQ(found.width(), expected.width());
+        EXPECT_EQ(found.flags(), expected.flags());
+    }
+}
+
+TEST(HexFormat, AFacetOfTheStreamsLocalePrintsTheDigits)
+{
+    struct Named : std::num_put<char> {
+        iter_type do_put(iter_type to, std::ios_base&, char, unsigned long) const override
+        {
+            for (const char letter : std::string("six"))
+                *to++ = letter;
+            return to;
+        }
+    };
+    std::ostringstream os;
+    os.imbue(std::locale(std::locale::classic(), new Named));
+    os << hexFormat(6U);
+    EXPECT_EQ(os.str(), "0xsix");
+}
+
+TEST(HexFormat, PrintsMoreDigitsThanAnyIntegerHasIfTheTypeRequestsThem)
+{
+    EXPECT_EQ(printed(hexFormat(kFormatterTestWideCode)), "0x00000000000000000000000A");
+    EXPECT_EQ(printed(hexFormat(kFormatterTestWideCode).noPrefix()), "00000000000000000000000A");
 }
 
 TEST(HexFormat, ReturnsTheStream)

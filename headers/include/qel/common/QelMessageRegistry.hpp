@@ -5,6 +5,7 @@
 #include <qel/common/QelMessage.hpp>
 
 #include <cstddef>
+#include <cstdint>
 #include <functional>
 #include <initializer_list>
 #include <iosfwd>
@@ -84,7 +85,23 @@ public:
     const Factory* findFactory(const Identifier& identifier) const;
 
 private:
-    const std::map<Identifier, Factory> mEntries;
+    /// The order of std::less, as one comparison of numbers: a look-up compares six times.
+    struct Order {
+        static std::uint64_t number(const Identifier& identifier) noexcept
+        {
+            constexpr unsigned int kFunctionShift = 48;
+            constexpr unsigned int kOperationShift = 32;
+            return static_cast<std::uint64_t>(std::get<0>(identifier)) << kFunctionShift |
+                   static_cast<std::uint64_t>(std::get<1>(identifier)) << kOperationShift |
+                   static_cast<std::uint64_t>(std::get<2>(identifier));
+        }
+        bool operator()(const Identifier& left, const Identifier& right) const noexcept
+        {
+            return number(left) < number(right);
+        }
+    };
+
+    const std::map<Identifier, Factory, Order> mEntries;
 };
 
 static_assert(sizeof(QelMessageRegistry::FastHeader) == 22 && alignof(QelMessageRegistry::FastHeader) == 1,

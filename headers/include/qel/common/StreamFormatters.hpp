@@ -111,6 +111,13 @@ protected:
         os.width(static_cast<std::streamsize>(width));
     }
 
+    /// Writes the prefix and the digits at once and leaves the stream as pSetupStream() and an inserted number do. Only
+    /// for a stream whose settings change nothing else about a number: no field width, the classic locale.
+    /// @param value the number, with as many bits as its type
+    /// @param width the least number of digits
+    /// @return false: the stream is another; nothing was written
+    QEL_EXPORT bool pPrintPlainly(std::ostream& os, std::uint64_t value, std::size_t width) const;
+
     const char* mPrefix; // PREFIX or NO_PREFIX
 };
 
@@ -134,6 +141,8 @@ public:
 
     friend std::ostream& operator<<(std::ostream& os, const HexFormatter& formatter)
     {
+        const auto bits = static_cast<std::make_unsigned_t<ConvertedType>>(formatter.mValue);
+        if (formatter.pPrintPlainly(os, bits, HexWidth<T>::value)) return os;
         formatter.pSetupStream(os, HexWidth<T>::value);
         return os << formatter.mValue;
     }
