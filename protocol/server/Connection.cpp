@@ -27,10 +27,13 @@ PollFd hangUpOf(int descriptor)
     return fd;
 }
 
-std::unique_ptr<Stream> protect(std::unique_ptr<Stream> stream, SSLServerContext* context)
+/// @param records  set to what is below TLS
+std::unique_ptr<Stream> protect(std::unique_ptr<Stream> stream, SSLServerContext* context, RecordStream*& records)
 {
     if (context == nullptr) return stream;
-    return std::make_unique<SSLStream>(*context, std::move(stream));
+    auto below = std::make_unique<RecordStream>(std::move(stream));
+    records = below.get();
+    return std::make_unique<SSLStream>(*context, std::move(below));
 }
 
 } // namespace
@@ -39,7 +42,7 @@ Connection::Connection(const ConnectionServices& services, ServedStream stream, 
                        HandshakePlaces::Place place)
     : Outbox(services.limits.queueBytes), mServices(services), mAddress(std::move(stream.address)),
       mSource(std::move(stream.source)), mHangUp(hangUpOf(stream.descriptor)), mPlace(std::move(place)),
-      mClear(*stream.stream), mStream(protect(std::move(stream.stream), context)),
+      mClear(*stream.stream), mStream(protect(std::move(stream.stream), context, mRecords)),
       mFrames(*mStream, context == nullptr ? FrameStream::ReadAhead::Yes : FrameStream::ReadAhead::No),
       mMessages(mFrames, messageRegistry()), mName(mAddress)
 {
@@ -187,6 +190,7 @@ void Connection::pOnIdentified()
     mHandshake = PollDeadline();
     mPlace.release();
     mFrames.limitFrames(mServices.limits.frame);
+    if (mRecords != nullptr) mRecords->limitRecords(mServices.limits.frame);
 }
 
 /// Waits until the hypervisor takes another message. @return false: the console has hung up

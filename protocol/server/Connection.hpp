@@ -15,6 +15,7 @@
 #include "server/HandshakePlaces.hpp"
 #include "server/LogThrottle.hpp"
 #include "server/Outbox.hpp"
+#include "server/RecordStream.hpp"
 
 #include <atomic>
 #include <chrono>
@@ -115,7 +116,8 @@ private:
     HandshakePlaces::Place mPlace; // until the console has identified itself; of the reader
     WakeUp mWake;                  // for the reader while it does not read
 
-    Stream& mClear; // the stream without TLS; owned by mStream
+    Stream& mClear;                   // the stream without TLS; owned by mStream
+    RecordStream* mRecords = nullptr; // below TLS; owned by mStream; null: plain
     const std::unique_ptr<Stream> mStream;
     std::optional<Admission> mAdmission; // to TLS; empty: plain
     FrameStream mFrames;                 // over mStream

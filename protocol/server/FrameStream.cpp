@@ -1,19 +1,26 @@
 #include "server/FrameStream.hpp"
 
+#include <qel/common/QelMessage.hpp>
+
 #include <algorithm>
 #include <cstring>
+#include <new>
 
 namespace qel::protocol {
 
 namespace {
 
-/// Most frames fit and are read with one system call. An idle console keeps the memory, so it is not the longest frame.
-constexpr std::size_t kAheadBytes = 2048;
+/// Most frames fit and are read with one system call. Every console keeps this memory.
+constexpr std::size_t kSmallAhead = 2048;
+
+/// The longest frame fits. Only consoles that have sent a longer one than above keep this memory.
+constexpr std::size_t kLargeAhead = QelMessage::MtuMax;
 
 } // namespace
 
 FrameStream::FrameStream(Stream& stream, ReadAhead readAhead)
-    : mStream(stream), mAhead(readAhead == ReadAhead::Yes ? new char[kAheadBytes] : nullptr) // not cleared: see read()
+    : mStream(stream), mAhead(readAhead == ReadAhead::Yes ? new char[kSmallAhead] : nullptr),
+      mAheadSize(readAhead == ReadAhead::Yes ? kSmallAhead : 0)
 {}
 
 FrameStream::~FrameStream() = default;
@@ -28,10 +35,14 @@ std::size_t FrameStream::read(char* buffer, std::size_t length)
 {
     if (length == 0) return 0;
     if (mAheadBegin == mAheadEnd) {
-        if (mAhead == nullptr || length >= kAheadBytes) return pReceive(buffer, length);
+        if (mIsTooSmall && length < mAheadSize) pGrow();
+        if (length >= mAheadSize) {
+            mIsTooSmall = mAheadSize == kSmallAhead;
+            return pReceive(buffer, length);
+        }
         mAheadBegin = 0;
         mAheadEnd = 0;
-        mAheadEnd = pReceive(mAhead.get(), kAheadBytes);
+        mAheadEnd = pReceive(mAhead.get(), mAheadSize);
     }
     return pTake(buffer, length);
 }
@@ -61,6 +72,14 @@ std::size_t FrameStream::pReceive(char* buffer, std::size_t length)
     const std::size_t count = mStream.read(buffer, length);
     if (count > 0) mInFrame = true;
     return count;
+}
+
+/// Without memory, nothing is read ahead any more.
+void FrameStream::pGrow()
+{
+    mIsTooSmall = false;
+    mAhead.reset(new (std::nothrow) char[kLargeAhead]);
+    mAheadSize = mAhead != nullptr ? kLargeAhead : 0;
 }
 
 /// Copies what was read ahead. The copy is cheaper than the system calls that it saves.

@@ -48,11 +48,14 @@ public:
     void setWriteDeadline(std::chrono::milliseconds timeout) override;
 
 private:
+    void pGrow();
     std::size_t pReceive(char* buffer, std::size_t length);
     std::size_t pTake(char* buffer, std::size_t length);
 
     Stream& mStream;
-    std::unique_ptr<char[]> mAhead; // null: no reading ahead
+    std::unique_ptr<char[]> mAhead;
+    std::size_t mAheadSize;   // 0: no reading ahead
+    bool mIsTooSmall = false; // a frame did not fit
     std::size_t mAheadBegin = 0;
     std::size_t mAheadEnd = 0;
     std::chrono::milliseconds mFrameTimeout{0}; // 0: frames have no limit of their own

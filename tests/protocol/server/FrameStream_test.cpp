@@ -1,13 +1,8 @@
-#include <qel/common/io/StreamIOException.hpp>
-
+#include "protocol/server/RecordingStream.hpp"
 #include "server/FrameStream.hpp"
 
-#include <algorithm>
-#include <cstring>
-#include <deque>
 #include <gmock/gmock.h>
 #include <string>
-#include <vector>
 
 namespace qel::test {
 
@@ -19,44 +14,6 @@ using ::testing::ElementsAre;
 using ::testing::IsEmpty;
 
 constexpr milliseconds kFrame(700);
-
-/// Delivers chunks, and records each read and each deadline that was in force then.
-class RecordingStream : public Stream {
-public:
-    std::deque<std::string> chunks;
-    std::vector<std::size_t> lengths;
-    std::vector<long> deadlines; ///< -1: none
-    std::vector<long> settings;  ///< of the deadline, in order
-    std::string written;
-    bool isClosed = false;
-
-    void close() override { isClosed = true; }
-    void setReadDeadline(milliseconds timeout) override
-    {
-        mDeadline = timeout.count();
-        settings.push_back(mDeadline);
-    }
-    void setWriteDeadline(milliseconds timeout) override { mWriteDeadline = timeout.count(); }
-    std::size_t read(char* buffer, std::size_t length) override
-    {
-        lengths.push_back(length);
-        deadlines.push_back(mDeadline);
-        if (chunks.empty()) return 0;
-        std::string& chunk = chunks.front();
-        const std::size_t count = std::min(length, chunk.size());
-        std::memcpy(buffer, chunk.data(), count);
-        chunk.erase(0, count);
-        if (chunk.empty()) chunks.pop_front();
-        return count;
-    }
-    void write(const char* buffer, std::size_t length) override { written.append(buffer, length); }
-
-    long writeDeadline() const { return mWriteDeadline; }
-
-private:
-    long mDeadline = 10000; // of the handshake
-    long mWriteDeadline = 0;
-};
 
 std::string take(FrameStream& stream, std::size_t length)
 {
@@ -90,14 +47,31 @@ TEST(FrameStream, ReadsAheadSeveralFrames)
     EXPECT_EQ(below.lengths.size(), 1U);
 }
 
-TEST(FrameStream, ALongRestIsReadWithoutACopy)
+TEST(FrameStream, AfterALongFrameTheNextOneIsReadWithOneCall)
 {
     RecordingStream below;
-    below.chunks = {"head" + std::string(4000, 'x'), std::string(12000, 'y')};
+    const std::string frame = "head" + std::string(15996, 'x');
+    below.chunks = {frame, frame, "head"};
     FrameStream stream(below, FrameStream::ReadAhead::Yes);
-    EXPECT_EQ(take(stream, 8), "headxxxx");
-    EXPECT_EQ(take(stream, 15996), std::string(3996, 'x') + std::string(12000, 'y'));
-    EXPECT_THAT(below.lengths, ElementsAre(2048, 15996 - 2040, 12000));
+    for (int round = 0; round < 2; ++round) {
+        EXPECT_EQ(take(stream, 8), "headxxxx");
+        EXPECT_EQ(take(stream, 15992), std::string(15992, 'x'));
+    }
+    EXPECT_EQ(take(stream, 4), "head");
+    EXPECT_THAT(below.lengths, ElementsAre(2048, 13952, 16384, 16384));
+}
+
+TEST(FrameStream, ARestThatJustDoesNotFitIsReadWithoutACopy)
+{
+    RecordingStream below;
+    below.chunks = {"head", std::string(2047, 'x'), "head", std::string(2048, 'y'), "head"};
+    FrameStream stream(below, FrameStream::ReadAhead::Yes);
+    EXPECT_EQ(take(stream, 4), "head");
+    EXPECT_EQ(take(stream, 2047), std::string(2047, 'x'));
+    EXPECT_EQ(take(stream, 4), "head");
+    EXPECT_EQ(take(stream, 2048), std::string(2048, 'y'));
+    EXPECT_EQ(take(stream, 4), "head");
+    EXPECT_THAT(below.lengths, ElementsAre(2048, 2048, 2048, 2048, 16384));
 }
 
 TEST(FrameStream, WithoutReadingAheadAsksForNoMoreThanItsReader)
