@@ -424,6 +424,57 @@ TEST(Serve, UnknownNoticesAreLoggedAndIgnored)
     EXPECT_THAT(server.stop().errors, HasSubstr("(W): [qel] console 1: ignored [CID: "));
 }
 
+TEST(ServeOptions, SeveralEndpointsArePrintedInOrderAndServed)
+{
+    ServeProcess server({"--listen", "[::1]:0"});
+    const std::string second = server.process().readLine();
+    EXPECT_THAT(server.endpoint(), StartsWith("127.0.0.1:"));
+    EXPECT_THAT(second, StartsWith("[::1]:"));
+    EXPECT_EQ(server.call({"time"}).exitStatus, 0);
+    EXPECT_EQ(runQel({"call", "--connect", second, "--plain", "time"}).exitStatus, 0);
+    server.stop();
+}
+
+TEST(ServeOptions, AMessageThatStopsEndsItsConnectionAfterTheFrameTimeout)
+{
+    ServeProcess server({"--frame-timeout", "0.05"});
+    TestConsole console(server.endpoint());
+    console.introduce("stops");
+    const QelMessageGetQelTodReq request;
+    console.messages().sendBytes(std::string(request.serialize(), request.msgLength() - 1));
+    EXPECT_TRUE(console.messages().isClosed());
+    server.process().awaitErrors("(W): [qel] console 1: closed, it did not finish a message in time\n");
+    server.stop();
+}
+
+TEST(ServeOptions, TheLimitsOnHandshakesApply)
+{
+    ServeProcess server({"--max-handshakes", "2", "--max-handshakes-per-address", "1"});
+    const TestConsole silent(server.endpoint());
+    TestConsole refused(server.endpoint());
+    EXPECT_TRUE(refused.messages().isClosed());
+    server.process().awaitErrors(": refused: too many connections from its address are in their handshake\n");
+    server.stop();
+}
+
+TEST(ServeOptions, TheLimitsAreChecked)
+{
+    const std::vector<std::vector<std::string>> refused{
+        {"--max-handshakes", "0"}, {"--max-handshakes", "65536"}, {"--max-handshakes-per-address", "0"},
+        {"--frame-timeout", "0"},  {"--frame-timeout", "86401"},  {"--keepalive", "0"},
+        {"--keepalive", "32768"},  {"--listen", "localhost:0"},   {"--listen", "0.0.0.0:0"},
+    };
+    for (const auto& options : refused) {
+        SCOPED_TRACE(options[0] + " " + options[1]);
+        std::vector<std::string> command{"serve", "--listen", "127.0.0.1:0", "--plain"};
+        command.insert(command.end(), options.begin(), options.end());
+        EXPECT_EQ(runQel(command).exitStatus, 2);
+    }
+    ServeProcess accepted({"--max-handshakes", "65535", "--max-handshakes-per-address", "65535", "--frame-timeout",
+                           "86400", "--keepalive", "32767"});
+    accepted.stop();
+}
+
 } // namespace
 
 } // namespace qel::test

@@ -149,7 +149,7 @@ TEST_F(ServerPeers, AreClosedWhenTheyStopBeforeTheyAreIdentified)
     ServerOptions options = plainOptions();
     options.handshakeTimeout = kTime;
     make(options);
-    for (const std::size_t bytes : {0, 1, 8, 31, 79}) {
+    for (const std::size_t bytes : {0U, 1U, 8U, 31U, 79U}) {
         SCOPED_TRACE(bytes);
         EXPECT_EQ(talkPlain(bytes, CutStream::Then::Stall), bytes);
         expectForgotten();
@@ -174,7 +174,7 @@ TEST_F(ServerPeers, AreClosedWhenTheyStopInTheStepsToTls)
 
 TEST_F(ServerPeers, AreClosedWhenTheyStopInsideATlsRecord)
 {
-    for (const std::size_t bytes : {1, 4, 5, 20}) {
+    for (const std::size_t bytes : {1U, 4U, 5U, 20U}) {
         SCOPED_TRACE(bytes);
         ServerOptions options = tlsOptions();
         options.frameTimeout = kTime;
