@@ -1,6 +1,7 @@
 #include "console/BackoffDelays.hpp"
 
 #include <algorithm>
+#include <cmath>
 
 namespace qel::protocol {
 
@@ -14,7 +15,7 @@ std::chrono::milliseconds BackoffDelays::next()
     mNominal = std::min(mNominal, mLongest);
     const double wait = std::uniform_real_distribution<double>(mNominal / 2, mNominal)(mRandom);
     mNominal *= mFactor;
-    return std::chrono::milliseconds(static_cast<std::chrono::milliseconds::rep>(wait + 0.5));
+    return std::chrono::milliseconds(std::llround(wait));
 }
 
 } // namespace qel::protocol

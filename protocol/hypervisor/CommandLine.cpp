@@ -41,7 +41,7 @@ void check(const std::string& command, const CommandLineOptions& options)
 
 } // namespace
 
-std::unique_ptr<SerialLine> commandLine(std::string command, CommandLineOptions options)
+std::unique_ptr<SerialLine> commandLine(std::string command, const CommandLineOptions& options)
 {
     check(command, options);
     return std::make_unique<PtyPort>(std::move(command), sharedReaper(),

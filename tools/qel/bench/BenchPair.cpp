@@ -28,10 +28,12 @@ bool isFrom(const QelMessageDaxBroadcastOutboundAsync& notice, const Identity& s
 BenchPair::BenchPair(BenchConsole first, BenchConsole second, std::size_t bytes, std::chrono::milliseconds timeout)
     : mConsoles{std::move(first), std::move(second)}, mPayload(bytes, 'q'), mTimeout(timeout)
 {
-    for (std::size_t i = 0; i < mConsoles.size(); ++i) {
-        mConsoles[i].console.onNotice<QelMessageDaxBroadcastOutboundAsync>(
-            [this, sender = &mConsoles[1 - i]](const auto& notice) { pTake(*sender, notice); });
-    }
+    const auto listen = [this](BenchConsole& addressee, BenchConsole& sender) {
+        addressee.console.onNotice<QelMessageDaxBroadcastOutboundAsync>(
+            [this, from = &sender](const auto& notice) { pTake(*from, notice); });
+    };
+    listen(mConsoles[0], mConsoles[1]);
+    listen(mConsoles[1], mConsoles[0]);
 }
 
 void BenchPair::exchange()

@@ -141,8 +141,8 @@ public:
 
     friend std::ostream& operator<<(std::ostream& os, const HexFormatter& formatter)
     {
-        const auto bits = static_cast<std::make_unsigned_t<ConvertedType>>(formatter.mValue);
-        if (formatter.pPrintPlainly(os, bits, HexWidth<T>::value)) return os;
+        const auto number = static_cast<std::make_unsigned_t<ConvertedType>>(formatter.mValue);
+        if (formatter.pPrintPlainly(os, number, HexWidth<T>::value)) return os;
         formatter.pSetupStream(os, HexWidth<T>::value);
         return os << formatter.mValue;
     }

@@ -29,6 +29,7 @@ struct CommandLineOptions {
 /// @param command  a shell command
 /// @throws std::invalid_argument  "command": it is empty; "environment": an entry has no name or no "="; either:
 ///         it contains a null character. Or "term": it is empty or contains a null character
-QEL_PROTOCOL_EXPORT std::unique_ptr<SerialLine> commandLine(std::string command, CommandLineOptions options = {});
+QEL_PROTOCOL_EXPORT std::unique_ptr<SerialLine> commandLine(std::string command,
+                                                            const CommandLineOptions& options = {});
 
 } // namespace qel::protocol
