@@ -259,6 +259,17 @@ TEST_F(SerialSessionTest, UnreadOutputHasALimit)
     EXPECT_FALSE(console->process());
 }
 
+TEST_F(SerialSessionTest, NoticesOfTheSessionGoToItAlone)
+{
+    open();
+    console->onOtherNotice([](const QelMessage&) { ADD_FAILURE(); });
+    console->onNotice<DataNotice>([](const DataNotice&) { ADD_FAILURE(); });
+    receive(output("x"));
+    receive(closed(ClosedNotice::CloseReasonForceClose));
+    EXPECT_EQ(available(), "x");
+    EXPECT_EQ(session->getEnd(), SessionEnd::Taken);
+}
+
 TEST_F(SerialSessionTest, NoticesOfAnotherSessionAreNotOurs)
 {
     open();
