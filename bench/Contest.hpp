@@ -56,6 +56,7 @@ void addLoggingContests(const std::string& memoryFolder, const std::string& disk
 void addTransportContests();
 void addTlsContests();
 void addBufferedContests();
+void addConsoleContests();
 void addQueueContests();
 
 /// Keeps the calling thread, and those it starts from now on, on one core: work that is passed between threads is then

@@ -119,6 +119,7 @@ int main(int argc, char** argv)
     qel::bench::addTransportContests();
     qel::bench::addTlsContests();
     qel::bench::addBufferedContests();
+    qel::bench::addConsoleContests();
     qel::bench::addQueueContests();
 
     RoundCollector rounds;

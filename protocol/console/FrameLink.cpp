@@ -10,6 +10,7 @@
 
 #include <algorithm>
 #include <array>
+#include <cstring>
 #include <stdexcept>
 #include <sys/socket.h>
 #include <utility>
@@ -39,24 +40,46 @@ std::exception_ptr failureOf(F fail)
 void FrameLink::Input::begin(milliseconds frameTimeout)
 {
     mFrameTimeout = frameTimeout;
-    mHasBegun = false;
+    mHasBegun = hasBytes();
+    if (mHasBegun) mStream.setReadDeadline(frameTimeout);
 }
 
 std::size_t FrameLink::Input::read(char* buffer, std::size_t length)
 {
-    const std::size_t count = mStream.read(buffer, length);
-    if (!mHasBegun && count > 0) {
-        mHasBegun = true;
-        mStream.setReadDeadline(mFrameTimeout);
+    if (mIsDirect) {
+        const std::size_t count = mStream.read(buffer, length);
+        pNote(count);
+        return count;
     }
+    if (!hasBytes() && !pFill()) return 0;
+    const std::size_t count = std::min(length, mLast - mFirst);
+    std::memcpy(buffer, mBuffer.data() + mFirst, count);
+    mFirst += count;
     return count;
+}
+
+/// @return false: the end of the stream
+bool FrameLink::Input::pFill()
+{
+    mFirst = mLast = 0;
+    mLast = mStream.read(mBuffer.data(), mBuffer.size());
+    pNote(mLast);
+    return hasBytes();
+}
+
+/// Begins the message with its first bytes.
+void FrameLink::Input::pNote(std::size_t count)
+{
+    if (mHasBegun || count == 0) return;
+    mHasBegun = true;
+    if (!mIsDirect) mStream.setReadDeadline(mFrameTimeout);
 }
 
 FrameLink::FrameLink(ConnectedStream connected, const std::string& server, milliseconds frameTimeout,
                      CloseSwitch& closeSwitch)
     : mStream(std::move(connected.stream)), mReadAhead(connected.readAhead),
       mTls(mReadAhead == nullptr ? nullptr : static_cast<SSLStream*>(mStream.get())), mDescriptor(connected.descriptor),
-      mServer(server), mFrameTimeout(frameTimeout), mCloseSwitch(closeSwitch), mInput(*mStream),
+      mServer(server), mFrameTimeout(frameTimeout), mCloseSwitch(closeSwitch), mInput(*mStream, mTls != nullptr),
       mMessages(mInput, messageRegistry())
 {
     mCloseSwitch.watch(mStream.get());
@@ -83,8 +106,8 @@ std::unique_ptr<QelMessage> FrameLink::receive(TimePoint begin, TimePoint end)
         const milliseconds frameTime = pFrameTime(begin == end ? left : timeLeft(end));
         mInput.begin(frameTime);
         if (mTls == nullptr) {
-            mStream->setReadDeadline(left);
-        } else {
+            if (!mInput.hasBegun()) mStream->setReadDeadline(left);
+        } else if (!mInput.hasBegun()) {
             if (!mTls->hasPending() && !mReadAhead->awaitBytes(left)) return nullptr;
             mStream->setReadDeadline(frameTime);
         }
@@ -120,6 +143,11 @@ void FrameLink::fail(std::exception_ptr failure)
     mReceiveFailure = failure;
     if (!mSendFailure) mSendFailure = failure;
     std::rethrow_exception(failure);
+}
+
+bool FrameLink::hasPending() const
+{
+    return mInput.hasBytes() || (mTls != nullptr && (mReadAhead->hasBytes() || mTls->hasPending()));
 }
 
 PollFd FrameLink::getPollFd(PollEvents events) const

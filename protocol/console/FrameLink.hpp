@@ -11,7 +11,9 @@
 #include "console/Connector.hpp"
 #include "console/TimeLeft.hpp"
 
+#include <array>
 #include <chrono>
+#include <cstddef>
 #include <exception>
 #include <memory>
 #include <string>
@@ -65,28 +67,40 @@ public:
     bool isUsable() const noexcept { return mSendFailure == nullptr && mReceiveFailure == nullptr; }
 
     PollFd getPollFd(PollEvents events) const;
-    bool hasPending() const { return mTls != nullptr && (mReadAhead->hasBytes() || mTls->hasPending()); }
+    /// True when receive() may have bytes to read although the descriptor is not readable.
+    bool hasPending() const;
     bool isProtected() const noexcept { return mTls != nullptr; }
 
     /// As Console::leave(). Sending and receiving fail from then on.
     void leave() noexcept;
 
 private:
-    /// Limits the first byte of a message by one deadline and the rest by another, and knows whether a message has
-    /// begun.
+    /// What has arrived. On a plain connection it is read in large pieces: a short message takes one system call
+    /// instead of two. There it also limits the first byte of a message by one deadline and the rest by another; over
+    /// TLS receive() waits for the first byte.
     class Input : public Stream {
     public:
-        explicit Input(Stream& stream) : mStream(stream) {}
+        /// @param isDirect  over TLS: read no more than is asked for, since TLS keeps the rest
+        Input(Stream& stream, bool isDirect) : mStream(stream), mIsDirect(isDirect) {}
 
+        /// A message may begin now. @param frameTimeout  for the rest of it once it has begun
         void begin(std::chrono::milliseconds frameTimeout);
         bool hasBegun() const noexcept { return mHasBegun; }
+        bool hasBytes() const noexcept { return mFirst != mLast; }
 
         std::size_t read(char* buffer, std::size_t length) override;
         void write(const char* buffer, std::size_t length) override { mStream.write(buffer, length); }
         void close() override { mStream.close(); }
 
     private:
+        bool pFill();
+        void pNote(std::size_t count);
+
         Stream& mStream;
+        const bool mIsDirect;
+        std::array<char, QelMessage::MtuMax> mBuffer;
+        std::size_t mFirst = 0; // of the bytes that were not asked for yet
+        std::size_t mLast = 0;
         std::chrono::milliseconds mFrameTimeout{0};
         bool mHasBegun = false;
     };

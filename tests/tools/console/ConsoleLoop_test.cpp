@@ -307,7 +307,9 @@ TEST_F(ConsoleLoopTest, StopsReceivingWhileTheOutputBufferIsFull)
     std::string all;
     open([&](const std::string&) {
         if (dataMessages != 15) return;
-        EXPECT_EQ(unreadBytes(), (kMessages - kThatFit) * kFrameBytes);
+        const int rest = (kMessages - kThatFit) * kFrameBytes;
+        EXPECT_LE(unreadBytes(), rest);
+        EXPECT_GT(unreadBytes(), rest - static_cast<int>(QelMessage::MtuMax)) << "the console reads a little ahead";
         closeSession();
         reader = std::thread([&] { all = readOutput(kPipeBytes + kMessages * chunk.size()); });
     });
