@@ -116,7 +116,8 @@ void PartitionSet::shutDown()
 bool PartitionSet::hasInputRoom(const ConsoleEntry& console) const
 {
     for (const auto& entry : mPartitions) {
-        if (entry.second.holder == &console && entry.second.input.size() >= kInputLimit) return false;
+        const Partition& partition = entry.second;
+        if (partition.holder == &console && partition.setUp && partition.input.size() >= kInputLimit) return false;
     }
     return true;
 }

@@ -89,7 +89,8 @@ public:
     /// Ends all sessions with the notice that the hypervisor shuts down, and takes all lines down.
     void shutDown();
 
-    /// False while a partition whose session the console holds has kInputLimit bytes of input waiting.
+    /// False while a partition has kInputLimit bytes of input waiting, and the console can add to them: it holds the
+    /// session and has set it up.
     bool hasInputRoom(const ConsoleEntry& console) const;
 
     /// What to wait for. Leaves out lines that have nothing to do: a line that has hung up would otherwise be reported

@@ -202,6 +202,28 @@ TEST_F(VirtualSerialTest, TheOldHolderOfATakenSessionIsReadAgain)
     EXPECT_EQ(holder.link.resumed, 1U);
 }
 
+TEST_F(VirtualSerialTest, ANewHolderOfAFullPartitionIsReadUntilItIsSetUp)
+{
+    Peer before;
+    Peer holder;
+    setUpSerial(before, "a", 1);
+    openSession(holder, "b");
+    port1->takes = 0;
+    sendData(before, 1, std::string(60000, 'x'));
+    sendData(before, 1, std::string(60000, 'x'));
+    openSerial(holder, 1, true);
+    EXPECT_TRUE(hypervisor->mayReceive(holder.id));
+    EXPECT_EQ(statusOf(holder, QelMessageVirtualSerialSetupSessionReq(1, 0)), 0U);
+    EXPECT_FALSE(hypervisor->mayReceive(holder.id)); // from here on it could add to what waits
+    port1->output = {"still here"};
+    hypervisor->serviceSerial(1);
+    EXPECT_EQ(takeData(holder, 1), "still here");
+    port1->takes = 1000 * 1000;
+    hypervisor->serviceSerial(1);
+    EXPECT_TRUE(hypervisor->mayReceive(holder.id));
+    EXPECT_EQ(holder.link.resumed, 1U);
+}
+
 } // namespace
 
 } // namespace qel::test
