@@ -82,6 +82,7 @@ private:
     WakeUp mWake;       // for run() and finish(): a connection has ended, or log lines were held back
     WakeUp mSerialWake; // for the serial loop
     LogThrottle mThrottle{[this] { mWake.interrupt(); }};
+    const std::string mAccepting = "new connections"; // for the throttle
     HandshakePlaces mPlaces;
     HypervisorEngine mEngine;
     const ConnectionServices mServices;
@@ -139,6 +140,7 @@ bool Server::Impl::pRunOnce(const PollFd& stop)
 
 void Server::Impl::pAccept(const PollResult& ready)
 {
+    const LogThrottle::Scope scope(mThrottle, mAccepting); // anybody can cause these lines, and nobody is to blame yet
     try {
         std::optional<Socket> socket = mListener->accept(ready);
         if (socket) pServe(std::move(*socket));

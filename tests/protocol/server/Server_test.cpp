@@ -9,6 +9,7 @@
 #include "support/RecordingLogBackend.hpp"
 #include "support/SettableClock.hpp"
 
+#include <algorithm>
 #include <gmock/gmock.h>
 #include <netinet/in.h>
 #include <netinet/tcp.h>
@@ -334,6 +335,35 @@ TEST_F(ServerTest, TheLogOfAPeerThatRepeatsItselfIsSummedUp)
         return !lines.empty() &&
                lines.back().find("console 1: 990 more lines like this one: console 1: ignored ") != std::string::npos;
     }));
+}
+
+TEST_F(ServerTest, ConnectionsThatAreResetBeforeTheyAreAcceptedDoNotFillTheLog)
+{
+    auto throttled = std::make_shared<RecordingLogBackend>();
+    QelLogger::get().setLevel(LogLevel::Info);
+    QelLogger::get().addBackend(std::make_shared<protocol::LogBackendThrottled>(throttled));
+    const SettableClock clock; // stands still
+    make(plainOptions());
+    for (int i = 0; i < 50; ++i) {
+        Socket socket(IPFamily::IPv4, SOCK_STREAM | SOCK_CLOEXEC, 0);
+        socket.connect(server->endpoints().front(), Loopback::kDeadline);
+        const linger reset{1, 0};
+        ASSERT_EQ(::setsockopt(socket.getFd(), SOL_SOCKET, SO_LINGER, &reset, sizeof(reset)), 0);
+    }
+    run();
+    EXPECT_TRUE(canIntroduce("x")); // those before it have been accepted
+    stop();
+    EXPECT_TRUE(hasEnded());
+    server.reset(); // before the clock
+    const auto lines = throttled->lines();
+    EXPECT_EQ(std::count_if(lines.begin(), lines.end(),
+                            [](const std::string& line) {
+                                return line.find("[qel] a connection ended before it was served") != std::string::npos;
+                            }),
+              10);
+    EXPECT_THAT(lines, Contains(HasSubstr(
+                           "new connections: 40 more lines like this one: a connection ended before it was served")));
+    EXPECT_LT(lines.size(), 50U); // the common library has a line about each of them too
 }
 
 } // namespace
