@@ -23,8 +23,9 @@ void set(const Socket& socket, int level, int name, int value)
 
 } // namespace
 
-// Half of the time is idle, the other half is for the probes. The user timeout ends the connection, whatever the number
-// of probes by then: see tcp(7).
+// Half of the time is idle, the other half is for the probes. The user timeout of the stream would not only replace
+// their number. It also cuts a peer that answers and has no room for data, such as a console that is suspended: see
+// tcp(7).
 void setKeepAlive(const Socket& socket, std::chrono::seconds time)
 {
     const int seconds = static_cast<int>(time.count());
@@ -32,7 +33,7 @@ void setKeepAlive(const Socket& socket, std::chrono::seconds time)
     set(socket, IPPROTO_TCP, TCP_KEEPCNT, kProbes);
     set(socket, IPPROTO_TCP, TCP_KEEPIDLE, std::max(seconds / 2, 1));
     set(socket, IPPROTO_TCP, TCP_KEEPINTVL, std::max(seconds / 2 / kProbes, 1));
-    set(socket, IPPROTO_TCP, TCP_USER_TIMEOUT, seconds * 1000);
+    set(socket, IPPROTO_TCP, TCP_USER_TIMEOUT, 0);
 }
 
 } // namespace qel::protocol

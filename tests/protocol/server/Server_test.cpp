@@ -309,10 +309,10 @@ TEST_F(ServerTest, ItsConnectionsHaveTheKeepAliveOfTheOptions)
         socklen_t length = sizeof(peer);
         if (::getpeername(fd, reinterpret_cast<sockaddr*>(&peer), &length) != 0 || peer.sin_family != AF_INET) continue;
         if (ntohs(peer.sin_port) != from.getPort()) continue;
-        unsigned int timeout = 0;
-        length = sizeof(timeout);
-        ASSERT_EQ(::getsockopt(fd, IPPROTO_TCP, TCP_USER_TIMEOUT, &timeout, &length), 0);
-        EXPECT_EQ(timeout, 1234000U);
+        int idle = 0;
+        length = sizeof(idle);
+        ASSERT_EQ(::getsockopt(fd, IPPROTO_TCP, TCP_KEEPIDLE, &idle, &length), 0);
+        EXPECT_EQ(idle, 617);
         ++found;
     }
     EXPECT_EQ(found, 1);

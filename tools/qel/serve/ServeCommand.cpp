@@ -273,7 +273,7 @@ void addLimitOptions(CLI::App& command, ServeOptions& options)
         ->type_name("SECONDS")
         ->check(numberIn(kMinFrameSeconds, kMaxFrameSeconds))
         ->capture_default_str();
-    command.add_option("--keepalive", options.keepAliveSeconds, "Seconds until a peer that is gone is noticed")
+    command.add_option("--keepalive", options.keepAliveSeconds, "Seconds until an idle peer that is gone is noticed")
         ->type_name("SECONDS")
         ->transform(integerIn(1, kMaxKeepAliveSeconds))
         ->capture_default_str();

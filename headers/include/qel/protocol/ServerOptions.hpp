@@ -31,9 +31,12 @@ struct ServerOptions {
 
     std::size_t queueBytes = 256 * 1024; ///< that may be queued for a console, half of them serial data; at least 1
 
+    // Each of these times is at most 24 hours, that of the keep-alive at most 32767 seconds.
     std::chrono::milliseconds handshakeTimeout{10000}; ///< from connecting to a granted version request; more than 0
     std::chrono::milliseconds frameTimeout{10000};     ///< from the first byte of a message to its last; more than 0
-    std::chrono::seconds keepAlive{60};                ///< in which a peer that is gone is noticed, by TCP; at least 1
+    /// In which TCP notices that an idle peer is gone; at least 1. One that data waits for has the system's
+    /// retransmission limits, which is minutes.
+    std::chrono::seconds keepAlive{60};
     std::chrono::milliseconds linger{2000}; ///< for the last messages to a console that is being closed; 0 or more
 };
 
