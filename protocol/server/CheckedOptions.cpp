@@ -12,6 +12,9 @@ namespace {
 /// TCP takes keep-alive times up to this; half of it counts.
 constexpr std::chrono::seconds kMaxKeepAlive{32767};
 
+/// Times up to this can be added to any time of the clock, and fit the timeout of poll(2).
+constexpr std::chrono::hours kMaxTime{24};
+
 void require(bool condition, const char* text)
 {
     if (!condition) throw std::invalid_argument(text);
@@ -33,9 +36,12 @@ void checkLimits(const ServerOptions& options)
     require(options.maxHandshakesPerAddress > 0, "maxHandshakesPerAddress: at least 1");
     require(options.queueBytes > 0, "queueBytes: at least 1");
     require(options.handshakeTimeout.count() > 0, "handshakeTimeout: more than 0");
+    require(options.handshakeTimeout <= kMaxTime, "handshakeTimeout: at most 24 hours");
     require(options.frameTimeout.count() > 0, "frameTimeout: more than 0");
+    require(options.frameTimeout <= kMaxTime, "frameTimeout: at most 24 hours");
     require(options.keepAlive.count() > 0 && options.keepAlive <= kMaxKeepAlive, "keepAlive: 1 to 32767 seconds");
     require(options.linger.count() >= 0, "linger: 0 or more");
+    require(options.linger <= kMaxTime, "linger: at most 24 hours");
 }
 
 } // namespace

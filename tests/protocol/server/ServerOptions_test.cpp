@@ -24,6 +24,8 @@ using ::testing::StartsWith;
 using ::testing::StrEq;
 using ::testing::ThrowsMessage;
 
+constexpr std::chrono::milliseconds kDay = std::chrono::hours(24);
+
 ServerOptions plainOptions()
 {
     ServerOptions options;
@@ -62,14 +64,22 @@ TEST(ServerOptions, EachLimitIsCheckedAtBothSides)
         {"no handshake time", [](ServerOptions& o) { o.handshakeTimeout = milliseconds(0); },
          "handshakeTimeout: more than 0"},
         {"short handshake time", [](ServerOptions& o) { o.handshakeTimeout = milliseconds(1); }, nullptr},
+        {"long handshake time", [](ServerOptions& o) { o.handshakeTimeout = kDay; }, nullptr},
+        {"too long handshake time", [](ServerOptions& o) { o.handshakeTimeout = kDay + milliseconds(1); },
+         "handshakeTimeout: at most 24 hours"},
         {"no frame time", [](ServerOptions& o) { o.frameTimeout = milliseconds(0); }, "frameTimeout: more than 0"},
         {"short frame time", [](ServerOptions& o) { o.frameTimeout = milliseconds(1); }, nullptr},
+        {"long frame time", [](ServerOptions& o) { o.frameTimeout = kDay; }, nullptr},
+        {"too long frame time", [](ServerOptions& o) { o.frameTimeout = kDay + milliseconds(1); },
+         "frameTimeout: at most 24 hours"},
         {"no keep-alive", [](ServerOptions& o) { o.keepAlive = seconds(0); }, "keepAlive: 1 to 32767 seconds"},
         {"short keep-alive", [](ServerOptions& o) { o.keepAlive = seconds(1); }, nullptr},
         {"long keep-alive", [](ServerOptions& o) { o.keepAlive = seconds(32767); }, nullptr},
         {"too long", [](ServerOptions& o) { o.keepAlive = seconds(32768); }, "keepAlive: 1 to 32767 seconds"},
         {"negative linger", [](ServerOptions& o) { o.linger = milliseconds(-1); }, "linger: 0 or more"},
         {"no linger", [](ServerOptions& o) { o.linger = milliseconds(0); }, nullptr},
+        {"long linger", [](ServerOptions& o) { o.linger = kDay; }, nullptr},
+        {"too long linger", [](ServerOptions& o) { o.linger = kDay + milliseconds(1); }, "linger: at most 24 hours"},
         {"not an endpoint", [](ServerOptions& o) { o.listen = {"127.0.0.1"}; },
          "listen: \"127.0.0.1\" is not an IP address and port"},
         {"a name", [](ServerOptions& o) { o.listen = {"localhost:1"}; },
