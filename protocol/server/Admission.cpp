@@ -11,8 +11,6 @@ Admission::Admission(const HypervisorEngine& hypervisor, Stream& clear, int desc
     : mHypervisor(hypervisor), mClear(clear), mDescriptor(descriptor), mTls(tls), mWake(wake), mPins(pins)
 {}
 
-Admission::~Admission() = default;
-
 PeerIdentity Admission::run(PollDeadline::time_point end)
 {
     if (!pAwaitFirstByte(end) || !pEnterStream()) {

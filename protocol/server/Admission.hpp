@@ -25,7 +25,7 @@ public:
     /// @param pins  which consoles are admitted
     Admission(const HypervisorEngine& hypervisor, Stream& clear, int descriptor, SSLStream& tls, PollInterrupt& wake,
               const PeerPins& pins);
-    ~Admission();
+    ~Admission() = default;
     Admission(const Admission&) = delete;
     Admission& operator=(const Admission&) = delete;
 

@@ -211,7 +211,6 @@ bool Connection::pAwaitReceive()
 /// The end of the reader: the hypervisor forgets the console, and the queued messages go out within the linger time.
 void Connection::pFinish() noexcept
 {
-    mPlace.release();
     if (mId != 0) {
         runGuarded([this] { mServices.hypervisor.disconnect(mId); }, mName);
     }
@@ -221,6 +220,7 @@ void Connection::pFinish() noexcept
     } else {
         abort();
     }
+    mPlace.release(); // not earlier: until here it has taken its threads
     mEnded = true;
     mServices.ended.interrupt();
 }
@@ -275,15 +275,18 @@ void Connection::pSendAll()
         mMessages.write(*message);
 }
 
+/// On any thread. The name belongs to the connection's own threads, so that of the log is the address here.
 void Connection::pClose() noexcept
 {
     mClosed = true;
     try {
         mStream->close();
     } catch (const std::exception& error) {
-        logQuietly(LogLevel::Warn, mName, ": cannot close: ", Explained{error});
+        logQuietly(LogLevel::Warn, mAddress, ": cannot close: ", Explained{error});
+    } catch (...) { // of a stream of the user's own
+        logCurrent(mAddress, ": cannot close");
     }
-    runGuarded([this] { mWake.interrupt(); }, mName);
+    runGuarded([this] { mWake.interrupt(); }, mAddress);
 }
 
 } // namespace qel::protocol

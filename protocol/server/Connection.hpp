@@ -113,7 +113,7 @@ private:
     const std::string mAddress;
     const std::string mSource;
     const PollFd mHangUp;
-    HandshakePlaces::Place mPlace; // until the console has identified itself; of the reader
+    HandshakePlaces::Place mPlace; // until the console has identified itself or the connection ends; of the reader
     WakeUp mWake;                  // for the reader while it does not read
 
     Stream& mClear;                   // the stream without TLS; owned by mStream
@@ -125,7 +125,7 @@ private:
 
     PollDeadline mHandshake;          // disabled: the console has identified itself; of the reader
     std::atomic<ConsoleId> mId{0};    // 0: in the handshake
-    std::string mName;                // for the log, of the two threads: the address, later "console 1"
+    std::string mName;                // for the log, of its own threads: the address, later "console 1"
     std::atomic<bool> mClosed{false}; // the stream is of no use any more
     std::atomic<bool> mEnded{false};
 

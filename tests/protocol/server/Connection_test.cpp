@@ -21,6 +21,25 @@ using ::testing::Contains;
 using ::testing::HasSubstr;
 using ::testing::StartsWith;
 
+/// Closes, and throws something unusual.
+class BadCloseStream : public Stream {
+public:
+    explicit BadCloseStream(std::unique_ptr<Stream> stream) : mStream(std::move(stream)) {}
+
+    void close() override
+    {
+        mStream->close();
+        throw 42;
+    }
+    void setReadDeadline(std::chrono::milliseconds timeout) override { mStream->setReadDeadline(timeout); }
+    void setWriteDeadline(std::chrono::milliseconds timeout) override { mStream->setWriteDeadline(timeout); }
+    std::size_t read(char* buffer, std::size_t length) override { return mStream->read(buffer, length); }
+    void write(const char* buffer, std::size_t length) override { mStream->write(buffer, length); }
+
+private:
+    const std::unique_ptr<Stream> mStream;
+};
+
 class ConnectionTest : public ServedFixture {
 protected:
     void start(ConnectionLimits limits = {})
@@ -519,6 +538,36 @@ TEST_F(ConnectionTest, CanBeDestroyedWithoutAStart)
     connection = ServedFixture::serve(loopback);
     connection.reset();
     EXPECT_TRUE(messages.isClosed());
+}
+
+TEST_F(ConnectionTest, WhateverItsStreamThrowsWhenItIsClosedIsLogged)
+{
+    auto ends = protocol::makeMemoryStreams();
+    connection = ServedFixture::serve(std::make_unique<BadCloseStream>(std::move(ends.second)), -1);
+    connection->start();
+    ends.first.reset();
+    expectEnd();
+    EXPECT_THAT(log.lines(), Contains("E: [qel] the test: cannot close: an exception that is not a std::exception"));
+}
+
+TEST_F(ConnectionTest, KeepsItsHandshakePlaceUntilItHasEnded)
+{
+    protocol::HandshakePlaces places(1, 1);
+    auto ends = protocol::makeMemoryStreams(1);
+    ConnectionLimits limits;
+    limits.linger = Loopback::kDeadline;
+    connection = std::make_unique<Connection>(
+        protocol::ConnectionServices{*hypervisor, pins, limits, throttle, ended},
+        protocol::ServedStream{std::move(ends.second), -1, "the test", "the source"}, nullptr, places.take("x"));
+    connection->start();
+    LoopbackMessages console(*ends.first);
+    console.send(QelMessageGetQelTodReq());                                      // the response is not taken
+    console.sendBytes(std::string("XXXX\0\0\0\x20", 8) + std::string(24, '\0')); // the end, but for the response
+    EXPECT_FALSE(endsWithin(std::chrono::milliseconds(100)));
+    EXPECT_FALSE(places.take("x"));
+    ends.first.reset();
+    expectEnd();
+    EXPECT_TRUE(places.take("x"));
 }
 
 } // namespace
