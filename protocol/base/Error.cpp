@@ -30,6 +30,7 @@ CertificateRejected::~CertificateRejected() = default;
 DeadlinePassed::~DeadlinePassed() = default;
 ClosedByPeer::~ClosedByPeer() = default;
 ProtocolBroken::~ProtocolBroken() = default;
+LimitReached::~LimitReached() = default;
 
 StatusError::StatusError(const QelMessage& response, std::string peer)
     : Error("the request was refused: " + toString(response.getLogID()), std::move(peer)), mResponse(response.clone())

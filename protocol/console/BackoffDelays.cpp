@@ -1,13 +1,16 @@
 #include "console/BackoffDelays.hpp"
 
+#include "console/TimeLeft.hpp"
+
 #include <algorithm>
 #include <cmath>
 
 namespace qel::protocol {
 
 BackoffDelays::BackoffDelays(const Backoff& backoff, unsigned int seed)
-    : mNominal(static_cast<double>(backoff.first.count())), mLongest(static_cast<double>(backoff.longest.count())),
-      mFactor(backoff.factor), mRandom(seed)
+    : mNominal(static_cast<double>(backoff.first.count())),
+      mLongest(static_cast<double>(std::min(backoff.longest, kLongestWait).count())), mFactor(backoff.factor),
+      mRandom(seed)
 {}
 
 std::chrono::milliseconds BackoffDelays::next()

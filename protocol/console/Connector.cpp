@@ -78,7 +78,8 @@ int descriptorOf(const Stream& stream)
 } // namespace
 
 Connector::Connector(const ConsoleOptions& options, bool needsAddress)
-    : mServer(options.server), mPins(normalizedPins(options.pins)), mHandshakeTimeout(options.handshakeTimeout)
+    : mServer(options.server), mPins(normalizedPins(options.pins)),
+      mHandshakeTimeout(std::min(options.handshakeTimeout, kLongestWait))
 {
     checkOptions(options);
     if (needsAddress) static_cast<void>(ServerAddress::parse(options.server));
@@ -99,8 +100,9 @@ ConnectedStream Connector::adopt(std::unique_ptr<Stream> stream, int descriptor,
                                  CloseSwitch& closeSwitch, TimePoint& handshakeEnd)
 {
     if (descriptor < 0) descriptor = descriptorOf(*stream);
-    handshakeEnd = std::min(end, TimeProvider::steady() + mHandshakeTimeout);
-    ConnectedStream connected{std::move(stream), nullptr, descriptor, {}};
+    handshakeEnd = std::min(end, deadlineIn(mHandshakeTimeout));
+    auto* const readiness = descriptor < 0 ? dynamic_cast<Readiness*>(stream.get()) : nullptr;
+    ConnectedStream connected{std::move(stream), nullptr, descriptor, readiness, {}};
     closeSwitch.watch(connected.stream.get());
     try {
         if (mContext != nullptr) pProtect(connected, handshakeEnd, closeSwitch);

@@ -8,6 +8,7 @@
 #include "console/CloseSwitch.hpp"
 #include "console/ReadAhead.hpp"
 #include "console/TimeLeft.hpp"
+#include "transport/Readiness.hpp"
 
 #include <chrono>
 #include <memory>
@@ -20,6 +21,7 @@ struct ConnectedStream {
     std::unique_ptr<Stream> stream;
     ReadAhead* readAhead = nullptr; ///< under the TLS of the stream; null: a plain connection
     int descriptor = -1;            ///< of the stream; -1: none
+    Readiness* readiness = nullptr; ///< of a stream without a descriptor, part of it; null: it cannot tell
     PeerIdentity peer;
 };
 

@@ -7,6 +7,8 @@
 
 namespace qel::protocol {
 
+// Every call that receives holds the core for itself: a handler may destroy or move the console.
+
 using std::chrono::milliseconds;
 
 Console::Console(const ConsoleOptions& options, milliseconds timeout)
@@ -52,7 +54,8 @@ std::unique_ptr<QelMessage> Console::exchange(const QelMessage& request)
 
 std::unique_ptr<QelMessage> Console::exchange(const QelMessage& request, milliseconds timeout)
 {
-    return mCore->exchange(request, deadlineIn(timeout));
+    const auto core = mCore;
+    return core->exchange(request, deadlineIn(timeout));
 }
 
 void Console::send(const QelMessage& notice) { mCore->send(notice, deadlineIn(mCore->requestTimeout())); }
@@ -61,11 +64,19 @@ void Console::onOtherNotice(NoticeHandler handler) { mCore->onOtherNotice(std::m
 
 void Console::openSession() { openSession(mCore->requestTimeout()); }
 
-void Console::openSession(milliseconds timeout) { mCore->openSession(deadlineIn(timeout)); }
+void Console::openSession(milliseconds timeout)
+{
+    const auto core = mCore;
+    core->openSession(deadlineIn(timeout));
+}
 
 void Console::closeSession() { closeSession(mCore->requestTimeout()); }
 
-void Console::closeSession(milliseconds timeout) { mCore->closeSession(deadlineIn(timeout)); }
+void Console::closeSession(milliseconds timeout)
+{
+    const auto core = mCore;
+    core->closeSession(deadlineIn(timeout));
+}
 
 SerialSession Console::openSerial(std::uint16_t partition, const SerialOptions& options)
 {
@@ -74,16 +85,25 @@ SerialSession Console::openSerial(std::uint16_t partition, const SerialOptions& 
 
 SerialSession Console::openSerial(std::uint16_t partition, const SerialOptions& options, milliseconds timeout)
 {
-    return SerialSession(mCore, mCore->openSerial(partition, options, deadlineIn(timeout)));
+    const auto core = mCore;
+    return SerialSession(core, core->openSerial(partition, options, deadlineIn(timeout)));
 }
 
 PollFd Console::getPollFd(PollEvents events) const { return mCore->getPollFd(events); }
 
 bool Console::hasPending() const { return mCore->hasPending(); }
 
-bool Console::process(milliseconds timeout) { return mCore->receiveOne(deadlineIn(timeout), TimePoint::max()); }
+bool Console::process(milliseconds timeout)
+{
+    const auto core = mCore;
+    return core->receiveOne(deadlineIn(timeout), TimePoint::max());
+}
 
-void Console::reconnect(milliseconds timeout) { mCore->reconnect(deadlineIn(timeout)); }
+void Console::reconnect(milliseconds timeout)
+{
+    const auto core = mCore;
+    core->reconnect(deadlineIn(timeout));
+}
 
 void Console::leave() noexcept { mCore->leave(); }
 
@@ -96,14 +116,16 @@ std::unique_ptr<QelMessage> Console::pRequest(const QelMessage& message)
 
 std::unique_ptr<QelMessage> Console::pRequest(const QelMessage& message, milliseconds timeout)
 {
-    return mCore->require(message, deadlineIn(timeout));
+    const auto core = mCore;
+    return core->require(message, deadlineIn(timeout));
 }
 
 detail::PendingExchange Console::pStart(const QelMessage& message)
 {
-    auto exchange = std::make_unique<Exchange>(message);
-    mCore->start(message, *exchange, deadlineIn(mCore->requestTimeout()));
-    return detail::PendingExchange(mCore, std::move(exchange));
+    const auto core = mCore;
+    auto exchange = std::make_shared<Exchange>(message);
+    core->start(message, *exchange, deadlineIn(core->requestTimeout()));
+    return detail::PendingExchange(core, std::move(exchange));
 }
 
 void Console::pOnNotice(const QelMessageRegistry::Identifier& identity, std::function<bool(const QelMessage&)> handler)

@@ -29,8 +29,6 @@ constexpr std::uint32_t kInterfaceVersion = 1;
 constexpr std::uint16_t kMajorVersion = 1;
 constexpr std::uint16_t kMinorVersion = 0;
 
-constexpr milliseconds kLongestAttempt = std::chrono::hours(20 * 24); // poll(2) takes an int
-
 QelMessageRegistry::Identifier identityOf(const QelMessage& message)
 {
     return {static_cast<unsigned short>(message.getFunction()), static_cast<unsigned short>(message.getOperation()),
@@ -104,7 +102,8 @@ Identity completeIdentity(const Identity& identity)
 
 ConsoleCore::ConsoleCore(const ConsoleOptions& options, bool needsAddress)
     : mServer(options.server), mIdentity(completeIdentity(options.identity)), mRequestTimeout(options.requestTimeout),
-      mFrameTimeout(options.frameTimeout), mHandshakeTimeout(options.handshakeTimeout), mRetry(options.retry),
+      mFrameTimeout(std::min(options.frameTimeout, kLongestWait)),
+      mHandshakeTimeout(std::min(options.handshakeTimeout, kLongestWait)), mRetry(options.retry),
       mIsConnector(needsAddress), mConnector(options, needsAddress)
 {}
 
@@ -120,7 +119,7 @@ void ConsoleCore::connect(TimePoint end)
             const bool isLast =
                 !mRetry || attempt == mRetry->attempts || !isTemporary(error, mConnector.isProtecting());
             const milliseconds wait = delays.next();
-            next = TimeProvider::steady() + wait;
+            next = deadlineIn(wait);
             if (isLast || next >= end) throw;
             logLine(LogLevel::Info, error.what(), "; next attempt in ", decFormat(wait.count()), " ms");
         }
@@ -139,28 +138,37 @@ void ConsoleCore::reconnect(TimePoint end)
 {
     if (!mIsConnector) throw std::logic_error("reconnect: the stream was given to the console");
     if (mCloseSwitch.isClosed()) throw Error("this console is closed", mServer);
-    if (mLink != nullptr && mLink->isUsable()) mLink->leave();
+    if (mIsReconnecting) return; // a handler that is called in the introduction
+    if (mLink != nullptr && mLink->isUsable()) mLink->leave(end);
     pDisconnect(std::make_exception_ptr(ClosedByPeer("the connection has been replaced by another one", mServer)));
-    for (const auto& serial : mSerials)
-        serial->finish(SessionEnd::ConnectionClosed);
-    mSerials.clear();
+    pEndSerials(SessionEnd::ConnectionClosed);
+    mIsReconnecting = true;
     try {
         connect(end);
     } catch (...) {
+        mIsReconnecting = false;
         mUnusable = std::current_exception();
         throw;
     }
+    mIsReconnecting = false;
 }
 
 void ConsoleCore::leave() noexcept
 {
-    if (mLink != nullptr) mLink->leave();
+    if (mLink == nullptr) return;
+    mLink->leave(TimePoint::max());
+    pFailExchanges();
 }
 
 void ConsoleCore::dispose() noexcept
 {
     mCloseSwitch.close();
     pDisconnect(std::make_exception_ptr(Error("this console is closed", mServer)));
+    // A handler may own a session, which owns this object.
+    const auto handlers = std::move(mHandlers);
+    const auto otherHandler = std::move(mOtherHandler);
+    mHandlers.clear();
+    mOtherHandler = nullptr;
 }
 
 const QelMessageGetEnclTypeAndInterfaceVersionRsp& ConsoleCore::version() const
@@ -176,10 +184,10 @@ PollFd ConsoleCore::getPollFd(PollEvents events) const
     return mLink == nullptr ? PollFd::Ignore : mLink->getPollFd(events);
 }
 
-std::unique_ptr<QelMessage> ConsoleCore::exchange(const QelMessage& request, TimePoint end)
+std::unique_ptr<QelMessage> ConsoleCore::exchange(const QelMessage& request, TimePoint end, Exchanges::Action action)
 {
     Exchange exchange(request);
-    start(request, exchange, end);
+    start(request, exchange, end, std::move(action));
     try {
         return finish(exchange, end);
     } catch (...) {
@@ -188,27 +196,26 @@ std::unique_ptr<QelMessage> ConsoleCore::exchange(const QelMessage& request, Tim
     }
 }
 
-std::unique_ptr<QelMessage> ConsoleCore::require(const QelMessage& request, TimePoint end)
+std::unique_ptr<QelMessage> ConsoleCore::require(const QelMessage& request, TimePoint end, Exchanges::Action action)
 {
-    std::unique_ptr<QelMessage> response = exchange(request, end);
+    std::unique_ptr<QelMessage> response = exchange(request, end, std::move(action));
     if (response->getStatus() != QelMessageStatusNoError) throw StatusError(*response, mServer);
     return response;
 }
 
-void ConsoleCore::start(const QelMessage& request, Exchange& exchange, TimePoint end)
+void ConsoleCore::start(const QelMessage& request, Exchange& exchange, TimePoint end, Exchanges::Action action)
 {
     requireSendable(request, true, "request");
-    if (mExchanges.isFull()) throw Error("too many requests are under way without a response", mServer);
-    const bool isAlone = mExchanges.isEmpty();
-    mExchanges.add(request, &exchange);
+    if (mExchanges.isFull()) throw LimitReached("too many requests are under way without a response", mServer);
+    const bool isAlone = mExchanges.isEmpty() && mSerials.empty();
+    mExchanges.add(request, &exchange, std::move(action));
     try {
-        if (isAlone) { // the peer has nothing to answer, so it takes the request
-            pLink().send(request, end);
-        } else {
-            sendAmongOthers(request, end, [] { return true; });
-        }
+        if (isAlone) return pSend(request, end); // the peer has nothing to say, so it takes the request
+        // It fails when a handler ends the connection; the next one does not know it.
+        const auto isWanted = [&] { return exchange.failure == nullptr; };
+        if (sendAmongOthers(request, end, isWanted) == Sending::Late) throwNotTaken();
     } catch (...) {
-        mExchanges.removeLast(request);
+        mExchanges.remove(exchange);
         throw;
     }
 }
@@ -216,7 +223,9 @@ void ConsoleCore::start(const QelMessage& request, Exchange& exchange, TimePoint
 std::unique_ptr<QelMessage> ConsoleCore::finish(Exchange& exchange, TimePoint end)
 {
     while (!exchange.isDone()) {
-        if (!receiveOne(end, end)) throw DeadlinePassed(noResponseText(exchange), mServer);
+        // A peer that goes on sending something else gains no time by it.
+        const bool isLate = !receiveOne(end, end) || (!exchange.isDone() && hasPassed(end));
+        if (isLate) throw DeadlinePassed(noResponseText(exchange), mServer);
     }
     if (exchange.failure) std::rethrow_exception(exchange.failure);
     if (exchange.isTaken) throw std::logic_error("the response has been taken");
@@ -227,36 +236,38 @@ std::unique_ptr<QelMessage> ConsoleCore::finish(Exchange& exchange, TimePoint en
 void ConsoleCore::send(const QelMessage& notice, TimePoint end)
 {
     requireSendable(notice, false, "notice");
-    pLink().send(notice, end);
+    pSend(notice, end);
 }
 
-bool ConsoleCore::sendAmongOthers(const QelMessage& message, TimePoint end, const std::function<bool()>& isWanted)
+Sending ConsoleCore::sendAmongOthers(const QelMessage& message, TimePoint end, const std::function<bool()>& isWanted)
 {
     while (isWanted()) {
-        const FrameLink::Ready ready = pLink().await(pFullSerial() == nullptr, end);
+        const Ready ready = pLink().await(pFullSerial() == nullptr, end);
         if (ready.send) {
-            pLink().send(message, end);
-            return true;
+            pSend(message, end);
+            return Sending::Done;
         }
-        if (!ready.receive) throw DeadlinePassed("the peer did not take a message in time", mServer);
+        if (!ready.receive || hasPassed(end)) return Sending::Late;
         receiveOne(end, TimePoint::max());
     }
-    return false;
+    return Sending::NotWanted;
 }
+
+void ConsoleCore::throwNotTaken() const { throw DeadlinePassed("the peer did not take a message in time", mServer); }
 
 bool ConsoleCore::receiveOne(TimePoint begin, TimePoint end)
 {
     if (const SerialState* const full = pFullSerial()) {
-        throw Error("the session of partition " + std::to_string(full->partition) + " holds " +
-                        std::to_string(full->unreadBytes()) + " bytes of output that nobody reads",
-                    mServer);
+        throw LimitReached("the session of partition " + std::to_string(full->partition) + " holds " +
+                               std::to_string(full->unreadBytes()) + " bytes of output that nobody reads",
+                           mServer);
     }
-    std::unique_ptr<QelMessage> message = pLink().receive(begin, end);
+    std::unique_ptr<QelMessage> message = pReceive(begin, end);
     if (message == nullptr) return false;
     if (message->getClassification() != QelMessageClassification::Response) {
         pHandleNotice(*message);
-    } else if (const char* const mistake = mExchanges.deliver(std::move(message))) {
-        pBreak(mistake);
+    } else {
+        pHandleResponse(std::move(message));
     }
     return true;
 }
@@ -278,18 +289,16 @@ void ConsoleCore::onOtherNotice(Console::NoticeHandler handler)
 void ConsoleCore::openSession(TimePoint end)
 {
     if (mIsSessionOpen) return;
-    static_cast<void>(require(QelMessageInterfaceCmpOpenKrogSessionReq(), end));
-    mIsSessionOpen = true;
+    const auto response = exchange(QelMessageInterfaceCmpOpenKrogSessionReq(), end);
+    // When an earlier request was given up, its grant may have come before this one's refusal.
+    if (!mIsSessionOpen) throw StatusError(*response, mServer);
 }
 
 void ConsoleCore::closeSession(TimePoint end)
 {
     if (!mIsSessionOpen) return;
-    static_cast<void>(require(QelMessageInterfaceCmpCloseKrogSessionReq(), end));
-    mIsSessionOpen = false;
-    for (const auto& serial : mSerials)
-        serial->finish(SessionEnd::Closed);
-    mSerials.clear();
+    const auto response = exchange(QelMessageInterfaceCmpCloseKrogSessionReq(), end);
+    if (mIsSessionOpen) throw StatusError(*response, mServer);
 }
 
 std::shared_ptr<SerialState> ConsoleCore::openSerial(std::uint16_t partition, const SerialOptions& options,
@@ -299,8 +308,10 @@ std::shared_ptr<SerialState> ConsoleCore::openSerial(std::uint16_t partition, co
     auto state = std::make_shared<SerialState>(partition, options.connection, options.maxUnread);
     mSerials.push_back(state);
     try {
-        static_cast<void>(require(QelMessageVirtualSerialOpenReq(partition, options.connection, options.force), end));
-        state->isOpen = true; // notices before the response are about an earlier session
+        // Notices before the response are about an earlier session.
+        const auto onResponse = [this, state](const QelMessage& response) { pHandleOpened(state, response); };
+        const QelMessageVirtualSerialOpenReq request(partition, options.connection, options.force);
+        static_cast<void>(require(request, end, onResponse));
         static_cast<void>(require(QelMessageVirtualSerialSetupSessionReq(partition, options.connection), end));
     } catch (...) {
         dropSerial(state);
@@ -312,33 +323,35 @@ std::shared_ptr<SerialState> ConsoleCore::openSerial(std::uint16_t partition, co
 void ConsoleCore::closeSerial(const std::shared_ptr<SerialState>& state, TimePoint end)
 {
     if (state->end != SessionEnd::None) return;
-    const auto response = exchange(QelMessageVirtualSerialCloseReq(state->partition, state->connection, false), end);
+    const auto onResponse = [this, state](const QelMessage& response) {
+        if (response.getStatus() != QelMessageStatusNoError) return;
+        state->finish(SessionEnd::Closed);
+        pForget(*state);
+    };
+    state->isClosing = true;
+    std::unique_ptr<QelMessage> response;
+    try {
+        const QelMessageVirtualSerialCloseReq request(state->partition, state->connection, false);
+        response = exchange(request, end, onResponse);
+    } catch (...) {
+        state->isClosing = false;
+        throw;
+    }
+    state->isClosing = false;
     // The session may have ended while the request was on its way; its notice then came before the response.
-    if (state->isOpen && response->getStatus() != QelMessageStatusNoError) throw StatusError(*response, mServer);
-    state->finish(SessionEnd::Closed);
-    pForget(*state);
+    if (state->end == SessionEnd::None) throw StatusError(*response, mServer);
 }
 
 void ConsoleCore::dropSerial(const std::shared_ptr<SerialState>& state) noexcept
 {
-    try {
-        if (state->isOpen && mLink != nullptr && mLink->isUsable() && !mExchanges.isFull() &&
-            mLink->await(false, TimeProvider::steady()).send) {
-            const QelMessageVirtualSerialCloseReq request(state->partition, state->connection, false);
-            mExchanges.add(request, nullptr);
-            mLink->send(request, deadlineIn(mRequestTimeout));
-        }
-    } catch (const std::exception& error) {
-        logLine(LogLevel::Debug, "while dropping a session: ", explain(error));
-    }
+    if (state->isOpen || state->isHeld) pSendClose(*state);
     state->finish(SessionEnd::Closed);
     pForget(*state);
 }
 
 void ConsoleCore::pConnectOnce(TimePoint end)
 {
-    const TimePoint now = TimeProvider::steady();
-    const TimePoint attemptEnd = std::min(end, now + (mRetry ? mHandshakeTimeout : kLongestAttempt));
+    const TimePoint attemptEnd = std::min(end, deadlineIn(mRetry ? mHandshakeTimeout : kLongestWait));
     TimePoint handshakeEnd;
     ConnectedStream connected = mConnector.connect(attemptEnd, mCloseSwitch, handshakeEnd);
     handshakeEnd = std::min(end, handshakeEnd);
@@ -393,6 +406,83 @@ FrameLink& ConsoleCore::pLink()
     return *mLink;
 }
 
+void ConsoleCore::pSend(const QelMessage& message, TimePoint end)
+{
+    try {
+        pLink().send(message, end);
+    } catch (...) {
+        pFailExchanges();
+        throw;
+    }
+}
+
+std::unique_ptr<QelMessage> ConsoleCore::pReceive(TimePoint begin, TimePoint end)
+{
+    try {
+        return pLink().receive(begin, end);
+    } catch (...) {
+        pFailExchanges();
+        throw;
+    }
+}
+
+/// Nothing can be received any more, if that is so: no request will be answered.
+void ConsoleCore::pFailExchanges() noexcept
+{
+    if (mLink != nullptr && mLink->receiveFailure() != nullptr) mExchanges.failAll(mLink->receiveFailure());
+}
+
+void ConsoleCore::pHandleResponse(std::unique_ptr<QelMessage> response)
+{
+    // Whoever asked, and even if nobody waits any more: the hypervisor has done it.
+    const bool isGrant = response->getStatus() == QelMessageStatusNoError;
+    const bool isOpened = isGrant && is<QelMessageInterfaceCmpOpenKrogSessionRsp>(*response);
+    const bool isClosed = isGrant && is<QelMessageInterfaceCmpCloseKrogSessionRsp>(*response);
+    if (const char* const mistake = mExchanges.deliver(std::move(response))) pBreak(mistake);
+    if (isOpened) mIsSessionOpen = true;
+    if (!isClosed) return;
+    mIsSessionOpen = false;
+    pEndSerials(SessionEnd::Closed);
+}
+
+/// The response to the request that opens a session.
+void ConsoleCore::pHandleOpened(const std::shared_ptr<SerialState>& state, const QelMessage& response) noexcept
+{
+    if (response.getStatus() != QelMessageStatusNoError) return;
+    if (state->end == SessionEnd::None) {
+        state->isOpen = true;
+        return;
+    }
+    // The opening was given up, and the hypervisor holds a session that nobody has. Another opening may be on its way.
+    for (const auto& serial : mSerials) {
+        if (serial->partition != state->partition || serial->connection != state->connection) continue;
+        serial->isHeld = true;
+        return;
+    }
+    pSendClose(*state);
+}
+
+void ConsoleCore::pEndSerials(SessionEnd reason) noexcept
+{
+    for (const auto& serial : mSerials)
+        serial->finish(reason);
+    mSerials.clear();
+}
+
+/// Sends the request to close a session if the connection takes it at once. Its response is dropped.
+void ConsoleCore::pSendClose(const SerialState& state) noexcept
+{
+    try {
+        if (mLink == nullptr || !mLink->isUsable() || mExchanges.isFull()) return;
+        if (!mLink->canTell() || !mLink->await(false, TimeProvider::steady()).send) return;
+        const QelMessageVirtualSerialCloseReq request(state.partition, state.connection, false);
+        mExchanges.add(request, nullptr);
+        pSend(request, deadlineIn(mRequestTimeout));
+    } catch (const std::exception& error) {
+        logLine(LogLevel::Debug, "while dropping a session: ", explain(error));
+    }
+}
+
 /// @return whether the notice was for a session
 bool ConsoleCore::pHandleSerial(const QelMessage& message)
 {
@@ -429,32 +519,42 @@ bool ConsoleCore::pHandleTyped(const QelMessage& message)
 void ConsoleCore::pHandleNotice(const QelMessage& message)
 {
     if (pHandleSerial(message)) return;
+    const bool isEnd = pHandleEnd(message); // first: a handler may throw or connect anew
     const bool isHandled = pHandleTyped(message);
-    pHandleEnd(message);
+    if (isEnd) return pLink().requireReceiving();
     if (isHandled) return;
     const std::shared_ptr<const Console::NoticeHandler> handler = mOtherHandler;
     if (handler != nullptr) return (*handler)(message);
     logLine(LogLevel::Debug, "ignored ", message.getLogID());
 }
 
-/// The notices that end the connection.
-void ConsoleCore::pHandleEnd(const QelMessage& message)
+/// @return whether the notice ends the connection
+bool ConsoleCore::pHandleEnd(const QelMessage& message)
 {
     if (is<QelMessageKrogConnectionClosedAsync>(message)) {
-        for (const auto& serial : mSerials)
-            serial->finish(SessionEnd::ConnectionClosed);
-        mSerials.clear();
-        pLink().fail(std::make_exception_ptr(ClosedByPeer("the server closed the connection", mServer)));
+        pEndSerials(SessionEnd::ConnectionClosed);
+        pFail(std::make_exception_ptr(ClosedByPeer("the server closed the connection", mServer)));
+        return true;
     }
     if (is<QelMessageAbortHandshakeAsync>(message)) {
-        pLink().fail(
-            std::make_exception_ptr(TurnedAway("the server refused the connection: it accepts only TLS", mServer)));
+        pFail(std::make_exception_ptr(TurnedAway("the server refused the connection: it accepts only TLS", mServer)));
+        return true;
     }
+    return false;
+}
+
+/// Ends the connection, which stays there to say why.
+void ConsoleCore::pFail(const std::exception_ptr& failure) noexcept
+{
+    if (mLink != nullptr) mLink->fail(failure);
+    mExchanges.failAll(failure);
 }
 
 void ConsoleCore::pBreak(const std::string& reason)
 {
-    pLink().fail(std::make_exception_ptr(ProtocolBroken("the peer broke the protocol: " + reason, mServer)));
+    const auto failure = std::make_exception_ptr(ProtocolBroken("the peer broke the protocol: " + reason, mServer));
+    pFail(failure);
+    std::rethrow_exception(failure);
 }
 
 void ConsoleCore::pForget(const SerialState& state) noexcept

@@ -23,6 +23,13 @@
 
 namespace qel::protocol {
 
+/// What came of sending a message that had to wait.
+enum class Sending {
+    Done,
+    NotWanted, ///< not any more
+    Late,      ///< the peer took nothing in time; the connection is as good as before
+};
+
 /// What a Console does; shared by the console, its sessions and its pending responses. See Console for the rules.
 /// Thread safety: one thread, except close().
 class ConsoleCore {
@@ -59,20 +66,22 @@ public:
     // Messages.
 
     /// Sends a request and waits for its response, whatever its status. A request whose wait fails is abandoned.
-    std::unique_ptr<QelMessage> exchange(const QelMessage& request, TimePoint end);
+    /// @param action  what the response means, also when it comes too late; must not outlive what it uses
+    std::unique_ptr<QelMessage> exchange(const QelMessage& request, TimePoint end, Exchanges::Action action = {});
     /// exchange() for a request that must be granted. @throws StatusError
-    std::unique_ptr<QelMessage> require(const QelMessage& request, TimePoint end);
-    /// Sends a request.
+    std::unique_ptr<QelMessage> require(const QelMessage& request, TimePoint end, Exchanges::Action action = {});
+    /// Sends a request. Returns without having sent it when the connection ends while others are received; the exchange
+    /// has failed then.
     /// @param exchange  made for this request; borrowed until it is done or abandoned
-    void start(const QelMessage& request, Exchange& exchange, TimePoint end);
+    void start(const QelMessage& request, Exchange& exchange, TimePoint end, Exchanges::Action action = {});
     /// Waits for the response to a request.
     std::unique_ptr<QelMessage> finish(Exchange& exchange, TimePoint end);
     void abandon(const Exchange& exchange) noexcept { mExchanges.abandon(exchange); }
     void send(const QelMessage& notice, TimePoint end);
     /// Sends a message; receives others while the peer takes nothing.
     /// @param isWanted  asked before each wait
-    /// @return false: the message was not wanted any more
-    bool sendAmongOthers(const QelMessage& message, TimePoint end, const std::function<bool()>& isWanted);
+    Sending sendAmongOthers(const QelMessage& message, TimePoint end, const std::function<bool()>& isWanted);
+    [[noreturn]] void throwNotTaken() const;
 
     /// Receives and handles one message. @return false: none began in time
     bool receiveOne(TimePoint begin, TimePoint end);
@@ -96,10 +105,19 @@ private:
     void pDisconnect(const std::exception_ptr& failure) noexcept;
     FrameLink& pLink();
 
+    void pSend(const QelMessage& message, TimePoint end);
+    std::unique_ptr<QelMessage> pReceive(TimePoint begin, TimePoint end);
+    void pFailExchanges() noexcept;
+
+    void pHandleResponse(std::unique_ptr<QelMessage> response);
+    void pHandleOpened(const std::shared_ptr<SerialState>& state, const QelMessage& response) noexcept;
+    void pEndSerials(SessionEnd reason) noexcept;
+    void pSendClose(const SerialState& state) noexcept;
     bool pHandleSerial(const QelMessage& message);
     bool pHandleTyped(const QelMessage& message);
     void pHandleNotice(const QelMessage& message);
-    void pHandleEnd(const QelMessage& message);
+    bool pHandleEnd(const QelMessage& message);
+    void pFail(const std::exception_ptr& failure) noexcept;
     [[noreturn]] void pBreak(const std::string& reason);
     void pForget(const SerialState& state) noexcept;
     const SerialState* pFullSerial() const noexcept;
@@ -124,6 +142,7 @@ private:
     std::shared_ptr<const Console::NoticeHandler> mOtherHandler;
     std::vector<std::shared_ptr<SerialState>> mSerials;
     bool mIsSessionOpen = false; // the hypervisor session
+    bool mIsReconnecting = false;
 };
 
 } // namespace qel::protocol

@@ -5,17 +5,17 @@
 
 namespace qel::protocol {
 
-void Exchanges::add(const QelMessage& request, Exchange* exchange)
+void Exchanges::add(const QelMessage& request, Exchange* exchange, Action action)
 {
     mEntries.push_back({request.getCallerId(), static_cast<unsigned short>(request.getFunction()),
-                        static_cast<unsigned short>(request.getOperation()), exchange});
+                        static_cast<unsigned short>(request.getOperation()), exchange, std::move(action)});
 }
 
-void Exchanges::removeLast(const QelMessage& request) noexcept
+void Exchanges::remove(const Exchange& exchange) noexcept
 {
-    const auto found = std::find_if(mEntries.rbegin(), mEntries.rend(),
-                                    [&](const Entry& entry) { return entry.callerId == request.getCallerId(); });
-    if (found != mEntries.rend()) mEntries.erase(std::next(found).base());
+    const auto found =
+        std::find_if(mEntries.begin(), mEntries.end(), [&](const Entry& entry) { return entry.exchange == &exchange; });
+    if (found != mEntries.end()) mEntries.erase(found);
 }
 
 void Exchanges::abandon(const Exchange& exchange) noexcept
@@ -33,8 +33,10 @@ const char* Exchanges::deliver(std::unique_ptr<QelMessage> response)
     if (found->function != response->getFunction() || found->operation != response->getOperation()) {
         return "a response of another kind than its request";
     }
-    if (found->exchange != nullptr) found->exchange->response = std::move(response);
-    mEntries.erase(found);
+    const Entry entry = std::move(*found);
+    mEntries.erase(found); // first: the action may send another request
+    if (entry.action) entry.action(*response);
+    if (entry.exchange != nullptr) entry.exchange->response = std::move(response);
     return nullptr;
 }
 

@@ -4,6 +4,7 @@
 
 #include <cstddef>
 #include <exception>
+#include <functional>
 #include <memory>
 #include <vector>
 
@@ -36,10 +37,14 @@ public:
     bool isFull() const noexcept { return mEntries.size() >= kMost; }
     bool isEmpty() const noexcept { return mEntries.empty(); }
 
+    /// What to do about a response as soon as it arrives, whether or not anybody still waits for it.
+    using Action = std::function<void(const QelMessage& response)>;
+
     /// @param exchange  gets the response; borrowed until then or until abandon(). Null: the response is dropped
-    void add(const QelMessage& request, Exchange* exchange);
-    /// Forgets the request that was added last: it could not be sent.
-    void removeLast(const QelMessage& request) noexcept;
+    /// @param action    called before the response is handed on; may be empty
+    void add(const QelMessage& request, Exchange* exchange, Action action = {});
+    /// Forgets a request: it could not be sent.
+    void remove(const Exchange& exchange) noexcept;
     /// Nobody waits for this response any more; it is dropped.
     void abandon(const Exchange& exchange) noexcept;
 
@@ -56,6 +61,7 @@ private:
         unsigned short function;
         unsigned short operation;
         Exchange* exchange; // null: abandoned
+        Action action;
     };
 
     std::vector<Entry> mEntries;

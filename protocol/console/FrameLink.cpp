@@ -35,13 +35,22 @@ std::exception_ptr failureOf(F fail)
     return nullptr;
 }
 
+/// How long a message may take that begins now.
+milliseconds frameTime(milliseconds frameTimeout, TimePoint end)
+{
+    const milliseconds left = timeLeft(end);
+    if (left < milliseconds::zero()) return frameTimeout;
+    return std::max(std::min(left, frameTimeout), kShortestWait);
+}
+
 } // namespace
 
-void FrameLink::Input::begin(milliseconds frameTimeout)
+void FrameLink::Input::begin(milliseconds frameTimeout, TimePoint end)
 {
     mFrameTimeout = frameTimeout;
+    mEnd = end;
     mHasBegun = hasBytes();
-    if (mHasBegun) mStream.setReadDeadline(frameTimeout);
+    if (mHasBegun) mStream.setReadDeadline(frameTime(frameTimeout, end));
 }
 
 std::size_t FrameLink::Input::read(char* buffer, std::size_t length)
@@ -72,15 +81,15 @@ void FrameLink::Input::pNote(std::size_t count)
 {
     if (mHasBegun || count == 0) return;
     mHasBegun = true;
-    if (!mIsDirect) mStream.setReadDeadline(mFrameTimeout);
+    if (!mIsDirect) mStream.setReadDeadline(frameTime(mFrameTimeout, mEnd));
 }
 
 FrameLink::FrameLink(ConnectedStream connected, const std::string& server, milliseconds frameTimeout,
                      CloseSwitch& closeSwitch)
     : mStream(std::move(connected.stream)), mReadAhead(connected.readAhead),
       mTls(mReadAhead == nullptr ? nullptr : static_cast<SSLStream*>(mStream.get())), mDescriptor(connected.descriptor),
-      mServer(server), mFrameTimeout(frameTimeout), mCloseSwitch(closeSwitch), mInput(*mStream, mTls != nullptr),
-      mMessages(mInput, messageRegistry())
+      mReadiness(connected.readiness), mServer(server), mFrameTimeout(frameTimeout), mCloseSwitch(closeSwitch),
+      mInput(*mStream, mTls != nullptr), mMessages(mInput, messageRegistry())
 {
     mCloseSwitch.watch(mStream.get());
 }
@@ -90,7 +99,7 @@ FrameLink::~FrameLink() { mCloseSwitch.watch(nullptr); }
 void FrameLink::send(const QelMessage& message, TimePoint end)
 {
     if (mSendFailure) std::rethrow_exception(mSendFailure);
-    mStream->setWriteDeadline(pFrameTime(timeLeft(end)));
+    mStream->setWriteDeadline(frameTime(mFrameTimeout, end));
     try {
         mMessages.write(message);
     } catch (const StreamIOException& error) {
@@ -100,32 +109,39 @@ void FrameLink::send(const QelMessage& message, TimePoint end)
 
 std::unique_ptr<QelMessage> FrameLink::receive(TimePoint begin, TimePoint end)
 {
-    if (mReceiveFailure) std::rethrow_exception(mReceiveFailure);
+    requireReceiving();
     try {
         const milliseconds left = timeLeft(begin);
-        const milliseconds frameTime = pFrameTime(begin == end ? left : timeLeft(end));
-        mInput.begin(frameTime);
+        // The stream would wait for at least a tick of the system's timers.
+        if (left == milliseconds::zero() && !pHasInput()) return nullptr;
+        mInput.begin(mFrameTimeout, end);
         if (mTls == nullptr) {
             if (!mInput.hasBegun()) mStream->setReadDeadline(left);
         } else if (!mInput.hasBegun()) {
             if (!mTls->hasPending() && !mReadAhead->awaitBytes(left)) return nullptr;
-            mStream->setReadDeadline(frameTime);
+            mStream->setReadDeadline(frameTime(mFrameTimeout, end));
         }
         return mMessages.read();
     } catch (const StreamIOException& error) {
         if (mTls == nullptr && !mInput.hasBegun() && isDeadline(error)) return nullptr;
-        fail(pFailure(error));
+        pFail(pFailure(error));
     } catch (const QelMessageValidationException& error) {
-        fail(failureOf([&] {
+        pFail(failureOf([&] {
             std::throw_with_nested(
                 ProtocolBroken(std::string("the peer broke the protocol: ") + error.what(), mServer));
         }));
     }
 }
 
-FrameLink::Ready FrameLink::await(bool wantsToReceive, TimePoint end)
+Ready FrameLink::await(bool wantsToReceive, TimePoint end)
 {
-    if (mDescriptor < 0) return {true, false};
+    if (!canTell()) return {true, false};
+    if (mDescriptor < 0) {
+        const bool isPending = wantsToReceive && hasPending();
+        Ready ready = mReadiness->awaitReady(wantsToReceive, isPending ? milliseconds::zero() : timeLeft(end));
+        ready.receive |= isPending;
+        return ready;
+    }
     const PollFd output(mDescriptor, PollEvents::Write);
     PollSet set(output);
     const PollFd input(mDescriptor, PollEvents::Read);
@@ -138,10 +154,15 @@ FrameLink::Ready FrameLink::await(bool wantsToReceive, TimePoint end)
     }
 }
 
-void FrameLink::fail(std::exception_ptr failure)
+void FrameLink::fail(const std::exception_ptr& failure) noexcept
 {
     mReceiveFailure = failure;
     if (!mSendFailure) mSendFailure = failure;
+}
+
+void FrameLink::pFail(const std::exception_ptr& failure)
+{
+    fail(failure);
     std::rethrow_exception(failure);
 }
 
@@ -155,13 +176,13 @@ PollFd FrameLink::getPollFd(PollEvents events) const
     return mDescriptor < 0 ? PollFd::Ignore : PollFd(mDescriptor, events);
 }
 
-void FrameLink::leave() noexcept
+void FrameLink::leave(TimePoint end) noexcept
 {
     mSendFailure = mReceiveFailure = std::make_exception_ptr(Error("this console has left", mServer));
     try {
         if (mDescriptor >= 0) {
             static_cast<void>(::shutdown(mDescriptor, SHUT_WR));
-            pAwaitEnd();
+            pAwaitEnd(end);
         }
         mStream->close();
     } catch (const std::exception& error) {
@@ -169,19 +190,18 @@ void FrameLink::leave() noexcept
     }
 }
 
-void FrameLink::pAwaitEnd()
+/// False when there is certainly nothing to receive at the moment.
+bool FrameLink::pHasInput() const
 {
-    std::array<char, 4096> rest;
-    mStream->setReadDeadline(kMaxFarewell);
-    while (mStream->read(rest.data(), rest.size()) > 0)
-        continue;
+    return mDescriptor < 0 || hasPending() || PollSet(PollFd(mDescriptor, PollEvents::Read)).poll().anyReady();
 }
 
-/// How long a message may take when so much time is left for it.
-milliseconds FrameLink::pFrameTime(milliseconds left) const
+void FrameLink::pAwaitEnd(TimePoint end)
 {
-    if (left < milliseconds::zero()) return mFrameTimeout;
-    return std::max(std::min(left, mFrameTimeout), kShortestWait);
+    std::array<char, 4096> rest;
+    mStream->setReadDeadline(timeLeft(std::min(end, deadlineIn(kMaxFarewell))));
+    while (mStream->read(rest.data(), rest.size()) > 0)
+        continue;
 }
 
 /// The frame may have been sent in part.

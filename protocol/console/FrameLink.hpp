@@ -51,18 +51,21 @@ public:
     ///         and receiving fail from then on
     std::unique_ptr<QelMessage> receive(TimePoint begin, TimePoint end);
 
-    /// What can be done without waiting.
-    struct Ready {
-        bool send = false;
-        bool receive = false;
-    };
-    /// Waits until a message can be sent or, if wanted, received. Without a descriptor a send can always be tried.
+    /// Waits until a message can be sent or, if wanted, received. A stream that cannot tell can always be tried.
     /// @return neither: not by the deadline
     Ready await(bool wantsToReceive, TimePoint end);
+    /// Whether await() knows more than that it can be tried.
+    bool canTell() const noexcept { return mDescriptor >= 0 || mReadiness != nullptr; }
 
     /// Makes the connection unusable: sending and receiving throw this from now on.
-    /// @throws the failure
-    [[noreturn]] void fail(std::exception_ptr failure);
+    void fail(const std::exception_ptr& failure) noexcept;
+    /// What receiving throws from now on; null: nothing.
+    const std::exception_ptr& receiveFailure() const noexcept { return mReceiveFailure; }
+    /// Throws it.
+    void requireReceiving() const
+    {
+        if (mReceiveFailure) std::rethrow_exception(mReceiveFailure);
+    }
     /// False after any failure.
     bool isUsable() const noexcept { return mSendFailure == nullptr && mReceiveFailure == nullptr; }
 
@@ -71,8 +74,8 @@ public:
     bool hasPending() const;
     bool isProtected() const noexcept { return mTls != nullptr; }
 
-    /// As Console::leave(). Sending and receiving fail from then on.
-    void leave() noexcept;
+    /// As Console::leave(), and only until `end`. Sending and receiving fail from then on.
+    void leave(TimePoint end) noexcept;
 
 private:
     /// What has arrived. On a plain connection it is read in large pieces: a short message takes one system call
@@ -83,8 +86,10 @@ private:
         /// @param isDirect  over TLS: read no more than is asked for, since TLS keeps the rest
         Input(Stream& stream, bool isDirect) : mStream(stream), mIsDirect(isDirect) {}
 
-        /// A message may begin now. @param frameTimeout  for the rest of it once it has begun
-        void begin(std::chrono::milliseconds frameTimeout);
+        /// A message may begin now.
+        /// @param frameTimeout  for the rest of it once it has begun
+        /// @param end           the same; whatever is earlier
+        void begin(std::chrono::milliseconds frameTimeout, TimePoint end);
         bool hasBegun() const noexcept { return mHasBegun; }
         bool hasBytes() const noexcept { return mFirst != mLast; }
 
@@ -102,11 +107,13 @@ private:
         std::size_t mFirst = 0; // of the bytes that were not asked for yet
         std::size_t mLast = 0;
         std::chrono::milliseconds mFrameTimeout{0};
+        TimePoint mEnd;
         bool mHasBegun = false;
     };
 
-    std::chrono::milliseconds pFrameTime(std::chrono::milliseconds left) const;
-    void pAwaitEnd();
+    bool pHasInput() const;
+    void pAwaitEnd(TimePoint end);
+    [[noreturn]] void pFail(const std::exception_ptr& failure);
     [[noreturn]] void pFailSending(const StreamIOException& error);
     std::exception_ptr pFailure(const StreamIOException& error) const;
 
@@ -114,6 +121,7 @@ private:
     ReadAhead* const mReadAhead; // under mTls; null for a plain connection
     SSLStream* const mTls;       // points to *mStream; null for a plain connection
     const int mDescriptor;
+    Readiness* const mReadiness; // of a stream without a descriptor; null: it cannot tell
     const std::string mServer;
     const std::chrono::milliseconds mFrameTimeout;
     CloseSwitch& mCloseSwitch;

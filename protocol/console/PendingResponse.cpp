@@ -3,11 +3,12 @@
 
 #include "console/ConsoleCore.hpp"
 
+#include <stdexcept>
 #include <utility>
 
 namespace qel::protocol::detail {
 
-PendingExchange::PendingExchange(std::shared_ptr<ConsoleCore> core, std::unique_ptr<Exchange> exchange) noexcept
+PendingExchange::PendingExchange(std::shared_ptr<ConsoleCore> core, std::shared_ptr<Exchange> exchange) noexcept
     : mCore(std::move(core)), mExchange(std::move(exchange))
 {}
 
@@ -30,16 +31,22 @@ std::unique_ptr<QelMessage> PendingExchange::take() { return take(mCore->request
 
 std::unique_ptr<QelMessage> PendingExchange::take(std::chrono::milliseconds timeout)
 {
-    std::unique_ptr<QelMessage> response = mCore->finish(*mExchange, deadlineIn(timeout));
-    if (response->getStatus() != QelMessageStatusNoError) throw StatusError(*response, mCore->server());
+    const std::shared_ptr<ConsoleCore> core = mCore; // a handler may destroy or move this object
+    const std::shared_ptr<Exchange> exchange = mExchange;
+    std::unique_ptr<QelMessage> response = core->finish(*exchange, deadlineIn(timeout));
+    if (response->getStatus() != QelMessageStatusNoError) throw StatusError(*response, core->server());
     return response;
 }
 
-const std::string& PendingExchange::peer() const noexcept { return mCore->server(); }
+std::string PendingExchange::peer() const { return mCore->server(); }
 
 void PendingExchange::pAbandon() noexcept
 {
-    if (mExchange != nullptr) mCore->abandon(*mExchange);
+    if (mExchange == nullptr) return;
+    mCore->abandon(*mExchange);
+    // A handler does this while take() waits: what it waits for will not come.
+    if (mExchange.use_count() == 1 || mExchange->isDone()) return;
+    mExchange->failure = std::make_exception_ptr(std::logic_error("the pending response was given up"));
 }
 
 } // namespace qel::protocol::detail

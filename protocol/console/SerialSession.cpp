@@ -67,15 +67,18 @@ std::size_t SerialSession::read(char* buffer, std::size_t length) { return read(
 std::size_t SerialSession::read(char* buffer, std::size_t length, milliseconds timeout)
 {
     if (length == 0) throw std::invalid_argument("length: zero");
+    const auto core = mCore; // a handler may destroy or move this session
+    const auto state = mState;
+    const auto isWaiting = [&] { return state->unreadBytes() == 0 && state->end == SessionEnd::None; };
     const TimePoint end = deadlineIn(timeout);
-    while (mState->unreadBytes() == 0 && mState->end == SessionEnd::None) {
-        doStep(*mState, [&] {
-            if (mCore->receiveOne(end, TimePoint::max())) return;
-            throw DeadlinePassed("partition " + std::to_string(mState->partition) + " sent nothing in time",
-                                 mCore->server());
+    while (isWaiting()) {
+        doStep(*state, [&] {
+            if (core->receiveOne(end, TimePoint::max()) && !(isWaiting() && hasPassed(end))) return;
+            throw DeadlinePassed("partition " + std::to_string(state->partition) + " sent nothing in time",
+                                 core->server());
         });
     }
-    return readAvailable(buffer, length);
+    return state->take(buffer, length);
 }
 
 std::size_t SerialSession::readAvailable(char* buffer, std::size_t length) noexcept
@@ -87,15 +90,21 @@ std::size_t SerialSession::getAvailable() const noexcept { return mState->unread
 
 std::size_t SerialSession::write(const char* data, std::size_t length)
 {
-    const auto isWanted = [this] { return mState->end == SessionEnd::None; };
+    const auto core = mCore; // a handler may destroy or move this session
+    const auto state = mState;
+    const auto isWanted = [&] { return state->end == SessionEnd::None; };
     std::size_t sent = 0;
     while (sent < length && isWanted()) {
         const std::size_t count = std::min(length - sent, kMaxData);
-        const auto message = dataMessage(*mState, data + sent, count);
-        bool isSent = false;
-        doStep(*mState,
-               [&] { isSent = mCore->sendAmongOthers(message, deadlineIn(mCore->requestTimeout()), isWanted); });
-        if (isSent) sent += count;
+        const auto message = dataMessage(*state, data + sent, count);
+        auto sending = Sending::NotWanted;
+        doStep(*state, [&] { sending = core->sendAmongOthers(message, deadlineIn(core->requestTimeout()), isWanted); });
+        if (sending == Sending::Late && sent == 0) core->throwNotTaken();
+        if (sending == Sending::Late) break;
+        if (sending == Sending::Done) {
+            sent += count;
+            state->sent += count;
+        }
     }
     return sent;
 }
@@ -105,8 +114,11 @@ void SerialSession::writeSome(std::string& data)
     if (mState->end != SessionEnd::None) return data.clear();
     const std::size_t count = std::min(data.size(), kMaxData);
     mCore->send(dataMessage(*mState, data.data(), count), deadlineIn(mCore->requestTimeout()));
+    mState->sent += count;
     data.erase(0, count);
 }
+
+std::uint64_t SerialSession::getSent() const noexcept { return mState->sent; }
 
 SessionEnd SerialSession::getEnd() const noexcept { return mState->end; }
 
@@ -120,7 +132,12 @@ std::string SerialSession::describeEnd() const
 
 void SerialSession::close() { close(mCore->requestTimeout()); }
 
-void SerialSession::close(milliseconds timeout) { mCore->closeSerial(mState, deadlineIn(timeout)); }
+void SerialSession::close(milliseconds timeout)
+{
+    const auto core = mCore; // a handler may destroy or move this session
+    const auto state = mState;
+    core->closeSerial(state, deadlineIn(timeout));
+}
 
 void SerialSession::pRelease() noexcept
 {

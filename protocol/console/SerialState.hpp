@@ -20,6 +20,9 @@ struct SerialState {
     const std::uint16_t connection;
     const std::size_t maxUnread;
     bool isOpen = false; ///< at the hypervisor
+    bool isHeld = false; ///< the hypervisor holds a session with this address for this console, of an earlier opening
+    bool isClosing = false; ///< a call waits for that; output may exceed the limit
+    std::uint64_t sent = 0; ///< bytes of input
     SessionEnd end = SessionEnd::None;
     CommandEnd commandEnd;
 
@@ -35,7 +38,7 @@ struct SerialState {
     /// Removes the oldest output. @return the number of bytes
     std::size_t take(char* buffer, std::size_t length) noexcept;
     std::size_t unreadBytes() const noexcept { return mOutput.size() - mTaken; }
-    bool isFull() const noexcept { return unreadBytes() >= maxUnread; }
+    bool isFull() const noexcept { return !isClosing && unreadBytes() >= maxUnread; }
 
     /// The session has ended. The first reason stays.
     void finish(SessionEnd reason) noexcept;

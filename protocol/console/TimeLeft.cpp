@@ -10,7 +10,6 @@ namespace {
 
 using std::chrono::milliseconds;
 
-constexpr milliseconds kLongest = std::chrono::hours(20 * 24);
 constexpr milliseconds kNoLimit(-1);
 
 } // namespace
@@ -28,7 +27,9 @@ milliseconds timeLeft(TimePoint deadline)
     if (deadline == TimePoint::max()) return kNoLimit;
     const TimePoint now = TimeProvider::steady();
     if (deadline <= now) return milliseconds::zero();
-    return std::min(std::chrono::ceil<milliseconds>(deadline - now), kLongest);
+    return std::min(std::chrono::ceil<milliseconds>(deadline - now), kLongestWait);
 }
+
+bool hasPassed(TimePoint deadline) { return deadline != TimePoint::max() && TimeProvider::steady() >= deadline; }
 
 } // namespace qel::protocol

@@ -1,10 +1,14 @@
+#include <qel/common/QelMessage.hpp>
 #include <qel/common/io/StreamDeadline.hpp>
 #include <qel/common/io/StreamIOException.hpp>
 #include <qel/common/util/ConditionVariable.hpp>
 #include <qel/common/util/Mutex.hpp>
 #include <qel/protocol/MemoryStream.hpp>
 
+#include "transport/Readiness.hpp"
+
 #include <algorithm>
+#include <array>
 #include <chrono>
 #include <stdexcept>
 #include <string>
@@ -15,12 +19,22 @@ namespace {
 
 using std::chrono::steady_clock;
 
-/// Bytes in one direction.
-class Pipe {
-public:
-    explicit Pipe(std::size_t capacity) : mCapacity(capacity) {}
+/// @param timeout  any; so long that nobody sees the end of it is cut to what the clock can hold
+steady_clock::time_point endOf(std::chrono::milliseconds timeout)
+{
+    constexpr std::chrono::milliseconds kLongest = std::chrono::hours(24 * 365 * 100);
+    return steady_clock::now() + std::min(timeout, kLongest);
+}
 
-    /// Ends this direction: the reader gets what is left, the writer fails.
+/// A console sends a message at once when there is room for it, with what TLS adds.
+constexpr std::size_t kWholeMessage = QelMessage::MtuMax + 1024;
+
+/// The bytes on their way between two ends, 0 and 1. Each direction has the number of the end that reads from it.
+class Link {
+public:
+    explicit Link(std::size_t capacity) : mCapacity(capacity) {}
+
+    /// Ends both directions: the readers get what is left, the writers fail.
     void close()
     {
         const MutexLock lock(mMutex);
@@ -28,44 +42,74 @@ public:
         mChanged.notifyAll();
     }
 
-    std::size_t read(char* buffer, std::size_t length, StreamDeadline& deadline)
+    std::size_t read(int self, char* buffer, std::size_t length, StreamDeadline& deadline)
     {
         const auto timeout = deadline.getEffectiveTimeout();
-        const auto end = steady_clock::now() + timeout;
+        const auto end = endOf(timeout);
         UniqueMutexLock lock(mMutex);
-        while (length != 0 && mFirst == mBytes.size() && !mClosed)
+        Bytes& bytes = mBytes[self];
+        while (length != 0 && bytes.size() == 0 && !mClosed)
             pWait(lock, timeout, end);
-        const std::size_t count = std::min(length, mBytes.size() - mFirst);
-        std::copy_n(mBytes.data() + mFirst, count, buffer);
-        mFirst += count;
-        if (mFirst == mBytes.size()) {
-            mBytes.clear();
-            mFirst = 0;
+        const std::size_t count = std::min(length, bytes.size());
+        std::copy_n(bytes.text.data() + bytes.first, count, buffer);
+        bytes.first += count;
+        if (bytes.size() == 0) {
+            bytes.text.clear();
+            bytes.first = 0;
         }
         mChanged.notifyAll();
         return count;
     }
 
-    void write(const char* buffer, std::size_t length, StreamDeadline& deadline)
+    void write(int self, const char* buffer, std::size_t length, StreamDeadline& deadline)
     {
         const auto timeout = deadline.getEffectiveTimeout();
-        const auto end = steady_clock::now() + timeout;
+        const auto end = endOf(timeout);
         UniqueMutexLock lock(mMutex);
+        Bytes& bytes = mBytes[1 - self];
         while (length != 0) {
-            while (!mClosed && mBytes.size() - mFirst >= mCapacity)
+            while (!mClosed && bytes.size() >= mCapacity)
                 pWait(lock, timeout, end);
             if (mClosed) throw StreamIOException("EOF");
-            mBytes.erase(0, mFirst);
-            mFirst = 0;
-            const std::size_t count = std::min(length, mCapacity - mBytes.size());
-            mBytes.append(buffer, count);
+            bytes.text.erase(0, bytes.first);
+            bytes.first = 0;
+            const std::size_t count = std::min(length, mCapacity - bytes.text.size());
+            bytes.text.append(buffer, count);
             buffer += count;
             length -= count;
             mChanged.notifyAll();
         }
     }
 
+    /// As Readiness.
+    Ready awaitReady(int self, bool wantsToReceive, std::chrono::milliseconds timeout)
+    {
+        const bool isLimited = timeout >= std::chrono::milliseconds::zero();
+        const auto end = endOf(timeout);
+        UniqueMutexLock lock(mMutex);
+        for (;;) {
+            const std::size_t room = mCapacity - mBytes[1 - self].size();
+            const Ready ready{mClosed || room >= std::min(mCapacity, kWholeMessage),
+                              wantsToReceive && (mClosed || mBytes[self].size() != 0)};
+            if (ready.send || ready.receive) return ready;
+            if (!isLimited) {
+                mChanged.wait(lock);
+            } else if (steady_clock::now() >= end) {
+                return ready;
+            } else {
+                static_cast<void>(mChanged.waitUntil(lock, end));
+            }
+        }
+    }
+
 private:
+    struct Bytes {
+        std::size_t size() const { return text.size() - first; }
+
+        std::string text;
+        std::size_t first = 0; // the first byte that was not read
+    };
+
     void pWait(UniqueMutexLock& lock, std::chrono::milliseconds timeout, steady_clock::time_point end)
         QEL_REQUIRES(mMutex)
     {
@@ -78,32 +122,32 @@ private:
 
     Mutex mMutex; // guards the bytes on their way and whether more can come
     ConditionVariable mChanged;
-    std::string mBytes QEL_GUARDED_BY(mMutex);
-    std::size_t mFirst QEL_GUARDED_BY(mMutex) = 0; // the first byte that was not read
+    std::array<Bytes, 2> mBytes QEL_GUARDED_BY(mMutex);
     bool mClosed QEL_GUARDED_BY(mMutex) = false;
 };
 
-class MemoryStream final : public Stream {
+class MemoryStream final : public Stream, public Readiness {
 public:
-    MemoryStream(std::shared_ptr<Pipe> in, std::shared_ptr<Pipe> out) : mIn(std::move(in)), mOut(std::move(out)) {}
+    MemoryStream(std::shared_ptr<Link> link, int self) : mLink(std::move(link)), mSelf(self) {}
 
-    ~MemoryStream() override { pClose(); }
+    ~MemoryStream() override { mLink->close(); }
 
-    void close() override { pClose(); }
+    void close() override { mLink->close(); }
     void setReadDeadline(std::chrono::milliseconds timeout) override { mReadDeadline = timeout; }
     void setWriteDeadline(std::chrono::milliseconds timeout) override { mWriteDeadline = timeout; }
-    std::size_t read(char* buffer, std::size_t length) override { return mIn->read(buffer, length, mReadDeadline); }
-    void write(const char* buffer, std::size_t length) override { mOut->write(buffer, length, mWriteDeadline); }
-
-private:
-    void pClose()
+    std::size_t read(char* buffer, std::size_t length) override
     {
-        mIn->close();
-        mOut->close();
+        return mLink->read(mSelf, buffer, length, mReadDeadline);
+    }
+    void write(const char* buffer, std::size_t length) override { mLink->write(mSelf, buffer, length, mWriteDeadline); }
+    Ready awaitReady(bool wantsToReceive, std::chrono::milliseconds timeout) override
+    {
+        return mLink->awaitReady(mSelf, wantsToReceive, timeout);
     }
 
-    const std::shared_ptr<Pipe> mIn;
-    const std::shared_ptr<Pipe> mOut;
+private:
+    const std::shared_ptr<Link> mLink;
+    const int mSelf; // 0 or 1
     StreamDeadline mReadDeadline;
     StreamDeadline mWriteDeadline;
 };
@@ -113,9 +157,8 @@ private:
 std::pair<std::unique_ptr<Stream>, std::unique_ptr<Stream>> makeMemoryStreams(std::size_t capacity)
 {
     if (capacity == 0) throw std::invalid_argument("capacity");
-    const auto there = std::make_shared<Pipe>(capacity);
-    const auto back = std::make_shared<Pipe>(capacity);
-    return {std::make_unique<MemoryStream>(back, there), std::make_unique<MemoryStream>(there, back)};
+    const auto link = std::make_shared<Link>(capacity);
+    return {std::make_unique<MemoryStream>(link, 0), std::make_unique<MemoryStream>(link, 1)};
 }
 
 } // namespace qel::protocol

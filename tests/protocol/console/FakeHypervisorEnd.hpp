@@ -96,6 +96,9 @@ public:
             continue;
     }
 
+    /// Called by every read(), first.
+    std::function<void()> beforeRead;
+
     /// Every write() throws this.
     void failWrites(std::function<void()> failure) { mWriteFailure = std::move(failure); }
 
@@ -113,6 +116,7 @@ public:
     void setWriteDeadline(Milliseconds timeout) override { writeDeadlines.push_back(timeout); }
     std::size_t read(char* buffer, std::size_t length) override
     {
+        if (const auto before = beforeRead) before();
         const ssize_t count = ::read(mNear, buffer, length);
         if (count < 0) throw StreamIOException("I/O deadline");
         return static_cast<std::size_t>(count);

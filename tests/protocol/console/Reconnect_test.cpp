@@ -243,6 +243,72 @@ TEST(Reconnect, EndsWhatBelongedToTheOldConnection)
     EXPECT_EQ(again.getEnd(), SessionEnd::None);
 }
 
+TEST(Reconnect, MayBeDoneByTheHandlerOfTheConnectionClosedNotice)
+{
+    const FakeServer server({[](LoopbackMessages& messages) {
+                                 welcome(messages);
+                                 messages.receive();
+                                 messages.send(QelMessageKrogConnectionClosedAsync());
+                                 messages.isClosed();
+                             },
+                             serveUntilTheEnd});
+    Console console(impatientOptions(server));
+    console.onNotice<QelMessageKrogConnectionClosedAsync>(
+        [&](const auto&) { console.reconnect(std::chrono::seconds(10)); });
+    EXPECT_THAT([&] { console.exchange(QelMessageGetQelTodReq()); },
+                failsWith<ClosedByPeer>("the server closed the connection"));
+    EXPECT_NO_THROW(console.exchange(QelMessageGetQelTodReq()));
+    EXPECT_EQ(server.connections(), 2U);
+}
+
+TEST(Reconnect, MayBeDoneByAHandlerWhileARequestWaitsToBeSent)
+{
+    std::promise<void> mayTake;
+    const FakeServer server({[&](LoopbackMessages& messages) {
+                                 welcome(messages);
+                                 messages.send(QelMessageDaxBroadcastOutboundAsync(1, 1, "them", "x"));
+                                 mayTake.get_future().wait();
+                                 for (;;)
+                                     messages.receive();
+                             },
+                             serveUntilTheEnd});
+    Console console(impatientOptions(server));
+    bool isReplaced = false;
+    console.onNotice<QelMessageDaxBroadcastOutboundAsync>([&](const auto&) {
+        mayTake.set_value();
+        console.reconnect(std::chrono::seconds(10));
+        isReplaced = true;
+    });
+    std::vector<PendingResponse<QelMessageSetGlobalSaveAreaMetadataRsp>> pending;
+    while (!isReplaced)
+        pending.push_back(console.start(QelMessageSetGlobalSaveAreaMetadataReq(std::string(16000, 'x'))));
+    EXPECT_THAT([&] { pending.back().get(); },
+                failsWith<ClosedByPeer>("the connection has been replaced by another one"));
+    EXPECT_NO_THROW(console.exchange(QelMessageGetQelTodReq()));
+    EXPECT_NO_THROW(console.exchange(QelMessageGetQelTodReq()));
+}
+
+TEST(Reconnect, IsNotBegunAgainByAHandlerThatItCalls)
+{
+    const FakeServer server({serveUntilTheEnd,
+                             [](LoopbackMessages& messages) {
+                                 messages.receive();
+                                 messages.send(QelMessageKrogConnectionClosedAsync());
+                                 messages.isClosed();
+                             },
+                             serveUntilTheEnd});
+    Console console(impatientOptions(server));
+    int calls = 0;
+    console.onNotice<QelMessageKrogConnectionClosedAsync>([&](const auto&) {
+        ++calls;
+        console.reconnect(std::chrono::seconds(10));
+    });
+    console.reconnect(std::chrono::seconds(10));
+    EXPECT_EQ(calls, 1);
+    EXPECT_NO_THROW(console.exchange(QelMessageGetQelTodReq()));
+    EXPECT_EQ(server.connections(), 3U);
+}
+
 TEST(Reconnect, LeavesPolitelyFirst)
 {
     std::promise<bool> hasLeft;

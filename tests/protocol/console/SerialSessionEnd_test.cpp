@@ -196,6 +196,14 @@ TEST_F(SerialSessionTest, DestructionClosesTheSessionWithoutWaiting)
     receive(output("late"));
 }
 
+TEST_F(SerialSessionTest, DestructionSendsNothingOverAStreamThatCannotTellWhetherItTakesIt)
+{
+    console.emplace(FakeHypervisorEnd::makeConsole(end));
+    open();
+    session.reset();
+    EXPECT_THAT(end->received, IsEmpty());
+}
+
 TEST_F(SerialSessionTest, AMovedSessionIsNotClosed)
 {
     open();

@@ -110,7 +110,8 @@ protected:
 
     CapturedLog log{LogLevel::Warn};
     FakeHypervisorEnd* end = nullptr; // owned by the console
-    std::optional<protocol::Console> console{FakeHypervisorEnd::makeConsole(end)};
+    std::optional<protocol::Console> console{
+        FakeHypervisorEnd::makeConsole(end, FakeHypervisorEnd::plainOptions(), true)};
     std::optional<protocol::SerialSession> session;
 };
 

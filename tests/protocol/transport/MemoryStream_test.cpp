@@ -1,7 +1,11 @@
 #include <qel/common/io/StreamIOException.hpp>
 #include <qel/protocol/MemoryStream.hpp>
 
+#include "transport/Readiness.hpp"
+
+#include <algorithm>
 #include <array>
+#include <chrono>
 #include <gmock/gmock.h>
 #include <numeric>
 #include <stdexcept>
@@ -13,6 +17,8 @@ namespace qel::test {
 namespace {
 
 using protocol::makeMemoryStreams;
+using protocol::Readiness;
+using protocol::Ready;
 using testing::StrEq;
 using testing::ThrowsMessage;
 
@@ -92,6 +98,78 @@ TEST(MemoryStream, ADeadlineThatPassesLeavesTheStreamUsable)
     write(*other, "ok");
     EXPECT_EQ(readSome(*one), "ok");
     EXPECT_EQ(readSome(*other), "1234");
+}
+
+TEST(MemoryStream, ADeadlineMayBeAsLongAsAnybodyLikes)
+{
+    const auto streams = makeMemoryStreams();
+    streams.first->setReadDeadline(std::chrono::milliseconds::max());
+    std::thread reader([&] { EXPECT_EQ(readSome(*streams.first), "late"); });
+    write(*streams.second, "late");
+    reader.join();
+}
+
+// Whether the stream is ready, as a console asks it.
+
+Ready readiness(Stream& stream, bool wantsToReceive = true, std::chrono::milliseconds timeout = {})
+{
+    return dynamic_cast<Readiness&>(stream).awaitReady(wantsToReceive, timeout);
+}
+
+TEST(MemoryStreamReadiness, IsThatOfTheDirectionAsked)
+{
+    const auto streams = makeMemoryStreams(20000);
+    write(*streams.first, "x");
+    EXPECT_TRUE(readiness(*streams.first).send);
+    EXPECT_FALSE(readiness(*streams.first).receive);
+    EXPECT_TRUE(readiness(*streams.second).receive);
+    EXPECT_FALSE(readiness(*streams.second, false).receive) << "not asked";
+    readSome(*streams.second);
+    EXPECT_FALSE(readiness(*streams.second).receive);
+}
+
+TEST(MemoryStreamReadiness, NeedsRoomForAWholeMessage)
+{
+    constexpr std::size_t kWhole = 16384 + 1024;
+    const auto streams = makeMemoryStreams(kWhole + 10);
+    write(*streams.first, std::string(10, 'x'));
+    EXPECT_TRUE(readiness(*streams.first).send);
+    write(*streams.first, "x");
+    EXPECT_FALSE(readiness(*streams.first).send);
+    readSome(*streams.second, 1);
+    EXPECT_TRUE(readiness(*streams.first).send);
+}
+
+TEST(MemoryStreamReadiness, OfASmallStreamNeedsAllOfItsRoom)
+{
+    const auto streams = makeMemoryStreams(4);
+    EXPECT_TRUE(readiness(*streams.first).send);
+    write(*streams.first, "x");
+    EXPECT_FALSE(readiness(*streams.first, true, kShort).send);
+    readSome(*streams.second);
+    EXPECT_TRUE(readiness(*streams.first).send);
+}
+
+TEST(MemoryStreamReadiness, ComesWithTheEnd)
+{
+    const auto streams = makeMemoryStreams(4);
+    write(*streams.first, "full");
+    EXPECT_FALSE(readiness(*streams.first).send);
+    streams.second->close();
+    EXPECT_TRUE(readiness(*streams.first).send);
+    EXPECT_TRUE(readiness(*streams.first).receive);
+}
+
+TEST(MemoryStreamReadiness, IsWaitedFor)
+{
+    const auto streams = makeMemoryStreams(4);
+    write(*streams.first, "full");
+    for (const auto timeout : {std::chrono::milliseconds(-1), std::chrono::milliseconds::max()}) {
+        std::thread other([&] { write(*streams.second, "x"); });
+        EXPECT_TRUE(readiness(*streams.first, true, timeout).receive);
+        other.join();
+        readSome(*streams.first);
+    }
 }
 
 TEST(MemoryStream, ClosingLetsTheRestBeReadAndEndsBothDirections)

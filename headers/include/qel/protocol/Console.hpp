@@ -116,13 +116,15 @@ public:
     template <typename Request>
     std::unique_ptr<ResponseTo<Request>> request(const Request& message)
     {
-        return readResponse<ResponseTo<Request>>(pRequest(message), getServer());
+        const std::string server = getServer(); // a handler may destroy this console meanwhile
+        return readResponse<ResponseTo<Request>>(pRequest(message), server);
     }
     /// The same with a timeout of its own.
     template <typename Request>
     std::unique_ptr<ResponseTo<Request>> request(const Request& message, std::chrono::milliseconds timeout)
     {
-        return readResponse<ResponseTo<Request>>(pRequest(message, timeout), getServer());
+        const std::string server = getServer();
+        return readResponse<ResponseTo<Request>>(pRequest(message, timeout), server);
     }
 
     /// Sends a request and returns. While the server takes nothing and other requests are under way, receives messages,

@@ -130,6 +130,14 @@ public:
     ~ProtocolBroken() override;
 };
 
+/// A limit of this library: too many requests are under way, or a session holds as much unread output as it may. The
+/// connection is as good as before; go on when there is room again.
+class QEL_PROTOCOL_EXPORT LimitReached : public Error {
+public:
+    using Error::Error;
+    ~LimitReached() override;
+};
+
 /// A request was answered with a status other than zero.
 class QEL_PROTOCOL_EXPORT StatusError : public Error {
 public:

@@ -6,6 +6,7 @@
 
 #include <chrono>
 #include <memory>
+#include <string>
 #include <utility>
 
 namespace qel::protocol {
@@ -18,7 +19,7 @@ namespace detail {
 /// A request under way, whatever the class of its response. Use PendingResponse.
 class QEL_PROTOCOL_EXPORT PendingExchange {
 public:
-    PendingExchange(std::shared_ptr<ConsoleCore> core, std::unique_ptr<Exchange> exchange) noexcept;
+    PendingExchange(std::shared_ptr<ConsoleCore> core, std::shared_ptr<Exchange> exchange) noexcept;
     PendingExchange(PendingExchange&& other) noexcept;
     PendingExchange& operator=(PendingExchange&& other) noexcept;
     ~PendingExchange();
@@ -26,13 +27,13 @@ public:
     bool isReady() const noexcept;
     std::unique_ptr<QelMessage> take();
     std::unique_ptr<QelMessage> take(std::chrono::milliseconds timeout);
-    const std::string& peer() const noexcept;
+    std::string peer() const;
 
 private:
     void pAbandon() noexcept;
 
     std::shared_ptr<ConsoleCore> mCore;
-    std::unique_ptr<Exchange> mExchange; // null when moved from
+    std::shared_ptr<Exchange> mExchange; // null when moved from; shared with take() while it waits
 };
 
 } // namespace detail
@@ -59,12 +60,17 @@ public:
     /// @throws StatusError  the response has another status; and what Console::request() throws. After DeadlinePassed
     ///         with a usable connection get() may be called again
     /// @throws std::logic_error  the response has been taken
-    std::unique_ptr<Response> get() { return readResponse<Response>(mExchange.take(), mExchange.peer()); }
+    std::unique_ptr<Response> get()
+    {
+        const std::string peer = mExchange.peer(); // a handler may destroy this object meanwhile
+        return readResponse<Response>(mExchange.take(), peer);
+    }
 
     /// The same with a timeout of its own. @param timeout  negative: no limit
     std::unique_ptr<Response> get(std::chrono::milliseconds timeout)
     {
-        return readResponse<Response>(mExchange.take(timeout), mExchange.peer());
+        const std::string peer = mExchange.peer();
+        return readResponse<Response>(mExchange.take(timeout), peer);
     }
 
 private:

@@ -78,11 +78,19 @@ public:
     // Input for the partition.
 
     /// Sends all bytes. While the hypervisor takes nothing, receives messages, so that neither side blocks the other,
-    /// as long as this session has room for its output.
-    /// @return the number of bytes sent: fewer than `length` only when the session ended first
-    /// @throws DeadlinePassed  a message was not taken within the request timeout. Read the output and go on
+    /// as long as every session of the console has room for its output.
+    ///
+    /// The bytes go out as messages; each must be taken within the request timeout. When one is not, read the output
+    /// and go on with the rest: the connection is as good as before.
+    /// @return the number of bytes sent: fewer than `length` only when the session ended first or a message was not
+    ///         taken in time
+    /// @throws DeadlinePassed  not even the first message was taken in time
     std::size_t write(const char* data, std::size_t length);
     std::size_t write(const std::string& data) { return write(data.data(), data.size()); }
+
+    /// How many bytes of input have been sent since the session was opened, by write() and writeSome(): tells how far a
+    /// write() has come that an exception of a handler has left.
+    std::uint64_t getSent() const noexcept;
 
     /// Sends the beginning of the bytes as one message. For a loop that waits until the console can be written to; does
     /// not receive.
