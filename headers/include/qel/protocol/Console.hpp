@@ -34,27 +34,36 @@ namespace qel::protocol {
 /// **Receiving.** A console has no thread of its own: messages are received by the calls that wait, which are
 /// request(), exchange(), PendingResponse::get(), process() and the calls of SerialSession. Each of them handles
 /// whatever arrives: responses go to their requests, serial data to their sessions, notices to their handlers, which
-/// are called then. A handler may use the console. An exception of a handler passes through the call and does no harm
+/// are called then. A handler may use the console, connect it anew, and move or destroy it, its sessions and pending
+/// responses; the call that waits then ends. An exception of a handler passes through the call and does no harm
 /// to the console.
 ///
-/// **Waiting together with other descriptors.** Wait until getPollFd() is readable, unless hasPending() is true, and
-/// call process().
+/// **Waiting together with other descriptors.** First take what other calls have received:
+/// SerialSession::getAvailable() and PendingResponse::isReady(). Then wait until getPollFd() is readable, unless
+/// hasPending() is true, and call process().
 ///
 /// **Deadlines.** Every call that waits has a timeout; a negative one means no limit. A timeout that passes throws
-/// DeadlinePassed. When no part of a message had been transferred by then, the console stays usable, and a response
-/// that comes later is dropped. Otherwise the connection is of no use any more. Independently of that, a
-/// message has ConsoleOptions::frameTimeout from its first byte to its last.
+/// DeadlinePassed. When no part of a message had been received by then, the console stays usable, and a response that
+/// comes later is dropped; what it says about the sessions of this console is noted. Otherwise the connection is of no
+/// use any more. A message that could not be sent in its time ends sending, since a part of it may have been sent;
+/// SerialSession::write() begins a message only when there is room. A peer that goes on sending other messages extends
+/// no deadline. Independently of that, a message has ConsoleOptions::frameTimeout from its first byte to its last. Over
+/// TLS a peer that updates its keys begins a message by that: when no message follows within the frame timeout, the
+/// connection ends.
 ///
 /// **Failures.** What the calls throw: StatusError, a response with a status other than zero; DeadlinePassed;
 /// ClosedByPeer, the connection broke or the hypervisor closed it, with or without its notice; TurnedAway, the
 /// hypervisor accepts only TLS; ProtocolBroken, a malformed message, or a response to no request or of another kind
-/// than its request; Error, close() or leave() has been called. After a failure other than StatusError and a harmless
-/// DeadlinePassed the connection is of no use: every call throws the same again, until reconnect(). There is one
-/// exception: on a connection without TLS, messages can still be received after sending has failed, as the hypervisor
-/// may have sent the reason.
+/// than its request; LimitReached, see below; Error, close() or leave() has been called. PosixError, when the system
+/// cannot wait for a descriptor, passes unchanged. StatusError, LimitReached, a harmless DeadlinePassed, and
+/// ProtocolBroken for a response whose payload alone is malformed leave the connection as it was. After any other
+/// failure the connection is of no use: every call throws the same again, until reconnect(). There is one exception: on
+/// a connection without TLS, messages can still be received after sending has failed, as the hypervisor may have sent
+/// the reason.
 ///
 /// **Limits.** At most 4096 requests can be under way. A session keeps the output that is not read, up to
-/// SerialOptions::maxUnread; beyond that the calls that receive throw Error until it is read.
+/// SerialOptions::maxUnread; beyond that the calls that receive throw LimitReached until it is read;
+/// SerialSession::close() does not.
 ///
 /// Lifetime: sessions and pending responses may outlive the console; they fail then. Movable, not copyable; a
 /// moved-from console can only be destroyed or assigned to. The destructor closes the connection at once: call leave()
@@ -145,8 +154,9 @@ public:
 
     // Notices.
 
-    /// Sets the handler for the notices of a class; an empty one removes it. It is called before the console itself
-    /// reacts to the notice.
+    /// Sets the handler for the notices of a class; an empty one removes it. Data and closed notices of open serial
+    /// sessions go to the sessions alone. When the hypervisor closes the connection or turns this console away, the
+    /// handler is called after the sessions and the requests have ended.
     /// @tparam T  such as QelMessageDaxBroadcastOutboundAsync. A notice with the identity of T whose payload is
     ///         malformed throws ProtocolBroken.
     template <typename T>
@@ -162,7 +172,8 @@ public:
         }
         pOnNotice(T::getMessageID(), std::move(untyped));
     }
-    /// Sets the handler for all other notices, requests of the peer included, which are not answered. Without it they
+    /// Sets the handler for all other notices, requests of the peer included, which are not answered. The notices that
+    /// end the connection and those for a session do not come here. Without it they
     /// are dropped, with a line at Debug.
     void onOtherNotice(NoticeHandler handler);
 
@@ -200,7 +211,8 @@ public:
 
     /// Connects anew with the same options, as the constructor does, and introduces this console again. The old
     /// connection is closed first; its requests fail with ClosedByPeer, its sessions end with
-    /// SessionEnd::ConnectionClosed. Handlers stay. May be called in any state but after close().
+    /// SessionEnd::ConnectionClosed. Handlers stay. May be called in any state but after close(). A handler that this
+    /// call itself calls in the introduction cannot begin another one: there it does nothing.
     /// @param timeout  for all of it
     /// @throws std::logic_error  the stream was given to the constructor
     void reconnect(std::chrono::milliseconds timeout);

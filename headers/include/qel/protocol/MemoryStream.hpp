@@ -17,6 +17,9 @@ namespace qel::protocol {
 /// this side reads what has already arrived and then 0, and its writes throw StreamIOException("EOF"); the peer reads
 /// what has been sent and then 0, and its writes throw as well. Destroying a stream closes it.
 ///
+/// A console sends over such a stream when it has room for a whole message with its TLS, 17408 bytes, or is empty; with
+/// a smaller capacity both sides can block each other.
+///
 /// Ownership: each stream is owned by the caller and may outlive the other.
 /// Thread safety: for each stream one reader and one writer thread, as for every Stream; close() from any thread.
 /// @param capacity  bytes that may be on their way in each direction; more than 0

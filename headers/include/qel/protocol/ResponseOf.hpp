@@ -48,8 +48,7 @@ namespace protocol {
 
 /// Names the class of the response to a request: ResponseOf<QelMessageGetQelTodReq>::type is QelMessageGetQelTodRsp.
 ///
-/// Specialise it for requests of your own. The response class then needs a constructor from bytes, and the console a
-/// registry that knows it; otherwise name QelMessage.
+/// Specialise it for requests of your own; name QelMessage, since a console knows the classes of this library only.
 template <typename Request>
 struct ResponseOf {
     static_assert(sizeof(Request) == 0, "no class is known for the response: use Console::exchange(), or specialise "

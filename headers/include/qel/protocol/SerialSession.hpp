@@ -44,7 +44,8 @@ struct SerialOptions {
 /// What the calls throw is described at Console. Data that was received before a failure can still be read.
 ///
 /// Destroying an open session closes it, without waiting for the hypervisor: a request to close it is sent if the
-/// connection takes it at once.
+/// connection takes it at once; over a stream without a descriptor, other than one of makeMemoryStreams(), none is
+/// sent. An opening that was given up and is granted later is closed in the same way.
 ///
 /// Lifetime: may outlive its console; its calls then throw Error. Movable; a moved-from session can only be destroyed
 /// or assigned to. Thread safety: the thread of the console.
@@ -108,7 +109,8 @@ public:
     /// The end in words: describe(getEnd()), and how the command ended where the hypervisor says so.
     std::string describeEnd() const;
 
-    /// Closes the session, unless it has ended. Output that has been received can still be read.
+    /// Closes the session, unless it has ended. Output that has been received can still be read; while this waits, it
+    /// may exceed SerialOptions::maxUnread.
     /// @throws StatusError  the hypervisor refuses; and what Console documents
     void close();
     /// The same with a timeout of its own; without it the request timeout of the console.
