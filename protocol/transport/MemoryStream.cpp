@@ -42,7 +42,7 @@ public:
         mChanged.notifyAll();
     }
 
-    std::size_t read(int self, char* buffer, std::size_t length, StreamDeadline& deadline)
+    std::size_t read(std::size_t self, char* buffer, std::size_t length, StreamDeadline& deadline)
     {
         const auto timeout = deadline.getEffectiveTimeout();
         const auto end = endOf(timeout);
@@ -61,7 +61,7 @@ public:
         return count;
     }
 
-    void write(int self, const char* buffer, std::size_t length, StreamDeadline& deadline)
+    void write(std::size_t self, const char* buffer, std::size_t length, StreamDeadline& deadline)
     {
         const auto timeout = deadline.getEffectiveTimeout();
         const auto end = endOf(timeout);
@@ -82,7 +82,7 @@ public:
     }
 
     /// As Readiness.
-    Ready awaitReady(int self, bool wantsToReceive, std::chrono::milliseconds timeout)
+    Ready awaitReady(std::size_t self, bool wantsToReceive, std::chrono::milliseconds timeout)
     {
         const bool isLimited = timeout >= std::chrono::milliseconds::zero();
         const auto end = endOf(timeout);
@@ -128,7 +128,7 @@ private:
 
 class MemoryStream final : public Stream, public Readiness {
 public:
-    MemoryStream(std::shared_ptr<Link> link, int self) : mLink(std::move(link)), mSelf(self) {}
+    MemoryStream(std::shared_ptr<Link> link, std::size_t self) : mLink(std::move(link)), mSelf(self) {}
 
     ~MemoryStream() override { mLink->close(); }
 
@@ -147,7 +147,7 @@ public:
 
 private:
     const std::shared_ptr<Link> mLink;
-    const int mSelf; // 0 or 1
+    const std::size_t mSelf; // 0 or 1
     StreamDeadline mReadDeadline;
     StreamDeadline mWriteDeadline;
 };
