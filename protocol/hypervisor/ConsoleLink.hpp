@@ -29,7 +29,7 @@ public:
     /// requests should be read.
     virtual bool hasRoom() const = 0;
 
-    /// False while anything waits for room.
+    /// False while anything waits for room, and once the connection ends: what is read from a partition then is lost.
     virtual bool hasSerialRoom() const = 0;
 
     /// HypervisorEngine::mayReceive() may have become true.

@@ -42,7 +42,7 @@ bool Outbox::hasRoom() const
 bool Outbox::hasSerialRoom() const
 {
     const MutexLock lock(mMutex);
-    return mWaiting.empty() || mQueue.isShutdown();
+    return mWaiting.empty() && !mFinished;
 }
 
 void Outbox::finish()
