@@ -54,8 +54,8 @@ struct ServedStream {
 };
 
 /// One connection of the hypervisor end, and the hypervisor's link to its console, with two threads: the reader
-/// protects the connection and hands received messages to the hypervisor, and the writer sends the queued messages.
-/// Neither waits for another connection.
+/// hands received messages to the hypervisor, and the writer sends the queued messages. Over TLS a third, the
+/// handshaker, comes first: it admits the console and starts the reader. None waits for another connection.
 ///
 /// While the hypervisor takes no message, the reader does not read. It watches for the console to hang up instead, so
 /// that a console that has disconnected does not hold its sessions.

@@ -38,8 +38,12 @@ constexpr std::chrono::milliseconds kPauseAfterFailure(100);
 /// connection.
 constexpr std::chrono::milliseconds kRefusalTime(10);
 
-/// Of streams that are not sockets of this server's own.
-constexpr int kNoDescriptor = -1;
+/// The descriptor of a stream that has one; -1: it has none.
+int descriptorOf(const Stream& stream)
+{
+    const auto* const socket = dynamic_cast<const SocketStream*>(&stream);
+    return socket == nullptr ? -1 : socket->getSocket().getFd();
+}
 
 ConnectionLimits limitsOf(const ServerOptions& options)
 {
@@ -285,7 +289,8 @@ void Server::run(const PollFd& stop) { mImpl->run(stop); }
 void Server::serve(std::unique_ptr<Stream> stream, const std::string& address)
 {
     if (stream == nullptr) throw std::invalid_argument("stream");
-    mImpl->serve({std::move(stream), kNoDescriptor, address, address}, {});
+    const int descriptor = descriptorOf(*stream);
+    mImpl->serve({std::move(stream), descriptor, address, address}, {});
 }
 
 void Server::setCredentials(const Credentials& credentials) { mImpl->setCredentials(credentials); }

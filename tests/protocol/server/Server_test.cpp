@@ -2,8 +2,10 @@
 #include <qel/common/QelMessageDax.hpp>
 #include <qel/common/QelMessageGeneric.hpp>
 #include <qel/common/QelMessageInterfaceComponent.hpp>
+#include <qel/common/QelMessageVirtualSerial.hpp>
 #include <qel/common/io/StreamIOException.hpp>
 
+#include "protocol/hypervisor/FakeSerialLine.hpp"
 #include "protocol/server/ServerFixture.hpp"
 #include "support/ComesTrue.hpp"
 #include "support/RecordingLogBackend.hpp"
@@ -146,6 +148,41 @@ TEST_F(ServerTest, AStreamInMemoryThatDoesNotAskForTlsIsClosedAtTheEnd)
     const auto console = connectInMemory("a test");
     server->finish();
     EXPECT_TRUE(isClosed(*console, true)); // after the abort message, if it had not begun to wait
+}
+
+/// Takes no input.
+class FullLine : public FakeSerialLine {
+public:
+    FullLine() { takes = 0; }
+    int descriptor() const override { return mDescriptor.getPollFd().mFd.fd; }
+
+private:
+    protocol::WakeUp mDescriptor;
+};
+
+TEST_F(ServerTest, NoticesThatACallersSocketHasHungUpWhileItDoesNotRead)
+{
+    machine.addPartition(1, std::make_unique<FullLine>());
+    ServerOptions options = plainOptions();
+    options.listen = {};
+    make(options);
+    Loopback ends;
+    server->serve(std::move(ends.far), "a test");
+    EXPECT_EQ(introduce(*ends.near, "x"), 0U);
+    LoopbackMessages messages(*ends.near);
+    messages.ask(QelMessageInterfaceCmpOpenKrogSessionReq());
+    messages.ask(QelMessageVirtualSerialOpenReq(1, 0, false));
+    EXPECT_EQ(messages.ask(QelMessageVirtualSerialSetupSessionReq(1, 0))->getStatus(), 0U);
+    const std::string data(16000, 'x');
+    for (int i = 0; i < 5; ++i) // they stop the reader
+        messages.send(QelMessageVirtualSerialDataToOsAsync(1, 0, 16000, data.data()));
+    messages.send(QelMessageGetQelTodReq());
+    ends.near.reset();
+    EXPECT_TRUE(comesTrue([&] {
+        std::ostringstream text;
+        server->dumpStatistics(text);
+        return text.str() == "No console is connected.\n";
+    }));
 }
 
 TEST_F(ServerTest, RefusesANullStream)

@@ -25,8 +25,9 @@ namespace qel::protocol {
 ///     server.run(stop.getPollFd()); // until another thread, or a signal, makes `stop` readable
 ///     server.finish();
 ///
-/// **Threads.** One for the serial lines of all partitions, and two for each console: one that protects the connection
-/// and reads, and one that writes. They take none of the program's signals. run() accepts connections on the thread
+/// **Threads.** One for the serial lines of all partitions, and two for each console: one that reads, and one that
+/// writes. Over TLS, one more for the time of its handshake. commandLine() has one while commands are ending. They take
+/// none of the program's signals. run() accepts connections on the thread
 /// that calls it. No console waits for another one.
 ///
 /// **Failures.** What concerns one connection is logged, and ends at most that connection. A want of memory,
@@ -58,7 +59,8 @@ public:
     Server(const Server&) = delete;
     Server& operator=(const Server&) = delete;
 
-    /// Where it listens, in the order of the options, with the ports that the system has chosen. Empty after finish().
+    /// Where it listens, in the order of the options, with the ports that the system has chosen. They stay
+    /// the same after finish(), when nothing listens there any more.
     std::vector<IPEndpoint> endpoints() const;
 
     /// Accepts connections until `stop` becomes readable. Consoles are served meanwhile and afterwards, until finish().
@@ -66,7 +68,10 @@ public:
     void run(const PollFd& stop);
 
     /// Serves a console on a stream of one's own, such as one of makeMemoryStreams(): with TLS or plain, as the options
-    /// say. Needs no run(). The limits on handshakes do not apply.
+    /// say. Needs no run(). The limits on handshakes do not apply. After finish() the stream is destroyed unserved.
+    ///
+    /// A SocketStream keeps its settings, those of its keep-alive included. That the console of any other stream has
+    /// hung up is noticed only by reading and writing, so not while its input or its responses wait for room.
     /// @param stream  connected, not null; closed when the console is done with, and destroyed later
     /// @param address  of the console, for Peer and the log: any text
     /// @throws std::invalid_argument  "stream"
