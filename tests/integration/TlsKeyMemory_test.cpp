@@ -32,6 +32,9 @@ std::vector<std::string> secretLines(const std::string& pem)
     return secret;
 }
 
+/// A mapping of more bytes is the bookkeeping of a sanitizer, which reserves terabytes.
+constexpr unsigned long kShadow = 1024UL * 1024 * 1024;
+
 /// The writable memory of a process, one mapping at a time.
 class MemoryOf {
 public:
@@ -51,6 +54,7 @@ public:
             unsigned long end = 0;
             char writable = '-';
             if (std::sscanf(line.c_str(), "%lx-%lx r%c", &begin, &end, &writable) != 3 || writable != 'w') continue;
+            if (end - begin > kShadow) continue;
             read(begin, end, bytes);
             return true;
         }
