@@ -434,7 +434,7 @@ void ConsoleCore::pFailExchanges() noexcept
 
 void ConsoleCore::pHandleResponse(std::unique_ptr<QelMessage> response)
 {
-    // Whoever asked, and even if nobody waits any more: the hypervisor has done it.
+    // Also when no caller waits any more: the hypervisor has done it.
     const bool isGrant = response->getStatus() == QelMessageStatusNoError;
     const bool isOpened = isGrant && is<QelMessageInterfaceCmpOpenKrogSessionRsp>(*response);
     const bool isClosed = isGrant && is<QelMessageInterfaceCmpCloseKrogSessionRsp>(*response);
@@ -453,7 +453,7 @@ void ConsoleCore::pHandleOpened(const std::shared_ptr<SerialState>& state, const
         state->isOpen = true;
         return;
     }
-    // The opening was given up, and the hypervisor holds a session that nobody has. Another opening may be on its way.
+    // The opening was given up, and the hypervisor holds a session without an owner. Another opening may be on its way.
     for (const auto& serial : mSerials) {
         if (serial->partition != state->partition || serial->connection != state->connection) continue;
         serial->isHeld = true;

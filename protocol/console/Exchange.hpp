@@ -45,7 +45,7 @@ public:
     void add(const QelMessage& request, Exchange* exchange, Action action = {});
     /// Forgets a request: it could not be sent.
     void remove(const Exchange& exchange) noexcept;
-    /// Nobody waits for this response any more; it is dropped.
+    /// No caller waits for this response any more; it is dropped.
     void abandon(const Exchange& exchange) noexcept;
 
     /// Hands a response to its request.

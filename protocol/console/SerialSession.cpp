@@ -19,7 +19,8 @@ static_assert(SerialSession::kMaxData ==
 
 namespace {
 
-/// Does a step that receives messages. The notice that the connection closes is no failure for a session: it has ended.
+/// Does a step that receives messages. The notice that the connection closes is not a failure for a session: it ends
+/// it.
 /// @return false: the session has ended by that
 template <typename F>
 bool doStep(const SerialState& state, F step)

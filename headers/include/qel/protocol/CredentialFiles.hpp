@@ -27,7 +27,7 @@ QEL_PROTOCOL_EXPORT std::string pathIn(const std::string& directory, const std::
 
 /// Which files of private keys are accepted.
 enum class KeyPermissions {
-    OwnerOnly, ///< files of this process's user (or of root) that nobody else may read or write
+    OwnerOnly, ///< files of this process's user (or of root) that no other user may read or write
     Any        ///< every file that can be read
 };
 

@@ -23,7 +23,7 @@ namespace qel::protocol {
 class QEL_PROTOCOL_EXPORT Error : public std::runtime_error {
 public:
     /// @param what  one line for a person
-    /// @param peer  with whom: the name or the address of the peer; empty: with nobody in particular
+    /// @param peer  with whom: the name or the address of the peer; empty: no peer is involved
     explicit Error(const std::string& what, std::string peer = {});
     Error(const Error&) = default;
     Error& operator=(const Error&) = default;

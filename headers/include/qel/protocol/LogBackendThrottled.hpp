@@ -9,7 +9,7 @@
 
 namespace qel::protocol {
 
-/// A log back-end that keeps the peers of a Server from pushing everything else out of the log. It stands in front of
+/// A log back-end that keeps the peers of a Server from pushing everything else out of the log. It filters lines for
 /// another back-end:
 ///
 ///     LogBackend::registerBackend(std::make_shared<LogBackendThrottled>(std::make_shared<LogBackendRotating>(...)));
