@@ -3,6 +3,7 @@
 #include "hypervisor/HypervisorImpl.hpp"
 
 #include <stdexcept>
+#include <utility>
 
 namespace qel::protocol {
 
@@ -12,11 +13,14 @@ Hypervisor::Hypervisor(MachineInfo machine, const QelCapabilities& capabilities)
 
 Hypervisor::~Hypervisor() = default;
 
-void Hypervisor::addPartition(std::uint16_t id, std::unique_ptr<SerialLine> line)
+void Hypervisor::addPartition(std::uint16_t id, std::unique_ptr<SerialLine> line, PartitionOptions options)
 {
     if (mImpl->served) throw std::logic_error("a server serves this hypervisor");
     if (line == nullptr) throw std::invalid_argument("line");
-    if (!mImpl->lines.emplace(id, std::move(line)).second) throw std::invalid_argument("partition");
+    if (options.replayBytes > PartitionOptions::kMaxReplayBytes) throw std::invalid_argument("replayBytes");
+    if (!mImpl->partitions.emplace(id, PartitionPlan{std::move(line), std::move(options)}).second) {
+        throw std::invalid_argument("partition");
+    }
 }
 
 QelMessageStatusCodes Hypervisor::mayRequest(const Peer&, const QelMessage&) { return QelMessageStatusNoError; }

@@ -54,8 +54,8 @@ HypervisorEngine::HypervisorEngine(Hypervisor& machine, std::uint8_t maxConsoles
     : mMachine(machine), mMaxConsoles(maxConsoles), mWakeSerial(std::move(wakeSerial))
 {
     const MutexLock lock(mMutex);
-    for (const auto& entry : mMachine.mImpl->lines)
-        mPartitions.add(entry.first, *entry.second);
+    for (const auto& entry : mMachine.mImpl->partitions)
+        mPartitions.add(entry.first, *entry.second.line);
     if (mMachine.mImpl->served.exchange(true)) throw std::logic_error("a server serves this hypervisor");
 }
 

@@ -4,10 +4,19 @@
 #include <qel/protocol/Hypervisor.hpp>
 
 #include <atomic>
+#include <cstdint>
 #include <map>
+#include <memory>
+#include <string>
 #include <utility>
 
 namespace qel::protocol {
+
+/// A partition, as Hypervisor::addPartition() has taken it.
+struct PartitionPlan {
+    std::unique_ptr<SerialLine> line; ///< not null
+    PartitionOptions options;
+};
 
 /// What a Hypervisor keeps for its engine and for the defaults of its operations.
 struct Hypervisor::Impl {
@@ -15,8 +24,8 @@ struct Hypervisor::Impl {
 
     const MachineInfo machine;
     const QelCapabilities capabilities;
-    std::map<std::uint16_t, std::unique_ptr<SerialLine>> lines; ///< by partition; does not change while served
-    std::atomic<bool> served{false};                            ///< an engine uses the object
+    std::map<std::uint16_t, PartitionPlan> partitions; ///< by id; does not change while served
+    std::atomic<bool> served{false};                   ///< an engine uses the object
 
     Mutex mutex; ///< a leaf
     GlobalMode mode QEL_GUARDED_BY(mutex);

@@ -71,6 +71,12 @@ TEST(HypervisorPartitions, AnIdCanBeAddedOnce)
     EXPECT_THAT([&] { machine.addPartition(0, std::make_unique<FakeSerialLine>()); },
                 ThrowsMessage<std::invalid_argument>("partition"));
     EXPECT_THAT([&] { machine.addPartition(1, nullptr); }, ThrowsMessage<std::invalid_argument>("line"));
+    protocol::PartitionOptions options;
+    options.replayBytes = 16 * 1024 * 1024;
+    machine.addPartition(2, std::make_unique<FakeSerialLine>(), options);
+    ++options.replayBytes;
+    EXPECT_THAT([&] { machine.addPartition(3, std::make_unique<FakeSerialLine>(), options); },
+                ThrowsMessage<std::invalid_argument>("replayBytes"));
 }
 
 TEST(HypervisorPartitions, DoNotChangeWhileAServerServesThem)

@@ -298,6 +298,16 @@ TEST(SerialLineDefaults, TheEndOfTheCommandIsUnknown)
     EXPECT_EQ(end->kind, CommandEnd::Kind::Unknown);
 }
 
+TEST(SerialLineDefaults, TheLineIsUpAtOnceAndHasNothingToDoOfItsOwn)
+{
+    PipeLine line;
+    EXPECT_TRUE(line.advance());
+    EXPECT_FALSE(line.wantsToWrite());
+    EXPECT_TRUE(line.advanceAt().isDisabled());
+    EXPECT_EQ(line.endReason(), "");
+    EXPECT_FALSE(line.sendBreak());
+}
+
 } // namespace
 
 } // namespace qel::test

@@ -2,6 +2,7 @@
 
 #include <qel/common/QelCapabilities.hpp>
 #include <qel/common/QelMessage.hpp>
+#include <qel/protocol/PartitionOptions.hpp>
 #include <qel/protocol/Peer.hpp>
 #include <qel/protocol/ProtocolExport.hpp>
 #include <qel/protocol/SerialLine.hpp>
@@ -52,10 +53,11 @@ public:
     Hypervisor& operator=(const Hypervisor&) = delete;
 
     /// Adds a partition. Consoles see the number of partitions, at most 255.
-    /// @param line  not null; started when a console opens the partition's session
-    /// @throws std::invalid_argument  "partition": the id is taken; "line": null
+    /// @param line  not null; started when a console opens the partition's session, or as the options say
+    /// @throws std::invalid_argument  "partition": the id is taken; "line": null; "replayBytes": above
+    ///         PartitionOptions::kMaxReplayBytes
     /// @throws std::logic_error  a server serves this object
-    void addPartition(std::uint16_t id, std::unique_ptr<SerialLine> line);
+    void addPartition(std::uint16_t id, std::unique_ptr<SerialLine> line, PartitionOptions options = {});
 
     // Decisions.
 
