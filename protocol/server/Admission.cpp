@@ -4,6 +4,8 @@
 #include <qel/protocol/Error.hpp>
 #include <qel/protocol/Handshake.hpp>
 
+#include "server/LastWords.hpp"
+
 namespace qel::protocol {
 
 Admission::Admission(const HypervisorEngine& hypervisor, Stream& clear, int descriptor, SSLStream& tls,
@@ -14,17 +16,16 @@ Admission::Admission(const HypervisorEngine& hypervisor, Stream& clear, int desc
 PeerIdentity Admission::run(PollDeadline::time_point end)
 {
     if (!pAwaitFirstByte(end) || !pEnterStream()) {
-        limitTo(mClear, end);
-        abortHandshake(mClear);
+        pTurnAway(end);
         throw Error("the server stops");
     }
     limitTo(mClear, end);
     awaitUpgrade(mClear, mDescriptor);
-    limitTo(mClear, end);
     if (!mHypervisor.takesConsoles()) {
-        abortHandshake(mClear);
+        pTurnAway(end);
         throw Error("no more consoles are taken");
     }
+    limitTo(mClear, end);
     grantUpgrade(mClear);
     startTls(mTls);
     PeerIdentity peer = identityOf(mTls);
@@ -63,6 +64,13 @@ bool Admission::pEnterStream()
     const MutexLock lock(mMutex);
     mIsInStream = !mStopping;
     return mIsInStream;
+}
+
+void Admission::pTurnAway(PollDeadline::time_point end)
+{
+    limitTo(mClear, end);
+    abortHandshake(mClear);
+    endSending(mDescriptor);
 }
 
 /// From here on the hypervisor ends the connection.

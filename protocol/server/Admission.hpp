@@ -43,6 +43,7 @@ public:
 private:
     bool pAwaitFirstByte(const PollDeadline& end);
     bool pEnterStream();
+    void pTurnAway(PollDeadline::time_point end);
     void pLeaveStream();
 
     const HypervisorEngine& mHypervisor;

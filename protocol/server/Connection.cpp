@@ -41,8 +41,8 @@ std::unique_ptr<Stream> protect(std::unique_ptr<Stream> stream, SSLServerContext
 Connection::Connection(const ConnectionServices& services, ServedStream stream, SSLServerContext* context,
                        HandshakePlaces::Place place)
     : Outbox(services.limits.queueBytes), mServices(services), mAddress(std::move(stream.address)),
-      mSource(std::move(stream.source)), mHangUp(hangUpOf(stream.descriptor)), mPlace(std::move(place)),
-      mClear(*stream.stream), mStream(protect(std::move(stream.stream), context, mRecords)),
+      mSource(std::move(stream.source)), mBlamed(mSource), mHangUp(hangUpOf(stream.descriptor)),
+      mPlace(std::move(place)), mClear(*stream.stream), mStream(protect(std::move(stream.stream), context, mRecords)),
       mFrames(*mStream, context == nullptr ? FrameStream::ReadAhead::Yes : FrameStream::ReadAhead::No),
       mMessages(mFrames, messageRegistry()), mName(mAddress)
 {
@@ -68,7 +68,7 @@ Connection::~Connection()
 void Connection::start()
 {
     mHandshake = TimeProvider::steady() + mServices.limits.handshake;
-    LogThrottle::Scope scope(mServices.throttle, mSource);
+    const LogThrottle::Scope scope(mServices.throttle, mSource);
     try {
         if (mAdmission) {
             const MutexLock lock(mThreadsMutex);
@@ -113,6 +113,7 @@ void Connection::pConnect(const PeerIdentity& identity)
     peer.isProtected = mAdmission.has_value();
     mId = mServices.hypervisor.connect(*this, std::move(peer));
     mName = "console " + std::to_string(mId);
+    if (!identity.fingerprint.empty()) mBlamed += ", SHA-256 " + identity.fingerprint;
 }
 
 void Connection::pHandshake() noexcept
@@ -153,21 +154,20 @@ void Connection::pJoinHandshake() noexcept
 
 void Connection::pRead() noexcept
 {
-    LogThrottle::Scope scope(mServices.throttle, mSource);
+    const LogThrottle::Scope scope(mServices.throttle, mBlamed);
     pJoinHandshake();
     try {
         mWriter = startThread([this] { pWrite(); });
         limitTo(*mStream, mHandshake);
         mStream->clearWriteDeadline();
-        pReceiveAll(scope);
+        pReceiveAll();
     } catch (...) {
         pReportFailure();
     }
-    scope.setPeer(mSource);
     pFinish();
 }
 
-void Connection::pReceiveAll(LogThrottle::Scope& scope)
+void Connection::pReceiveAll()
 {
     bool mayRead = true;
     while (mayRead || pAwaitReceive()) {
@@ -178,10 +178,7 @@ void Connection::pReceiveAll(LogThrottle::Scope& scope)
         // The hypervisor closes the connection and ignores further messages. The console may still take what is queued
         // for it, within the linger time.
         if (received.state == ConsoleState::Closing && !waitUntilWritten(mServices.limits.linger)) abort();
-        if (received.state == ConsoleState::Identified && !mHandshake.isDisabled()) {
-            pOnIdentified();
-            scope.setPeer(mName);
-        }
+        if (received.state == ConsoleState::Identified && !mHandshake.isDisabled()) pOnIdentified();
     }
 }
 
@@ -257,7 +254,7 @@ void Connection::pOnRoom()
 
 void Connection::pWrite() noexcept
 {
-    const LogThrottle::Scope scope(mServices.throttle, mSource);
+    const LogThrottle::Scope scope(mServices.throttle, mBlamed);
     try {
         pSendAll();
     } catch (const StreamIOException& error) {

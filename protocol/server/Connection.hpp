@@ -98,7 +98,7 @@ private:
     void pStartReader();
     void pJoinHandshake() noexcept;
     void pRead() noexcept;
-    void pReceiveAll(LogThrottle::Scope& scope);
+    void pReceiveAll();
     void pOnIdentified();
     bool pAwaitReceive();
     void pFinish() noexcept;
@@ -111,7 +111,8 @@ private:
 
     const ConnectionServices mServices;
     const std::string mAddress;
-    const std::string mSource;
+    const std::string mSource; // whom log lines count for until it is known who the console is
+    std::string mBlamed;       // and afterwards: the source, and over TLS the certificate; set before there is a reader
     const PollFd mHangUp;
     HandshakePlaces::Place mPlace; // until the console has identified itself or the connection ends; of the reader
     WakeUp mWake;                  // for the reader while it does not read

@@ -60,7 +60,7 @@ std::uint64_t kindOf(LogLevel::Level level, const std::string& text)
 } // namespace
 
 LogThrottle::Scope::Scope(LogThrottle& throttle, const std::string& peer) noexcept
-    : mThrottle(throttle), mPeer(&peer), mOuter(tScope)
+    : mThrottle(throttle), mPeer(peer), mOuter(tScope)
 {
     tScope = this;
 }
@@ -75,7 +75,7 @@ bool LogThrottle::admits(LogLevel::Level level, const std::string& line) noexcep
 {
     if (tScope == nullptr || level <= LogLevel::Debug) return true;
     try {
-        return tScope->mThrottle.pAdmits(*tScope->mPeer, level, line);
+        return tScope->mThrottle.pAdmits(tScope->mPeer, level, line);
     } catch (const std::exception&) {
         return true;
     }

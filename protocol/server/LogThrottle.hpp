@@ -42,14 +42,11 @@ public:
         Scope(const Scope&) = delete;
         Scope& operator=(const Scope&) = delete;
 
-        /// From here on the lines are about another peer. @param peer  borrowed
-        void setPeer(const std::string& peer) noexcept { mPeer = &peer; }
-
     private:
         friend class LogThrottle;
 
         LogThrottle& mThrottle;
-        const std::string* mPeer;
+        const std::string& mPeer;
         Scope* const mOuter;
     };
 

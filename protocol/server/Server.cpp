@@ -14,6 +14,7 @@
 #include "server/Connection.hpp"
 #include "server/HandshakePlaces.hpp"
 #include "server/KeepAlive.hpp"
+#include "server/LastWords.hpp"
 #include "server/Listener.hpp"
 #include "server/LogThrottle.hpp"
 #include "server/QuietLog.hpp"
@@ -74,7 +75,7 @@ private:
     bool pRunOnce(const PollFd& stop);
     void pAccept(const PollResult& ready);
     void pServe(Socket socket);
-    void pRefuse(Stream& stream, const ServedStream& served, const char* reason);
+    void pRefuse(SocketStream& stream, const ServedStream& served, const char* reason);
     void pAwaitEnd();
     bool pDropEnded();
 
@@ -176,7 +177,7 @@ void Server::Impl::pServe(Socket socket)
 }
 
 /// Closes a connection that finds no place. A console that uses TLS learns that it is turned away.
-void Server::Impl::pRefuse(Stream& stream, const ServedStream& served, const char* reason)
+void Server::Impl::pRefuse(SocketStream& stream, const ServedStream& served, const char* reason)
 {
     const LogThrottle::Scope scope(mThrottle, served.source);
     logLine(LogLevel::Warn, served.address, ": refused: ", reason);
@@ -184,6 +185,7 @@ void Server::Impl::pRefuse(Stream& stream, const ServedStream& served, const cha
     try {
         limitTo(stream, TimeProvider::steady() + kRefusalTime);
         abortHandshake(stream);
+        endSending(descriptorOf(stream));
     } catch (const Error&) { // NOLINT(bugprone-empty-catch): it is gone already
     }
 }

@@ -264,6 +264,22 @@ TEST_F(AdmissionTest, StopSendsAbortToAConsoleThatHasNotAsked)
     expectRefusal("the server stops");
 }
 
+TEST_F(AdmissionTest, StopDoesNotResetAConsoleWhoseRequestIsUnread)
+{
+    connection = ServedFixture::serve(loopback, {}, &serverContext);
+    send(QelMessageUpgradeConnectionAsync());
+    connection->stop();
+    connection->start(); // finds both, and the stop comes first
+    expect<QelMessageAbortHandshakeAsync>();
+    expectEnd();
+    connection.reset(); // closes the descriptor
+    expectClosed();
+    int error = -1; // a reset leaves EPIPE here
+    socklen_t length = sizeof(error);
+    ASSERT_EQ(::getsockopt(loopback.near->getSocket().getFd(), SOL_SOCKET, SO_ERROR, &error, &length), 0);
+    EXPECT_EQ(error, 0);
+}
+
 TEST_F(AdmissionTest, StopCutsAConsoleInTheTlsHandshake)
 {
     start();

@@ -148,9 +148,11 @@ TEST_F(LogThrottleTest, EachKindOfLineCountsByItself)
 TEST_F(LogThrottleTest, EachPeerCountsByItself)
 {
     const std::string other = "192.0.2.8";
-    LogThrottle::Scope scope(throttle, peer);
-    repeat(kBurst + 1);
-    scope.setPeer(other);
+    {
+        const LogThrottle::Scope scope(throttle, peer);
+        repeat(kBurst + 1);
+    }
+    const LogThrottle::Scope scope(throttle, other);
     lines();
     repeat(kBurst);
     EXPECT_THAT(lines(), SizeIs(kBurst));

@@ -4,6 +4,7 @@
 #include <qel/common/QelMessageInterfaceComponent.hpp>
 #include <qel/common/QelMessageVirtualSerial.hpp>
 #include <qel/common/io/StreamIOException.hpp>
+#include <qel/common/security/CertificateFacts.hpp>
 
 #include "protocol/hypervisor/FakeSerialLine.hpp"
 #include "protocol/server/ServerFixture.hpp"
@@ -320,6 +321,19 @@ TEST_F(ServerTest, AConsoleWithoutAPlaceLearnsThatItIsTurnedAway)
     EXPECT_TRUE(isClosed(*second));
 }
 
+TEST_F(ServerTest, AConsoleWithoutAPlaceThatHasAskedForTlsGetsTheAbortMessageAndTheEnd)
+{
+    ServerOptions options = tlsOptions();
+    options.maxHandshakes = 1;
+    make(options);
+    const auto first = connect();
+    const auto second = connect();
+    QelMessageStream(*second, QelInternalMessageRegistry::getInstance()).write(QelMessageUpgradeConnectionAsync());
+    run(); // accepts both; the request of the second waits unread
+    expect<QelMessageAbortHandshakeAsync>(*second);
+    EXPECT_TRUE(isClosed(*second)); // not reset, which could have overtaken the message
+}
+
 TEST_F(ServerTest, StreamsInMemoryNeedNoPlace)
 {
     ServerOptions options = plainOptions();
@@ -370,8 +384,90 @@ TEST_F(ServerTest, TheLogOfAPeerThatRepeatsItselfIsSummedUp)
     EXPECT_TRUE(comesTrue([&] { // by run(), without further traffic
         const auto lines = throttled->lines();
         return !lines.empty() &&
-               lines.back().find("console 1: 990 more lines like this one: console 1: ignored ") != std::string::npos;
+               lines.back().find("127.0.0.1: 990 more lines like this one: console 1: ignored ") != std::string::npos;
     }));
+}
+
+/// Counts the lines that go out about messages that are ignored, while the clock stands still.
+class ServerLogTest : public ServerFixture {
+protected:
+    void make(ServerOptions options)
+    {
+        options.listen = {};
+        QelLogger::get().addBackend(std::make_shared<protocol::LogBackendThrottled>(throttled));
+        ServerFixture::make(options);
+    }
+
+    ~ServerLogTest() override { server.reset(); } // before the clock
+
+    /// A console that introduces itself, sends 8 messages that are ignored, and leaves.
+    static void annoy(Stream& stream)
+    {
+        EXPECT_EQ(introduce(stream, "x"), 0U);
+        LoopbackMessages messages(stream);
+        for (int i = 0; i < 8; ++i)
+            messages.send(QelMessageGeneric(1, 0x7000, 0x0B0B, NoFlagSet));
+        EXPECT_EQ(messages.ask(QelMessageGetQelTodReq())->getStatus(), 0U);
+        stream.close();
+    }
+
+    void annoyOverTls(const SSLCredentials& credentials)
+    {
+        SSLClientContext context;
+        context.setCredentials(credentials);
+        auto clear = connectInMemory("192.0.2.7");
+        askForTls(*clear);
+        SSLStream console(context, std::move(clear));
+        console.handshake();
+        annoy(console);
+        expectNoConsole();
+    }
+
+    /// So that the next one may introduce itself by the same name.
+    void expectNoConsole()
+    {
+        EXPECT_TRUE(comesTrue([&] {
+            std::ostringstream text;
+            server->dumpStatistics(text);
+            return text.str() == "No console is connected.\n";
+        }));
+    }
+
+    long ignored() const
+    {
+        const auto lines = throttled->lines();
+        return std::count_if(lines.begin(), lines.end(),
+                             [](const std::string& line) { return line.find(": ignored ") != std::string::npos; });
+    }
+
+    const SettableClock clock;
+    std::shared_ptr<RecordingLogBackend> throttled = std::make_shared<RecordingLogBackend>();
+};
+
+TEST_F(ServerLogTest, AConsoleThatConnectsAgainGetsNoNewBurst)
+{
+    make(plainOptions());
+    for (int round = 0; round < 3; ++round) {
+        annoy(*connectInMemory("192.0.2.7"));
+        expectNoConsole();
+    }
+    EXPECT_EQ(ignored(), 10);
+    annoy(*connectInMemory("192.0.2.8"));
+    EXPECT_EQ(ignored(), 18);
+}
+
+TEST_F(ServerLogTest, OverTlsAConsoleCountsByItsAddressAndCertificate)
+{
+    make(tlsOptions());
+    const Authority& authority = Authority::trusted();
+    for (int round = 0; round < 3; ++round)
+        annoyOverTls(authority.clientCredentials());
+    EXPECT_EQ(ignored(), 10);
+    annoyOverTls(authority.credentialsOf(authority.server())); // another certificate of the same root
+    EXPECT_EQ(ignored(), 18);
+    server->finish();
+    EXPECT_THAT(throttled->lines(), Contains(HasSubstr("192.0.2.7, SHA-256 " + factsOf(authority.client()).fingerprint +
+                                                       ": 14 more lines like this one: console 3: ignored ")));
 }
 
 TEST_F(ServerTest, ConnectionsThatAreResetBeforeTheyAreAcceptedDoNotFillTheLog)

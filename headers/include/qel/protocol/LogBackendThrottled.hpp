@@ -17,8 +17,9 @@ namespace qel::protocol {
 /// The lines that a Server's threads log about one peer, and those of the libraries below, pass as long as they are not
 /// too many of one kind; lines that differ in words with digits only, such as addresses and identifiers, are of one
 /// kind. Ten lines of a kind pass at once, and one more for each second. The rest is counted, and summed up once a
-/// second: "192.0.2.7: 2989 more lines like this one: ...". Connections that have not identified themselves count by
-/// their address. Lines at Debug, and lines of all other threads, always pass.
+/// second: "192.0.2.7: 2989 more lines like this one: ...". A connection counts by its address, and inside TLS by its
+/// address and the console's certificate, so connecting again renews nothing. Lines at Debug, and lines of all other
+/// threads, always pass.
 ///
 /// The sums come while Server::run() runs, and in Server::finish().
 /// Thread safety: that of LogBackend.
