@@ -17,9 +17,10 @@ constexpr unsigned int kOldFrameMinimum = 40;
 
 constexpr std::uint64_t kFrameLengthMaximum = std::numeric_limits<unsigned int>::max();
 
-/// Logs the values at Error and throws the fixed phrase.
+/// Logs the values at Error and throws the fixed phrase. Out of line, and with the values by value: the checks of a
+/// good frame then need no stack.
 template <typename... Parts>
-[[noreturn]] void reject(const char* phrase, const Parts&... logged)
+[[noreturn, gnu::cold, gnu::noinline]] void reject(const char* phrase, Parts... logged)
 {
     logLine(LogLevel::Error, logged...);
     throw QelMessageValidationException(phrase);
@@ -134,10 +135,9 @@ QelMessage::QelMessage(unsigned int i_callerId, unsigned short i_function, unsig
 }
 
 QelMessage::QelMessage(const char* i_buffer, unsigned int i_length)
+    : mMessage(new char[CommonHeader::validate(i_buffer, i_length)->mMsgLength]) // not cleared: it is copied over
 {
-    const unsigned int length = CommonHeader::validate(i_buffer, i_length)->mMsgLength;
-    mMessage.reset(new char[length]); // not cleared: every byte is copied over
-    std::memcpy(mMessage.get(), i_buffer, length);
+    std::memcpy(mMessage.get(), i_buffer, reinterpret_cast<const CommonHeader*>(i_buffer)->mMsgLength);
 }
 
 QelMessage::QelMessage(const QelMessage& i_message) : mMessage(new char[i_message.msgLength()])

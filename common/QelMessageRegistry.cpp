@@ -51,7 +51,11 @@ QelMessageRegistry::QelMessageRegistry()
 
 QelMessageRegistry::QelMessageRegistry(std::initializer_list<std::pair<const Identifier, Factory>> entries)
     : mEntries(entries)
-{}
+{
+    pFillTable();
+}
+
+QelMessageRegistry::QelMessageRegistry(const QelMessageRegistry& other) : mEntries(other.mEntries) { pFillTable(); }
 
 QelMessageRegistry::~QelMessageRegistry() = default;
 
@@ -65,10 +69,10 @@ std::unique_ptr<QelMessage> QelMessageRegistry::deserialize(const char* buffer, 
     if (buffer == nullptr) throw QelMessageValidationException("i_buffer");
 
     const FastHeader& header = *reinterpret_cast<const FastHeader*>(buffer);
-    const auto entry = mEntries.find(header.getIdentifier());
-    if (entry != mEntries.end()) {
+    const Slot& slot = pSlot(pKey(header.getIdentifier()));
+    if (slot.factory != nullptr) {
         try {
-            return entry->second(buffer, length);
+            return slot.maker != nullptr ? slot.maker(buffer, length) : (*slot.factory)(buffer, length);
         } catch (const QelMessageValidationException& e) {
             logLine(LogLevel::Debug, "Failed to deserialize message ", header, ": ", e.what());
         }
@@ -83,8 +87,41 @@ std::unique_ptr<QelMessage> QelMessageRegistry::deserialize(const char* buffer, 
 
 const QelMessageRegistry::Factory* QelMessageRegistry::findFactory(const Identifier& identifier) const
 {
-    const auto entry = mEntries.find(identifier);
-    return entry == mEntries.end() ? nullptr : &entry->second;
+    return pSlot(pKey(identifier)).factory;
+}
+
+/// Spreads keys, which differ in few bits.
+std::size_t QelMessageRegistry::pHash(std::uint64_t key) noexcept
+{
+    constexpr std::uint64_t kOddFraction = 0x9E3779B97F4A7C15; // 2^64 divided by the golden ratio
+    constexpr unsigned int kLowBits = 40;
+    return static_cast<std::size_t>(key * kOddFraction >> kLowBits);
+}
+
+/// The slot of a key; if there is none, a free one.
+inline const QelMessageRegistry::Slot& QelMessageRegistry::pSlot(std::uint64_t key) const noexcept
+{
+    std::size_t index = pHash(key) & mTableMask;
+    while (mTable[index].key != key && mTable[index].factory != nullptr)
+        index = (index + 1) & mTableMask;
+    return mTable[index];
+}
+
+void QelMessageRegistry::pFillTable()
+{
+    std::size_t slots = 1;
+    while (slots < 4 * mEntries.size())
+        slots *= 2;
+    mTable.resize(slots);
+    mTableMask = slots - 1;
+    for (const auto& entry : mEntries) {
+        const std::uint64_t key = pKey(entry.first);
+        std::size_t index = pHash(key) & mTableMask;
+        while (mTable[index].factory != nullptr)
+            index = (index + 1) & mTableMask;
+        const Maker* const maker = entry.second.target<Maker>();
+        mTable[index] = {key, &entry.second, maker == nullptr ? nullptr : *maker};
+    }
 }
 
 std::ostream& operator<<(std::ostream& os, const QelMessageRegistry::FastHeader& header)

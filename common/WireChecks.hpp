@@ -7,12 +7,19 @@
 
 namespace qel {
 
+/// Out of line, so that a check costs the good case one comparison.
+/// @throws QelMessageValidationException  always
+[[noreturn, gnu::cold, gnu::noinline]] inline void throwValidation(const char* phrase)
+{
+    throw QelMessageValidationException(phrase);
+}
+
 /// Refuses a frame, or the arguments of a builder, if a condition does not hold.
 /// @param phrase  the text of the exception
 /// @throws QelMessageValidationException  the condition is false
 inline void require(bool condition, const char* phrase)
 {
-    if (!condition) throw QelMessageValidationException(phrase);
+    if (!condition) throwValidation(phrase);
 }
 
 /// The length of a text as its 16-bit length field holds it: it wraps from 65536 bytes on. The peer sees only the

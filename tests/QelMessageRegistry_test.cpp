@@ -10,6 +10,7 @@
 #include "support/MessageProbe.hpp"
 #include "support/RawFrame.hpp"
 
+#include <array>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <new>
@@ -480,6 +481,53 @@ TEST(QelMessageRegistry, TellsIdentitiesApartByEachPart)
     EXPECT_EQ(found.size(), 7U) << "six entries, and null for the last";
 }
 
+/// A registry of some identities that differ in few bits; each message comes from the factory of its own.
+template <std::size_t Count>
+void findsEachOf(const std::array<Identifier, Count>& identities)
+{
+    SCOPED_TRACE(Count);
+    std::set<Identifier> made;
+    const auto entry = [&made](const Identifier& identity) {
+        const auto factory = [&made, identity](const char* buffer, unsigned int length) {
+            made.insert(identity);
+            return std::make_unique<QelMessage>(buffer, length);
+        };
+        return std::pair<const Identifier, QelMessageRegistry::Factory>(identity, factory);
+    };
+    const QelMessageRegistry registry =
+        std::apply([&entry](const auto&... all) { return QelMessageRegistry({entry(all)...}); }, identities);
+    for (const Identifier& identity : identities) {
+        const Identifier other(std::get<0>(identity) ^ 0x8000U, std::get<1>(identity), std::get<2>(identity));
+        EXPECT_EQ(registry.findFactory(other), nullptr);
+        made.clear();
+        deserialize(registry, frameOfIdentity(identity).bytes());
+        EXPECT_THAT(made, ElementsAre(identity));
+    }
+}
+
+template <std::size_t Count>
+std::array<Identifier, Count> neighbours()
+{
+    constexpr Classification::Value kinds[] = {Classification::Request, Classification::Response,
+                                               Classification::Async};
+    std::array<Identifier, Count> identities;
+    for (std::size_t i = 0; i < Count; ++i) {
+        const auto function = static_cast<unsigned short>(0x6001 + i % 3);
+        const auto operation = static_cast<unsigned short>(0x0100 + i / 9);
+        identities.at(i) = {function, operation, kinds[i / 3 % 3]};
+    }
+    return identities;
+}
+
+TEST(QelMessageRegistry, FindsEachOfManyEntries)
+{
+    findsEachOf(neighbours<1>());
+    findsEachOf(neighbours<2>());
+    findsEachOf(neighbours<3>());
+    findsEachOf(neighbours<33>());
+    findsEachOf(neighbours<300>());
+}
+
 TEST(QelMessageRegistry, FactoryThrowsTheReasonOfARefusal)
 {
     const QelMessageRegistry registry;
@@ -552,6 +600,17 @@ TEST(QelMessageRegistry, IsImmutableOnceBuilt)
 
     const QelMessageRegistry original({QelMessageRegistry::Entry<Example>()});
     const QelMessageRegistry copy(original);
+    EXPECT_EQ(classOf(*deserialize(copy, exampleFrame().bytes())), typeid(Example));
+}
+
+TEST(QelMessageRegistry, CopyDoesNotNeedTheOriginal)
+{
+    auto original = std::make_unique<const QelMessageRegistry>(
+        std::initializer_list<std::pair<const Identifier, QelMessageRegistry::Factory>>{
+            QelMessageRegistry::Entry<Example>()});
+    const QelMessageRegistry copy(*original);
+    EXPECT_NE(copy.findFactory(Example::getMessageID()), original->findFactory(Example::getMessageID()));
+    original.reset();
     EXPECT_EQ(classOf(*deserialize(copy, exampleFrame().bytes())), typeid(Example));
 }
 

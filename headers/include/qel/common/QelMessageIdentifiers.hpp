@@ -159,16 +159,13 @@ struct QEL_EXPORT QelMessageClassification {
     /// @return the classification that the two known flags give; the other six bits never change it
     static constexpr Value fromFlags(QelMessageFlags flags) noexcept
     {
-        switch (flags & (MsgResponse | MsgResponseExpected)) {
-        case MsgResponseExpected:
-            return Request;
-        case MsgResponse:
-            return Response;
-        case NoFlagSet:
-            return Async;
-        default:
-            return Unknown;
-        }
+        // The upper two bits count down from Async. Each received message needs this twice, so there is no branch.
+        constexpr unsigned int kMeaninglessBits = 6;
+        static_assert(Async - (NoFlagSet >> kMeaninglessBits) == Async &&
+                          Async - (MsgResponse >> kMeaninglessBits) == Response &&
+                          Async - (MsgResponseExpected >> kMeaninglessBits) == Request,
+                      "the classification follows from the flags");
+        return static_cast<Value>(Async - (flags >> kMeaninglessBits));
     }
 };
 

@@ -13,6 +13,7 @@
 #include <memory>
 #include <tuple>
 #include <utility>
+#include <vector>
 
 namespace qel {
 
@@ -53,7 +54,7 @@ public:
     QelMessageRegistry(std::initializer_list<std::pair<const Identifier, Factory>> entries);
 
     /// A copy has the same entries. There is no assignment: other threads may be reading the entries.
-    QelMessageRegistry(const QelMessageRegistry&) = default;
+    QelMessageRegistry(const QelMessageRegistry& other);
     QelMessageRegistry& operator=(const QelMessageRegistry&) = delete;
 
     virtual ~QelMessageRegistry();
@@ -63,9 +64,7 @@ public:
     template <typename T>
     static std::pair<const Identifier, Factory> Entry()
     {
-        return {T::getMessageID(), [](const char* buffer, unsigned int length) -> std::unique_ptr<QelMessage> {
-                    return std::make_unique<T>(buffer, length);
-                }};
+        return {T::getMessageID(), &pMake<T>};
     }
 
     /// Builds the message that a frame holds.
@@ -85,23 +84,40 @@ public:
     const Factory* findFactory(const Identifier& identifier) const;
 
 private:
-    /// The order of std::less, as one comparison of numbers: a look-up compares six times.
-    struct Order {
-        static std::uint64_t number(const Identifier& identifier) noexcept
-        {
-            constexpr unsigned int kFunctionShift = 48;
-            constexpr unsigned int kOperationShift = 32;
-            return static_cast<std::uint64_t>(std::get<0>(identifier)) << kFunctionShift |
-                   static_cast<std::uint64_t>(std::get<1>(identifier)) << kOperationShift |
-                   static_cast<std::uint64_t>(std::get<2>(identifier));
-        }
-        bool operator()(const Identifier& left, const Identifier& right) const noexcept
-        {
-            return number(left) < number(right);
-        }
+    using Maker = std::unique_ptr<QelMessage> (*)(const char*, unsigned int);
+
+    /// A place of the look-up table.
+    struct Slot {
+        std::uint64_t key = 0;            // the identity, see pKey()
+        const Factory* factory = nullptr; // in mEntries; null: the slot is free
+        Maker maker = nullptr;            // the function in the factory; null: the factory holds something else
     };
 
-    const std::map<Identifier, Factory, Order> mEntries;
+    template <typename T>
+    static std::unique_ptr<QelMessage> pMake(const char* buffer, unsigned int length)
+    {
+        return std::make_unique<T>(buffer, length);
+    }
+
+    /// The identity as one number.
+    static std::uint64_t pKey(const Identifier& identifier) noexcept
+    {
+        constexpr unsigned int kClassificationShift = 32;
+        constexpr unsigned int kFunctionShift = 16;
+        return static_cast<std::uint64_t>(std::get<2>(identifier)) << kClassificationShift |
+               static_cast<std::uint64_t>(std::get<0>(identifier)) << kFunctionShift |
+               static_cast<std::uint64_t>(std::get<1>(identifier));
+    }
+    static std::size_t pHash(std::uint64_t key) noexcept;
+    const Slot& pSlot(std::uint64_t key) const noexcept;
+    void pFillTable();
+
+    const std::map<Identifier, Factory> mEntries;
+
+    // The same entries by hash: a frame is looked up with one probe, where the map needs six comparisons. The length is
+    // a power of two, and at least three quarters of the slots are free.
+    std::vector<Slot> mTable;
+    std::size_t mTableMask = 0; // its length - 1
 };
 
 static_assert(sizeof(QelMessageRegistry::FastHeader) == 22 && alignof(QelMessageRegistry::FastHeader) == 1,
