@@ -50,29 +50,9 @@ Words optionsOf(const CLI::App& app)
     return names;
 }
 
-/// The candidate that the word is most likely meant to be; empty when none is near.
-std::string nearest(const std::string& word, const Words& candidates)
-{
-    constexpr std::size_t kLettersPerMistake = 3;
-    constexpr std::size_t kShortestPrefix = 4;
-    std::size_t best = std::max<std::size_t>(word.size() / kLettersPerMistake, 1) + 1;
-    std::string found;
-    for (const std::string& candidate : candidates) {
-        const std::size_t distance = editDistance(word, candidate);
-        if (distance >= best) continue;
-        best = distance;
-        found = candidate;
-    }
-    if (!found.empty() || word.size() < kShortestPrefix) return found;
-    for (const std::string& candidate : candidates) {
-        if (candidate.compare(0, word.size(), word) == 0) return candidate;
-    }
-    return {};
-}
-
 std::string unknown(const char* kind, const std::string& word, const Words& candidates, const std::string& command)
 {
-    const std::string guess = nearest(word, candidates);
+    const std::string guess = nearestWord(word, candidates);
     const std::string hint =
         guess.empty() ? "; see \"" + command + " --help\"" : "; did you mean " + quoted(guess) + "?";
     return std::string("unknown ") + kind + " " + quoted(word) + hint;
@@ -159,6 +139,25 @@ std::string usageMessage(const CLI::App& app, const CLI::ParseError& error)
         return "a subcommand is missing: " + joined(subcommandsOf(*apps.back())) + "; see \"" + command + " --help\"";
     }
     return onOneLine(parserMessage(text));
+}
+
+std::string nearestWord(const std::string& word, const std::vector<std::string>& candidates)
+{
+    constexpr std::size_t kLettersPerMistake = 3;
+    constexpr std::size_t kShortestPrefix = 4;
+    std::size_t best = std::max<std::size_t>(word.size() / kLettersPerMistake, 1) + 1;
+    std::string found;
+    for (const std::string& candidate : candidates) {
+        const std::size_t distance = editDistance(word, candidate);
+        if (distance >= best) continue;
+        best = distance;
+        found = candidate;
+    }
+    if (!found.empty() || word.size() < kShortestPrefix) return found;
+    for (const std::string& candidate : candidates) {
+        if (candidate.compare(0, word.size(), word) == 0) return candidate;
+    }
+    return {};
 }
 
 std::size_t editDistance(const std::string& left, const std::string& right)

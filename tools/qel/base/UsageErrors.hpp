@@ -2,6 +2,7 @@
 
 #include <CLI/CLI.hpp>
 #include <string>
+#include <vector>
 
 namespace qel::tool {
 
@@ -12,6 +13,9 @@ namespace qel::tool {
 /// @param app  the top-level app, after the parse() that threw
 /// @param error  what it threw; not a request for help or the version
 std::string usageMessage(const CLI::App& app, const CLI::ParseError& error);
+
+/// The candidate that an unknown word most likely stands for. @return empty: none is near
+std::string nearestWord(const std::string& word, const std::vector<std::string>& candidates);
 
 /// The number of letters to insert, delete, replace, or swap with their neighbour to turn one word into the other.
 std::size_t editDistance(const std::string& left, const std::string& right);
