@@ -13,6 +13,7 @@
 #include <algorithm>
 #include <cerrno>
 #include <limits>
+#include <openssl/err.h>
 #include <openssl/pem.h>
 #include <openssl/x509_vfy.h>
 #include <string>
@@ -30,6 +31,15 @@ int cappedLength(std::size_t length) noexcept
 {
     constexpr std::size_t longest = std::numeric_limits<int>::max();
     return static_cast<int>(std::min(length, longest));
+}
+
+/// The fatal alert of the peer that is the first error in OpenSSL's queue; 0: the error is another one.
+int alertInErrorQueue() noexcept
+{
+    const unsigned long error = ERR_peek_error();
+    const int reason = ERR_GET_REASON(error);
+    if (ERR_GET_LIB(error) != ERR_LIB_SSL || reason < SSL_AD_REASON_OFFSET) return 0;
+    return reason - SSL_AD_REASON_OFFSET;
 }
 
 [[noreturn]] void failAtEndOfStream()
@@ -128,6 +138,12 @@ std::size_t SSLStream::getReadableBytes() const
     return static_cast<std::size_t>(SSL_pending(mSSL.get()));
 }
 
+int SSLStream::getPeerAlert() const
+{
+    const MutexLock lock(mLock);
+    return mPeerAlert;
+}
+
 std::string SSLStream::getVerificationFailure() const
 {
     const MutexLock lock(mLock);
@@ -211,6 +227,7 @@ int SSLStream::pHandleErrorLocked(int result)
         logLine(LogLevel::Error, "SSL stream encountered unrecoverable error code ", hexFormat(error));
         break;
     }
+    if (error == SSL_ERROR_SSL) mPeerAlert = alertInErrorQueue();
     SSLException::flushErrorQueue();
     if (error == SSL_ERROR_SSL) pLogVerificationLocked();
     pCloseLocked();

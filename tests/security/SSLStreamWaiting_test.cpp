@@ -2,11 +2,13 @@
 
 #include <qel/common/LogBackend.hpp>
 #include <qel/common/QelLogger.hpp>
+#include <qel/common/io/StreamIOException.hpp>
 #include <qel/common/security/SSLStream.hpp>
 
 #include "security/StreamExpectations.hpp"
 #include "security/StreamKit.hpp"
 #include "support/MemoryStreamPair.hpp"
+#include "support/RawTlsPeer.hpp"
 #include "support/TlsKit.hpp"
 
 #include <atomic>
@@ -66,6 +68,38 @@ TEST_F(SSLStreamTest, ReportsWhyThePeersCertificateWasRefused)
     EXPECT_EQ(server.getVerificationFailure(), "certificate has expired");
     EXPECT_EQ(client.getVerificationFailure(), "");
     EXPECT_EQ(server.getStatus(), SSLStream::STATUS_CLOSED);
+}
+
+TEST_F(SSLStreamTest, KnowsTheAlertOfThePeer)
+{
+    MemoryStreamPair memory;
+    SSLStream client(clientContext(Identity::Client), memory.takeClient());
+    const SSLCredentials credentials = test::credentialsOf(Identity::Server);
+    test::RawTlsPeer::Options options;
+    options.credentials = &credentials;
+    test::RawTlsPeer server(test::RawTlsPeer::Server, options, memory.takeServer());
+    std::thread thread([&] {
+        server.handshake();
+        server.exchangeVersions();
+        server.sendBytes(server.protectedRecord(21, "\x02\x31"));
+    });
+    client.handshake();
+    EXPECT_EQ(client.getPeerAlert(), 0);
+    char byte = 0;
+    EXPECT_THROW(client.read(&byte, 1), StreamIOException);
+    EXPECT_EQ(client.getPeerAlert(), 49);
+    EXPECT_EQ(client.getStatus(), SSLStream::STATUS_CLOSED);
+    thread.join();
+}
+
+TEST_F(SSLStreamTest, AFailureOfItsOwnIsNoAlertOfThePeer)
+{
+    MemoryStreamPair memory;
+    SSLStream client(clientContext(Identity::Expired), memory.takeClient());
+    SSLStream server(serverContext(), memory.takeServer());
+    shakeHands(client, server);
+    EXPECT_EQ(server.getPeerAlert(), 0);
+    EXPECT_EQ(client.getPeerAlert(), 0) << "this class sends none";
 }
 
 TEST_F(SSLStreamPair, HasNoVerificationFailureBeforeAndAfterAGoodHandshake)

@@ -43,8 +43,8 @@ class SSLContext;
 ///
 /// Thread safety: one reader thread and one writer thread, also at the same time; each deadline setter belongs to the
 /// thread of its direction. Any thread may call close(), getStatus(), getPeerCertificate(), getCipher(), hasPending(),
-/// getReadableBytes() and getVerificationFailure() at any time; they do not wait for a thread that waits in the
-/// underlying stream.
+/// getReadableBytes(), getPeerAlert() and getVerificationFailure() at any time; they do not wait for a thread that
+/// waits in the underlying stream.
 class QEL_EXPORT SSLStream : public Stream {
 public:
     enum Status : unsigned int {
@@ -138,6 +138,11 @@ public:
     /// @return bytes; 0 unless the status is STATUS_ENCRYPTED
     std::size_t getReadableBytes() const;
 
+    /// The number of the fatal alert with which the peer ended TLS (RFC 8446, 6.2), such as 48, unknown_ca. Remains
+    /// available after the stream was closed, to explain a failed handshake(), read() or write().
+    /// @return 0: the peer has sent none
+    int getPeerAlert() const;
+
     /// Why the peer's certificate was refused, such as "certificate has expired". Remains available after the stream
     /// was closed, to explain a failed handshake().
     /// @return the text of X509_verify_cert_error_string(3); empty when no certificate was refused
@@ -166,6 +171,7 @@ private:
     // Guards the TLS engine, both BIOs and the state. Not held while a thread waits in mStream.
     mutable Mutex mLock;
     Status mStatus QEL_GUARDED_BY(mLock) = STATUS_UNENCRYPTED;
+    int mPeerAlert QEL_GUARDED_BY(mLock) = 0;
     const std::unique_ptr<Stream> mStream;
     const SSL_PTR mSSL QEL_PT_GUARDED_BY(mLock);
     BIO_PTR mBuffer QEL_GUARDED_BY(mLock)
