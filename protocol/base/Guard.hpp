@@ -15,14 +15,21 @@ namespace qel::protocol {
 /// To be called in a handler only. @throws std::bad_alloc
 std::string explainCurrent();
 
-/// Logs the exception that is being handled at Error, after the parts and a colon. To be called in a handler only.
+/// Logs the exception that is being handled, after the parts and a colon. To be called in a handler only.
+template <typename... Parts>
+void logCurrentAt(LogLevel::Level level, const Parts&... parts) noexcept
+{
+    try {
+        logLine(level, parts..., ": ", explainCurrent());
+    } catch (...) { // without memory for the line there is none
+    }
+}
+
+/// The same at Error.
 template <typename... Parts>
 void logCurrent(const Parts&... parts) noexcept
 {
-    try {
-        logLine(LogLevel::Error, parts..., ": ", explainCurrent());
-    } catch (...) { // without memory for the line there is none
-    }
+    logCurrentAt(LogLevel::Error, parts...);
 }
 
 /// Runs an operation and logs what it throws as logCurrent() does.

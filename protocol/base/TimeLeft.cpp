@@ -1,4 +1,4 @@
-#include "console/TimeLeft.hpp"
+#include "base/TimeLeft.hpp"
 
 #include <qel/common/util/TimeProvider.hpp>
 
@@ -28,6 +28,12 @@ milliseconds timeLeft(TimePoint deadline)
     const TimePoint now = TimeProvider::steady();
     if (deadline <= now) return milliseconds::zero();
     return std::min(std::chrono::ceil<milliseconds>(deadline - now), kLongestWait);
+}
+
+milliseconds timeToTry(TimePoint deadline)
+{
+    const milliseconds left = timeLeft(deadline);
+    return left < milliseconds::zero() ? left : std::max(left, kShortestWait);
 }
 
 bool hasPassed(TimePoint deadline) { return deadline != TimePoint::max() && TimeProvider::steady() >= deadline; }

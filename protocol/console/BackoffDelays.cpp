@@ -1,6 +1,6 @@
 #include "console/BackoffDelays.hpp"
 
-#include "console/TimeLeft.hpp"
+#include "base/TimeLeft.hpp"
 
 #include <algorithm>
 #include <cmath>

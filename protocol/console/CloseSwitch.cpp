@@ -1,9 +1,6 @@
 #include "console/CloseSwitch.hpp"
 
-#include <qel/protocol/Error.hpp>
-#include <qel/protocol/Logging.hpp>
-
-#include <exception>
+#include "base/Guard.hpp"
 
 namespace qel::protocol {
 
@@ -42,8 +39,8 @@ void CloseSwitch::pCloseLocked() noexcept
     if (mStream == nullptr) return;
     try {
         mStream->close();
-    } catch (const std::exception& error) {
-        logLine(LogLevel::Debug, "while closing: ", explain(error));
+    } catch (...) {
+        logCurrentAt(LogLevel::Debug, "while closing");
     }
 }
 

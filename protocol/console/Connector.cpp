@@ -1,6 +1,7 @@
 #include "console/Connector.hpp"
 
 #include <qel/common/net/SocketStream.hpp>
+#include <qel/common/security/SSLException.hpp>
 #include <qel/common/util/PosixError.hpp>
 #include <qel/common/util/TimeProvider.hpp>
 #include <qel/protocol/Error.hpp>
@@ -9,15 +10,17 @@
 #include <qel/protocol/ServerAddress.hpp>
 
 #include <algorithm>
+#include <cerrno>
+#include <netinet/in.h>
+#include <netinet/tcp.h>
 #include <stdexcept>
+#include <sys/socket.h>
 #include <utility>
 #include <vector>
 
 namespace qel::protocol {
 
 namespace {
-
-constexpr std::size_t kToolIdBytes = 32;
 
 void require(bool isGood, const char* option, const char* reason)
 {
@@ -31,13 +34,13 @@ void checkOptions(const ConsoleOptions& options)
     require(!options.plain || !options.credentials, "plain", "it contradicts credentials");
     require(!options.plain || (options.pins.names.empty() && options.pins.fingerprints.empty()), "pins",
             "a plain connection has no certificates");
-    require(options.identity.toolId.size() <= kToolIdBytes, "identity.toolId", "longer than 32 bytes");
+    require(options.identity.toolId.size() <= Identity::kMaxToolIdBytes, "identity.toolId", "longer than 32 bytes");
     require(options.handshakeTimeout > none, "handshakeTimeout", "not positive");
     require(options.requestTimeout != none, "requestTimeout", "zero");
     require(options.frameTimeout > none, "frameTimeout", "not positive");
     if (!options.retry) return;
-    require(options.retry->first >= none && options.retry->longest >= options.retry->first, "retry",
-            "the first wait is negative or longer than the longest");
+    require(options.retry->first > none, "retry", "the first wait is not positive");
+    require(options.retry->longest >= options.retry->first, "retry", "the first wait is longer than the longest");
     require(options.retry->factor >= 1, "retry", "the factor is below 1");
 }
 
@@ -56,6 +59,19 @@ std::unique_ptr<SocketStream> tuneSocket(Socket socket, const std::string& serve
     } catch (const PosixError& error) {
         std::throw_with_nested(CannotConnect("cannot use connection to " + server + ": " + error.what(), server));
     }
+}
+
+/// Lets a server take any time to read. A SocketStream has a user timeout, which cuts a peer that answers and has no
+/// room for data, such as a partition that is stopped while somebody types: see tcp(7). Without it data that nobody
+/// acknowledges has the system's retransmission limits; the keep-alive of the stream finds an idle server that is gone.
+void removeUserTimeout(const Stream& stream, const std::string& server)
+{
+    const auto* const socket = dynamic_cast<const SocketStream*>(&stream);
+    if (socket == nullptr) return;
+    const int none = 0;
+    const int result = ::setsockopt(socket->getSocket().getFd(), IPPROTO_TCP, TCP_USER_TIMEOUT, &none, sizeof(none));
+    if (result != 0)
+        throw CannotConnect("cannot use connection to " + server + ": " + PosixError(errno).what(), server);
 }
 
 PeerPins normalizedPins(const PeerPins& pins)
@@ -99,6 +115,7 @@ ConnectedStream Connector::connect(TimePoint end, CloseSwitch& closeSwitch, Time
 ConnectedStream Connector::adopt(std::unique_ptr<Stream> stream, int descriptor, TimePoint end,
                                  CloseSwitch& closeSwitch, TimePoint& handshakeEnd)
 {
+    removeUserTimeout(*stream, mServer);
     if (descriptor < 0) descriptor = descriptorOf(*stream);
     handshakeEnd = std::min(end, deadlineIn(mHandshakeTimeout));
     auto* const readiness = descriptor < 0 ? dynamic_cast<Readiness*>(stream.get()) : nullptr;
@@ -117,6 +134,7 @@ ConnectedStream Connector::adopt(std::unique_ptr<Stream> stream, int descriptor,
 /// Upgrades a plain connection to TLS and checks the peer.
 void Connector::pProtect(ConnectedStream& connected, TimePoint end, CloseSwitch& closeSwitch)
 {
+    const std::string attempt = "no protected connection to " + mServer + ": ";
     try {
         limitTo(*connected.stream, end);
         requestUpgrade(*connected.stream, connected.descriptor);
@@ -132,8 +150,10 @@ void Connector::pProtect(ConnectedStream& connected, TimePoint end, CloseSwitch&
         checkPeer(connected.peer, mPins);
         logLine(LogLevel::Info, "connected over TLS to ", describePeer(connected.peer));
     } catch (Error& error) {
-        error.addContext("no protected connection to " + mServer + ": ", mServer);
+        error.addContext(attempt, mServer);
         throw;
+    } catch (const SSLException& error) { // out of memory, as a rule
+        std::throw_with_nested(Error(attempt + error.what(), mServer));
     }
 }
 

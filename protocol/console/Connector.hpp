@@ -5,9 +5,9 @@
 #include <qel/protocol/ConsoleOptions.hpp>
 #include <qel/protocol/PeerIdentity.hpp>
 
+#include "base/TimeLeft.hpp"
 #include "console/CloseSwitch.hpp"
 #include "console/ReadAhead.hpp"
-#include "console/TimeLeft.hpp"
 #include "transport/Readiness.hpp"
 
 #include <chrono>

@@ -8,13 +8,14 @@
 #include <qel/protocol/Error.hpp>
 #include <qel/protocol/Logging.hpp>
 
+#include "base/Guard.hpp"
+#include "base/MessageKind.hpp"
 #include "console/BackoffDelays.hpp"
 
 #include <algorithm>
 #include <random>
 #include <sstream>
 #include <stdexcept>
-#include <tuple>
 #include <unistd.h>
 #include <utility>
 
@@ -28,18 +29,6 @@ using std::chrono::milliseconds;
 constexpr std::uint32_t kInterfaceVersion = 1;
 constexpr std::uint16_t kMajorVersion = 1;
 constexpr std::uint16_t kMinorVersion = 0;
-
-QelMessageRegistry::Identifier identityOf(const QelMessage& message)
-{
-    return {static_cast<unsigned short>(message.getFunction()), static_cast<unsigned short>(message.getOperation()),
-            message.getClassification()};
-}
-
-template <typename T>
-bool is(const QelMessage& message)
-{
-    return identityOf(message) == T::getMessageID();
-}
 
 template <typename T>
 bool isA(const std::exception& error)
@@ -104,7 +93,8 @@ ConsoleCore::ConsoleCore(const ConsoleOptions& options, bool needsAddress)
     : mServer(options.server), mIdentity(completeIdentity(options.identity)), mRequestTimeout(options.requestTimeout),
       mFrameTimeout(std::min(options.frameTimeout, kLongestWait)),
       mHandshakeTimeout(std::min(options.handshakeTimeout, kLongestWait)), mRetry(options.retry),
-      mIsConnector(needsAddress), mConnector(options, needsAddress)
+      mIsConnector(needsAddress), mClosed(std::make_exception_ptr(Error("this console is closed", mServer))),
+      mConnector(options, needsAddress)
 {}
 
 void ConsoleCore::connect(TimePoint end)
@@ -163,7 +153,7 @@ void ConsoleCore::leave() noexcept
 void ConsoleCore::dispose() noexcept
 {
     mCloseSwitch.close();
-    pDisconnect(std::make_exception_ptr(Error("this console is closed", mServer)));
+    pDisconnect(mClosed);
     // A handler may own a session, which owns this object.
     const auto handlers = std::move(mHandlers);
     const auto otherHandler = std::move(mOtherHandler);
@@ -248,7 +238,8 @@ Sending ConsoleCore::sendAmongOthers(const QelMessage& message, TimePoint end, c
             return Sending::Done;
         }
         if (!ready.receive || hasPassed(end)) return Sending::Late;
-        receiveOne(end, TimePoint::max());
+        // What is there may be a part of a record of TLS: then room to send must not be waited for in vain.
+        receiveOne(TimeProvider::steady(), TimePoint::max());
     }
     return Sending::NotWanted;
 }
@@ -304,6 +295,7 @@ void ConsoleCore::closeSession(TimePoint end)
 std::shared_ptr<SerialState> ConsoleCore::openSerial(std::uint16_t partition, const SerialOptions& options,
                                                      TimePoint end)
 {
+    if (options.maxUnread == 0) throw std::invalid_argument("maxUnread: zero");
     openSession(end);
     auto state = std::make_shared<SerialState>(partition, options.connection, options.maxUnread);
     mSerials.push_back(state);
@@ -381,11 +373,18 @@ void ConsoleCore::pIntroduce(TimePoint end)
     } catch (const ClosedByPeer& error) {
         const std::string loss = lossOf(error);
         if (!mIsProtected || loss.empty()) throw;
-        std::throw_with_nested(CertificateRejected(CertificateRejected::Reason::OursByThem,
-                                                   "the server closed the connection right after the TLS handshake; it "
-                                                   "may not accept this console's certificate: " +
-                                                       loss,
-                                                   mServer));
+        const std::string alert = mLink->certificateAlert();
+        if (!alert.empty()) {
+            std::throw_with_nested(CertificateRejected(CertificateRejected::Reason::OursByThem,
+                                                       "the server refuses this console's certificate: " + alert,
+                                                       mServer));
+        }
+        // A server that pins its consoles closes without a word, and so does one that crashes. Trying again is right
+        // for the second and does no harm with the first.
+        std::throw_with_nested(ClosedByPeer("the server closed the connection right after the TLS handshake; it may "
+                                            "not accept this console's certificate: " +
+                                                loss,
+                                            mServer));
     }
 }
 
@@ -436,8 +435,8 @@ void ConsoleCore::pHandleResponse(std::unique_ptr<QelMessage> response)
 {
     // Also when no caller waits any more: the hypervisor has done it.
     const bool isGrant = response->getStatus() == QelMessageStatusNoError;
-    const bool isOpened = isGrant && is<QelMessageInterfaceCmpOpenKrogSessionRsp>(*response);
-    const bool isClosed = isGrant && is<QelMessageInterfaceCmpCloseKrogSessionRsp>(*response);
+    const bool isOpened = isGrant && isKind<QelMessageInterfaceCmpOpenKrogSessionRsp>(*response);
+    const bool isClosed = isGrant && isKind<QelMessageInterfaceCmpCloseKrogSessionRsp>(*response);
     if (const char* const mistake = mExchanges.deliver(std::move(response))) pBreak(mistake);
     if (isOpened) mIsSessionOpen = true;
     if (!isClosed) return;
@@ -478,8 +477,8 @@ void ConsoleCore::pSendClose(const SerialState& state) noexcept
         const QelMessageVirtualSerialCloseReq request(state.partition, state.connection, false);
         mExchanges.add(request, nullptr);
         pSend(request, deadlineIn(mRequestTimeout));
-    } catch (const std::exception& error) {
-        logLine(LogLevel::Debug, "while dropping a session: ", explain(error));
+    } catch (...) {
+        logCurrentAt(LogLevel::Debug, "while dropping a session");
     }
 }
 
@@ -488,7 +487,7 @@ bool ConsoleCore::pHandleSerial(const QelMessage& message)
 {
     using DataNotice = QelMessageVirtualSerialDataToDaxAsync;
     using ClosedNotice = QelMessageVirtualSerialSessionClosedAsync;
-    if (mSerials.empty() || (!is<DataNotice>(message) && !is<ClosedNotice>(message))) return false;
+    if (mSerials.empty() || (!isKind<DataNotice>(message) && !isKind<ClosedNotice>(message))) return false;
     const auto* const data = dynamic_cast<const DataNotice*>(&message);
     const auto* const closed = dynamic_cast<const ClosedNotice*>(&message);
     if (data == nullptr && closed == nullptr) pBreak("malformed notice " + toString(message.getLogID()));
@@ -509,7 +508,7 @@ bool ConsoleCore::pHandleSerial(const QelMessage& message)
 /// @return whether there was a handler for the class
 bool ConsoleCore::pHandleTyped(const QelMessage& message)
 {
-    const auto found = mHandlers.find(identityOf(message));
+    const auto found = mHandlers.find(kindOf(message));
     if (found == mHandlers.end()) return false;
     const std::shared_ptr<const TypedHandler> handler = found->second; // it may replace itself
     if (!(*handler)(message)) pBreak("malformed notice " + toString(message.getLogID()));
@@ -531,13 +530,15 @@ void ConsoleCore::pHandleNotice(const QelMessage& message)
 /// @return whether the notice ends the connection
 bool ConsoleCore::pHandleEnd(const QelMessage& message)
 {
-    if (is<QelMessageKrogConnectionClosedAsync>(message)) {
+    if (isKind<QelMessageKrogConnectionClosedAsync>(message)) {
         pEndSerials(SessionEnd::ConnectionClosed);
         pFail(std::make_exception_ptr(ClosedByPeer("the server closed the connection", mServer)));
         return true;
     }
-    if (is<QelMessageAbortHandshakeAsync>(message)) {
-        pFail(std::make_exception_ptr(TurnedAway("the server refused the connection: it accepts only TLS", mServer)));
+    if (isKind<QelMessageAbortHandshakeAsync>(message)) {
+        const char* const reason = mIsProtected ? "the server turned this console away inside TLS"
+                                                : "the server refused the connection: it accepts only TLS";
+        pFail(std::make_exception_ptr(TurnedAway(reason, mServer)));
         return true;
     }
     return false;

@@ -6,12 +6,12 @@
 #include <qel/protocol/Console.hpp>
 #include <qel/protocol/ConsoleOptions.hpp>
 
+#include "base/TimeLeft.hpp"
 #include "console/CloseSwitch.hpp"
 #include "console/Connector.hpp"
 #include "console/Exchange.hpp"
 #include "console/FrameLink.hpp"
 #include "console/SerialState.hpp"
-#include "console/TimeLeft.hpp"
 
 #include <chrono>
 #include <functional>
@@ -128,7 +128,8 @@ private:
     const std::chrono::milliseconds mFrameTimeout;
     const std::chrono::milliseconds mHandshakeTimeout;
     const std::optional<Backoff> mRetry;
-    const bool mIsConnector; // false: the stream was given
+    const bool mIsConnector;          // false: the stream was given
+    const std::exception_ptr mClosed; // what calls throw after close(); made beforehand, since dispose() cannot fail
     Connector mConnector;
     CloseSwitch mCloseSwitch;
 

@@ -3,10 +3,11 @@
 #include <qel/common/QelMessageExceptions.hpp>
 #include <qel/common/util/TimeProvider.hpp>
 #include <qel/protocol/Error.hpp>
-#include <qel/protocol/Logging.hpp>
 #include <qel/protocol/MessageRegistry.hpp>
 
+#include "base/Guard.hpp"
 #include "base/StreamFailure.hpp"
+#include "transport/TlsAlert.hpp"
 
 #include <algorithm>
 #include <array>
@@ -22,7 +23,14 @@ namespace {
 using std::chrono::milliseconds;
 
 constexpr milliseconds kMaxFarewell(1000);
-constexpr milliseconds kShortestWait(1);
+
+/// One thread reads and writes, and says itself when to flush.
+BufferedStreamOptions bufferOptions()
+{
+    BufferedStreamOptions options;
+    options.gatherBytes = FrameLink::kGatherBytes;
+    return options;
+}
 
 template <typename F>
 std::exception_ptr failureOf(F fail)
@@ -38,50 +46,36 @@ std::exception_ptr failureOf(F fail)
 /// How long a message may take that begins now.
 milliseconds frameTime(milliseconds frameTimeout, TimePoint end)
 {
-    const milliseconds left = timeLeft(end);
-    if (left < milliseconds::zero()) return frameTimeout;
-    return std::max(std::min(left, frameTimeout), kShortestWait);
+    const milliseconds left = timeToTry(end);
+    return left < milliseconds::zero() ? frameTimeout : std::min(left, frameTimeout);
 }
 
 } // namespace
 
-void FrameLink::Input::begin(milliseconds frameTimeout, TimePoint end)
+void FrameLink::Input::begin(std::size_t count) noexcept
 {
-    mFrameTimeout = frameTimeout;
-    mEnd = end;
-    mHasBegun = hasBytes();
-    if (mHasBegun) mStream.setReadDeadline(frameTime(frameTimeout, end));
+    mFirst = 0;
+    mLast = count;
 }
 
 std::size_t FrameLink::Input::read(char* buffer, std::size_t length)
 {
-    if (mIsDirect) {
-        const std::size_t count = mStream.read(buffer, length);
-        pNote(count);
-        return count;
-    }
-    if (!hasBytes() && !pFill()) return 0;
+    const std::size_t count = pTake(buffer, length);
+    return count != 0 ? count : mStream.read(buffer, length);
+}
+
+void FrameLink::Input::fill(char* buffer, std::size_t length)
+{
+    const std::size_t count = pTake(buffer, length);
+    if (count < length) mStream.fill(buffer + count, length - count);
+}
+
+std::size_t FrameLink::Input::pTake(char* buffer, std::size_t length) noexcept
+{
     const std::size_t count = std::min(length, mLast - mFirst);
-    std::memcpy(buffer, mBuffer.data() + mFirst, count);
+    std::memcpy(buffer, mBytes.data() + mFirst, count);
     mFirst += count;
     return count;
-}
-
-/// @return false: the end of the stream
-bool FrameLink::Input::pFill()
-{
-    mFirst = mLast = 0;
-    mLast = mStream.read(mBuffer.data(), mBuffer.size());
-    pNote(mLast);
-    return hasBytes();
-}
-
-/// Begins the message with its first bytes.
-void FrameLink::Input::pNote(std::size_t count)
-{
-    if (mHasBegun || count == 0) return;
-    mHasBegun = true;
-    if (!mIsDirect) mStream.setReadDeadline(frameTime(mFrameTimeout, mEnd));
 }
 
 FrameLink::FrameLink(ConnectedStream connected, const std::string& server, milliseconds frameTimeout,
@@ -89,7 +83,8 @@ FrameLink::FrameLink(ConnectedStream connected, const std::string& server, milli
     : mStream(std::move(connected.stream)), mReadAhead(connected.readAhead),
       mTls(mReadAhead == nullptr ? nullptr : static_cast<SSLStream*>(mStream.get())), mDescriptor(connected.descriptor),
       mReadiness(connected.readiness), mServer(server), mFrameTimeout(frameTimeout), mCloseSwitch(closeSwitch),
-      mInput(*mStream, mTls != nullptr), mMessages(mInput, messageRegistry())
+      mHasLeft(std::make_exception_ptr(Error("this console has left", mServer))), mBuffered(*mStream, bufferOptions()),
+      mInput(mBuffered), mMessages(mInput, messageRegistry())
 {
     mCloseSwitch.watch(mStream.get());
 }
@@ -101,7 +96,29 @@ void FrameLink::send(const QelMessage& message, TimePoint end)
     if (mSendFailure) std::rethrow_exception(mSendFailure);
     mStream->setWriteDeadline(frameTime(mFrameTimeout, end));
     try {
+        mGathered = 0;
         mMessages.write(message);
+        mBuffered.flush();
+    } catch (const StreamIOException& error) {
+        pFailSending(error);
+    }
+}
+
+void FrameLink::gather(const QelMessage& message)
+{
+    if (mSendFailure) std::rethrow_exception(mSendFailure);
+    mMessages.write(message);
+    mGathered += message.msgLength();
+}
+
+void FrameLink::flush(TimePoint end)
+{
+    if (mGathered == 0) return;
+    if (mSendFailure) std::rethrow_exception(mSendFailure);
+    mStream->setWriteDeadline(frameTime(mFrameTimeout, end));
+    try {
+        mGathered = 0;
+        mBuffered.flush();
     } catch (const StreamIOException& error) {
         pFailSending(error);
     }
@@ -111,25 +128,64 @@ std::unique_ptr<QelMessage> FrameLink::receive(TimePoint begin, TimePoint end)
 {
     requireReceiving();
     try {
-        const milliseconds left = timeLeft(begin);
-        // The stream would wait for at least a tick of the system's timers.
-        if (left == milliseconds::zero() && !pHasInput()) return nullptr;
-        mInput.begin(mFrameTimeout, end);
-        if (mTls == nullptr) {
-            if (!mInput.hasBegun()) mStream->setReadDeadline(left);
-        } else if (!mInput.hasBegun()) {
-            if (!mTls->hasPending() && !mReadAhead->awaitBytes(left)) return nullptr;
-            mStream->setReadDeadline(frameTime(mFrameTimeout, end));
-        }
+        if (!pBegin(begin, end)) return nullptr;
+        mStream->setReadDeadline(frameTime(mFrameTimeout, end));
         return mMessages.read();
     } catch (const StreamIOException& error) {
-        if (mTls == nullptr && !mInput.hasBegun() && isDeadline(error)) return nullptr;
         pFail(pFailure(error));
     } catch (const QelMessageValidationException& error) {
         pFail(failureOf([&] {
             std::throw_with_nested(
                 ProtocolBroken(std::string("the peer broke the protocol: ") + error.what(), mServer));
         }));
+    }
+}
+
+/// Waits for the first bytes of a message. @return false: none came in time
+bool FrameLink::pBegin(TimePoint begin, TimePoint end)
+{
+    const std::optional<std::size_t> count = mTls == nullptr ? pReadFirst(begin, end) : pReadFirstOverTls(begin);
+    if (count == 0) throw StreamIOException("EOF");
+    if (count) mInput.begin(*count);
+    return count.has_value();
+}
+
+/// @return the number of bytes in mInput.firstBytes(), 0 at the end of the stream; none: not in time
+std::optional<std::size_t> FrameLink::pReadFirst(TimePoint begin, TimePoint end)
+{
+    auto& bytes = mInput.firstBytes();
+    if (mBuffered.hasPending()) return mBuffered.read(bytes.data(), bytes.size());
+    milliseconds wait = timeLeft(begin);
+    if (wait == milliseconds::zero() && mDescriptor >= 0) {
+        // The stream itself would wait for at least a tick of the system's timers.
+        if (!pIsReadable()) return std::nullopt;
+        wait = frameTime(mFrameTimeout, end); // nothing is waited for; a deadline that stays costs no system call
+    }
+    mStream->setReadDeadline(wait);
+    try {
+        return mBuffered.read(bytes.data(), bytes.size());
+    } catch (const StreamIOException& error) {
+        if (!isDeadline(error)) throw;
+        return std::nullopt;
+    }
+}
+
+/// The same; the end of a deadline must not meet the TLS stream, which could not go on.
+std::optional<std::size_t> FrameLink::pReadFirstOverTls(TimePoint begin)
+{
+    auto& bytes = mInput.firstBytes();
+    for (;;) {
+        if (!mIsStarved) {
+            mReadAhead->setWaiting(false);
+            const std::size_t count = mBuffered.read(bytes.data(), bytes.size());
+            mReadAhead->setWaiting(true);
+            if (count != 0 || mReadAhead->hasEnded()) return count;
+            mIsStarved = true;
+        }
+        const milliseconds wait = timeLeft(begin);
+        if (wait == milliseconds::zero() && !pIsReadable()) return std::nullopt;
+        if (!mReadAhead->awaitBytes(wait)) return std::nullopt;
+        mIsStarved = false;
     }
 }
 
@@ -168,7 +224,12 @@ void FrameLink::pFail(const std::exception_ptr& failure)
 
 bool FrameLink::hasPending() const
 {
-    return mInput.hasBytes() || (mTls != nullptr && (mReadAhead->hasBytes() || mTls->hasPending()));
+    return !mIsStarved && (mBuffered.hasPending() || (mReadAhead != nullptr && mReadAhead->hasBytes()));
+}
+
+std::string FrameLink::certificateAlert() const
+{
+    return mTls == nullptr ? std::string() : protocol::certificateAlert(*mTls);
 }
 
 PollFd FrameLink::getPollFd(PollEvents events) const
@@ -178,28 +239,39 @@ PollFd FrameLink::getPollFd(PollEvents events) const
 
 void FrameLink::leave(TimePoint end) noexcept
 {
-    mSendFailure = mReceiveFailure = std::make_exception_ptr(Error("this console has left", mServer));
     try {
-        if (mDescriptor >= 0) {
-            static_cast<void>(::shutdown(mDescriptor, SHUT_WR));
-            pAwaitEnd(end);
-        }
+        const TimePoint farewell = std::min(end, deadlineIn(kMaxFarewell));
+        if (mGathered != 0 && isUsable() && await(false, farewell).send) flush(farewell);
+        mSendFailure = mReceiveFailure = mHasLeft;
+        if (pEndOutput()) pAwaitEnd(farewell);
         mStream->close();
-    } catch (const std::exception& error) {
-        logLine(LogLevel::Debug, "while leaving: ", explain(error));
+    } catch (...) {
+        logCurrentAt(LogLevel::Debug, "while leaving");
     }
+    mSendFailure = mReceiveFailure = mHasLeft;
 }
 
-/// False when there is certainly nothing to receive at the moment.
-bool FrameLink::pHasInput() const
+/// False when reading from the stream certainly waits.
+bool FrameLink::pIsReadable() const
 {
-    return mDescriptor < 0 || hasPending() || PollSet(PollFd(mDescriptor, PollEvents::Read)).poll().anyReady();
+    return mDescriptor < 0 || PollSet(PollFd(mDescriptor, PollEvents::Read)).poll().anyReady();
+}
+
+/// @return false: the stream has no way to end one direction alone
+bool FrameLink::pEndOutput() noexcept
+{
+    if (mDescriptor >= 0) {
+        static_cast<void>(::shutdown(mDescriptor, SHUT_WR));
+    } else if (mReadiness != nullptr) {
+        mReadiness->endOutput();
+    }
+    return canTell();
 }
 
 void FrameLink::pAwaitEnd(TimePoint end)
 {
     std::array<char, 4096> rest;
-    mStream->setReadDeadline(timeLeft(std::min(end, deadlineIn(kMaxFarewell))));
+    mStream->setReadDeadline(timeLeft(end));
     while (mStream->read(rest.data(), rest.size()) > 0)
         continue;
 }

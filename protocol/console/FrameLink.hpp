@@ -1,32 +1,40 @@
 #pragma once
 
 #include <qel/common/QelMessage.hpp>
+#include <qel/common/io/BufferedStream.hpp>
 #include <qel/common/io/QelMessageStream.hpp>
 #include <qel/common/io/Stream.hpp>
 #include <qel/common/io/StreamIOException.hpp>
 #include <qel/common/security/SSLStream.hpp>
 #include <qel/common/util/Poll.hpp>
 
+#include "base/TimeLeft.hpp"
 #include "console/CloseSwitch.hpp"
 #include "console/Connector.hpp"
-#include "console/TimeLeft.hpp"
 
 #include <array>
 #include <chrono>
 #include <cstddef>
 #include <exception>
 #include <memory>
+#include <optional>
 #include <string>
 
 namespace qel::protocol {
 
 /// Sends and receives the messages of one connection, with deadlines, and remembers what made it unusable.
 ///
-/// A deadline that passes before a message has begun does no harm, except over TLS on a stream without a descriptor:
-/// TLS cannot go on after a read that a deadline has ended, so one must not begin before there is something to read.
+/// Reads ahead: a short message takes one system call at most. A message begins with its first byte, over TLS with the
+/// first byte that is decrypted: neither a part of a record nor an update of keys starts its time. A deadline that
+/// passes before that does no harm.
+///
+/// Sends at once, or gathers short messages until flush(): whoever waits must flush first.
 /// Thread safety: one thread.
 class FrameLink {
 public:
+    /// The most bytes that are gathered.
+    static constexpr std::size_t kGatherBytes = 8192;
+
     /// @param connected    the connection; the deadlines of its stream are set by every call here
     /// @param server       for exceptions
     /// @param frameTimeout  for one message, from its first byte to its last
@@ -37,11 +45,26 @@ public:
     FrameLink(const FrameLink&) = delete;
     FrameLink& operator=(const FrameLink&) = delete;
 
-    /// Sends one message; waits for room for it until `end`, and for at most the frame timeout.
+    /// Sends one message after those that were gathered; waits for room for it until `end`, and for at most the frame
+    /// timeout.
     /// @throws DeadlinePassed, ClosedByPeer, or Error when this end has closed the connection. Sending fails from then
-    /// on;
-    ///         over TLS receiving too
+    ///         on; over TLS receiving too. What was gathered is lost
     void send(const QelMessage& message, TimePoint end);
+
+    /// Keeps a message for the next send() or flush().
+    /// @pre hasRoomFor() it
+    /// @throws as send(), when sending has failed before
+    void gather(const QelMessage& message);
+    /// Whether a message can be gathered. Those that go out together fit into one write that needs no more room than a
+    /// long message.
+    bool hasRoomFor(const QelMessage& message) const noexcept
+    {
+        return message.msgLength() <= kGatherBytes - mGathered;
+    }
+    /// Whether messages wait for flush().
+    bool hasGathered() const noexcept { return mGathered != 0; }
+    /// Sends what was gathered, as send() does; does nothing if there is nothing.
+    void flush(TimePoint end);
 
     /// Receives one message.
     /// @param begin  by when it must have begun
@@ -73,45 +96,43 @@ public:
     /// True when receive() may have bytes to read although the descriptor is not readable.
     bool hasPending() const;
     bool isProtected() const noexcept { return mTls != nullptr; }
+    /// What the peer said in TLS against this console's certificate; empty: nothing.
+    std::string certificateAlert() const;
 
-    /// As Console::leave(), and only until `end`. Sending and receiving fail from then on.
+    /// As Console::leave(), and only until `end`. Sends what was gathered if there is room for it. Sending and
+    /// receiving fail from then on.
     void leave(TimePoint end) noexcept;
 
 private:
-    /// What has arrived. On a plain connection it is read in large pieces: a short message takes one system call
-    /// instead of two. There it also limits the first byte of a message by one deadline and the rest by another; over
-    /// TLS receive() waits for the first byte.
+    /// What messages are read from: their first bytes, which were waited for, and the stream. Writes go to the stream.
     class Input : public Stream {
     public:
-        /// @param isDirect  over TLS: read no more than is asked for, since TLS keeps the rest
-        Input(Stream& stream, bool isDirect) : mStream(stream), mIsDirect(isDirect) {}
+        explicit Input(BufferedStream& stream) : mStream(stream) {}
 
-        /// A message may begin now.
-        /// @param frameTimeout  for the rest of it once it has begun
-        /// @param end           the same; whatever is earlier
-        void begin(std::chrono::milliseconds frameTimeout, TimePoint end);
-        bool hasBegun() const noexcept { return mHasBegun; }
-        bool hasBytes() const noexcept { return mFirst != mLast; }
+        /// Room for the first bytes, which must have been read.
+        std::array<char, sizeof(QelMessageStream::MessageHeader)>& firstBytes() noexcept { return mBytes; }
+        /// A message has begun with so many of them.
+        void begin(std::size_t count) noexcept;
 
         std::size_t read(char* buffer, std::size_t length) override;
+        void fill(char* buffer, std::size_t length) override;
         void write(const char* buffer, std::size_t length) override { mStream.write(buffer, length); }
         void close() override { mStream.close(); }
 
     private:
-        bool pFill();
-        void pNote(std::size_t count);
+        std::size_t pTake(char* buffer, std::size_t length) noexcept;
 
-        Stream& mStream;
-        const bool mIsDirect;
-        std::array<char, QelMessage::MtuMax> mBuffer;
-        std::size_t mFirst = 0; // of the bytes that were not asked for yet
+        BufferedStream& mStream;
+        std::array<char, sizeof(QelMessageStream::MessageHeader)> mBytes;
+        std::size_t mFirst = 0; // of the bytes in mBytes that were not read yet
         std::size_t mLast = 0;
-        std::chrono::milliseconds mFrameTimeout{0};
-        TimePoint mEnd;
-        bool mHasBegun = false;
     };
 
-    bool pHasInput() const;
+    bool pBegin(TimePoint begin, TimePoint end);
+    std::optional<std::size_t> pReadFirst(TimePoint begin, TimePoint end);
+    std::optional<std::size_t> pReadFirstOverTls(TimePoint begin);
+    bool pIsReadable() const;
+    bool pEndOutput() noexcept;
     void pAwaitEnd(TimePoint end);
     [[noreturn]] void pFail(const std::exception_ptr& failure);
     [[noreturn]] void pFailSending(const StreamIOException& error);
@@ -125,8 +146,12 @@ private:
     const std::string mServer;
     const std::chrono::milliseconds mFrameTimeout;
     CloseSwitch& mCloseSwitch;
+    const std::exception_ptr mHasLeft; // what calls throw after leave(), which cannot fail
+    BufferedStream mBuffered;          // over *mStream
     Input mInput;
     QelMessageStream mMessages;
+    std::size_t mGathered = 0;          // bytes in mBuffered that were not sent yet
+    bool mIsStarved = false;            // TLS holds a part of a record at most
     std::exception_ptr mSendFailure;    // set: sending throws it
     std::exception_ptr mReceiveFailure; // set: receiving throws it
 };

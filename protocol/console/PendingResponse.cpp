@@ -8,9 +8,22 @@
 
 namespace qel::protocol::detail {
 
+namespace {
+
+/// Made once: giving up a response cannot fail.
+const std::exception_ptr& givenUp()
+{
+    static const auto sError = std::make_exception_ptr(std::logic_error("the pending response was given up"));
+    return sError;
+}
+
+} // namespace
+
 PendingExchange::PendingExchange(std::shared_ptr<ConsoleCore> core, std::shared_ptr<Exchange> exchange) noexcept
     : mCore(std::move(core)), mExchange(std::move(exchange))
-{}
+{
+    static_cast<void>(givenUp());
+}
 
 PendingExchange::PendingExchange(PendingExchange&& other) noexcept = default;
 
@@ -46,7 +59,7 @@ void PendingExchange::pAbandon() noexcept
     mCore->abandon(*mExchange);
     // A handler does this while take() waits: what it waits for will not come.
     if (mExchange.use_count() == 1 || mExchange->isDone()) return;
-    mExchange->failure = std::make_exception_ptr(std::logic_error("the pending response was given up"));
+    mExchange->failure = givenUp();
 }
 
 } // namespace qel::protocol::detail

@@ -27,8 +27,7 @@ bool ReadAhead::awaitBytes(std::chrono::milliseconds timeout)
 
 std::size_t ReadAhead::read(char* buffer, std::size_t length)
 {
-    if (mHasEnded) return 0;
-    if (!hasBytes()) return mStream->read(buffer, length);
+    if (!hasBytes()) return mHasEnded || !mIsWaiting ? 0 : mStream->read(buffer, length);
     const std::size_t count = std::min(length, mLast - mFirst);
     std::memcpy(buffer, mBuffer.data() + mFirst, count);
     mFirst += count;

@@ -13,9 +13,10 @@ namespace qel::protocol {
 /// The stream under TLS: waits for bytes without TLS taking part.
 ///
 /// TLS cannot go on after a read that a deadline has ended. awaitBytes() reads into a buffer instead, so a deadline
-/// that passes there does no harm, and the next read() takes from the buffer. This costs no system call more than a
-/// read. Thread safety: as every stream; awaitBytes() and hasBytes() belong to the reader. close() as that of the
-/// stream below.
+/// that passes there does no harm, and the next read() takes from the buffer. With setWaiting(false) TLS takes from the
+/// buffer alone: so it is known whether the bytes hold data, or only a part of a record, or a record without data such
+/// as an update of keys. This costs no system call more than a read. Thread safety: as every stream; awaitBytes() and
+/// hasBytes() belong to the reader. close() as that of the stream below.
 class ReadAhead final : public Stream {
 public:
     explicit ReadAhead(std::unique_ptr<Stream> stream) : mStream(std::move(stream)) {}
@@ -28,6 +29,13 @@ public:
 
     /// True when bytes have been read ahead.
     bool hasBytes() const noexcept { return mFirst != mLast; }
+
+    /// True when the stream below has ended, as far as is known.
+    bool hasEnded() const noexcept { return mHasEnded; }
+
+    /// What read() does when nothing has been read ahead. True, the default: it reads from the stream below. False: it
+    /// returns 0, which an SSLStream takes for the end of its input, and then goes on as soon as there is more.
+    void setWaiting(bool isWaiting) noexcept { mIsWaiting = isWaiting; }
 
     std::size_t read(char* buffer, std::size_t length) override;
     void write(const char* buffer, std::size_t length) override { mStream->write(buffer, length); }
@@ -43,6 +51,7 @@ private:
     std::size_t mFirst = 0; // of the bytes that were read ahead
     std::size_t mLast = 0;
     bool mHasEnded = false;
+    bool mIsWaiting = true;
 };
 
 } // namespace qel::protocol

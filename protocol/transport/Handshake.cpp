@@ -3,13 +3,14 @@
 #include <qel/common/StreamFormatters.hpp>
 #include <qel/common/io/QelMessageStream.hpp>
 #include <qel/common/io/StreamIOException.hpp>
-#include <qel/common/util/TimeProvider.hpp>
 #include <qel/protocol/Error.hpp>
 #include <qel/protocol/Handshake.hpp>
 
+#include "base/MessageKind.hpp"
 #include "base/StreamFailure.hpp"
+#include "base/TimeLeft.hpp"
+#include "transport/TlsAlert.hpp"
 
-#include <algorithm>
 #include <cstring>
 #include <memory>
 #include <string>
@@ -18,14 +19,6 @@
 namespace qel::protocol {
 
 namespace {
-
-constexpr std::chrono::milliseconds kShortestWait(1);
-
-template <typename T>
-bool is(const QelMessage& message)
-{
-    return dynamic_cast<const T*>(&message) != nullptr;
-}
 
 [[noreturn]] void breakOff(const std::string& reason) { throw ProtocolBroken(reason); }
 
@@ -75,11 +68,17 @@ void expectSilence(int descriptor)
         throw CertificateRejected(CertificateRejected::Reason::TheirsByUs,
                                   "the peer's certificate is refused: " + refusal);
     }
+    const std::string alert = certificateAlert(stream);
+    if (!alert.empty()) {
+        throw CertificateRejected(CertificateRejected::Reason::OursByThem,
+                                  "the peer refuses this end's certificate: " + alert);
+    }
     if (isDeadline(error)) std::throw_with_nested(DeadlinePassed("the TLS handshake did not finish in time"));
     if (std::strncmp(error.what(), "SSL error", std::strlen("SSL error")) == 0) {
         breakOff(std::string("the TLS handshake failed: ") + error.what());
     }
-    // The peer sends no alert when it refuses a certificate: this end only sees the end of the stream.
+    // A peer that uses an SSLStream sends no alert when it refuses a certificate. This end then sees what it would see
+    // if the peer had crashed.
     std::throw_with_nested(ClosedByPeer(
         "the peer closed the connection in the TLS handshake, perhaps because it refuses this end's certificate: " +
         explain(error)));
@@ -89,9 +88,9 @@ void expectSilence(int descriptor)
 
 void limitTo(Stream& stream, std::chrono::steady_clock::time_point end)
 {
-    const auto left = std::chrono::duration_cast<std::chrono::milliseconds>(end - TimeProvider::steady());
-    stream.setReadDeadline(std::max(left, kShortestWait));
-    stream.setWriteDeadline(std::max(left, kShortestWait));
+    const std::chrono::milliseconds left = timeToTry(end);
+    stream.setReadDeadline(left);
+    stream.setWriteDeadline(left);
 }
 
 void requestUpgrade(Stream& stream, int descriptor)
@@ -100,11 +99,11 @@ void requestUpgrade(Stream& stream, int descriptor)
         send(stream, QelMessageUpgradeConnectionAsync());
         return receive(stream);
     });
-    if (is<QelMessageAbortHandshakeAsync>(*answer)) {
+    if (isKind<QelMessageAbortHandshakeAsync>(*answer)) {
         throw TurnedAway(
             "the server refused this console: it admits no more consoles, is stopping, or does not use TLS");
     }
-    if (!is<QelMessageUpgradeConnectionAsync>(*answer)) {
+    if (!isKind<QelMessageUpgradeConnectionAsync>(*answer)) {
         breakOff("the peer did not answer the request for TLS but sent something else: " +
                  toString(answer->getLogID()));
     }
@@ -114,7 +113,7 @@ void requestUpgrade(Stream& stream, int descriptor)
 void awaitUpgrade(Stream& stream, int descriptor)
 {
     const auto request = doStep("ask for TLS", [&] { return receive(stream); });
-    if (!is<QelMessageUpgradeConnectionAsync>(*request)) {
+    if (!isKind<QelMessageUpgradeConnectionAsync>(*request)) {
         abortHandshake(stream);
         breakOff("the peer did not ask for TLS but sent something else: " + toString(request->getLogID()));
     }

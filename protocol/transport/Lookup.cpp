@@ -14,6 +14,7 @@
 #include <netinet/in.h>
 #include <optional>
 #include <sys/socket.h>
+#include <system_error>
 #include <utility>
 
 namespace qel::protocol {
@@ -82,12 +83,17 @@ std::vector<IPEndpoint> lookUp(const std::string& host, std::uint16_t port,
 {
     const std::string name = host + ":" + std::to_string(port);
     const auto lookup = std::make_shared<Lookup>();
-    startThread([lookup, host, port, resolver = std::move(resolver)] {
-        LookupResult result = callSafely(resolver, host, port);
-        const MutexLock lock(lookup->mutex);
-        lookup->result = std::move(result);
-        lookup->answered.notifyAll();
-    }).detach();
+    try {
+        startThread([lookup, host, port, resolver = std::move(resolver)] {
+            LookupResult result = callSafely(resolver, host, port);
+            const MutexLock lock(lookup->mutex);
+            lookup->result = std::move(result);
+            lookup->answered.notifyAll();
+        }).detach();
+    } catch (const std::system_error& error) {
+        std::throw_with_nested(
+            NameNotResolved("cannot resolve the name " + host + ": no thread for it: " + error.what(), name));
+    }
     const std::optional<LookupResult> result = await(*lookup, deadline);
     if (!result) throw DeadlinePassed("the name " + host + " was not resolved in time", name);
     if (!result->endpoints.empty()) return result->endpoints;

@@ -42,13 +42,21 @@ public:
         mChanged.notifyAll();
     }
 
+    /// Ends the direction in which this end writes.
+    void endOutput(std::size_t self)
+    {
+        const MutexLock lock(mMutex);
+        mBytes[1 - self].hasEnded = true;
+        mChanged.notifyAll();
+    }
+
     std::size_t read(std::size_t self, char* buffer, std::size_t length, StreamDeadline& deadline)
     {
         const auto timeout = deadline.getEffectiveTimeout();
         const auto end = endOf(timeout);
         UniqueMutexLock lock(mMutex);
         Bytes& bytes = mBytes[self];
-        while (length != 0 && bytes.size() == 0 && !mClosed)
+        while (length != 0 && bytes.size() == 0 && !bytes.hasEnded && !mClosed)
             pWait(lock, timeout, end);
         const std::size_t count = std::min(length, bytes.size());
         std::copy_n(bytes.text.data() + bytes.first, count, buffer);
@@ -68,9 +76,9 @@ public:
         UniqueMutexLock lock(mMutex);
         Bytes& bytes = mBytes[1 - self];
         while (length != 0) {
-            while (!mClosed && bytes.size() >= mCapacity)
+            while (!mClosed && !bytes.hasEnded && bytes.size() >= mCapacity)
                 pWait(lock, timeout, end);
-            if (mClosed) throw StreamIOException("EOF");
+            if (mClosed || bytes.hasEnded) throw StreamIOException("EOF");
             bytes.text.erase(0, bytes.first);
             bytes.first = 0;
             const std::size_t count = std::min(length, mCapacity - bytes.text.size());
@@ -90,7 +98,7 @@ public:
         for (;;) {
             const std::size_t room = mCapacity - mBytes[1 - self].size();
             const Ready ready{mClosed || room >= std::min(mCapacity, kWholeMessage),
-                              wantsToReceive && (mClosed || mBytes[self].size() != 0)};
+                              wantsToReceive && (mClosed || mBytes[self].hasEnded || mBytes[self].size() != 0)};
             if (ready.send || ready.receive) return ready;
             if (!isLimited) {
                 mChanged.wait(lock);
@@ -108,6 +116,7 @@ private:
 
         std::string text;
         std::size_t first = 0; // the first byte that was not read
+        bool hasEnded = false; // no more will be written
     };
 
     void pWait(UniqueMutexLock& lock, std::chrono::milliseconds timeout, steady_clock::time_point end)
@@ -144,6 +153,7 @@ public:
     {
         return mLink->awaitReady(mSelf, wantsToReceive, timeout);
     }
+    void endOutput() noexcept override { mLink->endOutput(mSelf); }
 
 private:
     const std::shared_ptr<Link> mLink;

@@ -19,6 +19,9 @@ public:
     /// @return neither: not in this time
     virtual Ready awaitReady(bool wantsToReceive, std::chrono::milliseconds timeout) = 0;
 
+    /// Ends the outgoing direction, as shutdown(2) with SHUT_WR: the peer reads what was sent and then the end.
+    virtual void endOutput() noexcept = 0;
+
 protected:
     ~Readiness() = default;
 };

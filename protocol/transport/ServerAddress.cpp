@@ -3,6 +3,7 @@
 #include <qel/protocol/Error.hpp>
 #include <qel/protocol/ServerAddress.hpp>
 
+#include "base/TimeLeft.hpp"
 #include "transport/Lookup.hpp"
 
 #include <algorithm>
@@ -16,9 +17,6 @@ namespace qel::protocol {
 
 namespace {
 
-using TimePoint = std::chrono::steady_clock::time_point;
-
-constexpr std::chrono::milliseconds kShortestWait(1);
 constexpr std::size_t kMaxHostLength = 255; // RFC 1123, 2.1
 
 [[noreturn]] void refuse(const std::string& text, const char* reason)

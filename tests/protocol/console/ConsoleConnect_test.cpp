@@ -12,16 +12,23 @@
 #include "support/CapturedLog.hpp"
 #include "support/Errors.hpp"
 #include "support/Loopback.hpp"
+#include "support/LoopbackEnds.hpp"
+#include "support/RawTlsPeer.hpp"
+#include "support/TlsCalls.hpp"
 
 #include <cctype>
 #include <chrono>
 #include <functional>
 #include <gmock/gmock.h>
 #include <memory>
+#include <netinet/in.h>
+#include <netinet/tcp.h>
 #include <optional>
 #include <stdexcept>
 #include <string>
+#include <sys/socket.h>
 #include <thread>
+#include <utility>
 #include <vector>
 
 namespace qel::test {
@@ -66,13 +73,19 @@ TEST(ConsoleOptions, AWrongOneIsNamed)
              options.retry = Backoff();
              options.retry->first = milliseconds(-1);
          },
-         "retry: the first wait is negative or longer than the longest"},
+         "retry: the first wait is not positive"},
+        {"NoBackoff",
+         [](auto& options) {
+             options.retry = Backoff();
+             options.retry->first = milliseconds(0);
+         },
+         "retry: the first wait is not positive"},
         {"BackoffBeyondTheLongest",
          [](auto& options) {
              options.retry = Backoff();
              options.retry->first = milliseconds(30001);
          },
-         "retry: the first wait is negative or longer than the longest"},
+         "retry: the first wait is longer than the longest"},
         {"ShrinkingBackoff",
          [](auto& options) {
              options.retry = Backoff();
@@ -144,6 +157,35 @@ TEST(ConsoleConnect, ByAddress)
     EXPECT_EQ(console.version().getSystemMachineType(), "type");
     EXPECT_FALSE(console.isProtected());
     EXPECT_GE(console.getPollFd(PollEvents::Read).mFd.fd, 0);
+}
+
+int tcpOption(const Console& console, int name)
+{
+    int value = -1;
+    socklen_t length = sizeof(value);
+    EXPECT_EQ(::getsockopt(console.getPollFd(PollEvents::Read).mFd.fd, IPPROTO_TCP, name, &value, &length), 0);
+    return value;
+}
+
+TEST(ConsoleConnect, AServerMayTakeAnyTimeToRead)
+{
+    // A SocketStream would cut the connection when the server, which is alive, has had no room for data for 60 s.
+    const OneConsoleServer server;
+    const Console console(consoleOptions(Cover::Plain, "127.0.0.1:" + server.port()));
+    EXPECT_EQ(tcpOption(console, TCP_USER_TIMEOUT), 0);
+    EXPECT_EQ(tcpOption(console, TCP_KEEPIDLE), 30) << "a server that is gone is still found out";
+}
+
+TEST(ConsoleConnect, AServerMayTakeAnyTimeToReadFromASocketOfTheUsers)
+{
+    Loopback loopback;
+    std::thread server([&] {
+        LoopbackMessages messages(*loopback.far);
+        welcome(messages);
+    });
+    const Console console(std::move(loopback.near), consoleOptions(Cover::Plain));
+    server.join();
+    EXPECT_EQ(tcpOption(console, TCP_USER_TIMEOUT), 0);
 }
 
 TEST(ConsoleConnect, ByNameWhereNotEveryAddressAnswers)
@@ -351,20 +393,85 @@ void expectRejection(const std::function<void()>& connect, CertificateRejected::
     }
 }
 
-TEST_F(ConsoleHandshake, APeerThatClosesInsideTlsMayNotAcceptOurCertificate)
+TEST_F(ConsoleHandshake, APeerThatClosesInsideTlsHasCrashedOrDoesNotAcceptOurCertificate)
 {
     const std::string text = "the server closed the connection right after the TLS handshake; it may not accept this "
                              "console's certificate: EOF";
-    expectRejection([&] { connect([](auto stream) { takeCover(Cover::Tls, std::move(stream)); }); },
-                    CertificateRejected::Reason::OursByThem, text);
-    expectRejection(
-        [&] {
-            connect([](auto stream) {
-                const auto tls = takeCover(Cover::Tls, std::move(stream));
-                LoopbackMessages(*tls).receive();
-            });
-        },
-        CertificateRejected::Reason::OursByThem, text);
+    EXPECT_THAT([&] { connect([](auto stream) { takeCover(Cover::Tls, std::move(stream)); }); },
+                failsWith<ClosedByPeer>(text));
+    const auto takingTheRequest = [](auto stream) {
+        const auto tls = takeCover(Cover::Tls, std::move(stream));
+        LoopbackMessages(*tls).receive();
+    };
+    EXPECT_THAT([&] { connect(takingTheRequest); }, failsWith<ClosedByPeer>(text));
+}
+
+TEST_F(ConsoleHandshake, AnAlertInTheTlsHandshakeRejectsOurCertificate)
+{
+    // In TLS 1.3 the console's handshake is complete when the server sees the certificate.
+    SSLCredentials credentials = Authority::trusted().serverCredentials();
+    credentials.mRootCA = Authority::stranger().serverCredentials().mRootCA;
+    const auto refusing = [&credentials](auto stream) {
+        takeRequest(*stream);
+        grantUpgrade(*stream);
+        RawTlsPeer::Options options;
+        options.credentials = &credentials;
+        RawTlsPeer peer(RawTlsPeer::Server, options, std::move(stream));
+        EXPECT_FALSE(peer.handshake());
+        takeAll(peer.stream());
+    };
+    expectRejection([&] { connect(refusing); }, CertificateRejected::Reason::OursByThem,
+                    "no protected connection to memory:1: the peer refuses this end's certificate: unknown CA \\(TLS "
+                    "alert 48\\)");
+}
+
+TEST_F(ConsoleHandshake, AnAlertInTheIntroductionRejectsOurCertificate)
+{
+    const SSLCredentials credentials = Authority::trusted().serverCredentials();
+    const auto refusing = [&credentials](char alert) {
+        return [&credentials, alert](auto stream) {
+            takeRequest(*stream);
+            grantUpgrade(*stream);
+            RawTlsPeer::Options options;
+            options.credentials = &credentials;
+            RawTlsPeer peer(RawTlsPeer::Server, options, std::move(stream));
+            EXPECT_TRUE(peer.handshake());
+            peer.exchangeVersions();
+            peer.sendBytes(peer.protectedRecord(21, {2, alert}));
+            takeAll(peer.stream());
+        };
+    };
+    constexpr char kAccessDenied = 49;
+    constexpr char kInternalError = 80;
+    expectRejection([&] { connect(refusing(kAccessDenied)); }, CertificateRejected::Reason::OursByThem,
+                    "the server refuses this console's certificate: access denied \\(TLS alert 49\\)");
+    EXPECT_THAT([&] { connect(refusing(kInternalError)); },
+                failsWith<ClosedByPeer>("the server closed the connection right after the TLS handshake; it may not "
+                                        "accept this console's certificate: SSL error 1"));
+}
+
+TEST_F(ConsoleHandshake, APeerThatAbortsInsideTlsTurnsTheConsoleAway)
+{
+    const auto aborting = [](auto stream) {
+        const auto tls = takeCover(Cover::Tls, std::move(stream));
+        LoopbackMessages messages(*tls);
+        messages.receive();
+        messages.send(QelMessageAbortHandshakeAsync());
+    };
+    EXPECT_THAT([&] { connect(aborting); }, failsWith<TurnedAway>("the server turned this console away inside TLS"));
+}
+
+TEST_F(ConsoleHandshake, AFailureOfOpenSslIsAnError)
+{
+    const OtherEnd::Play granting = [](auto stream) {
+        takeRequest(*stream);
+        grantUpgrade(*stream);
+        takeAll(*stream);
+    };
+    TlsCalls calls;
+    calls.BIO_new_bio_pair = [](BIO**, std::size_t, BIO**, std::size_t) { return 0; };
+    EXPECT_THAT([&] { connect(granting); },
+                failsWith<Error>(StartsWith("no protected connection to memory:1: An SSL error occurred at ")));
 }
 
 TEST_F(ConsoleHandshake, APeerThatSaysWhyItClosesInsideTlsIsBelieved)

@@ -10,6 +10,7 @@
 #include <qel/protocol/Error.hpp>
 
 #include "protocol/console/ConsoleFixture.hpp"
+#include "support/Allocations.hpp"
 #include "support/Errors.hpp"
 #include "support/SettableClock.hpp"
 
@@ -288,6 +289,21 @@ TEST_F(ConsoleEnd, AfterLeavingEveryCallFails)
     console.leave();
     EXPECT_THAT([&] { console.request(request); }, failsWith<Error>("this console has left"));
     EXPECT_THAT([&] { console.process(); }, failsWith<Error>("this console has left"));
+}
+
+TEST_F(ConsoleEnd, LeavingAndDestroyingNeedNoMemory)
+{
+    QEL_TEST_NEEDS_ALLOCATIONS();
+    auto pending = std::make_optional(console.start(request));
+    std::optional<Console> owned(std::move(console));
+    {
+        Allocations allocations;
+        allocations.failAll();
+        owned->leave();
+        pending.reset();
+        owned.reset();
+    }
+    console = FakeHypervisorEnd::makeConsole(end);
 }
 
 TEST_F(ConsoleEnd, AfterClosingEveryCallFails)

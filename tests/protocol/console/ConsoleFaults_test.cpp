@@ -74,6 +74,7 @@ struct Fault {
     const char* type;
     std::string text;
     bool isStall = false;
+    std::string tlsText = {}; ///< instead of text, over TLS
 };
 
 void PrintTo(const Fault& fault, std::ostream* os) { *os << fault.name; }
@@ -95,7 +96,8 @@ const std::vector<Fault>& faults()
          [](Messages& messages, const QelMessage&) { messages.send(QelMessageKrogConnectionClosedAsync()); },
          "ClosedByPeer", "the server closed the connection"},
         {"TurnsAway", [](Messages& messages, const QelMessage&) { messages.send(QelMessageAbortHandshakeAsync()); },
-         "TurnedAway", "the server refused the connection: it accepts only TLS"},
+         "TurnedAway", "the server refused the connection: it accepts only TLS", false,
+         "the server turned this console away inside TLS"},
         {"SendsGarbage", [](Messages& messages, const QelMessage&) { messages.sendBytes(std::string(100, 'x')); },
          "ProtocolBroken", broken + "Invalid length"},
         {"SendsAFrameWithAWrongEyecatcher",
@@ -206,7 +208,8 @@ TEST_P(ConsoleFaults, EndInTheRightError)
     operation.prepare(console, session);
     const Thrown first = thrownBy([&, run = operation.run] { run(console, session); });
     EXPECT_EQ(first.type, fault.type);
-    EXPECT_EQ(first.text, fault.isStall ? operation.stallText : fault.text);
+    const std::string text = cover == Cover::Tls && !fault.tlsText.empty() ? fault.tlsText : fault.text;
+    EXPECT_EQ(first.text, fault.isStall ? operation.stallText : text);
     if (fault.isStall) return;
     const Thrown second = thrownBy([&] { console.request(QelMessageGetQelTodReq()); });
     EXPECT_EQ(second.type, first.type) << "the same again";

@@ -14,6 +14,7 @@
 
 #include <array>
 #include <chrono>
+#include <cstddef>
 #include <functional>
 #include <gmock/gmock.h>
 #include <memory>
@@ -186,6 +187,44 @@ TEST_F(ConsoleLimits, TakingLeaveHasADeadline)
     }
 }
 
+/// A stream without a descriptor that knows what it can do. Notes the steps of taking leave.
+class LeavingStream final : public Stream, public Readiness {
+public:
+    explicit LeavingStream(std::vector<std::string>& steps) : mSteps(steps) {}
+
+    void close() override { mSteps.emplace_back("close"); }
+    void setReadDeadline(milliseconds timeout) override
+    {
+        mSteps.push_back("limit " + std::to_string(timeout.count()));
+    }
+    void setWriteDeadline(milliseconds) override {}
+    std::size_t read(char*, std::size_t) override
+    {
+        mSteps.emplace_back("read");
+        return 0;
+    }
+    void write(const char*, std::size_t) override { mSteps.emplace_back("write"); }
+    Ready awaitReady(bool, milliseconds) override { return {true, false}; }
+    void endOutput() noexcept override { mSteps.emplace_back("end output"); }
+
+private:
+    std::vector<std::string>& mSteps;
+};
+
+TEST(ConsoleLeaving, OverAStreamWithoutADescriptorWaitsForThePeerToo)
+{
+    const SettableClock clock;
+    std::vector<std::string> steps;
+    CloseSwitch closeSwitch;
+    auto stream = std::make_unique<LeavingStream>(steps);
+    ConnectedStream connected;
+    connected.readiness = stream.get();
+    connected.stream = std::move(stream);
+    FrameLink link(std::move(connected), "fake:1", milliseconds(1000), closeSwitch);
+    link.leave(TimePoint::max());
+    EXPECT_THAT(steps, ElementsAre("end output", "limit 1000", "read", "close"));
+}
+
 TEST(ConsoleTimeouts, MayBeAsLongAsAnybodyLikes)
 {
     ConsoleOptions options = FakeHypervisorEnd::plainOptions();
@@ -340,6 +379,17 @@ TEST_F(ConsoleLimits, ASessionThatIsFullCanBeClosed)
     };
     EXPECT_NO_THROW(session.close());
     EXPECT_EQ(session.getAvailable(), 13U);
+}
+
+TEST_F(ConsoleLimits, ASessionThatMayHoldNothingIsRefused)
+{
+    SerialOptions options;
+    options.maxUnread = 0;
+    EXPECT_THAT([&] { console.openSerial(1, options); },
+                ThrowsMessage<std::invalid_argument>(StrEq("maxUnread: zero")));
+    EXPECT_THAT(end->received, IsEmpty());
+    options.maxUnread = 1;
+    EXPECT_NO_THROW(console.openSerial(1, options));
 }
 
 TEST_F(ConsoleLimits, ASessionThatWasNotClosedInTimeHasItsLimitAgain)

@@ -185,7 +185,7 @@ TEST_P(ConsoleOverSocket, ManySmallMessagesAreAllSeenByAPollLoop)
     });
     while (next < kMessages) {
         poll();
-        EXPECT_TRUE(console->process());
+        console->process(); // over TLS there may be a part of a record only
     }
 }
 

@@ -39,8 +39,8 @@ class FakeServer {
 public:
     using Way = std::function<void(LoopbackMessages&)>;
 
-    explicit FakeServer(std::vector<Way> ways)
-        : mWays(std::move(ways)), mListener(makeListener()), mThread([this] { pServe(); })
+    explicit FakeServer(std::vector<Way> ways, Cover cover = Cover::Plain)
+        : mWays(std::move(ways)), mCover(cover), mListener(makeListener()), mThread([this] { pServe(); })
     {}
     ~FakeServer()
     {
@@ -62,12 +62,14 @@ private:
     void pServe()
     {
         for (;;) {
-            SocketStream stream(mListener.accept());
+            auto socket = std::make_unique<SocketStream>(mListener.accept());
             if (mStopping) return;
             const unsigned int number = mConnections++;
-            stream.setReadDeadline(Loopback::kDeadline);
-            LoopbackMessages messages(stream);
+            socket->setReadDeadline(Loopback::kDeadline);
+            const int descriptor = socket->getSocket().getFd();
             try {
+                const auto stream = takeCover(mCover, std::move(socket), descriptor);
+                LoopbackMessages messages(*stream);
                 mWays[std::min<std::size_t>(number, mWays.size() - 1)](messages);
             } catch (const std::exception&) { // the console has gone
             }
@@ -75,6 +77,7 @@ private:
     }
 
     const std::vector<Way> mWays;
+    const Cover mCover;
     std::atomic<unsigned int> mConnections{0};
     std::atomic<bool> mStopping{false};
     Socket mListener;
@@ -130,6 +133,19 @@ TEST(Retry, GoesOnWhereWaitingMayHelp)
     EXPECT_EQ(server.connections(), 5U);
     EXPECT_NO_THROW(console.exchange(QelMessageGetQelTodReq()));
     EXPECT_THAT(log.lines(), Contains(MatchesRegex("I: \\[qel\\] connection lost: .*; next attempt in [12] ms")));
+}
+
+TEST(Retry, GoesOnWhenAServerIsGoneInTheIntroductionOverTls)
+{
+    const CapturedLog log(LogLevel::Info);
+    const FakeServer server({closeAtOnce, [](LoopbackMessages& messages) { messages.receive(); }, serveUntilTheEnd},
+                            Cover::Tls);
+    ConsoleOptions options = impatientOptions(server);
+    options.plain = false;
+    options.credentials = consoleCredentials();
+    Console console(options);
+    EXPECT_EQ(server.connections(), 3U);
+    EXPECT_NO_THROW(console.exchange(QelMessageGetQelTodReq()));
 }
 
 TEST(Retry, EndsWhereWaitingDoesNotHelp)

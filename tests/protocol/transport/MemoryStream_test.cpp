@@ -57,6 +57,21 @@ TEST(MemoryStream, ReadsAtMostWhatWasAskedForAndKeepsTheRest)
     EXPECT_EQ(other->read(&none, 0), 0U);
 }
 
+TEST(MemoryStream, OneDirectionCanEndAlone)
+{
+    const auto streams = makeMemoryStreams();
+    const auto& one = streams.first;
+    const auto& other = streams.second;
+    write(*one, "last");
+    dynamic_cast<Readiness&>(*one).endOutput();
+    EXPECT_THAT([&] { write(*one, "x"); }, ThrowsMessage<StreamIOException>(StrEq("EOF")));
+    EXPECT_EQ(readSome(*other), "last");
+    EXPECT_TRUE(dynamic_cast<Readiness&>(*other).awaitReady(true, kShort).receive);
+    EXPECT_EQ(readSome(*other), "");
+    write(*other, "back");
+    EXPECT_EQ(readSome(*one), "back");
+}
+
 TEST(MemoryStream, AReaderWaitsForBytes)
 {
     const auto streams = makeMemoryStreams();

@@ -9,7 +9,9 @@
 #include <cerrno>
 #include <future>
 #include <gmock/gmock.h>
+#include <pthread.h>
 #include <stdexcept>
+#include <system_error>
 
 namespace qel::test {
 
@@ -23,6 +25,30 @@ using testing::ElementsAre;
 using testing::MatchesRegex;
 using testing::StrEq;
 using testing::ThrowsMessage;
+
+/// From construction to destruction no thread can be started: there is no room for a stack of this size.
+class NoThreads {
+public:
+    NoThreads()
+    {
+        EXPECT_EQ(::pthread_getattr_default_np(&mBefore), 0);
+        pthread_attr_t attributes;
+        ::pthread_attr_init(&attributes);
+        EXPECT_EQ(::pthread_attr_setstacksize(&attributes, std::size_t{1} << 60), 0);
+        EXPECT_EQ(::pthread_setattr_default_np(&attributes), 0);
+        ::pthread_attr_destroy(&attributes);
+    }
+    ~NoThreads()
+    {
+        ::pthread_setattr_default_np(&mBefore);
+        ::pthread_attr_destroy(&mBefore);
+    }
+    NoThreads(const NoThreads&) = delete;
+    NoThreads& operator=(const NoThreads&) = delete;
+
+private:
+    pthread_attr_t mBefore;
+};
 
 std::chrono::steady_clock::time_point soon() { return TimeProvider::steady() + std::chrono::seconds(20); }
 
@@ -140,6 +166,19 @@ TEST(LookUp, AResolverThatThrowsHasFailed)
     const auto throws = [](const std::string&, std::uint16_t) -> LookupResult { throw std::bad_alloc(); };
     EXPECT_THAT([&] { protocol::lookUp("h", 7, soon(), throws); },
                 failsWith<protocol::NameNotResolved>("cannot resolve the name h: it has no address"));
+}
+
+TEST(LookUp, WithoutAThreadNoNameIsResolved)
+{
+    const NoThreads noThreads;
+    const auto unused = [](const std::string&, std::uint16_t) { return LookupResult(); };
+    try {
+        protocol::lookUp("h", 7, soon(), unused);
+        ADD_FAILURE() << "resolved";
+    } catch (const protocol::NameNotResolved& error) {
+        EXPECT_STREQ(error.what(), "cannot resolve the name h: no thread for it: Resource temporarily unavailable");
+        EXPECT_THROW(std::rethrow_if_nested(error), std::system_error);
+    }
 }
 
 TEST(LookUp, AResolverThatHangsDoesNotHoldTheCallerBeyondTheDeadline)

@@ -1,6 +1,8 @@
+#include "base/Failures.hpp"
 #include "client/ConnectOptions.hpp"
 
-#include <gtest/gtest.h>
+#include <gmock/gmock.h>
+#include <stdexcept>
 #include <string>
 #include <vector>
 
@@ -69,6 +71,18 @@ TEST(ConnectOptions, BadConnectOptionsAreRefused)
     };
     for (const auto& arguments : bad)
         EXPECT_NE(parse(arguments).status, 0) << CLI::detail::join(arguments, " ");
+}
+
+TEST(ConnectConsole, OnlyAPlainConnectionToAnotherMachineIsAMistakeOfTheUser)
+{
+    tool::ConnectOptions options;
+    options.server = "192.0.2.1:80";
+    options.transport.plain = true;
+    EXPECT_THAT([&] { tool::connectConsole(options); },
+                ::testing::ThrowsMessage<tool::CommandFailure>(::testing::HasSubstr("192.0.2.1:80")));
+    options.identity.toolId = std::string(33, 'x'); // the parser would have refused it
+    EXPECT_THAT([&] { tool::connectConsole(options); }, ::testing::ThrowsMessage<std::invalid_argument>(
+                                                            ::testing::StrEq("identity.toolId: longer than 32 bytes")));
 }
 
 TEST(ConnectOptions, TheToolTypeMayHaveLeadingZeros)

@@ -1,14 +1,14 @@
 #include "client/ConnectOptions.hpp"
 
 #include <qel/common/net/IPEndpoint.hpp>
+#include <qel/common/util/Poll.hpp>
 #include <qel/common/util/TimeProvider.hpp>
 #include <qel/protocol/ServerAddress.hpp>
 
 #include "base/Failures.hpp"
 #include "base/OptionChecks.hpp"
 
-#include <algorithm>
-#include <cstddef>
+#include <cstring>
 #include <limits>
 #include <stdexcept>
 
@@ -16,7 +16,6 @@ namespace qel::tool {
 
 namespace {
 
-constexpr std::size_t kToolIdBytes = 32;
 constexpr double kMinTimeout = 0.001;
 constexpr double kMaxTimeout = 24 * 60 * 60;
 
@@ -54,7 +53,7 @@ void addConnectOptions(CLI::App& app, ConnectOptions& options)
         ->capture_default_str();
     app.add_option("--tool-id", options.identity.toolId,
                    "Tool id of this console, at most 32 bytes (default: qel-<process id>)")
-        ->check(textUpTo(kToolIdBytes));
+        ->check(textUpTo(Identity::kMaxToolIdBytes));
 }
 
 void checkConnect(const ConnectOptions& options)
@@ -65,8 +64,7 @@ void checkConnect(const ConnectOptions& options)
 
 std::chrono::milliseconds timeLeft(std::chrono::steady_clock::time_point end)
 {
-    const auto left = std::chrono::duration_cast<std::chrono::milliseconds>(end - TimeProvider::steady());
-    return std::max(left, std::chrono::milliseconds(0));
+    return PollDeadline(end).getTimeout(TimeProvider::steady());
 }
 
 Console connectConsole(const ConnectOptions& options)
@@ -81,7 +79,9 @@ Console connectConsole(const ConnectOptions& options)
     library.frameTimeout = options.timeout();
     try {
         return Console(library, options.timeout());
-    } catch (const std::invalid_argument&) { // the one mistake that the parser cannot see
+    } catch (const std::invalid_argument& error) {
+        // The one mistake that the parser cannot see: the name means an address of another machine.
+        if (std::strncmp(error.what(), "plain:", std::strlen("plain:")) != 0) throw;
         throw CommandFailure(ExitStatus::Usage, plainRefusal(options.server));
     }
 }

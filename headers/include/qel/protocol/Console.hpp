@@ -48,18 +48,17 @@ namespace qel::protocol {
 /// use any more. A message that could not be sent in its time ends sending, since a part of it may have been sent;
 /// SerialSession::write() begins a message only when there is room. A peer that goes on sending other messages extends
 /// no deadline. Independently of that, a message has ConsoleOptions::frameTimeout from its first byte to its last. Over
-/// TLS a peer that updates its keys begins a message by that: when no message follows within the frame timeout, the
-/// connection ends.
+/// TLS its first byte is the first one that is decrypted: a peer that updates its keys begins no message by that.
 ///
 /// **Failures.** What the calls throw: StatusError, a response with a status other than zero; DeadlinePassed;
 /// ClosedByPeer, the connection broke or the hypervisor closed it, with or without its notice; TurnedAway, the
-/// hypervisor accepts only TLS; ProtocolBroken, a malformed message, or a response to no request or of another kind
-/// than its request; LimitReached, see below; Error, close() or leave() has been called. PosixError, when the system
-/// cannot wait for a descriptor, passes unchanged. StatusError, LimitReached, a harmless DeadlinePassed, and
-/// ProtocolBroken for a response whose payload alone is malformed leave the connection as it was. After any other
-/// failure the connection is of no use: every call throws the same again, until reconnect(). There is one exception: on
-/// a connection without TLS, messages can still be received after sending has failed, as the hypervisor may have sent
-/// the reason.
+/// hypervisor accepts only TLS, or sent its abort message inside TLS; ProtocolBroken, a malformed message, or a
+/// response to no request or of another kind than its request; LimitReached, see below; Error, close() or leave() has
+/// been called. PosixError, when the system cannot wait for a descriptor, passes unchanged. StatusError, LimitReached,
+/// a harmless DeadlinePassed, and ProtocolBroken for a response whose payload alone is malformed leave the connection
+/// as it was. After any other failure the connection is of no use: every call throws the same again, until reconnect().
+/// There is one exception: on a connection without TLS, messages can still be received after sending has failed, as the
+/// hypervisor may have sent the reason.
 ///
 /// **Limits.** At most 4096 requests can be under way. A session keeps the output that is not read, up to
 /// SerialOptions::maxUnread; beyond that the calls that receive throw LimitReached until it is read;
@@ -79,23 +78,42 @@ public:
     ///
     /// With ConsoleOptions::retry it tries again after NameNotResolved, CannotConnect, TurnedAway, ClosedByPeer,
     /// DeadlinePassed, and after a StatusError that says that the server takes no more consoles or knows one with this
-    /// identity. When the attempts or the time are used up, the last failure is thrown.
+    /// identity. When the attempts or the time are used up, the last failure is thrown. A server that closes the
+    /// connection in the handshake and says nothing may have crashed, and is tried again; a server of this library that
+    /// does not accept the console's certificate closes in the same way.
     /// @param timeout  for all of it
     /// @throws std::invalid_argument  names the option: "server", "credentials" (neither credentials nor plain),
     ///         "plain" (also with credentials or for an address that is not a loopback address), "pins" (with plain),
     ///         "identity.toolId", "handshakeTimeout", "requestTimeout", "frameTimeout", "retry"
     /// @throws NameNotResolved, CannotConnect  no connection: "cannot connect to SERVER: ..."
-    /// @throws CertificateRejected  ours by the server, theirs by us, or by a pin
+    /// @throws CertificateRejected  ours by the server, which said so with a TLS alert; theirs by us, or by a pin
     /// @throws TurnedAway, DeadlinePassed, ClosedByPeer, ProtocolBroken  in the handshake: "no protected connection to
     ///         SERVER: ...", or in the introduction
     /// @throws StatusError  the response to the version request
+    /// @throws Error  OpenSSL fails, as a rule for want of memory: "no protected connection to SERVER: ...";
+    /// SSLException
+    ///         is nested
+    /// @throws SSLException  OpenSSL cannot use the credentials
+    /// @throws PosixError  the system cannot wait for a descriptor
     explicit Console(const ConsoleOptions& options, std::chrono::milliseconds timeout = std::chrono::seconds(10));
 
     /// The same over a stream of one's own, such as one end of makeMemoryStreams(); it is protected as the options say.
     /// Here a plain connection is not limited to loopback addresses, and the server of the options is only the name for
     /// texts. Cannot reconnect().
+    ///
+    /// A stream without a descriptor, other than one of makeMemoryStreams(), cannot say what it could do at once. Over
+    /// such a stream every message is sent when its turn comes, and the call waits in Stream::write(), where it
+    /// receives nothing: a peer that sends all it has before it reads, such as one that echoes a long input, and this
+    /// console then wait for each other until the write deadline ends the connection. leave() cannot wait for the peer
+    /// either. Such a stream needs room for all that is under way, or a descriptor that poll(2) reports as readable and
+    /// writable when the stream is.
+    ///
+    /// A SocketStream loses its user timeout of 60 s, as the sockets do that a console connects: a server that answers
+    /// and takes no data, because nobody reads it, is not cut. A server that is gone is still found by the keep-alive,
+    /// or by the system's retransmission limits while data waits for it.
     /// @param stream  connected, not yet protected, not null, with deadlines, and close() from any thread
     /// @param descriptor  of the stream, to wait on; -1: none. That of a SocketStream need not be given
+    /// @throws std::invalid_argument  "stream: null"; and what the other constructor throws, except for the address
     Console(std::unique_ptr<Stream> stream, const ConsoleOptions& options,
             std::chrono::milliseconds timeout = std::chrono::seconds(10), int descriptor = -1);
 
@@ -190,6 +208,7 @@ public:
 
     /// Opens the virtual serial session of a partition and sets it up for data; opens the hypervisor session if needed.
     /// @param timeout  for all of it
+    /// @throws std::invalid_argument  "maxUnread: zero"
     SerialSession openSerial(std::uint16_t partition, const SerialOptions& options = SerialOptions());
     SerialSession openSerial(std::uint16_t partition, const SerialOptions& options, std::chrono::milliseconds timeout);
 
@@ -218,6 +237,7 @@ public:
     void reconnect(std::chrono::milliseconds timeout);
 
     /// Ends the connection gracefully: ends the outgoing stream and waits up to a second for the peer to do the same.
+    /// Over a stream that can neither be shut down nor tell what it can do (see the constructor), closes it at once.
     /// After that the hypervisor has released this console's name and place, so that the next console does not collide
     /// with one that has left.
     void leave() noexcept;

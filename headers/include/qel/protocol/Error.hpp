@@ -40,7 +40,7 @@ private:
     std::string mPeer;
 };
 
-/// The name of the server has no address, or the system's resolver failed.
+/// The name of the server has no address, the system's resolver failed, or there was no thread to ask it.
 class QEL_PROTOCOL_EXPORT NameNotResolved : public Error {
 public:
     using Error::Error;
@@ -62,7 +62,8 @@ public:
 };
 
 /// The hypervisor answered the request for TLS with the abort message: it takes no more consoles, is stopping, or does
-/// not use TLS; or it accepts only TLS and the request came without.
+/// not use TLS. Or it sent this message later: it accepts only TLS and the request came without, or it turned the
+/// console away inside TLS.
 class QEL_PROTOCOL_EXPORT TurnedAway : public Error {
 public:
     using Error::Error;
@@ -93,9 +94,9 @@ class QEL_PROTOCOL_EXPORT CertificateRejected : public Error {
 public:
     /// Whose certificate, and why.
     enum class Reason {
-        OursByThem, ///< the peer seems not to accept this end's certificate: it closed the connection in the handshake
-        TheirsByUs, ///< the root did not issue the peer's certificate, or it is not valid now
-        NamePin,    ///< the peer's name is none of the pinned ones
+        OursByThem,     ///< the peer said with a TLS alert that it does not accept this end's certificate
+        TheirsByUs,     ///< the root did not issue the peer's certificate, or it is not valid now
+        NamePin,        ///< the peer's name is none of the pinned ones
         FingerprintPin, ///< the fingerprint of the peer's certificate is none of the pinned ones
     };
 
@@ -116,7 +117,8 @@ public:
     ~DeadlinePassed() override;
 };
 
-/// The peer closed the connection, or the connection broke.
+/// The peer closed the connection, or the connection broke. A server of this library that refuses a console's
+/// certificate closes the connection and says nothing, so a console sees that in the same way.
 class QEL_PROTOCOL_EXPORT ClosedByPeer : public Error {
 public:
     using Error::Error;

@@ -29,11 +29,12 @@ enum class SessionEnd {
 /// The end in words, for people. Thread safety: any thread.
 QEL_PROTOCOL_EXPORT const char* describe(SessionEnd end);
 
-/// How to open a virtual serial session.
+/// How to open a virtual serial session. The caller makes this struct, so its layout is part of the binary interface: a
+/// new member needs a new soname.
 struct SerialOptions {
     bool force = false;                      ///< take the session from the console that holds it
     std::uint16_t connection = 0;            ///< number of the serial connection within the partition
-    std::size_t maxUnread = 4 * 1024 * 1024; ///< bytes of output that are kept until they are read
+    std::size_t maxUnread = 4 * 1024 * 1024; ///< bytes of output that are kept until they are read; more than 0
 };
 
 /// The console's side of one virtual serial session. Console::openSerial() makes it.
@@ -66,6 +67,7 @@ public:
     /// Waits until there is output, without limit, and takes it.
     /// @param buffer  room for `length` bytes, at least 1
     /// @return the number of bytes; 0: the session has ended, and all of its output has been read
+    /// @throws std::invalid_argument  "length: zero"
     std::size_t read(char* buffer, std::size_t length);
     /// The same with a limit. @throws DeadlinePassed  there was no output in time
     std::size_t read(char* buffer, std::size_t length, std::chrono::milliseconds timeout);

@@ -41,7 +41,8 @@ QEL_PROTOCOL_EXPORT bool isLoopback(const IPAddress& address);
 /// getaddrinfo() knows no deadline, so it runs on a thread of its own. When the deadline passes first, that thread ends
 /// by itself later. A numeric host is not looked up, and starts no thread.
 /// @return at least one
-/// @throws NameNotResolved  the host has no address, or the resolver failed
+/// @throws NameNotResolved  the host has no address, the resolver failed, or the system allows no more threads
+///         (std::system_error is nested then)
 /// @throws DeadlinePassed  the resolver did not answer in time
 /// Thread safety: any thread.
 QEL_PROTOCOL_EXPORT std::vector<IPEndpoint> resolve(const ServerAddress& server,

@@ -13,6 +13,7 @@
 namespace qel::protocol {
 
 /// How a Server listens, whom it admits, and what it lets a console use up. Either `credentials` or `plain` is needed.
+/// The caller makes this struct, so its layout is part of the binary interface: a new member needs a new soname.
 struct ServerOptions {
     /// Where to listen, as IPEndpoint takes it: "127.0.0.1:4711", "[::1]:0". Port 0 lets the system choose one. Empty:
     /// nowhere, Server::serve() brings the connections.
