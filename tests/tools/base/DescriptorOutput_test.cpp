@@ -136,6 +136,21 @@ TEST(DescriptorOutput, FlushingWaitsForTheReader)
     EXPECT_EQ(read, text);
 }
 
+TEST(DescriptorOutput, DroppedOutputIsNotWritten)
+{
+    const Pipe pipe;
+    DescriptorOutput output(pipe.writeEnd.get());
+    output.drop();
+    EXPECT_TRUE(output.endsLine()) << "nothing was dropped";
+    append(output, "line\n");
+    output.drop();
+    EXPECT_TRUE(output.isEmpty());
+    EXPECT_FALSE(output.endsLine()) << "a part of it may have been written";
+    append(output, "x");
+    output.writeSome();
+    EXPECT_EQ(pipe.read(100), "x");
+}
+
 TEST(DescriptorOutput, KnowsWhetherALineHasEnded)
 {
     DescriptorOutput output(-1);

@@ -77,8 +77,8 @@ protected:
         tool::ConsoleScreen screen(pty == nullptr ? outputWrite.get() : pty->slave(), errors, pty != nullptr, mode);
         console.onNotice<QelMessageDaxBroadcastOutboundAsync>(
             [&](const QelMessageDaxBroadcastOutboundAsync& broadcast) { screen.showBroadcast(broadcast); });
-        tool::ConsoleLoop loop(console, *session, screen, input, mode, signals, options);
-        return loop.run();
+        tool::ConsoleLoop loop(screen, input, mode, signals, options);
+        return loop.run(console, *session);
     }
 
     void typeAll(const std::string& text)
@@ -108,6 +108,14 @@ protected:
             there += static_cast<std::size_t>(count);
         }
         return text.substr(0, there);
+    }
+    /// Reads the terminal's screen until it ends with the text. @return all that was read
+    static std::string screenUntil(const Pty& pty, const std::string& text)
+    {
+        std::string screen;
+        while (screen.size() < text.size() || screen.compare(screen.size() - text.size(), text.size(), text) != 0)
+            screen += pty.read(1);
+        return screen;
     }
     /// What the loop has written to the pipe.
     std::string written()

@@ -26,6 +26,15 @@ void broadcast(ConsoleScreen& screen, std::uint32_t type, const std::string& id,
 
 class ConsoleScreenTest : public ::testing::Test {
 protected:
+    /// Reads the terminal up to this text.
+    std::string onTerminal(const std::string& end) const
+    {
+        std::string screen;
+        while (screen.size() < end.size() || screen.compare(screen.size() - end.size(), end.size(), end) != 0)
+            screen += pty.read(1);
+        return screen;
+    }
+
     const Pty pty;
     TerminalMode mode{pty.slave()};
     std::ostringstream errors;
@@ -63,7 +72,8 @@ TEST_F(ConsoleScreenTest, OnASharedTerminalAMessageStartsANewLine)
     together.say("second");
     show(together, "ls\n");
     together.say("third");
-    EXPECT_EQ(errors.str(), "qel: first\n\nqel: second\nqel: third\n");
+    EXPECT_EQ(onTerminal("third\r\n"), "qel: first\r\n$ \r\nqel: second\r\nls\r\nqel: third\r\n");
+    EXPECT_EQ(errors.str(), "");
 }
 
 TEST_F(ConsoleScreenTest, InRawModeAMessageEndsWithCarriageReturn)
@@ -72,9 +82,28 @@ TEST_F(ConsoleScreenTest, InRawModeAMessageEndsWithCarriageReturn)
     EXPECT_STREQ(together.lineEnd(), "\r\n");
     show(together, "$ ");
     together.say("hello");
-    EXPECT_EQ(errors.str(), "\r\nqel: hello\r\n");
+    EXPECT_EQ(onTerminal("hello\r\n"), "$ \r\nqel: hello\r\n");
     mode.restore();
     EXPECT_STREQ(together.lineEnd(), "\n");
+}
+
+TEST_F(ConsoleScreenTest, MessagesOnASharedTerminalKeepTheirPlaceInTheOutput)
+{
+    mode.enterRaw();
+    show(together, "before\r\n");
+    together.say("hello");
+    show(together, "after\r\n");
+    together.output().writeSome();
+    EXPECT_EQ(onTerminal("after\r\n"), "before\r\nqel: hello\r\nafter\r\n");
+}
+
+TEST_F(ConsoleScreenTest, OnlyATerminalHasABell)
+{
+    mode.enterRaw();
+    apart.sayLoudly("hello");
+    EXPECT_EQ(errors.str(), "qel: hello\n");
+    together.sayLoudly("hello");
+    EXPECT_EQ(onTerminal("\n"), "\aqel: hello\r\n");
 }
 
 TEST_F(ConsoleScreenTest, MessagesToAnotherPlaceIgnoreRawMode)

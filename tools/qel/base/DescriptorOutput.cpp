@@ -51,6 +51,13 @@ void DescriptorOutput::writeSome()
     mKept.erase(0, written);
 }
 
+void DescriptorOutput::drop()
+{
+    if (isEmpty()) return;
+    mKept.clear();
+    mEndsLine = false; // unknown
+}
+
 void DescriptorOutput::flush()
 {
     while (!isEmpty()) {

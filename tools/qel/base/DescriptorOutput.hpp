@@ -37,6 +37,9 @@ public:
     /// Writes what the descriptor takes without blocking. @throws PosixError  writing failed
     void writeSome();
 
+    /// Forgets what is kept.
+    void drop();
+
     /// Writes everything and waits without limit. @throws PosixError  writing failed
     void flush();
 

@@ -67,7 +67,7 @@ std::chrono::milliseconds timeLeft(std::chrono::steady_clock::time_point end)
     return PollDeadline(end).getTimeout(TimeProvider::steady());
 }
 
-Console connectConsole(const ConnectOptions& options)
+ConsoleOptions libraryOptions(const ConnectOptions& options)
 {
     ConsoleOptions library(options.server);
     library.credentials = loadCredentials(options.transport);
@@ -77,6 +77,12 @@ Console connectConsole(const ConnectOptions& options)
     library.handshakeTimeout = options.transport.handshakeTimeout();
     library.requestTimeout = options.timeout();
     library.frameTimeout = options.timeout();
+    return library;
+}
+
+Console connectConsole(const ConnectOptions& options)
+{
+    const ConsoleOptions library = libraryOptions(options);
     try {
         return Console(library, options.timeout());
     } catch (const std::invalid_argument& error) {

@@ -30,6 +30,10 @@ void addConnectOptions(CLI::App& app, ConnectOptions& options);
 /// @throws CLI::ValidationError
 void checkConnect(const ConnectOptions& options);
 
+/// What the library needs to connect. Reads the credentials.
+/// @throws FileIOError, CredentialsUnusable  the credentials cannot be used
+ConsoleOptions libraryOptions(const ConnectOptions& options);
+
 /// Connects within the timeout. Each request and each message of the console has the timeout too.
 /// @throws CommandFailure  Usage: --plain, and the host name has an address that is not a loopback address
 /// @throws FileIOError, CredentialsUnusable  the credentials cannot be used

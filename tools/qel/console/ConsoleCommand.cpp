@@ -15,9 +15,12 @@
 #include "base/SignalWatch.hpp"
 #include "base/TerminalMode.hpp"
 #include "client/ConnectOptions.hpp"
+#include "console/ConsoleConnection.hpp"
 #include "console/ConsoleLoop.hpp"
 #include "console/ConsoleScreen.hpp"
+#include "console/ConsoleTexts.hpp"
 #include "console/EscapeFilter.hpp"
+#include "console/MessageStream.hpp"
 
 #include <chrono>
 #include <csignal>
@@ -35,6 +38,10 @@ namespace qel::tool {
 namespace {
 
 constexpr double kMaxLinger = 24 * 60 * 60;
+constexpr double kMaxKeepAlive = 24 * 60 * 60;
+
+/// How long a person waits for the server when leaving.
+constexpr std::chrono::milliseconds kFarewell{90};
 
 /// Termination, suspension and continuation.
 constexpr std::initializer_list<int> kSignals{SIGINT, SIGTERM, SIGHUP, SIGQUIT, SIGTSTP, SIGCONT};
@@ -57,6 +64,7 @@ struct CommandOptions {
     bool noEof = false;
     std::string escape = "~";
     std::optional<double> lingerSeconds;
+    double keepAliveSeconds = 15;
 
     InputOptions inputOptions() const;
 };
@@ -92,6 +100,8 @@ InputOptions CommandOptions::inputOptions() const
 {
     InputOptions options;
     options.escape = parseEscape(escape);
+    options.keepAlive =
+        std::chrono::duration_cast<std::chrono::milliseconds>(std::chrono::duration<double>(keepAliveSeconds));
     options.sendsEnd = !noEof;
     if (lingerSeconds) {
         options.linger =
@@ -100,23 +110,25 @@ InputOptions CommandOptions::inputOptions() const
     return options;
 }
 
-ConsoleLoop::Outcome join(Console& console, SerialSession& session, ConsoleScreen& screen, TerminalMode& mode,
-                          const InputOptions& options)
+/// Closes the serial session and the hypervisor session, as far as they are open, and the connection. A person at a
+/// terminal does not wait for a server that does not answer.
+/// @param requestTimeout  for each response, if there is no terminal
+void close(ConsoleConnection& connection, SerialSession& session, ConsoleScreen& screen, const TerminalMode& mode,
+           std::chrono::milliseconds requestTimeout)
 {
-    // Signals are watched only while the terminal may have to be restored. At all other times they end this process at
-    // once.
-    SignalWatch signals(kSignals);
-    ConsoleLoop loop(console, session, screen, STDIN_FILENO, mode, signals, options);
-    return loop.run();
-}
-
-/// Closes the serial session and the hypervisor session, as far as they are open.
-void close(Console& console, SerialSession& session, ConsoleScreen& screen)
-{
-    session.close();
-    screen.showOutput(session);
-    if (session.getEnd() == SessionEnd::ShutDown || session.getEnd() == SessionEnd::ConnectionClosed) return;
-    console.closeSession();
+    Console& console = connection.console();
+    const auto end = TimeProvider::steady() + (mode.isTerminal() ? kFarewell : requestTimeout);
+    if (mode.isTerminal()) connection.stream().cutAt(end);
+    try {
+        session.close(timeLeft(end));
+        screen.showOutput(session);
+        if (session.getEnd() != SessionEnd::ShutDown && session.getEnd() != SessionEnd::ConnectionClosed)
+            console.closeSession(mode.isTerminal() ? timeLeft(end) : requestTimeout);
+    } catch (const std::exception& error) {
+        if (!mode.isTerminal()) throw;
+        logLine(LogLevel::Debug, "while leaving: ", explain(error));
+    }
+    console.leave();
 }
 
 /// The exit status of this command when its session ended this way.
@@ -141,6 +153,13 @@ ExitStatus exitStatusOf(SessionEnd end)
     throw CommandFailure(ExitStatus::Failed, "signal " + std::to_string(signal) + " did not end this process");
 }
 
+std::string leftText(const CommandOptions& options, const ConsoleLoop::Outcome& outcome)
+{
+    const std::string text = filled(texts::kLeft, {std::to_string(options.partition)});
+    if (outcome.thrownAway == 0) return text;
+    return text + filled(texts::kThrownAway, {std::to_string(outcome.thrownAway)});
+}
+
 ExitStatus conclude(const ConsoleLoop::Outcome& outcome, SessionEnd end, const std::string& endText,
                     const CommandOptions& options, ConsoleScreen& screen, const TerminalMode& mode)
 {
@@ -149,10 +168,10 @@ ExitStatus conclude(const ConsoleLoop::Outcome& outcome, SessionEnd end, const s
         endBy(outcome.signal);
     case ConsoleLoop::ExitReason::Left:
         screen.output().writeSome();
-        if (mode.isTerminal()) screen.say("left partition " + std::to_string(options.partition));
+        screen.output().drop(); // nobody waits for the screen
+        if (mode.isTerminal()) screen.say(leftText(options, outcome));
         return ExitStatus::Done;
     case ConsoleLoop::ExitReason::Ended:
-        screen.output().flush();
         screen.say(endText);
         return exitStatusOf(end);
     default:
@@ -170,17 +189,35 @@ std::string timeoutText(const ConnectOptions& options)
 
 /// Runs the session from opening to closing.
 /// @param openEnd  by when it must be open
-ExitStatus runSession(Console& console, ConsoleScreen& screen, TerminalMode& mode, const CommandOptions& options,
-                      std::chrono::steady_clock::time_point openEnd)
+ExitStatus runSession(ConsoleConnection& connection, ConsoleScreen& screen, TerminalMode& mode,
+                      const CommandOptions& options, std::chrono::steady_clock::time_point openEnd)
 {
-    SerialSession session = console.openSerial(options.partition, options.serial, timeLeft(openEnd));
-    const ConsoleLoop::Outcome outcome = join(console, session, screen, mode, options.inputOptions());
+    SerialSession session = connection.console().openSerial(options.partition, options.serial, timeLeft(openEnd));
+    ConsoleLoop::Outcome outcome;
+    {
+        // Signals are watched only while the terminal may have to be restored. At all other times they end this process
+        // at once.
+        SignalWatch signals(kSignals);
+        ConsoleLoop loop(screen, STDIN_FILENO, mode, signals, options.inputOptions());
+        outcome = loop.run(connection.console(), session, &connection.stream());
+    }
     const SessionEnd end = session.getEnd();
     const std::string endText = session.describeEnd();
-    // After a signal the process ends without further requests; the hypervisor closes its sessions.
-    if (outcome.reason != ConsoleLoop::ExitReason::Signal) close(console, session, screen);
-    console.leave();
+    if (outcome.reason == ConsoleLoop::ExitReason::Signal) {
+        // The process ends without further requests; the hypervisor closes its sessions.
+        if (mode.isTerminal()) connection.stream().cutAt(TimeProvider::steady() + kFarewell);
+        connection.console().leave();
+    } else {
+        close(connection, session, screen, mode, options.connect.timeout());
+    }
     return conclude(outcome, end, endText, options, screen, mode);
+}
+
+void addHandlers(Console& console, ConsoleScreen& screen)
+{
+    console.onNotice<QelMessageDaxBroadcastOutboundAsync>(
+        [&screen](const QelMessageDaxBroadcastOutboundAsync& broadcast) { screen.showBroadcast(broadcast); });
+    console.onOtherNotice([](const QelMessage& notice) { logLine(LogLevel::Warn, "ignored ", notice.getLogID()); });
 }
 
 ExitStatus runConsole(const CommandOptions& options)
@@ -188,23 +225,26 @@ ExitStatus runConsole(const CommandOptions& options)
     startLogging(options.log, "qel-console.log");
     static_cast<void>(std::signal(SIGPIPE, SIG_IGN)); // the terminal must be restored even when the output is closed
     TerminalMode mode(STDIN_FILENO);
-    ConsoleScreen screen(STDOUT_FILENO, std::cerr, ::isatty(STDERR_FILENO) == 1, mode);
+    MessageStream messages(STDERR_FILENO);
+    ConsoleScreen screen(STDOUT_FILENO, messages, ::isatty(STDERR_FILENO) == 1, mode);
     const auto openEnd = TimeProvider::steady() + options.connect.timeout();
-    Console console = connectConsole(options.connect);
-    console.onNotice<QelMessageDaxBroadcastOutboundAsync>(
-        [&screen](const QelMessageDaxBroadcastOutboundAsync& broadcast) { screen.showBroadcast(broadcast); });
-    console.onOtherNotice([](const QelMessage& notice) { logLine(LogLevel::Warn, "ignored ", notice.getLogID()); });
+    ConsoleConnection connection(options.connect, openEnd);
+    addHandlers(connection.console(), screen);
+    const auto leave = [&] {
+        if (mode.isTerminal()) connection.stream().cutAt(TimeProvider::steady() + kFarewell);
+        connection.console().leave();
+    };
     try {
-        return runSession(console, screen, mode, options, openEnd);
+        return runSession(connection, screen, mode, options, openEnd);
     } catch (const StatusError& refusal) {
-        console.leave();
+        leave();
         throw CommandFailure(ExitStatus::Refused,
                              refusalText(refusal.getResponse(), "partition " + std::to_string(options.partition)));
     } catch (const DeadlinePassed& error) {
-        console.leave();
+        leave();
         throw CommandFailure(ExitStatus::DeadlinePassed, timeoutText(options.connect) + error.what());
     } catch (...) {
-        console.leave();
+        leave();
         throw;
     }
 }
@@ -222,6 +262,13 @@ void addEscape(CLI::App& command, CommandOptions& options)
 
 void addInputOptions(CLI::App& command, CommandOptions& options)
 {
+    command
+        .add_option("--keepalive", options.keepAliveSeconds,
+                    "Say so when the server has sent nothing for this long; it is asked for the time of day before. 0: "
+                    "do not ask")
+        ->type_name("SECONDS")
+        ->check(numberIn(0.0, kMaxKeepAlive))
+        ->capture_default_str();
     command.add_flag("--no-eof", options.noEof, "Do not send an end-of-file character at the end of the input");
     command
         .add_option("--linger", options.lingerSeconds,

@@ -3,10 +3,15 @@
 #include <qel/common/util/PosixError.hpp>
 #include <qel/common/util/TimeProvider.hpp>
 #include <qel/protocol/Error.hpp>
+#include <qel/protocol/Text.hpp>
 
+#include "console/ConsoleTexts.hpp"
+
+#include <algorithm>
 #include <array>
 #include <cerrno>
 #include <csignal>
+#include <sstream>
 #include <unistd.h>
 
 namespace qel::tool {
@@ -14,18 +19,6 @@ namespace qel::tool {
 namespace {
 
 constexpr char kEndOfFile = 'D' & 0x1F; // control-D
-
-/// Raw mode from construction to destruction.
-class RawMode {
-public:
-    explicit RawMode(TerminalMode& mode) : mMode(mode) { mMode.enterRaw(); }
-    ~RawMode() { mMode.restore(); }
-    RawMode(const RawMode&) = delete;
-    RawMode& operator=(const RawMode&) = delete;
-
-private:
-    TerminalMode& mMode;
-};
 
 /// A SignalWatch blocks its signals, so it receives ignored ones too. A signal that was ignored when this process
 /// started, as nohup(1) does it, must not end the process.
@@ -48,26 +41,63 @@ void stop()
     ::pthread_sigmask(SIG_SETMASK, &before, nullptr);
 }
 
+/// Lets a stream attend to the keyboard for the time of a call.
+class Attending {
+public:
+    Attending(AttentiveStream* stream, StreamAttendant* attendant) : mStream(stream)
+    {
+        if (mStream != nullptr) mStream->setAttendant(attendant);
+    }
+    ~Attending()
+    {
+        if (mStream != nullptr) mStream->setAttendant(nullptr);
+    }
+    Attending(const Attending&) = delete;
+    Attending& operator=(const Attending&) = delete;
+
+private:
+    AttentiveStream* mStream;
+};
+
 } // namespace
 
-ConsoleLoop::ConsoleLoop(Console& console, SerialSession& session, ConsoleScreen& screen, int input, TerminalMode& mode,
-                         SignalWatch& signals, const InputOptions& options)
-    : mConsole(console), mSession(session), mScreen(screen), mInput(input), mMode(mode), mSignals(signals),
-      mInputOptions(options), mEscape(options.escape)
+ConsoleLoop::ConsoleLoop(ConsoleScreen& screen, int input, TerminalMode& mode, SignalWatch& signals,
+                         const InputOptions& options)
+    : mScreen(screen), mInput(input), mMode(mode), mSignals(signals), mInputOptions(options), mEscape(options.escape),
+      mKeepAlive(options.keepAlive)
 {}
 
-ConsoleLoop::Outcome ConsoleLoop::run()
+ConsoleLoop::~ConsoleLoop() { mMode.restore(); }
+
+ConsoleLoop::Outcome ConsoleLoop::run(Console& console, SerialSession& session, AttentiveStream* stream)
 {
-    const RawMode raw(mMode);
-    if (mMode.isTerminal() && mInputOptions.escape) {
-        mScreen.say("connected; " + characterName(*mInputOptions.escape) +
-                    "? at the start of a line lists the commands");
-    }
-    mScreen.showOutput(mSession);
+    pBegin(console, session);
+    const Attending attending(mMode.isTerminal() ? stream : nullptr, this);
+    mScreen.showOutput(session);
     while (!pIsDone())
         pPollOnce();
     if (mFailure && mOutcome.reason == ExitReason::Ended) std::rethrow_exception(mFailure);
     return mOutcome;
+}
+
+void ConsoleLoop::pBegin(Console& console, SerialSession& session)
+{
+    mConsole = &console;
+    mSession = &session;
+    mOutcome = Outcome();
+    mFailure = nullptr;
+    mKeepAlive.watch(console, TimeProvider::steady());
+    mMode.enterRaw();
+    if (mMode.isTerminal()) mScreen.say(pGreeting());
+}
+
+std::string ConsoleLoop::pGreeting() const
+{
+    const std::string peer =
+        mConsole->isProtected() ? filled(texts::kProtected, {quoted(mConsole->peer().commonName)}) : texts::kPlain;
+    const std::string escapes = mInputOptions.escape ? filled(texts::kEscapes, {characterName(*mInputOptions.escape)})
+                                                     : std::string(texts::kNoEscape);
+    return filled(texts::kConnected, {std::to_string(mSession->getPartition()), mConsole->getServer(), peer, escapes});
 }
 
 bool ConsoleLoop::pIsDone() const
@@ -83,27 +113,39 @@ bool ConsoleLoop::pIsDone() const
     }
 }
 
-bool ConsoleLoop::pWantsInput() const { return mOutcome.reason == ExitReason::None && mInputOpen && mPending.empty(); }
-
-bool ConsoleLoop::pWantsMessages() const { return mOutcome.reason == ExitReason::None && mScreen.output().hasRoom(); }
-
-bool ConsoleLoop::pWantsToSend() const { return mOutcome.reason == ExitReason::None && !mPending.empty(); }
-
-/// When pCheckTimers() is due; disabled while data is in flight.
-PollDeadline ConsoleLoop::pDeadline() const
+/// A terminal is read at all times, also while the last output is written.
+bool ConsoleLoop::pWantsInput() const
 {
-    const bool isWaiting = mOutcome.reason == ExitReason::None && !mInputOpen && !mSendBroken && mPending.empty() &&
-                           mScreen.output().isEmpty();
+    if (!mInputOpen) return false;
+    return mMode.isTerminal() || (pIsRunning() && mHeld.isEmpty());
+}
+
+bool ConsoleLoop::pWantsMessages() const { return pIsRunning() && mScreen.output().hasRoom(); }
+
+bool ConsoleLoop::pWantsToSend() const { return pIsRunning() && !mSendBroken && !mHeld.isEmpty(); }
+
+/// When pCheckEndTimer() is due; disabled while data is in flight.
+PollDeadline ConsoleLoop::pEndDeadline() const
+{
+    const bool isWaiting = pIsRunning() && !mInputOpen && !mSendBroken && mHeld.isEmpty() && mScreen.output().isEmpty();
     if (!isWaiting) return PollDeadline();
     if (mInputOptions.linger) return mQuietSince + *mInputOptions.linger;
     return mInputOptions.sendsEnd ? PollDeadline(mQuietSince + kEndRepeat) : PollDeadline();
 }
 
+PollDeadline ConsoleLoop::pDeadline() const
+{
+    PollDeadline deadline = pEndDeadline();
+    if (pWantsToSend()) deadline = std::min(deadline, mHeld.deadline());
+    if (pWantsMessages()) deadline = std::min(deadline, mKeepAlive.deadline());
+    return deadline;
+}
+
 void ConsoleLoop::pPollOnce()
 {
     const PollFd input(mInput, PollEvents::Read);
-    const PollFd messages = mConsole.getPollFd(PollEvents::Read);
-    const PollFd sending = mConsole.getPollFd(PollEvents::Write);
+    const PollFd messages = mConsole->getPollFd(PollEvents::Read);
+    const PollFd sending = mConsole->getPollFd(PollEvents::Write);
     const PollFd output = mScreen.output().getPollFd();
 
     // Poll only for events that are handled now. An event that is left unhandled would make this a busy loop.
@@ -113,7 +155,7 @@ void ConsoleLoop::pPollOnce()
     if (pWantsToSend()) set += sending;
     if (!mScreen.output().isEmpty()) set += output;
     // TLS may hold received bytes while the socket has none.
-    const bool isPending = pWantsMessages() && mConsole.hasPending();
+    const bool isPending = pWantsMessages() && mConsole->hasPending();
     const auto timeout = pDeadline().getTimeout(TimeProvider::steady());
     const PollResult ready = isPending ? set.poll() : set.wait(timeout);
 
@@ -122,7 +164,30 @@ void ConsoleLoop::pPollOnce()
     if (pWantsMessages() && (isPending || ready.contains(messages))) pReceive();
     if (pWantsToSend() && ready.contains(sending)) pSend();
     if (pWantsInput() && ready.contains(input)) pReadInput();
-    if (!ready.anyReady() && !isPending) pCheckTimers();
+    if (!ready.anyReady() && !isPending) pCheckEndTimer();
+    pCheckHeld();
+    pCheckSilence();
+}
+
+PollSet ConsoleLoop::attended() const
+{
+    PollSet set(mSignals.getPollFd());
+    if (pWantsInput()) set += PollFd(mInput, PollEvents::Read);
+    return set;
+}
+
+bool ConsoleLoop::attend(const PollResult& ready) noexcept
+{
+    mIsAttending = true;
+    try {
+        if (ready.contains(mSignals.getPollFd())) pHandleSignal();
+        if (pWantsInput() && ready.contains(PollFd(mInput, PollEvents::Read))) pReadInput();
+    } catch (...) {
+        mFailure = std::current_exception();
+        pExit(ExitReason::Ended);
+    }
+    mIsAttending = false;
+    return pIsRunning();
 }
 
 void ConsoleLoop::pHandleSignal()
@@ -130,7 +195,10 @@ void ConsoleLoop::pHandleSignal()
     const int signal = mSignals.take();
     if (signal == 0 || isIgnored(signal)) return;
     if (signal == SIGTSTP) return pSuspend();
-    if (signal == SIGCONT) return mMode.enterRaw();
+    if (signal == SIGCONT) {
+        mKeepAlive.postpone(TimeProvider::steady());
+        return mMode.enterRaw();
+    }
     mOutcome.signal = signal;
     pExit(ExitReason::Signal);
 }
@@ -140,6 +208,7 @@ void ConsoleLoop::pSuspend()
     mMode.restore();
     stop();
     mMode.enterRaw();
+    mKeepAlive.postpone(TimeProvider::steady());
 }
 
 void ConsoleLoop::pWriteOutput()
@@ -151,13 +220,14 @@ void ConsoleLoop::pWriteOutput()
 void ConsoleLoop::pReceive()
 {
     try {
-        static_cast<void>(mConsole.process());
+        if (mConsole->process()) pReport(mKeepAlive.noteHeard(TimeProvider::steady()));
     } catch (...) {
-        if (mSession.getEnd() == SessionEnd::None) mFailure = std::current_exception();
+        // When the user leaves while a message is received, the connection breaks.
+        if (pIsRunning() && mSession->getEnd() == SessionEnd::None) mFailure = std::current_exception();
         pExit(ExitReason::Ended);
     }
-    mScreen.showOutput(mSession);
-    if (mSession.getEnd() != SessionEnd::None) pExit(ExitReason::Ended);
+    mScreen.showOutput(*mSession);
+    if (mSession->getEnd() != SessionEnd::None) pExit(ExitReason::Ended);
 }
 
 /// Called when the connection is writable: on Linux that means a third of the send buffer is free, which is more than
@@ -165,14 +235,19 @@ void ConsoleLoop::pReceive()
 void ConsoleLoop::pSend()
 {
     try {
-        mQuietSince = TimeProvider::steady();
-        mSession.writeSome(mPending);
+        const auto now = TimeProvider::steady();
+        mQuietSince = now;
+        mSession->writeSome(mHeld.input());
+        const std::size_t dropped = mHeld.dropped();
+        if (mHeld.noteSent(now))
+            mScreen.say(dropped == 0 ? texts::kSent : filled(texts::kSentSome, {std::to_string(dropped)}));
     } catch (const Error& error) {
+        if (!pIsRunning()) return; // the user left meanwhile
         // A hypervisor that closes the connection may have sent the reason. Without TLS it can still be read.
-        mPending.clear();
-        mInputOpen = false;
+        mHeld.clear();
+        if (!mMode.isTerminal()) mInputOpen = false;
         mSendBroken = true;
-        if (dynamic_cast<const DeadlinePassed*>(&error) == nullptr && !mConsole.isProtected()) return;
+        if (dynamic_cast<const DeadlinePassed*>(&error) == nullptr && !mConsole->isProtected()) return;
         mFailure = std::current_exception();
         pExit(ExitReason::Ended);
     }
@@ -185,18 +260,28 @@ void ConsoleLoop::pReadInput()
     const int error = errno;
     if (count > 0) return pTakeTyped(buffer.data(), static_cast<std::size_t>(count));
     if (count == 0) return pEndInput();
+    if (error == EIO && mMode.isTerminal()) return pEndInput(); // it hung up
     if (error != EAGAIN && error != EINTR) throw PosixError(error, "cannot read standard input");
 }
 
 void ConsoleLoop::pTakeTyped(const char* data, std::size_t length)
 {
-    if (!mMode.isTerminal()) {
-        mPending.append(data, length);
-        return;
-    }
     std::string typed(data, length);
-    while (!typed.empty() && mOutcome.reason == ExitReason::None)
-        pExecute(mEscape.take(typed, mPending));
+    if (!mMode.isTerminal()) return pHold(typed);
+    while (!typed.empty() && !pHasLeft()) {
+        std::string forPartition;
+        const EscapeFilter::Command command = mEscape.take(typed, forPartition);
+        pHold(forPartition);
+        pExecute(command);
+    }
+}
+
+void ConsoleLoop::pHold(const std::string& typed)
+{
+    if (typed.empty() || !pIsRunning() || mSendBroken) return;
+    const bool wasDropping = mHeld.dropped() > 0;
+    if (mHeld.add(typed, TimeProvider::steady()) == 0 || wasDropping) return;
+    mScreen.sayLoudly(texts::kDropped + pLeaveHint(texts::kHeldLeave));
 }
 
 void ConsoleLoop::pExecute(EscapeFilter::Command command)
@@ -209,10 +294,15 @@ void ConsoleLoop::pExecute(EscapeFilter::Command command)
     case EscapeFilter::Command::Suspend:
         return pSuspend();
     case EscapeFilter::Command::Leave:
-        break;
+        return pLeave();
     }
-    // Characters typed before the command still go to the partition if it takes them at once.
-    if (!mPending.empty() && PollSet(mConsole.getPollFd(PollEvents::Write)).poll().anyReady()) pSend();
+}
+
+/// Characters typed before the command still go to the partition if it takes them at once.
+void ConsoleLoop::pLeave()
+{
+    const bool isUsable = pWantsToSend() && !mIsAttending;
+    if (isUsable && PollSet(mConsole->getPollFd(PollEvents::Write)).poll().anyReady()) pSend();
     pExit(ExitReason::Left);
 }
 
@@ -221,20 +311,55 @@ void ConsoleLoop::pEndInput()
     if (mMode.isTerminal()) return pExit(ExitReason::Left); // in raw mode this means that the terminal hung up
     mInputOpen = false;
     mQuietSince = TimeProvider::steady();
-    if (mInputOptions.sendsEnd) mPending += kEndOfFile;
+    if (mInputOptions.sendsEnd) pHold({kEndOfFile});
 }
 
-void ConsoleLoop::pCheckTimers()
+void ConsoleLoop::pCheckEndTimer()
 {
-    if (!pDeadline().isExpired(TimeProvider::steady())) return;
+    if (!pEndDeadline().isExpired(TimeProvider::steady())) return;
     if (mInputOptions.linger) return pExit(ExitReason::Lingered);
-    mPending += kEndOfFile;
+    pHold({kEndOfFile});
 }
 
+void ConsoleLoop::pCheckSilence()
+{
+    if (mInputOptions.keepAlive == std::chrono::milliseconds::zero()) return;
+    const auto now = TimeProvider::steady();
+    if (!pWantsMessages()) return mKeepAlive.postpone(now);
+    pReport(mKeepAlive.check(now));
+}
+
+void ConsoleLoop::pCheckHeld()
+{
+    if (!mMode.isTerminal() || !pWantsToSend() || !mHeld.isLate(TimeProvider::steady())) return;
+    mScreen.say(filled(texts::kHeld, {std::to_string(mHeld.size())}) + pLeaveHint(texts::kHeldLeave));
+}
+
+void ConsoleLoop::pReport(KeepAlive::Event event)
+{
+    if (event == KeepAlive::Event::None) return;
+    if (event == KeepAlive::Event::Back) return mScreen.say(texts::kBack);
+    const auto seconds = std::chrono::duration<double>(mInputOptions.keepAlive).count();
+    std::ostringstream number;
+    number << seconds;
+    const char* const text = mHeld.isEmpty() ? texts::kSilent : texts::kSilentHeld;
+    mScreen.say(filled(text, {number.str()}) + pLeaveHint(texts::kSilentChoice));
+}
+
+/// What a person at a terminal can do about it; empty for others.
+std::string ConsoleLoop::pLeaveHint(const char* text) const
+{
+    if (!mMode.isTerminal() || !mInputOptions.escape) return {};
+    return filled(text, {characterName(*mInputOptions.escape)});
+}
+
+/// A later reason replaces an earlier one only when it waits for less.
 void ConsoleLoop::pExit(ExitReason reason)
 {
-    if (mOutcome.reason != ExitReason::Signal) mOutcome.reason = reason;
-    mPending.clear();
+    const bool isLater = reason == ExitReason::Signal || (reason == ExitReason::Left && !pHasLeft());
+    if (pIsRunning() || isLater) mOutcome.reason = reason;
+    mOutcome.thrownAway += mHeld.size() + mHeld.dropped();
+    mHeld.clear();
 }
 
 } // namespace qel::tool

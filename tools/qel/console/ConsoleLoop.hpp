@@ -7,20 +7,26 @@
 #include "base/Library.hpp"
 #include "base/SignalWatch.hpp"
 #include "base/TerminalMode.hpp"
+#include "console/AttentiveStream.hpp"
 #include "console/ConsoleScreen.hpp"
 #include "console/EscapeFilter.hpp"
+#include "console/HeldInput.hpp"
+#include "console/KeepAlive.hpp"
 
 #include <chrono>
+#include <cstddef>
 #include <exception>
 #include <optional>
 #include <string>
 
 namespace qel::tool {
 
-/// What a console does with its input.
+/// What a console does with its input and its server.
 struct InputOptions {
     /// The escape character on a terminal; none: there are no commands.
     std::optional<char> escape = '~';
+    /// After how much silence of the server the user is told; 0: never.
+    std::chrono::milliseconds keepAlive{0};
 
     // For input that is not a terminal:
 
@@ -35,9 +41,11 @@ struct InputOptions {
 ///
 /// One thread polls everything, and the directions do not wait for each other: output is read while the session takes
 /// no input, and input is sent while the screen takes no output. Each direction buffers a few messages and then stops
-/// reading from its source.
+/// reading from its source. The keyboard alone is always read, so that an escape command is seen, even while the
+/// connection waits for the rest of a message (StreamAttendant): input that finds no room is held (HeldInput).
 ///
-/// A terminal is in raw mode while run() is active, and the escape character introduces commands (EscapeFilter).
+/// A terminal is in raw mode from the first run() to the end of this object, and the escape character introduces
+/// commands (EscapeFilter).
 ///
 /// Any other input is sent as it is. At its end the loop sends the end-of-file character, control-D (termios(3): VEOF),
 /// as a person would type it. The partition's terminal delivers that character once, to the command that happens to
@@ -46,7 +54,7 @@ struct InputOptions {
 /// time it is sent once, and the linger time ends the session.
 ///
 /// Lifetime: borrows everything it is given. Thread safety: one thread.
-class ConsoleLoop {
+class ConsoleLoop : private StreamAttendant {
 public:
     enum class ExitReason {
         None,     ///< still running
@@ -57,31 +65,47 @@ public:
     };
     struct Outcome {
         ExitReason reason = ExitReason::None;
-        int signal = 0; ///< its number for ExitReason::Signal, else 0
+        int signal = 0;             ///< its number for ExitReason::Signal, else 0
+        std::size_t thrownAway = 0; ///< bytes of input that were read and not sent
     };
 
     /// Time without output after which the end-of-file character is repeated.
     static constexpr std::chrono::milliseconds kEndRepeat{1000};
 
-    /// @param console  that of the session; its notices go to the handlers that it has
     /// @param input  descriptor to read from
     /// @param mode  the terminal mode of `input`
     /// @param signals  watches the termination signals, SIGTSTP and SIGCONT. Signals that the process inherited as
     ///        ignored stay ignored.
-    ConsoleLoop(Console& console, SerialSession& session, ConsoleScreen& screen, int input, TerminalMode& mode,
-                SignalWatch& signals, const InputOptions& options);
+    ConsoleLoop(ConsoleScreen& screen, int input, TerminalMode& mode, SignalWatch& signals,
+                const InputOptions& options);
 
-    /// Moves bytes until there is a reason to exit. On return the terminal is restored and all output has been written.
-    /// After ExitReason::Left and Signal some output may be dropped, since these do not wait for the screen.
+    /// Restores the terminal.
+    ~ConsoleLoop() override;
+    ConsoleLoop(const ConsoleLoop&) = delete;
+    ConsoleLoop& operator=(const ConsoleLoop&) = delete;
+
+    /// Moves bytes until there is a reason to exit. On return all output has been written. After ExitReason::Left and
+    /// Signal some output may be dropped, since these do not wait for the screen.
+    /// @param console  that of the session; its notices go to the handlers that it has
+    /// @param stream  under the console: the keyboard is read while it waits; null: none
     /// @throws Error  the session failed; output received before the failure has been written
     /// @throws PosixError  reading the input or writing the output failed
-    Outcome run();
+    Outcome run(Console& console, SerialSession& session, AttentiveStream* stream = nullptr);
 
 private:
+    PollSet attended() const override;
+    bool attend(const PollResult& ready) noexcept override;
+
+    void pBegin(Console& console, SerialSession& session);
+    std::string pGreeting() const;
+    std::string pLeaveHint(const char* text) const;
     bool pIsDone() const;
+    bool pIsRunning() const { return mOutcome.reason == ExitReason::None; }
+    bool pHasLeft() const { return mOutcome.reason == ExitReason::Left || mOutcome.reason == ExitReason::Signal; }
     bool pWantsInput() const;
     bool pWantsMessages() const;
     bool pWantsToSend() const;
+    PollDeadline pEndDeadline() const;
     PollDeadline pDeadline() const;
 
     void pPollOnce();
@@ -92,21 +116,30 @@ private:
     void pSend();
     void pReadInput();
     void pTakeTyped(const char* data, std::size_t length);
+    void pHold(const std::string& typed);
     void pExecute(EscapeFilter::Command command);
+    void pLeave();
     void pEndInput();
-    void pCheckTimers();
+    void pCheckEndTimer();
+    void pCheckSilence();
+    void pCheckHeld();
+    void pReport(KeepAlive::Event event);
     void pExit(ExitReason reason);
 
-    Console& mConsole;
-    SerialSession& mSession;
     ConsoleScreen& mScreen;
     const int mInput;
     TerminalMode& mMode;
     SignalWatch& mSignals;
     const InputOptions mInputOptions;
     EscapeFilter mEscape;
+    KeepAlive mKeepAlive;
+    HeldInput mHeld;
 
-    std::string mPending;                   // input to send
+    // Of the current run().
+    Console* mConsole = nullptr;
+    SerialSession* mSession = nullptr;
+
+    bool mIsAttending = false;              // inside a call of the library: it must not be called again
     bool mInputOpen = true;                 // false after the end of the input
     bool mSendBroken = false;               // sending failed; messages may still be received
     PollDeadline::time_point mQuietSince{}; // last output or input; used after the end of the input

@@ -15,11 +15,18 @@ ConsoleScreen::ConsoleScreen(int output, std::ostream& errors, bool errorsOnTerm
       mIsOneTerminal(errorsOnTerminal && ::isatty(output) == 1), mMode(mode)
 {}
 
-void ConsoleScreen::say(const std::string& text)
+void ConsoleScreen::say(const std::string& text) { pSay("qel: " + text); }
+
+void ConsoleScreen::sayLoudly(const std::string& text) { pSay((mErrorsOnTerminal ? "\aqel: " : "qel: ") + text); }
+
+/// Earlier output comes first.
+void ConsoleScreen::pSay(const std::string& text)
 {
-    mOutput.writeSome(); // earlier output first
-    if (mIsOneTerminal && !mOutput.endsLine()) mErrors << lineEnd();
-    mErrors << "qel: " << text << lineEnd() << std::flush;
+    const std::string start = mIsOneTerminal && !mOutput.endsLine() ? lineEnd() : "";
+    const std::string line = start + text + lineEnd();
+    if (mIsOneTerminal) mOutput.append(line.data(), line.size());
+    mOutput.writeSome();
+    if (!mIsOneTerminal) mErrors << line << std::flush;
 }
 
 const char* ConsoleScreen::lineEnd() const { return mErrorsOnTerminal && mMode.isRaw() ? "\r\n" : "\n"; }

@@ -13,7 +13,7 @@
 namespace qel::tool {
 
 /// What the user of a console sees: the partition's output unchanged, and the messages of this program, each on a line
-/// of its own.
+/// of its own. Where both go to one terminal, they appear there in the order in which they were made.
 /// Thread safety: one thread.
 class ConsoleScreen {
 public:
@@ -25,6 +25,9 @@ public:
 
     /// Prints "qel: " and the text on a line of its own.
     void say(const std::string& text);
+
+    /// The same with the bell, where messages go to a terminal.
+    void sayLoudly(const std::string& text);
 
     /// The line end of a message: "\r\n" while the terminal is in raw mode.
     const char* lineEnd() const;
@@ -39,6 +42,8 @@ public:
     void showBroadcast(const QelMessageDaxBroadcastOutboundAsync& broadcast);
 
 private:
+    void pSay(const std::string& text);
+
     DescriptorOutput mOutput;
     std::ostream& mErrors;
     const bool mErrorsOnTerminal;
