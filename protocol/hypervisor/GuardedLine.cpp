@@ -2,7 +2,9 @@
 
 #include "base/Guard.hpp"
 
+#include <algorithm>
 #include <stdexcept>
+#include <utility>
 
 namespace qel::protocol {
 
@@ -11,6 +13,24 @@ namespace {
 void require(bool condition, const char* what)
 {
     if (!condition) throw std::length_error(what);
+}
+
+/// Keeps what the exception that is being handled says, if there is memory for it.
+void keepCurrent(std::string& text) noexcept
+{
+    try {
+        text = explainCurrent();
+    } catch (...) {
+        text.clear();
+    }
+}
+
+/// A text that goes to terminals and logs: control characters of a line's peer must not.
+std::string printable(std::string text)
+{
+    std::replace_if(
+        text.begin(), text.end(), [](unsigned char character) { return character < 0x20 || character == 0x7F; }, '?');
+    return text;
 }
 
 } // namespace
@@ -22,19 +42,27 @@ Result GuardedLine::pCall(const Result& failed, Operation&& operation) const noe
     try {
         return operation();
     } catch (...) {
-        logCurrent("partition ", mPartition);
+        if (mLogs) logCurrent("partition ", mPartition);
+        keepCurrent(mThrown);
         return failed;
     }
 }
 
 bool GuardedLine::start() noexcept
 {
-    return runGuarded([this] { mLine.start(mPartition); }, "partition ", mPartition);
+    mThrown.clear();
+    return pCall(false, [this] {
+        mLine.start(mPartition);
+        return true;
+    });
 }
 
 void GuardedLine::stop() noexcept
 {
-    static_cast<void>(runGuarded([this] { mLine.stop(); }, "partition ", mPartition));
+    static_cast<void>(pCall(false, [this] {
+        mLine.stop();
+        return true;
+    }));
 }
 
 SerialLine::ReadResult GuardedLine::read(char* buffer, std::size_t length) noexcept
@@ -70,6 +98,38 @@ bool GuardedLine::hasHungUp() const noexcept
 std::optional<CommandEnd> GuardedLine::commandEnd() noexcept
 {
     return pCall(std::optional<CommandEnd>(CommandEnd()), [this] { return mLine.commandEnd(); });
+}
+
+GuardedLine::Progress GuardedLine::advance() noexcept
+{
+    return pCall(Progress::Failed, [this] { return mLine.advance() ? Progress::Up : Progress::ComingUp; });
+}
+
+bool GuardedLine::wantsToWrite() const noexcept
+{
+    return pCall(false, [this] { return mLine.wantsToWrite(); });
+}
+
+PollDeadline GuardedLine::advanceAt() const noexcept
+{
+    return pCall(PollDeadline(), [this] { return mLine.advanceAt(); });
+}
+
+bool GuardedLine::sendBreak() noexcept
+{
+    return pCall(false, [this] { return mLine.sendBreak(); });
+}
+
+std::string GuardedLine::failure() const
+{
+    constexpr std::size_t kMost = 200;
+    std::string text;
+    static_cast<void>(pCall(false, [&] {
+        text = mLine.endReason();
+        return true;
+    }));
+    if (text.empty()) text = mThrown;
+    return printable(text.substr(0, kMost));
 }
 
 } // namespace qel::protocol

@@ -5,6 +5,7 @@
 #include <cstddef>
 #include <cstdint>
 #include <optional>
+#include <string>
 
 namespace qel::protocol {
 
@@ -13,7 +14,12 @@ namespace qel::protocol {
 /// Lifetime: borrows the line. Thread safety: that of the line.
 class GuardedLine {
 public:
-    GuardedLine(std::uint16_t partition, SerialLine& line) : mPartition(partition), mLine(line) {}
+    enum class Progress { Up, ComingUp, Failed };
+
+    /// @param logs  false: what the line throws is not logged; failure() has it
+    GuardedLine(std::uint16_t partition, SerialLine& line, bool logs = true)
+        : mPartition(partition), mLine(line), mLogs(logs)
+    {}
 
     /// @return false: the line cannot be brought up
     bool start() noexcept;
@@ -28,6 +34,17 @@ public:
     bool hasHungUp() const noexcept;
     /// @return an unknown end when the line fails
     std::optional<CommandEnd> commandEnd() noexcept;
+    Progress advance() noexcept;
+    /// @return false when the line fails
+    bool wantsToWrite() const noexcept;
+    /// @return disabled when the line fails
+    PollDeadline advanceAt() const noexcept;
+    /// @return false: the line has no break, or it could not be sent
+    bool sendBreak() noexcept;
+
+    /// Why the line has ended or cannot be brought up, in printable characters: what the line says, else what it threw
+    /// last since start(), else empty. @throws std::bad_alloc
+    std::string failure() const;
 
 private:
     template <typename Result, typename Operation>
@@ -35,6 +52,8 @@ private:
 
     std::uint16_t mPartition;
     SerialLine& mLine;
+    bool mLogs;
+    mutable std::string mThrown; ///< what the line threw last
 };
 
 } // namespace qel::protocol

@@ -3,6 +3,7 @@
 #include <qel/common/QelInternalMessageRegistry.hpp>
 #include <qel/common/QelMessageDax.hpp>
 #include <qel/common/QelMessageGeneric.hpp>
+#include <qel/common/util/TimeProvider.hpp>
 #include <qel/protocol/FrameLimits.hpp>
 #include <qel/protocol/Logging.hpp>
 
@@ -55,11 +56,15 @@ HypervisorEngine::HypervisorEngine(Hypervisor& machine, std::uint8_t maxConsoles
 {
     const MutexLock lock(mMutex);
     for (const auto& entry : mMachine.mImpl->partitions)
-        mPartitions.add(entry.first, *entry.second.line);
+        mPartitions.add(entry.first, *entry.second.line, entry.second.options);
     if (mMachine.mImpl->served.exchange(true)) throw std::logic_error("a server serves this hypervisor");
 }
 
-HypervisorEngine::~HypervisorEngine() { mMachine.mImpl->served = false; }
+HypervisorEngine::~HypervisorEngine()
+{
+    pTellTaps();
+    mMachine.mImpl->served = false;
+}
 
 ConsoleId HypervisorEngine::connect(ConsoleLink& link, Peer peer)
 {
@@ -151,14 +156,42 @@ std::vector<SerialWatch> HypervisorEngine::serialWatches() const
 
 void HypervisorEngine::serviceSerial(std::uint16_t partition)
 {
-    const MutexLock lock(mMutex);
-    mPartitions.service(partition);
+    {
+        const MutexLock lock(mMutex);
+        mPartitions.service(partition);
+    }
+    pTellTaps();
 }
 
-bool HypervisorEngine::serviceEndedLines()
+std::chrono::milliseconds HypervisorEngine::serviceLines()
 {
-    const MutexLock lock(mMutex);
-    return mPartitions.serviceEnded();
+    std::chrono::milliseconds timeout;
+    {
+        const MutexLock lock(mMutex);
+        const auto now = TimeProvider::steady();
+        mPartitions.serviceTime(now);
+        timeout = mPartitions.nextDeadline(now).getTimeout(now);
+        static_cast<void>(mPartitions.takeChanged()); // the caller asks for the watches next
+    }
+    pTellTaps();
+    return timeout;
+}
+
+/// Tells the taps what has happened since the last call, in order: the serial thread is the only one that calls it.
+void HypervisorEngine::pTellTaps()
+{
+    std::vector<TapCall> calls;
+    {
+        const MutexLock lock(mMutex);
+        calls = mPartitions.takeTapCalls();
+    }
+    for (const TapCall& call : calls) {
+        if (call.isOutput) {
+            call.tap->onOutput(call.partition, call.text.data(), call.text.size());
+        } else {
+            call.tap->onEvent(call.partition, call.text);
+        }
+    }
 }
 
 template <typename T, HypervisorEngine::Handler<T> kHandler>
@@ -399,9 +432,10 @@ QelMessageStatusCodes HypervisorEngine::pMayUse(const ConsoleEntry& console, std
 }
 
 /// The same for a session that may be open: a console that holds it is not asked about again.
-QelMessageStatusCodes HypervisorEngine::pMayReach(const ConsoleEntry& console, std::uint16_t partition)
+QelMessageStatusCodes HypervisorEngine::pMayReach(const ConsoleEntry& console, std::uint16_t partition,
+                                                  std::uint16_t number)
 {
-    if (mPartitions.isHeldBy(console, partition)) return QelMessageStatusNoError;
+    if (mPartitions.isHeldBy(console, partition, number)) return QelMessageStatusNoError;
     return pMayUse(console, partition);
 }
 
@@ -420,7 +454,7 @@ HypervisorEngine::Reply HypervisorEngine::pOpenSerial(ConsoleEntry& console,
 HypervisorEngine::Reply HypervisorEngine::pCloseSerial(ConsoleEntry& console,
                                                        const QelMessageVirtualSerialCloseReq& request)
 {
-    auto status = pMayReach(console, request.getLpId());
+    auto status = pMayReach(console, request.getLpId(), request.getVssConnectionNumber());
     if (status == QelMessageStatusNoError) {
         status =
             mPartitions.close(console, request.getLpId(), request.getVssConnectionNumber(), request.isForceClose());
@@ -441,7 +475,7 @@ HypervisorEngine::Reply HypervisorEngine::pMaxSerialSessions(ConsoleEntry&,
 HypervisorEngine::Reply HypervisorEngine::pSetUpSerial(ConsoleEntry& console,
                                                        const QelMessageVirtualSerialSetupSessionReq& request)
 {
-    auto status = pMayReach(console, request.getLpId());
+    auto status = pMayReach(console, request.getLpId(), request.getVssConnectionNumber());
     if (status == QelMessageStatusNoError) {
         status = mPartitions.setUp(console, request.getLpId(), request.getVssConnectionNumber());
     }

@@ -9,6 +9,7 @@
 #include "hypervisor/ConsoleEntry.hpp"
 #include "hypervisor/PartitionSet.hpp"
 
+#include <chrono>
 #include <cstdint>
 #include <functional>
 #include <map>
@@ -80,12 +81,13 @@ public:
     /// What the serial thread has to wait for.
     std::vector<SerialWatch> serialWatches() const;
 
-    /// Moves the serial data of one partition.
+    /// Moves the serial data of one partition. This and the next one belong to one thread; they call the taps, without
+    /// the lock.
     void serviceSerial(std::uint16_t partition);
 
-    /// Takes down the lines whose commands have ended: see PartitionSet::serviceEnded().
-    /// @return true: call again soon
-    bool serviceEndedLines();
+    /// Does what is due on all partitions: see PartitionSet::serviceTime().
+    /// @return when to call it again at the latest: from now; negative: when serialWatches() have changed
+    std::chrono::milliseconds serviceLines();
 
 private:
     using Reply = std::unique_ptr<QelMessage>;
@@ -117,7 +119,9 @@ private:
     Reply pServe(ConsoleEntry& console, const QelMessage& message) QEL_REQUIRES(mMutex);
     void pAnnounce(ConsoleEntry& console) QEL_REQUIRES(mMutex);
     QelMessageStatusCodes pMayUse(const ConsoleEntry& console, std::uint16_t partition) QEL_REQUIRES(mMutex);
-    QelMessageStatusCodes pMayReach(const ConsoleEntry& console, std::uint16_t partition) QEL_REQUIRES(mMutex);
+    QelMessageStatusCodes pMayReach(const ConsoleEntry& console, std::uint16_t partition, std::uint16_t number)
+        QEL_REQUIRES(mMutex);
+    void pTellTaps();
 
     // One operation for each request; they return the response.
     Reply pVersion(ConsoleEntry&, const QelMessageGetEnclTypeAndInterfaceVersionReq&) QEL_REQUIRES(mMutex);

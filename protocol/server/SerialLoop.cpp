@@ -43,9 +43,7 @@ void SerialLoop::pRun() noexcept
 
 void SerialLoop::pPollOnce()
 {
-    const bool linesEnding = mHypervisor.serviceEndedLines();
-    std::chrono::milliseconds timeout = PollSet::TIMEOUT_INFINITE;
-    if (linesEnding) timeout = kExitInterval;
+    const std::chrono::milliseconds timeout = mHypervisor.serviceLines();
     const std::vector<SerialWatch> watches = mHypervisor.serialWatches();
     PollSet set(mWake.getPollFd());
     for (const SerialWatch& watch : watches)

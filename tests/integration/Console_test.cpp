@@ -396,10 +396,10 @@ TEST_F(ConsoleTest, AnUnknownPartitionOrConnectionIsRefused)
     EXPECT_EQ(partition.errors,
               "qel: the server does not have partition 9: 0x00000015 (QelMessageStatusInvalidLparId)\n");
     EXPECT_EQ(runConsole({"09"}, "").errors, partition.errors); // no octal number, which would be none
-    const auto connection = runConsole({"1", "--connection", "1"}, "");
+    const auto connection = runConsole({"1", "--connection", "16"}, "");
     EXPECT_EQ(connection.exitStatus, 1);
     EXPECT_EQ(connection.errors,
-              "qel: partition 1 does not have this serial connection; --connection 0 is the only one: 0x00000010 "
+              "qel: partition 1 does not have this serial connection; --connection 0 types, 1 to 15 watch: 0x00000010 "
               "(QelMessageStatusInvalidConnectionNumber)\n");
 }
 

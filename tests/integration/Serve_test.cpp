@@ -177,6 +177,8 @@ TEST(Serve, AfterTheEndOfTheCommandTheConsoleCanOpenAgain)
     console.readUntil(1, "bye\r\n");
     EXPECT_EQ(console.awaitClosed(1), 4U);
     console.openSerial(1);
+    // What it has put out before comes first.
+    EXPECT_EQ(pidIn(console.readUntil(1, "\r\n[qel: the command exited with status 0]\r\n")), first);
     EXPECT_NE(pidIn(console.readUntil(1, "\r\n")), first);
     server.stop();
 }

@@ -94,6 +94,7 @@ TEST_P(ConsoleStepsTest, AConsoleThatLeavesMakesRoomForTheNext)
 
 TEST_P(ConsoleStepsTest, AConsoleThatReadsNothingHoldsUpNobody)
 {
+    serveWith(waiting());
     Peer stalled;
     begin(stalled);
     stalled.link.room = false;

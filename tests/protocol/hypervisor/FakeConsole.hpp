@@ -4,6 +4,7 @@
 #include <qel/common/QelMessageRegistry.hpp>
 
 #include "hypervisor/ConsoleLink.hpp"
+#include "support/Allocations.hpp"
 
 #include <deque>
 #include <memory>
@@ -22,6 +23,7 @@ public:
 
     void post(std::unique_ptr<QelMessage> message) override
     {
+        const Allocations::Exempt exempt;
         if (finished) throw std::logic_error("posted after finish()");
         mPosted.push_back(mRegistry.deserialize(message->serialize(), message->msgLength()));
     }

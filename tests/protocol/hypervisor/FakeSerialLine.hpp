@@ -3,6 +3,8 @@
 #include <qel/common/util/PosixError.hpp>
 #include <qel/protocol/SerialLine.hpp>
 
+#include "support/Allocations.hpp"
+
 #include <algorithm>
 #include <atomic>
 #include <cerrno>
@@ -30,8 +32,14 @@ public:
     bool goesDownWhenItFailsToStart = false;
     bool failsToWrite = false;
     std::function<void(const std::string& operation)> onCall; ///< called first by each operation; may throw
-    std::optional<std::size_t> saysRead;                      ///< what read() returns, be it true or not
-    std::optional<std::size_t> saysTaken;                     ///< what write() returns, be it true or not
+    std::deque<std::string> steps; ///< of coming up: what advance() throws, one after the other; "": not up yet
+    protocol::SerialLine::LineState whenEnded = LineState::Ended; ///< what read() returns then
+    std::string reason;                                           ///< endReason()
+    bool wantsWriting = false;
+    PollDeadline nextAdvance;
+    bool hasBreak = false;
+    std::optional<std::size_t> saysRead;  ///< what read() returns, be it true or not
+    std::optional<std::size_t> saysTaken; ///< what write() returns, be it true or not
 
     // The calls.
     std::string input;           ///< all that was taken
@@ -39,6 +47,8 @@ public:
     unsigned started = 0;
     unsigned stopped = 0;
     unsigned reads = 0;
+    unsigned advanced = 0;
+    unsigned breaks = 0;
 
     void start(std::uint16_t id) override
     {
@@ -50,6 +60,25 @@ public:
         }
         if (!mRunning) ++started;
         mRunning = true;
+    }
+    bool advance() override
+    {
+        called("advance");
+        ++advanced;
+        if (steps.empty()) return true;
+        const std::string step = steps.front();
+        steps.pop_front();
+        if (!step.empty()) throw std::runtime_error(step);
+        return false;
+    }
+    bool wantsToWrite() const override { return wantsWriting; }
+    PollDeadline advanceAt() const override { return nextAdvance; }
+    std::string endReason() const override { return reason; }
+    bool sendBreak() override
+    {
+        requireRunning();
+        if (hasBreak) ++breaks;
+        return hasBreak;
     }
     bool hasHungUp() const override
     {
@@ -64,11 +93,12 @@ public:
     }
     ReadResult read(char* buffer, std::size_t length) override
     {
+        const Allocations::Exempt exempt;
         called("read");
         requireRunning();
         ++reads;
         if (saysRead) return {LineState::Data, *saysRead};
-        if (output.empty()) return {ended ? LineState::Ended : LineState::Idle, 0};
+        if (output.empty()) return {ended ? whenEnded : LineState::Idle, 0};
         const std::string chunk = output.front().substr(0, length);
         output.front().erase(0, chunk.size());
         if (output.front().empty()) output.pop_front();

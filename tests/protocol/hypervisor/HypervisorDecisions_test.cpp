@@ -228,7 +228,7 @@ TEST_F(HypervisorDecisionsTest, ForAConsoleThatMayOpenAPartitionTheUsualRulesHol
     openSession(other, "b");
     EXPECT_EQ(open(holder, 1), 0U);
     EXPECT_EQ(open(other, 1), kNotAvailable);
-    EXPECT_EQ(open(other, 1, 1), kInvalidConnectionNumber);
+    EXPECT_EQ(open(other, 1, 16), kInvalidConnectionNumber);
     EXPECT_EQ(close(other, 1), kClosureFailure);
     EXPECT_EQ(open(other, 1, 0, true), 0U);
 }

@@ -41,13 +41,20 @@ protected:
 
     /// Starts over with a machine, and gives it the two partitions.
     void serve(std::unique_ptr<protocol::Hypervisor> served,
-               std::uint8_t maxConsoles = protocol::HypervisorEngine::kDefaultMaxConsoles)
+               std::uint8_t maxConsoles = protocol::HypervisorEngine::kDefaultMaxConsoles,
+               const protocol::PartitionOptions& options = {})
     {
         hypervisor.reset();
         machine = std::move(served);
-        machine->addPartition(1, makeLine(port1));
-        machine->addPartition(2, makeLine(port2));
+        machine->addPartition(1, makeLine(port1), options);
+        machine->addPartition(2, makeLine(port2), options);
         startEngine(maxConsoles);
+    }
+
+    /// Starts over with two partitions that are served in a certain way.
+    void serveWith(const protocol::PartitionOptions& options)
+    {
+        serve(std::make_unique<protocol::Hypervisor>(), protocol::HypervisorEngine::kDefaultMaxConsoles, options);
     }
 
     /// Starts an engine for the machine.
@@ -149,6 +156,9 @@ protected:
             events.emplace_back(watch.partition, watch.fd.mFd.events);
         return events;
     }
+
+    /// Does what is due. @return whether the hypervisor looks again soon whether a command has ended
+    bool awaitsEnd() const { return hypervisor->serviceLines() == protocol::Partition::kExitInterval; }
 
     CapturedLog log{LogLevel::Warn};
     QelMessageRegistry registry;

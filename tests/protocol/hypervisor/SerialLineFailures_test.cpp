@@ -52,7 +52,7 @@ protected:
     /// Starts over with a console whose data flows.
     std::unique_ptr<Peer> begin()
     {
-        serve(std::make_unique<protocol::Hypervisor>());
+        serveWith(keeping(0));
         auto peer = std::make_unique<Peer>();
         setUpSerial(*peer, "a", 1);
         return peer;
@@ -75,7 +75,7 @@ TEST_F(SerialLineFailuresTest, StartFailsTheRequest)
 {
     for (const Kind& kind : kinds()) {
         SCOPED_TRACE(kind.logged);
-        serve(std::make_unique<protocol::Hypervisor>());
+        serveWith(keeping(0));
         Peer peer;
         openSession(peer, "a");
         failIn("start", kind);
@@ -88,6 +88,7 @@ TEST_F(SerialLineFailuresTest, StartFailsTheRequest)
 
 TEST_F(SerialLineFailuresTest, AHolderIsToldWhenItsLineIsDownAfterAFailedStart)
 {
+    serveWith(keeping(0));
     Peer holder;
     Peer other;
     setUpSerial(holder, "a", 1);
@@ -132,7 +133,9 @@ TEST_F(SerialLineFailuresTest, AHangUpThatCannotBeAskedAboutIsOne)
 {
     for (const Kind& kind : kinds()) {
         SCOPED_TRACE(kind.logged);
-        const auto peer = begin();
+        serveWith(waiting()); // otherwise the line is read, and says itself that it has ended
+        const auto peer = std::make_unique<Peer>();
+        setUpSerial(*peer, "a", 1);
         ASSERT_EQ(close(*peer, 1), 0U);
         failIn("hasHungUp", kind);
         hypervisor->serviceSerial(1);
@@ -210,10 +213,10 @@ TEST_F(SerialLineFailuresTest, OneBrokenLineDoesNotTouchTheOther)
 TEST_F(SerialLineFailuresTest, ALineThatHasReadMoreThanThereWasRoomForIsBroken)
 {
     const auto peer = begin();
-    port1->saysRead = protocol::PartitionSet::kOutputChunk;
+    port1->saysRead = protocol::PartitionSessions::kPiece;
     hypervisor->serviceSerial(1);
-    EXPECT_EQ(takeData(*peer, 1).size(), protocol::PartitionSet::kOutputChunk);
-    port1->saysRead = protocol::PartitionSet::kOutputChunk + 1;
+    EXPECT_EQ(takeData(*peer, 1).size(), protocol::PartitionSessions::kPiece);
+    port1->saysRead = protocol::PartitionSessions::kPiece + 1;
     hypervisor->serviceSerial(1);
     expectClosed(*peer, 1, kReadFailure, 0x0100);
     EXPECT_THAT(log.lines(),

@@ -9,7 +9,7 @@ namespace qel::test {
 
 namespace {
 
-using protocol::PartitionSet;
+using protocol::Partition;
 using ::testing::ElementsAre;
 using ::testing::HasSubstr;
 using ::testing::IsEmpty;
@@ -171,7 +171,7 @@ TEST_F(VirtualSerialTest, AConsoleIsNotReadWhileTooMuchOfItsInputWaits)
     setUpSerial(peer, "a", 1);
     setUpSerial(other, "b", 2);
     port1->takes = 0;
-    sendData(peer, 1, std::string(PartitionSet::kInputLimit - 1, 'x'));
+    sendData(peer, 1, std::string(Partition::kInputLimit - 1, 'x'));
     EXPECT_TRUE(hypervisor->mayReceive(peer.id));
     sendData(peer, 1, "x");
     EXPECT_FALSE(hypervisor->mayReceive(peer.id));

@@ -77,6 +77,7 @@ TEST_F(VirtualSerialTest, InputForAnEndedCommandIsDroppedAndReadingResumes)
 
 TEST_F(VirtualSerialTest, ACommandThatEndsWithoutASessionIsTakenDown)
 {
+    serveWith(waiting());
     Peer peer;
     setUpSerial(peer, "a", 1);
     EXPECT_EQ(close(peer, 1), 0U);
@@ -105,6 +106,7 @@ TEST_F(VirtualSerialTest, LogAndNoticeSayHowTheCommandEnded)
         {{Kind::Killed, 9}, 0x0209, "I: [qel] partition 1: the command was killed by signal 9 (Killed)"},
         {{Kind::Unknown, 0}, 0, "I: [qel] partition 1: the command ended"},
     };
+    serveWith(keeping(0));
     Peer peer;
     openSession(peer, "a");
     QelLogger::get().setLevel(LogLevel::Info);
@@ -127,17 +129,17 @@ TEST_F(VirtualSerialTest, TheNoticeWaitsForTheCommandToEnd)
     setUpSerial(peer, "a", 1);
     port1->ended = true;
     port1->end.reset(); // the line ends a moment before the command
-    EXPECT_FALSE(hypervisor->serviceEndedLines());
+    EXPECT_FALSE(awaitsEnd());
     hypervisor->serviceSerial(1);
-    EXPECT_TRUE(hypervisor->serviceEndedLines());
+    EXPECT_TRUE(awaitsEnd());
     EXPECT_EQ(peer.link.posted(), 0U);
     EXPECT_EQ(port1->stopped, 0U);
     EXPECT_THAT(watched(), IsEmpty()); // it would be reported without end
     port1->end = CommandEnd{CommandEnd::Kind::Exited, 3};
-    EXPECT_FALSE(hypervisor->serviceEndedLines());
+    EXPECT_FALSE(awaitsEnd());
     expectClosed(peer, 1, 4, 0x0103);
     EXPECT_EQ(port1->stopped, 1U);
-    EXPECT_FALSE(hypervisor->serviceEndedLines());
+    EXPECT_FALSE(awaitsEnd());
 }
 
 TEST_F(VirtualSerialTest, ACommandThatOnlyClosedItsTerminalIsTakenDownAfterASecond)
@@ -151,10 +153,10 @@ TEST_F(VirtualSerialTest, ACommandThatOnlyClosedItsTerminalIsTakenDownAfterASeco
     port1->end.reset();
     hypervisor->serviceSerial(1);
     clock.advance(std::chrono::milliseconds(999));
-    EXPECT_TRUE(hypervisor->serviceEndedLines());
+    EXPECT_TRUE(awaitsEnd());
     EXPECT_EQ(port1->stopped, 0U);
     clock.advance(std::chrono::milliseconds(1));
-    EXPECT_FALSE(hypervisor->serviceEndedLines());
+    EXPECT_FALSE(awaitsEnd());
     EXPECT_EQ(port1->stopped, 1U);
     expectClosed(peer, 1, 4, 0x0300);
     EXPECT_THAT(log.lines(), ElementsAre("I: [qel] partition 1: the command closed its terminal"));
@@ -189,10 +191,11 @@ TEST_F(VirtualSerialTest, OpeningAnEndedLineStartsTheCommandAgain)
     expectClosed(holder, 1, 4, 0x0103);
     EXPECT_EQ(port1->started, 2U);
     port1->ended = false;
-    EXPECT_FALSE(hypervisor->serviceEndedLines());
+    EXPECT_FALSE(awaitsEnd());
     EXPECT_EQ(setUp(other, 1), 0U);
     port1->output = {"again"};
     hypervisor->serviceSerial(1);
+    EXPECT_EQ(takeData(other, 1), "\r\n[qel: the command exited with status 3]\r\n");
     EXPECT_EQ(takeData(other, 1), "again");
 }
 
@@ -210,10 +213,11 @@ TEST_F(VirtualSerialTest, OpeningAnEndedLineWhoseCommandRunsStartsTheCommandAgai
     EXPECT_EQ(port1->stopped, 1U);
     EXPECT_EQ(port1->started, 2U);
     port1->ended = false;
-    EXPECT_FALSE(hypervisor->serviceEndedLines());
+    EXPECT_FALSE(awaitsEnd());
     EXPECT_EQ(setUp(other, 1), 0U);
     port1->output = {"again"};
     hypervisor->serviceSerial(1);
+    EXPECT_EQ(takeData(other, 1), "\r\n[qel: the command closed its terminal]\r\n");
     EXPECT_EQ(takeData(other, 1), "again");
 }
 

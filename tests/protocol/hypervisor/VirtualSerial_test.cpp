@@ -44,16 +44,16 @@ TEST_F(VirtualSerialTest, AnUnknownPartitionIsReportedBeforeAnUnknownConnectionN
     for (const bool force : {false, true}) {
         SCOPED_TRACE(force);
         EXPECT_EQ(open(peer, 3, 0, force), kInvalidLparId);
-        EXPECT_EQ(open(peer, 0, 1, force), kInvalidLparId);
-        EXPECT_EQ(open(peer, 1, 1, force), kInvalidConnectionNumber);
+        EXPECT_EQ(open(peer, 0, 16, force), kInvalidLparId);
+        EXPECT_EQ(open(peer, 1, 16, force), kInvalidConnectionNumber);
         EXPECT_EQ(open(peer, 1, 65535, force), kInvalidConnectionNumber);
         EXPECT_EQ(close(peer, 3, 0, force), kInvalidLparId);
-        EXPECT_EQ(close(peer, 3, 1, force), kInvalidLparId);
-        EXPECT_EQ(close(peer, 1, 1, force), kInvalidConnectionNumber);
+        EXPECT_EQ(close(peer, 3, 16, force), kInvalidLparId);
+        EXPECT_EQ(close(peer, 1, 16, force), kInvalidConnectionNumber);
     }
     EXPECT_EQ(setUp(peer, 3), kInvalidLparId);
-    EXPECT_EQ(setUp(peer, 3, 1), kInvalidLparId);
-    EXPECT_EQ(setUp(peer, 1, 1), kInvalidConnectionNumber);
+    EXPECT_EQ(setUp(peer, 3, 16), kInvalidLparId);
+    EXPECT_EQ(setUp(peer, 1, 16), kInvalidConnectionNumber);
     EXPECT_EQ(port1->started, 0U);
 }
 
@@ -65,7 +65,7 @@ TEST_F(VirtualSerialTest, ASessionThatAnotherConsoleHoldsIsNotAvailable)
     openSession(other, "b");
     openSerial(holder, 1);
     EXPECT_EQ(open(other, 1), kConnectionNotAvailable);
-    EXPECT_EQ(open(other, 1, 1), kInvalidConnectionNumber);
+    EXPECT_EQ(open(other, 1, 16), kInvalidConnectionNumber);
     EXPECT_EQ(open(holder, 1), kConnectionNotAvailable); // itself too
     EXPECT_EQ(holder.link.posted(), 0U);
     EXPECT_EQ(open(other, 2), 0U);
@@ -151,6 +151,7 @@ TEST_F(VirtualSerialTest, OnlyTheHolderSetsUp)
 
 TEST_F(VirtualSerialTest, BeforeTheSetUpNoDataFlows)
 {
+    serveWith(waiting());
     Peer peer;
     openSession(peer, "a");
     openSerial(peer, 1);
@@ -172,6 +173,7 @@ TEST_F(VirtualSerialTest, BeforeTheSetUpNoDataFlows)
 
 TEST_F(VirtualSerialTest, ClosingTheSessionKeepsTheCommandRunning)
 {
+    serveWith(waiting());
     Peer peer;
     setUpSerial(peer, "a", 1);
     receive(peer, QelMessageVirtualSerialCloseReq(1, 0, false));
@@ -188,6 +190,7 @@ TEST_F(VirtualSerialTest, ClosingTheSessionKeepsTheCommandRunning)
 
 TEST_F(VirtualSerialTest, OutputWithoutASessionWaitsForTheNextOne)
 {
+    serveWith(waiting());
     Peer peer;
     setUpSerial(peer, "a", 1);
     EXPECT_EQ(close(peer, 1), 0U);
@@ -249,6 +252,7 @@ TEST_F(VirtualSerialTest, ADisconnectedConsoleReleasesItsSerialSessions)
 
 TEST_F(VirtualSerialTest, TheNextHolderMustSetTheSessionUp)
 {
+    serveWith(waiting());
     Peer gone;
     Peer closed;
     Peer next;

@@ -35,7 +35,7 @@ TEST(RefusalReason, SaysWhatToDoAboutEachRefusalOfTheServer)
               "the command of partition 3 cannot be started; the log of the server says why");
     EXPECT_EQ(reason(0x6002, 0x0402, 21), "the server does not have partition 3");
     EXPECT_EQ(reason(0x6002, 0x0402, 16),
-              "partition 3 does not have this serial connection; --connection 0 is the only one");
+              "partition 3 does not have this serial connection; --connection 0 types, 1 to 15 watch");
     EXPECT_EQ(reason(0x6002, 0x0406, 4), "another console has taken partition 3 in the meantime");
     EXPECT_EQ(reason(0x6002, 0x0403, 20), "this console does not hold partition 3");
 }

@@ -42,7 +42,7 @@ constexpr Row kReasons[] = {
      "this console does not hold $"},
     {kSerial, kAny, QelMessageStatusInvalidLparId, "the server does not have $"},
     {kSerial, kAny, QelMessageStatusInvalidConnectionNumber,
-     "$ does not have this serial connection; --connection 0 is the only one"},
+     "$ does not have this serial connection; --connection 0 types, 1 to 15 watch"},
 
     {kAny, kAny, QelMessageStatusInvalidFunction, "the server does not know this kind of request"},
     {kAny, kAny, QelMessageStatusInvalidOperation, "the server does not know this request"},

@@ -9,6 +9,7 @@
 #include "base/Logging.hpp"
 #include "base/OptionChecks.hpp"
 #include "base/SignalWatch.hpp"
+#include "serve/PartitionChoices.hpp"
 #include "transport/TransportOptions.hpp"
 
 #include <algorithm>
@@ -44,6 +45,7 @@ struct ServeOptions {
     TransportOptions transport;
     std::vector<std::string> partitions; ///< "ID=COMMAND"
     std::string term = "vt220";
+    PartitionChoices serving;
     std::uint32_t maxConsoles = ServerOptions().maxConsoles;
     double frameSeconds = std::chrono::duration<double>(ServerOptions().frameTimeout).count();
     std::uint32_t keepAliveSeconds = static_cast<std::uint32_t>(ServerOptions().keepAlive.count());
@@ -114,6 +116,7 @@ struct ServePlan {
     ServerOptions server; ///< without the credentials, which are loaded when it starts
     std::map<std::uint16_t, std::string> commands;
     std::string term;
+    PartitionOptions serving; ///< of all partitions
     MachineInfo machine;
     QelCapabilities capabilities;
     TransportOptions transport;
@@ -123,7 +126,7 @@ struct ServePlan {
 void addPartitions(Hypervisor& machine, const ServePlan& plan)
 {
     for (const auto& command : plan.commands)
-        machine.addPartition(command.first, commandLine(command.second, {plan.term, {}}));
+        machine.addPartition(command.first, commandLine(command.second, {plan.term, {}}), plan.serving);
 }
 
 ServerOptions parseServer(const ServeOptions& options)
@@ -148,6 +151,7 @@ ServePlan makePlan(const ServeOptions& options)
     plan.transport = options.transport;
     plan.commands = parsePartitions(options.partitions);
     plan.term = options.term;
+    plan.serving = options.serving.options();
     plan.machine = parseMachine(options);
     plan.capabilities = QelCapabilities(options.capabilities);
     plan.log = options.log;
@@ -303,6 +307,7 @@ CLI::App& addServeCommand(CLI::App& parent, Action& action)
         ->type_name("NAME")
         ->check(CLI::Validator(checkTerm, ""))
         ->capture_default_str();
+    addPartitionChoices(command, options->serving);
     addLimitOptions(command, *options);
     addIdentityOptions(command, *options);
     addLogOptions(command, options->log);

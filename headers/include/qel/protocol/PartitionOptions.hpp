@@ -44,8 +44,9 @@ struct PartitionOptions {
     RestartLine restart = RestartLine::Never;
 
     /// For a line to something that breaks and comes back, such as a socket or a device. The line is brought up when
-    /// the server starts, and again whenever it is lost: at once, then after 1 s, doubled to 30 s. Its sessions stay
-    /// open meanwhile; their data say when the line is lost and when it is back. `start` and `restart` do not apply.
+    /// the server starts, and again when it is lost: after 1 s, then after twice the time, up to 30 s; 1 s again once
+    /// it has been up for 5 s. Its sessions stay open meanwhile, and their data say when the line is lost and when it
+    /// is back. What is typed while it is down is dropped. `start` and `restart` do not apply.
     bool keepsSession = false;
 
     std::shared_ptr<SerialTap> tap; ///< listens to the output; may be null

@@ -1,0 +1,388 @@
+#include "hypervisor/Partition.hpp"
+
+#include <qel/common/util/TimeProvider.hpp>
+#include <qel/protocol/Logging.hpp>
+
+#include <algorithm>
+#include <array>
+#include <new>
+#include <utility>
+
+namespace qel::protocol {
+
+namespace {
+
+constexpr CommandEnd kClosedTerminal{CommandEnd::Kind::ClosedTerminal, 0};
+
+/// How long a line has to be up for the next pause to be a short one.
+constexpr std::chrono::seconds kSettledCommand(30);
+constexpr std::chrono::seconds kSettledConnection(5);
+
+/// Pieces of output that are read at once from a line that is about to be started again.
+constexpr int kDrainedPieces = 64;
+
+/// The history holds at least the piece that is on its way to the session that types.
+std::size_t historyLimit(const PartitionOptions& options)
+{
+    return std::max(options.replayBytes, PartitionSessions::kPiece);
+}
+
+bool isSuccess(const CommandEnd& end) { return end.kind == CommandEnd::Kind::Exited && end.number == 0; }
+
+} // namespace
+
+Partition::Partition(std::uint16_t id, SerialLine& line, PartitionOptions options, SerialEvents& events)
+    : mId(id), mOptions(std::move(options)), mEvents(events), mLine(id, line, !mOptions.keepsSession),
+      mOutput(historyLimit(mOptions)), mSessions(id, mOutput),
+      mPause(mOptions.keepsSession ? kSettledConnection : kSettledCommand)
+{
+    if (mOptions.keepsSession || mOptions.start == StartLine::Boot) mStartAt = TimeProvider::steady();
+}
+
+Partition::~Partition()
+{
+    if (mState != State::Down) mLine.stop();
+}
+
+QelMessageStatusCodes Partition::open(ConsoleEntry& console, std::uint16_t number, bool force)
+{
+    if (mSessions.has(number) && !force) return QelMessageStatusConnectionNotAvailable;
+    mEvents.changed = true; // even when the command cannot be started: what is left of an ended one is taken down first
+    if (!pBringUp(number == PartitionSessions::kTyping)) return QelMessageStatusCmdFailed;
+    mSessions.end(number, CloseReason::CloseReasonForceClose);
+    mSessions.open(number, console);
+    return QelMessageStatusNoError;
+}
+
+QelMessageStatusCodes Partition::setUp(ConsoleEntry& console, std::uint16_t number)
+{
+    if (!mSessions.isOf(number, console)) return QelMessageStatusInvalidCmdSequence;
+    mSessions.setUp(number, mOptions.replayBytes);
+    mEvents.changed = true;
+    return QelMessageStatusNoError;
+}
+
+QelMessageStatusCodes Partition::close(ConsoleEntry& console, std::uint16_t number, bool force)
+{
+    if (mSessions.isOf(number, console)) {
+        mSessions.drop(number);
+    } else if (mSessions.has(number) && force) {
+        mSessions.end(number, CloseReason::CloseReasonForceClose);
+    } else {
+        return QelMessageStatusConnectionClosureFailure;
+    }
+    mEvents.changed = true;
+    return QelMessageStatusNoError;
+}
+
+bool Partition::feed(const ConsoleEntry& console, std::uint16_t number, const char* data, std::size_t length)
+{
+    if (!mSessions.isOf(number, console) || !mSessions.isSetUp(number)) return false;
+    if (length == 0) return true;
+    mEvents.changed = true;
+    if (number != PartitionSessions::kTyping) {
+        mSessions.refuseInput(number);
+    } else if (mState == State::Up || mState == State::ComingUp) {
+        mInput.append(data, length);
+        pPumpInput();
+    } // nothing reads what is typed on a line that is down
+    return true;
+}
+
+void Partition::release(const ConsoleEntry& console)
+{
+    if (mSessions.dropAllOf(console)) mEvents.changed = true;
+}
+
+bool Partition::mayAddInput(const ConsoleEntry& console) const
+{
+    return mInput.size() < kInputLimit || !mSessions.isOf(PartitionSessions::kTyping, console) ||
+           !mSessions.isSetUp(PartitionSessions::kTyping);
+}
+
+bool Partition::sendBreak()
+{
+    mEvents.changed = true; // the line may want to be called to end the break
+    return mState == State::Up && mLine.sendBreak();
+}
+
+void Partition::change(const PartitionOptions& options)
+{
+    PartitionOptions changed = options;
+    changed.keepsSession = mOptions.keepsSession;
+    mOutput.setLimit(historyLimit(changed));
+    mOptions = std::move(changed);
+    mEvents.changed = true;
+}
+
+void Partition::retire(CloseReason reason)
+{
+    mSessions.endAll(reason);
+    mIsRetired = true;
+    mEvents.changed = true;
+    pStopLine();
+}
+
+void Partition::remove()
+{
+    pNote("the partition has been removed");
+    mSessions.deliver();
+    retire(CloseReason::CloseReasonQelShutdown);
+}
+
+std::optional<PollFd> Partition::watch() const
+{
+    if (mState != State::Up && mState != State::ComingUp) return std::nullopt;
+    const bool isUp = mState == State::Up;
+    const bool wantsOutput = !isUp || pWantsOutput();
+    const bool wantsToWrite = (isUp && !mInput.empty()) || mLine.wantsToWrite();
+    if (!mSessions.isEmpty() && !wantsOutput && !wantsToWrite) return std::nullopt;
+    // Without a session nothing may be read, but a hang-up is noticed: poll(2) always reports it.
+    PollFd fd(mLine.descriptor(), PollEvents::Error);
+    if (wantsToWrite) fd.mFd.events |= static_cast<short>(PollEvents::Write);
+    if (wantsOutput) fd.mFd.events |= static_cast<short>(PollEvents::Read);
+    return fd;
+}
+
+PollDeadline Partition::deadline(TimePoint now) const
+{
+    if (mSessions.canDeliver()) return now;
+    switch (mState) {
+    case State::Down:
+        return mStartAt;
+    case State::ComingUp:
+    case State::Up:
+        return mLine.advanceAt();
+    case State::Ended:
+        break;
+    }
+    if (pMayFinishExit(now)) return now + kExitInterval;
+    return mSetUpBy.isExpired(now) ? PollDeadline() : mSetUpBy; // room in a link comes with a wake-up
+}
+
+void Partition::service()
+{
+    if (mState != State::Up && mState != State::ComingUp) return;
+    if ((mState == State::ComingUp || mLine.wantsToWrite()) && !pAdvance()) return pFail();
+    if (mState != State::Up) return;
+    if (mSessions.isEmpty() && !pWantsOutput() && mLine.hasHungUp()) mIsDraining = true;
+    pPumpInput();
+    mSessions.deliver();
+    if (mState != State::Up || !pWantsOutput() || pReadOutput() || !mIsDraining) return;
+    if (mState == State::Up) pBeginExit(); // it has hung up and has nothing left
+}
+
+void Partition::serviceTime(TimePoint now)
+{
+    mSessions.deliver();
+    if (mState == State::Ended) return pFinishExit(now);
+    if (mState == State::Down && mStartAt.isExpired(now)) {
+        mStartAt = PollDeadline();
+        if (!pStart(now)) pFail();
+    } else if ((mState == State::Up || mState == State::ComingUp) && mLine.advanceAt().isExpired(now)) {
+        if (!pAdvance()) pFail();
+    }
+}
+
+/// Brings the line up for a console that opens a session.
+/// @param mayRestart  an ended command is started again; otherwise the session only gets what is left of its output
+/// @return false: the line is down
+bool Partition::pBringUp(bool mayRestart)
+{
+    if (mIsRetired) return false;
+    if (mOptions.keepsSession) return true; // it comes up by itself
+    if (mState == State::ComingUp || (mState != State::Down && !mayRestart)) return true;
+    if (mState == State::Up && mLine.hasHungUp()) pDrain();
+    if (mState == State::Ended) pEndCommand(mLine.commandEnd().value_or(kClosedTerminal));
+    const bool wasUp = mState == State::Up;
+    if (wasUp ? mLine.start() : pStart(TimeProvider::steady())) return true;
+    // What had ended on the line could not be started again.
+    if (!wasUp || mLine.descriptor() < 0) pTakeDown(CloseReason::CloseReasonReadFailure, {});
+    return false;
+}
+
+/// @return false: the line has failed, and pFail() or pTakeDown() must follow
+bool Partition::pStart(TimePoint now)
+{
+    mStartAt = PollDeadline();
+    mState = State::ComingUp; // so that it is taken down even when it fails
+    mUpSince = now;
+    return mLine.start() && pAdvance();
+}
+
+/// @return false: the line has failed
+bool Partition::pAdvance()
+{
+    const GuardedLine::Progress progress = mLine.advance();
+    if (progress == GuardedLine::Progress::Up && mState == State::ComingUp) pOnUp();
+    return progress != GuardedLine::Progress::Failed;
+}
+
+void Partition::pOnUp()
+{
+    mState = State::Up;
+    mEvents.changed = true;
+    mUpSince = TimeProvider::steady();
+    if (!std::exchange(mIsLost, false)) return;
+    logLine(LogLevel::Info, "partition ", mId, ": line is back");
+    pNote("line is back");
+}
+
+/// The line has failed otherwise than by reading.
+void Partition::pFail()
+{
+    if (mOptions.keepsSession) return pLoseLine();
+    pTakeDown(CloseReason::CloseReasonReadFailure, {});
+}
+
+/// Takes a line that keeps its sessions down until the next attempt.
+void Partition::pLoseLine()
+{
+    const auto now = TimeProvider::steady();
+    const bool wasUp = mState == State::Up;
+    if (!mIsLost) {
+        std::string reason = mLine.failure();
+        if (reason.empty()) reason = "it has ended";
+        const std::string text = (wasUp ? "line lost: " : "line is down: ") + reason + "; connecting again";
+        logLine(LogLevel::Warn, "partition ", mId, ": ", text);
+        pNote(text);
+        mIsLost = true;
+    }
+    pStopLine();
+    mStartAt = now + mPause.next(wasUp ? now - mUpSince : RestartPause::Duration(0));
+}
+
+/// The line has ended. Its command ends a moment later, unless it has only closed its terminal.
+void Partition::pBeginExit()
+{
+    const auto now = TimeProvider::steady();
+    mState = State::Ended;
+    mEvents.changed = true;
+    mExitBy = now + kExitTimeout;
+    mSetUpBy = now + kSetUpTimeout;
+    pFinishExit(now);
+}
+
+/// Whether the sessions have got what they wait for.
+bool Partition::pMayFinishExit(TimePoint now) const
+{
+    if (!mSessions.isCaughtUp(PartitionSessions::kTyping)) return false;
+    return mSessions.areAllSetUp() || mSetUpBy.isExpired(now);
+}
+
+/// Takes the line of an ended command down, as soon as it is known how the command ended.
+void Partition::pFinishExit(TimePoint now)
+{
+    if (!pMayFinishExit(now)) return;
+    std::optional<CommandEnd> end = mLine.commandEnd();
+    if (!end) {
+        if (!mExitBy.isExpired(now)) return;
+        end = kClosedTerminal;
+    }
+    pEndCommand(*end);
+}
+
+/// Takes the line of a command down and tells the consoles, the log and the history how it ended.
+void Partition::pEndCommand(const CommandEnd& end)
+{
+    const bool isAttended = !mSessions.isEmpty();
+    pTakeDown(CloseReason::CloseReasonReadFailure, end);
+    const std::string text = describe(end);
+    logLine(LogLevel::Info, "partition ", mId, ": ", text, isAttended ? "" : ", with no session open");
+    pNote(text);
+}
+
+/// Ends the sessions and takes the line of a command down. It is brought up again as the options say.
+void Partition::pTakeDown(CloseReason reason, const CommandEnd& end)
+{
+    mSessions.endAll(reason, end);
+    const auto now = TimeProvider::steady();
+    const bool cameUp = mState == State::Up || mState == State::Ended;
+    pStopLine();
+    const bool again =
+        mOptions.restart == RestartLine::Always || (mOptions.restart == RestartLine::OnFailure && !isSuccess(end));
+    if (again) mStartAt = now + mPause.next(cameUp ? now - mUpSince : RestartPause::Duration(0));
+}
+
+void Partition::pStopLine()
+{
+    const bool wasFull = mInput.size() >= kInputLimit;
+    mState = State::Down;
+    mInput.clear();
+    mIsDraining = false;
+    mStartAt = mExitBy = mSetUpBy = PollDeadline();
+    mEvents.changed = true;
+    mLine.stop();
+    if (wasFull) mSessions.resumeTyping();
+}
+
+void Partition::pPumpInput()
+{
+    if (mInput.empty() || mState != State::Up) return;
+    const bool wasFull = mInput.size() >= kInputLimit;
+    if (mLine.hasHungUp()) mInput.clear(); // nothing is left that reads it
+    while (!mInput.empty()) {
+        const std::optional<std::size_t> taken = mLine.write(mInput.data(), mInput.size());
+        if (!taken) return mOptions.keepsSession ? pLoseLine() : pTakeDown(CloseReason::CloseReasonWriteFailure, {});
+        if (*taken == 0) break;
+        mInput.erase(0, *taken);
+    }
+    if (wasFull && mInput.size() < kInputLimit) mSessions.resumeTyping();
+}
+
+/// Reads one piece of output and passes it on. @return false: there was none
+bool Partition::pReadOutput()
+{
+    // Whatever needs memory comes before the reading: what has been read must not be lost.
+    mOutput.reserve(PartitionSessions::kPiece);
+    if (mOptions.tap != nullptr) mEvents.tapCalls.reserve(mEvents.tapCalls.size() + 1);
+    std::string tapped;
+    if (mOptions.tap != nullptr) tapped.reserve(PartitionSessions::kPiece);
+    std::array<char, PartitionSessions::kPiece> buffer;
+    const SerialLine::ReadResult result = mLine.read(buffer.data(), buffer.size());
+    switch (result.state) {
+    case SerialLine::LineState::Idle:
+        return false;
+    case SerialLine::LineState::Ended:
+        mOptions.keepsSession ? pLoseLine() : pBeginExit();
+        return false;
+    case SerialLine::LineState::Data:
+        break;
+    }
+    mOutput.append(buffer.data(), result.length);
+    if (mOptions.tap != nullptr) {
+        tapped.assign(buffer.data(), result.length);
+        mEvents.tapCalls.push_back({mOptions.tap, mId, true, std::move(tapped)});
+    }
+    mSessions.deliver();
+    return true;
+}
+
+/// Reads what is left of the output of a command that has hung up, before it is started again.
+void Partition::pDrain()
+{
+    for (int piece = 0; piece < kDrainedPieces && mState == State::Up; ++piece) {
+        if (!pReadOutput()) return;
+    }
+}
+
+bool Partition::pWantsOutput() const
+{
+    constexpr std::uint16_t kTyping = PartitionSessions::kTyping;
+    if (mSessions.isSetUp(kTyping)) return mSessions.hasRoom(kTyping);
+    return mIsDraining || mOptions.unattended == WhenUnattended::Keep || mSessions.isAnySetUp();
+}
+
+/// Puts a line of the program's own into the output, and tells the tap.
+void Partition::pNote(const std::string& text)
+{
+    try {
+        const std::string line = "\r\n[qel: " + text + "]\r\n";
+        mOutput.reserve(line.size());
+        mOutput.append(line.data(), line.size());
+        if (mOptions.tap != nullptr) mEvents.tapCalls.push_back({mOptions.tap, mId, false, text});
+    } catch (const std::bad_alloc&) { // NOLINT(bugprone-empty-catch): the log has it
+    }
+}
+
+} // namespace qel::protocol
