@@ -1,6 +1,5 @@
 #include "serve/ServeCommand.hpp"
 
-#include <qel/protocol/CommandLine.hpp>
 #include <qel/protocol/Hypervisor.hpp>
 #include <qel/protocol/Server.hpp>
 
@@ -9,6 +8,7 @@
 #include "base/Logging.hpp"
 #include "base/OptionChecks.hpp"
 #include "base/SignalWatch.hpp"
+#include "lines/LineText.hpp"
 #include "serve/PartitionChoices.hpp"
 #include "transport/TransportOptions.hpp"
 
@@ -22,6 +22,7 @@
 #include <map>
 #include <memory>
 #include <sstream>
+#include <stdexcept>
 #include <string>
 #include <utility>
 #include <vector>
@@ -43,7 +44,7 @@ constexpr std::initializer_list<int> kSignals{SIGTERM, SIGINT, SIGHUP, SIGUSR1};
 struct ServeOptions {
     ServerOptions server;
     TransportOptions transport;
-    std::vector<std::string> partitions; ///< "ID=COMMAND"
+    std::vector<std::string> partitions; ///< "ID=LINE"
     std::string term = "vt220";
     PartitionChoices serving;
     std::uint32_t maxConsoles = ServerOptions().maxConsoles;
@@ -79,19 +80,31 @@ std::string checkTerm(const std::string& name)
     return isName ? std::string() : "\"" + name + "\" is not a terminal type, such as vt220";
 }
 
+/// Making a line opens nothing, so it is made once to find out that it can be.
+void checkLine(const std::string& text)
+{
+    try {
+        static_cast<void>(makeLine(text));
+    } catch (const std::invalid_argument& error) {
+        refuse("--partition", error.what());
+    }
+}
+
 std::map<std::uint16_t, std::string> parsePartitions(const std::vector<std::string>& texts)
 {
-    std::map<std::uint16_t, std::string> commands;
+    std::map<std::uint16_t, std::string> lines;
     for (const std::string& text : texts) {
         const std::size_t equals = text.find('=');
-        if (equals == std::string::npos || equals + 1 == text.size()) refuse("--partition", "takes ID=COMMAND");
+        if (equals == std::string::npos || equals + 1 == text.size()) refuse("--partition", "takes ID=LINE");
         const std::uint16_t id = parseUint16(text.substr(0, equals), 1, "--partition");
-        if (!commands.emplace(id, text.substr(equals + 1)).second) {
+        const std::string line = text.substr(equals + 1);
+        checkLine(line);
+        if (!lines.emplace(id, line).second) {
             refuse("--partition", "partition " + std::to_string(id) + " is given twice");
         }
     }
-    if (commands.size() > kMaxPartitions) refuse("--partition", "more than 255 partitions");
-    return commands;
+    if (lines.size() > kMaxPartitions) refuse("--partition", "more than 255 partitions");
+    return lines;
 }
 
 void parseVersion(const std::string& text, MachineInfo& machine)
@@ -113,8 +126,8 @@ MachineInfo parseMachine(const ServeOptions& options)
 
 /// The options, parsed.
 struct ServePlan {
-    ServerOptions server; ///< without the credentials, which are loaded when it starts
-    std::map<std::uint16_t, std::string> commands;
+    ServerOptions server;                       ///< without the credentials, which are loaded when it starts
+    std::map<std::uint16_t, std::string> lines; ///< as texts, by the ids of their partitions
     std::string term;
     PartitionOptions serving; ///< of all partitions
     MachineInfo machine;
@@ -125,8 +138,12 @@ struct ServePlan {
 
 void addPartitions(Hypervisor& machine, const ServePlan& plan)
 {
-    for (const auto& command : plan.commands)
-        machine.addPartition(command.first, commandLine(command.second, {plan.term, {}}), plan.serving);
+    for (const auto& entry : plan.lines) {
+        MadeLine made = makeLine(entry.second, {plan.term, {}});
+        PartitionOptions options = plan.serving;
+        options.keepsSession = made.options.keepsSession;
+        machine.addPartition(entry.first, std::move(made.line), std::move(options));
+    }
 }
 
 ServerOptions parseServer(const ServeOptions& options)
@@ -149,7 +166,7 @@ ServePlan makePlan(const ServeOptions& options)
     ServePlan plan;
     plan.server = parseServer(options);
     plan.transport = options.transport;
-    plan.commands = parsePartitions(options.partitions);
+    plan.lines = parsePartitions(options.partitions);
     plan.term = options.term;
     plan.serving = options.serving.options();
     plan.machine = parseMachine(options);
@@ -300,8 +317,9 @@ CLI::App& addServeCommand(CLI::App& parent, Action& action)
     command
         .add_option(
             "--partition", options->partitions,
-            "A partition: its id, and the shell command on its serial console, which starts when a console opens it")
-        ->type_name("ID=COMMAND")
+            "A partition: its id, and its serial line: a shell command (pty:COMMAND or the command alone), unix:PATH, "
+            "tcp:HOST:PORT, telnet:HOST:PORT[,SETTINGS] or tty:DEVICE[,SETTINGS] with settings such as 115200n8,rtscts")
+        ->type_name("ID=LINE")
         ->allow_extra_args(false);
     command.add_option("--term", options->term, "Terminal type of the partitions' commands: their TERM")
         ->type_name("NAME")
