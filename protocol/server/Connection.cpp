@@ -27,33 +27,23 @@ PollFd hangUpOf(int descriptor)
     return fd;
 }
 
-/// Puts what belongs below the messages on top of the lowest stream.
 /// @param records  set to what is below TLS
-std::unique_ptr<Stream> protect(std::unique_ptr<WireStream> wire, SSLServerContext* context, RecordStream*& records)
+std::unique_ptr<Stream> protect(std::unique_ptr<Stream> stream, SSLServerContext* context, RecordStream*& records)
 {
-    if (context == nullptr) return wire;
-    auto below = std::make_unique<RecordStream>(std::move(wire));
+    if (context == nullptr) return stream;
+    auto below = std::make_unique<RecordStream>(std::move(stream));
     records = below.get();
     return std::make_unique<SSLStream>(*context, std::move(below));
 }
-
-/// For what has been received and not been handed to the hypervisor, and for a batch that is being sent.
-constexpr BufferedStreamOptions kBuffers{Outbox::kBatchBytes, Outbox::kBatchBytes, false};
 
 } // namespace
 
 Connection::Connection(const ConnectionServices& services, ServedStream stream, SSLServerContext* context,
                        HandshakePlaces::Place place)
-    : Connection(services, stream, std::make_unique<WireStream>(std::move(stream.stream), stream.descriptor), context,
-                 std::move(place))
-{}
-
-Connection::Connection(const ConnectionServices& services, ServedStream& stream, std::unique_ptr<WireStream> wire,
-                       SSLServerContext* context, HandshakePlaces::Place place)
     : Outbox(services.limits.queueBytes), mServices(services), mAddress(std::move(stream.address)),
       mSource(std::move(stream.source)), mBlamed(mSource), mHangUp(hangUpOf(stream.descriptor)),
-      mPlace(std::move(place)), mClear(wire->below()), mWire(*wire),
-      mStream(protect(std::move(wire), context, mRecords)), mBuffered(*mStream, kBuffers), mFrames(mBuffered),
+      mPlace(std::move(place)), mClear(*stream.stream), mStream(protect(std::move(stream.stream), context, mRecords)),
+      mFrames(*mStream, context == nullptr ? FrameStream::ReadAhead::Yes : FrameStream::ReadAhead::No),
       mMessages(mFrames, messageRegistry()), mName(mAddress)
 {
     if (context == nullptr) return;
@@ -73,7 +63,6 @@ Connection::~Connection()
     }
     if (reader.joinable()) reader.join();
     if (mWriter.joinable()) mWriter.join();
-    retire();
 }
 
 void Connection::start()
@@ -114,10 +103,7 @@ bool Connection::dumpStatistics(std::ostream& os) const
     return true;
 }
 
-void Connection::resumeReading()
-{
-    if (mHeldBack) mWake.interrupt();
-}
+void Connection::resumeReading() { mWake.interrupt(); }
 
 void Connection::pConnect(const PeerIdentity& identity)
 {
@@ -183,27 +169,17 @@ void Connection::pRead() noexcept
 
 void Connection::pReceiveAll()
 {
-    startReading();
-    mWire.onRead([this] { sendOwn(); });
     bool mayRead = true;
     while (mayRead || pAwaitReceive()) {
         mFrames.beginFrame();
         const std::unique_ptr<QelMessage> message = mMessages.read();
-        const Received received = pHandOver(*message);
+        const Received received = mServices.hypervisor.receive(mId, *message);
         mayRead = received.mayReadNext;
         // The hypervisor closes the connection and ignores further messages. The console may still take what is queued
         // for it, within the linger time.
         if (received.state == ConsoleState::Closing && !waitUntilWritten(mServices.limits.linger)) abort();
         if (received.state == ConsoleState::Identified && !mHandshake.isDisabled()) pOnIdentified();
     }
-}
-
-/// What the message causes for one other console goes out on this thread, unless the next message is waiting already.
-Received Connection::pHandOver(const QelMessage& message)
-{
-    const DeferredWakeUps wakeUps(mBuffered.hasPending() ? DeferredWakeUps::How::Wake
-                                                         : DeferredWakeUps::How::SendForOne);
-    return mServices.hypervisor.receive(mId, message);
 }
 
 void Connection::pOnIdentified()
@@ -217,8 +193,6 @@ void Connection::pOnIdentified()
 /// Waits until the hypervisor takes another message. @return false: the console has hung up
 bool Connection::pAwaitReceive()
 {
-    sendOwn();
-    mHeldBack = true; // before the question: what changes the answer afterwards interrupts the wait
     while (!mServices.hypervisor.mayReceive(mId)) {
         if (mClosed) return false;
         const PollSet set{mWake.getPollFd(), mHangUp};
@@ -228,7 +202,6 @@ bool Connection::pAwaitReceive()
         if (result.contains(mWake.getPollFd())) mWake.eoi();
         if (result.contains(mHangUp)) return false;
     }
-    mHeldBack = false;
     return true;
 }
 
@@ -272,20 +245,6 @@ void Connection::pReport(const StreamIOException& error) const noexcept
                mHandshake.isDisabled() ? "finish a message" : "introduce itself", " in time");
 }
 
-void Connection::pBeginBatch(bool mayWait)
-{
-    mWire.setMayWait(mayWait);
-    if (mayWait) mWire.sendRest();
-}
-
-void Connection::pGather(const QelMessage& message) { mMessages.write(message); }
-
-bool Connection::pSendBatch()
-{
-    mBuffered.flush();
-    return !mWire.hasRest();
-}
-
 /// A message that waited for room is in the queue: the reader and the serial thread may have held back for it.
 void Connection::pOnRoom()
 {
@@ -297,33 +256,20 @@ void Connection::pWrite() noexcept
 {
     const LogThrottle::Scope scope(mServices.throttle, mBlamed);
     try {
-        while (sendNext())
-            continue;
-    } catch (...) {
-        pReportSendFailure();
-    }
-    abort(); // wakes the reader
-    setWritten();
-}
-
-/// On the thread of another console.
-void Connection::pOnSendFailure() noexcept
-{
-    const LogThrottle::Scope scope(mServices.throttle, mBlamed);
-    pReportSendFailure();
-    abort();
-}
-
-/// Logs the exception that is being handled.
-void Connection::pReportSendFailure() const noexcept
-{
-    try {
-        throw;
+        pSendAll();
     } catch (const StreamIOException& error) {
         logQuietly(LogLevel::Info, mName, ": ", Explained{error});
     } catch (...) {
         logCurrent(mName);
     }
+    abort(); // wakes the reader
+    setWritten();
+}
+
+void Connection::pSendAll()
+{
+    while (const std::unique_ptr<QelMessage> message = take())
+        mMessages.write(*message);
 }
 
 /// On any thread. The name belongs to the connection's own threads, so that of the log is the address here.
