@@ -6,6 +6,7 @@
 
 #include "hypervisor/SerialSpeed.hpp"
 
+#include <algorithm>
 #include <cerrno>
 #include <fcntl.h>
 #include <stdexcept>
@@ -112,6 +113,7 @@ void DeviceLine::stop()
         static_cast<void>(::ioctl(mPort.get(), TIOCNXCL));
     }
     mPort.reset();
+    mHeld.clear();
     mHasEnded = false;
     mReason.clear();
 }
@@ -120,8 +122,11 @@ bool DeviceLine::advance()
 {
     const int error = pStepBreak();
     if (error != 0) logLine(LogLevel::Warn, mDevice, ": cannot send a break: ", describe(error));
+    if (wantsToWrite()) pWriteHeld();
     return true;
 }
+
+bool DeviceLine::wantsToWrite() const { return mBreak != Break::On && !mHeld.empty(); }
 
 PollDeadline DeviceLine::advanceAt() const { return mBreakStep; }
 
@@ -138,7 +143,18 @@ SerialLine::ReadResult DeviceLine::read(char* buffer, std::size_t length)
 
 std::size_t DeviceLine::write(const char* data, std::size_t length)
 {
-    if (mBreak == Break::On) return 0; // the port would lose it
+    if (mBreak == Break::On) { // the port would lose it
+        const std::size_t taken = std::min(length, kMaxHeld - mHeld.size());
+        mHeld.append(data, taken);
+        return taken;
+    }
+    if (!mHeld.empty()) pWriteHeld();
+    return mHeld.empty() ? pWrite(data, length) : 0;
+}
+
+/// @return how many bytes the port took
+std::size_t DeviceLine::pWrite(const char* data, std::size_t length)
+{
     const ssize_t count = ::write(mPort.get(), data, length);
     const int error = errno;
     if (count >= 0) return static_cast<std::size_t>(count);
@@ -163,6 +179,8 @@ bool DeviceLine::sendBreak()
     if (error != 0) throw PosixError(error, "cannot send a break on " + mDevice);
     return true;
 }
+
+void DeviceLine::pWriteHeld() { mHeld.erase(0, pWrite(mHeld.data(), mHeld.size())); }
 
 UniqueFd DeviceLine::pOpen() const
 {

@@ -32,6 +32,8 @@ public:
     static constexpr std::chrono::milliseconds kDrainInterval{10};
     static constexpr std::chrono::milliseconds kDrainLimit{1000};
     static constexpr std::chrono::milliseconds kBreakTime{250};
+    /// Bytes of input that are taken during a break.
+    static constexpr std::size_t kMaxHeld = 4096;
 
     DeviceLine(std::string device, SerialSettings settings);
     DeviceLine(std::string device, SerialSettings settings, Port calls);
@@ -42,6 +44,7 @@ public:
     void start(std::uint16_t partition) override;
     void stop() override;
     bool advance() override;
+    bool wantsToWrite() const override;
     PollDeadline advanceAt() const override;
     ReadResult read(char* buffer, std::size_t length) override;
     std::size_t write(const char* data, std::size_t length) override;
@@ -52,6 +55,8 @@ public:
 private:
     enum class Break { None, Draining, On };
 
+    std::size_t pWrite(const char* data, std::size_t length);
+    void pWriteHeld();
     UniqueFd pOpen() const;
     void pSetUp(int fd, const termios& before) const;
     int pStepBreak();
@@ -65,6 +70,7 @@ private:
     bool mHasEnded = false;
     std::string mReason; // why it has ended
     Break mBreak = Break::None;
+    std::string mHeld;        // input for after the break
     PollDeadline mBreakStep;  // when to look after the break again
     PollDeadline mDrainLimit; // when to begin the break at the latest
 };

@@ -274,10 +274,42 @@ TEST_F(DeviceBreak, LastsAQuarterOfASecond)
 TEST_F(DeviceBreak, InputWaitsForItsEnd)
 {
     EXPECT_TRUE(mLine.sendBreak());
-    EXPECT_EQ(mLine.write("x", 1), 0U);
+    const std::string input(4096, 'x');
+    EXPECT_EQ(mLine.write(input.data(), 4095), 4095U);
+    EXPECT_EQ(mLine.write("yz", 2), 1U);
+    EXPECT_EQ(mLine.write("z", 1), 0U);
+    EXPECT_FALSE(mLine.wantsToWrite());
+    EXPECT_FALSE(PollSet(PollFd(mPty.master(), PollEvents::Read)).poll().anyReady());
     mClock.advance(std::chrono::milliseconds(250));
     EXPECT_TRUE(mLine.advance());
-    EXPECT_EQ(mLine.write("x", 1), 1U);
+    LineDriver(mLine).write("z");
+    EXPECT_EQ(mPty.read(4097), std::string(4095, 'x') + "yz");
+    EXPECT_FALSE(mLine.wantsToWrite());
+}
+
+TEST_F(DeviceBreak, HeldInputThatThePortDoesNotTakeWaitsOn)
+{
+    const std::size_t before = LineDriver(mLine).fill();
+    EXPECT_TRUE(mLine.sendBreak());
+    EXPECT_EQ(mLine.write("y", 1), 1U);
+    mClock.advance(std::chrono::milliseconds(250));
+    EXPECT_TRUE(mLine.advance());
+    EXPECT_TRUE(mLine.wantsToWrite());
+    EXPECT_EQ(mLine.write("z", 1), 0U);
+    EXPECT_EQ(mPty.read(before), std::string(before, 'x'));
+    LineDriver(mLine).write("z");
+    EXPECT_EQ(mPty.read(2), "yz");
+}
+
+TEST_F(DeviceBreak, HeldInputIsDroppedWithTheLine)
+{
+    EXPECT_TRUE(mLine.sendBreak());
+    EXPECT_EQ(mLine.write("old", 3), 3U);
+    mLine.stop();
+    mLine.start(7);
+    EXPECT_TRUE(mLine.advance());
+    LineDriver(mLine).write("new");
+    EXPECT_EQ(mPty.read(3), "new");
 }
 
 TEST_F(DeviceBreak, BeginsWhenWhatWasWrittenBeforeHasBeenSent)

@@ -199,6 +199,19 @@ TEST_F(TelnetLineTest, ABreakOfRfc2217LastsAQuarterOfASecondAndInputWaitsForItsE
     EXPECT_EQ(line->write("y", 1), 1U);
 }
 
+TEST_F(TelnetLineTest, InputThatWaitsForTheEndOfABreakIsDroppedWithTheLine)
+{
+    bringUp();
+    EXPECT_TRUE(line->sendBreak());
+    EXPECT_EQ(line->write("old", 3), 3U);
+    line->stop();
+    bringUp();
+    EXPECT_TRUE(line->sendBreak());
+    clock.advance(std::chrono::milliseconds(250));
+    EXPECT_TRUE(line->advance());
+    EXPECT_EQ(wire.written, "\xFF\xFA\x2C\x05\x05\xFF\xF0\xFF\xFA\x2C\x05\x06\xFF\xF0");
+}
+
 TEST_F(TelnetLineTest, TelnetsOwnBreakHasNoEnd)
 {
     bringUp("");
