@@ -9,6 +9,7 @@
 
 #include "base/Guard.hpp"
 #include "base/MessageKind.hpp"
+#include "hypervisor/DeferredWakeUps.hpp"
 #include "hypervisor/HypervisorImpl.hpp"
 
 #include <algorithm>
@@ -79,6 +80,7 @@ ConsoleId HypervisorEngine::connect(ConsoleLink& link, Peer peer)
 
 Received HypervisorEngine::receive(ConsoleId id, const QelMessage& message)
 {
+    const DeferredWakeUps wakeUps; // until the lock is released
     const MutexLock lock(mMutex);
     const auto found = mConsoles.find(id);
     if (found == mConsoles.end()) return {ConsoleState::Closing, true};
@@ -114,6 +116,7 @@ bool HypervisorEngine::takesConsoles() const
 
 void HypervisorEngine::disconnect(ConsoleId id)
 {
+    const DeferredWakeUps wakeUps; // until the lock is released
     const MutexLock lock(mMutex);
     const auto found = mConsoles.find(id);
     if (found == mConsoles.end()) return;
@@ -135,6 +138,7 @@ void HypervisorEngine::outputDrained()
 
 void HypervisorEngine::shutDown()
 {
+    const DeferredWakeUps wakeUps; // until the lock is released
     const MutexLock lock(mMutex);
     mShutDown = true;
     mPartitions.shutDown();
@@ -157,6 +161,7 @@ std::vector<SerialWatch> HypervisorEngine::serialWatches() const
 void HypervisorEngine::serviceSerial(std::uint16_t partition)
 {
     {
+        const DeferredWakeUps wakeUps; // until the lock is released
         const MutexLock lock(mMutex);
         mPartitions.service(partition);
     }
@@ -167,6 +172,7 @@ std::chrono::milliseconds HypervisorEngine::serviceLines()
 {
     std::chrono::milliseconds timeout;
     {
+        const DeferredWakeUps wakeUps; // until the lock is released
         const MutexLock lock(mMutex);
         const auto now = TimeProvider::steady();
         mPartitions.serviceTime(now);

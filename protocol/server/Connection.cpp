@@ -27,23 +27,33 @@ PollFd hangUpOf(int descriptor)
     return fd;
 }
 
+/// Puts what belongs below the messages on top of the lowest stream.
 /// @param records  set to what is below TLS
-std::unique_ptr<Stream> protect(std::unique_ptr<Stream> stream, SSLServerContext* context, RecordStream*& records)
+std::unique_ptr<Stream> protect(std::unique_ptr<WireStream> wire, SSLServerContext* context, RecordStream*& records)
 {
-    if (context == nullptr) return stream;
-    auto below = std::make_unique<RecordStream>(std::move(stream));
+    if (context == nullptr) return wire;
+    auto below = std::make_unique<RecordStream>(std::move(wire));
     records = below.get();
     return std::make_unique<SSLStream>(*context, std::move(below));
 }
+
+/// For what has been received and not been handed to the hypervisor, and for a batch that is being sent.
+constexpr BufferedStreamOptions kBuffers{Outbox::kBatchBytes, Outbox::kBatchBytes, false};
 
 } // namespace
 
 Connection::Connection(const ConnectionServices& services, ServedStream stream, SSLServerContext* context,
                        HandshakePlaces::Place place)
+    : Connection(services, stream, std::make_unique<WireStream>(std::move(stream.stream), stream.descriptor), context,
+                 std::move(place))
+{}
+
+Connection::Connection(const ConnectionServices& services, ServedStream& stream, std::unique_ptr<WireStream> wire,
+                       SSLServerContext* context, HandshakePlaces::Place place)
     : Outbox(services.limits.queueBytes), mServices(services), mAddress(std::move(stream.address)),
       mSource(std::move(stream.source)), mBlamed(mSource), mHangUp(hangUpOf(stream.descriptor)),
-      mPlace(std::move(place)), mClear(*stream.stream), mStream(protect(std::move(stream.stream), context, mRecords)),
-      mFrames(*mStream, context == nullptr ? FrameStream::ReadAhead::Yes : FrameStream::ReadAhead::No),
+      mPlace(std::move(place)), mClear(wire->below()), mWire(*wire),
+      mStream(protect(std::move(wire), context, mRecords)), mBuffered(*mStream, kBuffers), mFrames(mBuffered),
       mMessages(mFrames, messageRegistry()), mName(mAddress)
 {
     if (context == nullptr) return;
@@ -63,6 +73,7 @@ Connection::~Connection()
     }
     if (reader.joinable()) reader.join();
     if (mWriter.joinable()) mWriter.join();
+    retire();
 }
 
 void Connection::start()
@@ -103,7 +114,10 @@ bool Connection::dumpStatistics(std::ostream& os) const
     return true;
 }
 
-void Connection::resumeReading() { mWake.interrupt(); }
+void Connection::resumeReading()
+{
+    if (mHeldBack) mWake.interrupt();
+}
 
 void Connection::pConnect(const PeerIdentity& identity)
 {
@@ -169,17 +183,27 @@ void Connection::pRead() noexcept
 
 void Connection::pReceiveAll()
 {
+    startReading();
+    mWire.onRead([this] { sendOwn(); });
     bool mayRead = true;
     while (mayRead || pAwaitReceive()) {
         mFrames.beginFrame();
         const std::unique_ptr<QelMessage> message = mMessages.read();
-        const Received received = mServices.hypervisor.receive(mId, *message);
+        const Received received = pHandOver(*message);
         mayRead = received.mayReadNext;
         // The hypervisor closes the connection and ignores further messages. The console may still take what is queued
         // for it, within the linger time.
         if (received.state == ConsoleState::Closing && !waitUntilWritten(mServices.limits.linger)) abort();
         if (received.state == ConsoleState::Identified && !mHandshake.isDisabled()) pOnIdentified();
     }
+}
+
+/// What the message causes for one other console goes out on this thread, unless the next message is waiting already.
+Received Connection::pHandOver(const QelMessage& message)
+{
+    const DeferredWakeUps wakeUps(mBuffered.hasPending() ? DeferredWakeUps::How::Wake
+                                                         : DeferredWakeUps::How::SendForOne);
+    return mServices.hypervisor.receive(mId, message);
 }
 
 void Connection::pOnIdentified()
@@ -193,6 +217,8 @@ void Connection::pOnIdentified()
 /// Waits until the hypervisor takes another message. @return false: the console has hung up
 bool Connection::pAwaitReceive()
 {
+    sendOwn();
+    mHeldBack = true; // before the question: what changes the answer afterwards interrupts the wait
     while (!mServices.hypervisor.mayReceive(mId)) {
         if (mClosed) return false;
         const PollSet set{mWake.getPollFd(), mHangUp};
@@ -202,6 +228,7 @@ bool Connection::pAwaitReceive()
         if (result.contains(mWake.getPollFd())) mWake.eoi();
         if (result.contains(mHangUp)) return false;
     }
+    mHeldBack = false;
     return true;
 }
 
@@ -245,6 +272,20 @@ void Connection::pReport(const StreamIOException& error) const noexcept
                mHandshake.isDisabled() ? "finish a message" : "introduce itself", " in time");
 }
 
+void Connection::pBeginBatch(bool mayWait)
+{
+    mWire.setMayWait(mayWait);
+    if (mayWait) mWire.sendRest();
+}
+
+void Connection::pGather(const QelMessage& message) { mMessages.write(message); }
+
+bool Connection::pSendBatch()
+{
+    mBuffered.flush();
+    return !mWire.hasRest();
+}
+
 /// A message that waited for room is in the queue: the reader and the serial thread may have held back for it.
 void Connection::pOnRoom()
 {
@@ -256,20 +297,33 @@ void Connection::pWrite() noexcept
 {
     const LogThrottle::Scope scope(mServices.throttle, mBlamed);
     try {
-        pSendAll();
-    } catch (const StreamIOException& error) {
-        logQuietly(LogLevel::Info, mName, ": ", Explained{error});
+        while (sendNext())
+            continue;
     } catch (...) {
-        logCurrent(mName);
+        pReportSendFailure();
     }
     abort(); // wakes the reader
     setWritten();
 }
 
-void Connection::pSendAll()
+/// On the thread of another console.
+void Connection::pOnSendFailure() noexcept
 {
-    while (const std::unique_ptr<QelMessage> message = take())
-        mMessages.write(*message);
+    const LogThrottle::Scope scope(mServices.throttle, mBlamed);
+    pReportSendFailure();
+    abort();
+}
+
+/// Logs the exception that is being handled.
+void Connection::pReportSendFailure() const noexcept
+{
+    try {
+        throw;
+    } catch (const StreamIOException& error) {
+        logQuietly(LogLevel::Info, mName, ": ", Explained{error});
+    } catch (...) {
+        logCurrent(mName);
+    }
 }
 
 /// On any thread. The name belongs to the connection's own threads, so that of the log is the address here.

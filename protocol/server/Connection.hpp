@@ -1,5 +1,6 @@
 #pragma once
 
+#include <qel/common/io/BufferedStream.hpp>
 #include <qel/common/io/QelMessageStream.hpp>
 #include <qel/common/io/Stream.hpp>
 #include <qel/common/io/StreamIOException.hpp>
@@ -16,6 +17,7 @@
 #include "server/LogThrottle.hpp"
 #include "server/Outbox.hpp"
 #include "server/RecordStream.hpp"
+#include "server/WireStream.hpp"
 
 #include <atomic>
 #include <chrono>
@@ -54,8 +56,12 @@ struct ServedStream {
 };
 
 /// One connection of the hypervisor end, and the hypervisor's link to its console, with two threads: the reader
-/// hands received messages to the hypervisor, and the writer sends the queued messages. Over TLS a third, the
-/// handshaker, comes first: it admits the console and starts the reader. None waits for another connection.
+/// hands received messages to the hypervisor, and sends what comes of them for this console as long as it does not have
+/// to wait; the writer sends all else that is queued. Over TLS a third, the handshaker, comes first: it admits the
+/// console and starts the reader. None waits for another connection.
+///
+/// The reader sends before it waits for the console, and not after each message: the responses to requests that have
+/// arrived together go out together.
 ///
 /// While the hypervisor takes no message, the reader does not read. It watches for the console to hang up instead, so
 /// that a console that has disconnected does not hold its sessions.
@@ -89,8 +95,17 @@ public:
     bool dumpStatistics(std::ostream& os) const;
 
 private:
+    Connection(const ConnectionServices& services, ServedStream& stream, std::unique_ptr<WireStream> wire,
+               SSLServerContext* context, HandshakePlaces::Place place);
+
     void resumeReading() override;
+
+    bool pNeedsNoWait() const override { return mWire.needsNoWait(); }
+    void pBeginBatch(bool mayWait) override;
+    void pGather(const QelMessage& message) override;
+    bool pSendBatch() override;
     void pOnRoom() override;
+    void pOnSendFailure() noexcept override;
 
     void pConnect(const PeerIdentity& identity);
     void pHandshake() noexcept;
@@ -99,6 +114,7 @@ private:
     void pJoinHandshake() noexcept;
     void pRead() noexcept;
     void pReceiveAll();
+    Received pHandOver(const QelMessage& message);
     void pOnIdentified();
     bool pAwaitReceive();
     void pFinish() noexcept;
@@ -106,7 +122,7 @@ private:
     void pReport(const StreamIOException& error) const noexcept;
 
     void pWrite() noexcept;
-    void pSendAll();
+    void pReportSendFailure() const noexcept;
     void pClose() noexcept;
 
     const ConnectionServices mServices;
@@ -117,17 +133,21 @@ private:
     HandshakePlaces::Place mPlace; // until the console has identified itself or the connection ends; of the reader
     WakeUp mWake;                  // for the reader while it does not read
 
-    Stream& mClear;                   // the stream without TLS; owned by mStream
+    // From below to above.
+    Stream& mClear;                   // the stream of the caller, without TLS; owned by mWire
+    WireStream& mWire;                // owned by mStream
     RecordStream* mRecords = nullptr; // below TLS; owned by mStream; null: plain
     const std::unique_ptr<Stream> mStream;
+    BufferedStream mBuffered;
+    FrameStream mFrames;
+    QelMessageStream mMessages;
     std::optional<Admission> mAdmission; // to TLS; empty: plain
-    FrameStream mFrames;                 // over mStream
-    QelMessageStream mMessages;          // over mFrames
 
-    PollDeadline mHandshake;          // disabled: the console has identified itself; of the reader
-    std::atomic<ConsoleId> mId{0};    // 0: in the handshake
-    std::string mName;                // for the log, of its own threads: the address, later "console 1"
-    std::atomic<bool> mClosed{false}; // the stream is of no use any more
+    PollDeadline mHandshake;            // disabled: the console has identified itself; of the reader
+    std::atomic<ConsoleId> mId{0};      // 0: in the handshake
+    std::string mName;                  // for the log, of its own threads: the address, later "console 1"
+    std::atomic<bool> mHeldBack{false}; // the reader waits for the hypervisor to take another message
+    std::atomic<bool> mClosed{false};   // the stream is of no use any more
     std::atomic<bool> mEnded{false};
 
     // Guards the thread objects while threads start and join each other.

@@ -4,7 +4,6 @@
 
 #include <chrono>
 #include <cstddef>
-#include <memory>
 
 namespace qel::protocol {
 
@@ -16,13 +15,8 @@ namespace qel::protocol {
 /// reader.
 class FrameStream final : public Stream {
 public:
-    /// Whether to read as much as has arrived, instead of what is asked for.
-    enum class ReadAhead {
-        No,  ///< for TLS, which reads ahead by itself, and whose failure within what is read drops all of it
-        Yes, ///< for everything else: a frame costs one system call instead of two, and one for its deadline
-    };
-
-    FrameStream(Stream& stream, ReadAhead readAhead);
+    /// @param stream  may read ahead: what it has read before beginFrame() takes no time from a frame
+    explicit FrameStream(Stream& stream) : mStream(stream) {}
     ~FrameStream() override;
 
     /// From the next frame on, each has this time from its first byte to its last. Until then the deadlines of the
@@ -48,16 +42,9 @@ public:
     void setWriteDeadline(std::chrono::milliseconds timeout) override;
 
 private:
-    void pGrow();
-    std::size_t pReceive(char* buffer, std::size_t length);
-    std::size_t pTake(char* buffer, std::size_t length);
+    void pLimit();
 
     Stream& mStream;
-    std::unique_ptr<char[]> mAhead;
-    std::size_t mAheadSize;   // 0: no reading ahead
-    bool mIsTooSmall = false; // a frame did not fit
-    std::size_t mAheadBegin = 0;
-    std::size_t mAheadEnd = 0;
     std::chrono::milliseconds mFrameTimeout{0}; // 0: frames have no limit of their own
     bool mInFrame = false;                      // a byte of the current frame has been read
     bool mIsTimed = false;                      // the deadline below is that of the current frame

@@ -80,23 +80,29 @@ TEST(RefusedCommandLine, NamesTheEndpointThatServeCannotListenOn)
 TEST(RefusedCommandLine, NamesTheMalformedPartitionOfServe)
 {
     const Arguments common{"serve", "--plain"};
-    expectRefused(common,
-                  {
-                      {{"--partition"}, "--partition needs a value: ID=LINE"},
-                      {{"--partition", "1"}, "--partition: takes ID=LINE"},
-                      {{"--partition", "=cat"}, "--partition: \"\" is not an integer in [1, 65535]"},
-                      {{"--partition", "1="}, "--partition: takes ID=LINE"},
-                      {{"--partition", "0=cat"}, "--partition: \"0\" is not an integer in [1, 65535]"},
-                      {{"--partition", "65536=cat"}, "--partition: \"65536\" is not an integer in [1, 65535]"},
-                      {{"--partition", "99999999999999999999=cat"},
-                       "--partition: \"99999999999999999999\" is not an integer in [1, 65535]"},
-                      {{"--partition", "-1=cat"}, "--partition: \"-1\" is not an integer in [1, 65535]"},
-                      {{"--partition", "one=cat"}, "--partition: \"one\" is not an integer in [1, 65535]"},
-                      {{"--partition", "0x=cat"}, "--partition: \"0x\" is not an integer in [1, 65535]"},
-                      {{"--partition", "1=cat", "--partition", "1=cat"}, "--partition: partition 1 is given twice"},
-                      {{"--partition", "1=cat", "--partition", "01=cat"}, "--partition: partition 1 is given twice"},
-                      {{"--partition", "10=cat", "--partition", "0xA=cat"}, "--partition: partition 10 is given twice"},
-                  });
+    expectRefused(
+        common,
+        {
+            {{"--partition"}, "--partition needs a value: ID=LINE"},
+            {{"--partition", "1"}, "--partition: takes ID=LINE"},
+            {{"--partition", "=cat"}, "--partition: \"\" is not an integer in [1, 65535]"},
+            {{"--partition", "1="}, "--partition: takes ID=LINE"},
+            {{"--partition", "0=cat"}, "--partition: \"0\" is not an integer in [1, 65535]"},
+            {{"--partition", "65536=cat"}, "--partition: \"65536\" is not an integer in [1, 65535]"},
+            {{"--partition", "99999999999999999999=cat"},
+             "--partition: \"99999999999999999999\" is not an integer in [1, 65535]"},
+            {{"--partition", "-1=cat"}, "--partition: \"-1\" is not an integer in [1, 65535]"},
+            {{"--partition", "one=cat"}, "--partition: \"one\" is not an integer in [1, 65535]"},
+            {{"--partition", "0x=cat"}, "--partition: \"0x\" is not an integer in [1, 65535]"},
+            {{"--partition", "1=unix:"}, "--partition: line \"unix:\": it takes a path, as in unix:/run/vm1.sock"},
+            {{"--partition", "1=tcp:host"},
+             "--partition: line \"tcp:host\": \"host\" has no port from 1 to 65535 after its last colon"},
+            {{"--partition", "1=tty:/dev/ttyS0,9601"},
+             "--partition: line \"tty:/dev/ttyS0,9601\": \"9601\" has a speed that serial ports do not have"},
+            {{"--partition", "1=cat", "--partition", "1=cat"}, "--partition: partition 1 is given twice"},
+            {{"--partition", "1=cat", "--partition", "01=cat"}, "--partition: partition 1 is given twice"},
+            {{"--partition", "10=cat", "--partition", "0xA=cat"}, "--partition: partition 10 is given twice"},
+        });
 }
 
 TEST(RefusedCommandLine, NamesTheOptionOfServeThatIsOutOfRange)

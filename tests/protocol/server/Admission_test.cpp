@@ -1,5 +1,6 @@
 #include <qel/common/QelInternalMessageRegistry.hpp>
 #include <qel/common/QelMessageCast.hpp>
+#include <qel/common/QelMessageDax.hpp>
 #include <qel/common/io/StreamIOException.hpp>
 #include <qel/common/security/CertificateFacts.hpp>
 
@@ -121,7 +122,9 @@ TEST_F(AdmissionTest, TheWriteDeadlineEndsWithTheHandshake)
 {
     start();
     const auto console = startTls();
-    EXPECT_EQ(introduce(*console), 0U); // the response passes the changed deadline to the kernel
+    EXPECT_EQ(introduce(*console), 0U);
+    hypervisor->shutDown(); // the writer sends the notice, which passes the changed deadline to the kernel
+    EXPECT_NE(LoopbackMessages(*console).receive<QelMessageKrogConnectionClosedAsync>(), nullptr);
     timeval timeout{};
     socklen_t length = sizeof(timeout);
     ASSERT_EQ(::getsockopt(descriptor, SOL_SOCKET, SO_SNDTIMEO, &timeout, &length), 0);

@@ -1,3 +1,5 @@
+#include <qel/common/io/BufferedStream.hpp>
+
 #include "protocol/server/RecordingStream.hpp"
 #include "server/FrameStream.hpp"
 
@@ -26,7 +28,8 @@ TEST(FrameStream, ReadsAFrameThatHasArrivedWithOneCallAndNoDeadline)
 {
     RecordingStream below;
     below.chunks = {"headbody", "headbody"};
-    FrameStream stream(below, FrameStream::ReadAhead::Yes);
+    BufferedStream ahead(below);
+    FrameStream stream(ahead);
     stream.limitFrames(kFrame);
     for (int frame = 0; frame < 2; ++frame) {
         stream.beginFrame();
@@ -40,56 +43,21 @@ TEST(FrameStream, ReadsAheadSeveralFrames)
 {
     RecordingStream below;
     below.chunks = {"111122223333"};
-    FrameStream stream(below, FrameStream::ReadAhead::Yes);
+    BufferedStream ahead(below);
+    FrameStream stream(ahead);
     EXPECT_EQ(take(stream, 4), "1111");
     EXPECT_EQ(take(stream, 4), "2222");
     EXPECT_EQ(take(stream, 4), "3333");
     EXPECT_EQ(below.lengths.size(), 1U);
 }
 
-TEST(FrameStream, AfterALongFrameTheNextOneIsReadWithOneCall)
-{
-    RecordingStream below;
-    const std::string frame = "head" + std::string(15996, 'x');
-    below.chunks = {frame, frame, "head"};
-    FrameStream stream(below, FrameStream::ReadAhead::Yes);
-    for (int round = 0; round < 2; ++round) {
-        EXPECT_EQ(take(stream, 8), "headxxxx");
-        EXPECT_EQ(take(stream, 15992), std::string(15992, 'x'));
-    }
-    EXPECT_EQ(take(stream, 4), "head");
-    EXPECT_THAT(below.lengths, ElementsAre(2048, 13952, 16384, 16384));
-}
-
-TEST(FrameStream, ARestThatJustDoesNotFitIsReadWithoutACopy)
-{
-    RecordingStream below;
-    below.chunks = {"head", std::string(2047, 'x'), "head", std::string(2048, 'y'), "head"};
-    FrameStream stream(below, FrameStream::ReadAhead::Yes);
-    EXPECT_EQ(take(stream, 4), "head");
-    EXPECT_EQ(take(stream, 2047), std::string(2047, 'x'));
-    EXPECT_EQ(take(stream, 4), "head");
-    EXPECT_EQ(take(stream, 2048), std::string(2048, 'y'));
-    EXPECT_EQ(take(stream, 4), "head");
-    EXPECT_THAT(below.lengths, ElementsAre(2048, 2048, 2048, 2048, 16384));
-}
-
-TEST(FrameStream, WithoutReadingAheadAsksForNoMoreThanItsReader)
-{
-    RecordingStream below;
-    below.chunks = {"headbodynext"};
-    FrameStream stream(below, FrameStream::ReadAhead::No);
-    EXPECT_EQ(take(stream, 4), "head");
-    EXPECT_EQ(take(stream, 4), "body");
-    EXPECT_THAT(below.lengths, ElementsAre(4, 4));
-}
-
 TEST(FrameStream, TheRestOfAFrameHasADeadlineAndTheNextFrameHasNone)
 {
-    for (const auto readAhead : {FrameStream::ReadAhead::No, FrameStream::ReadAhead::Yes}) {
+    for (const bool readsAhead : {false, true}) {
         RecordingStream below;
         below.chunks = {"he", "ad", "b", "ody", "x"};
-        FrameStream stream(below, readAhead);
+        BufferedStream ahead(below);
+        FrameStream stream(readsAhead ? static_cast<Stream&>(ahead) : below);
         stream.limitFrames(kFrame);
         stream.beginFrame();
         EXPECT_EQ(take(stream, 4), "head");
@@ -106,7 +74,8 @@ TEST(FrameStream, ABeginningThatWasReadAheadIsWithinItsFrame)
 {
     RecordingStream below;
     below.chunks = {"headbodyhe", "ad"};
-    FrameStream stream(below, FrameStream::ReadAhead::Yes);
+    BufferedStream ahead(below);
+    FrameStream stream(ahead);
     stream.limitFrames(kFrame);
     stream.beginFrame();
     EXPECT_EQ(take(stream, 8), "headbody");
@@ -119,20 +88,22 @@ TEST(FrameStream, ABeginningThatWasReadAheadHasATimeOfItsOwn)
 {
     RecordingStream below;
     below.chunks = {"he", "adhe", "ad"};
-    FrameStream stream(below, FrameStream::ReadAhead::Yes);
+    BufferedStream ahead(below);
+    FrameStream stream(ahead);
     stream.limitFrames(kFrame);
     for (int frame = 0; frame < 2; ++frame) {
         stream.beginFrame();
         EXPECT_EQ(take(stream, 4), "head");
     }
-    EXPECT_THAT(below.settings, ElementsAre(-1, 700, 700));
+    EXPECT_THAT(below.settings, ElementsAre(-1, 700, -1, 700));
 }
 
 TEST(FrameStream, BeforeTheLimitTheDeadlinesBelowAreLeftAlone)
 {
     RecordingStream below;
     below.chunks = {"h", "e", "x"};
-    FrameStream stream(below, FrameStream::ReadAhead::Yes);
+    BufferedStream ahead(below);
+    FrameStream stream(ahead);
     stream.beginFrame();
     EXPECT_EQ(take(stream, 2), "he");
     stream.limitFrames(kFrame);
@@ -143,20 +114,19 @@ TEST(FrameStream, BeforeTheLimitTheDeadlinesBelowAreLeftAlone)
 
 TEST(FrameStream, TheEndOfTheStreamIsItsEnd)
 {
-    for (const auto readAhead : {FrameStream::ReadAhead::No, FrameStream::ReadAhead::Yes}) {
-        RecordingStream below;
-        FrameStream stream(below, readAhead);
-        char byte = 0;
-        EXPECT_EQ(stream.read(&byte, 1), 0U);
-        EXPECT_EQ(stream.read(&byte, 1), 0U);
-        EXPECT_FALSE(stream.isInFrame());
-    }
+    RecordingStream below;
+    FrameStream stream(below);
+    char byte = 0;
+    EXPECT_EQ(stream.read(&byte, 1), 0U);
+    EXPECT_EQ(stream.read(&byte, 1), 0U);
+    EXPECT_FALSE(stream.isInFrame());
 }
 
 TEST(FrameStream, ReadingNothingAsksForNothing)
 {
     RecordingStream below;
-    FrameStream stream(below, FrameStream::ReadAhead::Yes);
+    BufferedStream ahead(below);
+    FrameStream stream(ahead);
     char byte = 0;
     EXPECT_EQ(stream.read(&byte, 0), 0U);
     EXPECT_THAT(below.lengths, IsEmpty());
@@ -165,7 +135,7 @@ TEST(FrameStream, ReadingNothingAsksForNothing)
 TEST(FrameStream, PassesTheRestThrough)
 {
     RecordingStream below;
-    FrameStream stream(below, FrameStream::ReadAhead::Yes);
+    FrameStream stream(below);
     stream.write("out", 3);
     stream.setWriteDeadline(milliseconds(5));
     stream.setReadDeadline(milliseconds(6));

@@ -25,10 +25,10 @@ namespace qel::protocol {
 ///     server.run(stop.getPollFd()); // until another thread, or a signal, makes `stop` readable
 ///     server.finish();
 ///
-/// **Threads.** One for the serial lines of all partitions, and two for each console: one that reads, and one that
-/// writes. Over TLS, one more for the time of its handshake. commandLine() has one while commands are ending. They take
-/// none of the program's signals. run() accepts connections on the thread
-/// that calls it. No console waits for another one.
+/// **Threads.** One for the serial lines of all partitions, and two for each console: one that reads and answers, and
+/// one that sends what has to wait for the console. Over TLS, one more for the time of its handshake. commandLine() has
+/// one while commands are ending. They take none of the program's signals. run() accepts connections on the thread that
+/// calls it. No console waits for another one.
 ///
 /// **Failures.** What concerns one connection is logged, and ends at most that connection. A want of memory,
 /// descriptors or threads is logged, and run() tries again.
