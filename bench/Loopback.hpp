@@ -13,7 +13,9 @@
 #include <cstdint>
 #include <cstring>
 #include <memory>
+#include <stdexcept>
 #include <sys/socket.h>
+#include <unistd.h>
 #include <utility>
 #include <vector>
 
@@ -58,6 +60,46 @@ struct TcpPair {
 
     std::unique_ptr<SocketStream> near;
     std::unique_ptr<SocketStream> far;
+};
+
+inline void readAll(int descriptor, char* buffer, std::size_t length)
+{
+    while (length > 0) {
+        const ssize_t count = ::read(descriptor, buffer, length);
+        if (count <= 0) throw std::runtime_error("read");
+        buffer += count;
+        length -= static_cast<std::size_t>(count);
+    }
+}
+
+inline void sendAll(int descriptor, const char* buffer, std::size_t length)
+{
+    while (length > 0) {
+        const ssize_t count = ::send(descriptor, buffer, length, MSG_NOSIGNAL);
+        if (count <= 0) throw std::runtime_error("send");
+        buffer += count;
+        length -= static_cast<std::size_t>(count);
+    }
+}
+
+/// Reads one frame with two calls, as the message stream does.
+inline void readFrame(int descriptor, char* buffer)
+{
+    readAll(descriptor, buffer, kPrefix);
+    readAll(descriptor, buffer + kPrefix, frameLength(buffer) - kPrefix);
+}
+
+/// Duplicates of the pair's descriptors for Boost.Asio, which needs descriptors of its own.
+struct AsioPair {
+    AsioPair()
+        : near(context, boost::asio::ip::tcp::v4(), ::dup(pair.nearFd())),
+          far(context, boost::asio::ip::tcp::v4(), ::dup(pair.farFd()))
+    {}
+
+    TcpPair pair;
+    boost::asio::io_context context{1};
+    boost::asio::ip::tcp::socket near;
+    boost::asio::ip::tcp::socket far;
 };
 
 /// What a program that uses Boost.Asio would receive into: a message that owns its bytes.

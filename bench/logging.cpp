@@ -224,7 +224,7 @@ void addLoggingContests(const std::string& memoryFolder, const std::string& disk
     contest("log: compose a line, hand it over")
         .ours(composeOurs)
         .floor("a copy of the ready line", 0, copyReadyLine)
-        .peer("spdlog: format the same line", 0.55, composeSpdlog);
+        .peer("spdlog: format the same line", 0.72, composeSpdlog);
     contest("log: a line into the rotating file, tmpfs")
         .ours(in(memoryFolder, fileOurs))
         .floor("writev of a ready line", 0, in(memoryFolder, fileFloor))

@@ -1,8 +1,10 @@
 #include "Contest.hpp"
+#include "Median.hpp"
 
 #include <algorithm>
 #include <cstdio>
 #include <cstdlib>
+#include <fstream>
 #include <iostream>
 #include <map>
 #include <string>
@@ -11,7 +13,8 @@
 
 /// @file
 /// Runs all contests and prints one table of ratios. Every flag of Google Benchmark is understood, for example
-/// --benchmark_filter='^log'. Nothing here passes or fails: the figures are for people.
+/// --benchmark_filter='^log'; --figures=FILE writes the medians as a table with tabs, too. Nothing here passes or
+/// fails: the figures are for people.
 
 namespace {
 
@@ -46,10 +49,7 @@ public:
     {
         const auto found = mRounds.find(name);
         if (found == mRounds.end() || found->second.empty()) return -1;
-        std::vector<double> sorted = found->second;
-        std::sort(sorted.begin(), sorted.end());
-        const std::size_t middle = sorted.size() / 2;
-        return sorted.size() % 2 == 1 ? sorted[middle] : (sorted[middle - 1] + sorted[middle]) / 2;
+        return qel::bench::median(found->second);
     }
 
 private:
@@ -85,6 +85,37 @@ void printTable(const RoundCollector& rounds)
     }
 }
 
+/// All figures, for gnuplot: work, contestant, nanoseconds of ours, of theirs, and the most that the ratio may be.
+/// @return false: the file could not be written
+bool writeFigures(const RoundCollector& rounds, const std::string& path)
+{
+    std::ofstream file(path);
+    for (const Contest* contest : qel::bench::contests()) {
+        const double ours = rounds.median(Contest::benchmarkName(contest->work(), Contest::kOurs));
+        for (const Contest::Rival& rival : contest->rivals()) {
+            const double theirs = rounds.median(Contest::benchmarkName(contest->work(), rival.name));
+            if (ours <= 0 || theirs <= 0) continue;
+            file << contest->work() << '\t' << rival.name << '\t' << ours << '\t' << theirs << '\t' << rival.atMost
+                 << '\n';
+        }
+    }
+    return file.flush().good();
+}
+
+/// Takes the flag with the path of the figures out of the arguments.
+/// @return the path; empty if there is no such flag
+std::string takeFiguresFlag(std::vector<std::string>& arguments)
+{
+    const std::string flag = "--figures=";
+    const auto found = std::find_if(arguments.begin(), arguments.end(), [&flag](const std::string& argument) {
+        return argument.compare(0, flag.size(), flag) == 0;
+    });
+    if (found == arguments.end()) return {};
+    const std::string path = found->substr(flag.size());
+    arguments.erase(found);
+    return path;
+}
+
 /// Our defaults come first, so that what the user gives overrides them.
 std::vector<std::string> withDefaults(int argc, char** argv)
 {
@@ -99,6 +130,7 @@ std::vector<std::string> withDefaults(int argc, char** argv)
 int main(int argc, char** argv)
 {
     std::vector<std::string> arguments = withDefaults(argc, argv);
+    const std::string figures = takeFiguresFlag(arguments);
     std::vector<char*> pointers;
     for (std::string& argument : arguments)
         pointers.push_back(argument.data());
@@ -125,6 +157,10 @@ int main(int argc, char** argv)
     RoundCollector rounds;
     benchmark::RunSpecifiedBenchmarks(&rounds);
     printTable(rounds);
+    if (!figures.empty() && !writeFigures(rounds, figures)) {
+        std::fprintf(stderr, "bench: cannot write %s\n", figures.c_str());
+        return EXIT_FAILURE;
+    }
 
     for (const std::string& folder : {disk, memory}) {
         const std::string command = "rm -rf '" + folder + "'";

@@ -3,12 +3,11 @@
 
 #include "Contest.hpp"
 #include "Loopback.hpp"
+#include "Median.hpp"
+#include "QelServer.hpp"
 #include "TlsEnds.hpp"
 #include "bench/BenchLoad.hpp"
-#include "support/Process.hpp"
-#include "support/TemporaryDirectory.hpp"
 
-#include <algorithm>
 #include <array>
 #include <atomic>
 #include <cerrno>
@@ -20,7 +19,6 @@
 #include <cstdlib>
 #include <exception>
 #include <memory>
-#include <nlohmann/json.hpp>
 #include <stdexcept>
 #include <string>
 #include <sys/wait.h>
@@ -45,20 +43,10 @@ namespace qel::bench {
 
 namespace {
 
-using nlohmann::json;
-using test::Process;
-
 constexpr std::array<std::size_t, 3> kSizes{64, 256, 4096}; // bytes of payload
 constexpr unsigned int kRounds = 5;
 constexpr std::chrono::milliseconds kOursTime(1000);
 constexpr std::chrono::milliseconds kRawTime(500); // twice in a round, before ours and after it
-
-volatile std::sig_atomic_t sStop = 0;
-
-void checkNotStopped()
-{
-    if (sStop != 0) throw std::runtime_error("interrupted");
-}
 
 /// The bytes of the frame that carries so many bytes of payload up to the server.
 std::size_t frameOf(std::size_t payload)
@@ -104,7 +92,7 @@ public:
         std::atomic<std::uint64_t> done{0};
         const tool::BenchShare share(load, 0, TimeProvider::steady());
         try {
-            share.run([&] { pExchange(length); }, [](tool::BenchShare::TimePoint) { return sStop == 0; }, figures,
+            share.run([&] { pExchange(length); }, [](tool::BenchShare::TimePoint) { return !isStopped(); }, figures,
                       done);
         } catch (const std::exception& error) {
             throw std::runtime_error(std::string("the echo with OpenSSL: ") + error.what());
@@ -139,70 +127,6 @@ private:
     pid_t mFar = -1;
 };
 
-/// `qel serve`, and certificates for it and for those who connect.
-class OurServer {
-public:
-    /// @throws std::runtime_error  one of the programs failed; what it wrote is in the text
-    OurServer()
-    {
-        pRun({"ca", "init", pCredentials(), "--subject", "CN=bench root"});
-        pRun({"ca", "issue", pCredentials(), "server", "--subject", "CN=server"});
-        pRun({"ca", "issue", pCredentials(), "operator", "--subject", "CN=operator"});
-        mServer = std::make_unique<Process>(std::vector<std::string>{
-            QEL_PROGRAM, "serve", "--listen", "127.0.0.1:0", "--credentials", pCredentials(), "--name", "server"});
-        mEndpoint = mServer->readLine();
-    }
-
-    Figures measure(std::size_t payload)
-    {
-        const std::string seconds = std::to_string(std::chrono::duration<double>(kOursTime).count());
-        Process bench({QEL_PROGRAM, "bench", "--connect", mEndpoint, "--credentials", pCredentials(), "--name",
-                       "operator", "--peer-name", "server", "--json", "--seconds", seconds, "--size",
-                       std::to_string(payload)});
-        awaitEnd(bench);
-        Process::Result result = bench.wait();
-        checkNotStopped();
-        if (result.exitStatus != 0) {
-            result.errors += "qel serve wrote:\n" + mServer->errors();
-            fail("bench", result);
-        }
-        const json report = json::parse(result.output);
-        if (report.at("interrupted").get<bool>()) throw std::runtime_error("qel bench was interrupted");
-        const double nanoseconds = report.at("latencyNanoseconds").at("p99").get<double>();
-        return {report.at("messagesPerSecond").get<double>(), nanoseconds / 1000};
-    }
-
-private:
-    /// Sleeps until the process has ended. Its own wait() looks again and again, on the core that is measured.
-    static void awaitEnd(const Process& process)
-    {
-        siginfo_t info;
-        while (::waitid(P_PID, static_cast<id_t>(process.pid()), &info, WEXITED | WNOWAIT) != 0 && errno == EINTR)
-            continue;
-    }
-
-    [[noreturn]] static void fail(const std::string& command, const Process::Result& result)
-    {
-        throw std::runtime_error("qel " + command + " ended with exit status " + std::to_string(result.exitStatus) +
-                                 ", signal " + std::to_string(result.signal) + "\n" + result.output + result.errors);
-    }
-
-    static void pRun(const std::vector<std::string>& arguments)
-    {
-        std::vector<std::string> command{QEL_PROGRAM};
-        command.insert(command.end(), arguments.begin(), arguments.end());
-        const Process::Result result = test::run(command);
-        checkNotStopped();
-        if (result.exitStatus != 0) fail(arguments.at(0) + " " + arguments.at(1), result);
-    }
-
-    std::string pCredentials() const { return mDirectory.file("authority"); }
-
-    const test::TemporaryDirectory mDirectory;
-    std::unique_ptr<Process> mServer;
-    std::string mEndpoint;
-};
-
 /// What the rounds of one contestant have shown.
 class Series {
 public:
@@ -216,16 +140,9 @@ public:
         mPerSecond.insert(mPerSecond.end(), other.mPerSecond.begin(), other.mPerSecond.end());
         mP99.insert(mP99.end(), other.mP99.begin(), other.mP99.end());
     }
-    Figures median() const { return {pMedian(mPerSecond), pMedian(mP99)}; }
+    Figures median() const { return {bench::median(mPerSecond), bench::median(mP99)}; }
 
 private:
-    static double pMedian(std::vector<double> values)
-    {
-        std::sort(values.begin(), values.end());
-        const std::size_t middle = values.size() / 2;
-        return values.size() % 2 == 1 ? values[middle] : (values[middle - 1] + values[middle]) / 2;
-    }
-
     std::vector<double> mPerSecond;
     std::vector<double> mP99;
 };
@@ -269,29 +186,28 @@ void printTable(const std::array<Row, kSizes.size()>& rows)
         "connection.\n");
 }
 
+Figures oursOf(QelServer& server, std::size_t payload)
+{
+    const QelServer::Figures figures = server.measure(2, payload, kOursTime);
+    return {figures.perSecond, figures.p99};
+}
+
 void measureAll()
 {
     // The far ends of the echo must come first: a process that has threads had better not fork.
     const RawContexts contexts;
     RawEcho raw(contexts);
     RawEcho again(contexts);
-    OurServer server;
+    QelServer server(QelServer::Protection::Tls);
     std::array<Row, kSizes.size()> rows;
     for (unsigned int round = 0; round < kRounds; ++round) {
         for (std::size_t i = 0; i < kSizes.size(); ++i) {
             rows[i].raw.add(raw.measure(frameOf(kSizes[i])));
-            rows[i].ours.add(server.measure(kSizes[i]));
+            rows[i].ours.add(oursOf(server, kSizes[i]));
             rows[i].again.add(again.measure(frameOf(kSizes[i])));
         }
     }
     printTable(rows);
-}
-
-void setUpSignals()
-{
-    static_cast<void>(std::signal(SIGPIPE, SIG_IGN)); // an end that is gone shows as a failed write
-    for (const int number : {SIGINT, SIGTERM, SIGHUP})
-        static_cast<void>(std::signal(number, [](int) { sStop = 1; })); // processes and files are to be cleaned up
 }
 
 } // namespace
@@ -301,7 +217,7 @@ void setUpSignals()
 int main()
 {
     try {
-        qel::bench::setUpSignals();
+        qel::bench::stopOnSignals();
         qel::bench::pinToOneCore();
         qel::bench::measureAll();
         return EXIT_SUCCESS;

@@ -23,26 +23,6 @@ namespace {
 
 constexpr std::size_t kShortest = 40;
 
-void readAll(int descriptor, char* buffer, std::size_t length)
-{
-    while (length > 0) {
-        const ssize_t count = ::read(descriptor, buffer, length);
-        if (count <= 0) throw std::runtime_error("read");
-        buffer += count;
-        length -= static_cast<std::size_t>(count);
-    }
-}
-
-void sendAll(int descriptor, const char* buffer, std::size_t length)
-{
-    while (length > 0) {
-        const ssize_t count = ::send(descriptor, buffer, length, MSG_NOSIGNAL);
-        if (count <= 0) throw std::runtime_error("send");
-        buffer += count;
-        length -= static_cast<std::size_t>(count);
-    }
-}
-
 /// A stream over a descriptor and nothing more: what the message stream costs without the care of SocketStream.
 class DescriptorStream : public Stream {
 public:
@@ -100,24 +80,10 @@ void rawOneWay(benchmark::State& state, std::size_t length)
     std::vector<char> buffer(QelMessage::MtuMax);
     for (auto _ : state) {
         sendAll(pair.nearFd(), message->serialize(), message->msgLength());
-        readAll(pair.farFd(), buffer.data(), kPrefix);
-        readAll(pair.farFd(), buffer.data() + kPrefix, frameLength(buffer.data()) - kPrefix);
+        readFrame(pair.farFd(), buffer.data());
         benchmark::DoNotOptimize(buffer.data());
     }
 }
-
-/// Duplicates of the pair's descriptors for Boost.Asio, which needs descriptors of its own.
-struct AsioPair {
-    AsioPair()
-        : near(context, boost::asio::ip::tcp::v4(), ::dup(pair.nearFd())),
-          far(context, boost::asio::ip::tcp::v4(), ::dup(pair.farFd()))
-    {}
-
-    TcpPair pair;
-    boost::asio::io_context context{1};
-    boost::asio::ip::tcp::socket near;
-    boost::asio::ip::tcp::socket far;
-};
 
 void asioOneWay(benchmark::State& state, std::size_t length)
 {
@@ -162,8 +128,7 @@ void rawThereAndBack(benchmark::State& state)
     std::vector<char> buffer(QelMessage::MtuMax);
     const auto oneWay = [&](int from, int to) {
         sendAll(from, message.serialize(), message.msgLength());
-        readAll(to, buffer.data(), kPrefix);
-        readAll(to, buffer.data() + kPrefix, frameLength(buffer.data()) - kPrefix);
+        readFrame(to, buffer.data());
     };
     for (auto _ : state) {
         oneWay(pair.nearFd(), pair.farFd());
