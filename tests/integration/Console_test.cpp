@@ -372,8 +372,9 @@ TEST_F(ConsoleTest, AHeldPartitionIsRefused)
     const auto refused = runConsole({"1"}, "");
     EXPECT_EQ(refused.exitStatus, 1);
     EXPECT_EQ(refused.output, "");
-    EXPECT_EQ(refused.errors, "qel: partition 1 is held by another console; --force takes it: 0x00000013 "
-                              "(QelMessageStatusConnectionNotAvailable)\n");
+    EXPECT_EQ(refused.errors,
+              "qel: partition 1 is held by another console; --force takes it, --watch looks on: 0x00000013 "
+              "(QelMessageStatusConnectionNotAvailable)\n");
 }
 
 TEST_F(ConsoleTest, AHeldPartitionCanBeTakenByForce)

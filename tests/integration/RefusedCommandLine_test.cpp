@@ -42,14 +42,15 @@ const char* const kNoCredentials = "credentials are missing: give --credentials 
 
 TEST(RefusedCommandLine, NamesUnknownSubcommandsAndOptions)
 {
-    expectRefused({}, {
-                          {{}, "a subcommand is missing: serve, call, console, bench, decode, ca; see \"qel --help\""},
-                          {{"nonsense"}, "unknown subcommand \"nonsense\"; see \"qel --help\""},
-                          {{"--nonsense"}, "unknown option \"--nonsense\"; see \"qel --help\""},
-                          {{"cosole", "--connect", "x"}, "unknown subcommand \"cosole\"; did you mean \"console\"?"},
-                          {{"--connect", "x", "console"},
-                           "write --connect after \"console\": it is an option of that subcommand"},
-                      });
+    expectRefused(
+        {},
+        {
+            {{}, "a subcommand is missing: serve, call, console, list, bench, decode, ca; see \"qel --help\""},
+            {{"nonsense"}, "unknown subcommand \"nonsense\"; see \"qel --help\""},
+            {{"--nonsense"}, "unknown option \"--nonsense\"; see \"qel --help\""},
+            {{"cosole", "--connect", "x"}, "unknown subcommand \"cosole\"; did you mean \"console\"?"},
+            {{"--connect", "x", "console"}, "write --connect after \"console\": it is an option of that subcommand"},
+        });
 }
 
 TEST(RefusedCommandLine, NamesWhatServeLacks)

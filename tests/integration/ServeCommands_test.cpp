@@ -28,7 +28,7 @@ TEST(ServeCommands, TheConsoleAndTheLogReportTheExitStatus)
 {
     ServeProcess server({"--partition", "1=exit 3"});
     const auto console = runConsole(server, "1");
-    EXPECT_EQ(console.exitStatus, 0);
+    EXPECT_EQ(console.exitStatus, 8);
     EXPECT_EQ(console.output, "");
     EXPECT_EQ(console.errors, "qel: session closed: the command exited with status 3\n");
     EXPECT_THAT(server.stop().errors, HasSubstr("(I): [qel] partition 1: the command exited with status 3\n"));
@@ -38,7 +38,7 @@ TEST(ServeCommands, TheConsoleAndTheLogReportTheSignal)
 {
     ServeProcess server({"--partition", "1=kill -KILL $$"});
     const auto console = runConsole(server, "1");
-    EXPECT_EQ(console.exitStatus, 0);
+    EXPECT_EQ(console.exitStatus, 8);
     EXPECT_EQ(console.errors, "qel: session closed: the command was killed by signal 9 (Killed)\n");
     EXPECT_THAT(server.stop().errors,
                 HasSubstr("(I): [qel] partition 1: the command was killed by signal 9 (Killed)\n"));
@@ -49,7 +49,7 @@ TEST(ServeCommands, TheExitStatusIsTheLastLineOnATerminal)
     ServeProcess server({"--partition", "1=echo last words; exit 3"});
     PtyProcess person(qelCommand({"console", "--connect", server.endpoint(), "--plain", "1"}));
     const auto result = person.wait();
-    EXPECT_EQ(result.exitStatus, 0);
+    EXPECT_EQ(result.exitStatus, 8);
     EXPECT_THAT(result.screen, EndsWith("last words\r\nqel: session closed: the command exited with status 3\r\n"));
     server.stop();
 }

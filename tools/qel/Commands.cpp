@@ -4,6 +4,7 @@
 #include "certificates/CaCommand.hpp"
 #include "client/CallCommand.hpp"
 #include "console/ConsoleCommand.hpp"
+#include "console/ListCommand.hpp"
 #include "decode/DecodeCommand.hpp"
 #include "serve/ServeCommand.hpp"
 
@@ -14,6 +15,7 @@ void addCommands(CLI::App& app, Action& action)
     addServeCommand(app, action);
     addCallCommand(app, action);
     addConsoleCommand(app, action);
+    addListCommand(app, action);
     addBenchCommand(app, action);
     addDecodeCommand(app, action);
     addCaCommand(app, action);

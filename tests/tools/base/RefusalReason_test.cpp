@@ -30,7 +30,7 @@ TEST(RefusalReason, SaysWhatToDoAboutEachRefusalOfTheServer)
     EXPECT_EQ(reason(0x6003, 0x0102, 23), "this console has opened its session already");
     EXPECT_EQ(reason(0x6003, 0x0106, 19), "no other console has this tool type and id");
     EXPECT_EQ(reason(0x6003, 0x0106, 6), "the addressed console takes no more messages at the moment; try again later");
-    EXPECT_EQ(reason(0x6002, 0x0402, 19), "partition 3 is held by another console; --force takes it");
+    EXPECT_EQ(reason(0x6002, 0x0402, 19), "partition 3 is held by another console; --force takes it, --watch looks on");
     EXPECT_EQ(reason(0x6002, 0x0402, 6),
               "the command of partition 3 cannot be started; the log of the server says why");
     EXPECT_EQ(reason(0x6002, 0x0402, 21), "the server does not have partition 3");
@@ -68,7 +68,7 @@ TEST(RefusalReason, NamesThePartitionWithoutASubject)
 TEST(RefusalReason, ComesBeforeTheStatusInTheMessageOfARefusal)
 {
     EXPECT_EQ(tool::refusalText(response(0x6002, 0x0402, 19), "partition 3"),
-              "partition 3 is held by another console; --force takes it: 0x00000013 "
+              "partition 3 is held by another console; --force takes it, --watch looks on: 0x00000013 "
               "(QelMessageStatusConnectionNotAvailable)");
 }
 

@@ -77,7 +77,11 @@ protected:
         tool::ConsoleScreen screen(pty == nullptr ? outputWrite.get() : pty->slave(), errors, pty != nullptr, mode);
         console.onNotice<QelMessageDaxBroadcastOutboundAsync>(
             [&](const QelMessageDaxBroadcastOutboundAsync& broadcast) { screen.showBroadcast(broadcast); });
-        tool::ConsoleLoop loop(screen, input, mode, signals, options);
+        screen.stamps() = tool::TimeStamps(stamps);
+        for (tool::LogFile* logFile : tools.logs)
+            screen.addTap(*logFile);
+        if (tools.script != nullptr) screen.addTap(*tools.script);
+        tool::ConsoleLoop loop(screen, input, mode, signals, options, tools);
         return loop.run(console, *session);
     }
 
@@ -143,6 +147,8 @@ protected:
     FakeHypervisorEnd* end = nullptr; // owned by the console
     protocol::Console console = FakeHypervisorEnd::makeConsole(end, FakeHypervisorEnd::plainOptions(), true);
     std::optional<protocol::SerialSession> session;
+    tool::SessionTools tools;
+    tool::TimeStamps::Style stamps = tool::TimeStamps::Style::Off;
     std::string sent; // serial data
     std::atomic<bool> hasSent{false};
     unsigned int dataMessages = 0;

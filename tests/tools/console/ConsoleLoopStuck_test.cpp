@@ -103,6 +103,20 @@ TEST_F(ConsoleLoopStuckTest, TheUserCanLeaveWhileTheLastOutputIsStuck)
     person.join();
 }
 
+TEST_F(ConsoleLoopStuckTest, InputThatHasBeenReadMeanwhileIsNotWaitedFor)
+{
+    open([](const std::string&) { ADD_FAILURE() << "sent"; });
+    pty.type("x");
+    output("a");
+    closeSession();
+    end->beforeRead = [&] {
+        char key = 0;
+        if (!PollSet(PollFd(pty.slave(), PollEvents::Read)).poll().anyReady()) return;
+        ASSERT_EQ(::read(pty.slave(), &key, 1), 1);
+    };
+    EXPECT_EQ(run(InputOptions(), &pty).reason, ExitReason::Ended);
+}
+
 TEST_F(ConsoleLoopStuckTest, ASilentServerIsReportedAndSoIsItsReturn)
 {
     SettableClock clock;

@@ -12,6 +12,7 @@ enum class ExitStatus : int {
     ProtocolBroken = 5, ///< the peer violated the protocol
     DeadlinePassed = 6, ///< the peer did not answer in time
     ClosedByPeer = 7,   ///< the peer closed the connection, or the connection broke
+    CommandFailed = 8,  ///< a command of a partition failed
 
     CertificateDue = 10, ///< valid, but expires soon
     CertificateExpired = 11,

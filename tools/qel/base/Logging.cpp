@@ -11,6 +11,7 @@
 #include "base/Library.hpp"
 #include "base/OptionChecks.hpp"
 #include "base/TerminalMode.hpp"
+#include "base/UsageErrors.hpp"
 
 #include <algorithm>
 #include <array>
@@ -77,8 +78,10 @@ bool isLevel(const std::string& text)
 
 std::string checkLevel(std::string& text)
 {
-    return isLevel(text) ? std::string()
-                         : tool::quoted(text) + " is not a log level: debug, info, warn, error or critical";
+    if (isLevel(text)) return {};
+    const std::string guess = nearestWord(text, {"debug", "info", "warn", "error", "critical"});
+    return tool::quoted(text) + " is not a log level: debug, info, warn, error or critical" +
+           (guess.empty() ? "" : "; did you mean " + tool::quoted(guess) + "?");
 }
 
 std::string checkDirectory(std::string& name)

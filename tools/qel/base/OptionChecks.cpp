@@ -6,7 +6,9 @@
 #include <qel/protocol/Text.hpp>
 
 #include "base/Library.hpp"
+#include "base/UsageErrors.hpp"
 
+#include <algorithm>
 #include <charconv>
 #include <exception>
 #include <filesystem>
@@ -16,6 +18,7 @@
 #include <stdexcept>
 #include <string>
 #include <system_error>
+#include <utility>
 
 namespace qel::tool {
 
@@ -131,6 +134,21 @@ CLI::Validator numberIn(double min, double max)
         "FLOAT in " + range);
 }
 
+CLI::Validator oneOf(std::vector<std::string> words)
+{
+    return CLI::Validator(
+        [words = std::move(words)](std::string& text) {
+            if (std::find(words.begin(), words.end(), text) != words.end()) return std::string();
+            std::string all;
+            for (const std::string& word : words)
+                all += (all.empty() ? "" : ", ") + word;
+            const std::string guess = nearestWord(text, words);
+            return tool::quoted(text) + " is none of " + all +
+                   (guess.empty() ? "" : "; did you mean " + tool::quoted(guess) + "?");
+        },
+        "");
+}
+
 CLI::Validator textUpTo(std::size_t bytes)
 {
     return CLI::Validator(
@@ -147,6 +165,14 @@ CLI::Validator serverValidator() { return CLI::Validator(checkServer, ""); }
 CLI::Validator capabilityValidator() { return CLI::Validator(checkCapabilities, ""); }
 
 CLI::Validator fileValidator() { return CLI::Validator(checkFile, ""); }
+
+CLI::Option* findOption(CLI::App& command, const std::string& name)
+{
+    for (CLI::Option* option : command.get_options()) {
+        if (option->check_lname(name)) return option;
+    }
+    return nullptr;
+}
 
 void describeOption(CLI::App& command, const std::string& name, const std::string& description)
 {

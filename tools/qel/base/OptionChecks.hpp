@@ -8,6 +8,7 @@
 #include <cstdint>
 #include <optional>
 #include <string>
+#include <vector>
 
 /// @file
 /// Checks of option values. Every command uses these, so the same mistake gets the same message everywhere.
@@ -29,6 +30,9 @@ std::string notAnIntegerIn(const std::string& text, std::uint64_t min, std::uint
 /// Accepts a number in [min, max]; NaN is refused.
 CLI::Validator numberIn(double min, double max);
 
+/// Accepts one of these words; names the nearest one otherwise.
+CLI::Validator oneOf(std::vector<std::string> words);
+
 /// Accepts at most `bytes` bytes of text.
 CLI::Validator textUpTo(std::size_t bytes);
 
@@ -45,8 +49,12 @@ CLI::Validator capabilityValidator();
 /// later, with the reason.
 CLI::Validator fileValidator();
 
-/// Replaces the description of an option that others have added. CLI::App::get_option() would end the process for want
-/// of memory.
+/// An option of a command by its long name, without dashes. CLI::App::get_option() would end the process for want of
+/// memory.
+/// @return null: the command has no such option
+CLI::Option* findOption(CLI::App& command, const std::string& name);
+
+/// Replaces the description of an option that others have added.
 /// @param name  with its dashes, such as "--timeout"; an option of the command
 void describeOption(CLI::App& command, const std::string& name, const std::string& description);
 

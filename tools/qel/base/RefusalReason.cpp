@@ -33,7 +33,7 @@ constexpr Row kReasons[] = {
      "the addressed console takes no more messages at the moment; try again later"},
 
     {kSerial, QelMessageOpOpenVirtualSerialSession, QelMessageStatusConnectionNotAvailable,
-     "$ is held by another console; --force takes it"},
+     "$ is held by another console; --force takes it, --watch looks on"},
     {kSerial, QelMessageOpOpenVirtualSerialSession, QelMessageStatusCmdFailed,
      "the command of $ cannot be started; the log of the server says why"},
     {kSerial, QelMessageOpSetupVirtualSerialSession, QelMessageStatusInvalidCmdSequence,

@@ -7,7 +7,7 @@
 namespace qel::tool {
 
 /// Says in words why a request was refused and what to do about it, such as "partition 3 is held by another console;
-/// --force takes it". Covers every status that a hypervisor sends.
+/// --force takes it, --watch looks on". Covers every status that a hypervisor sends.
 /// @param response  its function, operation and status are used
 /// @param subject  what the request is about, such as "partition 3"; empty: nothing in particular
 /// @return empty for a status without a text
@@ -19,8 +19,9 @@ std::string refusalReason(const QelMessage& response, const std::string& subject
 std::string requestName(const QelMessage& response);
 
 /// The line for the user about a response with a status other than zero: the reason in words, then the status, as in
-/// "partition 3 is held by another console; --force takes it: 0x00000013 (QelMessageStatusConnectionNotAvailable)".
-/// Without words for the reason it begins with the name of the request: "limits refused: ...".
+/// "partition 3 is held by another console; --force takes it, --watch looks on: 0x00000013
+/// (QelMessageStatusConnectionNotAvailable)". Without words for the reason it begins with the name of the request:
+/// "limits refused: ...".
 /// @param subject  as for refusalReason()
 std::string refusalText(const QelMessage& response, const std::string& subject = {});
 

@@ -58,6 +58,7 @@ void addConnectOptions(CLI::App& app, ConnectOptions& options)
 
 void checkConnect(const ConnectOptions& options)
 {
+    if (options.server.empty()) throw CLI::RequiredError("--connect");
     checkCredentials(options.transport);
     if (!isHostName(options.server)) checkPlain(options.transport, options.server);
 }

@@ -1,37 +1,24 @@
 #include "console/ConsoleCommand.hpp"
 
-#include <qel/common/QelMessageDax.hpp>
-#include <qel/common/util/TimeProvider.hpp>
-#include <qel/protocol/Console.hpp>
-#include <qel/protocol/Error.hpp>
-#include <qel/protocol/SerialSession.hpp>
 #include <qel/protocol/Text.hpp>
 
-#include "base/Failures.hpp"
 #include "base/Library.hpp"
 #include "base/Logging.hpp"
 #include "base/OptionChecks.hpp"
-#include "base/RefusalReason.hpp"
-#include "base/SignalWatch.hpp"
-#include "base/TerminalMode.hpp"
+#include "base/UsageErrors.hpp"
 #include "client/ConnectOptions.hpp"
-#include "console/ConsoleConnection.hpp"
-#include "console/ConsoleLoop.hpp"
-#include "console/ConsoleScreen.hpp"
-#include "console/ConsoleTexts.hpp"
+#include "console/ConsoleRun.hpp"
 #include "console/EscapeFilter.hpp"
-#include "console/MessageStream.hpp"
+#include "console/Profiles.hpp"
+#include "console/TypedText.hpp"
 
 #include <chrono>
 #include <csignal>
 #include <cstdint>
-#include <initializer_list>
-#include <iostream>
 #include <memory>
 #include <optional>
-#include <sstream>
 #include <string>
-#include <unistd.h>
+#include <vector>
 
 namespace qel::tool {
 
@@ -39,12 +26,7 @@ namespace {
 
 constexpr double kMaxLinger = 24 * 60 * 60;
 constexpr double kMaxKeepAlive = 24 * 60 * 60;
-
-/// How long a person waits for the server when leaving.
-constexpr std::chrono::milliseconds kFarewell{90};
-
-/// Termination, suspension and continuation.
-constexpr std::initializer_list<int> kSignals{SIGINT, SIGTERM, SIGHUP, SIGQUIT, SIGTSTP, SIGCONT};
+constexpr std::size_t kMaxCommand = 2048; // a terminal takes lines of 4095 bytes, and quotes take room
 
 constexpr const char* kFooter = R"(
 On a terminal, "~." at the start of a line leaves the session and "~?" lists the other commands. Input that is not a
@@ -52,19 +34,27 @@ terminal is sent as it is: echo 'uname -srm' | qel console ... PARTITION. At the
 end-of-file character (control-D), repeats it after each second without output, and prints all output until the
 partition's command ends. The output includes the echo of the input if the partition echoes it, as terminals do.
 
-Exit status: 0 the command ended, or you left; 1 a request was refused, the server has the wrong certificate, or another
-console took the session; 2 usage error; 3 cannot connect; 4 failure on this machine; 5 the server broke the protocol;
-6 timeout; 7 the server shut down or the connection was lost.)";
+A server that is used often gets a profile, and its partitions names: see qel list --help.
+
+--send, --expect and --exec are done in the order in which they are given, instead of reading the input, and the console
+leaves after the last one: qel console ... --send '\r' --expect 'login:' 3. In TEXT, \r, \n, \t, \e, \\ and \xHH stand
+for the characters that they usually mean. A regular expression is a POSIX extended one.
+
+Exit status: 0 the command ended with 0, or you left; 1 a request was refused, the server has the wrong certificate, or
+another console took the session; 2 usage error; 3 cannot connect; 4 failure on this machine; 5 the server broke the
+protocol; 6 timeout; 7 the server shut down or the connection was lost; 8 the partition's command, or that of --exec,
+failed.)";
 
 struct CommandOptions {
-    ConnectOptions connect;
+    std::string target; ///< the partition as it was given
+    ConsoleRunOptions run;
     LogOptions log;
-    std::uint16_t partition = 0;
-    SerialOptions serial;
     bool noEof = false;
-    std::string escape = "~";
-    std::optional<double> lingerSeconds;
     double keepAliveSeconds = 15;
+    std::string escape = "~";
+    std::string stamps;
+    std::optional<double> lingerSeconds;
+    std::vector<std::string> sends, expects, commands; // see stepsOf()
 
     InputOptions inputOptions() const;
 };
@@ -96,157 +86,64 @@ std::string checkEscape(std::string& text)
     return {};
 }
 
+std::chrono::milliseconds inMilliseconds(double seconds)
+{
+    return std::chrono::duration_cast<std::chrono::milliseconds>(std::chrono::duration<double>(seconds));
+}
+
 InputOptions CommandOptions::inputOptions() const
 {
     InputOptions options;
     options.escape = parseEscape(escape);
-    options.keepAlive =
-        std::chrono::duration_cast<std::chrono::milliseconds>(std::chrono::duration<double>(keepAliveSeconds));
+    options.keepAlive = inMilliseconds(keepAliveSeconds);
     options.sendsEnd = !noEof;
-    if (lingerSeconds) {
-        options.linger =
-            std::chrono::duration_cast<std::chrono::milliseconds>(std::chrono::duration<double>(*lingerSeconds));
-    }
+    if (lingerSeconds) options.linger = inMilliseconds(*lingerSeconds);
     return options;
 }
 
-/// Closes the serial session and the hypervisor session, as far as they are open, and the connection. A person at a
-/// terminal does not wait for a server that does not answer.
-/// @param requestTimeout  for each response, if there is no terminal
-void close(ConsoleConnection& connection, SerialSession& session, ConsoleScreen& screen, const TerminalMode& mode,
-           std::chrono::milliseconds requestTimeout)
+std::string checkTarget(std::string& text)
 {
-    Console& console = connection.console();
-    const auto end = TimeProvider::steady() + (mode.isTerminal() ? kFarewell : requestTimeout);
-    if (mode.isTerminal()) connection.stream().cutAt(end);
-    try {
-        session.close(timeLeft(end));
-        screen.showOutput(session);
-        if (session.getEnd() != SessionEnd::ShutDown && session.getEnd() != SessionEnd::ConnectionClosed)
-            console.closeSession(mode.isTerminal() ? timeLeft(end) : requestTimeout);
-    } catch (const std::exception& error) {
-        if (!mode.isTerminal()) throw;
-        logLine(LogLevel::Debug, "while leaving: ", explain(error));
-    }
-    console.leave();
+    constexpr std::uint64_t kMaxPartition = 65535;
+    return namesProfile(text) ? std::string() : integerIn(0, kMaxPartition)(text);
 }
 
-/// The exit status of this command when its session ended this way.
-ExitStatus exitStatusOf(SessionEnd end)
+/// Reads the partition, and the profile that the command line names.
+void findPartition(CLI::App& command, CommandOptions& options)
 {
-    switch (end) {
-    case SessionEnd::None:
-    case SessionEnd::Closed:
-    case SessionEnd::CommandEnded:
-        return ExitStatus::Done;
-    case SessionEnd::Taken:
-        return ExitStatus::Refused;
-    default:
-        return ExitStatus::ClosedByPeer;
-    }
-}
-
-/// Ends this process by the signal that SignalWatch held back, so that its parent sees the signal as the reason.
-[[noreturn]] void endBy(int signal)
-{
-    static_cast<void>(::raise(signal));
-    throw CommandFailure(ExitStatus::Failed, "signal " + std::to_string(signal) + " did not end this process");
-}
-
-std::string leftText(const CommandOptions& options, const ConsoleLoop::Outcome& outcome)
-{
-    const std::string text = filled(texts::kLeft, {std::to_string(options.partition)});
-    if (outcome.thrownAway == 0) return text;
-    return text + filled(texts::kThrownAway, {std::to_string(outcome.thrownAway)});
-}
-
-ExitStatus conclude(const ConsoleLoop::Outcome& outcome, SessionEnd end, const std::string& endText,
-                    const CommandOptions& options, ConsoleScreen& screen, const TerminalMode& mode)
-{
-    switch (outcome.reason) {
-    case ConsoleLoop::ExitReason::Signal:
-        endBy(outcome.signal);
-    case ConsoleLoop::ExitReason::Left:
-        screen.output().writeSome();
-        screen.output().drop(); // nobody waits for the screen
-        if (mode.isTerminal()) screen.say(leftText(options, outcome));
-        return ExitStatus::Done;
-    case ConsoleLoop::ExitReason::Ended:
-        screen.say(endText);
-        return exitStatusOf(end);
-    default:
-        screen.output().flush();
-        return ExitStatus::Done;
-    }
-}
-
-std::string timeoutText(const ConnectOptions& options)
-{
-    std::ostringstream text;
-    text << "timed out after " << options.timeoutSeconds << " s (--timeout): ";
-    return text.str();
-}
-
-/// Runs the session from opening to closing.
-/// @param openEnd  by when it must be open
-ExitStatus runSession(ConsoleConnection& connection, ConsoleScreen& screen, TerminalMode& mode,
-                      const CommandOptions& options, std::chrono::steady_clock::time_point openEnd)
-{
-    SerialSession session = connection.console().openSerial(options.partition, options.serial, timeLeft(openEnd));
-    ConsoleLoop::Outcome outcome;
-    {
-        // Signals are watched only while the terminal may have to be restored. At all other times they end this process
-        // at once.
-        SignalWatch signals(kSignals);
-        ConsoleLoop loop(screen, STDIN_FILENO, mode, signals, options.inputOptions());
-        outcome = loop.run(connection.console(), session, &connection.stream());
-    }
-    const SessionEnd end = session.getEnd();
-    const std::string endText = session.describeEnd();
-    if (outcome.reason == ConsoleLoop::ExitReason::Signal) {
-        // The process ends without further requests; the hypervisor closes its sessions.
-        if (mode.isTerminal()) connection.stream().cutAt(TimeProvider::steady() + kFarewell);
-        connection.console().leave();
+    if (namesProfile(options.target)) {
+        options.run.partition = applyProfile(options.target, readProfiles(profilesPath()), command);
     } else {
-        close(connection, session, screen, mode, options.connect.timeout());
+        options.run.partition = static_cast<std::uint16_t>(*parseInteger(options.target));
     }
-    return conclude(outcome, end, endText, options, screen, mode);
 }
 
-void addHandlers(Console& console, ConsoleScreen& screen)
+TimeStamps::Style styleOf(const std::string& name)
 {
-    console.onNotice<QelMessageDaxBroadcastOutboundAsync>(
-        [&screen](const QelMessageDaxBroadcastOutboundAsync& broadcast) { screen.showBroadcast(broadcast); });
-    console.onOtherNotice([](const QelMessage& notice) { logLine(LogLevel::Warn, "ignored ", notice.getLogID()); });
+    if (name == "iso") return TimeStamps::Style::Iso;
+    return name == "delta" ? TimeStamps::Style::Delta : TimeStamps::Style::Off;
+}
+
+/// The steps in the order in which they were given.
+std::vector<ScriptStep> stepsOf(const CLI::App& command, const CommandOptions& options)
+{
+    using Kind = ScriptStep::Kind;
+    std::vector<ScriptStep> steps;
+    std::size_t sends = 0;
+    std::size_t expects = 0;
+    std::size_t commands = 0;
+    for (const CLI::Option* option : command.parse_order()) {
+        if (option->check_lname("send")) steps.push_back({Kind::Send, *parseTypedText(options.sends.at(sends++))});
+        if (option->check_lname("expect")) steps.push_back({Kind::Expect, options.expects.at(expects++)});
+        if (option->check_lname("exec")) steps.push_back({Kind::Exec, options.commands.at(commands++)});
+    }
+    return steps;
 }
 
 ExitStatus runConsole(const CommandOptions& options)
 {
     startLogging(options.log, "qel-console.log");
     static_cast<void>(std::signal(SIGPIPE, SIG_IGN)); // the terminal must be restored even when the output is closed
-    TerminalMode mode(STDIN_FILENO);
-    MessageStream messages(STDERR_FILENO);
-    ConsoleScreen screen(STDOUT_FILENO, messages, ::isatty(STDERR_FILENO) == 1, mode);
-    const auto openEnd = TimeProvider::steady() + options.connect.timeout();
-    ConsoleConnection connection(options.connect, openEnd);
-    addHandlers(connection.console(), screen);
-    const auto leave = [&] {
-        if (mode.isTerminal()) connection.stream().cutAt(TimeProvider::steady() + kFarewell);
-        connection.console().leave();
-    };
-    try {
-        return runSession(connection, screen, mode, options, openEnd);
-    } catch (const StatusError& refusal) {
-        leave();
-        throw CommandFailure(ExitStatus::Refused,
-                             refusalText(refusal.getResponse(), "partition " + std::to_string(options.partition)));
-    } catch (const DeadlinePassed& error) {
-        leave();
-        throw CommandFailure(ExitStatus::DeadlinePassed, timeoutText(options.connect) + error.what());
-    } catch (...) {
-        leave();
-        throw;
-    }
+    return ConsoleRun(options.run).run();
 }
 
 void addEscape(CLI::App& command, CommandOptions& options)
@@ -262,13 +159,6 @@ void addEscape(CLI::App& command, CommandOptions& options)
 
 void addInputOptions(CLI::App& command, CommandOptions& options)
 {
-    command
-        .add_option("--keepalive", options.keepAliveSeconds,
-                    "Say so when the server has sent nothing for this long; it is asked for the time of day before. 0: "
-                    "do not ask")
-        ->type_name("SECONDS")
-        ->check(numberIn(0.0, kMaxKeepAlive))
-        ->capture_default_str();
     command.add_flag("--no-eof", options.noEof, "Do not send an end-of-file character at the end of the input");
     command
         .add_option("--linger", options.lingerSeconds,
@@ -278,33 +168,93 @@ void addInputOptions(CLI::App& command, CommandOptions& options)
         ->check(numberIn(0.0, kMaxLinger));
 }
 
+void addSessionOptions(CLI::App& command, CommandOptions& options)
+{
+    CLI::Option* const connection = command.add_option("--connection", options.run.serial.connection,
+                                                       "Serial connection of the partition: 0 types, 1 to 15 watch");
+    connection->type_name("N")->transform(integerIn(0, 65535))->capture_default_str();
+    CLI::Option* const force =
+        command.add_flag("--force", options.run.serial.force, "Take the session from the console that holds it");
+    command.add_flag("--watch", options.run.watch, "Watch what the partition puts out, and type nothing")
+        ->excludes(connection)
+        ->excludes(force);
+    command.add_flag("--reconnect", options.run.reconnect,
+                     "When the connection is lost, connect again, after 1 second at first and 30 at most");
+    command
+        .add_option("--keepalive", options.keepAliveSeconds,
+                    "Say so when the server has sent nothing for this long; it is asked for the time of day before. 0: "
+                    "do not ask")
+        ->type_name("SECONDS")
+        ->check(numberIn(0.0, kMaxKeepAlive))
+        ->capture_default_str();
+}
+
+void addFileOptions(CLI::App& command, CommandOptions& options)
+{
+    command.add_option("--log", options.run.log, "Append the output of the partition to this file, as it is")
+        ->type_name("FILE");
+    command
+        .add_option("--log-strip", options.run.logStrip,
+                    "Append the output to this file without control sequences, with --timestamps in front of each line")
+        ->type_name("FILE");
+    command
+        .add_option("--timestamps", options.stamps,
+                    "The time in front of each line: in UTC, or since the line before; ~t changes it")
+        ->type_name("iso|delta")
+        ->check(oneOf({"iso", "delta"}));
+    command.add_option("--record", options.run.record, "Record the output in this file, in the format asciicast v2")
+        ->type_name("FILE");
+}
+
+void addScriptOptions(CLI::App& command, CommandOptions& options)
+{
+    command.add_option("--send", options.sends, "Type this text; may be repeated, as the next two")
+        ->type_name("TEXT")
+        ->allow_extra_args(false)
+        ->check(CLI::Validator(checkTypedText, ""));
+    command.add_option("--expect", options.expects, "Wait until the output matches; at most --timeout")
+        ->type_name("REGEX")
+        ->allow_extra_args(false)
+        ->check(CLI::Validator(checkPattern, ""));
+    command
+        .add_option("--exec", options.commands,
+                    "Run a command with sh -c at the shell of the partition, print only its output, and fail if it "
+                    "fails; at most --timeout")
+        ->type_name("COMMAND")
+        ->allow_extra_args(false)
+        ->check(textUpTo(kMaxCommand));
+}
+
 } // namespace
 
 CLI::App& addConsoleCommand(CLI::App& parent, Action& action)
 {
     CLI::App& command = addCommand(parent, "console", "Connect the terminal to the serial console of a partition");
     const auto options = std::make_shared<CommandOptions>();
-    command.add_option("partition", options->partition, "Partition id")
+    command.add_option("partition", options->target, "Partition id, or a name from the profiles, as qel list shows it")
         ->required()
-        ->type_name("PARTITION")
-        ->transform(integerIn(0, 65535));
-    addConnectOptions(command, options->connect);
+        ->type_name("PARTITION|PROFILE/PARTITION")
+        ->transform(CLI::Validator(checkTarget, ""));
+    addConnectOptions(command, options->run.connect);
+    findOption(command, "connect")->required(false); // a profile may give it
     describeOption(command, "--timeout",
-                   "Timeout in seconds: one for connecting and opening the session, then one for each response and "
-                   "for each message once it has begun");
-    command.add_option("--connection", options->serial.connection, "Serial connection of the partition")
-        ->type_name("N")
-        ->transform(integerIn(0, 65535))
-        ->capture_default_str();
-    command.add_flag("--force", options->serial.force, "Take the session from the console that holds it");
+                   "Timeout in seconds: one for connecting and opening the session, then one for each response, for "
+                   "each message once it has begun, and for --expect and --exec");
+    addSessionOptions(command, *options);
     addEscape(command, *options);
     addInputOptions(command, *options);
+    addFileOptions(command, *options);
+    addScriptOptions(command, *options);
     options->log.usual = LogLevel::Warn;
     options->log.quiet = true;
     addLogOptions(command, options->log);
     command.footer(kFooter);
-    command.callback([&action, options] {
-        checkConnect(options->connect);
+    command.callback([&action, &command, options] {
+        findPartition(command, *options);
+        checkConnect(options->run.connect);
+        options->run.input = options->inputOptions();
+        options->run.stamps = styleOf(options->stamps);
+        options->run.steps = stepsOf(command, *options);
         action = [options] { return runConsole(*options); };
     });
     return command;

@@ -5,14 +5,15 @@
 #include <qel/protocol/Error.hpp>
 #include <qel/protocol/Text.hpp>
 
+#include "base/Failures.hpp"
 #include "console/ConsoleTexts.hpp"
 
 #include <algorithm>
 #include <array>
 #include <cerrno>
 #include <csignal>
-#include <sstream>
 #include <unistd.h>
+#include <utility>
 
 namespace qel::tool {
 
@@ -62,9 +63,9 @@ private:
 } // namespace
 
 ConsoleLoop::ConsoleLoop(ConsoleScreen& screen, int input, TerminalMode& mode, SignalWatch& signals,
-                         const InputOptions& options)
+                         const InputOptions& options, SessionTools tools)
     : mScreen(screen), mInput(input), mMode(mode), mSignals(signals), mInputOptions(options), mEscape(options.escape),
-      mKeepAlive(options.keepAlive)
+      mKeepAlive(options.keepAlive), mTools(std::move(tools))
 {}
 
 ConsoleLoop::~ConsoleLoop() { mMode.restore(); }
@@ -73,10 +74,32 @@ ConsoleLoop::Outcome ConsoleLoop::run(Console& console, SerialSession& session, 
 {
     pBegin(console, session);
     const Attending attending(mMode.isTerminal() ? stream : nullptr, this);
-    mScreen.showOutput(session);
+    pShowReceived();
     while (!pIsDone())
         pPollOnce();
+    mConsole = nullptr;
+    mSession = nullptr;
+    mPrompt.reset();
+    mFile.reset();
     if (mFailure && mOutcome.reason == ExitReason::Ended) std::rethrow_exception(mFailure);
+    return mOutcome;
+}
+
+ConsoleLoop::Outcome ConsoleLoop::wait(std::chrono::milliseconds duration)
+{
+    mOutcome = Outcome();
+    mFailure = nullptr;
+    const PollDeadline end(TimeProvider::steady() + duration);
+    while (pIsRunning()) {
+        const auto now = TimeProvider::steady();
+        if (end.isExpired(now)) break;
+        PollSet set = attended();
+        if (!mScreen.output().isEmpty()) set += mScreen.output().getPollFd();
+        const PollResult ready = set.wait(end.getTimeout(now));
+        if (ready.contains(mScreen.output().getPollFd())) mScreen.output().writeSome();
+        if (ready.anyReady()) attend(ready);
+    }
+    if (mFailure) std::rethrow_exception(mFailure);
     return mOutcome;
 }
 
@@ -86,9 +109,12 @@ void ConsoleLoop::pBegin(Console& console, SerialSession& session)
     mSession = &session;
     mOutcome = Outcome();
     mFailure = nullptr;
+    mSendBroken = false;
+    mReceived = 0;
     mKeepAlive.watch(console, TimeProvider::steady());
     mMode.enterRaw();
     if (mMode.isTerminal()) mScreen.say(pGreeting());
+    pFollowScript();
 }
 
 std::string ConsoleLoop::pGreeting() const
@@ -106,6 +132,7 @@ bool ConsoleLoop::pIsDone() const
     case ExitReason::None:
         return false;
     case ExitReason::Left:
+    case ExitReason::Force:
     case ExitReason::Signal:
         return true;
     default:
@@ -116,11 +143,12 @@ bool ConsoleLoop::pIsDone() const
 /// A terminal is read at all times, also while the last output is written.
 bool ConsoleLoop::pWantsInput() const
 {
-    if (!mInputOpen) return false;
-    return mMode.isTerminal() || (pIsRunning() && mHeld.isEmpty());
+    if (!mInputOpen || pHasLeft()) return false;
+    return mMode.isTerminal() || (pIsRunning() && mHeld.isEmpty() && mTools.script == nullptr);
 }
 
-bool ConsoleLoop::pWantsMessages() const { return pIsRunning() && mScreen.output().hasRoom(); }
+/// Output waits while the user answers a prompt, so that it does not run into the answer.
+bool ConsoleLoop::pWantsMessages() const { return pIsRunning() && mScreen.output().hasRoom() && !mPrompt; }
 
 bool ConsoleLoop::pWantsToSend() const { return pIsRunning() && !mSendBroken && !mHeld.isEmpty(); }
 
@@ -138,11 +166,13 @@ PollDeadline ConsoleLoop::pDeadline() const
     PollDeadline deadline = pEndDeadline();
     if (pWantsToSend()) deadline = std::min(deadline, mHeld.deadline());
     if (pWantsMessages()) deadline = std::min(deadline, mKeepAlive.deadline());
+    if (pIsRunning() && mTools.script != nullptr) deadline = std::min(deadline, mTools.script->deadline());
     return deadline;
 }
 
 void ConsoleLoop::pPollOnce()
 {
+    pFeedFile();
     const PollFd input(mInput, PollEvents::Read);
     const PollFd messages = mConsole->getPollFd(PollEvents::Read);
     const PollFd sending = mConsole->getPollFd(PollEvents::Write);
@@ -167,6 +197,7 @@ void ConsoleLoop::pPollOnce()
     if (!ready.anyReady() && !isPending) pCheckEndTimer();
     pCheckHeld();
     pCheckSilence();
+    pFollowScript();
 }
 
 PollSet ConsoleLoop::attended() const
@@ -199,6 +230,7 @@ void ConsoleLoop::pHandleSignal()
         mKeepAlive.postpone(TimeProvider::steady());
         return mMode.enterRaw();
     }
+    if (signal == SIGWINCH) return pNoteResize();
     mOutcome.signal = signal;
     pExit(ExitReason::Signal);
 }
@@ -226,8 +258,16 @@ void ConsoleLoop::pReceive()
         if (pIsRunning() && mSession->getEnd() == SessionEnd::None) mFailure = std::current_exception();
         pExit(ExitReason::Ended);
     }
-    mScreen.showOutput(*mSession);
+    pShowReceived();
     if (mSession->getEnd() != SessionEnd::None) pExit(ExitReason::Ended);
+}
+
+void ConsoleLoop::pShowReceived()
+{
+    const std::size_t count = mScreen.showOutput(*mSession);
+    if (count == 0) return;
+    mReceived += count;
+    pReportFailures();
 }
 
 /// Called when the connection is writable: on Linux that means a third of the send buffer is free, which is more than
@@ -255,6 +295,8 @@ void ConsoleLoop::pSend()
 
 void ConsoleLoop::pReadInput()
 {
+    // It may have been read since it was ready, while the connection waited (attend()).
+    if (!PollSet(PollFd(mInput, PollEvents::Read)).poll().anyReady()) return;
     std::array<char, SerialSession::kMaxData> buffer;
     const ssize_t count = ::read(mInput, buffer.data(), buffer.size());
     const int error = errno;
@@ -266,9 +308,18 @@ void ConsoleLoop::pReadInput()
 
 void ConsoleLoop::pTakeTyped(const char* data, std::size_t length)
 {
+    constexpr char kInterrupt = 'C' & 0x1F;
     std::string typed(data, length);
     if (!mMode.isTerminal()) return pHold(typed);
     while (!typed.empty() && !pHasLeft()) {
+        if (mPrompt) {
+            pAnswerPrompt(typed);
+            continue;
+        }
+        if (mFile && typed.find(kInterrupt) != std::string::npos) {
+            mHeld.clear();
+            return pEndFile(texts::kFileStopped);
+        }
         std::string forPartition;
         const EscapeFilter::Command command = mEscape.take(typed, forPartition);
         pHold(forPartition);
@@ -279,31 +330,10 @@ void ConsoleLoop::pTakeTyped(const char* data, std::size_t length)
 void ConsoleLoop::pHold(const std::string& typed)
 {
     if (typed.empty() || !pIsRunning() || mSendBroken) return;
+    if (mIsReadOnly || mSession == nullptr) return mScreen.echo("\a");
     const bool wasDropping = mHeld.dropped() > 0;
     if (mHeld.add(typed, TimeProvider::steady()) == 0 || wasDropping) return;
     mScreen.sayLoudly(texts::kDropped + pLeaveHint(texts::kHeldLeave));
-}
-
-void ConsoleLoop::pExecute(EscapeFilter::Command command)
-{
-    switch (command) {
-    case EscapeFilter::Command::None:
-        return;
-    case EscapeFilter::Command::Help:
-        return mScreen.say(mEscape.help(mScreen.lineEnd()));
-    case EscapeFilter::Command::Suspend:
-        return pSuspend();
-    case EscapeFilter::Command::Leave:
-        return pLeave();
-    }
-}
-
-/// Characters typed before the command still go to the partition if it takes them at once.
-void ConsoleLoop::pLeave()
-{
-    const bool isUsable = pWantsToSend() && !mIsAttending;
-    if (isUsable && PollSet(mConsole->getPollFd(PollEvents::Write)).poll().anyReady()) pSend();
-    pExit(ExitReason::Left);
 }
 
 void ConsoleLoop::pEndInput()
@@ -319,6 +349,27 @@ void ConsoleLoop::pCheckEndTimer()
     if (!pEndDeadline().isExpired(TimeProvider::steady())) return;
     if (mInputOptions.linger) return pExit(ExitReason::Lingered);
     pHold({kEndOfFile});
+}
+
+/// Types what the script says, and ends when it is done or late.
+void ConsoleLoop::pFollowScript()
+{
+    SessionScript* const script = mTools.script;
+    if (script == nullptr || !pIsRunning()) return;
+    const auto now = TimeProvider::steady();
+    const std::string input = script->takeInput(now);
+    if (!input.empty()) mHeld.add(input, now);
+    if (!script->isDone()) {
+        if (!script->deadline().isExpired(now)) return;
+        const auto seconds = std::chrono::duration<double>(script->timeout()).count();
+        mFailure = std::make_exception_ptr(CommandFailure(
+            ExitStatus::DeadlinePassed, filled(texts::kStepLate, {numberText(seconds), script->waitsFor()})));
+        return pExit(ExitReason::Ended);
+    }
+    if (!mHeld.isEmpty()) return;
+    if (!mInputOptions.linger) return pExit(ExitReason::Lingered);
+    if (mInputOpen) mQuietSince = now;
+    mInputOpen = false; // the linger time runs
 }
 
 void ConsoleLoop::pCheckSilence()
@@ -340,10 +391,8 @@ void ConsoleLoop::pReport(KeepAlive::Event event)
     if (event == KeepAlive::Event::None) return;
     if (event == KeepAlive::Event::Back) return mScreen.say(texts::kBack);
     const auto seconds = std::chrono::duration<double>(mInputOptions.keepAlive).count();
-    std::ostringstream number;
-    number << seconds;
     const char* const text = mHeld.isEmpty() ? texts::kSilent : texts::kSilentHeld;
-    mScreen.say(filled(text, {number.str()}) + pLeaveHint(texts::kSilentChoice));
+    mScreen.say(filled(text, {numberText(seconds)}) + pLeaveHint(texts::kSilentChoice));
 }
 
 /// What a person at a terminal can do about it; empty for others.

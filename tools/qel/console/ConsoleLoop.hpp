@@ -10,14 +10,21 @@
 #include "console/AttentiveStream.hpp"
 #include "console/ConsoleScreen.hpp"
 #include "console/EscapeFilter.hpp"
+#include "console/FileSender.hpp"
 #include "console/HeldInput.hpp"
 #include "console/KeepAlive.hpp"
+#include "console/LineInput.hpp"
+#include "console/LogFile.hpp"
+#include "console/Recording.hpp"
+#include "console/SessionScript.hpp"
 
 #include <chrono>
 #include <cstddef>
+#include <cstdint>
 #include <exception>
 #include <optional>
 #include <string>
+#include <vector>
 
 namespace qel::tool {
 
@@ -34,6 +41,13 @@ struct InputOptions {
     bool sendsEnd = true;
     /// After the end of the input, leave once the partition has sent nothing for this long.
     std::optional<std::chrono::milliseconds> linger;
+};
+
+/// What a session is written to, and what leads it. Borrowed.
+struct SessionTools {
+    std::vector<LogFile*> logs;
+    Recording* recording = nullptr;
+    SessionScript* script = nullptr; ///< instead of input that is not a terminal
 };
 
 /// Connects an open virtual serial session to an input and a screen. Moves bytes in both directions until the session
@@ -61,6 +75,7 @@ public:
         Left,     ///< the user left, or the terminal hung up
         Lingered, ///< the linger time passed
         Ended,    ///< the session ended: see SerialSession::getEnd()
+        Force,    ///< the user wants the session to be opened again by force
         Signal,   ///< a termination signal arrived
     };
     struct Outcome {
@@ -76,8 +91,8 @@ public:
     /// @param mode  the terminal mode of `input`
     /// @param signals  watches the termination signals, SIGTSTP and SIGCONT. Signals that the process inherited as
     ///        ignored stay ignored.
-    ConsoleLoop(ConsoleScreen& screen, int input, TerminalMode& mode, SignalWatch& signals,
-                const InputOptions& options);
+    ConsoleLoop(ConsoleScreen& screen, int input, TerminalMode& mode, SignalWatch& signals, const InputOptions& options,
+                SessionTools tools = {});
 
     /// Restores the terminal.
     ~ConsoleLoop() override;
@@ -91,6 +106,16 @@ public:
     /// @throws Error  the session failed; output received before the failure has been written
     /// @throws PosixError  reading the input or writing the output failed
     Outcome run(Console& console, SerialSession& session, AttentiveStream* stream = nullptr);
+
+    /// Waits without a session, and reads the keyboard meanwhile; what is typed is thrown away.
+    /// @return the reason to exit, if the user or a signal gives one
+    Outcome wait(std::chrono::milliseconds duration);
+
+    /// Attends to the keyboard in connections that are made between two sessions.
+    StreamAttendant& attendant() { return *this; }
+
+    /// Why run() or wait() ended, or what the user has asked for since.
+    const Outcome& outcome() const noexcept { return mOutcome; }
 
 private:
     PollSet attended() const override;
@@ -117,8 +142,26 @@ private:
     void pReadInput();
     void pTakeTyped(const char* data, std::size_t length);
     void pHold(const std::string& typed);
+    void pShowReceived();
+    void pFollowScript();
+
+    // The commands of the user: see ConsoleEscapes.cpp.
     void pExecute(EscapeFilter::Command command);
+    void pExecuteInSession(EscapeFilter::Command command);
     void pLeave();
+    void pTellAbout();
+    void pToggleLogs();
+    void pCycleStamps();
+    void pToggleReadOnly();
+    void pTypeWindowSize();
+    void pAskForFile();
+    void pAnswerPrompt(std::string& typed);
+    void pBeginFile(const std::string& path);
+    void pFeedFile();
+    void pEndFile(const char* text);
+    void pNoteResize();
+    void pReportFailures();
+
     void pEndInput();
     void pCheckEndTimer();
     void pCheckSilence();
@@ -134,10 +177,16 @@ private:
     EscapeFilter mEscape;
     KeepAlive mKeepAlive;
     HeldInput mHeld;
+    const SessionTools mTools;
+    bool mIsReadOnly = false;
+    std::optional<LineInput> mPrompt;   // the name of a file is asked for
+    std::optional<FileSender> mFile;    // a file is being typed
+    PollDeadline::time_point mToldAt{}; // how much of it
 
-    // Of the current run().
+    // Of the current run(); null: none.
     Console* mConsole = nullptr;
     SerialSession* mSession = nullptr;
+    std::uint64_t mReceived = 0; // bytes
 
     bool mIsAttending = false;              // inside a call of the library: it must not be called again
     bool mInputOpen = true;                 // false after the end of the input

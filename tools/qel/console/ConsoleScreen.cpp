@@ -19,23 +19,49 @@ void ConsoleScreen::say(const std::string& text) { pSay("qel: " + text); }
 
 void ConsoleScreen::sayLoudly(const std::string& text) { pSay((mErrorsOnTerminal ? "\aqel: " : "qel: ") + text); }
 
-/// Earlier output comes first.
 void ConsoleScreen::pSay(const std::string& text)
 {
     const std::string start = mIsOneTerminal && !mOutput.endsLine() ? lineEnd() : "";
-    const std::string line = start + text + lineEnd();
-    if (mIsOneTerminal) mOutput.append(line.data(), line.size());
-    mOutput.writeSome();
-    if (!mIsOneTerminal) mErrors << line << std::flush;
+    echo(start + text + lineEnd());
 }
 
 const char* ConsoleScreen::lineEnd() const { return mErrorsOnTerminal && mMode.isRaw() ? "\r\n" : "\n"; }
 
-void ConsoleScreen::showOutput(SerialSession& session)
+std::size_t ConsoleScreen::showOutput(SerialSession& session)
 {
     std::array<char, SerialSession::kMaxData> buffer;
-    while (const std::size_t count = session.readAvailable(buffer.data(), buffer.size()))
-        mOutput.append(buffer.data(), count);
+    std::size_t total = 0;
+    while (const std::size_t count = session.readAvailable(buffer.data(), buffer.size())) {
+        total += count;
+        for (SessionTap* const tap : mTaps)
+            tap->onOutput(buffer.data(), count);
+        if (mInstead) continue;
+        pShow(buffer.data(), count);
+    }
+    if (mInstead && total > 0) {
+        const std::string text = mInstead();
+        mOutput.append(text.data(), text.size());
+    }
+    return total;
+}
+
+void ConsoleScreen::pShow(const char* data, std::size_t length)
+{
+    if (mStamps.style() == TimeStamps::Style::Off) {
+        mStamps.skip(data, length);
+        return mOutput.append(data, length);
+    }
+    std::string stamped;
+    mStamps.append(data, length, stamped);
+    mOutput.append(stamped.data(), stamped.size());
+}
+
+/// Earlier output comes first.
+void ConsoleScreen::echo(const std::string& text)
+{
+    if (mIsOneTerminal) mOutput.append(text.data(), text.size());
+    mOutput.writeSome();
+    if (!mIsOneTerminal) mErrors << text << std::flush;
 }
 
 void ConsoleScreen::showBroadcast(const QelMessageDaxBroadcastOutboundAsync& broadcast)

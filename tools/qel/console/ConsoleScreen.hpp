@@ -6,9 +6,15 @@
 #include "base/DescriptorOutput.hpp"
 #include "base/Library.hpp"
 #include "base/TerminalMode.hpp"
+#include "console/SessionTap.hpp"
+#include "console/TimeStamps.hpp"
 
+#include <cstddef>
+#include <functional>
 #include <ostream>
 #include <string>
+#include <utility>
+#include <vector>
 
 namespace qel::tool {
 
@@ -35,20 +41,38 @@ public:
     /// The buffer of the partition's output.
     DescriptorOutput& output() noexcept { return mOutput; }
 
-    /// Appends to output() what the session has received.
-    void showOutput(SerialSession& session);
+    /// Appends to output() what the session has received, stamped; the taps get it as it came.
+    /// @return the number of bytes received
+    std::size_t showOutput(SerialSession& session);
+
+    /// @param tap  gets all that follows; borrowed
+    void addTap(SessionTap& tap) { mTaps.push_back(&tap); }
+    const std::vector<SessionTap*>& taps() const noexcept { return mTaps; }
+
+    /// Shows only what this returns, asked after each piece of output, instead of the output.
+    void showInstead(std::function<std::string()> source) { mInstead = std::move(source); }
+
+    /// The time in front of each line.
+    TimeStamps& stamps() noexcept { return mStamps; }
+
+    /// Shows text of this program as it is, such as a prompt.
+    void echo(const std::string& text);
 
     /// Prints sender and text of a broadcast of another console, with control characters escaped.
     void showBroadcast(const QelMessageDaxBroadcastOutboundAsync& broadcast);
 
 private:
     void pSay(const std::string& text);
+    void pShow(const char* data, std::size_t length);
 
     DescriptorOutput mOutput;
     std::ostream& mErrors;
     const bool mErrorsOnTerminal;
     const bool mIsOneTerminal; ///< output and messages share a terminal
     const TerminalMode& mMode;
+    TimeStamps mStamps;
+    std::vector<SessionTap*> mTaps;
+    std::function<std::string()> mInstead;
 };
 
 } // namespace qel::tool

@@ -1,5 +1,7 @@
 #include "console/ConsoleTexts.hpp"
 
+#include <sstream>
+
 namespace qel::tool {
 
 std::string filled(const char* text, std::initializer_list<std::string> values)
@@ -13,6 +15,13 @@ std::string filled(const char* text, std::initializer_list<std::string> values)
         }
     }
     return result;
+}
+
+std::string numberText(double number)
+{
+    std::ostringstream text;
+    text << number;
+    return text.str();
 }
 
 } // namespace qel::tool

@@ -11,6 +11,9 @@ namespace qel::tool {
 /// Replaces "$1" by the first value, and so on. @param text  has no other dollar signs
 std::string filled(const char* text, std::initializer_list<std::string> values);
 
+/// A number as it is given on a command line: 15, 0.4.
+std::string numberText(double number);
+
 namespace texts {
 
 // The session.
@@ -35,6 +38,62 @@ constexpr const char* kSilentHeld =
     "the server has sent nothing for $1 s: it is gone or stopped, or the partition takes no input";
 constexpr const char* kSilentChoice = "; wait, or leave with $1. at the start of a line";
 constexpr const char* kBack = "the server answers again";
+
+// The commands after the escape character.
+constexpr const char* kHelpTitle = "at the start of a line:";
+constexpr const char* kHelpLeave = "leave";
+constexpr const char* kHelpHelp = "this list";
+constexpr const char* kHelpInfo = "tell about the session";
+constexpr const char* kHelpLog = "turn the log off or on";
+constexpr const char* kHelpStamps = "time stamps: UTC, since the last line, off";
+constexpr const char* kHelpReadOnly = "read only: type nothing; or type again";
+constexpr const char* kHelpForce = "open the session again by force, to type";
+constexpr const char* kHelpBreak = "how to send a break";
+constexpr const char* kHelpWindow = "type the command that sets the size of this window";
+constexpr const char* kHelpFile = "type a file";
+constexpr const char* kHelpSuspend = "suspend this program";
+constexpr const char* kHelpEscape = "type $1";
+
+constexpr const char* kLogOn = "log on: $1";
+constexpr const char* kLogOff = "log off: $1";
+constexpr const char* kNoLog = "there is no log; start with --log FILE or --log-strip FILE";
+constexpr const char* kStampsOff = "time stamps off";
+constexpr const char* kStampsIso = "time stamps in UTC";
+constexpr const char* kStampsDelta = "time stamps: seconds since the line before";
+constexpr const char* kReadOnly = "read only: nothing that is typed is sent";
+constexpr const char* kReadWrite = "what is typed is sent again";
+constexpr const char* kBreak =
+    "the protocol carries no break; on the server's machine, qel status --break $1 sends one where the line can";
+constexpr const char* kNoWindow = "the size of this window is not known";
+constexpr const char* kForcing = "opening partition $1 again by force";
+
+constexpr const char* kInfoTraffic = "$1 bytes received, $2 sent, $3 held";
+constexpr const char* kInfoHeard = "the server was heard $1 ago";
+constexpr const char* kInfoRoundTrip = "it last answered in $1 ms";
+constexpr const char* kInfoLog = "log $1: $2";
+
+constexpr const char* kFilePrompt = "qel: file to type (return alone cancels): ";
+constexpr const char* kFileCancelled = "no file is typed";
+constexpr const char* kFileBegins = "typing $1 ($2 bytes); control-C stops it";
+constexpr const char* kFileProgress = "$1 of $2 bytes of the file are typed";
+constexpr const char* kFileDone = "the file is typed: $1 bytes";
+constexpr const char* kFileStopped = "stopped after $1 bytes of the file";
+
+// Without a person.
+constexpr const char* kStepLate = "timed out after $1 s (--timeout): waiting for $2";
+constexpr const char* kStepUnfinished = "the session ended while waiting for $1: $2";
+constexpr const char* kCommandStatus = "the command exited with status $1";
+
+constexpr const char* kTimedOut = "timed out after $1 s (--timeout): $2";
+
+// Watching.
+constexpr const char* kNoWatching = "the server lets nobody watch partition $1: its sessions have connection 0 only";
+constexpr const char* kWatchersFull = "15 consoles watch partition $1 already; wait until one leaves";
+
+// Connecting again.
+constexpr const char* kLost = "$1; connecting again";
+constexpr const char* kNextAttempt = "$1; next attempt in $2 s";
+constexpr const char* kBackAgain = "connected again after $1 s; output may be missing";
 
 } // namespace texts
 

@@ -3,14 +3,35 @@
 #include <qel/protocol/Text.hpp>
 
 #include "base/Library.hpp"
+#include "console/ConsoleTexts.hpp"
+
+#include <algorithm>
+#include <cstddef>
+#include <iterator>
 
 namespace qel::tool {
 
 namespace {
 
-constexpr char kLeave = '.';
-constexpr char kHelp = '?';
-constexpr char kSuspend = 'Z' & 0x1F; // control-Z
+struct Row {
+    char key;
+    EscapeFilter::Command command;
+    const char* help;
+};
+
+constexpr Row kRows[] = {
+    {'.', EscapeFilter::Command::Leave, texts::kHelpLeave},
+    {'?', EscapeFilter::Command::Help, texts::kHelpHelp},
+    {'i', EscapeFilter::Command::Info, texts::kHelpInfo},
+    {'l', EscapeFilter::Command::Log, texts::kHelpLog},
+    {'t', EscapeFilter::Command::Stamps, texts::kHelpStamps},
+    {'r', EscapeFilter::Command::ReadOnly, texts::kHelpReadOnly},
+    {'f', EscapeFilter::Command::Force, texts::kHelpForce},
+    {'b', EscapeFilter::Command::Break, texts::kHelpBreak},
+    {'w', EscapeFilter::Command::WindowSize, texts::kHelpWindow},
+    {'#', EscapeFilter::Command::SendFile, texts::kHelpFile},
+    {'Z' & 0x1F, EscapeFilter::Command::Suspend, texts::kHelpSuspend},
+};
 
 constexpr unsigned char kFirstPrintable = 0x20;
 constexpr unsigned char kDelete = 0x7F;
@@ -32,18 +53,23 @@ EscapeFilter::Command EscapeFilter::take(std::string& typed, std::string& forPar
 
 std::string EscapeFilter::help(const std::string& lineEnd) const
 {
-    if (!mEscape) return "no escape character is set";
+    if (!mEscape) return texts::kNoEscape;
     const std::string escape = characterName(*mEscape);
-    return "at the start of a line:" + lineEnd +                  //
-           "  " + escape + ".   leave" + lineEnd +                //
-           "  " + escape + "^Z  suspend this program" + lineEnd + //
-           "  " + escape + "?   this list" + lineEnd +            //
-           "  " + escape + escape + "   type " + escape;
+    const std::size_t width = escape.size() + 4;
+    const auto row = [width](std::string keys, const std::string& help) {
+        keys.resize(width, ' ');
+        return "  " + keys + help;
+    };
+    std::string list = texts::kHelpTitle + lineEnd;
+    for (const Row& each : kRows)
+        list += row(escape + characterName(each.key), each.help) + lineEnd;
+    return list + row(escape + escape, filled(texts::kHelpEscape, {escape}));
 }
 
 bool EscapeFilter::isCommandCharacter(char c)
 {
-    return c == kLeave || c == kHelp || c == kSuspend || c == '\r' || c == '\n';
+    return c == '\r' || c == '\n' ||
+           std::any_of(std::begin(kRows), std::end(kRows), [c](const Row& row) { return row.key == c; });
 }
 
 EscapeFilter::Command EscapeFilter::pTake(char c, std::string& forPartition)
@@ -60,9 +86,9 @@ EscapeFilter::Command EscapeFilter::pTake(char c, std::string& forPartition)
 EscapeFilter::Command EscapeFilter::pTakeEscaped(char c, std::string& forPartition)
 {
     mEscaped = false;
-    if (c == kLeave) return Command::Leave;
-    if (c == kHelp) return Command::Help;
-    if (c == kSuspend) return Command::Suspend;
+    for (const Row& row : kRows) {
+        if (row.key == c) return row.command;
+    }
     pType(*mEscape, forPartition);
     if (c != *mEscape) pType(c, forPartition);
     return Command::None;

@@ -6,10 +6,7 @@
 namespace qel::tool {
 
 /// Separates commands to this program from input for the partition. As in remote shells, the escape character at the
-/// start of a line makes a command of the character after it.
-///
-///     ~.    leave            ~^Z   suspend this program
-///     ~?    list these       ~~    type one ~
+/// start of a line makes a command of the character after it; help() lists them.
 ///
 /// The escape character before any other character is not a command; both characters are input. A line starts at the
 /// beginning of the session and after every carriage return or line feed in the input. A command is not input, so
@@ -18,7 +15,7 @@ namespace qel::tool {
 /// Thread safety: one thread.
 class EscapeFilter {
 public:
-    enum class Command { None, Leave, Help, Suspend };
+    enum class Command { None, Leave, Help, Suspend, Info, Log, Stamps, ReadOnly, Force, Break, WindowSize, SendFile };
 
     /// @param escape  the escape character; none: everything is input
     explicit EscapeFilter(std::optional<char> escape);

@@ -1,0 +1,87 @@
+#pragma once
+
+#include <qel/common/net/IPEndpoint.hpp>
+#include <qel/protocol/SerialSession.hpp>
+
+#include "base/ExitStatus.hpp"
+#include "base/Library.hpp"
+#include "base/TerminalMode.hpp"
+#include "client/ConnectOptions.hpp"
+#include "console/ConsoleConnection.hpp"
+#include "console/ConsoleLoop.hpp"
+#include "console/ConsoleScreen.hpp"
+#include "console/LogFile.hpp"
+#include "console/MessageStream.hpp"
+#include "console/Recording.hpp"
+#include "console/SessionScript.hpp"
+#include "console/TimeStamps.hpp"
+
+#include <chrono>
+#include <exception>
+#include <memory>
+#include <optional>
+#include <string>
+#include <vector>
+
+namespace qel::tool {
+
+/// What "qel console" is to do.
+struct ConsoleRunOptions {
+    ConnectOptions connect;
+    std::uint16_t partition = 0;
+    SerialOptions serial;
+    bool watch = false;     ///< with the first connection number from 1 on that is free
+    bool reconnect = false; ///< when the connection is lost
+    InputOptions input;
+    TimeStamps::Style stamps = TimeStamps::Style::Off;
+    std::string log;      ///< path; empty: none, here and below
+    std::string logStrip; ///< path
+    std::string record;   ///< path
+    std::vector<ScriptStep> steps;
+};
+
+/// One run of "qel console", from the first connection to the end.
+/// Thread safety: one thread.
+class ConsoleRun {
+public:
+    /// Opens the files. @throws FileIOError  one cannot be written
+    explicit ConsoleRun(const ConsoleRunOptions& options);
+
+    /// Connects, opens the session, moves data, and leaves.
+    /// @throws CommandFailure, and what connectConsole() throws
+    ExitStatus run();
+
+private:
+    using TimePoint = std::chrono::steady_clock::time_point;
+
+    SessionTools pTools();
+    void pUse(ConsoleConnection&& connection);
+    void pOpen(TimePoint end);
+    SerialSession pOpenFirstFree(TimePoint end);
+    void pOpenAgain(ConsoleLoop& loop);
+    ConsoleLoop::Outcome pRunLoop();
+    bool pRunOnce(ConsoleLoop& loop, ConsoleLoop::Outcome& outcome);
+    bool pReconnect(ConsoleLoop& loop, const std::string& reason);
+    bool pTryToReconnect(ConsoleLoop& loop, std::chrono::milliseconds& delay);
+    void pMarkGap(const std::string& text);
+    void pClose();
+    void pLeave() noexcept;
+    ExitStatus pConclude(const ConsoleLoop::Outcome& outcome, SessionEnd end, const std::string& endText);
+    ExitStatus pStatusOf(SessionEnd end) const;
+    std::string pLeftText(const ConsoleLoop::Outcome& outcome) const;
+
+    const ConsoleRunOptions mOptions;
+    TerminalMode mMode;
+    MessageStream mMessages;
+    ConsoleScreen mScreen;
+    std::optional<LogFile> mLog;
+    std::optional<LogFile> mStrippedLog;
+    std::optional<Recording> mRecording;
+    std::optional<SessionScript> mScript;
+    SerialOptions mSerial; // of the session that is open
+    std::vector<IPEndpoint> mKnown;
+    std::optional<ConsoleConnection> mConnection;
+    std::optional<SerialSession> mSession; // after the connection: it uses it
+};
+
+} // namespace qel::tool

@@ -1,0 +1,13 @@
+#pragma once
+
+#include "base/Program.hpp"
+
+#include <CLI/CLI.hpp>
+
+namespace qel::tool {
+
+/// Adds "qel list": prints the partitions of the user's profiles.
+/// @param action  set when the command line asks for it
+CLI::App& addListCommand(CLI::App& parent, Action& action);
+
+} // namespace qel::tool

@@ -1,0 +1,143 @@
+#include "console/Profiles.hpp"
+
+#include <qel/protocol/Text.hpp>
+
+#include "base/Failures.hpp"
+#include "base/Library.hpp"
+#include "base/OptionChecks.hpp"
+#include "base/UsageErrors.hpp"
+
+#include <algorithm>
+#include <cstdlib>
+#include <filesystem>
+#include <limits>
+#include <optional>
+
+namespace qel::tool {
+
+namespace {
+
+constexpr const char* kPartitions = "partitions";
+constexpr std::uint16_t kMaxPartition = std::numeric_limits<std::uint16_t>::max();
+
+std::string variable(const char* name)
+{
+    const char* const value = std::getenv(name);
+    return value == nullptr ? std::string() : value;
+}
+
+[[noreturn]] void failUnknown(const char* kind, const std::string& word, const std::vector<std::string>& known)
+{
+    const std::string guess = nearestWord(word, known);
+    const std::string hint = guess.empty() ? "; qel list shows what there is" : "; did you mean " + quoted(guess) + "?";
+    throw CommandFailure(ExitStatus::Usage, std::string("there is no ") + kind + " " + quoted(word) + hint);
+}
+
+Profile readProfile(const TomlEntry& entry)
+{
+    Profile profile{entry.key, tableOf(entry), {}};
+    if (entry.key.find('/') != std::string::npos) failAt(entry.place, "the name of a profile must not contain a slash");
+    const TomlEntry* const partitions = profile.options.find(kPartitions);
+    if (partitions == nullptr) return profile;
+    for (const TomlEntry& each : tableOf(*partitions).entries)
+        profile.partitions.emplace_back(each.key, static_cast<std::uint16_t>(integerOf(each, 0, kMaxPartition)));
+    return profile;
+}
+
+const Profile& findProfile(const std::string& name, const std::vector<Profile>& profiles)
+{
+    std::vector<std::string> names;
+    for (const Profile& profile : profiles) {
+        if (profile.name == name) return profile;
+        names.push_back(profile.name);
+    }
+    failUnknown("profile", name, names);
+}
+
+std::uint16_t findPartition(const std::string& name, const Profile& profile)
+{
+    std::vector<std::string> names;
+    for (const auto& partition : profile.partitions) {
+        if (partition.first == name) return partition.second;
+        names.push_back(profile.name + "/" + partition.first);
+    }
+    const std::optional<std::uint64_t> number = parseInteger(name);
+    if (number && *number <= kMaxPartition) return static_cast<std::uint16_t>(*number);
+    failUnknown("partition", profile.name + "/" + name, names);
+}
+
+/// The long names of the options that a profile can set.
+std::vector<std::string> optionNames(const CLI::App& command)
+{
+    std::vector<std::string> names{kPartitions};
+    for (const CLI::Option* option : command.get_options()) {
+        for (const std::string& name : option->get_lnames()) {
+            if (name != "help" && name != "version") names.push_back(name);
+        }
+    }
+    return names;
+}
+
+/// Sets one option as the parser would.
+void setOption(CLI::Option& option, const TomlEntry& entry)
+{
+    if (option.count() > 0) return; // the command line comes first
+    try {
+        if (entry.value.kind == TomlValue::Kind::Boolean && option.get_items_expected_max() == 0) {
+            if (!flagOf(entry)) return;
+            option.add_result("true");
+        } else {
+            for (const TomlValue* item : itemsOf(entry))
+                option.add_result(item->text);
+        }
+        option.run_callback();
+    } catch (const CLI::ParseError& error) {
+        failAt(entry.place, error.what());
+    }
+}
+
+} // namespace
+
+std::string Profile::option(const std::string& key) const
+{
+    const TomlEntry* const entry = options.find(key);
+    return entry == nullptr ? std::string() : entry->value.text;
+}
+
+std::string profilesPath()
+{
+    const std::string configuration = variable("XDG_CONFIG_HOME");
+    if (!configuration.empty()) return configuration + "/qel/config.toml";
+    const std::string home = variable("HOME");
+    return home.empty() ? home : home + "/.config/qel/config.toml";
+}
+
+std::vector<Profile> readProfiles(const std::string& path)
+{
+    std::error_code error; // a file that cannot be examined is read, which says why
+    if (path.empty() || (!std::filesystem::exists(path, error) && !error)) return {};
+    const TomlValue file = readToml(path);
+    requireKnownKeys(file, {"profile"});
+    std::vector<Profile> profiles;
+    const TomlEntry* const table = file.find("profile");
+    if (table == nullptr) return profiles;
+    for (const TomlEntry& entry : tableOf(*table).entries)
+        profiles.push_back(readProfile(entry));
+    return profiles;
+}
+
+bool namesProfile(const std::string& target) { return target.find('/') != std::string::npos; }
+
+std::uint16_t applyProfile(const std::string& target, const std::vector<Profile>& profiles, CLI::App& command)
+{
+    const std::size_t slash = target.find('/');
+    const Profile& profile = findProfile(target.substr(0, slash), profiles);
+    const std::uint16_t partition = findPartition(target.substr(slash + 1), profile);
+    requireKnownKeys(profile.options, optionNames(command));
+    for (const TomlEntry& entry : profile.options.entries) {
+        if (entry.key != kPartitions) setOption(*findOption(command, entry.key), entry);
+    }
+    return partition;
+}
+
+} // namespace qel::tool

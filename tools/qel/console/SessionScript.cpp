@@ -1,0 +1,177 @@
+#include "console/SessionScript.hpp"
+
+#include <qel/protocol/Text.hpp>
+
+#include "base/Library.hpp"
+
+#include <algorithm>
+#include <array>
+#include <cstdlib>
+#include <stdexcept>
+#include <utility>
+
+namespace qel::tool {
+
+namespace {
+
+constexpr const char* kBegin = "qel-begin-";
+constexpr const char* kEnd = "qel-end-";
+
+/// In single quotes for a shell.
+std::string shellQuoted(const std::string& text)
+{
+    std::string quoted = "'";
+    for (const char c : text)
+        quoted += c == '\'' ? std::string("'\\''") : std::string(1, c);
+    return quoted + "'";
+}
+
+} // namespace
+
+/// A compiled regular expression. That of POSIX does not recurse, as std::regex does, so that no output can exhaust the
+/// stack.
+struct SessionScript::Pattern {
+    explicit Pattern(const std::string& text)
+    {
+        const int error = ::regcomp(&regex, text.c_str(), REG_EXTENDED | REG_NEWLINE);
+        if (error == 0) return;
+        std::array<char, 256> reason{};
+        ::regerror(error, &regex, reason.data(), reason.size());
+        throw std::invalid_argument(quoted(text) + " is not a regular expression: " + reason.data());
+    }
+    ~Pattern() { ::regfree(&regex); }
+    Pattern(const Pattern&) = delete;
+    Pattern& operator=(const Pattern&) = delete;
+
+    regex_t regex{};
+};
+
+std::string commandLineWithMarks(const std::string& command, const std::string& mark)
+{
+    return std::string("printf '%s%s\\n' ") + kBegin + " " + mark + "; sh -c " + shellQuoted(command) +
+           " </dev/null; printf '%s%s:%d\\n' " + kEnd + " " + mark + " $?";
+}
+
+SessionScript::SessionScript(const std::vector<ScriptStep>& steps, std::chrono::milliseconds timeout, std::string mark)
+    : mTimeout(timeout), mMark(std::move(mark))
+{
+    for (const ScriptStep& step : steps) {
+        const bool isExpect = step.kind == ScriptStep::Kind::Expect;
+        mSteps.push_back({step, isExpect ? std::make_shared<Pattern>(step.text) : nullptr});
+    }
+}
+
+SessionScript::~SessionScript() = default;
+
+std::string SessionScript::takeInput(TimePoint now)
+{
+    std::string input;
+    while (!mSteps.empty() && !mSteps.front().hasBegun)
+        input += pBegin(mSteps.front(), now);
+    return input;
+}
+
+/// @return what it types
+std::string SessionScript::pBegin(Step& step, TimePoint now)
+{
+    if (step.step.kind == ScriptStep::Kind::Send) {
+        std::string text = std::move(step.step.text);
+        mSteps.pop_front();
+        return text;
+    }
+    step.hasBegun = true;
+    mDeadline = now + mTimeout;
+    if (step.step.kind == ScriptStep::Kind::Exec) return commandLineWithMarks(step.step.text, mMark) + "\r";
+    pMatch();
+    return {};
+}
+
+void SessionScript::onOutput(const char* data, std::size_t length)
+{
+    mUnused.append(data, length);
+    pMatch();
+    if (mUnused.size() > kWindow) mUnused.erase(0, mUnused.size() - kWindow);
+}
+
+/// Finishes the step that waits if its output has come.
+void SessionScript::pMatch()
+{
+    if (mSteps.empty() || !mSteps.front().hasBegun) return;
+    const Step& step = mSteps.front();
+    if (step.pattern != nullptr ? pMatchPattern(*step.pattern) : pMatchCommand()) pFinish();
+}
+
+bool SessionScript::pMatchPattern(const Pattern& pattern)
+{
+    regmatch_t match{};
+    match.rm_eo = static_cast<regoff_t>(mUnused.size());
+    if (::regexec(&pattern.regex, mUnused.data(), 1, &match, REG_STARTEND) != 0) return false;
+    mUnused.erase(0, static_cast<std::size_t>(match.rm_eo));
+    return true;
+}
+
+bool SessionScript::pMatchCommand()
+{
+    if (!mIsInCommand) {
+        const std::string begin = kBegin + mMark;
+        const std::size_t place = mUnused.find(begin);
+        const std::size_t lineEnd = place == std::string::npos ? place : mUnused.find('\n', place);
+        if (lineEnd == std::string::npos) return false;
+        mUnused.erase(0, lineEnd + 1);
+        mIsInCommand = true;
+    }
+    const std::string end = kEnd + mMark + ":";
+    const std::size_t place = mUnused.find(end);
+    const std::size_t lineEnd = place == std::string::npos ? place : mUnused.find('\n', place);
+    if (lineEnd == std::string::npos) {
+        // All but what may be the beginning of the mark.
+        const std::size_t held =
+            std::min(mUnused.size(), place == std::string::npos ? end.size() : mUnused.size() - place);
+        pKeepCommandOutput(mUnused.size() - held);
+        return false;
+    }
+    mStatus = std::atoi(mUnused.c_str() + place + end.size());
+    pKeepCommandOutput(place);
+    mUnused.erase(0, mUnused.find('\n') + 1);
+    mIsInCommand = false;
+    return true;
+}
+
+/// Moves the first bytes to the output of the command.
+void SessionScript::pKeepCommandOutput(std::size_t end)
+{
+    mCommandOutput.append(mUnused, 0, end);
+    mUnused.erase(0, end);
+}
+
+void SessionScript::pFinish()
+{
+    mSteps.pop_front();
+    mDeadline = PollDeadline();
+}
+
+std::string SessionScript::waitsFor() const
+{
+    if (mSteps.empty()) return {};
+    const ScriptStep& step = mSteps.front().step;
+    const bool isExpect = step.kind == ScriptStep::Kind::Expect;
+    return (isExpect ? "output that matches " : "the end of ") + quoted(step.text);
+}
+
+std::string SessionScript::takeCommandOutput()
+{
+    std::string all = std::exchange(mCommandOutput, {});
+    // A return whose line feed has not come yet waits for it.
+    if (!mSteps.empty() && !all.empty() && all.back() == '\r') {
+        mCommandOutput = "\r";
+        all.pop_back();
+    }
+    std::string text;
+    for (std::size_t i = 0; i < all.size(); ++i) {
+        const bool isLineEnd = all[i] == '\r' && i + 1 < all.size() && all[i + 1] == '\n';
+        if (!isLineEnd) text += all[i];
+    }
+    return text;
+}
+
+} // namespace qel::tool
