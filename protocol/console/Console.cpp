@@ -124,7 +124,7 @@ detail::PendingExchange Console::pStart(const QelMessage& message)
 {
     const auto core = mCore;
     auto exchange = std::make_shared<Exchange>(message);
-    core->start(message, *exchange, deadlineIn(core->requestTimeout()));
+    core->start(message, *exchange, deadlineIn(core->requestTimeout()), SendTime::WithOthers);
     return detail::PendingExchange(core, std::move(exchange));
 }
 

@@ -171,13 +171,21 @@ const QelMessageGetEnclTypeAndInterfaceVersionRsp& ConsoleCore::version() const
 
 PollFd ConsoleCore::getPollFd(PollEvents events) const
 {
-    return mLink == nullptr ? PollFd::Ignore : mLink->getPollFd(events);
+    if (mLink == nullptr) return PollFd::Ignore;
+    PollFd fd = mLink->getPollFd(events);
+    if (mIsStuck) fd.mFd.events |= static_cast<short>(PollEvents::Write);
+    return fd;
+}
+
+bool ConsoleCore::hasPending() const
+{
+    return mLink != nullptr && (mLink->hasPending() || (mLink->hasGathered() && !mIsStuck && mLink->isUsable()));
 }
 
 std::unique_ptr<QelMessage> ConsoleCore::exchange(const QelMessage& request, TimePoint end, Exchanges::Action action)
 {
     Exchange exchange(request);
-    start(request, exchange, end, std::move(action));
+    start(request, exchange, end, SendTime::Now, std::move(action));
     try {
         return finish(exchange, end);
     } catch (...) {
@@ -193,13 +201,19 @@ std::unique_ptr<QelMessage> ConsoleCore::require(const QelMessage& request, Time
     return response;
 }
 
-void ConsoleCore::start(const QelMessage& request, Exchange& exchange, TimePoint end, Exchanges::Action action)
+void ConsoleCore::start(const QelMessage& request, Exchange& exchange, TimePoint end, SendTime when,
+                        Exchanges::Action action)
 {
     requireSendable(request, true, "request");
     if (mExchanges.isFull()) throw LimitReached("too many requests are under way without a response", mServer);
-    const bool isAlone = mExchanges.isEmpty() && mSerials.empty();
+    FrameLink& link = pLink();
+    const bool isAlone = pIsQuiet() && !link.hasGathered();
     mExchanges.add(request, &exchange, std::move(action));
     try {
+        if (when == SendTime::WithOthers && link.hasRoomFor(request)) {
+            link.gather(request);
+            return mExchanges.noteGathered();
+        }
         if (isAlone) return pSend(request, end); // the peer has nothing to say, so it takes the request
         // It fails when a handler ends the connection; the next one does not know it.
         const auto isWanted = [&] { return exchange.failure == nullptr; };
@@ -233,6 +247,10 @@ Sending ConsoleCore::sendAmongOthers(const QelMessage& message, TimePoint end, c
 {
     while (isWanted()) {
         const Ready ready = pLink().await(pFullSerial() == nullptr, end);
+        if (ready.send && pLink().hasGathered() && !pLink().hasRoomFor(message)) {
+            pFlush(); // there is room for one long write
+            continue;
+        }
         if (ready.send) {
             pSend(message, end);
             return Sending::Done;
@@ -253,8 +271,14 @@ bool ConsoleCore::receiveOne(TimePoint begin, TimePoint end)
                                std::to_string(full->unreadBytes()) + " bytes of output that nobody reads",
                            mServer);
     }
-    std::unique_ptr<QelMessage> message = pReceive(begin, end);
-    if (message == nullptr) return false;
+    std::unique_ptr<QelMessage> message;
+    while (message == nullptr) {
+        const Ready ready = pAwaitTurn(begin);
+        if (!ready.send && !ready.receive) return false;
+        // While something waits to be sent, only what has arrived is received.
+        message = pReceive(ready.send ? begin : TimeProvider::steady(), end);
+        if (message == nullptr && (ready.send || hasPassed(begin))) return false;
+    }
     if (message->getClassification() != QelMessageClassification::Response) {
         pHandleNotice(*message);
     } else {
@@ -392,6 +416,7 @@ void ConsoleCore::pIntroduce(TimePoint end)
 void ConsoleCore::pDisconnect(const std::exception_ptr& failure) noexcept
 {
     mLink.reset();
+    mIsStuck = false;
     mUnusable = failure;
     mExchanges.failAll(failure);
     mIsSessionOpen = false;
@@ -407,12 +432,46 @@ FrameLink& ConsoleCore::pLink()
 
 void ConsoleCore::pSend(const QelMessage& message, TimePoint end)
 {
+    FrameLink& link = pLink();
+    const bool hasGathered = link.hasGathered();
     try {
-        pLink().send(message, end);
+        link.send(message, end);
     } catch (...) {
+        mExchanges.failGathered(std::current_exception());
         pFailExchanges();
         throw;
     }
+    if (!hasGathered) return;
+    mExchanges.noteSent();
+    mIsStuck = false;
+}
+
+/// Sends what was gathered.
+void ConsoleCore::pFlush()
+{
+    try {
+        pLink().flush(TimePoint::max());
+    } catch (...) {
+        mExchanges.failGathered(std::current_exception());
+        pFailExchanges();
+        throw;
+    }
+    mExchanges.noteSent();
+    mIsStuck = false;
+}
+
+/// Sends what was gathered as soon as the peer takes it, unless there is something to receive without waiting.
+/// @return send: nothing is left to be sent; receive: something is, and something has arrived; neither: late
+Ready ConsoleCore::pAwaitTurn(TimePoint end)
+{
+    FrameLink& link = pLink();
+    if (!link.hasGathered() || !link.isUsable()) return {true, false};
+    if (link.hasPending()) return {false, true};
+    // A peer that has nothing to say takes them.
+    const Ready ready = pIsQuiet() ? Ready{true, false} : link.await(true, end);
+    mIsStuck = !ready.send;
+    if (ready.send) pFlush();
+    return ready;
 }
 
 std::unique_ptr<QelMessage> ConsoleCore::pReceive(TimePoint begin, TimePoint end)

@@ -30,6 +30,12 @@ enum class Sending {
     Late,      ///< the peer took nothing in time; the connection is as good as before
 };
 
+/// When a request is sent.
+enum class SendTime {
+    Now,
+    WithOthers, ///< before this console waits for anything, or when there is no room to gather more
+};
+
 /// What a Console does; shared by the console, its sessions and its pending responses. See Console for the rules.
 /// Thread safety: one thread, except close().
 class ConsoleCore {
@@ -61,7 +67,7 @@ public:
     bool isProtected() const noexcept { return mIsProtected; }
     const QelMessageGetEnclTypeAndInterfaceVersionRsp& version() const;
     PollFd getPollFd(PollEvents events) const;
-    bool hasPending() const { return mLink != nullptr && mLink->hasPending(); }
+    bool hasPending() const;
 
     // Messages.
 
@@ -73,7 +79,8 @@ public:
     /// Sends a request. Returns without having sent it when the connection ends while others are received; the exchange
     /// has failed then.
     /// @param exchange  made for this request; borrowed until it is done or abandoned
-    void start(const QelMessage& request, Exchange& exchange, TimePoint end, Exchanges::Action action = {});
+    void start(const QelMessage& request, Exchange& exchange, TimePoint end, SendTime when,
+               Exchanges::Action action = {});
     /// Waits for the response to a request.
     std::unique_ptr<QelMessage> finish(Exchange& exchange, TimePoint end);
     void abandon(const Exchange& exchange) noexcept { mExchanges.abandon(exchange); }
@@ -83,7 +90,7 @@ public:
     Sending sendAmongOthers(const QelMessage& message, TimePoint end, const std::function<bool()>& isWanted);
     [[noreturn]] void throwNotTaken() const;
 
-    /// Receives and handles one message. @return false: none began in time
+    /// Sends what was gathered; receives and handles one message. @return false: none began in time
     bool receiveOne(TimePoint begin, TimePoint end);
 
     void onNotice(const QelMessageRegistry::Identifier& identity, TypedHandler handler);
@@ -106,6 +113,9 @@ private:
     FrameLink& pLink();
 
     void pSend(const QelMessage& message, TimePoint end);
+    void pFlush();
+    bool pIsQuiet() const noexcept { return mSerials.empty() && mExchanges.isQuiet(); }
+    Ready pAwaitTurn(TimePoint end);
     std::unique_ptr<QelMessage> pReceive(TimePoint begin, TimePoint end);
     void pFailExchanges() noexcept;
 
@@ -144,6 +154,7 @@ private:
     std::vector<std::shared_ptr<SerialState>> mSerials;
     bool mIsSessionOpen = false; // the hypervisor session
     bool mIsReconnecting = false;
+    bool mIsStuck = false; // the peer has not taken what was gathered
 };
 
 } // namespace qel::protocol

@@ -8,7 +8,22 @@ namespace qel::protocol {
 void Exchanges::add(const QelMessage& request, Exchange* exchange, Action action)
 {
     mEntries.push_back({request.getCallerId(), static_cast<unsigned short>(request.getFunction()),
-                        static_cast<unsigned short>(request.getOperation()), exchange, std::move(action)});
+                        static_cast<unsigned short>(request.getOperation()), exchange, std::move(action), false});
+}
+
+void Exchanges::noteSent() noexcept
+{
+    for (Entry& entry : mEntries)
+        entry.isGathered = false;
+}
+
+void Exchanges::failGathered(const std::exception_ptr& failure) noexcept
+{
+    const auto isLost = [&](const Entry& entry) {
+        if (entry.isGathered && entry.exchange != nullptr) entry.exchange->failure = failure;
+        return entry.isGathered;
+    };
+    mEntries.erase(std::remove_if(mEntries.begin(), mEntries.end(), isLost), mEntries.end());
 }
 
 void Exchanges::remove(const Exchange& exchange) noexcept

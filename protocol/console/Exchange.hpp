@@ -35,7 +35,6 @@ public:
     static constexpr std::size_t kMost = 4096;
 
     bool isFull() const noexcept { return mEntries.size() >= kMost; }
-    bool isEmpty() const noexcept { return mEntries.empty(); }
 
     /// What to do about a response as soon as it arrives, whether or not anybody still waits for it.
     using Action = std::function<void(const QelMessage& response)>;
@@ -43,6 +42,14 @@ public:
     /// @param exchange  gets the response; borrowed until then or until abandon(). Null: the response is dropped
     /// @param action    called before the response is handed on; may be empty
     void add(const QelMessage& request, Exchange* exchange, Action action = {});
+    /// The request that was added last is gathered: it goes out with others, later.
+    void noteGathered() noexcept { mEntries.back().isGathered = true; }
+    /// The gathered requests have been sent.
+    void noteSent() noexcept;
+    /// The gathered requests cannot be sent any more.
+    void failGathered(const std::exception_ptr& failure) noexcept;
+    /// True when no request has been sent that is still to be answered. Gathered ones do not count.
+    bool isQuiet() const noexcept { return mEntries.empty() || mEntries.front().isGathered; }
     /// Forgets a request: it could not be sent.
     void remove(const Exchange& exchange) noexcept;
     /// No caller waits for this response any more; it is dropped.
@@ -62,6 +69,7 @@ private:
         unsigned short operation;
         Exchange* exchange; // null: abandoned
         Action action;
+        bool isGathered = false;
     };
 
     std::vector<Entry> mEntries;

@@ -43,6 +43,17 @@ std::exception_ptr failureOf(F fail)
     return nullptr;
 }
 
+/// Takes one of the steps of leaving.
+template <typename F>
+void attempt(F step) noexcept
+{
+    try {
+        step();
+    } catch (...) {
+        logCurrentAt(LogLevel::Debug, "while leaving");
+    }
+}
+
 /// How long a message may take that begins now.
 milliseconds frameTime(milliseconds frameTimeout, TimePoint end)
 {
@@ -239,16 +250,15 @@ PollFd FrameLink::getPollFd(PollEvents events) const
 
 void FrameLink::leave(TimePoint end) noexcept
 {
-    try {
-        const TimePoint farewell = std::min(end, deadlineIn(kMaxFarewell));
+    const TimePoint farewell = std::min(end, deadlineIn(kMaxFarewell));
+    attempt([&] {
         if (mGathered != 0 && isUsable() && await(false, farewell).send) flush(farewell);
-        mSendFailure = mReceiveFailure = mHasLeft;
-        if (pEndOutput()) pAwaitEnd(farewell);
-        mStream->close();
-    } catch (...) {
-        logCurrentAt(LogLevel::Debug, "while leaving");
-    }
+    });
     mSendFailure = mReceiveFailure = mHasLeft;
+    attempt([&] {
+        if (pEndOutput()) pAwaitEnd(farewell);
+    });
+    attempt([&] { mStream->close(); });
 }
 
 /// False when reading from the stream certainly waits.

@@ -8,6 +8,8 @@
 
 #include <algorithm>
 #include <cctype>
+#include <netinet/in.h>
+#include <netinet/tcp.h>
 #include <optional>
 #include <stdexcept>
 #include <sys/socket.h>
@@ -18,6 +20,7 @@ namespace qel::protocol {
 namespace {
 
 constexpr std::size_t kMaxHostLength = 255; // RFC 1123, 2.1
+constexpr int kMaxSegmentBytes = 16384;
 
 [[noreturn]] void refuse(const std::string& text, const char* reason)
 {
@@ -101,6 +104,9 @@ Socket connectTo(const ServerAddress& server, const std::vector<IPEndpoint>& end
         --attemptsLeft;
         try {
             Socket socket(endpoint.getFamily(), SOCK_STREAM | SOCK_CLOEXEC, 0);
+            // Over loopback a segment could be as long as the receive buffer of a SocketStream. TCP sends no part of
+            // it, so a server that has more to send than there is room for would wait until a timer of 200 ms.
+            socket.setSocketOption(IPPROTO_TCP, TCP_MAXSEG, kMaxSegmentBytes);
             socket.connect(endpoint, share);
             return socket;
         } catch (const PosixError& error) {

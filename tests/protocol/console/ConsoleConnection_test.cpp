@@ -10,7 +10,6 @@
 #include <qel/protocol/Error.hpp>
 
 #include "protocol/console/ConsoleFixture.hpp"
-#include "support/Allocations.hpp"
 #include "support/Errors.hpp"
 #include "support/SettableClock.hpp"
 
@@ -289,21 +288,6 @@ TEST_F(ConsoleEnd, AfterLeavingEveryCallFails)
     console.leave();
     EXPECT_THAT([&] { console.request(request); }, failsWith<Error>("this console has left"));
     EXPECT_THAT([&] { console.process(); }, failsWith<Error>("this console has left"));
-}
-
-TEST_F(ConsoleEnd, LeavingAndDestroyingNeedNoMemory)
-{
-    QEL_TEST_NEEDS_ALLOCATIONS();
-    auto pending = std::make_optional(console.start(request));
-    std::optional<Console> owned(std::move(console));
-    {
-        Allocations allocations;
-        allocations.failAll();
-        owned->leave();
-        pending.reset();
-        owned.reset();
-    }
-    console = FakeHypervisorEnd::makeConsole(end);
 }
 
 TEST_F(ConsoleEnd, AfterClosingEveryCallFails)

@@ -65,6 +65,7 @@ TEST_F(ConsoleHandlers, AHandlerThatStartsTheSameRequestAndThrowsLeavesItUnderWa
 {
     answerNothing();
     const auto first = console->start(QelMessageGetQelTodReq());
+    EXPECT_FALSE(console->process());
     std::optional<PendingResponse<QelMessageGetQelTodRsp>> inner;
     console->onNotice<Broadcast>([&](const auto&) {
         end->takeAgain();
@@ -73,7 +74,7 @@ TEST_F(ConsoleHandlers, AHandlerThatStartsTheSameRequestAndThrowsLeavesItUnderWa
     });
     end->stopTaking();
     end->push(broadcast());
-    EXPECT_THAT([&] { console->start(request); }, ThrowsMessage<std::out_of_range>(StrEq("mine")));
+    EXPECT_THAT([&] { console->exchange(request); }, ThrowsMessage<std::out_of_range>(StrEq("mine")));
     ASSERT_TRUE(inner);
     end->push(QelMessageGetQelTodRsp(request.getCallerId(), std::time_t{5}));
     EXPECT_EQ(timeOf(*inner->get(milliseconds(5))), 5);

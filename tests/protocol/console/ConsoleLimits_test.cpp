@@ -8,6 +8,7 @@
 
 #include "console/FrameLink.hpp"
 #include "protocol/console/FakeHypervisorEnd.hpp"
+#include "support/Allocations.hpp"
 #include "support/CapturedLog.hpp"
 #include "support/Errors.hpp"
 #include "support/SettableClock.hpp"
@@ -18,6 +19,7 @@
 #include <functional>
 #include <gmock/gmock.h>
 #include <memory>
+#include <optional>
 #include <stdexcept>
 #include <string>
 #include <utility>
@@ -185,6 +187,21 @@ TEST_F(ConsoleLimits, TakingLeaveHasADeadline)
         link.leave(deadlineIn(row.limit));
         EXPECT_THAT(stream.readDeadlines, ElementsAre(row.wait));
     }
+}
+
+TEST_F(ConsoleLimits, LeavingAndDestroyingNeedNoMemory)
+{
+    QEL_TEST_NEEDS_ALLOCATIONS();
+    auto pending = std::make_optional(console.start(QelMessageGetQelTodReq()));
+    std::optional<Console> owned(std::move(console));
+    {
+        Allocations allocations;
+        allocations.failAll();
+        owned->leave();
+        pending.reset();
+        owned.reset();
+    }
+    console = FakeHypervisorEnd::makeConsole(end);
 }
 
 /// A stream without a descriptor that knows what it can do. Notes the steps of taking leave.

@@ -208,6 +208,8 @@ TEST_F(ConsoleRequests, ResponsesFindTheirRequestsInAnyOrder)
     auto time = console.start(request);
     auto mode = console.start(QelMessageGetGlobalModeAttributeReq());
     auto metadata = console.start(QelMessageGetGlobalSaveAreaMetadataReq());
+    EXPECT_FALSE(console.process());
+    EXPECT_EQ(end->writes, 1U) << "they go out together";
     ASSERT_EQ(end->received.size(), 3U);
     EXPECT_FALSE(time.isReady());
     end->push(QelMessageGetGlobalSaveAreaMetadataRsp(end->received[2]->getCallerId(), "third"));
@@ -289,6 +291,7 @@ TEST_F(ConsoleRequests, AssigningToAPendingResponseAbandonsItsRequest)
     answerNothing();
     auto pending = console.start(request);
     pending = console.start(QelMessageGetQelTodReq());
+    EXPECT_FALSE(console.process());
     end->push(QelMessageGetQelTodRsp(end->received[0]->getCallerId(), std::time_t{1}));
     end->push(QelMessageGetQelTodRsp(end->received[1]->getCallerId(), std::time_t{2}));
     EXPECT_EQ(timeOf(*pending.get()), 2);

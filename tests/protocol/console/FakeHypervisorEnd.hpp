@@ -3,6 +3,7 @@
 #include <qel/common/QelMessageGeneric.hpp>
 #include <qel/common/QelMessageInterfaceComponent.hpp>
 #include <qel/common/QelMessageRegistry.hpp>
+#include <qel/common/io/QelMessageStream.hpp>
 #include <qel/common/io/Stream.hpp>
 #include <qel/common/io/StreamIOException.hpp>
 #include <qel/protocol/Console.hpp>
@@ -11,6 +12,7 @@
 #include <array>
 #include <cerrno>
 #include <chrono>
+#include <cstring>
 #include <fcntl.h>
 #include <functional>
 #include <memory>
@@ -106,6 +108,7 @@ public:
 
     /// All messages that came, in order.
     std::vector<std::unique_ptr<QelMessage>> received;
+    unsigned int writes = 0; ///< each of one or more whole messages
     std::vector<Milliseconds> readDeadlines;
     std::vector<Milliseconds> writeDeadlines;
 
@@ -124,8 +127,17 @@ public:
     void write(const char* buffer, std::size_t length) override
     {
         if (mWriteFailure) mWriteFailure();
-        received.push_back(mRegistry.deserialize(buffer, static_cast<unsigned int>(length)));
-        onMessage(*received.back());
+        ++writes;
+        while (length > 0) {
+            QelMessageStream::MessageHeader header;
+            std::memcpy(&header, buffer, sizeof(header));
+            const unsigned int frame = header.mMsgLength;
+            if (frame > length) throw std::runtime_error("a part of a frame");
+            received.push_back(mRegistry.deserialize(buffer, frame));
+            buffer += frame;
+            length -= frame;
+            onMessage(*received.back());
+        }
     }
 
     /// A console over it, introduced, without TLS.
@@ -153,6 +165,7 @@ public:
     void forget()
     {
         received.clear();
+        writes = 0;
         readDeadlines.clear();
         writeDeadlines.clear();
     }

@@ -9,8 +9,11 @@
 #include <cerrno>
 #include <future>
 #include <gmock/gmock.h>
+#include <netinet/in.h>
+#include <netinet/tcp.h>
 #include <pthread.h>
 #include <stdexcept>
+#include <sys/socket.h>
 #include <system_error>
 
 namespace qel::test {
@@ -206,6 +209,19 @@ TEST(ConnectTo, TakesTheFirstAddressThatAccepts)
     const auto server = ServerAddress::parse("host:1");
     const Socket socket = connectTo(server, {refusing.get(), listener.getSocketName()}, soon());
     EXPECT_EQ(socket.getPeerName(), listener.getSocketName());
+}
+
+TEST(ConnectTo, ALongSegmentDoesNotFillAReceiveBuffer)
+{
+    // Over loopback segments have 64 KiB unless one end announces less; the peer never sends a longer one.
+    Socket listener = listenOn(IPEndpoint("127.0.0.1:0"), 1);
+    const Socket near = connectTo(ServerAddress::parse("h:1"), {listener.getSocketName()}, soon());
+    const Socket far = listener.accept();
+    int bytes = 0;
+    socklen_t length = sizeof(bytes);
+    ASSERT_EQ(::getsockopt(far.getFd(), IPPROTO_TCP, TCP_MAXSEG, &bytes, &length), 0);
+    EXPECT_LE(bytes, 16384);
+    EXPECT_GT(bytes, 16000) << "without the options of TCP";
 }
 
 TEST(ConnectTo, ReportsTheFailureOfTheLastAddressUnderTheNameOfTheServer)

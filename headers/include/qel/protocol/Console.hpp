@@ -39,7 +39,7 @@ namespace qel::protocol {
 /// to the console.
 ///
 /// **Waiting together with other descriptors.** First take what other calls have received:
-/// SerialSession::getAvailable() and PendingResponse::isReady(). Then wait until getPollFd() is readable, unless
+/// SerialSession::getAvailable() and PendingResponse::isReady(). Then wait until getPollFd() is ready, unless
 /// hasPending() is true, and call process().
 ///
 /// **Deadlines.** Every call that waits has a timeout; a negative one means no limit. A timeout that passes throws
@@ -65,9 +65,9 @@ namespace qel::protocol {
 /// SerialSession::close() does not.
 ///
 /// Lifetime: sessions and pending responses may outlive the console; they fail then. Movable, not copyable; a
-/// moved-from console can only be destroyed or assigned to. The destructor closes the connection at once: call leave()
-/// before it. Thread safety: one thread, except close(). Looking up a host name uses a thread of its own, see
-/// resolve().
+/// moved-from console can only be destroyed or assigned to. The destructor closes the connection at once, and drops
+/// requests that are still gathered: call leave() before it. Thread safety: one thread, except close(). Looking up a
+/// host name uses a thread of its own, see resolve().
 class QEL_PROTOCOL_EXPORT Console {
 public:
     /// Receives a notice. Borrows the message for the call.
@@ -154,8 +154,13 @@ public:
         return readResponse<ResponseTo<Request>>(pRequest(message, timeout), server);
     }
 
-    /// Sends a request and returns. While the server takes nothing and other requests are under way, receives messages,
-    /// so that neither side blocks the other.
+    /// Begins a request and returns. Short requests are gathered, up to 8 KiB, and go out in one write: as soon as this
+    /// console sends anything else, or before it waits in any call, be it for another message. A program that waits by
+    /// itself calls process() first; hasPending() reminds it. While the server takes nothing and other requests are
+    /// under way, receives messages, so that neither side blocks the other.
+    ///
+    /// When gathered requests cannot be sent, the call that sends them throws, and so does their
+    /// PendingResponse::get().
     template <typename Request>
     PendingResponse<ResponseTo<Request>> start(const Request& message)
     {
@@ -215,15 +220,20 @@ public:
     // Waiting.
 
     /// For waiting on this console together with other descriptors.
-    /// @return PollFd::Ignore for a stream without a descriptor. Valid until reconnect().
+    /// @return PollFd::Ignore for a stream without a descriptor. Valid until the next call of this console: it waits
+    /// for
+    ///         room to send too, while the server does not take gathered requests
     PollFd getPollFd(PollEvents events) const;
 
-    /// True when process() may have bytes to read although the descriptor is not readable: they were read for TLS.
+    /// True when process() has something to do although the descriptor is not readable: bytes have been read ahead, or
+    /// requests have been gathered.
     bool hasPending() const;
 
-    /// Receives and handles one message.
+    /// Sends the requests that were gathered, if the server takes them; receives and handles one message.
     /// @param timeout  how long to wait for it to begin; 0: it must have begun. It then has the frame timeout
-    /// @return false: none began in this time
+    /// @return false: none began in this time. Over TLS that may be so although the descriptor was readable: a part of
+    /// a
+    ///         record, or one without data, is no message
     bool process(std::chrono::milliseconds timeout = std::chrono::milliseconds(0));
 
     // The end.

@@ -38,7 +38,7 @@ private:
 
 } // namespace detail
 
-/// The response to a request that Console::start() has sent.
+/// The response to a request that Console::start() has begun.
 ///
 /// Destroying it before the response has arrived abandons the request: the response is dropped when it comes.
 /// Lifetime: may outlive its console, whose end is then reported by get(). Thread safety: the thread of the console.

@@ -51,7 +51,8 @@ QEL_PROTOCOL_EXPORT std::vector<IPEndpoint> resolve(const ServerAddress& server,
 /// Connects over TCP to the first of the endpoints that accepts. Each attempt gets an equal share of the time that is
 /// left, so that one silent address does not use up the time of the others.
 /// @param endpoints  at least one
-/// @return a blocking, close-on-exec socket
+/// @return a blocking, close-on-exec socket, which announces segments of at most 16 KiB: with the 64 KiB of loopback a
+///         peer would wait for a timer when the receive buffer of a SocketStream has less room than that
 /// @throws CannotConnect  none accepted in time: "cannot connect to SERVER: " and the reason of the last attempt, which
 ///         is nested
 /// Thread safety: any thread.
