@@ -16,11 +16,9 @@ Hypervisor::~Hypervisor() = default;
 void Hypervisor::addPartition(std::uint16_t id, std::unique_ptr<SerialLine> line, PartitionOptions options)
 {
     if (mImpl->served) throw std::logic_error("a server serves this hypervisor");
-    if (line == nullptr) throw std::invalid_argument("line");
-    if (options.replayBytes > PartitionOptions::kMaxReplayBytes) throw std::invalid_argument("replayBytes");
-    if (!mImpl->partitions.emplace(id, PartitionPlan{std::move(line), std::move(options)}).second) {
-        throw std::invalid_argument("partition");
-    }
+    PartitionPlan plan{std::move(line), std::move(options)};
+    checkPartition(plan);
+    if (!mImpl->partitions.emplace(id, std::move(plan)).second) throw std::invalid_argument("partition");
 }
 
 QelMessageStatusCodes Hypervisor::mayRequest(const Peer&, const QelMessage&) { return QelMessageStatusNoError; }

@@ -97,7 +97,7 @@ Received HypervisorEngine::receive(ConsoleId id, const QelMessage& message)
         logLine(LogLevel::Warn, "console ", id, ": ignored ", message.getLogID());
         break;
     }
-    if (mPartitions.takeChanged()) mWakeSerial();
+    pWakeIfChanged();
     return {console.state, pMayReceive(console)};
 }
 
@@ -198,6 +198,74 @@ void HypervisorEngine::pTellTaps()
             call.tap->onEvent(call.partition, call.text);
         }
     }
+}
+
+void HypervisorEngine::addPartition(std::uint16_t id, std::unique_ptr<SerialLine> line, PartitionOptions options)
+{
+    PartitionPlan plan{std::move(line), std::move(options)};
+    checkPartition(plan);
+    const MutexLock lock(mMutex);
+    if (mShutDown) throw std::logic_error("the server has finished");
+    auto& plans = mMachine.mImpl->partitions;
+    const auto added = plans.emplace(id, std::move(plan));
+    if (!added.second) throw std::invalid_argument("partition");
+    try {
+        mPartitions.add(id, *added.first->second.line, added.first->second.options);
+    } catch (...) {
+        plans.erase(added.first);
+        throw;
+    }
+    logLine(LogLevel::Info, "partition ", id, ": added");
+    pWakeIfChanged();
+}
+
+bool HypervisorEngine::changePartition(std::uint16_t id, const PartitionOptions& options)
+{
+    if (options.replayBytes > PartitionOptions::kMaxReplayBytes) throw std::invalid_argument("replayBytes");
+    const MutexLock lock(mMutex);
+    const bool isThere = mPartitions.change(id, options);
+    pWakeIfChanged();
+    return isThere;
+}
+
+bool HypervisorEngine::removePartition(std::uint16_t id)
+{
+    decltype(mMachine.mImpl->partitions)::node_type plan; // destroyed without the lock: its command may take its time
+    const DeferredWakeUps wakeUps;
+    const MutexLock lock(mMutex);
+    if (!mPartitions.remove(id)) return false;
+    plan = mMachine.mImpl->partitions.extract(id);
+    logLine(LogLevel::Info, "partition ", id, ": removed");
+    pWakeIfChanged();
+    return true;
+}
+
+std::vector<PartitionState> HypervisorEngine::partitions() const
+{
+    const MutexLock lock(mMutex);
+    return mPartitions.states();
+}
+
+bool HypervisorEngine::closeSession(std::uint16_t partition, std::uint16_t number)
+{
+    const DeferredWakeUps wakeUps;
+    const MutexLock lock(mMutex);
+    const bool wasOpen = mPartitions.endSession(partition, number);
+    pWakeIfChanged();
+    return wasOpen;
+}
+
+bool HypervisorEngine::sendBreak(std::uint16_t partition)
+{
+    const MutexLock lock(mMutex);
+    const bool sent = mPartitions.sendBreak(partition);
+    pWakeIfChanged();
+    return sent;
+}
+
+void HypervisorEngine::pWakeIfChanged()
+{
+    if (mPartitions.takeChanged()) mWakeSerial();
 }
 
 template <typename T, HypervisorEngine::Handler<T> kHandler>

@@ -89,6 +89,15 @@ public:
     /// @return when to call it again at the latest: from now; negative: when serialWatches() have changed
     std::chrono::milliseconds serviceLines();
 
+    // Partitions, while consoles are served: see Server.
+
+    void addPartition(std::uint16_t id, std::unique_ptr<SerialLine> line, PartitionOptions options);
+    bool changePartition(std::uint16_t id, const PartitionOptions& options);
+    bool removePartition(std::uint16_t id);
+    std::vector<PartitionState> partitions() const;
+    bool closeSession(std::uint16_t partition, std::uint16_t number);
+    bool sendBreak(std::uint16_t partition);
+
 private:
     using Reply = std::unique_ptr<QelMessage>;
     /// The identity of a request: function and operation.
@@ -122,6 +131,7 @@ private:
     QelMessageStatusCodes pMayReach(const ConsoleEntry& console, std::uint16_t partition, std::uint16_t number)
         QEL_REQUIRES(mMutex);
     void pTellTaps();
+    void pWakeIfChanged() QEL_REQUIRES(mMutex);
 
     // One operation for each request; they return the response.
     Reply pVersion(ConsoleEntry&, const QelMessageGetEnclTypeAndInterfaceVersionReq&) QEL_REQUIRES(mMutex);

@@ -44,6 +44,20 @@ Partition::~Partition()
     if (mState != State::Down) mLine.stop();
 }
 
+PartitionState Partition::state() const
+{
+    return {mId,
+            mOptions.name,
+            mOptions.description,
+            mState,
+            mSessions.states(),
+            mOutputBytes,
+            mInputBytes,
+            mStarts,
+            static_cast<std::size_t>(mOutput.end() - mOutput.begin()),
+            mInput.size()};
+}
+
 QelMessageStatusCodes Partition::open(ConsoleEntry& console, std::uint16_t number, bool force)
 {
     if (mSessions.has(number) && !force) return QelMessageStatusConnectionNotAvailable;
@@ -98,6 +112,14 @@ bool Partition::mayAddInput(const ConsoleEntry& console) const
 {
     return mInput.size() < kInputLimit || !mSessions.isOf(PartitionSessions::kTyping, console) ||
            !mSessions.isSetUp(PartitionSessions::kTyping);
+}
+
+bool Partition::endSession(std::uint16_t number)
+{
+    if (!mSessions.has(number)) return false;
+    mSessions.end(number, CloseReason::CloseReasonForceClose);
+    mEvents.changed = true;
+    return true;
 }
 
 bool Partition::sendBreak()
@@ -223,6 +245,7 @@ void Partition::pOnUp()
     mState = State::Up;
     mEvents.changed = true;
     mUpSince = TimeProvider::steady();
+    ++mStarts;
     if (!std::exchange(mIsLost, false)) return;
     logLine(LogLevel::Info, "partition ", mId, ": line is back");
     pNote("line is back");
@@ -326,6 +349,7 @@ void Partition::pPumpInput()
         if (!taken) return mOptions.keepsSession ? pLoseLine() : pTakeDown(CloseReason::CloseReasonWriteFailure, {});
         if (*taken == 0) break;
         mInput.erase(0, *taken);
+        mInputBytes += *taken;
     }
     if (wasFull && mInput.size() < kInputLimit) mSessions.resumeTyping();
 }
@@ -350,6 +374,7 @@ bool Partition::pReadOutput()
         break;
     }
     mOutput.append(buffer.data(), result.length);
+    mOutputBytes += result.length;
     if (mOptions.tap != nullptr) {
         tapped.assign(buffer.data(), result.length);
         mEvents.tapCalls.push_back({mOptions.tap, mId, true, std::move(tapped)});

@@ -5,6 +5,7 @@
 #include <qel/common/util/Poll.hpp>
 #include <qel/protocol/CommandEnd.hpp>
 #include <qel/protocol/PartitionOptions.hpp>
+#include <qel/protocol/PartitionState.hpp>
 
 #include "hypervisor/ConsoleEntry.hpp"
 #include "hypervisor/GuardedLine.hpp"
@@ -55,6 +56,8 @@ public:
 
     bool isHeldBy(const ConsoleEntry& console, std::uint16_t number) const { return mSessions.isOf(number, console); }
 
+    PartitionState state() const;
+
     // Requests and input of consoles: see PartitionSet.
 
     QelMessageStatusCodes open(ConsoleEntry& console, std::uint16_t number, bool force);
@@ -63,6 +66,9 @@ public:
     bool feed(const ConsoleEntry& console, std::uint16_t number, const char* data, std::size_t length);
     void release(const ConsoleEntry& console);
     bool mayAddInput(const ConsoleEntry& console) const;
+
+    /// Ends a session with a notice, for an operator. @return false: it is free
+    bool endSession(std::uint16_t number);
 
     /// Sends a break. @return false: the line is not up, has no break, or could not send it
     bool sendBreak();
@@ -92,12 +98,7 @@ public:
     void serviceTime(TimePoint now);
 
 private:
-    enum class State {
-        Down,
-        ComingUp,
-        Up,
-        Ended ///< the output has been read; the command may still run, and sessions may still have to get output
-    };
+    using State = PartitionState::Line;
 
     bool pBringUp(bool mayRestart);
     bool pStart(TimePoint now);
@@ -125,6 +126,10 @@ private:
     OutputHistory mOutput;
     PartitionSessions mSessions;
     std::string mInput; ///< from consoles, not yet taken by the line
+
+    std::uint64_t mOutputBytes = 0;
+    std::uint64_t mInputBytes = 0;
+    std::uint64_t mStarts = 0;
 
     State mState = State::Down;
     bool mIsRetired = false;

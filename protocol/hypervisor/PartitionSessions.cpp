@@ -113,6 +113,15 @@ void PartitionSessions::resumeTyping()
     if (found != mSessions.end()) found->second.console->link.resumeReading();
 }
 
+std::vector<SessionState> PartitionSessions::states() const
+{
+    std::vector<SessionState> states;
+    states.reserve(mSessions.size());
+    for (const auto& entry : mSessions)
+        states.push_back({entry.first, entry.second.console->peer.id, entry.second.isSetUp});
+    return states;
+}
+
 void PartitionSessions::deliver()
 {
     for (auto& entry : mSessions)

@@ -2,6 +2,7 @@
 
 #include <qel/common/QelMessageVirtualSerial.hpp>
 #include <qel/protocol/CommandEnd.hpp>
+#include <qel/protocol/PartitionState.hpp>
 
 #include "hypervisor/ConsoleEntry.hpp"
 #include "hypervisor/OutputHistory.hpp"
@@ -11,6 +12,7 @@
 #include <map>
 #include <memory>
 #include <string>
+#include <vector>
 
 namespace qel::protocol {
 
@@ -69,6 +71,9 @@ public:
 
     /// Tells the console on number 0 that it may be read again.
     void resumeTyping();
+
+    /// The sessions that are open, by number.
+    std::vector<SessionState> states() const;
 
     /// Sends what there is room for, a bounded part at a time.
     void deliver();

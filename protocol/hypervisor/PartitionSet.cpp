@@ -12,6 +12,43 @@ void PartitionSet::add(std::uint16_t id, SerialLine& line, const PartitionOption
     mEvents.changed = true;
 }
 
+bool PartitionSet::remove(std::uint16_t id)
+{
+    const auto found = mPartitions.find(id);
+    if (found == mPartitions.end()) return false;
+    found->second.remove();
+    mPartitions.erase(found);
+    return true;
+}
+
+bool PartitionSet::change(std::uint16_t id, const PartitionOptions& options)
+{
+    Partition* const partition = pFind(id);
+    if (partition != nullptr) partition->change(options);
+    return partition != nullptr;
+}
+
+bool PartitionSet::endSession(std::uint16_t id, std::uint16_t number)
+{
+    Partition* const partition = pFind(id);
+    return partition != nullptr && partition->endSession(number);
+}
+
+bool PartitionSet::sendBreak(std::uint16_t id)
+{
+    Partition* const partition = pFind(id);
+    return partition != nullptr && partition->sendBreak();
+}
+
+std::vector<PartitionState> PartitionSet::states() const
+{
+    std::vector<PartitionState> states;
+    states.reserve(mPartitions.size());
+    for (const auto& entry : mPartitions)
+        states.push_back(entry.second.state());
+    return states;
+}
+
 bool PartitionSet::isHeldBy(const ConsoleEntry& console, std::uint16_t id, std::uint16_t number) const
 {
     const auto found = mPartitions.find(id);

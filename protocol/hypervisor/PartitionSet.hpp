@@ -36,6 +36,22 @@ public:
     /// @param line  borrowed
     void add(std::uint16_t id, SerialLine& line, const PartitionOptions& options);
 
+    /// Ends the sessions of a partition with a notice, takes its line down and forgets both.
+    /// @return false: there is no such partition
+    bool remove(std::uint16_t id);
+
+    /// Changes how a partition is served: see Partition::change(). @return false: there is no such partition
+    bool change(std::uint16_t id, const PartitionOptions& options);
+
+    /// Ends a session with a notice. @return false: there is none
+    bool endSession(std::uint16_t id, std::uint16_t number);
+
+    /// Sends a break on a partition's line. @return false: see Partition::sendBreak(); or there is no such partition
+    bool sendBreak(std::uint16_t id);
+
+    /// What all partitions do, by id.
+    std::vector<PartitionState> states() const;
+
     std::size_t size() const noexcept { return mPartitions.size(); }
 
     /// Whether the partition exists.

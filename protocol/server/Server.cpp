@@ -67,6 +67,7 @@ struct Server::Impl {
     void serve(ServedStream stream, HandshakePlaces::Place place);
     void setCredentials(const Credentials& credentials);
     void dumpStatistics(std::ostream& os);
+    HypervisorEngine& engine() noexcept { return mEngine; }
     void finish() noexcept;
 
 private:
@@ -296,6 +297,27 @@ void Server::serve(std::unique_ptr<Stream> stream, const std::string& address)
 }
 
 void Server::setCredentials(const Credentials& credentials) { mImpl->setCredentials(credentials); }
+
+void Server::addPartition(std::uint16_t id, std::unique_ptr<SerialLine> line, PartitionOptions options)
+{
+    mImpl->engine().addPartition(id, std::move(line), std::move(options));
+}
+
+bool Server::changePartition(std::uint16_t id, const PartitionOptions& options)
+{
+    return mImpl->engine().changePartition(id, options);
+}
+
+bool Server::removePartition(std::uint16_t id) { return mImpl->engine().removePartition(id); }
+
+std::vector<PartitionState> Server::partitions() const { return mImpl->engine().partitions(); }
+
+bool Server::closeSession(std::uint16_t partition, std::uint16_t number)
+{
+    return mImpl->engine().closeSession(partition, number);
+}
+
+bool Server::sendBreak(std::uint16_t partition) { return mImpl->engine().sendBreak(partition); }
 
 void Server::dumpStatistics(std::ostream& os) { mImpl->dumpStatistics(os); }
 

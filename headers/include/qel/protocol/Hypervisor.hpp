@@ -56,7 +56,7 @@ public:
     /// @param line  not null; started when a console opens the partition's session, or as the options say
     /// @throws std::invalid_argument  "partition": the id is taken; "line": null; "replayBytes": above
     ///         PartitionOptions::kMaxReplayBytes
-    /// @throws std::logic_error  a server serves this object
+    /// @throws std::logic_error  a server serves this object: use Server::addPartition()
     void addPartition(std::uint16_t id, std::unique_ptr<SerialLine> line, PartitionOptions options = {});
 
     // Decisions.

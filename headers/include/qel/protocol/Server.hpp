@@ -5,6 +5,7 @@
 #include <qel/common/util/Poll.hpp>
 #include <qel/protocol/Credentials.hpp>
 #include <qel/protocol/Hypervisor.hpp>
+#include <qel/protocol/PartitionState.hpp>
 #include <qel/protocol/ProtocolExport.hpp>
 #include <qel/protocol/ServerOptions.hpp>
 
@@ -39,7 +40,8 @@ namespace qel::protocol {
 /// Sockets cause no SIGPIPE.
 ///
 /// Lifetime: borrows the hypervisor, which must outlive this object. Thread safety: one thread owns it (constructor,
-/// run(), dumpStatistics(), finish(), destructor); endpoints(), setCredentials() and serve() from any thread.
+/// run(), dumpStatistics(), finish(), destructor); endpoints(), setCredentials(), serve() and the operations on
+/// partitions from any thread.
 class QEL_PROTOCOL_EXPORT Server {
 public:
     /// Listens. Connections are accepted in run(); until then they wait.
@@ -82,6 +84,39 @@ public:
     /// @throws std::logic_error  connections are plain
     /// @throws SSLException  OpenSSL cannot use them; nothing has changed
     void setCredentials(const Credentials& credentials);
+
+    // The partitions, while consoles are served. These may be called from any thread, but not by an operation of the
+    // hypervisor, a line or a tap.
+
+    /// Adds a partition. Consoles can open it from now on; the hypervisor object owns the line.
+    /// @throws std::invalid_argument  as Hypervisor::addPartition() does
+    /// @throws std::logic_error  after finish()
+    void addPartition(std::uint16_t id, std::unique_ptr<SerialLine> line, PartitionOptions options = {});
+
+    /// Changes how a partition is served. Its line and its sessions go on; `keepsSession` stays as it was. A change of
+    /// `start` means nothing any more, one of `restart` counts from the next end of the command on.
+    /// @return false: there is no such partition
+    /// @throws std::invalid_argument  "replayBytes"
+    bool changePartition(std::uint16_t id, const PartitionOptions& options);
+
+    /// Removes a partition: its consoles read "[qel: the partition has been removed]" as far as they have room, their
+    /// sessions end with reason 3 (shutdown), and the line is taken down and destroyed. That of a command waits until
+    /// the command has ended, if it is the last one.
+    /// @return false: there is no such partition
+    bool removePartition(std::uint16_t id);
+
+    /// What the partitions do at this moment, by id.
+    std::vector<PartitionState> partitions() const;
+
+    /// Ends a console's session as a forced close by another console does: with reason 2.
+    /// @param number  connection number
+    /// @return false: the session is free, or there is no such partition
+    bool closeSession(std::uint16_t partition, std::uint16_t number);
+
+    /// Sends a break on a partition's line.
+    /// @return false: the line has no break, is not up or could not send it, which is logged; or there is no such
+    ///         partition
+    bool sendBreak(std::uint16_t partition);
 
     /// Prints the statistics of each console's queue, in the order of connecting. docs/connection.md explains them.
     void dumpStatistics(std::ostream& os);
