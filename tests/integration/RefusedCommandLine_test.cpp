@@ -118,6 +118,8 @@ TEST(RefusedCommandLine, NamesTheOptionOfServeThatIsOutOfRange)
             {{"--queue-limit", "1073741825"}, "--queue-limit: \"1073741825\" is not an integer in [1, 1073741824]"},
             {{"--queue-limit", "x"}, "--queue-limit: \"x\" is not an integer in [1, 1073741824]"},
             {{"--replay", "16777217"}, "--replay: \"16777217\" is not an integer in [0, 16777216]"},
+            {{"--line-log", "/dev/null"}, "--line-log: \"/dev/null\" is not a directory"},
+            {{"--line-log-size", "4095"}, "--line-log-size: \"4095\" is not an integer in [4096, 1099511627776]"},
             {{"--when-unattended", "drop"}, "--when-unattended: \"drop\" is not keep or wait"},
             {{"--start", "now"}, "--start: \"now\" is not open or boot"},
             {{"--restart", "yes"}, "--restart: \"yes\" is not never, failure or always"},

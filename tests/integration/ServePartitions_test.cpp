@@ -5,6 +5,7 @@
 #include "support/TemporaryDirectory.hpp"
 
 #include <algorithm>
+#include <csignal>
 #include <filesystem>
 #include <fstream>
 #include <gmock/gmock.h>
@@ -91,6 +92,34 @@ TEST(ServePartitions, RestartFailureStartsAFailedCommandAgainUntilItSucceeds)
     server.process().awaitErrors("partition 1: the command exited with status 0");
     EXPECT_EQ(contentsOf(file), "run\nrun\n");
     server.stop();
+}
+
+TEST(ServePartitions, LineLogHasTheBytesAndTheLinesOfEachPartition)
+{
+    const TemporaryDirectory directory;
+    ServeProcess server({"--start", "boot", "--line-log", directory.path(), "--partition",
+                         "1=stty -onlcr; printf '\\033[1mhello\\033[m\\n'; exit 3", "--partition", "2=cat"});
+    const auto text = [&] { return contentsOf(directory.file("partition-1.log")); };
+    ASSERT_TRUE(comesTrue([&] { return text().find("exited with status 3]\n") != std::string::npos; }));
+    EXPECT_EQ(contentsOf(directory.file("partition-1.raw")), "\x1B[1mhello\x1B[m\n");
+    const std::string time = "2[0-9]{3}-[0-9]{2}-[0-9]{2}T[0-9]{2}:[0-9]{2}:[0-9]{2}\\.[0-9]{3}Z ";
+    EXPECT_THAT(text(), ::testing::MatchesRegex(time + "\\[qel: the log begins]\n" + time + "hello\n" + time +
+                                                "\\[qel: the command exited with status 3]\n"));
+    server.process().signal(SIGHUP);
+    ASSERT_TRUE(comesTrue([&] { return text().empty(); }));
+    EXPECT_EQ(contentsOf(directory.file("partition-1.raw.1")), "\x1B[1mhello\x1B[m\n");
+    server.stop();
+    EXPECT_THAT(text(), ::testing::MatchesRegex(time + "\\[qel: the log ends]\n"));
+}
+
+TEST(ServePartitions, ALineLogThatCannotBeWrittenEndsTheStart)
+{
+    const TemporaryDirectory directory;
+    std::filesystem::create_directory(directory.file("partition-1.raw"));
+    const auto result = runQel({"serve", "--plain", "--line-log", directory.path(), "--partition", "1=cat"});
+    EXPECT_EQ(result.exitStatus, 4);
+    EXPECT_THAT(result.errors, ::testing::HasSubstr("qel: cannot write the line log " +
+                                                    directory.file("partition-1.raw") + ": 21 (Is a directory)\n"));
 }
 
 // What sessions and partitions cost.

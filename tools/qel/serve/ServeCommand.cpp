@@ -7,6 +7,7 @@
 #include "base/Library.hpp"
 #include "base/Logging.hpp"
 #include "base/SignalWatch.hpp"
+#include "lines/LineLogs.hpp"
 #include "lines/LineText.hpp"
 #include "serve/ServeMachine.hpp"
 #include "serve/ServePlan.hpp"
@@ -27,13 +28,14 @@ namespace {
 
 constexpr std::initializer_list<int> kSignals{SIGTERM, SIGINT, SIGHUP, SIGUSR1};
 
-void addPartitions(Hypervisor& machine, const ServePlan& plan)
+void addPartitions(Hypervisor& machine, const ServePlan& plan, LineLogs& logs)
 {
     for (const auto& entry : plan.partitions) {
         const PlannedPartition& partition = entry.second;
         MadeLine made = makeLine(partition.line, {plan.term, {}});
         PartitionOptions options = partition.options;
         options.keepsSession = made.options.keepsSession;
+        options.tap = logs.open(entry.first, options.name);
         machine.addPartition(entry.first, std::move(made.line), options);
     }
 }
@@ -78,13 +80,14 @@ void logStatistics(Server& server)
 }
 
 /// @return the signal that ended it
-int serveUntilStopped(Server& server, SignalWatch& signals, const TransportOptions& transport)
+int serveUntilStopped(Server& server, SignalWatch& signals, const TransportOptions& transport, LineLogs& logs)
 {
     for (;;) {
         server.run(signals.getPollFd());
         const int signal = signals.take();
         if (signal == SIGHUP) {
             reload(server, transport);
+            logs.rotate();
         } else if (signal == SIGUSR1) {
             logStatistics(server);
         } else if (signal != 0) {
@@ -100,10 +103,11 @@ ExitStatus runServe(const ServePlan& plan)
     static_cast<void>(std::signal(SIGCHLD, SIG_DFL)); // ignored, as a parent may leave it, it hides how commands end
     SignalWatch signals(kSignals);
     ServeMachine machine(plan.machine, plan.capabilities, plan.rules, plan.maxPerCertificate);
-    addPartitions(machine, plan);
+    LineLogs logs(plan.lineLog);
+    addPartitions(machine, plan, logs);
     const auto server = makeServer(machine, plan);
     announce(*server);
-    const int signal = serveUntilStopped(*server, signals, plan.transport);
+    const int signal = serveUntilStopped(*server, signals, plan.transport, logs);
 
     logLine(LogLevel::Info, "stopping: signal ", signal);
     logStatistics(*server);

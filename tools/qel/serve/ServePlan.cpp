@@ -34,6 +34,7 @@ struct ServeInput::Options {
     std::vector<std::string> partitions; ///< "ID=LINE"
     std::string term = "vt220";
     PartitionChoices serving;
+    LineLogOptions lineLog;
     std::uint32_t maxConsoles = ServerOptions().maxConsoles;
     double frameSeconds = std::chrono::duration<double>(ServerOptions().frameTimeout).count();
     std::uint32_t keepAliveSeconds = static_cast<std::uint32_t>(ServerOptions().keepAlive.count());
@@ -240,6 +241,7 @@ ServeInput::ServeInput(CLI::App& command)
         ->check(CLI::Validator(checkTerm, ""))
         ->capture_default_str();
     addPartitionChoices(command, options.serving);
+    addLineLogOptions(command, options.lineLog);
     addLimitOptions(command, options);
     addIdentityOptions(command, options);
     addLogOptions(command, options.log);
@@ -291,6 +293,7 @@ ServePlan ServeInput::plan() const
         throw CLI::ValidationError("rules and access need certificates, and --plain has none");
     }
     plan.term = options.term;
+    plan.lineLog = options.lineLog;
     plan.machine = parseMachine(options);
     plan.capabilities = QelCapabilities(options.capabilities);
     plan.log = options.log;

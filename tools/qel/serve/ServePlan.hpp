@@ -7,6 +7,7 @@
 
 #include "base/Library.hpp"
 #include "base/Logging.hpp"
+#include "lines/LineLogs.hpp"
 #include "serve/AccessRules.hpp"
 #include "serve/OptionSources.hpp"
 #include "serve/ServeConfig.hpp"
@@ -35,6 +36,7 @@ struct ServePlan {
     AccessRules rules;
     std::size_t maxPerCertificate = 0; ///< consoles; 0: any number
     std::string term;
+    LineLogOptions lineLog;
     MachineInfo machine;
     QelCapabilities capabilities;
     TransportOptions transport;
