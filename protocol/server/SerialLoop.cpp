@@ -10,9 +10,6 @@ namespace qel::protocol {
 
 namespace {
 
-/// How often to look at commands whose line has ended, which end at any moment.
-constexpr std::chrono::milliseconds kExitInterval(5);
-
 /// The pause after a failure, before the next attempt.
 constexpr std::chrono::milliseconds kPauseAfterFailure(100);
 
