@@ -196,6 +196,28 @@ TEST(ConsoleReconnect, ThePersonCanLeaveWhileItConnects)
     EXPECT_TRUE(person.isTerminalUntouched());
 }
 
+// Watching.
+
+TEST_F(ConsoleScriptTest, AWatcherSeesWhatIsTypedAndCanTakeOver)
+{
+    PtyProcess holder(consoleTo(server.endpoint(), {"1"}));
+    holder.await("$ ");
+    PtyProcess watcher(consoleTo(server.endpoint(), {"1", "--watch"}));
+    watcher.await("connected to partition 1");
+    watcher.await("$ ");
+    holder.type("echo $((6 * 7))\r");
+    watcher.await("42\r\n");
+    watcher.type("\r~f");
+    watcher.await("qel: opening partition 1 again by force\r\n");
+    EXPECT_EQ(holder.wait().exitStatus, 1);
+    watcher.await("connected to partition 1");
+    watcher.type("echo $((7 * 7))\r");
+    watcher.await("49\r\n");
+    watcher.type("~.");
+    EXPECT_EQ(watcher.wait().exitStatus, 0);
+    EXPECT_TRUE(watcher.isTerminalUntouched());
+}
+
 // A server that lets people watch, played by the test.
 
 /// Answers the requests up to the open session; sessions with other numbers than `free` are held.

@@ -70,8 +70,7 @@ TEST(RefusedCommandLine, NamesTheEndpointThatServeCannotListenOn)
             {{"--listen", "localhost:0"},
              "--listen: \"localhost:0\" is not an endpoint such as 127.0.0.1:4711 or [::1]:4711: \"localhost\" is not "
              "an IP address (names are not looked up)"},
-            {{"--listen", "127.0.0.1"},
-             "--listen: \"127.0.0.1\" is not an endpoint such as 127.0.0.1:4711 or [::1]:4711: the port is missing"},
+            {{"--listen", "10.0.0.1"}, "--plain is refused for 10.0.0.1:4717: it is not a loopback address"},
             {{"--listen", "0.0.0.0:0"}, "--plain is refused for 0.0.0.0:0: it is not a loopback address"},
             {{"--listen", "10.0.0.1:0"}, "--plain is refused for 10.0.0.1:0: it is not a loopback address"},
             {{"--listen", "[::]:0"}, "--plain is refused for [::]:0: it is not a loopback address"},

@@ -6,6 +6,7 @@
 #include <gtest/gtest.h>
 #include <optional>
 #include <string>
+#include <utility>
 
 namespace qel::test {
 
@@ -26,6 +27,27 @@ TEST(OptionChecks, OtherAddressesAreNotLoopback)
     for (const char* endpoint : {"126.255.255.255:1", "128.0.0.1:1", "0.0.0.0:1", "10.0.0.1:1", "[::]:1", "[::2]:1",
                                  "[fe80::1]:1", "[1::1]:1", "[::ffff:10.0.0.1]:1", "[::7f00:1]:1"}) {
         EXPECT_FALSE(isLoopback(endpoint)) << endpoint;
+    }
+}
+
+TEST(OptionChecks, TheDefaultPortIsAddedWhereThereIsNone)
+{
+    const CLI::Validator addPort = tool::defaultPort();
+    const std::pair<const char*, const char*> rows[] = {{"127.0.0.1", "127.0.0.1:4717"},
+                                                        {"[::1]", "[::1]:4717"},
+                                                        {"host.example", "host.example:4717"},
+                                                        {"127.0.0.1:0", "127.0.0.1:0"},
+                                                        {"[::1]:1", "[::1]:1"},
+                                                        {"host:1", "host:1"},
+                                                        {"::1", "::1"},
+                                                        {"host:", "host:"},
+                                                        {"host:99999", "host:99999"},
+                                                        {"", ""},
+                                                        {"a b", "a b"}};
+    for (const auto& row : rows) {
+        std::string text = row.first;
+        EXPECT_EQ(addPort(text), "");
+        EXPECT_EQ(text, row.second);
     }
 }
 

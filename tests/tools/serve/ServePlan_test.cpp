@@ -162,8 +162,10 @@ TEST_F(ServePlanning, AFalseFlagIsAsIfItWereNotThere)
 TEST_F(ServePlanning, NamesTheLineAndTheColumnOfAWrongValue)
 {
     EXPECT_EQ(saidOf("plain = true\nmax-consoles = 0"), ":2:16: max-consoles: \"0\" is not an integer in [1, 255]");
-    EXPECT_EQ(saidOf("listen = ['127.0.0.1:1',\n 'x']"),
-              ":2:2: listen: \"x\" is not an endpoint such as 127.0.0.1:4711 or [::1]:4711: the port is missing");
+    EXPECT_EQ(
+        saidOf("listen = ['127.0.0.1:1',\n 'x']"),
+        ":2:2: listen: \"x:4717\" is not an endpoint such as 127.0.0.1:4711 or [::1]:4711: \"x\" is not an IP address "
+        "(names are not looked up)");
     EXPECT_EQ(saidOf("plain = 'yes'"), ":1:9: plain takes true or false, not a text");
     EXPECT_EQ(saidOf("name = ['a', 'b']"), ":1:8: name takes one value, not a list");
     EXPECT_EQ(saidOf("listen = [true]"), ":1:11: listen takes a text or a number, not true or false");

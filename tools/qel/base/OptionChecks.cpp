@@ -55,6 +55,23 @@ std::string checkEndpoint(std::string& text)
     return tool::quoted(text) + " is not an endpoint such as 127.0.0.1:4711 or [::1]:4711: " + endpointProblem(text);
 }
 
+bool isServer(const std::string& text)
+{
+    try {
+        static_cast<void>(ServerAddress::parse(text));
+        return true;
+    } catch (const std::invalid_argument&) {
+        return false;
+    }
+}
+
+std::string addDefaultPort(std::string& text)
+{
+    const std::string withPort = text + ":" + std::to_string(kDefaultPort);
+    if (!isServer(text) && !isEndpoint(text) && isServer(withPort)) text = withPort;
+    return {};
+}
+
 std::string checkServer(std::string& text)
 {
     try {
@@ -159,6 +176,8 @@ CLI::Validator textUpTo(std::size_t bytes)
 }
 
 CLI::Validator endpointValidator() { return CLI::Validator(checkEndpoint, ""); }
+
+CLI::Validator defaultPort() { return CLI::Validator(addDefaultPort, ""); }
 
 CLI::Validator serverValidator() { return CLI::Validator(checkServer, ""); }
 

@@ -39,6 +39,13 @@ CLI::Validator textUpTo(std::size_t bytes);
 /// Accepts an IP address and port: "127.0.0.1:4711", "[::1]:4711".
 CLI::Validator endpointValidator();
 
+/// The port of a server unless an option says otherwise. It is not assigned to a service.
+constexpr std::uint16_t kDefaultPort = 4717;
+
+/// Adds the default port to an address or a name that has none; leaves everything else to other checks. Use it with
+/// transform().
+CLI::Validator defaultPort();
+
 /// Accepts where a server can be reached, as ServerAddress::parse() does: "hypervisor.example:4711", "127.0.0.1:4711".
 CLI::Validator serverValidator();
 

@@ -39,9 +39,12 @@ std::chrono::milliseconds ConnectOptions::timeout() const
 
 void addConnectOptions(CLI::App& app, ConnectOptions& options)
 {
-    app.add_option("--connect", options.server, "Server to connect to: NAME:PORT, 127.0.0.1:PORT or [::1]:PORT")
+    app.add_option("--connect", options.server,
+                   "Server to connect to: NAME:PORT, 127.0.0.1:PORT or [::1]:PORT; port " +
+                       std::to_string(kDefaultPort) + " if there is none")
         ->required()
         ->type_name("SERVER")
+        ->transform(defaultPort())
         ->check(serverValidator());
     addTransportOptions(app, options.transport);
     app.add_option("--timeout", options.timeoutSeconds, "Timeout in seconds for connecting and all responses together")

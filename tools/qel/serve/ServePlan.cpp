@@ -226,6 +226,7 @@ ServeInput::ServeInput(CLI::App& command)
                     "Where to listen; port 0 lets the system choose one; may be repeated")
         ->type_name("ENDPOINT")
         ->allow_extra_args(false)
+        ->transform(defaultPort())
         ->check(endpointValidator())
         ->default_str(options.server.listen.front());
     addTransportOptions(command, options.transport);
