@@ -31,10 +31,10 @@
 /// OpenSSL directly. A program of its own, because it starts others. Nothing here passes or fails: the figures are for
 /// people.
 ///
-/// The two do not do the same work. A message of ours takes three frames through three threads one after the other: the
-/// sender's request, and the server's notice and response, which two writing threads take from the queues of two
-/// connections. One of the echo takes two records, to a thread that sends back what it gets. So three are held against
-/// two, and there is nothing that ours could be equal to; the ratio tells what the server adds to TLS.
+/// The two do not do the same work. A message of ours takes three frames: the sender's request, and the server's notice
+/// and response, which pass the queues of two connections. One of the echo takes two records, to a thread that sends
+/// back what it gets. So three are held against two, and there is nothing that ours could be equal to; the ratio tells
+/// what the server adds to TLS.
 ///
 /// A message of the echo has the bytes of the request's frame in both directions. Both are counted by the same loop:
 /// one message at a time, each from its sending to the end of its last frame or record.
