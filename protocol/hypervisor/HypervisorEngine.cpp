@@ -111,7 +111,7 @@ bool HypervisorEngine::mayReceive(ConsoleId id) const
 bool HypervisorEngine::takesConsoles() const
 {
     const MutexLock lock(mMutex);
-    return !mShutDown && pCountIdentified() < mMaxConsoles;
+    return !mShutDown && mIdentified.size() < mMaxConsoles;
 }
 
 void HypervisorEngine::disconnect(ConsoleId id)
@@ -125,6 +125,7 @@ void HypervisorEngine::disconnect(ConsoleId id)
     if (console.announced) {
         static_cast<void>(runGuarded([&] { mMachine.onDisconnected(console.peer); }, "console ", id));
     }
+    pForgetIdentified(console);
     mConsoles.erase(found);
     logLine(LogLevel::Info, "console ", id, " disconnected");
     mWakeSerial();
@@ -393,14 +394,15 @@ HypervisorEngine::Reply HypervisorEngine::pServe(ConsoleEntry& console, const Qe
 HypervisorEngine::Reply HypervisorEngine::pVersion(ConsoleEntry& console,
                                                    const QelMessageGetEnclTypeAndInterfaceVersionReq& request)
 {
-    if (pFindIdentified(request.getToolType(), request.getToolId()) != nullptr) {
+    if (pFindIdentified({request.getToolType(), request.getToolId()}) != nullptr) {
         return bareResponse(request, QelMessageStatusDaxAlreadyConnected);
     }
-    if (pCountIdentified() >= mMaxConsoles) return bareResponse(request, QelMessageStatusTooManyConnections);
+    if (mIdentified.size() >= mMaxConsoles) return bareResponse(request, QelMessageStatusTooManyConnections);
     const MachineInfo machine = mMachine.machine();
     auto response = std::make_unique<QelMessageGetEnclTypeAndInterfaceVersionRsp>(
         request.getCallerId(), machine.interfaceFamily, machine.majorVersion, machine.minorVersion, machine.machineType,
         machine.serialNumber);
+    mIdentified.emplace(ToolName(request.getToolType(), request.getToolId()), &console);
     console.state = ConsoleState::Identified;
     return response;
 }
@@ -444,7 +446,7 @@ HypervisorEngine::Reply HypervisorEngine::pBroadcast(ConsoleEntry& console, cons
 {
     if (request.getBroadcastMsgLen() > kMaxBroadcast) return bareResponse(request, QelMessageStatusInvalidData);
     if (request.getBroadcastMode() == kUnicast) {
-        ConsoleEntry* const addressee = pFindIdentified(request.getToolType(), request.getToolId());
+        ConsoleEntry* const addressee = pFindIdentified({request.getToolType(), request.getToolId()});
         if (addressee == nullptr || addressee == &console) {
             return bareResponse(request, QelMessageStatusConnectionNotAvailable);
         }
@@ -557,23 +559,15 @@ HypervisorEngine::Reply HypervisorEngine::pSetUpSerial(ConsoleEntry& console,
     return std::make_unique<QelMessageVirtualSerialSetupSessionRsp>(request.getCallerId());
 }
 
-ConsoleEntry* HypervisorEngine::pFindIdentified(std::uint32_t toolType, const std::string& toolId)
+ConsoleEntry* HypervisorEngine::pFindIdentified(const ToolName& name)
 {
-    for (auto& entry : mConsoles) {
-        ConsoleEntry& console = entry.second;
-        if (console.state != ConsoleState::Identified) continue;
-        if (console.peer.toolType == toolType && console.peer.toolId == toolId) return &console;
-    }
-    return nullptr;
+    const auto found = mIdentified.find(name);
+    return found == mIdentified.end() ? nullptr : found->second;
 }
 
-std::size_t HypervisorEngine::pCountIdentified() const
+void HypervisorEngine::pForgetIdentified(const ConsoleEntry& console)
 {
-    std::size_t count = 0;
-    for (const auto& entry : mConsoles) {
-        if (entry.second.state == ConsoleState::Identified) ++count;
-    }
-    return count;
+    if (console.state == ConsoleState::Identified) mIdentified.erase({console.peer.toolType, console.peer.toolId});
 }
 
 /// @return false: the console's queue is full, and it did not get the broadcast
@@ -590,6 +584,7 @@ bool HypervisorEngine::pSendBroadcast(ConsoleEntry& to, const ConsoleEntry& from
 
 void HypervisorEngine::pClose(ConsoleEntry& console)
 {
+    pForgetIdentified(console);
     console.state = ConsoleState::Closing;
     console.link.finish();
 }

@@ -100,6 +100,8 @@ public:
 
 private:
     using Reply = std::unique_ptr<QelMessage>;
+    /// The type and the id of a console's tool.
+    using ToolName = std::pair<std::uint32_t, std::string>;
     /// The identity of a request: function and operation.
     using RequestId = std::pair<unsigned short, unsigned short>;
 
@@ -150,8 +152,8 @@ private:
     Reply pMaxSerialSessions(ConsoleEntry&, const QelMessageVirtualSerialGetMaxSessionsReq&) QEL_REQUIRES(mMutex);
     Reply pSetUpSerial(ConsoleEntry&, const QelMessageVirtualSerialSetupSessionReq&) QEL_REQUIRES(mMutex);
 
-    ConsoleEntry* pFindIdentified(std::uint32_t toolType, const std::string& toolId) QEL_REQUIRES(mMutex);
-    std::size_t pCountIdentified() const QEL_REQUIRES(mMutex);
+    ConsoleEntry* pFindIdentified(const ToolName& name) QEL_REQUIRES(mMutex);
+    void pForgetIdentified(const ConsoleEntry& console) QEL_REQUIRES(mMutex);
     bool pSendBroadcast(ConsoleEntry& to, const ConsoleEntry& from, const QelMessageDaxBroadcastReq&)
         QEL_REQUIRES(mMutex);
     void pRefuseUpgrade(ConsoleEntry& console) QEL_REQUIRES(mMutex);
@@ -164,6 +166,9 @@ private:
     mutable Mutex mMutex;
     PartitionSet mPartitions QEL_GUARDED_BY(mMutex);
     std::map<ConsoleId, ConsoleEntry> mConsoles QEL_GUARDED_BY(mMutex);
+    // Those in the state Identified, by what they say about themselves. A look at each console would be most of the
+    // engine's work on a message between two of many.
+    std::map<ToolName, ConsoleEntry*> mIdentified QEL_GUARDED_BY(mMutex);
     ConsoleId mLastConsoleId QEL_GUARDED_BY(mMutex) = 0;
     bool mShutDown QEL_GUARDED_BY(mMutex) = false;
 };
