@@ -186,13 +186,14 @@ std::optional<std::size_t> FrameLink::pReadFirstOverTls(TimePoint begin)
 {
     auto& bytes = mInput.firstBytes();
     for (;;) {
-        if (!mIsStarved) {
+        if (hasPending()) {
             mReadAhead->setWaiting(false);
             const std::size_t count = mBuffered.read(bytes.data(), bytes.size());
             mReadAhead->setWaiting(true);
-            if (count != 0 || mReadAhead->hasEnded()) return count;
+            if (count != 0) return count;
             mIsStarved = true;
         }
+        if (mReadAhead->hasEnded()) return 0;
         const milliseconds wait = timeLeft(begin);
         if (wait == milliseconds::zero() && !pIsReadable()) return std::nullopt;
         if (!mReadAhead->awaitBytes(wait)) return std::nullopt;
