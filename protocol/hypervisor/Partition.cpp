@@ -96,11 +96,18 @@ bool Partition::feed(const ConsoleEntry& console, std::uint16_t number, const ch
     mEvents.changed = true;
     if (number != PartitionSessions::kTyping) {
         mSessions.refuseInput(number);
-    } else if (mState == State::Up || mState == State::ComingUp) {
+    } else if (mState == State::Up || mState == State::ComingUp || pIsFirstStartDue()) {
         mInput.append(data, length);
         pPumpInput();
     } // nothing reads what is typed on a line that is down
     return true;
+}
+
+/// Whether the line is to be brought up for the first time in a moment, as when a console comes right after the start
+/// of the server.
+bool Partition::pIsFirstStartDue() const
+{
+    return mState == State::Down && mOptions.keepsSession && !mIsLost && !mStartAt.isDisabled();
 }
 
 void Partition::release(const ConsoleEntry& console)

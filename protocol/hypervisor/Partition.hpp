@@ -100,6 +100,7 @@ public:
 private:
     using State = PartitionState::Line;
 
+    bool pIsFirstStartDue() const;
     bool pBringUp(bool mayRestart);
     bool pStart(TimePoint now);
     bool pAdvance();

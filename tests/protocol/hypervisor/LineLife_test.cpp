@@ -245,6 +245,18 @@ TEST_F(LineLifeTest, AConnectionIsMadeWithTheServer)
     EXPECT_THAT(watched(), ElementsAre(1, 2));
 }
 
+TEST_F(LineLifeTest, WhatIsTypedBeforeAConnectionIsBroughtUpForTheFirstTimeWaitsForIt)
+{
+    serveWith(connection());
+    Peer peer;
+    setUpSerial(peer, "a", 1);
+    sendData(peer, 1, "typed early");
+    EXPECT_EQ(port1->started, 0U);
+    hypervisor->serviceLines();
+    hypervisor->serviceSerial(1);
+    EXPECT_EQ(port1->input, "typed early");
+}
+
 TEST_F(LineLifeTest, ALostConnectionKeepsItsSessionAndIsToldOnce)
 {
     serveWith(connection());
