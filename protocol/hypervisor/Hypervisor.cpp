@@ -57,6 +57,8 @@ void Hypervisor::setMetadata(const Peer&, const std::string& metadata)
 
 void Hypervisor::onConnected(const Peer&) {}
 
+void Hypervisor::onAnswered(const Peer&, const QelMessage&, QelMessageStatusCodes) {}
+
 void Hypervisor::onDisconnected(const Peer&) {}
 
 } // namespace qel::protocol

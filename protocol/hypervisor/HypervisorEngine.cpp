@@ -319,6 +319,8 @@ void HypervisorEngine::pHandleRequest(ConsoleEntry& console, const QelMessage& r
         logLine(LogLevel::Info, "console ", console.peer.id, ": refused ", request.getLogID(), ": ", status);
     }
     console.link.post(std::move(reply));
+    static_cast<void>(
+        runGuarded([&] { mMachine.onAnswered(console.peer, request, status); }, "console ", console.peer.id));
     if (console.state == ConsoleState::Identified) return pAnnounce(console);
     if (status == QelMessageStatusTooManyConnections) pClose(console);
 }

@@ -15,9 +15,9 @@ const Authority& Authority::stranger()
 }
 
 Authority::Authority(const std::string& rootName)
-    : mRoot(SSLSubject{{"CN", rootName}}, SSLValidityPeriod::days(2)), mServerRequest(SSLSubject{{"CN", "server"}}),
-      mClientRequest(SSLSubject{{"CN", "client"}}), mServer(issue(mServerRequest, SSLValidityPeriod::days(1))),
-      mClient(issue(mClientRequest, SSLValidityPeriod::days(1)))
+    : mRoot(SSLSubject{{"CN", rootName}}, SSLValidityPeriod::days(200)), mServerRequest(SSLSubject{{"CN", "server"}}),
+      mClientRequest(SSLSubject{{"CN", "client"}}), mServer(issue(mServerRequest, SSLValidityPeriod::days(100))),
+      mClient(issue(mClientRequest, SSLValidityPeriod::days(100)))
 {}
 
 SSLCertificate Authority::issue(const SSLCertificateRequest& request, const SSLValidityPeriod& validity) const

@@ -136,7 +136,7 @@ TEST(AccessRules, APartitionOutsideTheRangesDoesNotExist)
 TEST(AccessRules, AWatcherMayOpenEveryConnectionButTheOneThatTypes)
 {
     const AccessRules rules({rule({"a"}, AccessRight::Watch)});
-    EXPECT_EQ(open(rules, peer("a"), 1, 0), QelMessageStatusInvalidConnectionNumber);
+    EXPECT_EQ(open(rules, peer("a"), 1, 0), QelMessageStatusInvalidOperation);
     EXPECT_EQ(open(rules, peer("a"), 1, 1), QelMessageStatusNoError);
     EXPECT_EQ(open(rules, peer("a"), 1, 15), QelMessageStatusNoError);
     EXPECT_TRUE(rules.mayOpen(peer("a"), 1));

@@ -7,9 +7,12 @@
 
 #include "base/Failures.hpp"
 #include "base/OptionChecks.hpp"
+#include "transport/CertificateNotes.hpp"
 
 #include <cstring>
+#include <iostream>
 #include <limits>
+#include <mutex>
 #include <stdexcept>
 
 namespace qel::tool {
@@ -28,6 +31,16 @@ bool isHostName(const std::string& server)
     } catch (const std::exception&) {
         return true;
     }
+}
+
+/// Notes for the user, once in a process: "qel bench" connects many times.
+void sayOnce(const TransportOptions& options)
+{
+    static std::once_flag said;
+    std::call_once(said, [&options] {
+        for (const std::string& note : clientNotes(options, SSLValidityPeriod::Clock::now()))
+            std::cerr << "qel: note: " << note << std::endl;
+    });
 }
 
 } // namespace
@@ -81,6 +94,7 @@ ConsoleOptions libraryOptions(const ConnectOptions& options)
     library.handshakeTimeout = options.transport.handshakeTimeout();
     library.requestTimeout = options.timeout();
     library.frameTimeout = options.timeout();
+    sayOnce(options.transport); // the credentials can be used
     return library;
 }
 

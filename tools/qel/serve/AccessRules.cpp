@@ -111,7 +111,7 @@ QelMessageStatusCodes AccessRules::pDecideOpen(const PeerIdentity& peer, std::ui
                                                std::uint16_t connection, bool force) const
 {
     if (!mayOpen(peer, partition)) return QelMessageStatusInvalidLparId;
-    if (!mayUse(peer, partition, connection)) return QelMessageStatusInvalidConnectionNumber;
+    if (!mayUse(peer, partition, connection)) return QelMessageStatusInvalidOperation;
     if (force && !has(pRightsOn(peer, partition), AccessRight::Force)) return QelMessageStatusInvalidOperation;
     return QelMessageStatusNoError;
 }

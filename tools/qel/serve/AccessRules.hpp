@@ -46,8 +46,7 @@ struct AccessRule {
 /// |---|---|
 /// | to connect: no rule is for the console | 18, for the version request |
 /// | to use a partition at all | 21, as if it did not exist |
-/// | to type: connection 0 of a partition that the console may watch | 16 |
-/// | to force, to broadcast, to set attributes | 1 |
+/// | to type (connection 0), to force, to broadcast, to set attributes | 1 |
 ///
 /// A plain value. Thread safety: that of one.
 class AccessRules {

@@ -11,6 +11,7 @@
 #include "lines/LineText.hpp"
 #include "serve/ServeMachine.hpp"
 #include "serve/ServePlan.hpp"
+#include "serve/ServeReload.hpp"
 #include "transport/TransportOptions.hpp"
 
 #include <csignal>
@@ -19,6 +20,7 @@
 #include <memory>
 #include <sstream>
 #include <string>
+#include <sys/time.h>
 #include <utility>
 #include <vector>
 
@@ -26,17 +28,13 @@ namespace qel::tool {
 
 namespace {
 
-constexpr std::initializer_list<int> kSignals{SIGTERM, SIGINT, SIGHUP, SIGUSR1};
+constexpr std::initializer_list<int> kSignals{SIGTERM, SIGINT, SIGHUP, SIGUSR1, SIGALRM};
 
 void addPartitions(Hypervisor& machine, const ServePlan& plan, LineLogs& logs)
 {
     for (const auto& entry : plan.partitions) {
-        const PlannedPartition& partition = entry.second;
-        MadeLine made = makeLine(partition.line, {plan.term, {}});
-        PartitionOptions options = partition.options;
-        options.keepsSession = made.options.keepsSession;
-        options.tap = logs.open(entry.first, options.name);
-        machine.addPartition(entry.first, std::move(made.line), options);
+        MadeLine made = makePartition(entry.first, entry.second, plan.term, logs);
+        machine.addPartition(entry.first, std::move(made.line), made.options);
     }
 }
 
@@ -59,16 +57,11 @@ void announce(const Server& server)
         logLine(LogLevel::Info, "listening on ", endpoint);
 }
 
-/// On SIGHUP: loads the credentials from their files again, for new connections.
-void reload(Server& server, const TransportOptions& transport)
+/// Has SIGALRM sent once a day.
+void alarmEveryDay()
 {
-    if (transport.plain) return logLine(LogLevel::Info, "SIGHUP: connections are plain, there is nothing to load");
-    try {
-        server.setCredentials(*loadCredentials(transport));
-        logLine(LogLevel::Info, "SIGHUP: loaded ", transport.paths().certificate, " for new connections");
-    } catch (const std::exception& error) {
-        logLine(LogLevel::Error, "SIGHUP: the credentials stay as they were: ", userMessage(error));
-    }
+    constexpr itimerval kDaily{{24 * 60 * 60, 0}, {24 * 60 * 60, 0}};
+    static_cast<void>(::setitimer(ITIMER_REAL, &kDaily, nullptr));
 }
 
 /// On SIGUSR1 and at the end: logs the statistics of the queues.
@@ -80,14 +73,16 @@ void logStatistics(Server& server)
 }
 
 /// @return the signal that ended it
-int serveUntilStopped(Server& server, SignalWatch& signals, const TransportOptions& transport, LineLogs& logs)
+int serveUntilStopped(Server& server, SignalWatch& signals, ServeReload& reload, LineLogs& logs)
 {
     for (;;) {
         server.run(signals.getPollFd());
         const int signal = signals.take();
         if (signal == SIGHUP) {
-            reload(server, transport);
+            reload.run();
             logs.rotate();
+        } else if (signal == SIGALRM) {
+            reload.warnOfExpiry();
         } else if (signal == SIGUSR1) {
             logStatistics(server);
         } else if (signal != 0) {
@@ -107,7 +102,10 @@ ExitStatus runServe(const ServePlan& plan)
     addPartitions(machine, plan, logs);
     const auto server = makeServer(machine, plan);
     announce(*server);
-    const int signal = serveUntilStopped(*server, signals, plan.transport, logs);
+    ServeReload reload(*server, machine, logs, plan);
+    reload.warnOfExpiry();
+    alarmEveryDay();
+    const int signal = serveUntilStopped(*server, signals, reload, logs);
 
     logLine(LogLevel::Info, "stopping: signal ", signal);
     logStatistics(*server);
@@ -115,11 +113,6 @@ ExitStatus runServe(const ServePlan& plan)
         static_cast<void>(std::signal(number, SIG_IGN)); // a second one must not cut the shutdown short
     server->finish();
     return ExitStatus::Done;
-}
-
-std::string countText(std::size_t count, const char* what)
-{
-    return std::to_string(count) + " " + what + (count == 1 ? "" : "s");
 }
 
 /// Checks what can be checked without serving. Everything that is wrong is an error of usage here.

@@ -1,7 +1,12 @@
 #include "serve/ServeMachine.hpp"
 
 #include <qel/common/QelMessageInterfaceComponent.hpp>
+#include <qel/common/QelMessageVirtualSerial.hpp>
+#include <qel/protocol/Logging.hpp>
 
+#include "serve/AuditLog.hpp"
+
+#include <iterator>
 #include <utility>
 
 namespace qel::tool {
@@ -34,17 +39,52 @@ bool ServeMachine::mayOpen(const Peer& peer, std::uint16_t partition)
     return mRules.mayOpen(peer, partition);
 }
 
+std::vector<ServeMachine::SessionPlace> ServeMachine::sessionsToEnd() const
+{
+    const MutexLock lock(mMutex);
+    std::vector<SessionPlace> places;
+    for (const auto& session : mSessions) {
+        const SessionPlace place = session.first;
+        if (!mRules.mayUse(session.second, place.first, place.second)) places.push_back(place);
+    }
+    return places;
+}
+
+void ServeMachine::onAnswered(const Peer& peer, const QelMessage& request, QelMessageStatusCodes status)
+{
+    const std::string line = auditAnswered(peer, request, status);
+    if (!line.empty()) logLine(LogLevel::Info, line);
+    if (status != QelMessageStatusNoError) return;
+    const MutexLock lock(mMutex);
+    if (const auto* open = dynamic_cast<const QelMessageVirtualSerialOpenReq*>(&request)) {
+        mSessions.insert_or_assign(SessionPlace(open->getLpId(), open->getVssConnectionNumber()), peer);
+    } else if (const auto* close = dynamic_cast<const QelMessageVirtualSerialCloseReq*>(&request)) {
+        mSessions.erase(SessionPlace(close->getLpId(), close->getVssConnectionNumber()));
+    } else if (dynamic_cast<const QelMessageInterfaceCmpCloseKrogSessionReq*>(&request) != nullptr) {
+        pForgetSessionsLocked(peer);
+    }
+}
+
 void ServeMachine::onConnected(const Peer& peer)
 {
+    logLine(LogLevel::Info, auditConnected(peer));
     const MutexLock lock(mMutex);
     if (!peer.fingerprint.empty()) ++mConsoles[peer.fingerprint];
 }
 
 void ServeMachine::onDisconnected(const Peer& peer)
 {
+    logLine(LogLevel::Info, auditLeft(peer));
     const MutexLock lock(mMutex);
+    pForgetSessionsLocked(peer);
     const auto found = mConsoles.find(peer.fingerprint);
     if (found != mConsoles.end() && --found->second == 0) mConsoles.erase(found);
+}
+
+void ServeMachine::pForgetSessionsLocked(const Peer& peer)
+{
+    for (auto next = mSessions.begin(); next != mSessions.end();)
+        next = next->second.id == peer.id ? mSessions.erase(next) : std::next(next);
 }
 
 } // namespace qel::tool

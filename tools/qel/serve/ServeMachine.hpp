@@ -7,12 +7,15 @@
 #include "serve/AccessRules.hpp"
 
 #include <cstddef>
+#include <cstdint>
 #include <map>
 #include <string>
+#include <utility>
+#include <vector>
 
 namespace qel::tool {
 
-/// The hypervisor of "qel serve": the library's, with rules for who may do what.
+/// The hypervisor of "qel serve": the library's, with rules for who may do what, and with a log of who did what.
 /// Thread safety: as Hypervisor; setRules() from any thread.
 class ServeMachine : public Hypervisor {
 public:
@@ -23,16 +26,26 @@ public:
     /// Replaces the rules for everything that is asked from now on.
     void setRules(AccessRules rules);
 
+    /// A session of a partition, by the partition's id and the number of the connection.
+    using SessionPlace = std::pair<std::uint16_t, std::uint16_t>;
+
+    /// The sessions that were opened and that the rules do not allow any more. Some of them may have ended since.
+    std::vector<SessionPlace> sessionsToEnd() const;
+
     QelMessageStatusCodes mayRequest(const Peer& peer, const QelMessage& request) override;
     bool mayOpen(const Peer& peer, std::uint16_t partition) override;
     void onConnected(const Peer& peer) override;
+    void onAnswered(const Peer& peer, const QelMessage& request, QelMessageStatusCodes status) override;
     void onDisconnected(const Peer& peer) override;
 
 private:
+    void pForgetSessionsLocked(const Peer& peer) QEL_REQUIRES(mMutex);
+
     const std::size_t mMaxPerCertificate;
 
-    Mutex mMutex; ///< a leaf
+    mutable Mutex mMutex; ///< guards what follows; only the logger's lock is taken under it
     AccessRules mRules QEL_GUARDED_BY(mMutex);
+    std::map<SessionPlace, Peer> mSessions QEL_GUARDED_BY(mMutex);       ///< see sessionsToEnd()
     std::map<std::string, std::size_t> mConsoles QEL_GUARDED_BY(mMutex); ///< connected ones, by fingerprint
 };
 

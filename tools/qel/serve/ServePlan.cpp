@@ -36,6 +36,8 @@ struct ServeInput::Options {
     PartitionChoices serving;
     LineLogOptions lineLog;
     std::uint32_t maxConsoles = ServerOptions().maxConsoles;
+    std::uint32_t maxPerCertificate = 0;
+    std::uint32_t warnDays = 30;
     double frameSeconds = std::chrono::duration<double>(ServerOptions().frameTimeout).count();
     std::uint32_t keepAliveSeconds = static_cast<std::uint32_t>(ServerOptions().keepAlive.count());
     std::string family;
@@ -189,6 +191,11 @@ void addLimitOptions(CLI::App& command, Options& options)
         ->transform(integerIn(1, 255))
         ->capture_default_str();
     command
+        .add_option("--max-consoles-per-certificate", options.maxPerCertificate,
+                    "Consoles that may be connected with one certificate at a time; 0: as many as all")
+        ->transform(integerIn(0, 255))
+        ->capture_default_str();
+    command
         .add_option("--max-handshakes", options.server.maxHandshakes,
                     "Connections that may be in their handshake at a time")
         ->transform(integerIn(1, kMaxHandshakes))
@@ -203,6 +210,12 @@ void addLimitOptions(CLI::App& command, Options& options)
                     "Bytes that may be queued for a console, half of them serial data")
         ->type_name("BYTES")
         ->transform(integerIn(1, kMaxQueueBytes))
+        ->capture_default_str();
+    command
+        .add_option("--warn-expiry", options.warnDays,
+                    "Warn in the log, once a day, when an own certificate expires within this many days; 0: never")
+        ->type_name("DAYS")
+        ->transform(integerIn(0, 3650))
         ->capture_default_str();
     command.add_option("--frame-timeout", options.frameSeconds, "Seconds from the first byte of a message to its last")
         ->type_name("SECONDS")
@@ -293,6 +306,8 @@ ServePlan ServeInput::plan() const
     if (options.transport.plain && plan.rules.size() > 0) {
         throw CLI::ValidationError("rules and access need certificates, and --plain has none");
     }
+    plan.maxPerCertificate = options.maxPerCertificate;
+    plan.warnExpiry = std::chrono::hours(24) * options.warnDays;
     plan.term = options.term;
     plan.lineLog = options.lineLog;
     plan.machine = parseMachine(options);

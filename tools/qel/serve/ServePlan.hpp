@@ -14,6 +14,7 @@
 #include "transport/TransportOptions.hpp"
 
 #include <CLI/CLI.hpp>
+#include <chrono>
 #include <cstddef>
 #include <cstdint>
 #include <map>
@@ -35,6 +36,7 @@ struct ServePlan {
     std::map<std::uint16_t, PlannedPartition> partitions;
     AccessRules rules;
     std::size_t maxPerCertificate = 0; ///< consoles; 0: any number
+    std::chrono::hours warnExpiry{0};  ///< so long before its end a certificate is warned about
     std::string term;
     LineLogOptions lineLog;
     MachineInfo machine;

@@ -106,6 +106,11 @@ public:
     /// A console's version request has been granted.
     virtual void onConnected(const Peer& peer);
 
+    /// A request of a console has been answered. What it asked for has been done, or has been refused, by this object
+    /// or by the server. Called for every request, the version request included, before onConnected().
+    /// @param status  of the response
+    virtual void onAnswered(const Peer& peer, const QelMessage& request, QelMessageStatusCodes status);
+
     /// The connection of a console that onConnected() was called for has ended. Its sessions are free.
     virtual void onDisconnected(const Peer& peer);
 

@@ -1,0 +1,27 @@
+#pragma once
+
+#include <qel/common/QelMessage.hpp>
+#include <qel/protocol/Peer.hpp>
+
+#include "base/Library.hpp"
+
+#include <string>
+
+namespace qel::tool {
+
+/// @file
+/// The lines about who did what. docs/serve.md has their format: an event, then "key=value" in a fixed order. Texts of
+/// the peer are quoted and safe to print.
+
+/// "audit: connected console=1 name="alice" ..."
+std::string auditConnected(const Peer& peer);
+
+/// "audit: left console=1 name="alice" ..."
+std::string auditLeft(const Peer& peer);
+
+/// The line about a request: opened, forced, watched, closed or refused.
+/// @param status  of the response
+/// @return empty: the request has no line, because it was granted and changes no session
+std::string auditAnswered(const Peer& peer, const QelMessage& request, QelMessageStatusCodes status);
+
+} // namespace qel::tool
