@@ -187,6 +187,9 @@ void Connection::pReceiveAll()
     mWire.onRead([this] { sendOwn(); });
     bool mayRead = true;
     while (mayRead || pAwaitReceive()) {
+        // What has been caused goes out before the reader waits. The stream says so too, but inside TLS, where sending
+        // needs memory of the stack that this thread would keep.
+        if (!mBuffered.hasPending()) sendOwn();
         mFrames.beginFrame();
         const std::unique_ptr<QelMessage> message = mMessages.read();
         const Received received = pHandOver(*message);
