@@ -39,7 +39,7 @@ CLI::Validator textUpTo(std::size_t bytes);
 /// Accepts an IP address and port: "127.0.0.1:4711", "[::1]:4711".
 CLI::Validator endpointValidator();
 
-/// The port of a server unless an option says otherwise. It is not assigned to a service.
+/// The port of a server unless an option says otherwise. Debian's services(5) has no service on it.
 constexpr std::uint16_t kDefaultPort = 4717;
 
 /// Adds the default port to an address or a name that has none; leaves everything else to other checks. Use it with

@@ -11,7 +11,6 @@
 #include <exception>
 #include <string>
 #include <utility>
-#include <vector>
 
 namespace qel::tool {
 
@@ -61,34 +60,45 @@ void ServeReload::warnOfExpiry() const
 
 void ServeReload::pApply(const ServePlan& next)
 {
+    MadeLines made; // what may fail comes first
+    for (const auto& entry : next.partitions)
+        made.emplace_back(entry.first, makePartition(entry.first, entry.second, mPlan.term, mLogs));
     pLogSettings(next);
-    pApplyPartitions(next.partitions);
-    mPlan.partitions = next.partitions;
+    // Before the partitions: whatever happens to them, nobody may do what the file no longer allows.
     mMachine.setRules(next.rules);
     mPlan.rules = next.rules;
+    pApplyPartitions(next.partitions, std::move(made));
     logLine(LogLevel::Info, "SIGHUP: read ", mPlan.file, ": ", countText(next.partitions.size(), "partition"), ", ",
             countText(next.rules.size(), "rule"), ", ", countText(pEndForbiddenSessions(), "session"), " ended");
 }
 
-/// A partition whose line has changed is removed and added. What may fail comes first.
-void ServeReload::pApplyPartitions(const std::map<std::uint16_t, PlannedPartition>& next)
+/// A partition whose line has changed is removed and added. One that fails is logged, and the others are applied; the
+/// next SIGHUP tries it again.
+void ServeReload::pApplyPartitions(const std::map<std::uint16_t, PlannedPartition>& next, MadeLines made)
 {
-    std::vector<std::pair<std::uint16_t, MadeLine>> made;
-    for (const auto& entry : next)
-        made.emplace_back(entry.first, makePartition(entry.first, entry.second, mPlan.term, mLogs));
-    for (const auto& entry : mPlan.partitions) {
+    const std::map<std::uint16_t, PlannedPartition> before = mPlan.partitions;
+    for (const auto& entry : before) {
         const auto kept = next.find(entry.first);
         if (kept != next.end() && kept->second.line == entry.second.line) continue;
         if (mServer.removePartition(entry.first)) logLine(LogLevel::Info, "partition ", entry.first, ": removed");
+        mPlan.partitions.erase(entry.first);
     }
     for (auto& entry : made) {
-        if (pHasLine(entry.first, next.at(entry.first).line)) {
-            static_cast<void>(mServer.changePartition(entry.first, entry.second.options));
-            continue;
+        try {
+            pApplyPartition(entry.first, std::move(entry.second));
+            mPlan.partitions.insert_or_assign(entry.first, next.at(entry.first));
+        } catch (const std::exception& error) {
+            logLine(LogLevel::Error, "partition ", entry.first, ": cannot be changed: ", userMessage(error));
         }
-        mServer.addPartition(entry.first, std::move(entry.second.line), entry.second.options);
-        logLine(LogLevel::Info, "partition ", entry.first, ": added");
     }
+}
+
+/// A partition that is still there has the same line.
+void ServeReload::pApplyPartition(std::uint16_t id, MadeLine made)
+{
+    if (mPlan.partitions.count(id) != 0) return static_cast<void>(mServer.changePartition(id, made.options));
+    mServer.addPartition(id, std::move(made.line), made.options);
+    logLine(LogLevel::Info, "partition ", id, ": added");
 }
 
 /// @return how many sessions were ended
@@ -126,13 +136,6 @@ void ServeReload::pLoadCredentials()
     } catch (const std::exception& error) {
         logLine(LogLevel::Error, "SIGHUP: the credentials stay as they were: ", userMessage(error));
     }
-}
-
-/// Whether a partition is served on a line of this text.
-bool ServeReload::pHasLine(std::uint16_t id, const std::string& line) const
-{
-    const auto found = mPlan.partitions.find(id);
-    return found != mPlan.partitions.end() && found->second.line == line;
 }
 
 std::string countText(std::size_t count, const char* what)

@@ -10,6 +10,8 @@
 
 #include <cstdint>
 #include <map>
+#include <utility>
+#include <vector>
 
 namespace qel::tool {
 
@@ -33,12 +35,14 @@ public:
     void warnOfExpiry() const;
 
 private:
+    using MadeLines = std::vector<std::pair<std::uint16_t, MadeLine>>;
+
     void pApply(const ServePlan& next);
-    void pApplyPartitions(const std::map<std::uint16_t, PlannedPartition>& next);
+    void pApplyPartitions(const std::map<std::uint16_t, PlannedPartition>& next, MadeLines made);
+    void pApplyPartition(std::uint16_t id, MadeLine made);
     std::size_t pEndForbiddenSessions();
     void pLogSettings(const ServePlan& next) const;
     void pLoadCredentials();
-    bool pHasLine(std::uint16_t id, const std::string& line) const;
 
     Server& mServer;
     ServeMachine& mMachine;
