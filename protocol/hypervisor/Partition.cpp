@@ -6,6 +6,7 @@
 #include <algorithm>
 #include <array>
 #include <new>
+#include <tuple>
 #include <utility>
 
 namespace qel::protocol {
@@ -161,7 +162,7 @@ void Partition::remove()
 
 std::optional<PollFd> Partition::watch() const
 {
-    if (mState != State::Up && mState != State::ComingUp) return std::nullopt;
+    if ((mState != State::Up && mState != State::ComingUp) || mTurns.isPausing()) return std::nullopt;
     const bool isUp = mState == State::Up;
     const bool wantsOutput = !isUp || pWantsOutput();
     const bool wantsToWrite = (isUp && !mInput.empty()) || mLine.wantsToWrite();
@@ -181,7 +182,7 @@ PollDeadline Partition::deadline(TimePoint now) const
         return mStartAt;
     case State::ComingUp:
     case State::Up:
-        return mLine.advanceAt();
+        return std::min(mLine.advanceAt(), mTurns.pauseEnd());
     case State::Ended:
         break;
     }
@@ -191,6 +192,14 @@ PollDeadline Partition::deadline(TimePoint now) const
 
 void Partition::service()
 {
+    const auto progress = [this] { return std::make_tuple(mState, mStarts, mOutputBytes, mInputBytes, mInput.size()); };
+    const auto before = progress();
+    pTakeTurn();
+    mTurns.count(progress() != before, TimeProvider::steady());
+}
+
+void Partition::pTakeTurn()
+{
     if (mState != State::Up && mState != State::ComingUp) return;
     if ((mState == State::ComingUp || mLine.wantsToWrite()) && !pAdvance()) return pFail();
     if (mState != State::Up) return;
@@ -198,11 +207,13 @@ void Partition::service()
     pPumpInput();
     mSessions.deliver();
     if (mState != State::Up || !pWantsOutput() || pReadOutput() || !mIsDraining) return;
-    if (mState == State::Up) pBeginExit(); // it has hung up and has nothing left
+    if (mState != State::Up) return;
+    mOptions.keepsSession ? pLoseLine() : pBeginExit(); // it has hung up and has nothing left
 }
 
 void Partition::serviceTime(TimePoint now)
 {
+    mTurns.passTime(now);
     mSessions.deliver();
     if (mState == State::Ended) return pFinishExit(now);
     if (mState == State::Down && mStartAt.isExpired(now)) {
@@ -340,6 +351,7 @@ void Partition::pStopLine()
     mState = State::Down;
     mInput.clear();
     mIsDraining = false;
+    mTurns = FruitlessTurns();
     mStartAt = mExitBy = mSetUpBy = PollDeadline();
     mEvents.changed = true;
     mLine.stop();

@@ -8,6 +8,7 @@
 #include <qel/protocol/PartitionState.hpp>
 
 #include "hypervisor/ConsoleEntry.hpp"
+#include "hypervisor/FruitlessTurns.hpp"
 #include "hypervisor/GuardedLine.hpp"
 #include "hypervisor/OutputHistory.hpp"
 #include "hypervisor/PartitionSessions.hpp"
@@ -85,7 +86,7 @@ public:
     // The serial thread's side.
 
     /// What to wait for; empty: nothing, or only deadline(). A line that has hung up and has nothing to do is left out:
-    /// it would be reported without end.
+    /// it would be reported without end. So is one whose last turns have moved nothing, for a moment.
     std::optional<PollFd> watch() const;
 
     /// When to call serviceTime() at the latest.
@@ -114,6 +115,7 @@ private:
     void pTakeDown(CloseReason reason, const CommandEnd& end);
     void pStopLine();
     void pScheduleStart(RestartPause::Duration wasUp);
+    void pTakeTurn();
     void pPumpInput();
     bool pReadOutput();
     void pDrain();
@@ -141,6 +143,7 @@ private:
     PollDeadline mExitBy;     ///< of a line that has ended, for its command to end
     PollDeadline mSetUpBy;    ///< of a line that has ended, for its sessions to be set up
     RestartPause mPause;
+    FruitlessTurns mTurns;
 };
 
 } // namespace qel::protocol

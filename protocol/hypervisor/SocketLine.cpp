@@ -44,9 +44,11 @@ void set(int fd, int level, int name, int value)
     static_cast<void>(::setsockopt(fd, level, name, &value, sizeof(value)));
 }
 
-/// Sends key strokes at once, and finds out in about a minute that a peer is gone.
+/// Sends key strokes at once, and finds out in about a minute that a peer is gone: by probes while nothing is under
+/// way, and by a limit for what the peer does not acknowledge, during which the system sends no probes.
 void tune(int fd)
 {
+    constexpr int kUnacknowledgedMilliseconds = 60000;
     constexpr int kIdleSeconds = 30;
     constexpr int kProbeSeconds = 5;
     constexpr int kProbes = 6;
@@ -55,6 +57,7 @@ void tune(int fd)
     set(fd, IPPROTO_TCP, TCP_KEEPIDLE, kIdleSeconds);
     set(fd, IPPROTO_TCP, TCP_KEEPINTVL, kProbeSeconds);
     set(fd, IPPROTO_TCP, TCP_KEEPCNT, kProbes);
+    set(fd, IPPROTO_TCP, TCP_USER_TIMEOUT, kUnacknowledgedMilliseconds);
 }
 
 } // namespace
@@ -147,12 +150,20 @@ std::size_t SocketLine::write(const char* data, std::size_t length)
     const ssize_t count = ::send(mSocket.get(), data, length, MSG_NOSIGNAL);
     const int error = errno;
     if (count >= 0) return static_cast<std::size_t>(count);
-    // Not an exception: what the peer has sent before must be read first, and reading ends the line.
-    if (!isTransient(error) && mReason.empty()) mReason = error == EPIPE ? kClosed : describe(error);
-    return 0;
+    if (isTransient(error)) return 0;
+    // Not an exception: what the peer has sent before must be read first, and reading ends the line. The socket may go
+    // on being writable without a hang-up, so it would never take the bytes and never say so: they are dropped, and it
+    // is shut down, which makes reading reach the end.
+    if (mReason.empty()) mReason = error == EPIPE ? kClosed : describe(error);
+    static_cast<void>(::shutdown(mSocket.get(), SHUT_RDWR)); // refused when the peer has reset the connection
+    return length;
 }
 
-int SocketLine::descriptor() const { return mState == State::LookingUp ? mLookup->descriptor() : mSocket.get(); }
+int SocketLine::descriptor() const
+{
+    if (mState != State::LookingUp) return mSocket.get();
+    return mLookup ? mLookup->descriptor() : -1;
+}
 
 std::string SocketLine::endReason() const { return mReason; }
 
@@ -164,10 +175,12 @@ void SocketLine::pCheckLookup()
         if (mDeadline.isExpired(TimeProvider::steady())) pFail(attempt, kTimedOut);
         return;
     }
-    mLookup.reset();
-    mAddresses.clear();
+    std::vector<SocketAddress> addresses;
+    addresses.reserve(result->endpoints.size());
     for (const IPEndpoint& endpoint : result->endpoints)
-        mAddresses.push_back(addressOf(endpoint));
+        addresses.push_back(addressOf(endpoint));
+    mAddresses.swap(addresses);
+    mLookup.reset(); // last: without memory for the addresses its answer is asked for again
     if (mAddresses.empty()) pFail(attempt, result->error.empty() ? "it has no address" : result->error);
     mState = State::Connecting;
 }

@@ -368,6 +368,77 @@ TEST_F(LineLifeTest, AConsoleIsReadAgainWhenALineThatTookNothingIsLost)
     EXPECT_EQ(peer.link.resumed, 1U);
 }
 
+TEST_F(LineLifeTest, AWaitingConnectionThatHasHungUpWithNothingLeftIsMadeAgain)
+{
+    PartitionOptions options = connection();
+    options.unattended = protocol::WhenUnattended::Wait;
+    serveWith(options);
+    hypervisor->serviceLines();
+    clock.advance(seconds(5));
+    port1->ended = true;
+    port1->whenEnded = protocol::SerialLine::LineState::Idle;
+    hypervisor->serviceSerial(1);
+    port1->ended = false;
+    EXPECT_THAT(log.lines(), ElementsAre("W: [qel] partition 1: line lost: it has ended; connecting again"));
+    expectStartAfter(seconds(1));
+}
+
+// Lines whose descriptor is ready although nothing can be moved.
+
+TEST_F(LineLifeTest, ALineWithWhichNothingMovesIsLeftAloneForAMoment)
+{
+    constexpr milliseconds kPause = protocol::FruitlessTurns::kPause;
+    serveWith(boot());
+    hypervisor->serviceLines();
+    Peer peer;
+    setUpSerial(peer, "a", 1);
+    port1->takes = 0;
+    sendData(peer, 1, "stuck");
+    for (int turn = 0; turn < protocol::FruitlessTurns::kMost; ++turn) {
+        EXPECT_THAT(watched(), ElementsAre(1, 2)) << turn;
+        hypervisor->serviceSerial(1);
+    }
+    EXPECT_THAT(watched(), ElementsAre(2));
+    EXPECT_EQ(hypervisor->serviceLines(), kPause);
+    clock.advance(kPause - milliseconds(1));
+    EXPECT_EQ(hypervisor->serviceLines(), milliseconds(1));
+    EXPECT_THAT(watched(), ElementsAre(2));
+    clock.advance(milliseconds(1));
+    EXPECT_EQ(hypervisor->serviceLines().count(), -1);
+    EXPECT_THAT(watched(), ElementsAre(1, 2));
+    port1->takes = 5;
+    hypervisor->serviceSerial(1);
+    EXPECT_EQ(port1->input, "stuck");
+}
+
+TEST_F(LineLifeTest, ALineWithWhichSomethingMovesNowAndThenIsNotLeftAlone)
+{
+    serveWith(boot());
+    hypervisor->serviceLines();
+    for (int round = 0; round < 3; ++round) {
+        for (int turn = 1; turn < protocol::FruitlessTurns::kMost; ++turn)
+            hypervisor->serviceSerial(1);
+        port1->output = {"x"};
+        hypervisor->serviceSerial(1);
+    }
+    EXPECT_THAT(watched(), ElementsAre(1, 2));
+}
+
+TEST_F(LineLifeTest, ALineThatIsLostWhileItIsLeftAloneIsWatchedAgainWhenItIsBack)
+{
+    serveWith(connection());
+    hypervisor->serviceLines();
+    for (int turn = 0; turn < protocol::FruitlessTurns::kMost; ++turn)
+        hypervisor->serviceSerial(1);
+    EXPECT_THAT(watched(), ElementsAre(2));
+    port1->ended = true;
+    hypervisor->serviceSerial(1);
+    port1->ended = false;
+    EXPECT_EQ(hypervisor->serviceLines(), seconds(1));
+    expectStartAfter(seconds(1));
+    EXPECT_THAT(watched(), ElementsAre(1, 2));
+}
+
 // Taps.
 
 class RecordingTap : public protocol::SerialTap {

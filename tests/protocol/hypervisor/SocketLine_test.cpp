@@ -5,6 +5,7 @@
 
 #include "hypervisor/SocketLine.hpp"
 #include "protocol/hypervisor/LineDriver.hpp"
+#include "support/Allocations.hpp"
 #include "support/Loopback.hpp"
 #include "support/SettableClock.hpp"
 #include "support/TemporaryDirectory.hpp"
@@ -59,6 +60,8 @@ public:
         bytes.resize(count < 0 ? 0 : static_cast<std::size_t>(count));
         return bytes;
     }
+
+    void stopReading() const { ASSERT_EQ(::shutdown(mSocket.getFd(), SHUT_RD), 0); }
 
     void close() { mSocket = Socket(-1); }
 
@@ -190,7 +193,7 @@ TEST_F(UnixLine, AllOutputIsReadBeforeTheEnd)
     EXPECT_EQ(line->endReason(), "the peer has closed the connection");
 }
 
-TEST_F(UnixLine, InputForAPeerThatHasClosedIsNotTakenAndItsOutputIsStillRead)
+TEST_F(UnixLine, InputForAPeerThatHasClosedIsDroppedAndItsOutputIsStillRead)
 {
     UnixListener listener(mPath);
     const auto line = unixLine(mPath);
@@ -199,7 +202,23 @@ TEST_F(UnixLine, InputForAPeerThatHasClosedIsNotTakenAndItsOutputIsStillRead)
     Peer peer = listener.accept();
     peer.send("last words");
     peer.close();
-    EXPECT_EQ(line->write("x", 1), 0U);
+    EXPECT_EQ(line->write("x", 1), 1U);
+    EXPECT_TRUE(line->hasHungUp());
+    EXPECT_EQ(driver.readUntilEnd(), "last words");
+    EXPECT_EQ(line->endReason(), "the peer has closed the connection");
+}
+
+TEST_F(UnixLine, APeerThatOnlyNoLongerReadsEndsTheLineAtTheFirstInput)
+{
+    UnixListener listener(mPath);
+    const auto line = unixLine(mPath);
+    LineDriver driver(*line);
+    driver.bringUp();
+    const Peer peer = listener.accept();
+    peer.send("last words");
+    peer.stopReading();
+    EXPECT_FALSE(line->hasHungUp());
+    EXPECT_EQ(line->write("typed", 5), 5U);
     EXPECT_TRUE(line->hasHungUp());
     EXPECT_EQ(driver.readUntilEnd(), "last words");
     EXPECT_EQ(line->endReason(), "the peer has closed the connection");
@@ -319,7 +338,7 @@ TEST_P(TcpLine, AResetIsTheReason)
     EXPECT_EQ(line->endReason(), "Connection reset by peer");
 }
 
-TEST_P(TcpLine, APeerThatIsGoneWithoutAWordIsNoticed)
+TEST_P(TcpLine, HasTheOptionsThatTellThatAPeerIsGone)
 {
     Socket listener = makeListener(GetParam());
     const auto line = tcpLine(listener.getSocketName().str());
@@ -334,6 +353,7 @@ TEST_P(TcpLine, APeerThatIsGoneWithoutAWordIsNoticed)
     EXPECT_EQ(option(SOL_SOCKET, SO_KEEPALIVE), 1);
     EXPECT_EQ(option(IPPROTO_TCP, TCP_KEEPIDLE) + option(IPPROTO_TCP, TCP_KEEPINTVL) * option(IPPROTO_TCP, TCP_KEEPCNT),
               60);
+    EXPECT_EQ(option(IPPROTO_TCP, TCP_USER_TIMEOUT), 60000);
     EXPECT_EQ(option(IPPROTO_TCP, TCP_NODELAY), 1);
 }
 
@@ -451,6 +471,36 @@ TEST(NamedTcpLine, TheNameIsLookedUpForEachConnection)
     EXPECT_EQ(driver.readUntilEnd(), "");
     driver.bringUp();
     EXPECT_EQ(*asked, 2);
+}
+
+TEST(NamedTcpLine, AnAnswerThatThereIsNoMemoryForIsTakenLater)
+{
+    QEL_TEST_NEEDS_ALLOCATIONS();
+    Socket listener = makeListener();
+    const LookupResult found{{listener.getSocketName()}, ""};
+    bool isUp = false;
+    for (std::size_t allowed = 0; !isUp; ++allowed) {
+        ASSERT_LT(allowed, 100U);
+        const auto line = namedLine([found](const std::string&, std::uint16_t) { return found; });
+        LineDriver driver(*line);
+        line->start(7);
+        driver.await(PollEvents::Read);
+        bool failed = false;
+        {
+            Allocations allocations;
+            allocations.failAfter(allowed);
+            try {
+                isUp = line->advance();
+            } catch (const std::bad_alloc&) {
+                failed = true;
+            }
+        }
+        EXPECT_GE(line->descriptor(), 0);
+        if (!failed) break;
+        while (!line->advance())
+            driver.await(PollEvents::Read);
+        listener.accept();
+    }
 }
 
 TEST(NamedTcpLine, TheSystemResolvesLocalhost)

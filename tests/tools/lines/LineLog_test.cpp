@@ -7,12 +7,14 @@
 #include "support/TemporaryDirectory.hpp"
 
 #include <cerrno>
+#include <cstdio>
 #include <fstream>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <memory>
 #include <sstream>
 #include <sys/stat.h>
+#include <unistd.h>
 
 namespace qel::test {
 
@@ -179,6 +181,50 @@ TEST_F(RotatingFileTest, AFileThatCannotBeOpenedAgainKeepsTheOldOne)
     }
     EXPECT_EQ(file.append("b"), 0);
     EXPECT_EQ(contentsOf(name(1)), "ab");
+}
+
+TEST_F(RotatingFileTest, AttemptsThatFailCostNoOlderFile)
+{
+    RotatingFile file(name(0), 4);
+    for (const char* text : {"old4", "old3", "old2", "old1", "last"})
+        EXPECT_EQ(file.append(text), 0);
+    {
+        FileCalls calls;
+        calls.fail(FileCalls::Open, EMFILE, 6);
+        for (int attempt = 0; attempt < 6; ++attempt)
+            EXPECT_EQ(file.append("lost"), EMFILE);
+    }
+    EXPECT_EQ(file.append("new"), 0);
+    EXPECT_EQ(contentsOf(name(0)), "new");
+    EXPECT_EQ(contentsOf(name(1)), "last");
+    EXPECT_EQ(contentsOf(name(2)), "old1");
+    EXPECT_EQ(contentsOf(name(3)), "old2");
+    EXPECT_EQ(contentsOf(name(4)), "old3");
+}
+
+TEST_F(RotatingFileTest, AFileThatSomebodyElseHasMovedAwayIsBegunAnew)
+{
+    RotatingFile file(name(0), 100);
+    ASSERT_EQ(std::rename(name(0).c_str(), directory.file("moved").c_str()), 0);
+    EXPECT_EQ(file.rotate(), 0);
+    EXPECT_EQ(file.append("new"), 0);
+    EXPECT_EQ(contentsOf(name(0)), "new");
+    EXPECT_EQ(contentsOf(directory.file("moved")), "");
+    EXPECT_FALSE(exists(name(1)));
+}
+
+TEST_F(RotatingFileTest, AFailureAfterSomebodyElseHasCutTheFileDoesNotExtendIt)
+{
+    RotatingFile file(name(0), 100);
+    EXPECT_EQ(file.append("many bytes\n"), 0);
+    ASSERT_EQ(::truncate(name(0).c_str(), 0), 0);
+    {
+        FileCalls calls;
+        calls.shortenNextWrite(3);
+        calls.fail(FileCalls::Writev, ENOSPC, 1, 1);
+        EXPECT_EQ(file.append("torn\n"), ENOSPC);
+    }
+    EXPECT_EQ(contentsOf(name(0)), "");
 }
 
 TEST_F(RotatingFileTest, ADirectoryThatIsNotThereIsReported)

@@ -40,8 +40,7 @@ int RotatingFile::append(const std::string& bytes) noexcept
         if (count > 0) {
             written += static_cast<std::size_t>(count);
         } else if (count == 0 || error != EINTR) {
-            // A part of it would be a torn line.
-            if (::ftruncate(mFile.get(), static_cast<off_t>(mSize)) != 0) mSize += written;
+            pTakeBack(written);
             return error;
         }
     }
@@ -51,9 +50,22 @@ int RotatingFile::append(const std::string& bytes) noexcept
 
 int RotatingFile::rotate() noexcept
 {
-    if (mFile.get() >= 0 && mSize == 0) return 0;
+    const bool isThere = pExists(0);
+    if (mFile.get() >= 0 && mSize == 0 && isThere) return 0;
     pMoveOlder();
     return pOpen();
+}
+
+/// Removes a part that has been written: it would be a torn line. Somebody else may have cut the file meanwhile, so its
+/// size is asked for.
+void RotatingFile::pTakeBack(std::uint64_t written) noexcept
+{
+    struct stat status {};
+    mSize += written;
+    if (::fstat(mFile.get(), &status) != 0) return;
+    mSize = static_cast<std::uint64_t>(status.st_size);
+    const std::uint64_t whole = mSize - std::min(mSize, written);
+    if (::ftruncate(mFile.get(), static_cast<off_t>(whole)) == 0) mSize = whole;
 }
 
 /// Opens the current file anew. When that fails, the one that is open stays open, if there is one.
@@ -69,14 +81,30 @@ int RotatingFile::pOpen() noexcept
     return 0;
 }
 
-/// Makes every file one older, from the oldest down: the other way round, a failure would overwrite a newer one. What
+/// Makes room for a new current file: makes every file one older, up to the first name that is free. So nothing moves
+/// when the room is there already, because the new file could not be opened the last time; otherwise each attempt would
+/// cost the oldest file. It goes from the oldest down: the other way round, a failure would overwrite a newer one. What
 /// cannot be moved stays, and the file that should make room for it grows on.
 void RotatingFile::pMoveOlder() noexcept
 {
     try {
-        for (int age = kOlderFiles; age > 0; --age)
+        int free = 0;
+        while (free < kOlderFiles && pExists(free))
+            ++free;
+        for (int age = free; age > 0; --age)
             static_cast<void>(std::rename(pName(age - 1).c_str(), pName(age).c_str()));
     } catch (const std::bad_alloc&) { // NOLINT(bugprone-empty-catch): the file grows on
+    }
+}
+
+/// True too when there is no memory for the name.
+bool RotatingFile::pExists(int age) const noexcept
+{
+    try {
+        struct stat status {};
+        return ::lstat(pName(age).c_str(), &status) == 0;
+    } catch (const std::bad_alloc&) {
+        return true;
     }
 }
 

@@ -29,12 +29,15 @@ public:
     /// @return 0, or the error number: nothing has been written
     int append(const std::string& bytes) noexcept;
 
-    /// Begins a new file, unless the current one is empty. @return 0, or the error number
+    /// Begins a new file, unless the current one is empty; also when somebody else has moved it away. @return 0, or the
+    /// error number
     int rotate() noexcept;
 
 private:
     int pOpen() noexcept;
+    void pTakeBack(std::uint64_t written) noexcept;
     void pMoveOlder() noexcept;
+    bool pExists(int age) const noexcept;
     std::string pName(int age) const { return age == 0 ? mPath : mPath + "." + std::to_string(age); }
 
     const std::string mPath;

@@ -18,8 +18,8 @@
 ///
 /// When the peer ends the connection or it breaks, all that the peer has sent is read, and then read() reports Ended;
 /// endReason() is "the peer has closed the connection" or the reason of the system, such as "Connection reset by peer".
-/// write() on a connection that has broken throws nothing: it takes nothing. After the end, start() connects anew; what
-/// the line has taken and the peer has not is lost.
+/// write() on a connection that has broken throws nothing: it drops the bytes, and reading ends. After the end, start()
+/// connects anew; what the line has taken and the peer has not is lost.
 ///
 /// The lines need no thread but for the look-up of a name (getaddrinfo(3)): at most one for each line. It ends by
 /// itself when the resolver has answered, and neither stop() nor the destructor waits for it.
