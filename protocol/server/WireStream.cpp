@@ -1,10 +1,32 @@
 #include "server/WireStream.hpp"
 
+#include <qel/common/io/StreamIOException.hpp>
+#include <qel/common/util/PosixError.hpp>
+#include <qel/protocol/Logging.hpp>
+
 #include <cerrno>
+#include <exception>
 #include <sys/socket.h>
 #include <utility>
 
 namespace qel::protocol {
+
+namespace {
+
+/// Fails as a SocketStream does. It could not find out any more what is wrong: a socket reports a failure once, and
+/// then only that it has ended.
+[[noreturn]] void failSocket(PosixErrorCode code, const char* context, const char* text)
+{
+    try {
+        const PosixError error(code, context);
+        logLine(LogLevel::Error, error.what());
+        throw error;
+    } catch (const PosixError&) {
+        std::throw_with_nested(StreamIOException(text));
+    }
+}
+
+} // namespace
 
 WireStream::WireStream(std::unique_ptr<Stream> stream, int descriptor)
     : mStream(std::move(stream)), mDescriptor(descriptor)
@@ -23,10 +45,12 @@ std::size_t WireStream::read(char* buffer, std::size_t length)
 {
     if (mOnRead) mOnRead();
     if (mHasNewDeadline) {
-        const std::size_t count = pReceiveAtOnce(buffer, length);
-        if (count > 0) return count; // nothing to wait for
+        // Its time has begun even if nothing has to be waited for: a peer that floods must not stop it.
+        const std::chrono::milliseconds timeLeft = mNewDeadline.getEffectiveTimeout();
+        const std::size_t count = timeLeft >= std::chrono::milliseconds::zero() ? pReceiveAtOnce(buffer, length) : 0;
+        if (count > 0) return count;
         mHasNewDeadline = false;
-        mStream->setReadDeadline(mNewDeadline);
+        mStream->setReadDeadline(timeLeft);
     }
     return mStream->read(buffer, length);
 }
@@ -34,7 +58,7 @@ std::size_t WireStream::read(char* buffer, std::size_t length)
 void WireStream::write(const char* buffer, std::size_t length)
 {
     if (mMayWait) return mStream->write(buffer, length);
-    if (mRest.empty() && !pSendAtOnce(buffer, length)) return mStream->write(buffer, length);
+    if (mRest.empty()) pSendAtOnce(buffer, length);
     mRest.append(buffer, length);
 }
 
@@ -49,26 +73,32 @@ void WireStream::setReadDeadline(std::chrono::milliseconds timeout)
 void WireStream::setWriteDeadline(std::chrono::milliseconds timeout) { mStream->setWriteDeadline(timeout); }
 
 /// Only with a deadline, which would otherwise have to be set and taken back. @return 0: there is nothing to read, or
-/// the stream below has to find out what is wrong
-std::size_t WireStream::pReceiveAtOnce(char* buffer, std::size_t length) const noexcept
+/// the peer has ended
+std::size_t WireStream::pReceiveAtOnce(char* buffer, std::size_t length) const
 {
-    if (mDescriptor < 0 || mNewDeadline < std::chrono::milliseconds::zero()) return 0;
+    if (mDescriptor < 0) return 0;
     const ssize_t count = ::recv(mDescriptor, buffer, length, MSG_DONTWAIT);
-    return count > 0 ? static_cast<std::size_t>(count) : 0;
+    if (count >= 0) return static_cast<std::size_t>(count);
+    const int code = errno;
+    if (code == EAGAIN || code == EWOULDBLOCK || code == EINTR) return 0;
+    failSocket(code, "socket stream failed to receive", "socket stream receive failure");
 }
 
 /// Sends what there is room for, and steps over it.
-/// @return false: the socket fails; the stream below finds out why
-bool WireStream::pSendAtOnce(const char*& buffer, std::size_t& length) const noexcept
+void WireStream::pSendAtOnce(const char*& buffer, std::size_t& length) const
 {
     ssize_t count = 0;
     do {
         count = ::send(mDescriptor, buffer, length, MSG_DONTWAIT | MSG_NOSIGNAL);
     } while (count < 0 && errno == EINTR);
-    if (count < 0) return errno == EAGAIN || errno == EWOULDBLOCK || errno == ENOBUFS || errno == ENOMEM;
-    buffer += count;
-    length -= static_cast<std::size_t>(count);
-    return true;
+    if (count >= 0) {
+        buffer += count;
+        length -= static_cast<std::size_t>(count);
+        return;
+    }
+    const int code = errno;
+    if (code == EAGAIN || code == EWOULDBLOCK || code == ENOBUFS || code == ENOMEM) return;
+    failSocket(code, "socket stream send failure", "socket stream send failure");
 }
 
 } // namespace qel::protocol

@@ -1,6 +1,7 @@
 #pragma once
 
 #include <qel/common/io/Stream.hpp>
+#include <qel/common/io/StreamDeadline.hpp>
 
 #include <chrono>
 #include <cstddef>
@@ -14,7 +15,7 @@ namespace qel::protocol {
 ///
 /// Reading: says before each read that the reader may have to wait, so that what it has to send goes out first. A
 /// deadline reaches the stream below when there is something to wait for, and not before: changing it costs a system
-/// call.
+/// call. Its time begins with the first read nevertheless.
 ///
 /// Writing: a thread that must not wait for the peer sends as much as there is room for. The rest is kept, and is sent
 /// by a thread that may wait. That needs a socket.
@@ -48,15 +49,16 @@ public:
     void sendRest();
 
     std::size_t read(char* buffer, std::size_t length) override;
-    /// @throws std::bad_alloc  without memory for the rest; and what a write of the stream below throws
+    /// @throws std::bad_alloc  without memory for the rest, of which a part may have been sent; and what a write of the
+    ///                         stream below throws
     void write(const char* buffer, std::size_t length) override;
     void close() override;
     void setReadDeadline(std::chrono::milliseconds timeout) override;
     void setWriteDeadline(std::chrono::milliseconds timeout) override;
 
 private:
-    std::size_t pReceiveAtOnce(char* buffer, std::size_t length) const noexcept;
-    bool pSendAtOnce(const char*& buffer, std::size_t& length) const noexcept;
+    std::size_t pReceiveAtOnce(char* buffer, std::size_t length) const;
+    void pSendAtOnce(const char*& buffer, std::size_t& length) const;
 
     const std::unique_ptr<Stream> mStream;
     const int mDescriptor;
@@ -64,7 +66,7 @@ private:
     // Of the reader.
     std::function<void()> mOnRead;
     bool mHasNewDeadline = false; // the stream below does not know it yet
-    std::chrono::milliseconds mNewDeadline{0};
+    StreamDeadline mNewDeadline;
 
     // Of the writer.
     bool mMayWait = true;

@@ -1,8 +1,11 @@
 #include <qel/common/io/StreamIOException.hpp>
+#include <qel/common/util/PosixError.hpp>
+#include <qel/protocol/Error.hpp>
 
 #include "protocol/server/RecordingStream.hpp"
 #include "server/WireStream.hpp"
 #include "support/LoopbackEnds.hpp"
+#include "support/SettableClock.hpp"
 
 #include <future>
 #include <gmock/gmock.h>
@@ -101,6 +104,13 @@ protected:
         return bytes;
     }
 
+    void resetByPeer()
+    {
+        const linger atOnce{1, 0};
+        ASSERT_EQ(::setsockopt(ends.near->getSocket().getFd(), SOL_SOCKET, SO_LINGER, &atOnce, sizeof(atOnce)), 0);
+        ends.near.reset();
+    }
+
     Loopback ends;
     std::unique_ptr<WireStream> stream;
 };
@@ -181,6 +191,49 @@ TEST_F(WireStreamOverSocket, ADeadlineThatPassesIsThatOfTheSocket)
                 readSome(*stream); // what has arrived, and then nothing more
         },
         StreamIOException);
+}
+
+TEST_F(WireStreamOverSocket, APeerThatKeepsSendingDoesNotStopTheTime)
+{
+    SettableClock clock;
+    stream->setReadDeadline(std::chrono::seconds(10));
+    ends.near->write("onetwothree", 11);
+    EXPECT_EQ(readSome(*stream, 3), "one");
+    clock.advance(std::chrono::seconds(10));
+    EXPECT_EQ(readSome(*stream, 3), "two");
+    clock.advance(milliseconds(1));
+    try {
+        readSome(*stream);
+        FAIL() << "the deadline has passed";
+    } catch (const StreamIOException& error) {
+        EXPECT_STREQ(error.what(), "I/O deadline");
+    }
+}
+
+TEST_F(WireStreamOverSocket, AReadWithADeadlineSaysThatThePeerHasResetTheConnection)
+{
+    resetByPeer();
+    stream->setReadDeadline(Loopback::kDeadline);
+    try {
+        readSome(*stream);
+        FAIL() << "the end of the stream";
+    } catch (const StreamIOException& error) {
+        EXPECT_STREQ(error.what(), "socket stream receive failure");
+        EXPECT_THROW(std::rethrow_if_nested(error), PosixError);
+    }
+}
+
+TEST_F(WireStreamOverSocket, AWriteThatDoesNotWaitSaysThatThePeerHasResetTheConnection)
+{
+    resetByPeer();
+    stream->setMayWait(false);
+    try {
+        stream->write("some", 4);
+        FAIL() << "it was sent";
+    } catch (const StreamIOException& error) {
+        EXPECT_EQ(protocol::explain(error),
+                  "socket stream send failure: socket stream send failure: 104 (Connection reset by peer)");
+    }
 }
 
 TEST_F(WireStreamOverSocket, TheEndIsThatOfTheSocket)
