@@ -23,11 +23,20 @@ public:
     Turn(const Turn&) = delete;
     Turn& operator=(const Turn&) = delete;
 
-    void send(bool mayWait) { mIsAllSent = mOutbox.pSend(mayWait); }
+    /// After a failure nothing follows: a part of a message may have been sent.
+    void send(bool mayWait)
+    {
+        try {
+            mIsAllSent = mOutbox.pSend(mayWait);
+        } catch (...) {
+            mOutbox.abandon();
+            throw;
+        }
+    }
 
 private:
     Outbox& mOutbox;
-    bool mIsAllSent = true; // after a failure too: nothing can be sent any more
+    bool mIsAllSent = true; // after a failure too: nothing is sent any more
 };
 
 void Outbox::Writer::send() noexcept

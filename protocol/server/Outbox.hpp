@@ -78,14 +78,14 @@ public:
 
     /// Sends what is queued, if this thread has posted anything since the last call, and no other thread is sending. At
     /// most one batch, and no more than goes out without waiting; the writer gets the rest.
-    /// @throws ...  what sending throws; the messages of the batch are lost
+    /// @throws ...  what sending throws; the outbox is abandoned then
     void sendOwn();
 
     // The writer's side.
 
     /// Waits for messages, and sends a batch of them.
     /// @return false: there will be no more, and nothing was sent
-    /// @throws ...  what sending throws; the messages of the batch are lost
+    /// @throws ...  what sending throws; the outbox is abandoned then
     bool sendNext();
 
     /// Says that the writer has ended.
