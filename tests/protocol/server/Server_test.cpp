@@ -42,6 +42,7 @@ protected:
         options.linger = kTime;
         make(options);
     }
+    ~PatientServerTest() override { server.reset(); } // before the clock
 
     SettableClock clock;
 };
