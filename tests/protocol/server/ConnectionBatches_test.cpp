@@ -2,6 +2,7 @@
 
 #include <qel/common/QelInternalMessageRegistry.hpp>
 #include <qel/common/QelMessageDax.hpp>
+#include <qel/common/QelMessageInterfaceComponent.hpp>
 #include <qel/common/io/StreamIOException.hpp>
 #include <qel/protocol/MemoryStream.hpp>
 
@@ -14,6 +15,7 @@
 #include <future>
 #include <gmock/gmock.h>
 #include <random>
+#include <sys/socket.h>
 #include <thread>
 
 namespace qel::test {
@@ -39,6 +41,7 @@ std::string bytesOf(const QelMessage& message) { return {message.serialize(), me
 struct Served {
     std::unique_ptr<Stream> stream; // of the console
     std::unique_ptr<Connection> connection;
+    int descriptor = -1; // of the stream's socket; -1: it has none
 };
 
 class ConnectionBatches : public ServedFixture {
@@ -62,6 +65,7 @@ protected:
         const bool isTls = transport == Transport::Tls;
         served.connection = ServedFixture::serve(ends, limits, isTls ? &mServerContext : nullptr);
         served.connection->start();
+        served.descriptor = ends.near->getSocket().getFd();
         served.stream = std::move(ends.near);
         if (isTls) served.stream = startTls(std::move(served.stream));
         return served;
@@ -319,6 +323,60 @@ TEST_P(OnEachTransport, TheNoticesOfTheEndComeAfterTheResponsesOfABatch)
     } catch (const StreamIOException&) {
         EXPECT_TRUE(isOver); // the notice was the last message
     }
+}
+
+/// Identities are free again, whoever was sending to them when they left.
+TEST_P(OnEachTransport, ConsolesThatComeAndGoWhileAllSendToOneAnotherAreForgotten)
+{
+    constexpr unsigned kConsoles = 4;
+    const auto comeAndGo = [this](unsigned number) {
+        std::mt19937 random(number);
+        for (unsigned round = 0; round < 10; ++round) {
+            Served console = connectAs(std::to_string(number), transport());
+            std::string bytes;
+            for (unsigned i = 0; i < 40; ++i) { // each has a response
+                const std::string other = std::to_string(random() % kConsoles);
+                bytes += bytesOf(broadcastTo(other, std::string(random() % 2000, 'x')));
+            }
+            console.stream->write(bytes.data(), bytes.size());
+            LoopbackMessages messages(*console.stream);
+            for (auto left = random() % 40; left > 0; --left)
+                static_cast<void>(messages.receive());
+            if (random() % 2 == 0) console.stream.reset(); // otherwise the connection ends first
+            console.connection.reset();
+        }
+    };
+    std::vector<std::thread> threads;
+    for (unsigned number = 0; number < kConsoles; ++number)
+        threads.emplace_back(comeAndGo, number);
+    for (std::thread& thread : threads)
+        thread.join();
+    for (unsigned number = 0; number < kConsoles; ++number)
+        static_cast<void>(connectAs(std::to_string(number), transport()));
+}
+
+class OnEachSocket : public OnEachTransport {};
+
+INSTANTIATE_TEST_SUITE_P(Transports, OnEachSocket, ::testing::Values(1, 2), nameOf);
+
+/// They are many batches, of which the reader of the connection sends at most one.
+TEST_P(OnEachSocket, AConsoleThatHalfClosesGetsTheResponsesToAllItHasSent)
+{
+    const Served console = connectAs("a", transport());
+    LoopbackMessages messages(*console.stream);
+    ASSERT_EQ(messages.ask(QelMessageSetGlobalSaveAreaMetadataReq(std::string(16000, 'm')))->getStatus(), 0U);
+    std::string bytes;
+    std::vector<unsigned int> ids;
+    for (unsigned i = 0; i < 15; ++i) { // the queue has room for all responses
+        const QelMessageGetGlobalSaveAreaMetadataReq request;
+        ids.push_back(request.getCallerId());
+        bytes += bytesOf(request);
+    }
+    messages.sendBytes(bytes);
+    ASSERT_EQ(::shutdown(console.descriptor, SHUT_WR), 0);
+    for (const unsigned int id : ids)
+        ASSERT_EQ(messages.receive()->getCallerId(), id);
+    EXPECT_TRUE(messages.isClosed());
 }
 
 } // namespace
