@@ -68,6 +68,7 @@ void GuardedLine::stop() noexcept
 SerialLine::ReadResult GuardedLine::read(char* buffer, std::size_t length) noexcept
 {
     using LineState = SerialLine::LineState;
+    mThrown.clear();
     return pCall(SerialLine::ReadResult{LineState::Ended, 0}, [&] {
         SerialLine::ReadResult result = mLine.read(buffer, length);
         require(result.length <= length, "the line says it has read more than there was room for");
@@ -78,6 +79,7 @@ SerialLine::ReadResult GuardedLine::read(char* buffer, std::size_t length) noexc
 
 std::optional<std::size_t> GuardedLine::write(const char* data, std::size_t length) noexcept
 {
+    mThrown.clear();
     return pCall(std::optional<std::size_t>(), [&] {
         const std::size_t taken = mLine.write(data, length);
         require(taken <= length, "the line says it has taken more than there was");
@@ -115,9 +117,15 @@ PollDeadline GuardedLine::advanceAt() const noexcept
     return pCall(PollDeadline(), [this] { return mLine.advanceAt(); });
 }
 
+/// What it throws is logged whatever the line is: the line goes on, so failure() never tells it.
 bool GuardedLine::sendBreak() noexcept
 {
-    return pCall(false, [this] { return mLine.sendBreak(); });
+    try {
+        return mLine.sendBreak();
+    } catch (...) {
+        logCurrent("partition ", mPartition);
+        return false;
+    }
 }
 
 std::string GuardedLine::failure() const

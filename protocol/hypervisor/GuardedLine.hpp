@@ -16,7 +16,7 @@ class GuardedLine {
 public:
     enum class Progress { Up, ComingUp, Failed };
 
-    /// @param logs  false: what the line throws is not logged; failure() has it
+    /// @param logs  false: what the line throws is not logged, except by sendBreak(); failure() has it
     GuardedLine(std::uint16_t partition, SerialLine& line, bool logs = true)
         : mPartition(partition), mLine(line), mLogs(logs)
     {}
@@ -43,7 +43,7 @@ public:
     bool sendBreak() noexcept;
 
     /// Why the line has ended or cannot be brought up, in printable characters: what the line says, else what it threw
-    /// last since start(), else empty. @throws std::bad_alloc
+    /// last since start(), read() or write(), else empty. @throws std::bad_alloc
     std::string failure() const;
 
 private:

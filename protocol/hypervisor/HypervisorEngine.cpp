@@ -224,7 +224,10 @@ bool HypervisorEngine::changePartition(std::uint16_t id, const PartitionOptions&
 {
     if (options.replayBytes > PartitionOptions::kMaxReplayBytes) throw std::invalid_argument("replayBytes");
     const MutexLock lock(mMutex);
+    PartitionOptions kept = options;
     const bool isThere = mPartitions.change(id, options);
+    // Not to keep the old tap, such as the log of a line, as long as the partition.
+    if (isThere) mMachine.mImpl->partitions.at(id).options.tap.swap(kept.tap);
     pWakeIfChanged();
     return isThere;
 }

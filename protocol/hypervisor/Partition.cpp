@@ -3,9 +3,12 @@
 #include <qel/common/util/TimeProvider.hpp>
 #include <qel/protocol/Logging.hpp>
 
+#include "base/Guard.hpp"
+
 #include <algorithm>
 #include <array>
 #include <new>
+#include <poll.h>
 #include <tuple>
 #include <utility>
 
@@ -96,11 +99,13 @@ bool Partition::feed(const ConsoleEntry& console, std::uint16_t number, const ch
     if (length == 0) return true;
     mEvents.changed = true;
     if (number != PartitionSessions::kTyping) {
-        mSessions.refuseInput(number);
-    } else if (mState == State::Up || mState == State::ComingUp || pIsFirstStartDue()) {
+        mSessions.refuseInput(number, "watching only, input is not passed on");
+    } else if (!mIsLost && (mState == State::Up || mState == State::ComingUp || pIsFirstStartDue())) {
         mInput.append(data, length);
         pPumpInput();
-    } // nothing reads what is typed on a line that is down
+    } else if (mIsLost) { // also while it connects: the second half of a line that was typed blindly is worse than none
+        mSessions.refuseInput(number, "the line is down, input is dropped");
+    } // nothing reads what is typed after the end of a command
     return true;
 }
 
@@ -140,7 +145,7 @@ void Partition::change(const PartitionOptions& options)
 {
     PartitionOptions changed = options;
     changed.keepsSession = mOptions.keepsSession;
-    mOutput.setLimit(historyLimit(changed));
+    mOutput.setLimit(std::max(historyLimit(changed), mSessions.unseenBytes(PartitionSessions::kTyping)));
     mOptions = std::move(changed);
     mEvents.changed = true;
 }
@@ -171,10 +176,19 @@ std::optional<PollFd> Partition::watch() const
     PollFd fd(mLine.descriptor(), PollEvents::Error);
     if (wantsToWrite) fd.mFd.events |= static_cast<short>(PollEvents::Write);
     if (wantsOutput) fd.mFd.events |= static_cast<short>(PollEvents::Read);
+    // The peer of a connection that is not read may end it without a hang-up. It has to be made again before somebody
+    // types into it.
+    if (mOptions.keepsSession && mSessions.isEmpty() && !wantsOutput) fd.mFd.events |= POLLRDHUP;
     return fd;
 }
 
 PollDeadline Partition::deadline(TimePoint now) const
+{
+    const PollDeadline next = pNextStep(now);
+    return mOwedNote.empty() ? next : std::min(next, PollDeadline(now + kNoteInterval));
+}
+
+PollDeadline Partition::pNextStep(TimePoint now) const
 {
     if (mSessions.canDeliver()) return now;
     switch (mState) {
@@ -203,7 +217,7 @@ void Partition::pTakeTurn()
     if (mState != State::Up && mState != State::ComingUp) return;
     if ((mState == State::ComingUp || mLine.wantsToWrite()) && !pAdvance()) return pFail();
     if (mState != State::Up) return;
-    if (mSessions.isEmpty() && !pWantsOutput() && mLine.hasHungUp()) mIsDraining = true;
+    if (mSessions.isEmpty() && !pWantsOutput() && (mLine.hasHungUp() || pPeerHasFinished())) mIsDraining = true;
     pPumpInput();
     mSessions.deliver();
     if (mState != State::Up || !pWantsOutput() || pReadOutput() || !mIsDraining) return;
@@ -214,6 +228,7 @@ void Partition::pTakeTurn()
 void Partition::serviceTime(TimePoint now)
 {
     mTurns.passTime(now);
+    pPayNote();
     mSessions.deliver();
     if (mState == State::Ended) return pFinishExit(now);
     if (mState == State::Down && mStartAt.isExpired(now)) {
@@ -264,6 +279,7 @@ void Partition::pOnUp()
     mEvents.changed = true;
     mUpSince = TimeProvider::steady();
     ++mStarts;
+    mSessions.forgetRefusal(PartitionSessions::kTyping);
     if (!std::exchange(mIsLost, false)) return;
     logLine(LogLevel::Info, "partition ", mId, ": line is back");
     pNote("line is back");
@@ -281,16 +297,26 @@ void Partition::pLoseLine()
 {
     const auto now = TimeProvider::steady();
     const bool wasUp = mState == State::Up;
-    if (!mIsLost) {
-        std::string reason = mLine.failure();
-        if (reason.empty()) reason = "it has ended";
-        const std::string text = (wasUp ? "line lost: " : "line is down: ") + reason + "; connecting again";
-        logLine(LogLevel::Warn, "partition ", mId, ": ", text);
-        pNote(text);
-        mIsLost = true;
+    if (!std::exchange(mIsLost, true)) {
+        std::string text = pLossText(wasUp);
+        static_cast<void>(
+            runGuarded([&] { logLine(LogLevel::Warn, "partition ", mId, ": ", text); }, "partition ", mId));
+        pNote(std::move(text));
     }
     pStopLine();
     mStartAt = now + mPause.next(wasUp ? now - mUpSince : RestartPause::Duration(0));
+}
+
+/// Without memory for the reason there is none.
+std::string Partition::pLossText(bool wasUp) const noexcept
+{
+    const char* const what = wasUp ? "line lost" : "line is down"; // short enough for a string without memory
+    try {
+        const std::string reason = mLine.failure();
+        return std::string(what) + ": " + (reason.empty() ? "it has ended" : reason) + "; connecting again";
+    } catch (const std::bad_alloc&) {
+        return what;
+    }
 }
 
 /// The line has ended. Its command ends a moment later, unless it has only closed its terminal.
@@ -377,6 +403,7 @@ void Partition::pPumpInput()
 bool Partition::pReadOutput()
 {
     // Whatever needs memory comes before the reading: what has been read must not be lost.
+    pFitHistory(0);
     mOutput.reserve(PartitionSessions::kPiece);
     if (mOptions.tap != nullptr) mEvents.tapCalls.reserve(mEvents.tapCalls.size() + 1);
     std::string tapped;
@@ -417,16 +444,49 @@ bool Partition::pWantsOutput() const
     return mIsDraining || mOptions.unattended == WhenUnattended::Keep || mSessions.isAnySetUp();
 }
 
-/// Puts a line of the program's own into the output, and tells the tap.
-void Partition::pNote(const std::string& text)
+/// Whether the peer of a connection will send nothing more, although the connection has not hung up.
+bool Partition::pPeerHasFinished() const noexcept
+{
+    if (!mOptions.keepsSession) return false;
+    pollfd fd{mLine.descriptor(), POLLRDHUP, 0};
+    return ::poll(&fd, 1, 0) > 0 && (fd.revents & POLLRDHUP) != 0;
+}
+
+/// Makes the history as large as the options say; larger while that is needed for what the session that types has not
+/// got, with more bytes to come.
+void Partition::pFitHistory(std::size_t more)
+{
+    const std::size_t limit = historyLimit(mOptions);
+    const std::size_t unseen = mSessions.unseenBytes(PartitionSessions::kTyping);
+    if (unseen == 0) return mOutput.setLimit(limit);
+    mOutput.setLimit(std::max(limit, std::min(unseen + more, std::max(unseen, limit + kMostExtraHistory))));
+}
+
+/// Puts a line of the program's own into the output, and tells the tap. Without memory that is done later.
+void Partition::pNote(std::string text) noexcept
+{
+    pPayNote();
+    if (!mOwedNote.empty() || !pTryNote(text)) mOwedNote = std::move(text);
+}
+
+/// @return false: there is no memory, and nothing has been done
+bool Partition::pTryNote(const std::string& text) noexcept
 {
     try {
         const std::string line = "\r\n[qel: " + text + "]\r\n";
+        pFitHistory(line.size());
         mOutput.reserve(line.size());
-        mOutput.append(line.data(), line.size());
         if (mOptions.tap != nullptr) mEvents.tapCalls.push_back({mOptions.tap, mId, false, text});
-    } catch (const std::bad_alloc&) { // NOLINT(bugprone-empty-catch): the log has it
+        mOutput.append(line.data(), line.size());
+        return true;
+    } catch (const std::bad_alloc&) {
+        return false;
     }
+}
+
+void Partition::pPayNote() noexcept
+{
+    if (!mOwedNote.empty() && pTryNote(mOwedNote)) mOwedNote.clear();
 }
 
 } // namespace qel::protocol

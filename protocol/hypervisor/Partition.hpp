@@ -44,6 +44,10 @@ public:
     static constexpr std::chrono::milliseconds kExitInterval{5};
     /// How long an ended line waits for sessions that are open and not set up yet: a short command may end in between.
     static constexpr std::chrono::seconds kSetUpTimeout{10};
+    /// How much larger than its limit the history may become for what the session that types has not got.
+    static constexpr std::size_t kMostExtraHistory = 16 * 1024;
+    /// How often to try to tell what there was no memory for.
+    static constexpr std::chrono::milliseconds kNoteInterval{1000};
 
     Partition(std::uint16_t id, SerialLine& line, PartitionOptions options, SerialEvents& events);
 
@@ -120,7 +124,13 @@ private:
     bool pReadOutput();
     void pDrain();
     bool pWantsOutput() const;
-    void pNote(const std::string& text);
+    bool pPeerHasFinished() const noexcept;
+    PollDeadline pNextStep(TimePoint now) const;
+    std::string pLossText(bool wasUp) const noexcept;
+    void pFitHistory(std::size_t more);
+    void pNote(std::string text) noexcept;
+    bool pTryNote(const std::string& text) noexcept;
+    void pPayNote() noexcept;
 
     const std::uint16_t mId;
     PartitionOptions mOptions;
@@ -139,6 +149,7 @@ private:
     bool mIsLost = false;     ///< of a line that keeps its sessions: they have been told that it is down
     bool mIsDraining = false; ///< the line has hung up: the rest of its output is read whoever looks
     TimePoint mUpSince;       ///< of the start of the line
+    std::string mOwedNote;    ///< the newest line of the program's own that there was no memory for
     PollDeadline mStartAt;    ///< when to bring the line up; disabled: nothing is planned
     PollDeadline mExitBy;     ///< of a line that has ended, for its command to end
     PollDeadline mSetUpBy;    ///< of a line that has ended, for its sessions to be set up

@@ -99,12 +99,25 @@ void PartitionSessions::endAll(CloseReason reason, const CommandEnd& end)
         pEnd(mSessions.begin(), reason, end);
 }
 
-void PartitionSessions::refuseInput(std::uint16_t number)
+std::size_t PartitionSessions::unseenBytes(std::uint16_t number) const
+{
+    const auto found = mSessions.find(number);
+    if (found == mSessions.end() || !found->second.isSetUp) return 0;
+    return static_cast<std::size_t>(mOutput.end() - std::max(found->second.next, mOutput.begin()));
+}
+
+void PartitionSessions::refuseInput(std::uint16_t number, const char* answer)
 {
     Session& session = mSessions.at(number);
     if (session.isWarned) return;
-    session.aside += "\r\n[qel: watching only, input is not passed on]\r\n";
+    session.aside += std::string("\r\n[qel: ") + answer + "]\r\n";
     session.isWarned = true;
+}
+
+void PartitionSessions::forgetRefusal(std::uint16_t number)
+{
+    const auto found = mSessions.find(number);
+    if (found != mSessions.end()) found->second.isWarned = false;
 }
 
 void PartitionSessions::resumeTyping()
@@ -134,7 +147,7 @@ void PartitionSessions::pDeliver(std::uint16_t number, Session& session)
     if (!session.isSetUp) return;
     ConsoleLink& link = session.console->link;
     for (int sent = 0; sent < kMostMessages && !pIsCaughtUp(session) && link.hasSerialRoom(); ++sent) {
-        pSkipLost(session);
+        pSkipLost(number, session);
         if (!session.aside.empty()) {
             link.postSerial(pMessage(number, session.aside.data(), session.aside.size()));
             session.aside.clear();
@@ -147,11 +160,12 @@ void PartitionSessions::pDeliver(std::uint16_t number, Session& session)
 }
 
 /// Lets a session that has fallen behind the history go on in the middle of it: at its oldest byte it would soon fall
-/// behind again.
-void PartitionSessions::pSkipLost(Session& session)
+/// behind again. Not so the one that types, which nothing runs away from.
+void PartitionSessions::pSkipLost(std::uint16_t number, Session& session)
 {
     if (session.next >= mOutput.begin()) return;
-    const std::uint64_t goOn = mOutput.end() - (mOutput.end() - mOutput.begin()) / 2;
+    const std::uint64_t kept = mOutput.end() - mOutput.begin();
+    const std::uint64_t goOn = mOutput.end() - (number == kTyping ? kept : kept / 2);
     session.aside += skippedText(goOn - session.next);
     session.next = goOn;
 }

@@ -66,8 +66,13 @@ public:
     /// Ends all sessions with notices.
     void endAll(CloseReason reason, const CommandEnd& end = {});
 
-    /// Answers the first input of a session that watches.
-    void refuseInput(std::uint16_t number);
+    /// Bytes of the history that a session has still to get; 0 when there is none, or it is not set up.
+    std::size_t unseenBytes(std::uint16_t number) const;
+
+    /// Answers input that is not passed on, in the session's data, once.
+    void refuseInput(std::uint16_t number, const char* answer);
+    /// Lets the next input that is not passed on be answered again.
+    void forgetRefusal(std::uint16_t number);
 
     /// Tells the console on number 0 that it may be read again.
     void resumeTyping();
@@ -91,7 +96,7 @@ private:
     using Sessions = std::map<std::uint16_t, Session>;
 
     void pDeliver(std::uint16_t number, Session& session);
-    void pSkipLost(Session& session);
+    void pSkipLost(std::uint16_t number, Session& session);
     void pFinish(std::uint16_t number, Session& session);
     bool pIsCaughtUp(const Session& session) const;
     Sessions::iterator pEnd(Sessions::iterator session, CloseReason reason, const CommandEnd& end);

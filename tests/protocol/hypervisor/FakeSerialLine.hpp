@@ -76,6 +76,7 @@ public:
     std::string endReason() const override { return reason; }
     bool sendBreak() override
     {
+        called("sendBreak");
         requireRunning();
         if (hasBreak) ++breaks;
         return hasBreak;
@@ -119,7 +120,7 @@ public:
     int descriptor() const override
     {
         called("descriptor");
-        return mRunning ? kDescriptor : -1;
+        return mRunning ? fd : -1;
     }
     void stop() override
     {
@@ -129,6 +130,7 @@ public:
     }
 
     static constexpr int kDescriptor = 1000;
+    int fd = kDescriptor; ///< while it is up
 
 private:
     void called(const char* operation) const

@@ -2,8 +2,7 @@
 
 #include <qel/common/QelLogger.hpp>
 
-#include "protocol/hypervisor/VirtualSerialFixture.hpp"
-#include "support/SettableClock.hpp"
+#include "protocol/hypervisor/LineLifeFixture.hpp"
 
 #include <gmock/gmock.h>
 
@@ -23,47 +22,7 @@ using ::testing::IsEmpty;
 constexpr unsigned int kCmdFailed = 6;
 constexpr unsigned int kReadFailure = 4;
 
-class LineLifeTest : public VirtualSerialFixture {
-protected:
-    static PartitionOptions boot(RestartLine restart = RestartLine::Never)
-    {
-        PartitionOptions options;
-        options.start = StartLine::Boot;
-        options.restart = restart;
-        return options;
-    }
-    static PartitionOptions connection()
-    {
-        PartitionOptions options;
-        options.keepsSession = true;
-        return options;
-    }
-
-    /// Lets the command of partition 1 end.
-    void endCommand(CommandEnd end)
-    {
-        port1->ended = true;
-        port1->end = end;
-        hypervisor->serviceSerial(1);
-        hypervisor->serviceLines();
-        port1->ended = false;
-    }
-
-    /// Moves the clock to just before a pause is over and expects nothing, then over it.
-    void expectStartAfter(milliseconds pause)
-    {
-        const unsigned started = port1->started;
-        clock.advance(pause - milliseconds(1));
-        EXPECT_EQ(hypervisor->serviceLines(), milliseconds(1));
-        EXPECT_EQ(port1->started, started);
-        clock.advance(milliseconds(1));
-        hypervisor->serviceLines();
-        EXPECT_EQ(port1->started, started + 1);
-    }
-
-    SettableClock clock;
-};
-
+using LineLifeTest = LineLifeFixture;
 using Kind = CommandEnd::Kind;
 
 TEST_F(LineLifeTest, BootStartsTheCommandWithTheServer)
@@ -290,7 +249,7 @@ TEST_F(LineLifeTest, ALostConnectionKeepsItsSessionAndIsToldOnce)
     sendData(peer, 1, "into the void");
     expectStartAfter(seconds(4));
     hypervisor->serviceLines();
-    EXPECT_EQ(received(peer), "\r\n[qel: line is back]\r\n");
+    EXPECT_EQ(received(peer), "\r\n[qel: the line is down, input is dropped]\r\n\r\n[qel: line is back]\r\n");
     EXPECT_EQ(received(watcher, 1), "\r\n[qel: line is back]\r\n");
     EXPECT_EQ(port1->input, "");
     sendData(peer, 1, "heard");
@@ -368,94 +327,7 @@ TEST_F(LineLifeTest, AConsoleIsReadAgainWhenALineThatTookNothingIsLost)
     EXPECT_EQ(peer.link.resumed, 1U);
 }
 
-TEST_F(LineLifeTest, AWaitingConnectionThatHasHungUpWithNothingLeftIsMadeAgain)
-{
-    PartitionOptions options = connection();
-    options.unattended = protocol::WhenUnattended::Wait;
-    serveWith(options);
-    hypervisor->serviceLines();
-    clock.advance(seconds(5));
-    port1->ended = true;
-    port1->whenEnded = protocol::SerialLine::LineState::Idle;
-    hypervisor->serviceSerial(1);
-    port1->ended = false;
-    EXPECT_THAT(log.lines(), ElementsAre("W: [qel] partition 1: line lost: it has ended; connecting again"));
-    expectStartAfter(seconds(1));
-}
-
-// Lines whose descriptor is ready although nothing can be moved.
-
-TEST_F(LineLifeTest, ALineWithWhichNothingMovesIsLeftAloneForAMoment)
-{
-    constexpr milliseconds kPause = protocol::FruitlessTurns::kPause;
-    serveWith(boot());
-    hypervisor->serviceLines();
-    Peer peer;
-    setUpSerial(peer, "a", 1);
-    port1->takes = 0;
-    sendData(peer, 1, "stuck");
-    for (int turn = 0; turn < protocol::FruitlessTurns::kMost; ++turn) {
-        EXPECT_THAT(watched(), ElementsAre(1, 2)) << turn;
-        hypervisor->serviceSerial(1);
-    }
-    EXPECT_THAT(watched(), ElementsAre(2));
-    EXPECT_EQ(hypervisor->serviceLines(), kPause);
-    clock.advance(kPause - milliseconds(1));
-    EXPECT_EQ(hypervisor->serviceLines(), milliseconds(1));
-    EXPECT_THAT(watched(), ElementsAre(2));
-    clock.advance(milliseconds(1));
-    EXPECT_EQ(hypervisor->serviceLines().count(), -1);
-    EXPECT_THAT(watched(), ElementsAre(1, 2));
-    port1->takes = 5;
-    hypervisor->serviceSerial(1);
-    EXPECT_EQ(port1->input, "stuck");
-}
-
-TEST_F(LineLifeTest, ALineWithWhichSomethingMovesNowAndThenIsNotLeftAlone)
-{
-    serveWith(boot());
-    hypervisor->serviceLines();
-    for (int round = 0; round < 3; ++round) {
-        for (int turn = 1; turn < protocol::FruitlessTurns::kMost; ++turn)
-            hypervisor->serviceSerial(1);
-        port1->output = {"x"};
-        hypervisor->serviceSerial(1);
-    }
-    EXPECT_THAT(watched(), ElementsAre(1, 2));
-}
-
-TEST_F(LineLifeTest, ALineThatIsLostWhileItIsLeftAloneIsWatchedAgainWhenItIsBack)
-{
-    serveWith(connection());
-    hypervisor->serviceLines();
-    for (int turn = 0; turn < protocol::FruitlessTurns::kMost; ++turn)
-        hypervisor->serviceSerial(1);
-    EXPECT_THAT(watched(), ElementsAre(2));
-    port1->ended = true;
-    hypervisor->serviceSerial(1);
-    port1->ended = false;
-    EXPECT_EQ(hypervisor->serviceLines(), seconds(1));
-    expectStartAfter(seconds(1));
-    EXPECT_THAT(watched(), ElementsAre(1, 2));
-}
-
 // Taps.
-
-class RecordingTap : public protocol::SerialTap {
-public:
-    void onOutput(std::uint16_t partition, const char* data, std::size_t length) noexcept override
-    {
-        calls.push_back(std::to_string(partition) + " output " + std::string(data, length));
-    }
-    void onEvent(std::uint16_t partition, const std::string& text) noexcept override
-    {
-        calls.push_back(std::to_string(partition) + " event " + text);
-        if (onCall) onCall();
-    }
-
-    std::vector<std::string> calls;
-    std::function<void()> onCall;
-};
 
 TEST_F(LineLifeTest, ATapHearsOutputAndEventsInOrderWhoeverLooks)
 {

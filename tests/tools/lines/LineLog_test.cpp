@@ -64,6 +64,22 @@ const std::vector<PlainRow>& plainRows()
          "b\tc\n",
          {"ab\tc"}},
         {"a zero byte", std::string("a\0b\n", 4), {"ab"}},
+        {"upper control characters",
+         "a\x9B"
+         "2Jb\x80\x9F"
+         "c\n",
+         {"a2Jbc"}},
+        {"upper control characters in UTF-8",
+         "a\xC2\x9B"
+         "2J\xC2\x80\xC2\x9F"
+         "b\xC2\xA0"
+         "c\n",
+         {"a2Jb\xC2\xA0"
+          "c"}},
+        {"UTF-8 whose later bytes look like them",
+         "\xC3\x9F\xE2\x82\x9B\xF0\x9F\x98\x80\n",
+         {"\xC3\x9F\xE2\x82\x9B\xF0\x9F\x98\x80"}},
+        {"a character too many", "\xC3\x9F\x9B\n", {"\xC3\x9F"}},
         {"UTF-8", "gr\xC3\xBC\xC3\x9F\n", {"gr\xC3\xBC\xC3\x9F"}},
         {"a torn sequence does not swallow the next line",
          "\x1B[12\nnext\n\x1B]0;torn\nlast\n",
@@ -267,6 +283,14 @@ TEST_F(LineLogTest, HasTheBytesAndTheLinesWithTheTimeTheyBegan)
                                             "2024-01-02T03:04:06.234Z next\n"
                                             "2024-01-02T03:04:07.234Z [qel: the command exited with status 3]\n");
     EXPECT_THAT(log.lines(), IsEmpty());
+}
+
+TEST_F(LineLogTest, OutputCannotPassForALineOfTheServer)
+{
+    putOut("[qel: the log ends]\r\n\\[qel: x]\r\n[qem: y]\r\n");
+    EXPECT_EQ(text(), std::string(kBegin) + "2024-01-02T03:04:05.000Z \\[qel: the log ends]\n"
+                                            "2024-01-02T03:04:05.000Z \\[qel: x]\n"
+                                            "2024-01-02T03:04:05.000Z [qem: y]\n");
 }
 
 TEST_F(LineLogTest, SaysWhereItBeginsAndEnds)

@@ -199,6 +199,38 @@ TEST_F(TelnetLineTest, ABreakOfRfc2217LastsAQuarterOfASecondAndInputWaitsForItsE
     EXPECT_EQ(line->write("y", 1), 1U);
 }
 
+TEST_F(TelnetLineTest, ABreakBehindAFullConnectionLastsAsLongOnceItIsSent)
+{
+    bringUp();
+    wire.room = 3;
+    EXPECT_TRUE(line->sendBreak());
+    EXPECT_EQ(line->write("held", 4), 4U);
+    EXPECT_TRUE(line->sendBreak()) << "one is under way";
+    EXPECT_TRUE(line->wantsToWrite());
+    EXPECT_TRUE(line->advanceAt().isDisabled());
+    clock.advance(std::chrono::seconds(1));
+    wire.room = 1000;
+    EXPECT_TRUE(line->advance());
+    EXPECT_EQ(wire.written, "\xFF\xFA\x2C\x05\x05\xFF\xF0");
+    EXPECT_EQ(line->advanceAt(), PollDeadline(clock.steady() + std::chrono::milliseconds(250)));
+    clock.advance(std::chrono::milliseconds(250));
+    EXPECT_TRUE(line->advance());
+    EXPECT_EQ(wire.written, "\xFF\xFA\x2C\x05\x05\xFF\xF0\xFF\xFA\x2C\x05\x06\xFF\xF0held");
+}
+
+TEST_F(TelnetLineTest, ABreakThatWaitsToBeSentIsDroppedWithTheLine)
+{
+    bringUp();
+    wire.room = 0;
+    EXPECT_TRUE(line->sendBreak());
+    line->stop();
+    wire.room = 1000;
+    bringUp();
+    EXPECT_TRUE(line->advanceAt().isDisabled());
+    EXPECT_EQ(line->write("x", 1), 1U);
+    EXPECT_EQ(wire.written, "x");
+}
+
 TEST_F(TelnetLineTest, InputThatWaitsForTheEndOfABreakIsDroppedWithTheLine)
 {
     bringUp();
@@ -248,6 +280,26 @@ TEST_F(TelnetLineTest, APeerThatBreaksTheProtocolEndsTheLine)
     EXPECT_EQ(wire.stops, 1U) << "the connection is given up";
     EXPECT_EQ(wire.starts, 2U);
     EXPECT_TRUE(line->advance());
+    wire.toRead = "new";
+    EXPECT_EQ(readAll(), "new");
+}
+
+TEST_F(TelnetLineTest, WhatCameBeforeABreachOfTheProtocolIsRead)
+{
+    bringUp();
+    wire.toRead = "last words\xFF\xFA\x56\xFF\xF0lost";
+    std::array<char, 100> buffer;
+    const auto result = line->read(buffer.data(), buffer.size());
+    EXPECT_EQ(result.state, LineState::Data);
+    EXPECT_EQ(std::string(buffer.data(), result.length), "last words");
+    EXPECT_TRUE(line->advanceAt().isExpired(clock.steady())) << "nothing else would make anybody call the line again";
+    const std::string reason = "the peer compresses its data without agreement";
+    EXPECT_THAT([&] { line->advance(); }, ThrowsMessage<std::runtime_error>(StrEq(reason)));
+    EXPECT_EQ(line->read(buffer.data(), buffer.size()).state, LineState::Ended);
+    EXPECT_EQ(line->endReason(), reason);
+    line->start(7);
+    EXPECT_TRUE(line->advance());
+    EXPECT_TRUE(line->advanceAt().isDisabled());
     wire.toRead = "new";
     EXPECT_EQ(readAll(), "new");
 }

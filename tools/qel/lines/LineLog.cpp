@@ -27,6 +27,9 @@ void guarded(Operation&& operation) noexcept
     }
 }
 
+/// A line of output that could be taken for one of the server's gets a backslash.
+std::string notOurs(const std::string& line) { return line.rfind("[qel: ", 0) == 0 ? "\\" + line : line; }
+
 std::string errorText(int error)
 {
     std::array<char, 128> buffer{};
@@ -38,7 +41,7 @@ std::string errorText(int error)
 LineLog::LineLog(const std::string& directory, const std::string& name, std::uint64_t limit)
     : mRaw{RotatingFile(directory + "/" + name + ".raw", limit)}, mText{RotatingFile(directory + "/" + name + ".log",
                                                                                      limit)},
-      mLines([this](const std::string& line) QEL_NO_THREAD_SAFETY_ANALYSIS { pLine(line); })
+      mLines([this](const std::string& line) QEL_NO_THREAD_SAFETY_ANALYSIS { pLine(notOurs(line)); })
 {
     onEvent(0, "the log begins");
 }

@@ -15,6 +15,14 @@ constexpr char kDelete = '\x7F';
 
 bool isIn(char byte, char first, char last) { return byte >= first && byte <= last; }
 
+/// Bytes that follow the first one of a character in UTF-8; 0: it is not one, or has none.
+int bytesToFollow(unsigned char byte)
+{
+    if (byte >= 0xC2 && byte <= 0xDF) return 1;
+    if (byte >= 0xE0 && byte <= 0xEF) return 2;
+    return byte >= 0xF0 && byte <= 0xF4 ? 3 : 0;
+}
+
 } // namespace
 
 PlainLines::PlainLines(std::function<void(const std::string& line)> onLine) : mOnLine(std::move(onLine)) {}
@@ -68,6 +76,23 @@ PlainLines::State PlainLines::pAfterEscape(char byte) const
     return isIn(byte, ' ', '/') ? State::Intermediate : State::Text;
 }
 
+/// Whether a byte is one of the upper control characters, U+0080 to U+009F, which terminals obey as well: alone, or as
+/// the second byte of one in UTF-8. The first byte of that is taken back.
+bool PlainLines::pIsUpperControl(unsigned char byte)
+{
+    const bool isUpper = byte >= 0x80 && byte <= 0x9F;
+    if (byte < 0x80 || byte > 0xBF) {
+        mToFollow = bytesToFollow(byte);
+        mFirst = byte;
+        return false;
+    }
+    if (mToFollow == 0) return isUpper;
+    --mToFollow;
+    const bool isControl = isUpper && std::exchange(mFirst, 0) == 0xC2;
+    if (isControl && !mLine.empty()) mLine.pop_back();
+    return isControl;
+}
+
 void PlainLines::pText(char byte, const std::function<void()>& onBegin)
 {
     const bool endedByReturn = std::exchange(mEndedByReturn, false);
@@ -77,7 +102,7 @@ void PlainLines::pText(char byte, const std::function<void()>& onBegin)
     }
     if (byte == '\n' && endedByReturn) return; // of the same line end
     const bool isControl = (byte >= '\0' && byte < ' ' && byte != '\t' && byte != '\n') || byte == kDelete;
-    if (isControl) return;
+    if (isControl || pIsUpperControl(static_cast<unsigned char>(byte))) return;
     if (!std::exchange(mHasBegun, true)) onBegin();
     if (byte == '\n') return flush();
     mLine += byte;

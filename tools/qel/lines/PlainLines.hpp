@@ -8,7 +8,8 @@ namespace qel::tool {
 
 /// Turns the output of a terminal line into lines of plain text: control sequences and control characters are left out,
 /// tabs stay. A line ends with a line feed, with a carriage return that follows text, with both, or when it is kLongest
-/// bytes long. Bytes above 0x7F pass, so text in UTF-8 does.
+/// bytes long. Bytes above 0x7F pass, so text in UTF-8 does; but not the control characters U+0080 to U+009F, as bytes
+/// or in UTF-8.
 /// Thread safety: none of its own.
 class PlainLines {
 public:
@@ -35,6 +36,7 @@ private:
 
     void pText(char byte, const std::function<void()>& onBegin);
     State pAfterEscape(char byte) const;
+    bool pIsUpperControl(unsigned char byte);
     State pNext(char byte, const std::function<void()>& onBegin);
 
     const std::function<void(const std::string&)> mOnLine;
@@ -42,6 +44,8 @@ private:
     std::string mLine;
     bool mHasBegun = false;      ///< a byte of the line has come
     bool mEndedByReturn = false; ///< a carriage return has just ended a line
+    int mToFollow = 0;           ///< bytes of a character in UTF-8 that are missing
+    unsigned char mFirst = 0;    ///< the byte before, if a character in UTF-8 may begin with it
 };
 
 } // namespace qel::tool

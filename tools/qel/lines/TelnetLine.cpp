@@ -7,6 +7,7 @@
 
 #include <algorithm>
 #include <chrono>
+#include <stdexcept>
 #include <string>
 #include <utility>
 
@@ -43,6 +44,7 @@ public:
 
     bool advance() override
     {
+        if (!mReason.empty()) throw std::runtime_error(mReason); // read() has passed on what came before it
         if (!mConnection->advance()) return false;
         const auto now = TimeProvider::steady();
         if (mCodec == nullptr) {
@@ -63,27 +65,34 @@ public:
         return mConnection->wantsToWrite() || (mCodec != nullptr && !mCodec->output().empty());
     }
 
-    PollDeadline advanceAt() const override { return std::min({mConnection->advanceAt(), mBreakEnd, mAgreementEnd}); }
+    PollDeadline advanceAt() const override
+    {
+        return std::min({mConnection->advanceAt(), mBreakEnd, mAgreementEnd, mBroken});
+    }
 
     ReadResult read(char* buffer, std::size_t length) override
     {
+        if (!mReason.empty()) return {LineState::Ended, 0};
         const ReadResult result = mConnection->read(buffer, length);
         if (result.state == LineState::Ended) mHasEnded = true;
         if (result.state != LineState::Data) return result;
         const std::string data = mCodec->receive(buffer, result.length);
         mReason = mCodec->failure();
-        if (!mReason.empty() || data.size() > length) {
+        const bool isBroken = !mReason.empty() || data.size() > length;
+        if (isBroken) {
             mHasEnded = true;
-            return {LineState::Ended, 0};
+            if (data.empty() || data.size() > length) return {LineState::Ended, 0};
+            mBroken = TimeProvider::steady(); // the connection may have nothing more that would make it readable
+        } else {
+            pFlush();
         }
-        pFlush();
         data.copy(buffer, length);
         return {data.empty() ? LineState::Idle : LineState::Data, data.size()};
     }
 
     std::size_t write(const char* data, std::size_t length) override
     {
-        if (!mBreakEnd.isDisabled()) { // it would be lost in the break
+        if (pIsBreaking()) { // it would be lost in the break
             const std::size_t taken = std::min(length, kMaxHeld - mHeld.size());
             mHeld.append(data, taken);
             return taken;
@@ -102,13 +111,15 @@ public:
 
     bool sendBreak() override
     {
-        if (!mBreakEnd.isDisabled()) return true; // one is under way
-        if (mCodec->beginBreak()) mBreakEnd = TimeProvider::steady() + kBreakTime;
+        if (pIsBreaking()) return true; // one is under way
+        mIsBreakQueued = mCodec->beginBreak();
         pFlush();
         return true;
     }
 
 private:
+    bool pIsBreaking() const { return mIsBreakQueued || !mBreakEnd.isDisabled(); }
+
     void pEndBreak()
     {
         mBreakEnd = PollDeadline();
@@ -124,13 +135,17 @@ private:
             if (taken == 0) return;
             output.erase(0, taken);
         }
+        // Counted from now on: behind a full connection the end of the break would go out together with its beginning.
+        if (std::exchange(mIsBreakQueued, false)) mBreakEnd = TimeProvider::steady() + kBreakTime;
     }
 
     void pForget()
     {
         mCodec.reset();
+        mIsBreakQueued = false;
         mBreakEnd = PollDeadline();
         mAgreementEnd = PollDeadline();
+        mBroken = PollDeadline();
         mHeld.clear();
         mReason.clear();
         mHasEnded = false;
@@ -140,9 +155,11 @@ private:
     const std::optional<SerialSettings> mSettings;
     std::string mName;                   // for the log
     std::unique_ptr<TelnetCodec> mCodec; // of this connection; null: it is not made yet
+    bool mIsBreakQueued = false;         // the beginning of a break waits to be sent
     PollDeadline mBreakEnd;              // enabled: a break is under way
     PollDeadline mAgreementEnd;          // enabled: the peer has time left to agree to the settings
     std::string mHeld;                   // input for after the break
+    PollDeadline mBroken;                // enabled: when the peer has broken the protocol, after other data
     std::string mReason;                 // how the peer has broken the protocol
     bool mHasEnded = false;              // read() has said so
 };

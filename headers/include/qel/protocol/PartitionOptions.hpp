@@ -46,7 +46,8 @@ struct PartitionOptions {
     /// For a line to something that breaks and comes back, such as a socket or a device. The line is brought up when
     /// the server starts, and again when it is lost: after 1 s, then after twice the time, up to 30 s; 1 s again once
     /// it has been up for 5 s. Its sessions stay open meanwhile, and their data say when the line is lost and when it
-    /// is back. What is typed while it is down is dropped. `start` and `restart` do not apply.
+    /// is back. What is typed from the loss until then is dropped, and the session is told. `start` and `restart` do
+    /// not apply.
     bool keepsSession = false;
 
     std::shared_ptr<SerialTap> tap; ///< listens to the output; may be null
