@@ -108,9 +108,10 @@ std::string TestConsole::readUntil(std::uint16_t partition, const std::string& t
         if (keepData(*message) || message->getOperation() == QelMessageOpOutboundBroadcastAsync) continue;
         throw std::runtime_error("no data, after: " + mData);
     }
-    std::string all;
-    all.swap(mData);
-    return all;
+    const std::size_t end = mData.find(text) + text.size();
+    std::string found = mData.substr(0, end);
+    mData.erase(0, end);
+    return found;
 }
 
 unsigned int TestConsole::awaitClosed(std::uint16_t partition)

@@ -65,8 +65,8 @@ public:
 
     void type(std::uint16_t partition, const std::string& text);
 
-    /// Reads serial data until they contain the text; broadcasts in between are dropped. @return all serial data since
-    /// the last call
+    /// Reads serial data until they contain the text; broadcasts in between are dropped. @return the serial data
+    /// since the last call, up to the end of the text; the next call gets what follows
     std::string readUntil(std::uint16_t partition, const std::string& text);
 
     /// Takes messages until a session-closed notice. @return its reason
