@@ -195,8 +195,10 @@ PollDeadline Partition::pNextStep(TimePoint now) const
     case State::Down:
         return mStartAt;
     case State::ComingUp:
-    case State::Up:
-        return std::min(mLine.advanceAt(), mTurns.pauseEnd());
+    case State::Up: {
+        const PollDeadline look = pMayHoldRestart() ? PollDeadline(now + kStallInterval) : PollDeadline();
+        return std::min({mLine.advanceAt(), mTurns.pauseEnd(), look});
+    }
     case State::Ended:
         break;
     }
@@ -237,6 +239,28 @@ void Partition::serviceTime(TimePoint now)
     } else if ((mState == State::Up || mState == State::ComingUp) && mLine.advanceAt().isExpired(now)) {
         if (!pAdvance()) pFail();
     }
+    if (mState == State::Up) pCheckStall(now);
+}
+
+/// Whether the console on number 0 does not read, so that the end of a command that is to be started again would not be
+/// noticed.
+bool Partition::pMayHoldRestart() const
+{
+    constexpr std::uint16_t kTyping = PartitionSessions::kTyping;
+    return mState == State::Up && !mOptions.keepsSession && mOptions.restart != RestartLine::Never &&
+           mSessions.isSetUp(kTyping) && !mSessions.hasRoom(kTyping);
+}
+
+/// A console that does not read, such as a suspended one, must not keep a service down: after a time the rest of the
+/// output is read without it, and it is told how much it has missed.
+void Partition::pCheckStall(TimePoint now)
+{
+    if (!pMayHoldRestart() || !mLine.hasHungUp()) {
+        mGiveUpBy = PollDeadline();
+        return;
+    }
+    if (mGiveUpBy.isDisabled()) mGiveUpBy = now + kStallTimeout;
+    if (mGiveUpBy.isExpired(now)) pDrain();
 }
 
 /// Brings the line up for a console that opens a session.
@@ -326,6 +350,7 @@ void Partition::pBeginExit()
     mState = State::Ended;
     mEvents.changed = true;
     mExitBy = now + kExitTimeout;
+    if (mGiveUpBy.isDisabled() && mOptions.restart != RestartLine::Never) mGiveUpBy = now + kStallTimeout;
     mSetUpBy = now + kSetUpTimeout;
     pFinishExit(now);
 }
@@ -333,7 +358,7 @@ void Partition::pBeginExit()
 /// Whether the sessions have got what they wait for.
 bool Partition::pMayFinishExit(TimePoint now) const
 {
-    if (!mSessions.isCaughtUp(PartitionSessions::kTyping)) return false;
+    if (!mSessions.isCaughtUp(PartitionSessions::kTyping) && !mGiveUpBy.isExpired(now)) return false;
     return mSessions.areAllSetUp() || mSetUpBy.isExpired(now);
 }
 
@@ -378,7 +403,7 @@ void Partition::pStopLine()
     mInput.clear();
     mIsDraining = false;
     mTurns = FruitlessTurns();
-    mStartAt = mExitBy = mSetUpBy = PollDeadline();
+    mStartAt = mExitBy = mSetUpBy = mGiveUpBy = PollDeadline();
     mEvents.changed = true;
     mLine.stop();
     if (wasFull) mSessions.resumeTyping();

@@ -44,6 +44,10 @@ public:
     static constexpr std::chrono::milliseconds kExitInterval{5};
     /// How long an ended line waits for sessions that are open and not set up yet: a short command may end in between.
     static constexpr std::chrono::seconds kSetUpTimeout{10};
+    /// How long a command that has ended, and is to be started again, waits for the console on number 0 to read.
+    static constexpr std::chrono::seconds kStallTimeout{10};
+    /// How often to look whether the line of a console that does not read has hung up.
+    static constexpr std::chrono::seconds kStallInterval{1};
     /// How much larger than its limit the history may become for what the session that types has not got.
     static constexpr std::size_t kMostExtraHistory = 16 * 1024;
     /// How often to try to tell what there was no memory for.
@@ -120,6 +124,8 @@ private:
     void pStopLine();
     void pScheduleStart(RestartPause::Duration wasUp);
     void pTakeTurn();
+    bool pMayHoldRestart() const;
+    void pCheckStall(TimePoint now);
     void pPumpInput();
     bool pReadOutput();
     void pDrain();
@@ -152,6 +158,7 @@ private:
     std::string mOwedNote;    ///< the newest line of the program's own that there was no memory for
     PollDeadline mStartAt;    ///< when to bring the line up; disabled: nothing is planned
     PollDeadline mExitBy;     ///< of a line that has ended, for its command to end
+    PollDeadline mGiveUpBy;   ///< of a line that has hung up, for the console on number 0 to read
     PollDeadline mSetUpBy;    ///< of a line that has ended, for its sessions to be set up
     RestartPause mPause;
     FruitlessTurns mTurns;

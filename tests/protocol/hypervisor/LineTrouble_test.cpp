@@ -177,6 +177,52 @@ TEST_F(LineTroubleTest, ABreakThatCannotBeSentIsLoggedAndIsNotTheReasonOfALaterE
     EXPECT_THAT(log.lines(), ElementsAre("W: [qel] partition 1: line lost: it has ended; connecting again"));
 }
 
+TEST_F(LineTroubleTest, AConsoleThatDoesNotReadKeepsACommandFromStartingAgainForTenSeconds)
+{
+    serveWith(boot(RestartLine::Always));
+    hypervisor->serviceLines();
+    Peer peer;
+    setUpSerial(peer, "a", 1);
+    peer.link.serialRoom = false;
+    port1->output = {std::string(4096, 'x'), "missed"};
+    EXPECT_EQ(hypervisor->serviceLines(), seconds(1)); // nothing else would make the server look
+    clock.advance(seconds(100));
+    hypervisor->serviceLines();
+    EXPECT_EQ(port1->reads, 0U); // it runs, and waits for the console
+    port1->ended = true;
+    port1->end = CommandEnd{Kind::Exited, 3};
+    hypervisor->serviceLines();
+    clock.advance(milliseconds(9999));
+    hypervisor->serviceLines();
+    EXPECT_EQ(port1->stopped, 0U);
+    clock.advance(milliseconds(1));
+    hypervisor->serviceLines();
+    EXPECT_EQ(port1->stopped, 1U);
+    EXPECT_EQ(takeData(peer, 1), "\r\n[qel: 4102 bytes skipped]\r\n");
+    expectClosed(peer, 1, 4, 0x0103);
+    port1->ended = false;
+    expectStartAfter(seconds(1));
+}
+
+TEST_F(LineTroubleTest, AConsoleThatReadsInTimeMissesNothingOfACommandThatStartsAgain)
+{
+    serveWith(boot(RestartLine::Always));
+    hypervisor->serviceLines();
+    Peer peer;
+    setUpSerial(peer, "a", 1);
+    peer.link.serialRoom = false;
+    port1->output = {"last words"};
+    port1->ended = true;
+    hypervisor->serviceLines();
+    clock.advance(milliseconds(9999));
+    hypervisor->serviceLines();
+    peer.link.serialRoom = true;
+    hypervisor->serviceSerial(1);
+    hypervisor->serviceSerial(1);
+    EXPECT_EQ(takeData(peer, 1), "last words");
+    expectClosed(peer, 1, 4, 0x0100);
+}
+
 // Lines whose descriptor is ready although nothing can be moved.
 
 TEST_F(LineTroubleTest, ALineWithWhichNothingMovesIsLeftAloneForAMoment)
