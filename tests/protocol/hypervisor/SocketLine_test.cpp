@@ -12,6 +12,7 @@
 
 #include <cerrno>
 #include <chrono>
+#include <fcntl.h>
 #include <future>
 #include <gmock/gmock.h>
 #include <memory>
@@ -136,6 +137,14 @@ TEST_F(UnixLine, IsIdleWithNothingToRead)
     EXPECT_FALSE(line->hasHungUp());
     EXPECT_FALSE(line->wantsToWrite());
     EXPECT_TRUE(line->advanceAt().isDisabled());
+}
+
+TEST_F(UnixLine, IsNotInheritedByCommands)
+{
+    UnixListener listener(mPath);
+    const auto line = unixLine(mPath);
+    LineDriver(*line).bringUp();
+    EXPECT_EQ(::fcntl(line->descriptor(), F_GETFD), FD_CLOEXEC);
 }
 
 TEST_F(UnixLine, StartingALineThatIsUpChangesNothing)

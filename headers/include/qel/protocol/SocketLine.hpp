@@ -35,7 +35,8 @@ QEL_PROTOCOL_EXPORT std::unique_ptr<SerialLine> unixLine(const std::string& path
 /// The serial line that is a TCP connection to a host, by name or by IP address: its bytes are those of the line, as a
 /// terminal server sends them on a raw port. A peer that is gone without a word is noticed within about a minute.
 /// @param address  as ServerAddress::parse() takes it: "terminals.example:4001", "192.0.2.7:4001" or "[::1]:4001". All
-///         addresses of a name are tried in turn, and looked up again for each connection
+///         addresses of a name are tried in turn, and looked up again for each connection; an answer that comes after
+///         its 10 s serves the next one
 /// @throws std::invalid_argument  as ServerAddress::parse()
 QEL_PROTOCOL_EXPORT std::unique_ptr<SerialLine> tcpLine(const std::string& address);
 
