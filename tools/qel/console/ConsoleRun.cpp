@@ -343,7 +343,7 @@ ExitStatus ConsoleRun::pStatusOf(SessionEnd end) const
 
 std::string ConsoleRun::pLeftText(const ConsoleLoop::Outcome& outcome) const
 {
-    const std::string text = filled(texts::kLeft, {std::to_string(mOptions.partition)});
+    std::string text = filled(texts::kLeft, {std::to_string(mOptions.partition)});
     if (outcome.thrownAway == 0) return text;
     return text + filled(texts::kThrownAway, {std::to_string(outcome.thrownAway)});
 }

@@ -62,7 +62,7 @@ std::string EscapeFilter::help(const std::string& lineEnd) const
     };
     std::string list = texts::kHelpTitle + lineEnd;
     for (const Row& each : kRows)
-        list += row(escape + characterName(each.key), each.help) + lineEnd;
+        list.append(row(escape + characterName(each.key), each.help)).append(lineEnd);
     return list + row(escape + escape, filled(texts::kHelpEscape, {escape}));
 }
 

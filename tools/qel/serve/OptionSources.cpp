@@ -51,7 +51,7 @@ std::string valueText(const CLI::Option& option, const std::string& value)
 std::string settingText(const CLI::Option& option)
 {
     if (isFlag(option)) return option.count() > 0 && !isFalse(option.results().front()) ? "true" : "false";
-    const std::vector<std::string> given = option.results();
+    const std::vector<std::string>& given = option.results();
     if (!isList(option)) {
         const std::string value = given.empty() ? option.get_default_str() : given.back();
         return given.empty() && value.empty() ? std::string() : valueText(option, value);
@@ -116,7 +116,7 @@ std::vector<std::string> OptionSources::words() const
         const bool isGiven = mOthers.count(key) != 0 || (origin != mOrigins.end() && origin->second == "option");
         if (!isGiven) continue;
         for (const std::string& value : option->results()) {
-            if (!value.empty()) words.push_back("--" + key + "=" + value);
+            if (!value.empty()) words.push_back(std::string("--").append(key).append("=").append(value));
         }
     }
     return words;

@@ -164,7 +164,7 @@ AccessRight readRights(const TomlEntry& entry)
     AccessRight rights = AccessRight::None;
     std::vector<std::string> names;
     for (const RightName& known : kRights)
-        names.push_back(known.name);
+        names.emplace_back(known.name);
     for (const TomlValue* item : itemsOf(entry)) {
         const auto found = std::find(names.begin(), names.end(), item->text);
         if (item->kind != TomlValue::Kind::Text || found == names.end()) {

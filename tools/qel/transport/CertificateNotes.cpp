@@ -42,7 +42,8 @@ std::vector<std::string> clientNotes(const TransportOptions& options, SSLValidit
     if (options.plain) return {};
     std::vector<std::string> notes = expiryNotes(options.paths(), now, kClientNotice);
     if (options.pins.names.empty() && options.pins.fingerprints.empty()) {
-        notes.push_back("any certificate of the root may be the server: --peer-name or --peer-fingerprint says which");
+        notes.emplace_back(
+            "any certificate of the root may be the server: --peer-name or --peer-fingerprint says which");
     }
     return notes;
 }
