@@ -6,6 +6,7 @@
 #include "support/Bytes.hpp"
 #include "support/CapturedLog.hpp"
 #include "support/RawFrame.hpp"
+#include "support/RegistryFrames.hpp"
 
 #include <array>
 #include <gmock/gmock.h>
@@ -22,6 +23,9 @@ namespace qel {
 namespace {
 
 using test::CapturedLog;
+using test::classOf;
+using test::deserialize;
+using test::frameOfIdentity;
 using test::heapCopy;
 using test::RawFrame;
 using testing::ElementsAre;
@@ -32,20 +36,6 @@ using testing::ThrowsMessage;
 
 using Classification = QelMessageClassification;
 using Identifier = QelMessageRegistry::Identifier;
-
-std::unique_ptr<QelMessage> deserialize(const QelMessageRegistry& registry, const std::vector<char>& frame)
-{
-    return registry.deserialize(heapCopy(frame).get(), static_cast<unsigned int>(frame.size()));
-}
-
-const std::type_info& classOf(const QelMessage& message) { return typeid(message); }
-
-RawFrame frameOfIdentity(const Identifier& identity)
-{
-    RawFrame frame = RawFrame::newForm();
-    frame.callerId(0x1234).function(std::get<0>(identity)).operation(std::get<1>(identity));
-    return frame.flags(Classification::toFlags(std::get<2>(identity)));
-}
 
 class Example : public QelMessageMetadata<Example, QelMessageFunctionQelKrog, QelMessageOpRunMacro,
                                           QelMessageClassification::Request> {

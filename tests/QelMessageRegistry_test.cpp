@@ -9,6 +9,7 @@
 #include "support/CapturedLog.hpp"
 #include "support/MessageProbe.hpp"
 #include "support/RawFrame.hpp"
+#include "support/RegistryFrames.hpp"
 
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
@@ -25,7 +26,10 @@ namespace {
 
 using test::bytes;
 using test::CapturedLog;
+using test::classOf;
+using test::deserialize;
 using test::frameOf;
+using test::frameOfIdentity;
 using test::heapCopy;
 using test::hex;
 using test::RawFrame;
@@ -36,20 +40,6 @@ using testing::ThrowsMessage;
 
 using Classification = QelMessageClassification;
 using Identifier = QelMessageRegistry::Identifier;
-
-std::unique_ptr<QelMessage> deserialize(const QelMessageRegistry& registry, const std::vector<char>& frame)
-{
-    return registry.deserialize(heapCopy(frame).get(), static_cast<unsigned int>(frame.size()));
-}
-
-const std::type_info& classOf(const QelMessage& message) { return typeid(message); }
-
-RawFrame frameOfIdentity(const Identifier& identity)
-{
-    RawFrame frame = RawFrame::newForm();
-    frame.callerId(0x1234).function(std::get<0>(identity)).operation(std::get<1>(identity));
-    return frame.flags(Classification::toFlags(std::get<2>(identity)));
-}
 
 // --- which class each identity becomes
 

@@ -27,7 +27,8 @@ namespace qel::protocol {
 /// PartitionOptions::keepsSession says whether the sessions survive the end of the line, and that it is started again.
 ///
 /// No operation may block: one lock is held for all consoles and partitions. Whatever an operation throws is logged,
-/// and the operation has failed: the session ends, or the request of the console is answered with status 6.
+/// and the operation has failed: the session ends, or the request of the console is answered with status 6. With
+/// PartitionOptions::keepsSession the session goes on, and the line is brought up again.
 /// Thread safety: none needed; one operation is called at a time, from several threads.
 class QEL_PROTOCOL_EXPORT SerialLine {
 public:
