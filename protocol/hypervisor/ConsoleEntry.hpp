@@ -1,10 +1,14 @@
 #pragma once
 
+#include <qel/common/util/Poll.hpp>
+#include <qel/protocol/DisconnectReason.hpp>
 #include <qel/protocol/Peer.hpp>
 
 #include "hypervisor/ConsoleLink.hpp"
 
+#include <chrono>
 #include <cstdint>
+#include <optional>
 #include <utility>
 
 namespace qel::protocol {
@@ -28,6 +32,10 @@ struct ConsoleEntry {
     ConsoleState state = ConsoleState::Connected;
     bool sessionOpen = false; ///< the hypervisor session
     bool announced = false;   ///< Hypervisor::onConnected() has been called
+
+    std::chrono::steady_clock::time_point heardAt; ///< its newest message that counts; used with an idle limit only
+    std::optional<DisconnectReason> end;           ///< why the hypervisor has ended the connection; empty: it has not
+    PollDeadline cutAt;                            ///< of a console that is let go: to take what is queued for it
 };
 
 } // namespace qel::protocol

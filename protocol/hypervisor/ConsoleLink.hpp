@@ -37,6 +37,9 @@ public:
 
     /// Ends the connection once everything posted has gone out. Nothing more is posted.
     virtual void finish() = 0;
+
+    /// Ends the connection at once: the console has not taken what was posted before finish().
+    virtual void cut() = 0;
 };
 
 } // namespace qel::protocol

@@ -59,6 +59,6 @@ void Hypervisor::onConnected(const Peer&) {}
 
 void Hypervisor::onAnswered(const Peer&, const QelMessage&, QelMessageStatusCodes) {}
 
-void Hypervisor::onDisconnected(const Peer&) {}
+void Hypervisor::onDisconnected(const Peer&, DisconnectReason) {}
 
 } // namespace qel::protocol

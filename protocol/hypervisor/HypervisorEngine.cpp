@@ -52,8 +52,9 @@ QelCapabilities intersection(const QelCapabilities& left, const QelCapabilities&
 
 } // namespace
 
-HypervisorEngine::HypervisorEngine(Hypervisor& machine, std::uint8_t maxConsoles, std::function<void()> wakeSerial)
-    : mMachine(machine), mMaxConsoles(maxConsoles), mWakeSerial(std::move(wakeSerial))
+HypervisorEngine::HypervisorEngine(Hypervisor& machine, std::uint8_t maxConsoles, std::function<void()> wakeSerial,
+                                   IdleLimits idle)
+    : mMachine(machine), mMaxConsoles(maxConsoles), mWakeSerial(std::move(wakeSerial)), mIdle(idle)
 {
     const MutexLock lock(mMutex);
     for (const auto& entry : mMachine.mImpl->partitions)
@@ -86,6 +87,7 @@ Received HypervisorEngine::receive(ConsoleId id, const QelMessage& message)
     if (found == mConsoles.end()) return {ConsoleState::Closing, true};
     ConsoleEntry& console = found->second;
     if (console.state == ConsoleState::Closing) return {console.state, pMayReceive(console)};
+    pNoteHeard(console, message);
     switch (message.getClassification()) {
     case QelMessageClassification::Request:
         pHandleRequest(console, message);
@@ -114,42 +116,9 @@ bool HypervisorEngine::takesConsoles() const
     return !mShutDown && mIdentified.size() < mMaxConsoles;
 }
 
-void HypervisorEngine::disconnect(ConsoleId id)
-{
-    const DeferredWakeUps wakeUps; // until the lock is released
-    const MutexLock lock(mMutex);
-    const auto found = mConsoles.find(id);
-    if (found == mConsoles.end()) return;
-    ConsoleEntry& console = found->second;
-    mPartitions.release(console);
-    if (console.announced) {
-        static_cast<void>(runGuarded([&] { mMachine.onDisconnected(console.peer); }, "console ", id));
-    }
-    pForgetIdentified(console);
-    mConsoles.erase(found);
-    logLine(LogLevel::Info, "console ", id, " disconnected");
-    mWakeSerial();
-}
-
 void HypervisorEngine::outputDrained()
 {
     const MutexLock lock(mMutex);
-    mWakeSerial();
-}
-
-void HypervisorEngine::shutDown()
-{
-    const DeferredWakeUps wakeUps; // until the lock is released
-    const MutexLock lock(mMutex);
-    mShutDown = true;
-    mPartitions.shutDown();
-    for (auto& entry : mConsoles) {
-        ConsoleEntry& console = entry.second;
-        if (console.state == ConsoleState::Identified) {
-            console.link.post(std::make_unique<QelMessageKrogConnectionClosedAsync>());
-        }
-        if (console.state != ConsoleState::Closing) pClose(console);
-    }
     mWakeSerial();
 }
 
@@ -177,7 +146,8 @@ std::chrono::milliseconds HypervisorEngine::serviceLines()
         const MutexLock lock(mMutex);
         const auto now = TimeProvider::steady();
         mPartitions.serviceTime(now);
-        timeout = mPartitions.nextDeadline(now).getTimeout(now);
+        if (mLookAtIdle.isExpired(now)) pServiceIdle(now);
+        timeout = std::min(mPartitions.nextDeadline(now), mLookAtIdle).getTimeout(now);
         static_cast<void>(mPartitions.takeChanged()); // the caller asks for the watches next
     }
     pTellTaps();
@@ -361,6 +331,7 @@ void HypervisorEngine::pHandleNotice(ConsoleEntry& console, const QelMessage& no
 void HypervisorEngine::pRefuseUpgrade(ConsoleEntry& console)
 {
     logLine(LogLevel::Warn, "console ", console.peer.id, ": closed, it asked for TLS, which is not done here");
+    console.end = DisconnectReason::Protocol;
     console.link.post(std::make_unique<QelMessageAbortHandshakeAsync>());
     pClose(console);
 }
@@ -409,6 +380,7 @@ HypervisorEngine::Reply HypervisorEngine::pVersion(ConsoleEntry& console,
         machine.serialNumber);
     mIdentified.emplace(ToolName(request.getToolType(), request.getToolId()), &console);
     console.state = ConsoleState::Identified;
+    pNoteHeard(console, request);
     return response;
 }
 
@@ -570,11 +542,6 @@ ConsoleEntry* HypervisorEngine::pFindIdentified(const ToolName& name)
     return found == mIdentified.end() ? nullptr : found->second;
 }
 
-void HypervisorEngine::pForgetIdentified(const ConsoleEntry& console)
-{
-    if (console.state == ConsoleState::Identified) mIdentified.erase({console.peer.toolType, console.peer.toolId});
-}
-
 /// @return false: the console's queue is full, and it did not get the broadcast
 bool HypervisorEngine::pSendBroadcast(ConsoleEntry& to, const ConsoleEntry& from,
                                       const QelMessageDaxBroadcastReq& request)
@@ -585,13 +552,6 @@ bool HypervisorEngine::pSendBroadcast(ConsoleEntry& to, const ConsoleEntry& from
     }
     logLine(LogLevel::Warn, "console ", to.peer.id, ": too slow for a broadcast of console ", from.peer.id);
     return false;
-}
-
-void HypervisorEngine::pClose(ConsoleEntry& console)
-{
-    pForgetIdentified(console);
-    console.state = ConsoleState::Closing;
-    console.link.finish();
 }
 
 } // namespace qel::protocol

@@ -4,6 +4,7 @@
 #include <qel/common/QelMessageInterfaceComponent.hpp>
 #include <qel/common/QelMessageVirtualSerial.hpp>
 #include <qel/common/util/Mutex.hpp>
+#include <qel/common/util/Poll.hpp>
 #include <qel/protocol/Hypervisor.hpp>
 
 #include "hypervisor/ConsoleEntry.hpp"
@@ -28,6 +29,12 @@ struct Received {
     bool mayReadNext;
 };
 
+/// When a console that says nothing is let go.
+struct IdleLimits {
+    std::chrono::steady_clock::duration timeout{0};                      ///< after its newest message; 0: never
+    std::chrono::steady_clock::duration linger{std::chrono::seconds(2)}; ///< to take what is queued for it
+};
+
 /// The logic of the hypervisor end, without input or output: which response each request gets, and which console holds
 /// which session. Messages come in through receive(); responses and notices go out through the consoles' links, serial
 /// data through the partitions' lines. What is specific to a machine it asks the user's Hypervisor; what that throws is
@@ -45,7 +52,8 @@ public:
     /// @param maxConsoles  identified at a time; more than 0
     /// @param wakeSerial  called, with the lock held, when serialWatches() may have changed
     /// @throws std::logic_error  another engine serves the machine
-    HypervisorEngine(Hypervisor& machine, std::uint8_t maxConsoles, std::function<void()> wakeSerial);
+    HypervisorEngine(Hypervisor& machine, std::uint8_t maxConsoles, std::function<void()> wakeSerial,
+                     IdleLimits idle = {});
 
     /// Takes the partitions' lines down. All connections must have been disconnected.
     ~HypervisorEngine();
@@ -69,7 +77,8 @@ public:
     bool takesConsoles() const;
 
     /// Forgets a connection; its sessions end. Its link is not called afterwards. Unknown ids are ignored.
-    void disconnect(ConsoleId id);
+    /// @param why  as far as the connection knows: a reason of the hypervisor's own comes first
+    void disconnect(ConsoleId id, DisconnectReason why = DisconnectReason::Closed);
 
     /// To be called when a link has room again.
     void outputDrained();
@@ -85,7 +94,7 @@ public:
     /// the lock.
     void serviceSerial(std::uint16_t partition);
 
-    /// Does what is due on all partitions: see PartitionSet::serviceTime().
+    /// Does what is due on all partitions, see PartitionSet::serviceTime(), and lets consoles go that say nothing.
     /// @return when to call it again at the latest: from now; negative: when serialWatches() have changed
     std::chrono::milliseconds serviceLines();
 
@@ -100,6 +109,7 @@ public:
 
 private:
     using Reply = std::unique_ptr<QelMessage>;
+    using TimePoint = std::chrono::steady_clock::time_point;
     /// The type and the id of a console's tool.
     using ToolName = std::pair<std::uint32_t, std::string>;
     /// The identity of a request: function and operation.
@@ -158,10 +168,15 @@ private:
         QEL_REQUIRES(mMutex);
     void pRefuseUpgrade(ConsoleEntry& console) QEL_REQUIRES(mMutex);
     void pClose(ConsoleEntry& console) QEL_REQUIRES(mMutex);
+    void pNoteHeard(ConsoleEntry& console, const QelMessage& message) QEL_REQUIRES(mMutex);
+    void pServiceIdle(TimePoint now) QEL_REQUIRES(mMutex);
+    PollDeadline pServiceIdle(ConsoleEntry& console, TimePoint now) QEL_REQUIRES(mMutex);
+    void pLetGo(ConsoleEntry& console, TimePoint now) QEL_REQUIRES(mMutex);
 
     Hypervisor& mMachine;
     const std::uint8_t mMaxConsoles;
     const std::function<void()> mWakeSerial;
+    const IdleLimits mIdle;
 
     mutable Mutex mMutex;
     PartitionSet mPartitions QEL_GUARDED_BY(mMutex);
@@ -171,6 +186,7 @@ private:
     std::map<ToolName, ConsoleEntry*> mIdentified QEL_GUARDED_BY(mMutex);
     ConsoleId mLastConsoleId QEL_GUARDED_BY(mMutex) = 0;
     bool mShutDown QEL_GUARDED_BY(mMutex) = false;
+    PollDeadline mLookAtIdle QEL_GUARDED_BY(mMutex); // not later than a console is to be let go or cut
 };
 
 } // namespace qel::protocol

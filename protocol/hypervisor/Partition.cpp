@@ -116,6 +116,11 @@ bool Partition::pIsFirstStartDue() const
     return mState == State::Down && mOptions.keepsSession && !mIsLost && !mStartAt.isDisabled();
 }
 
+void Partition::endSessionsOf(const ConsoleEntry& console, const std::string& why)
+{
+    if (mSessions.endAllOf(console, why)) mEvents.changed = true;
+}
+
 void Partition::release(const ConsoleEntry& console)
 {
     if (mSessions.dropAllOf(console)) mEvents.changed = true;

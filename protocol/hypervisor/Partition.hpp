@@ -73,6 +73,7 @@ public:
     QelMessageStatusCodes setUp(ConsoleEntry& console, std::uint16_t number);
     QelMessageStatusCodes close(ConsoleEntry& console, std::uint16_t number, bool force);
     bool feed(const ConsoleEntry& console, std::uint16_t number, const char* data, std::size_t length);
+    void endSessionsOf(const ConsoleEntry& console, const std::string& why);
     void release(const ConsoleEntry& console);
     bool mayAddInput(const ConsoleEntry& console) const;
 

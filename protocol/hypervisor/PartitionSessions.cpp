@@ -24,7 +24,10 @@ std::unique_ptr<QelMessage> closedNotice(const QelMessageVirtualSerialSessionClo
     return detailed;
 }
 
-std::string skippedText(std::uint64_t bytes) { return "\r\n[qel: " + std::to_string(bytes) + " bytes skipped]\r\n"; }
+/// A line of the program's own.
+std::string noteText(const std::string& text) { return "\r\n[qel: " + text + "]\r\n"; }
+
+std::string skippedText(std::uint64_t bytes) { return noteText(std::to_string(bytes) + " bytes skipped"); }
 
 } // namespace
 
@@ -99,6 +102,21 @@ void PartitionSessions::endAll(CloseReason reason, const CommandEnd& end)
         pEnd(mSessions.begin(), reason, end);
 }
 
+bool PartitionSessions::endAllOf(const ConsoleEntry& console, const std::string& why)
+{
+    const std::string line = noteText(why);
+    bool isAny = false;
+    for (auto next = mSessions.begin(); next != mSessions.end();) {
+        const auto session = next++;
+        if (session->second.console != &console) continue;
+        isAny = true;
+        pFinish(session->first, session->second);
+        if (session->second.isSetUp) console.link.post(pMessage(session->first, line.data(), line.size()));
+        pEnd(session, CloseReason::CloseReasonForceClose, {});
+    }
+    return isAny;
+}
+
 std::size_t PartitionSessions::unseenBytes(std::uint16_t number) const
 {
     const auto found = mSessions.find(number);
@@ -110,7 +128,7 @@ void PartitionSessions::refuseInput(std::uint16_t number, const char* answer)
 {
     Session& session = mSessions.at(number);
     if (session.isWarned) return;
-    session.aside += std::string("\r\n[qel: ") + answer + "]\r\n";
+    session.aside += noteText(answer);
     session.isWarned = true;
 }
 

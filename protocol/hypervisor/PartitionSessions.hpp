@@ -66,6 +66,10 @@ public:
     /// Ends all sessions with notices.
     void endAll(CloseReason reason, const CommandEnd& end = {});
 
+    /// Ends the sessions of a console with a line in their data, and the notice of a forced close.
+    /// @return whether there were any
+    bool endAllOf(const ConsoleEntry& console, const std::string& why);
+
     /// Bytes of the history that a session has still to get; 0 when there is none, or it is not set up.
     std::size_t unseenBytes(std::uint16_t number) const;
 

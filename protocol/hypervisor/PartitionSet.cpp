@@ -83,6 +83,12 @@ bool PartitionSet::feed(const ConsoleEntry& console, const QelMessageVirtualSeri
            partition->feed(console, data.getVssConnectionNumber(), data.getSerialData(), data.getSerialDataLength());
 }
 
+void PartitionSet::endSessionsOf(const ConsoleEntry& console, const std::string& why)
+{
+    for (auto& entry : mPartitions)
+        entry.second.endSessionsOf(console, why);
+}
+
 void PartitionSet::release(const ConsoleEntry& console)
 {
     for (auto& entry : mPartitions)

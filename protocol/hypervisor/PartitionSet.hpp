@@ -13,6 +13,7 @@
 #include <cstddef>
 #include <cstdint>
 #include <map>
+#include <string>
 #include <vector>
 
 namespace qel::protocol {
@@ -79,6 +80,9 @@ public:
     /// Hands console input to a partition.
     /// @return false: the console does not hold the session, or has not set it up; the data is dropped
     bool feed(const ConsoleEntry& console, const QelMessageVirtualSerialDataToOsAsync& data);
+
+    /// Ends all sessions of a console as a forced close does. @param why  comes in the data of those that are set up
+    void endSessionsOf(const ConsoleEntry& console, const std::string& why);
 
     /// Ends all sessions of a console, without notices.
     void release(const ConsoleEntry& console);

@@ -40,6 +40,7 @@ void checkLimits(const ServerOptions& options)
     require(options.frameTimeout.count() > 0, "frameTimeout: more than 0");
     require(options.frameTimeout <= kMaxTime, "frameTimeout: at most 24 hours");
     require(options.keepAlive.count() > 0 && options.keepAlive <= kMaxKeepAlive, "keepAlive: 1 to 32767 seconds");
+    require(options.idleTimeout.count() >= 0 && options.idleTimeout <= kMaxTime, "idleTimeout: 0 to 24 hours");
     require(options.linger.count() >= 0, "linger: 0 or more");
     require(options.linger <= kMaxTime, "linger: at most 24 hours");
 }

@@ -12,6 +12,7 @@
 #include "base/Threads.hpp"
 #include "server/QuietLog.hpp"
 
+#include <cstring>
 #include <poll.h>
 #include <utility>
 
@@ -223,7 +224,10 @@ bool Connection::pAwaitReceive()
     sendOwn();
     mHeldBack = true; // before the question: what changes the answer afterwards interrupts the wait
     while (!mServices.hypervisor.mayReceive(mId)) {
-        if (mClosed) return false;
+        if (mClosed) {
+            mWhy = DisconnectReason::Lost;
+            return false;
+        }
         const PollSet set{mWake.getPollFd(), mHangUp};
         const auto now = TimeProvider::steady();
         if (mHandshake.isExpired(now)) throw StreamIOException("I/O deadline");
@@ -239,7 +243,7 @@ bool Connection::pAwaitReceive()
 void Connection::pFinish() noexcept
 {
     if (mId != 0) {
-        runGuarded([this] { mServices.hypervisor.disconnect(mId); }, mName);
+        runGuarded([this] { mServices.hypervisor.disconnect(mId, mWhy); }, mName);
     }
     if (mWriter.joinable()) {
         finish();
@@ -253,11 +257,13 @@ void Connection::pFinish() noexcept
 }
 
 /// Logs the exception that is being handled.
-void Connection::pReportFailure() const noexcept
+void Connection::pReportFailure() noexcept
 {
+    mWhy = DisconnectReason::Failure;
     try {
         throw;
     } catch (const QelMessageValidationException& error) {
+        mWhy = DisconnectReason::Protocol;
         logQuietly(LogLevel::Warn, mName, ": closed for a malformed frame: ", error.what());
     } catch (const StreamIOException& error) {
         pReport(error);
@@ -268,11 +274,19 @@ void Connection::pReportFailure() const noexcept
     }
 }
 
-void Connection::pReport(const StreamIOException& error) const noexcept
+void Connection::pReport(const StreamIOException& error) noexcept
 {
+    mWhy = pReasonOf(error);
     if (!isDeadline(error)) return logQuietly(LogLevel::Info, mName, ": ", Explained{error});
     logQuietly(LogLevel::Warn, mName, ": closed, it did not ",
                mHandshake.isDisabled() ? "finish a message" : "introduce itself", " in time");
+}
+
+DisconnectReason Connection::pReasonOf(const StreamIOException& error) const noexcept
+{
+    if (isDeadline(error)) return DisconnectReason::Timeout;
+    const bool isEnd = std::strcmp(error.what(), "EOF") == 0 && !mFrames.isInFrame();
+    return isEnd && !mClosed ? DisconnectReason::Closed : DisconnectReason::Lost;
 }
 
 void Connection::pBeginBatch(bool mayWait)

@@ -99,6 +99,7 @@ private:
                SSLServerContext* context, HandshakePlaces::Place place);
 
     void resumeReading() override;
+    void cut() override { abort(); }
 
     bool pNeedsNoWait() const override { return mWire.needsNoWait(); }
     void pBeginBatch(bool mayWait) override;
@@ -118,8 +119,9 @@ private:
     void pOnIdentified();
     bool pAwaitReceive();
     void pFinish() noexcept;
-    void pReportFailure() const noexcept;
-    void pReport(const StreamIOException& error) const noexcept;
+    void pReportFailure() noexcept;
+    void pReport(const StreamIOException& error) noexcept;
+    DisconnectReason pReasonOf(const StreamIOException& error) const noexcept;
 
     void pWrite() noexcept;
     void pReportSendFailure() const noexcept;
@@ -143,11 +145,12 @@ private:
     QelMessageStream mMessages;
     std::optional<Admission> mAdmission; // to TLS; empty: plain
 
-    PollDeadline mHandshake;            // disabled: the console has identified itself; of the reader
-    std::atomic<ConsoleId> mId{0};      // 0: in the handshake
-    std::string mName;                  // for the log, of its own threads: the address, later "console 1"
-    std::atomic<bool> mHeldBack{false}; // the reader waits for the hypervisor to take another message
-    std::atomic<bool> mClosed{false};   // the stream is of no use any more
+    DisconnectReason mWhy = DisconnectReason::Closed; // of the thread that reads
+    PollDeadline mHandshake;                          // disabled: the console has identified itself; of the reader
+    std::atomic<ConsoleId> mId{0};                    // 0: in the handshake
+    std::string mName;                                // for the log, of its own threads: the address, later "console 1"
+    std::atomic<bool> mHeldBack{false};               // the reader waits for the hypervisor to take another message
+    std::atomic<bool> mClosed{false};                 // the stream is of no use any more
     std::atomic<bool> mEnded{false};
 
     // Guards the thread objects while threads start and join each other.

@@ -106,11 +106,10 @@ private:
 Server::Impl::Impl(Hypervisor& hypervisor, const ServerOptions& options)
     : mListenAt(checkOptions(options)), mKeepAlive(options.keepAlive), mPins(options.pins), mIsPlain(options.plain),
       mPlaces(options.maxHandshakes, options.maxHandshakesPerAddress),
-      mEngine(hypervisor, options.maxConsoles, [this] { mSerialWake.interrupt(); }), mServices{mEngine, mPins,
-                                                                                               limitsOf(options),
-                                                                                               mThrottle, mWake},
-      mContext(contextOf(options)), mListener(std::in_place, mListenAt), mEndpoints(mListener->endpoints()),
-      mSerialLoop(mEngine, mSerialWake)
+      mEngine(hypervisor, options.maxConsoles, [this] { mSerialWake.interrupt(); },
+              {options.idleTimeout, options.linger}),
+      mServices{mEngine, mPins, limitsOf(options), mThrottle, mWake}, mContext(contextOf(options)),
+      mListener(std::in_place, mListenAt), mEndpoints(mListener->endpoints()), mSerialLoop(mEngine, mSerialWake)
 {}
 
 void Server::Impl::run(const PollFd& stop)

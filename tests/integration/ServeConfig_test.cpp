@@ -6,6 +6,8 @@
 
 #include "integration/TlsConsole.hpp"
 #include "integration/TlsTest.hpp"
+#include "support/ComesTrue.hpp"
+#include "support/TemporaryDirectory.hpp"
 
 #include <chrono>
 #include <csignal>
@@ -114,8 +116,8 @@ TEST_F(ServeConfigured, LogsWhoDidWhat)
     call(*server);
     const std::string log = server->stop().errors;
     const std::string who = " console=1 name=\"client\" fingerprint=[0-9A-F:]{95} address=127\\.0\\.0\\.1:[0-9]+";
-    for (const std::string& event :
-         {"connected" + who + " tool=1,\"qel-[0-9]+\"", "opened" + who + " partition=1 connection=0", "left" + who}) {
+    for (const std::string& event : {"connected" + who + " tool=1,\"qel-[0-9]+\"",
+                                     "opened" + who + " partition=1 connection=0", "left" + who + " why=closed"}) {
         SCOPED_TRACE(event);
         EXPECT_TRUE(std::regex_search(log, std::regex("\\(I\\): \\[qel\\] audit: " + event + "\n"))) << log;
     }
@@ -185,6 +187,69 @@ TEST_F(ServeConfigured, SighupEndsTheSessionsThatTheRulesForbidAndNoOthers)
                                   "more\n");
     server->process().awaitErrors(": 2 partitions, 1 rule, 1 session ended\n");
     EXPECT_EQ(typing.statusOf(QelMessageVirtualSerialOpenReq(1, 1, false)), 0U);
+    server->stop();
+}
+
+TEST_F(ServeConfigured, SighupOpensAndClosesTheLogOfALine)
+{
+    const TemporaryDirectory logs;
+    const std::string partition = "[partition.web]\nid = 1\nline = 'echo hello; cat'\n";
+    const auto server = serveWith(partition);
+    HoldingConsole holder(*server);
+    write(partition + "log = '" + logs.path() + "'\n");
+    server->process().signal(SIGHUP);
+    server->process().awaitErrors("SIGHUP: read ");
+    EXPECT_THAT(Utilities::readFile(logs.file("web.log")), HasSubstr(" [qel: the log begins]\n"));
+    write(partition + "[partition.new]\nid = 2\nline = 'cat'\n"); // whose line in the log is awaited
+    server->process().signal(SIGHUP);
+    server->process().awaitErrors("partition 2: added\n");
+    EXPECT_TRUE(comesTrue(
+        [&] { return Utilities::readFile(logs.file("web.log")).find(" [qel: the log ends]\n") != std::string::npos; }));
+    EXPECT_EQ(holder.statusOf(QelMessageVirtualSerialOpenReq(1, 0, false)), 19U); // its session goes on
+    server->stop();
+}
+
+TEST_F(ServeConfigured, SighupTakesCredentialsWithAnotherName)
+{
+    directory.put("other", Authority::trusted().serverCredentials());
+    const std::string common = "credentials = '" + directory.path() + "'\n";
+    write(common + "name = 'server'\n");
+    ServeProcess server({"--config", file()}, "127.0.0.1:0", {});
+    write(common + "name = 'none'\n");
+    server.process().signal(SIGHUP);
+    server.process().awaitErrors("(E): [qel] SIGHUP: the credentials stay as they were: ");
+    EXPECT_EQ(call(server).exitStatus, 0);
+    write(common + "name = 'other'\nmax-consoles = 9\n");
+    server.process().signal(SIGHUP);
+    server.process().awaitErrors("SIGHUP: these need a restart: max-consoles\n");
+    server.process().awaitErrors("SIGHUP: loaded " + directory.file("other.crt") + " for new connections\n");
+    EXPECT_EQ(call(server).exitStatus, 0);
+}
+
+TEST_F(ServeConfigured, SighupMutesMessagesBetweenConsoles)
+{
+    const auto server = serveWith("no-broadcasts = false\n" + kPartitions);
+    const auto broadcast = [&] {
+        return runQel(Arguments{"call", "--connect", server->endpoint()} + directory.options("client") +
+                      Arguments{"broadcast", "hello"});
+    };
+    EXPECT_EQ(broadcast().exitStatus, 0);
+    write("no-broadcasts = true\n" + kPartitions);
+    server->process().signal(SIGHUP);
+    server->process().awaitErrors("SIGHUP: loaded ");
+    const auto muted = broadcast();
+    EXPECT_EQ(muted.exitStatus, 1);
+    EXPECT_THAT(muted.errors, HasSubstr("0x00000001 (QelMessageStatusInvalidOperation)"));
+    EXPECT_THAT(server->stop().errors, Not(HasSubstr("need a restart")));
+}
+
+TEST_F(ServeConfigured, AConsoleThatSaysNothingIsLetGo)
+{
+    const auto server = serveWith("idle-timeout = 1\n" + kPartitions);
+    HoldingConsole holder(*server);
+    EXPECT_EQ(holder.awaitClosed(), 2U);
+    server->process().awaitErrors("console 1: let go, nothing has come from this console for 1 s\n");
+    server->process().awaitErrors(" why=idle\n");
     server->stop();
 }
 

@@ -19,6 +19,7 @@ public:
     bool room = true;       ///< for responses, notices and broadcasts
     bool serialRoom = true; ///< for serial data
     bool finished = false;
+    bool isCut = false;
     unsigned resumed = 0;
 
     void post(std::unique_ptr<QelMessage> message) override
@@ -45,6 +46,7 @@ public:
         if (finished) throw std::logic_error("finished twice");
         finished = true;
     }
+    void cut() override { isCut = true; }
 
     std::size_t posted() const { return mPosted.size(); }
 

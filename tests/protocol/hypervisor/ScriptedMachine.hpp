@@ -28,7 +28,8 @@ public:
     std::function<QelMessageStatusCodes(const protocol::Peer&, const QelMessage&)> decide;
     std::function<bool(const protocol::Peer&, std::uint16_t)> decideOpen;
 
-    std::vector<std::string> calls; ///< the operations, and what they were called with
+    std::vector<protocol::DisconnectReason> reasons; ///< of onDisconnected()
+    std::vector<std::string> calls;                  ///< the operations, and what they were called with
 
     QelMessageStatusCodes mayRequest(const protocol::Peer& peer, const QelMessage& request) override
     {
@@ -76,7 +77,11 @@ public:
         metadata = to;
     }
     void onConnected(const protocol::Peer& peer) override { pCalled("onConnected", " " + peer.toolId); }
-    void onDisconnected(const protocol::Peer& peer) override { pCalled("onDisconnected", " " + peer.toolId); }
+    void onDisconnected(const protocol::Peer& peer, protocol::DisconnectReason why) override
+    {
+        reasons.push_back(why);
+        pCalled("onDisconnected", " " + peer.toolId);
+    }
 
     std::vector<std::string> takeCalls() { return std::exchange(calls, {}); }
 

@@ -40,6 +40,7 @@ public:
     ~TestOutbox() override { retire(); }
 
     void resumeReading() override {}
+    void cut() override {}
 
     bool needsNoWait = true;
     std::size_t room = ~std::size_t{0}; // messages that go out without waiting

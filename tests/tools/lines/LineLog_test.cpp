@@ -336,8 +336,8 @@ TEST_F(LineLogTest, BothFilesRotate)
 
 TEST(LineLogs, OpenNothingWithoutADirectory)
 {
-    tool::LineLogs logs({});
-    EXPECT_EQ(logs.open(1, ""), nullptr);
+    tool::LineLogs logs(100000);
+    EXPECT_EQ(logs.open(1, "", ""), nullptr);
     logs.rotate();
 }
 
@@ -345,10 +345,12 @@ TEST(LineLogs, OpenALogForEachPartitionAndRotateThemAll)
 {
     const SettableClock clock;
     const TemporaryDirectory directory;
-    tool::LineLogs logs({directory.path(), 100000});
-    const auto first = logs.open(1, "");
-    auto second = logs.open(2, "web1");
-    EXPECT_EQ(logs.open(2, "web1"), second); // as after a reload
+    tool::LineLogs logs(100000);
+    const auto first = logs.open(1, "", directory.path());
+    auto second = logs.open(2, "web1", directory.path());
+    EXPECT_EQ(logs.open(2, "web1", directory.path()), second); // as after a reload
+    const TemporaryDirectory elsewhere;
+    EXPECT_NE(logs.open(2, "web1", elsewhere.path()), second);
     EXPECT_NE(first, second);
     first->onOutput(1, "a", 1);
     logs.rotate();
@@ -356,7 +358,7 @@ TEST(LineLogs, OpenALogForEachPartitionAndRotateThemAll)
     EXPECT_TRUE(exists(directory.file("web1.log.1")));
     second.reset(); // its partition has been removed
     EXPECT_EQ(contentsOf(directory.file("web1.log")), "2024-01-02T03:04:05.000Z [qel: the log ends]\n");
-    EXPECT_NE(logs.open(2, "web1"), nullptr);
+    EXPECT_NE(logs.open(2, "web1", directory.path()), nullptr);
 }
 
 TEST(LineLogName, IsThatOfThePartitionInCharactersThatFilesMayHave)

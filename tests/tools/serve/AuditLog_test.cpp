@@ -11,6 +11,7 @@ namespace qel::test {
 
 namespace {
 
+using protocol::DisconnectReason;
 using tool::auditAnswered;
 
 protocol::Peer alice()
@@ -31,7 +32,18 @@ const std::string kWho = " console=7 name=\"alice\" fingerprint=AB:CD address=19
 TEST(AuditLog, SaysWhoConnectsAndLeaves)
 {
     EXPECT_EQ(tool::auditConnected(alice()), "audit: connected" + kWho + " tool=5,\"ops-1\"");
-    EXPECT_EQ(tool::auditLeft(alice()), "audit: left" + kWho);
+    EXPECT_EQ(tool::auditLeft(alice(), DisconnectReason::Closed), "audit: left" + kWho + " why=closed");
+}
+
+TEST(AuditLog, SaysWhyAConsoleHasLeft)
+{
+    const std::pair<DisconnectReason, std::string> cases[] = {
+        {DisconnectReason::Closed, "closed"},     {DisconnectReason::Lost, "lost"},
+        {DisconnectReason::Protocol, "protocol"}, {DisconnectReason::Timeout, "timeout"},
+        {DisconnectReason::Idle, "idle"},         {DisconnectReason::Shutdown, "shutdown"},
+        {DisconnectReason::Failure, "failure"}};
+    for (const auto& row : cases)
+        EXPECT_EQ(tool::auditLeft(alice(), row.first), "audit: left" + kWho + " why=" + row.second);
 }
 
 TEST(AuditLog, AConsoleWithoutACertificateHasNoName)
@@ -39,7 +51,8 @@ TEST(AuditLog, AConsoleWithoutACertificateHasNoName)
     protocol::Peer peer = alice();
     peer.commonName.clear();
     peer.fingerprint.clear();
-    EXPECT_EQ(tool::auditLeft(peer), "audit: left console=7 name=\"\" fingerprint=- address=192.0.2.7:40312");
+    EXPECT_EQ(tool::auditLeft(peer, DisconnectReason::Lost),
+              "audit: left console=7 name=\"\" fingerprint=- address=192.0.2.7:40312 why=lost");
 }
 
 TEST(AuditLog, StaysOnOneLineWhateverThePeerSaysItIs)

@@ -249,6 +249,50 @@ TEST_F(ServePlanning, AWrongKeyOfAPartitionIsRefusedWithItsPlace)
               ":5:10: replay: \"-1\" is not an integer in [0, 16777216]");
 }
 
+TEST_F(ServePlanning, ALineIsLoggedWithTheOthersUnlessItsPartitionSaysOtherwise)
+{
+    const TemporaryDirectory own;
+    const auto partition = [](int id, const std::string& log) {
+        const std::string number = std::to_string(id);
+        return "[partition.p" + number + "]\nid = " + number + "\nline = 'cat'\n" + log;
+    };
+    const std::string partitions =
+        partition(1, "") + partition(2, "log = false\n") + partition(3, "log = '" + own.path() + "'\n");
+    const ServePlan made =
+        planOf("plain = true\nline-log = '" + directory.path() + "'\n" + partitions + partition(4, "log = true\n"),
+               {"--partition", "5=cat"});
+    EXPECT_EQ(made.partitions.at(1).logDirectory, directory.path());
+    EXPECT_EQ(made.partitions.at(2).logDirectory, "");
+    EXPECT_EQ(made.partitions.at(3).logDirectory, own.path());
+    EXPECT_EQ(made.partitions.at(4).logDirectory, directory.path());
+    EXPECT_EQ(made.partitions.at(5).logDirectory, directory.path());
+    const ServePlan without = planOf("plain = true\n" + partitions);
+    EXPECT_EQ(without.partitions.at(1).logDirectory, "");
+    EXPECT_EQ(without.partitions.at(3).logDirectory, own.path());
+}
+
+TEST_F(ServePlanning, AWrongLogOfAPartitionIsRefusedWithItsPlace)
+{
+    const std::string partition = "plain = true\n[partition.a]\nid = 1\nline = 'cat'\n";
+    EXPECT_EQ(saidOf(partition + "log = true\n"), ":5:7: log: line-log names no directory; name one here");
+    EXPECT_EQ(saidOf(partition + "log = '/no/such'\n"), ":5:7: log: \"/no/such\" is not a directory");
+    EXPECT_EQ(saidOf(partition + "log = ''\n"), ":5:7: log: \"\" is not a directory");
+    EXPECT_EQ(saidOf(partition + "log = 1\n"), ":5:7: log takes true, false or a directory, not an integer");
+    EXPECT_EQ(saidOf(partition + "log = ['/']\n"), ":5:7: log takes true, false or a directory, not a list");
+}
+
+TEST_F(ServePlanning, TakesTheIdleTimeoutAndTheMutedBroadcasts)
+{
+    const ServePlan plain = plan({"--plain"});
+    EXPECT_EQ(plain.server.idleTimeout.count(), 0);
+    EXPECT_FALSE(plain.policy.mutesBroadcasts);
+    const ServePlan made = planOf("plain = true\nidle-timeout = 86400\nno-broadcasts = true\n");
+    EXPECT_EQ(made.server.idleTimeout, std::chrono::hours(24));
+    EXPECT_TRUE(made.policy.mutesBroadcasts);
+    EXPECT_EQ(said({"--plain", "--idle-timeout", "86401"}),
+              "--idle-timeout: \"86401\" is not an integer in [0, 86400]");
+}
+
 TEST_F(ServePlanning, ALineThatIsNoneIsRefused)
 {
     EXPECT_THAT(saidOf("plain = true\n[partition.web]\nid = 1\nline = 'tcp:nowhere'\n"),
@@ -276,7 +320,7 @@ TEST_F(ServePlanning, RulesNeedCertificates)
 {
     EXPECT_EQ(saidOf("plain = true\n[[rule]]\nname = 'a'\nmay = 'type'\n"),
               "rules and access need certificates, and --plain has none");
-    EXPECT_EQ(planOf("credentials = 'x'\nname = 'y'\n[[rule]]\nname = 'a'\nmay = 'type'\n").rules.size(), 1U);
+    EXPECT_EQ(planOf("credentials = 'x'\nname = 'y'\n[[rule]]\nname = 'a'\nmay = 'type'\n").policy.rules.size(), 1U);
 }
 
 TEST_F(ServePlanning, WhatIsPrintedIsAFileThatSaysTheSame)

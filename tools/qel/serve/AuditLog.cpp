@@ -18,6 +18,27 @@ std::string line(const char* event, const Peer& peer)
            " fingerprint=" + (peer.fingerprint.empty() ? "-" : peer.fingerprint) + " address=" + peer.address;
 }
 
+const char* wordFor(DisconnectReason why)
+{
+    switch (why) {
+    case DisconnectReason::Closed:
+        return "closed";
+    case DisconnectReason::Lost:
+        return "lost";
+    case DisconnectReason::Protocol:
+        return "protocol";
+    case DisconnectReason::Timeout:
+        return "timeout";
+    case DisconnectReason::Idle:
+        return "idle";
+    case DisconnectReason::Shutdown:
+        return "shutdown";
+    case DisconnectReason::Failure:
+        break;
+    }
+    return "failure";
+}
+
 std::string place(std::uint16_t partition, std::uint16_t connection)
 {
     return " partition=" + std::to_string(partition) + " connection=" + std::to_string(connection);
@@ -52,7 +73,7 @@ std::string auditConnected(const Peer& peer)
     return line("connected", peer) + " tool=" + std::to_string(peer.toolType) + "," + quoted(peer.toolId);
 }
 
-std::string auditLeft(const Peer& peer) { return line("left", peer); }
+std::string auditLeft(const Peer& peer, DisconnectReason why) { return line("left", peer) + " why=" + wordFor(why); }
 
 std::string auditAnswered(const Peer& peer, const QelMessage& request, QelMessageStatusCodes status)
 {

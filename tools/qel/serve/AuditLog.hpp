@@ -1,6 +1,7 @@
 #pragma once
 
 #include <qel/common/QelMessage.hpp>
+#include <qel/protocol/DisconnectReason.hpp>
 #include <qel/protocol/Peer.hpp>
 
 #include "base/Library.hpp"
@@ -16,8 +17,8 @@ namespace qel::tool {
 /// "audit: connected console=1 name="alice" ..."
 std::string auditConnected(const Peer& peer);
 
-/// "audit: left console=1 name="alice" ..."
-std::string auditLeft(const Peer& peer);
+/// "audit: left console=1 name="alice" ... why=closed"
+std::string auditLeft(const Peer& peer, DisconnectReason why);
 
 /// The line about a request: opened, forced, watched, closed or refused.
 /// @param status  of the response

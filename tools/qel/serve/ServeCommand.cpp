@@ -79,8 +79,8 @@ int serveUntilStopped(Server& server, SignalWatch& signals, ServeReload& reload,
         server.run(signals.getPollFd());
         const int signal = signals.take();
         if (signal == SIGHUP) {
+            logs.rotate(); // before new ones are opened
             reload.run();
-            logs.rotate();
         } else if (signal == SIGALRM) {
             reload.warnOfExpiry();
         } else if (signal == SIGUSR1) {
@@ -97,8 +97,8 @@ ExitStatus runServe(const ServePlan& plan)
     static_cast<void>(std::signal(SIGPIPE, SIG_IGN)); // a log pipe without a reader must not end the server
     static_cast<void>(std::signal(SIGCHLD, SIG_DFL)); // ignored, as a parent may leave it, it hides how commands end
     SignalWatch signals(kSignals);
-    ServeMachine machine(plan.machine, plan.capabilities, plan.rules, plan.maxPerCertificate);
-    LineLogs logs(plan.lineLog);
+    ServeMachine machine(plan.machine, plan.capabilities, plan.policy);
+    LineLogs logs(plan.lineLogBytes);
     addPartitions(machine, plan, logs);
     const auto server = makeServer(machine, plan);
     announce(*server);
@@ -125,11 +125,11 @@ ExitStatus checkPlan(const ServePlan& plan)
     }
     std::cout << (plan.file.empty() ? "the configuration" : plan.file)
               << " is fine: " << countText(plan.partitions.size(), "partition") << ", ";
-    if (plan.rules.size() == 0) {
+    if (plan.policy.rules.size() == 0) {
         std::cout << "no rules: " << (plan.transport.plain ? "every console" : "every certificate of the root")
                   << " may do anything\n";
     } else {
-        std::cout << countText(plan.rules.size(), "rule") << '\n';
+        std::cout << countText(plan.policy.rules.size(), "rule") << '\n';
     }
     return ExitStatus::Done;
 }

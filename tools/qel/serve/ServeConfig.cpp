@@ -27,8 +27,8 @@ constexpr std::size_t kMaxDescriptionBytes = 256;
 /// The rights of one whom a partition's `access` names.
 constexpr AccessRight kAccess = AccessRight::Watch | AccessRight::Type | AccessRight::Force;
 
-const std::vector<std::string> kPartitionKeys{"id",    "line",   "description", "access", "replay", "when-unattended",
-                                              "start", "restart"};
+const std::vector<std::string> kPartitionKeys{
+    "id", "line", "description", "access", "log", "replay", "when-unattended", "start", "restart"};
 const std::vector<std::string> kRuleKeys{"name", "fingerprint", "partitions", "may"};
 
 struct RightName {

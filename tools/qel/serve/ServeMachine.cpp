@@ -11,32 +11,36 @@
 
 namespace qel::tool {
 
-ServeMachine::ServeMachine(MachineInfo machine, const QelCapabilities& capabilities, AccessRules rules,
-                           std::size_t maxPerCertificate)
-    : Hypervisor(std::move(machine), capabilities), mMaxPerCertificate(maxPerCertificate), mRules(std::move(rules))
+ServeMachine::ServeMachine(MachineInfo machine, const QelCapabilities& capabilities, ServePolicy policy)
+    : Hypervisor(std::move(machine), capabilities), mPolicy(std::move(policy))
 {}
 
-void ServeMachine::setRules(AccessRules rules)
+void ServeMachine::setPolicy(ServePolicy policy)
 {
     const MutexLock lock(mMutex);
-    mRules = std::move(rules);
+    mPolicy = std::move(policy);
 }
 
 QelMessageStatusCodes ServeMachine::mayRequest(const Peer& peer, const QelMessage& request)
 {
     const MutexLock lock(mMutex);
     const bool introduces = dynamic_cast<const QelMessageGetEnclTypeAndInterfaceVersionReq*>(&request) != nullptr;
-    if (introduces && mMaxPerCertificate > 0 && !peer.fingerprint.empty()) {
+    if (introduces && mPolicy.maxPerCertificate > 0 && !peer.fingerprint.empty()) {
         const auto found = mConsoles.find(peer.fingerprint);
-        if (found != mConsoles.end() && found->second >= mMaxPerCertificate) return QelMessageStatusTooManyConnections;
+        if (found != mConsoles.end() && found->second >= mPolicy.maxPerCertificate) {
+            return QelMessageStatusTooManyConnections;
+        }
     }
-    return mRules.decide(peer, request);
+    const QelMessageStatusCodes decision = mPolicy.rules.decide(peer, request);
+    if (decision != QelMessageStatusNoError) return decision;
+    const bool isMuted = mPolicy.mutesBroadcasts && dynamic_cast<const QelMessageDaxBroadcastReq*>(&request) != nullptr;
+    return isMuted ? QelMessageStatusInvalidOperation : QelMessageStatusNoError;
 }
 
 bool ServeMachine::mayOpen(const Peer& peer, std::uint16_t partition)
 {
     const MutexLock lock(mMutex);
-    return mRules.mayOpen(peer, partition);
+    return mPolicy.rules.mayOpen(peer, partition);
 }
 
 std::vector<ServeMachine::SessionPlace> ServeMachine::sessionsToEnd() const
@@ -45,7 +49,7 @@ std::vector<ServeMachine::SessionPlace> ServeMachine::sessionsToEnd() const
     std::vector<SessionPlace> places;
     for (const auto& session : mSessions) {
         const SessionPlace place = session.first;
-        if (!mRules.mayUse(session.second, place.first, place.second)) places.push_back(place);
+        if (!mPolicy.rules.mayUse(session.second, place.first, place.second)) places.push_back(place);
     }
     return places;
 }
@@ -72,9 +76,9 @@ void ServeMachine::onConnected(const Peer& peer)
     if (!peer.fingerprint.empty()) ++mConsoles[peer.fingerprint];
 }
 
-void ServeMachine::onDisconnected(const Peer& peer)
+void ServeMachine::onDisconnected(const Peer& peer, DisconnectReason why)
 {
-    logLine(LogLevel::Info, auditLeft(peer));
+    logLine(LogLevel::Info, auditLeft(peer, why));
     const MutexLock lock(mMutex);
     pForgetSessionsLocked(peer);
     const auto found = mConsoles.find(peer.fingerprint);

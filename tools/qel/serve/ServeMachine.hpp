@@ -15,16 +15,21 @@
 
 namespace qel::tool {
 
+/// What consoles may do, and how many.
+struct ServePolicy {
+    AccessRules rules;
+    std::size_t maxPerCertificate = 0; ///< consoles that may be connected with one certificate; 0: any number
+    bool mutesBroadcasts = false;      ///< no console may send messages to others, whatever the rules say
+};
+
 /// The hypervisor of "qel serve": the library's, with rules for who may do what, and with a log of who did what.
-/// Thread safety: as Hypervisor; setRules() from any thread.
+/// Thread safety: as Hypervisor; setPolicy() from any thread.
 class ServeMachine : public Hypervisor {
 public:
-    /// @param maxPerCertificate  consoles that may be connected with one certificate; 0: any number
-    ServeMachine(MachineInfo machine, const QelCapabilities& capabilities, AccessRules rules,
-                 std::size_t maxPerCertificate);
+    ServeMachine(MachineInfo machine, const QelCapabilities& capabilities, ServePolicy policy);
 
-    /// Replaces the rules for everything that is asked from now on.
-    void setRules(AccessRules rules);
+    /// Replaces the policy for everything that is asked from now on.
+    void setPolicy(ServePolicy policy);
 
     /// A session of a partition, by the partition's id and the number of the connection.
     using SessionPlace = std::pair<std::uint16_t, std::uint16_t>;
@@ -36,15 +41,13 @@ public:
     bool mayOpen(const Peer& peer, std::uint16_t partition) override;
     void onConnected(const Peer& peer) override;
     void onAnswered(const Peer& peer, const QelMessage& request, QelMessageStatusCodes status) override;
-    void onDisconnected(const Peer& peer) override;
+    void onDisconnected(const Peer& peer, DisconnectReason why) override;
 
 private:
     void pForgetSessionsLocked(const Peer& peer) QEL_REQUIRES(mMutex);
 
-    const std::size_t mMaxPerCertificate;
-
     mutable Mutex mMutex; ///< guards what follows; only the logger's lock is taken under it
-    AccessRules mRules QEL_GUARDED_BY(mMutex);
+    ServePolicy mPolicy QEL_GUARDED_BY(mMutex);
     std::map<SessionPlace, Peer> mSessions QEL_GUARDED_BY(mMutex);       ///< see sessionsToEnd()
     std::map<std::string, std::size_t> mConsoles QEL_GUARDED_BY(mMutex); ///< connected ones, by fingerprint
 };

@@ -3,6 +3,7 @@
 #include <qel/common/QelCapabilities.hpp>
 
 #include "base/OptionChecks.hpp"
+#include "lines/LineLogs.hpp"
 #include "lines/LineText.hpp"
 #include "serve/PartitionChoices.hpp"
 
@@ -25,6 +26,7 @@ constexpr std::uint64_t kMaxHandshakes = 65535;
 constexpr double kMinFrameSeconds = 0.001;
 constexpr double kMaxFrameSeconds = 24 * 60 * 60;
 constexpr std::uint64_t kMaxKeepAliveSeconds = 32767; // of TCP
+constexpr std::uint64_t kMaxIdleSeconds = 24 * 60 * 60;
 
 } // namespace
 
@@ -37,6 +39,8 @@ struct ServeInput::Options {
     LineLogOptions lineLog;
     std::uint32_t maxConsoles = ServerOptions().maxConsoles;
     std::uint32_t maxPerCertificate = 0;
+    std::uint32_t idleSeconds = 0;
+    bool mutesBroadcasts = false;
     std::uint32_t warnDays = 30;
     double frameSeconds = std::chrono::duration<double>(ServerOptions().frameTimeout).count();
     std::uint32_t keepAliveSeconds = static_cast<std::uint32_t>(ServerOptions().keepAlive.count());
@@ -87,18 +91,18 @@ std::string lineProblem(const std::string& text)
     }
 }
 
-std::map<std::uint16_t, PlannedPartition> parsePartitions(const std::vector<std::string>& texts,
-                                                          const PartitionOptions& serving)
+std::map<std::uint16_t, PlannedPartition> parsePartitions(const Options& options)
 {
+    const PartitionOptions serving = options.serving.options();
     std::map<std::uint16_t, PlannedPartition> partitions;
-    for (const std::string& text : texts) {
+    for (const std::string& text : options.partitions) {
         const std::size_t equals = text.find('=');
         if (equals == std::string::npos || equals + 1 == text.size()) refuse("--partition", "takes ID=LINE");
         const std::uint16_t id = parseUint16(text.substr(0, equals), 1, "--partition");
         const std::string line = text.substr(equals + 1);
         const std::string problem = lineProblem(line);
         if (!problem.empty()) refuse("--partition", problem);
-        if (!partitions.emplace(id, PlannedPartition{line, serving}).second) {
+        if (!partitions.emplace(id, PlannedPartition{line, serving, options.lineLog.directory}).second) {
             refuse("--partition", "partition " + std::to_string(id) + " is given twice");
         }
     }
@@ -120,14 +124,34 @@ PartitionOptions servingOf(const PartitionConfig& partition, PartitionChoices ch
     return options;
 }
 
+/// Where the line of a partition of the file is logged: with all others, unless its own key says otherwise.
+std::string logDirectoryOf(const PartitionConfig& partition, const std::string& common)
+{
+    const TomlEntry* const entry = partition.entry.value.find("log");
+    if (entry == nullptr) return common;
+    const TomlPlace& place = entry->value.place;
+    if (entry->value.kind == TomlValue::Kind::Boolean) {
+        if (!flagOf(*entry)) return {};
+        if (common.empty()) failAt(place, "log: line-log names no directory; name one here");
+        return common;
+    }
+    if (entry->value.kind != TomlValue::Kind::Text) {
+        failAt(place, std::string("log takes true, false or a directory, not ") + kindName(entry->value.kind));
+    }
+    const std::string problem = directoryProblem(entry->value.text);
+    if (!problem.empty()) failAt(place, "log: " + problem);
+    return entry->value.text;
+}
+
 /// Adds the partitions of the file to those of the command line.
 void addPartitions(std::map<std::uint16_t, PlannedPartition>& partitions, const ServeConfig& config,
-                   const PartitionChoices& choices)
+                   const Options& options)
 {
     for (const PartitionConfig& partition : config.partitions) {
         const std::string problem = lineProblem(partition.line);
         if (!problem.empty()) failAt(partition.entry.value.find("line")->value.place, problem);
-        const PlannedPartition planned{partition.line, servingOf(partition, choices)};
+        const PlannedPartition planned{partition.line, servingOf(partition, options.serving),
+                                       logDirectoryOf(partition, options.lineLog.directory)};
         if (partitions.emplace(partition.id, planned).second) continue;
         failAt(partition.entry.place, "partition " + std::to_string(partition.id) + " is given by --partition too");
     }
@@ -163,6 +187,7 @@ ServerOptions parseServer(const Options& options)
     server.frameTimeout =
         std::chrono::duration_cast<std::chrono::milliseconds>(std::chrono::duration<double>(options.frameSeconds));
     server.keepAlive = std::chrono::seconds(options.keepAliveSeconds);
+    server.idleTimeout = std::chrono::seconds(options.idleSeconds);
     return server;
 }
 
@@ -225,6 +250,13 @@ void addLimitOptions(CLI::App& command, Options& options)
         ->type_name("SECONDS")
         ->transform(integerIn(1, kMaxKeepAliveSeconds))
         ->capture_default_str();
+    command
+        .add_option("--idle-timeout", options.idleSeconds,
+                    "Seconds after which a console that says nothing is let go; 0: never")
+        ->type_name("SECONDS")
+        ->transform(integerIn(0, kMaxIdleSeconds))
+        ->capture_default_str();
+    command.add_flag("--no-broadcasts", options.mutesBroadcasts, "Refuse messages between consoles");
 }
 
 } // namespace
@@ -300,16 +332,15 @@ ServePlan ServeInput::plan() const
     ServePlan plan;
     plan.server = parseServer(options);
     plan.transport = options.transport;
-    plan.partitions = parsePartitions(options.partitions, options.serving.options());
-    addPartitions(plan.partitions, mConfig, options.serving);
-    plan.rules = AccessRules(mConfig.rules);
-    if (options.transport.plain && plan.rules.size() > 0) {
+    plan.partitions = parsePartitions(options);
+    addPartitions(plan.partitions, mConfig, options);
+    plan.policy = {AccessRules(mConfig.rules), options.maxPerCertificate, options.mutesBroadcasts};
+    if (options.transport.plain && plan.policy.rules.size() > 0) {
         throw CLI::ValidationError("rules and access need certificates, and --plain has none");
     }
-    plan.maxPerCertificate = options.maxPerCertificate;
     plan.warnExpiry = std::chrono::hours(24) * options.warnDays;
     plan.term = options.term;
-    plan.lineLog = options.lineLog;
+    plan.lineLogBytes = options.lineLog.fileBytes;
     plan.machine = parseMachine(options);
     plan.capabilities = QelCapabilities(options.capabilities);
     plan.log = options.log;

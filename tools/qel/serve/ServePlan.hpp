@@ -7,10 +7,9 @@
 
 #include "base/Library.hpp"
 #include "base/Logging.hpp"
-#include "lines/LineLogs.hpp"
-#include "serve/AccessRules.hpp"
 #include "serve/OptionSources.hpp"
 #include "serve/ServeConfig.hpp"
+#include "serve/ServeMachine.hpp"
 #include "transport/TransportOptions.hpp"
 
 #include <CLI/CLI.hpp>
@@ -28,17 +27,17 @@ namespace qel::tool {
 struct PlannedPartition {
     std::string line;
     PartitionOptions options;
+    std::string logDirectory; ///< of the line's log; empty: there is none
 };
 
 /// What "qel serve" shall do: the options, parsed, whatever they come from.
 struct ServePlan {
     ServerOptions server; ///< without the credentials, which are loaded when it starts
     std::map<std::uint16_t, PlannedPartition> partitions;
-    AccessRules rules;
-    std::size_t maxPerCertificate = 0; ///< consoles; 0: any number
-    std::chrono::hours warnExpiry{0};  ///< so long before its end a certificate is warned about
+    ServePolicy policy;
+    std::chrono::hours warnExpiry{0}; ///< so long before its end a certificate is warned about
     std::string term;
-    LineLogOptions lineLog;
+    std::uint64_t lineLogBytes = 0; ///< of one file of a line's log
     MachineInfo machine;
     QelCapabilities capabilities;
     TransportOptions transport;

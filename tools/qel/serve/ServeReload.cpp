@@ -16,10 +16,16 @@ namespace qel::tool {
 
 namespace {
 
-/// The options that are about partitions alone: they count at once, for the partitions without a key of their own.
-bool isOfPartitions(const std::string& key)
+/// Whether a change of an option counts at once.
+bool isReadAgain(const std::string& key)
 {
-    constexpr std::array<const char*, 4> kKeys{"replay", "when-unattended", "start", "restart"};
+    constexpr std::array<const char*, 13> kKeys{"replay",        "when-unattended",
+                                                "start",         "restart",
+                                                "line-log", // for partitions without a key of their own
+                                                "no-broadcasts", "max-consoles-per-certificate",
+                                                "warn-expiry",   "credentials",
+                                                "name",          "cert",
+                                                "key",           "root"};
     return std::find(kKeys.begin(), kKeys.end(), key) != kKeys.end();
 }
 
@@ -31,7 +37,7 @@ MadeLine makePartition(std::uint16_t id, const PlannedPartition& partition, cons
     const bool keepsSession = made.options.keepsSession;
     made.options = partition.options;
     made.options.keepsSession = keepsSession;
-    made.options.tap = logs.open(id, made.options.name);
+    made.options.tap = logs.open(id, made.options.name, partition.logDirectory);
     return made;
 }
 
@@ -41,12 +47,17 @@ ServeReload::ServeReload(Server& server, ServeMachine& machine, LineLogs& logs, 
 
 void ServeReload::run()
 {
+    TransportOptions wanted = mPlan.transport;
     try {
-        if (!mPlan.file.empty()) pApply(planAgain(mPlan.words));
+        if (!mPlan.file.empty()) {
+            const ServePlan next = planAgain(mPlan.words);
+            pApply(next);
+            if (!next.transport.plain) wanted = next.transport;
+        }
     } catch (const std::exception& error) {
         logLine(LogLevel::Error, "SIGHUP: the configuration stays as it was: ", userMessage(error));
     }
-    pLoadCredentials();
+    pLoadCredentials(wanted);
     warnOfExpiry();
 }
 
@@ -65,11 +76,12 @@ void ServeReload::pApply(const ServePlan& next)
         made.emplace_back(entry.first, makePartition(entry.first, entry.second, mPlan.term, mLogs));
     pLogSettings(next);
     // Before the partitions: whatever happens to them, nobody may do what the file no longer allows.
-    mMachine.setRules(next.rules);
-    mPlan.rules = next.rules;
+    mMachine.setPolicy(next.policy);
+    mPlan.policy = next.policy;
+    mPlan.warnExpiry = next.warnExpiry;
     pApplyPartitions(next.partitions, std::move(made));
     logLine(LogLevel::Info, "SIGHUP: read ", mPlan.file, ": ", countText(next.partitions.size(), "partition"), ", ",
-            countText(next.rules.size(), "rule"), ", ", countText(pEndForbiddenSessions(), "session"), " ended");
+            countText(next.policy.rules.size(), "rule"), ", ", countText(pEndForbiddenSessions(), "session"), " ended");
 }
 
 /// A partition whose line has changed is removed and added. One that fails is logged, and the others are applied; the
@@ -120,18 +132,20 @@ void ServeReload::pLogSettings(const ServePlan& next) const
     std::string keys;
     for (std::size_t i = 0; i < next.settings.size(); ++i) {
         const Setting& setting = next.settings[i];
-        if (setting.value == mPlan.settings.at(i).value || isOfPartitions(setting.key)) continue;
+        if (setting.value == mPlan.settings.at(i).value || isReadAgain(setting.key)) continue;
         keys += (keys.empty() ? "" : ", ") + setting.key;
     }
     if (!keys.empty()) logLine(LogLevel::Warn, "SIGHUP: these need a restart: ", keys);
 }
 
-void ServeReload::pLoadCredentials()
+/// @param wanted  where the credentials are now
+void ServeReload::pLoadCredentials(const TransportOptions& wanted)
 {
     if (mPlan.transport.plain)
         return logLine(LogLevel::Info, "SIGHUP: connections are plain, there is nothing to load");
     try {
-        mServer.setCredentials(*loadCredentials(mPlan.transport));
+        mServer.setCredentials(*loadCredentials(wanted));
+        mPlan.transport = wanted;
         logLine(LogLevel::Info, "SIGHUP: loaded ", mPlan.transport.paths().certificate, " for new connections");
     } catch (const std::exception& error) {
         logLine(LogLevel::Error, "SIGHUP: the credentials stay as they were: ", userMessage(error));

@@ -42,7 +42,7 @@ private:
     void pApplyPartition(std::uint16_t id, MadeLine made);
     std::size_t pEndForbiddenSessions();
     void pLogSettings(const ServePlan& next) const;
-    void pLoadCredentials();
+    void pLoadCredentials(const TransportOptions& wanted);
 
     Server& mServer;
     ServeMachine& mMachine;

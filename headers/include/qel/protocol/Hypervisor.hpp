@@ -2,6 +2,7 @@
 
 #include <qel/common/QelCapabilities.hpp>
 #include <qel/common/QelMessage.hpp>
+#include <qel/protocol/DisconnectReason.hpp>
 #include <qel/protocol/PartitionOptions.hpp>
 #include <qel/protocol/Peer.hpp>
 #include <qel/protocol/ProtocolExport.hpp>
@@ -112,7 +113,7 @@ public:
     virtual void onAnswered(const Peer& peer, const QelMessage& request, QelMessageStatusCodes status);
 
     /// The connection of a console that onConnected() was called for has ended. Its sessions are free.
-    virtual void onDisconnected(const Peer& peer);
+    virtual void onDisconnected(const Peer& peer, DisconnectReason why);
 
 private:
     friend class HypervisorEngine;

@@ -48,7 +48,7 @@ public:
     /// @throws std::invalid_argument  names the option: "listen" (not an endpoint), "credentials" (neither credentials
     ///         nor plain), "plain" (also with credentials, or to listen on an address that is not a loopback address),
     ///         "pins" (with plain), "maxConsoles", "maxHandshakes", "maxHandshakesPerAddress", "queueBytes",
-    ///         "handshakeTimeout", "frameTimeout", "keepAlive", "linger"
+    ///         "handshakeTimeout", "frameTimeout", "keepAlive", "idleTimeout", "linger"
     /// @throws CannotListen  "cannot listen on ENDPOINT: ..."
     /// @throws SSLException  OpenSSL cannot use the credentials
     /// @throws std::logic_error  another server serves the hypervisor

@@ -38,6 +38,9 @@ struct ServerOptions {
     /// In which TCP notices that an idle peer is gone; at least 1. One that data waits for has the system's
     /// retransmission limits, which is minutes.
     std::chrono::seconds keepAlive{60};
+    /// After which a console that says nothing is let go; 0: never. A request for the time, with which consoles look
+    /// whether the server is there, says nothing. No time passes while the server does not read from the console.
+    std::chrono::seconds idleTimeout{0};
     std::chrono::milliseconds linger{2000}; ///< for the last messages to a console that is being closed; 0 or more
 };
 
