@@ -23,6 +23,7 @@ namespace {
 using ::testing::EndsWith;
 using ::testing::HasSubstr;
 using ::testing::MatchesRegex;
+using ::testing::Not;
 
 using Arguments = std::vector<std::string>;
 
@@ -57,19 +58,38 @@ TEST_F(ConsoleScriptTest, ACommandPrintsItsOutputOnly)
     EXPECT_EQ(result.exitStatus, 0);
 }
 
-TEST_F(ConsoleScriptTest, ACommandThatFailsIsTold)
+TEST_F(ConsoleScriptTest, TheExitStatusIsThatOfTheFirstCommandThatFails)
 {
-    const auto result = runConsole({"1", "--exec", "echo one", "--exec", "exit 7"});
-    EXPECT_EQ(result.output, "one\n");
+    const auto result =
+        runConsole({"1", "--exec", "echo one", "--exec", "exit 7", "--exec", "exit 5", "--exec", "echo two"});
+    EXPECT_EQ(result.output, "one\ntwo\n");
     EXPECT_EQ(result.errors, "qel: the command exited with status 7\n");
-    EXPECT_EQ(result.exitStatus, 8);
+    EXPECT_EQ(result.exitStatus, 7);
+}
+
+TEST_F(ConsoleScriptTest, FailuresOfTheConsoleItselfKeepClearOfTheStatusOfACommand)
+{
+    const auto late = runConsole({"1", "--exec", "sleep 1000", "--timeout", "0.3"});
+    EXPECT_EQ(late.errors, "qel: timed out after 0.3 s (--timeout): waiting for the end of \"sleep 1000\"\n");
+    EXPECT_EQ(late.exitStatus, 246);
+    EXPECT_EQ(runConsole({"2", "--exec", "true"}).exitStatus, 248);
+    EXPECT_EQ(runConsole({"9", "--exec", "true"}).exitStatus, 241);
+    EXPECT_EQ(runConsole({"9"}).exitStatus, 1);
+}
+
+TEST_F(ConsoleScriptTest, WhoLeavesBeforeTheEndOfAScriptHasNotFinishedIt)
+{
+    PtyProcess person(consoleTo(server.endpoint(), {"1", "--exec", "sleep 1000"}));
+    person.await("connected");
+    person.type("~.");
+    EXPECT_EQ(person.wait().exitStatus, 248);
 }
 
 TEST_F(ConsoleScriptTest, StepsAreDoneInTheirOrder)
 {
     const auto result = runConsole({"1", "--expect", "\\$ ", "--send", "echo $((6 * 7))\\r", "--expect", "^42",
-                                    "--send", "exit\\r", "--linger", "1"});
-    EXPECT_THAT(result.output, HasSubstr("42\r\n$ "));
+                                    "--expect", "\\$ ", "--send", "exit\\r", "--linger", "1"});
+    EXPECT_THAT(result.output, HasSubstr("42\r\n$ exit"));
     EXPECT_EQ(result.exitStatus, 0);
 }
 
@@ -154,6 +174,12 @@ TEST_F(ConsoleScriptTest, AProfileNamesTheServerAndItsPartitions)
     const auto result = unknown.wait();
     EXPECT_EQ(result.exitStatus, 2);
     EXPECT_EQ(result.errors, "qel: there is no partition \"lab/sell\"; did you mean \"lab/shell\"?\n");
+    Process bare(qelCommand({"console", "--connect", "127.0.0.1:1", "shell"}), environment);
+    const auto refused = bare.wait();
+    EXPECT_EQ(refused.exitStatus, 2);
+    EXPECT_EQ(refused.errors,
+              "qel: \"shell\" is no partition id from 0 to 65535 and no PROFILE/PARTITION; did you mean "
+              "\"lab/shell\"?\n");
 }
 
 // A lost connection.
@@ -203,7 +229,7 @@ TEST_F(ConsoleScriptTest, AWatcherSeesWhatIsTypedAndCanTakeOver)
     PtyProcess holder(consoleTo(server.endpoint(), {"1"}));
     holder.await("$ ");
     PtyProcess watcher(consoleTo(server.endpoint(), {"1", "--watch"}));
-    watcher.await("connected to partition 1");
+    watcher.await("watching partition 1");
     watcher.await("$ ");
     holder.type("echo $((6 * 7))\r");
     watcher.await("42\r\n");
@@ -265,6 +291,14 @@ TEST(ConsoleWatch, TakesTheFirstFreePlace)
     const WatchedServer server(3);
     const auto result = run(consoleTo(server.endpoint(), {"1", "--watch", "--no-eof"}));
     EXPECT_EQ(result.output, "look\n");
+}
+
+TEST_F(ConsoleScriptTest, TheEndOfTheInputOfAWatcherIsNotTyped)
+{
+    const auto result = runConsole({"1", "--watch", "--linger", "0.3"});
+    EXPECT_THAT(result.output, Not(HasSubstr("not passed on"))) << "a warning of the server";
+    EXPECT_EQ(result.errors, "");
+    EXPECT_EQ(result.exitStatus, 0);
 }
 
 TEST(ConsoleWatch, SaysWhenAllPlacesAreTaken)

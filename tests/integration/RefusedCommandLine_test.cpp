@@ -189,12 +189,17 @@ TEST(RefusedCommandLine, NamesWhatIsWrongWithABroadcast)
 
 TEST(RefusedCommandLine, NamesWhatConsoleLacks)
 {
-    expectRefused({}, {
-                          {{"console", "--connect", "127.0.0.1:1", "1"}, kNoCredentials},
-                          {{"console", "--connect", "192.0.2.1:1", "--plain", "1"},
-                           "--plain is refused for 192.0.2.1:1: it is not a loopback address"},
-                          {{"console", "--plain", "1"}, "--connect is required"},
-                      });
+    expectRefused({},
+                  {
+                      {{"console", "--connect", "127.0.0.1:1", "1"}, kNoCredentials},
+                      {{"console", "--connect", "192.0.2.1:1", "--plain", "1"},
+                       "--plain is refused for 192.0.2.1:1: it is not a loopback address"},
+                      {{"console", "--plain", "1"}, "--connect is required"},
+                      {{"console", "--plain", "--connect", "::1", "1"},
+                       "--connect: \"::1\": write an IPv6 address in brackets, such as [::1] or [::1]:4717"},
+                      {{"console", "--plain", "--connect", "fe80::1:4717", "1"},
+                       "--connect: \"fe80::1:4717\": write an IPv6 address in brackets, such as [::1] or [::1]:4717"},
+                  });
 }
 
 TEST(RefusedCommandLine, NamesTheArgumentOfConsoleThatIsWrong)
@@ -203,7 +208,7 @@ TEST(RefusedCommandLine, NamesTheArgumentOfConsoleThatIsWrong)
     expectRefused(common,
                   {
                       {{}, "partition is required"},
-                      {{"one"}, "partition: \"one\" is not an integer in [0, 65535]"},
+                      {{"1x"}, "partition: \"1x\" is not an integer in [0, 65535]"},
                       {{"-1"}, "partition: \"-1\" is not an integer in [0, 65535]"},
                       {{"65536"}, "partition: \"65536\" is not an integer in [0, 65535]"},
                       {{"1", "2"}, "unexpected argument \"2\"; see \"qel console --help\""},

@@ -77,11 +77,31 @@ TEST_F(ConsoleEscapesTest, TellsTheTraffic)
     open([](const std::string&) {});
     const std::string screen = runAndType("~i~l~l~.", "log off: " + logFile.path() + "\r\n");
     EXPECT_THAT(screen, HasSubstr("qel: connected to partition 1 of fake:1 (plain)"));
-    EXPECT_THAT(screen, EndsWith("qel: 0 bytes received, 0 sent, 0 held\r\nqel: the server was heard 0 s ago\r\nqel: "
+    EXPECT_THAT(screen, EndsWith("qel: 0 bytes received, 0 sent, 0 held\r\nqel: the partition has put out nothing so "
+                                 "far\r\nqel: the server was heard 0 s ago\r\nqel: "
                                  "log on: " +
                                  logFile.path() + "\r\nqel: log off: " + logFile.path() + "\r\n"));
     EXPECT_EQ(screenUntil(pty, "\n"), "qel: log on: " + logFile.path() + "\r\n");
     EXPECT_TRUE(logFile.isOn());
+}
+
+TEST_F(ConsoleEscapesTest, TellsWhenTheLastOutputCame)
+{
+    SettableClock clock;
+    open([](const std::string&) {});
+    output("x\n");
+    tool::SignalWatch signals{SIGUSR1};
+    tool::TerminalMode mode(pty.slave());
+    tool::ConsoleScreen screen(pty.slave(), errors, true, mode);
+    tool::ConsoleLoop loop(screen, pty.slave(), mode, signals, InputOptions());
+    std::thread person([&] {
+        screenUntil(pty, "x\n");
+        clock.advance(std::chrono::milliseconds(1500));
+        pty.type("~i~.");
+    });
+    loop.run(console, *session);
+    person.join();
+    EXPECT_THAT(screenUntil(pty, "ago\r\n"), EndsWith("qel: the partition's last output came 1.5 s ago\r\n"));
 }
 
 TEST_F(ConsoleEscapesTest, WithoutALogThereIsNoneToTurnOn)

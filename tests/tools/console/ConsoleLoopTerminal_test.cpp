@@ -89,6 +89,23 @@ TEST_F(ConsoleLoopTest, TypedInputIsSentAndTheLeaveCommandLeaves)
     EXPECT_EQ(errors.str(), "");
 }
 
+TEST_F(ConsoleLoopTest, WhoWatchesIsToldSoAndThePartitionHasAName)
+{
+    const Pty pty;
+    TerminalMode raw(pty.slave());
+    raw.enterRaw();
+    protocol::SerialOptions watching;
+    watching.connection = 3;
+    session.emplace(console.openSerial(kPartition, watching));
+    pty.type("~.");
+    InputOptions options;
+    options.partitionName = "lab/web1";
+    EXPECT_EQ(run(options, &pty).reason, ExitReason::Left);
+    EXPECT_EQ(screenUntil(pty, "\n"),
+              "qel: watching partition 1 (lab/web1) of fake:1 (plain); ~. at the start of a line "
+              "leaves, ~? lists the commands\r\n");
+}
+
 TEST_F(ConsoleLoopTest, TheLeaveCommandWorksWhileTheConnectionTakesNothing)
 {
     const Pty pty;

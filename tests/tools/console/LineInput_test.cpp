@@ -42,6 +42,30 @@ TEST(LineInput, CanBeCancelled)
     }
 }
 
+TEST(LineInput, ACharacterOfSeveralBytesIsErasedAsOne)
+{
+    LineInput line;
+    std::string typed = "a\xC3\xA9\xE2\x82\xAC\x7F";
+    EXPECT_EQ(line.take(typed), "a\xC3\xA9\xE2\x82\xAC\b \b");
+    EXPECT_EQ(line.text(), "a\xC3\xA9");
+    typed = "\x15\xA9\x7F\r";
+    EXPECT_EQ(line.take(typed), "\b \b\b \b\xA9\b \b\r\n");
+    EXPECT_EQ(line.text(), "");
+}
+
+TEST(LineInput, KeysThatSendSequencesOnlyRingTheBell)
+{
+    for (const char* const key : {"\x1B[A", "\x1B[1;5C", "\x1BOP", "\x1B[3~", "\x1B["}) {
+        LineInput line;
+        std::string typed = "a" + std::string(key);
+        EXPECT_EQ(line.take(typed), "a\a") << key + 1;
+        EXPECT_EQ(typed, "");
+        typed = "b\r";
+        EXPECT_EQ(line.take(typed), "b\r\n");
+        EXPECT_EQ(line.text(), "ab");
+    }
+}
+
 } // namespace
 
 } // namespace qel::test

@@ -1,4 +1,5 @@
 #include "base/Failures.hpp"
+#include "base/HomePath.hpp"
 #include "base/OptionChecks.hpp"
 #include "console/Profiles.hpp"
 #include "support/TemporaryDirectory.hpp"
@@ -16,6 +17,7 @@ namespace {
 
 using ::testing::ElementsAre;
 using ::testing::EndsWith;
+using ::testing::HasSubstr;
 using ::testing::IsEmpty;
 using ::testing::Pair;
 using tool::Profile;
@@ -124,6 +126,35 @@ TEST_F(ProfilesTest, MistakesInTheFileAreNamedWithTheirPlace)
     EXPECT_THAT(failureOf([&] { profiles("[profile.\"a/b\"]\n"); }),
                 EndsWith("the name of a profile must not contain a slash"));
     EXPECT_NE(failureOf([&] { profiles("[profile.lab.partitions]\nx = 65536\n"); }), "no error");
+}
+
+TEST_F(ProfilesTest, TheHomeDirectoryMayBeATilde)
+{
+    apply("lab/1", "[profile.lab]\nconnect = \"~/x\"\npeer-name = [\"~\", \"a~/b\"]\n");
+    EXPECT_EQ(connect, tool::environmentValue("HOME") + "/x");
+    EXPECT_THAT(names, ElementsAre("~", "a~/b"));
+}
+
+TEST_F(ProfilesTest, StepsOfAScriptAreNoOptionsOfAProfile)
+{
+    std::string steps;
+    for (const char* const name : {"send", "expect", "exec"}) {
+        command.add_option(std::string("--") + name, steps);
+        EXPECT_THAT(failureOf([&] { apply("lab/1", std::string("[profile.lab]\n") + name + " = \"x\"\n"); }),
+                    HasSubstr(std::string("unknown key \"") + name + "\""));
+    }
+}
+
+TEST_F(ProfilesTest, AWordThatIsNoPartitionIsAnsweredWithTheNearestName)
+{
+    const auto answer = [&](const std::string& word) {
+        return failureOf([&] { tool::failNoPartition(word, profiles(kLab)); });
+    };
+    const std::string text = " is no partition id from 0 to 65535 and no PROFILE/PARTITION; ";
+    EXPECT_EQ(answer("web1"), "\"web1\"" + text + "did you mean \"lab/web1\"?");
+    EXPECT_EQ(answer("web"), "\"web\"" + text + "did you mean \"lab/web1\"?");
+    EXPECT_EQ(answer("lab"), "\"lab\"" + text + "did you mean \"lab/PARTITION\"?");
+    EXPECT_EQ(answer("something"), "\"something\"" + text + "qel list shows the names of the profiles");
 }
 
 } // namespace

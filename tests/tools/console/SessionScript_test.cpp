@@ -151,6 +151,17 @@ TEST(TypedText, BackslashesStandForCharacters)
         EXPECT_EQ(tool::parseTypedText(wrong), std::nullopt) << wrong;
 }
 
+TEST(SessionScript, TheStatusIsThatOfTheFirstCommandThatFails)
+{
+    SessionScript script({{Kind::Exec, "a"}, {Kind::Exec, "b"}, {Kind::Exec, "c"}, {Kind::Exec, "d"}}, seconds(5), "7");
+    for (const char* const status : {"0", "3", "4", "0"}) {
+        script.takeInput(kStart);
+        show(script, std::string("qel-begin-7\r\nqel-end-7:") + status + "\r\n");
+    }
+    EXPECT_TRUE(script.isDone());
+    EXPECT_EQ(script.commandStatus(), 3);
+}
+
 } // namespace
 
 } // namespace qel::test

@@ -78,6 +78,8 @@ std::string checkServer(std::string& text)
         static_cast<void>(ServerAddress::parse(text));
         return {};
     } catch (const std::invalid_argument& error) {
+        if (isEndpoint("[" + text + "]:0"))
+            return tool::quoted(text) + ": write an IPv6 address in brackets, such as [::1] or [::1]:4717";
         const std::string prefix = "server: "; // the parser names the option itself
         const std::string reason = error.what();
         return reason.compare(0, prefix.size(), prefix) == 0 ? reason.substr(prefix.size()) : reason;

@@ -2,6 +2,7 @@
 
 #include <qel/protocol/Text.hpp>
 
+#include "base/Failures.hpp"
 #include "base/Library.hpp"
 #include "base/Logging.hpp"
 #include "base/OptionChecks.hpp"
@@ -42,8 +43,9 @@ for the characters that they usually mean. A regular expression is a POSIX exten
 
 Exit status: 0 the command ended with 0, or you left; 1 a request was refused, the server has the wrong certificate, or
 another console took the session; 2 usage error; 3 cannot connect; 4 failure on this machine; 5 the server broke the
-protocol; 6 timeout; 7 the server shut down or the connection was lost; 8 the partition's command, or that of --exec,
-failed.)";
+protocol; 6 timeout; 7 the server shut down or the connection was lost; 8 the partition's command failed, or --send and
+--expect could not be finished. With --exec: the exit status of the first command that failed, or 0; when the console
+itself has failed, the above and 240, such as 243 for cannot connect, except for 2.)";
 
 struct CommandOptions {
     std::string target; ///< the partition as it was given
@@ -96,7 +98,9 @@ InputOptions CommandOptions::inputOptions() const
     InputOptions options;
     options.escape = parseEscape(escape);
     options.keepAlive = inMilliseconds(keepAliveSeconds);
-    options.sendsEnd = !noEof;
+    const bool isWatching = run.watch || run.serial.connection != 0; // and its input is not passed on
+    options.sendsEnd = !noEof && !isWatching;
+    options.partitionName = run.name;
     if (lingerSeconds) options.linger = inMilliseconds(*lingerSeconds);
     return options;
 }
@@ -104,7 +108,8 @@ InputOptions CommandOptions::inputOptions() const
 std::string checkTarget(std::string& text)
 {
     constexpr std::uint64_t kMaxPartition = 65535;
-    return namesProfile(text) ? std::string() : integerIn(0, kMaxPartition)(text);
+    const bool isName = namesProfile(text) || text.find_first_of("-0123456789") != 0;
+    return isName ? std::string() : integerIn(0, kMaxPartition)(text); // for names see findPartition()
 }
 
 /// Reads the partition, and the profile that the command line names.
@@ -112,8 +117,11 @@ void findPartition(CLI::App& command, CommandOptions& options)
 {
     if (namesProfile(options.target)) {
         options.run.partition = applyProfile(options.target, readProfiles(profilesPath()), command);
+        options.run.name = options.target;
+    } else if (const auto number = parseInteger(options.target)) {
+        options.run.partition = static_cast<std::uint16_t>(*number);
     } else {
-        options.run.partition = static_cast<std::uint16_t>(*parseInteger(options.target));
+        failNoPartition(options.target, readProfiles(profilesPath()));
     }
 }
 
@@ -139,11 +147,32 @@ std::vector<ScriptStep> stepsOf(const CLI::App& command, const CommandOptions& o
     return steps;
 }
 
+/// With --exec the exit status is that of the command. Those of this program are then moved out of its way, to where
+/// hardly any command has its own.
+ExitStatus besideCommand(ExitStatus own)
+{
+    constexpr int kOffset = 240;
+    return ExitStatus{kOffset + static_cast<int>(own)};
+}
+
+ExitStatus runCommands(ConsoleRun& run)
+{
+    try {
+        const ExitStatus own = run.run();
+        return own == ExitStatus::Done ? ExitStatus{run.commandStatus().value_or(0)} : besideCommand(own);
+    } catch (const std::bad_alloc&) {
+        throw;
+    } catch (const std::exception& error) {
+        throw CommandFailure(besideCommand(exitStatusOf(error)), userMessage(error));
+    }
+}
+
 ExitStatus runConsole(const CommandOptions& options)
 {
     startLogging(options.log, "qel-console.log");
     static_cast<void>(std::signal(SIGPIPE, SIG_IGN)); // the terminal must be restored even when the output is closed
-    return ConsoleRun(options.run).run();
+    ConsoleRun run(options.run);
+    return options.commands.empty() ? run.run() : runCommands(run);
 }
 
 void addEscape(CLI::App& command, CommandOptions& options)
@@ -218,8 +247,8 @@ void addScriptOptions(CLI::App& command, CommandOptions& options)
         ->check(CLI::Validator(checkPattern, ""));
     command
         .add_option("--exec", options.commands,
-                    "Run a command with sh -c at the shell of the partition, print only its output, and fail if it "
-                    "fails; at most --timeout")
+                    "Run a command with sh -c at the shell of the partition, print only its output, and end with its "
+                    "exit status; at most --timeout")
         ->type_name("COMMAND")
         ->allow_extra_args(false)
         ->check(textUpTo(kMaxCommand));

@@ -3,6 +3,7 @@
 #include <qel/common/util/PosixError.hpp>
 #include <qel/common/util/TimeProvider.hpp>
 
+#include "base/HomePath.hpp"
 #include "console/ConsoleLoop.hpp"
 #include "console/ConsoleTexts.hpp"
 
@@ -16,9 +17,10 @@ namespace {
 /// How often the progress of a file is told.
 constexpr std::chrono::seconds kProgressInterval{1};
 
-std::string secondsText(std::chrono::milliseconds duration)
+std::string secondsText(PollDeadline::time_point::duration duration)
 {
-    return numberText(std::chrono::duration<double>(duration).count()) + " s";
+    const auto milliseconds = std::chrono::floor<std::chrono::milliseconds>(duration);
+    return numberText(std::chrono::duration<double>(milliseconds).count()) + " s";
 }
 
 /// @return false: the descriptor has no window, or does not know its size
@@ -85,7 +87,9 @@ void ConsoleLoop::pTellAbout()
     mScreen.say(pGreeting());
     mScreen.say(filled(texts::kInfoTraffic,
                        {std::to_string(mReceived), std::to_string(mSession->getSent()), std::to_string(mHeld.size())}));
-    mScreen.say(filled(texts::kInfoHeard, {secondsText(mKeepAlive.silence(TimeProvider::steady()))}));
+    const auto now = TimeProvider::steady();
+    mScreen.say(mLastOutput ? filled(texts::kInfoOutput, {secondsText(now - *mLastOutput)}) : texts::kInfoNoOutput);
+    mScreen.say(filled(texts::kInfoHeard, {secondsText(mKeepAlive.silence(now))}));
     if (const auto roundTrip = mKeepAlive.roundTrip()) {
         const double milliseconds = std::chrono::duration<double, std::milli>(*roundTrip).count();
         mScreen.say(filled(texts::kInfoRoundTrip, {numberText(milliseconds)}));
@@ -146,8 +150,9 @@ void ConsoleLoop::pAnswerPrompt(std::string& typed)
     pBeginFile(path);
 }
 
-void ConsoleLoop::pBeginFile(const std::string& path)
+void ConsoleLoop::pBeginFile(const std::string& typed)
 {
+    const std::string path = expandHome(typed);
     try {
         mFile.emplace(path);
     } catch (const FileIOError& error) {

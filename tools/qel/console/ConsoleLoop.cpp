@@ -111,6 +111,7 @@ void ConsoleLoop::pBegin(Console& console, SerialSession& session)
     mFailure = nullptr;
     mSendBroken = false;
     mReceived = 0;
+    mLastOutput.reset();
     mKeepAlive.watch(console, TimeProvider::steady());
     mMode.enterRaw();
     if (mMode.isTerminal()) mScreen.say(pGreeting());
@@ -123,7 +124,10 @@ std::string ConsoleLoop::pGreeting() const
         mConsole->isProtected() ? filled(texts::kProtected, {quoted(mConsole->peer().commonName)}) : texts::kPlain;
     const std::string escapes = mInputOptions.escape ? filled(texts::kEscapes, {characterName(*mInputOptions.escape)})
                                                      : std::string(texts::kNoEscape);
-    return filled(texts::kConnected, {std::to_string(mSession->getPartition()), mConsole->getServer(), peer, escapes});
+    std::string partition = std::to_string(mSession->getPartition());
+    if (!mInputOptions.partitionName.empty()) partition += " (" + printable(mInputOptions.partitionName) + ")";
+    const char* const text = mSession->getConnection() == 0 ? texts::kConnected : texts::kWatching;
+    return filled(text, {partition, mConsole->getServer(), peer, escapes});
 }
 
 bool ConsoleLoop::pIsDone() const
@@ -267,6 +271,7 @@ void ConsoleLoop::pShowReceived()
     const std::size_t count = mScreen.showOutput(*mSession);
     if (count == 0) return;
     mReceived += count;
+    mLastOutput = TimeProvider::steady();
     pReportFailures();
 }
 

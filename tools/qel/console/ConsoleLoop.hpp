@@ -32,6 +32,8 @@ namespace qel::tool {
 struct InputOptions {
     /// The escape character on a terminal; none: there are no commands.
     std::optional<char> escape = '~';
+    /// What the user calls the partition; empty: nothing.
+    std::string partitionName;
     /// After how much silence of the server the user is told; 0: never.
     std::chrono::milliseconds keepAlive{0};
 
@@ -156,7 +158,7 @@ private:
     void pTypeWindowSize();
     void pAskForFile();
     void pAnswerPrompt(std::string& typed);
-    void pBeginFile(const std::string& path);
+    void pBeginFile(const std::string& typed);
     void pFeedFile();
     void pEndFile(const char* text);
     void pNoteResize();
@@ -186,7 +188,8 @@ private:
     // Of the current run(); null: none.
     Console* mConsole = nullptr;
     SerialSession* mSession = nullptr;
-    std::uint64_t mReceived = 0; // bytes
+    std::uint64_t mReceived = 0;                         // bytes
+    std::optional<PollDeadline::time_point> mLastOutput; // when the partition's last output came
 
     bool mIsAttending = false;              // inside a call of the library: it must not be called again
     bool mInputOpen = true;                 // false after the end of the input

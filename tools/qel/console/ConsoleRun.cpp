@@ -305,7 +305,7 @@ ExitStatus ConsoleRun::pConclude(const ConsoleLoop::Outcome& outcome, SessionEnd
         mScreen.output().writeSome();
         mScreen.output().drop(); // nobody waits for the screen
         if (mMode.isTerminal()) mScreen.say(pLeftText(outcome));
-        return ExitStatus::Done;
+        return mScript && !mScript->isDone() ? ExitStatus::CommandFailed : ExitStatus::Done;
     case ConsoleLoop::ExitReason::Ended:
         if (mScript && !mScript->isDone()) {
             throw CommandFailure(ExitStatus::CommandFailed,
@@ -315,9 +315,9 @@ ExitStatus ConsoleRun::pConclude(const ConsoleLoop::Outcome& outcome, SessionEnd
         return pStatusOf(end);
     default:
         mScreen.output().flush();
-        if (!mScript || mScript->commandStatus().value_or(0) == 0) return ExitStatus::Done;
-        mScreen.say(filled(texts::kCommandStatus, {std::to_string(*mScript->commandStatus())}));
-        return ExitStatus::CommandFailed;
+        if (commandStatus().value_or(0) != 0)
+            mScreen.say(filled(texts::kCommandStatus, {std::to_string(*commandStatus())}));
+        return ExitStatus::Done;
     }
 }
 

@@ -29,6 +29,7 @@ namespace qel::tool {
 struct ConsoleRunOptions {
     ConnectOptions connect;
     std::uint16_t partition = 0;
+    std::string name; ///< of the partition, for its user; empty: none
     SerialOptions serial;
     bool watch = false;     ///< with the first connection number from 1 on that is free
     bool reconnect = false; ///< when the connection is lost
@@ -50,6 +51,9 @@ public:
     /// Connects, opens the session, moves data, and leaves.
     /// @throws CommandFailure, and what connectConsole() throws
     ExitStatus run();
+
+    /// With --exec: the exit status of the first command that failed, or 0; none: no command has ended.
+    std::optional<int> commandStatus() const { return mScript ? mScript->commandStatus() : std::nullopt; }
 
 private:
     using TimePoint = std::chrono::steady_clock::time_point;

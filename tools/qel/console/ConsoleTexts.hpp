@@ -18,6 +18,7 @@ namespace texts {
 
 // The session.
 constexpr const char* kConnected = "connected to partition $1 of $2 ($3); $4";
+constexpr const char* kWatching = "watching partition $1 of $2 ($3); $4";
 constexpr const char* kEscapes = "$1. at the start of a line leaves, $1? lists the commands";
 constexpr const char* kNoEscape = "there is no escape character";
 constexpr const char* kPlain = "plain";
@@ -68,6 +69,8 @@ constexpr const char* kNoWindow = "the size of this window is not known";
 constexpr const char* kForcing = "opening partition $1 again by force";
 
 constexpr const char* kInfoTraffic = "$1 bytes received, $2 sent, $3 held";
+constexpr const char* kInfoOutput = "the partition's last output came $1 ago";
+constexpr const char* kInfoNoOutput = "the partition has put out nothing so far";
 constexpr const char* kInfoHeard = "the server was heard $1 ago";
 constexpr const char* kInfoRoundTrip = "it last answered in $1 ms";
 constexpr const char* kInfoLog = "log $1: $2";

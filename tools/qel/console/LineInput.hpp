@@ -6,7 +6,8 @@
 namespace qel::tool {
 
 /// A line that a person types at a terminal in raw mode, with the keys to correct it: backspace, control-U; return
-/// ends it, control-C and escape cancel it. Other control characters ring the bell.
+/// ends it, control-C and escape cancel it. Other control characters ring the bell, and so do cursor and function keys,
+/// which send several bytes at once that begin with escape.
 /// Thread safety: one thread.
 class LineInput {
 public:
@@ -21,6 +22,7 @@ public:
 
 private:
     std::string pTake(char c);
+    void pEraseCharacter();
 
     std::string mText;
     State mState = State::Open;

@@ -3,13 +3,14 @@
 #include <qel/protocol/Text.hpp>
 
 #include "base/Failures.hpp"
+#include "base/HomePath.hpp"
 #include "base/Library.hpp"
 #include "base/OptionChecks.hpp"
 #include "base/UsageErrors.hpp"
 
 #include <algorithm>
-#include <cstdlib>
 #include <filesystem>
+#include <iterator>
 #include <limits>
 #include <optional>
 
@@ -19,12 +20,6 @@ namespace {
 
 constexpr const char* kPartitions = "partitions";
 constexpr std::uint16_t kMaxPartition = std::numeric_limits<std::uint16_t>::max();
-
-std::string variable(const char* name)
-{
-    const char* const value = std::getenv(name);
-    return value == nullptr ? std::string() : value;
-}
 
 [[noreturn]] void failUnknown(const char* kind, const std::string& word, const std::vector<std::string>& known)
 {
@@ -66,13 +61,17 @@ std::uint16_t findPartition(const std::string& name, const Profile& profile)
     failUnknown("partition", profile.name + "/" + name, names);
 }
 
+/// The options that are for one run. The order of the steps of a script counts, and keys of a table have none.
+constexpr const char* kOfOneRun[] = {"help", "version", "send", "expect", "exec"};
+
 /// The long names of the options that a profile can set.
 std::vector<std::string> optionNames(const CLI::App& command)
 {
     std::vector<std::string> names{kPartitions};
     for (const CLI::Option* option : command.get_options()) {
         for (const std::string& name : option->get_lnames()) {
-            if (name != "help" && name != "version") names.push_back(name);
+            if (std::find(std::begin(kOfOneRun), std::end(kOfOneRun), name) == std::end(kOfOneRun))
+                names.push_back(name);
         }
     }
     return names;
@@ -88,7 +87,7 @@ void setOption(CLI::Option& option, const TomlEntry& entry)
             option.add_result("true");
         } else {
             for (const TomlValue* item : itemsOf(entry))
-                option.add_result(item->text);
+                option.add_result(expandHome(item->text));
         }
         option.run_callback();
     } catch (const CLI::ParseError& error) {
@@ -106,9 +105,9 @@ std::string Profile::option(const std::string& key) const
 
 std::string profilesPath()
 {
-    const std::string configuration = variable("XDG_CONFIG_HOME");
+    const std::string configuration = environmentValue("XDG_CONFIG_HOME");
     if (!configuration.empty()) return configuration + "/qel/config.toml";
-    const std::string home = variable("HOME");
+    const std::string home = environmentValue("HOME");
     return home.empty() ? home : home + "/.config/qel/config.toml";
 }
 
@@ -138,6 +137,27 @@ std::uint16_t applyProfile(const std::string& target, const std::vector<Profile>
         if (entry.key != kPartitions) setOption(*findOption(command, entry.key), entry);
     }
     return partition;
+}
+
+void failNoPartition(const std::string& word, const std::vector<Profile>& profiles)
+{
+    std::vector<std::string> words;
+    std::vector<std::string> targets; // that the words stand for
+    for (const Profile& profile : profiles) {
+        for (const auto& partition : profile.partitions) {
+            words.push_back(partition.first);
+            targets.push_back(profile.name + "/" + partition.first);
+        }
+        words.push_back(profile.name);
+        targets.push_back(profile.name + "/PARTITION");
+    }
+    const auto guess = std::find(words.begin(), words.end(), nearestWord(word, words));
+    const std::string hint =
+        guess == words.end()
+            ? "; qel list shows the names of the profiles"
+            : "; did you mean " + tool::quoted(targets[static_cast<std::size_t>(guess - words.begin())]) + "?";
+    throw CommandFailure(ExitStatus::Usage, quoted(word) + " is no partition id from 0 to " +
+                                                std::to_string(kMaxPartition) + " and no PROFILE/PARTITION" + hint);
 }
 
 } // namespace qel::tool

@@ -43,11 +43,16 @@ std::vector<Profile> readProfiles(const std::string& path);
 bool namesProfile(const std::string& target);
 
 /// Sets the options of a command from a profile, except those that the command line gives, and finds the partition.
+/// "~/" at the beginning of a value is the home directory.
 /// @param target  "PROFILE/PARTITION"
-/// @param command  whose options the profile sets; all long names except --help and --version
+/// @param command  whose options the profile sets; all long names except --help, --version, --send, --expect and --exec
 /// @return the partition id
 /// @throws CommandFailure  Usage: there is no such profile or partition, with the nearest name; or an option of the
 ///         profile is unknown or has a wrong value, with its place
 std::uint16_t applyProfile(const std::string& target, const std::vector<Profile>& profiles, CLI::App& command);
+
+/// Refuses a word that is neither a partition id nor "PROFILE/PARTITION".
+/// @throws CommandFailure  Usage: with the nearest name
+[[noreturn]] void failNoPartition(const std::string& word, const std::vector<Profile>& profiles);
 
 } // namespace qel::tool

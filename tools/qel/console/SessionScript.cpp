@@ -130,7 +130,8 @@ bool SessionScript::pMatchCommand()
         pKeepCommandOutput(mUnused.size() - held);
         return false;
     }
-    mStatus = std::atoi(mUnused.c_str() + place + end.size());
+    const int status = std::atoi(mUnused.c_str() + place + end.size());
+    if (mStatus.value_or(0) == 0) mStatus = status;
     pKeepCommandOutput(place);
     mUnused.erase(0, mUnused.find('\n') + 1);
     mIsInCommand = false;

@@ -62,7 +62,7 @@ public:
     /// The step that waits, in words: `output that matches "login:"`.
     std::string waitsFor() const;
 
-    /// The exit status of the last command; none: there has been none.
+    /// The exit status of the first command that failed, or 0; none: no command has ended.
     std::optional<int> commandStatus() const noexcept { return mStatus; }
 
     /// What the commands have put out since the last call, without the marks, and with the line ends of the command
