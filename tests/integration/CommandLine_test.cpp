@@ -39,7 +39,9 @@ TEST(CommandLine, EveryLevelHasHelpAndVersion)
         {"call", "broadcast"},
         {"console"},
         {"bench"},
-        {"decode"}, // those of "ca" have a test beside the others of "ca"
+        {"decode"},
+        {"check"},
+        {"check", "server"}, // those of "ca" have a test beside the others of "ca"
     };
     for (std::vector<std::string> level : levels) {
         SCOPED_TRACE(joined(level));

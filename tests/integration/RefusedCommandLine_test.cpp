@@ -45,7 +45,7 @@ TEST(RefusedCommandLine, NamesUnknownSubcommandsAndOptions)
     expectRefused(
         {},
         {
-            {{}, "a subcommand is missing: serve, call, console, list, bench, decode, ca; see \"qel --help\""},
+            {{}, "a subcommand is missing: serve, call, console, list, bench, decode, check, ca; see \"qel --help\""},
             {{"nonsense"}, "unknown subcommand \"nonsense\"; see \"qel --help\""},
             {{"--nonsense"}, "unknown option \"--nonsense\"; see \"qel --help\""},
             {{"cosole", "--connect", "x"}, "unknown subcommand \"cosole\"; did you mean \"console\"?"},

@@ -2,6 +2,7 @@
 
 #include "bench/BenchCommand.hpp"
 #include "certificates/CaCommand.hpp"
+#include "check/CheckCommand.hpp"
 #include "client/CallCommand.hpp"
 #include "console/ConsoleCommand.hpp"
 #include "console/ListCommand.hpp"
@@ -18,6 +19,7 @@ void addCommands(CLI::App& app, Action& action)
     addListCommand(app, action);
     addBenchCommand(app, action);
     addDecodeCommand(app, action);
+    addCheckCommand(app, action);
     addCaCommand(app, action);
 }
 

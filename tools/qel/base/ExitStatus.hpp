@@ -5,7 +5,7 @@ namespace qel::tool {
 /// The exit statuses of the program. Each has the same meaning in every subcommand.
 enum class ExitStatus : int {
     Done = 0,           ///< success
-    Refused = 1,        ///< the peer refused a request, or the checked input is not valid
+    Refused = 1,        ///< the peer refused a request, or what was checked, an input or a peer, is not right
     Usage = 2,          ///< the command line is wrong
     CannotConnect = 3,  ///< connecting to the endpoint, or listening on it, failed
     Failed = 4,         ///< a failure on this machine: no memory, no room for the output

@@ -7,10 +7,10 @@
 #include "base/Library.hpp"
 #include "base/Logging.hpp"
 #include "base/OptionChecks.hpp"
+#include "base/ProgressBar.hpp"
 #include "base/SignalWatch.hpp"
 #include "bench/BenchReport.hpp"
 #include "bench/BenchRun.hpp"
-#include "bench/ProgressBar.hpp"
 #include "client/CallRequests.hpp"
 #include "client/ConnectOptions.hpp"
 

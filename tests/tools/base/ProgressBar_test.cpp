@@ -1,4 +1,4 @@
-#include "bench/ProgressBar.hpp"
+#include "base/ProgressBar.hpp"
 #include "support/Pty.hpp"
 
 #include <gtest/gtest.h>

@@ -26,6 +26,9 @@ public:
     /// @param remark  printed after the bar
     void update(double fraction, const std::string& remark);
 
+    /// Clears the line, for text that goes to the same terminal.
+    void clear() { pWrite("\r\x1B[K"); }
+
     /// The line for a terminal of `columns` columns; one column shorter, so that the cursor stays on it.
     static std::string line(double fraction, const std::string& remark, std::size_t columns);
 

@@ -1,4 +1,4 @@
-#include "bench/ProgressBar.hpp"
+#include "base/ProgressBar.hpp"
 
 #include <algorithm>
 #include <cmath>
@@ -16,7 +16,7 @@ constexpr std::size_t kMaxBar = 40;
 
 ProgressBar::ProgressBar(int descriptor) noexcept : mDescriptor(descriptor), mShown(::isatty(descriptor) == 1) {}
 
-ProgressBar::~ProgressBar() { pWrite("\r\x1B[K"); }
+ProgressBar::~ProgressBar() { clear(); }
 
 void ProgressBar::update(double fraction, const std::string& remark)
 {
