@@ -113,6 +113,12 @@ bool QelMessageQueue::hasRoom(MessageQueuingOptions options) const
     return limiter.canEnqueue(mStats.getPending().mBytes);
 }
 
+QelMessageQueueStatistics QelMessageQueue::getStatistics() const
+{
+    const MutexLock lock(mLock);
+    return mStats;
+}
+
 std::unique_ptr<QelMessage> QelMessageQueue::waitForMsg(const std::chrono::milliseconds& timeout)
 {
     UniqueMutexLock lock(mLock);

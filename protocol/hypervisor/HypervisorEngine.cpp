@@ -220,6 +220,19 @@ std::vector<PartitionState> HypervisorEngine::partitions() const
     return mPartitions.states();
 }
 
+std::vector<ConnectedConsole> HypervisorEngine::consoles() const
+{
+    const MutexLock lock(mMutex);
+    std::vector<ConnectedConsole> consoles(mConsoles.size());
+    auto next = consoles.begin();
+    for (const auto& entry : mConsoles) {
+        next->peer = entry.second.peer;
+        next->isIdentified = entry.second.announced;
+        ++next;
+    }
+    return consoles;
+}
+
 bool HypervisorEngine::closeSession(std::uint16_t partition, std::uint16_t number)
 {
     const DeferredWakeUps wakeUps;

@@ -6,6 +6,7 @@
 #include <qel/common/util/Mutex.hpp>
 #include <qel/common/util/Poll.hpp>
 #include <qel/protocol/Hypervisor.hpp>
+#include <qel/protocol/ServerState.hpp>
 
 #include "hypervisor/ConsoleEntry.hpp"
 #include "hypervisor/PartitionSet.hpp"
@@ -104,6 +105,8 @@ public:
     bool changePartition(std::uint16_t id, const PartitionOptions& options);
     bool removePartition(std::uint16_t id);
     std::vector<PartitionState> partitions() const;
+    /// Who is connected: see Server::state().
+    std::vector<ConnectedConsole> consoles() const;
     bool closeSession(std::uint16_t partition, std::uint16_t number);
     bool sendBreak(std::uint16_t partition);
 

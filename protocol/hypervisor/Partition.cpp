@@ -58,8 +58,13 @@ PartitionState Partition::state() const
             mOutputBytes,
             mInputBytes,
             mStarts,
+            mSessions.sentMessages(),
+            mInputMessages,
+            mSessions.skippedBytes(),
+            mDroppedBytes,
             static_cast<std::size_t>(mOutput.end() - mOutput.begin()),
-            mInput.size()};
+            mInput.size(),
+            mOptions.replayBytes};
 }
 
 QelMessageStatusCodes Partition::open(ConsoleEntry& console, std::uint16_t number, bool force)
@@ -98,14 +103,17 @@ bool Partition::feed(const ConsoleEntry& console, std::uint16_t number, const ch
     if (!mSessions.isOf(number, console) || !mSessions.isSetUp(number)) return false;
     if (length == 0) return true;
     mEvents.changed = true;
+    ++mInputMessages;
     if (number != PartitionSessions::kTyping) {
         mSessions.refuseInput(number, "watching only, input is not passed on");
     } else if (!mIsLost && (mState == State::Up || mState == State::ComingUp || pIsFirstStartDue())) {
         mInput.append(data, length);
         pPumpInput();
+        return true;
     } else if (mIsLost) { // also while it connects: the second half of a line that was typed blindly is worse than none
         mSessions.refuseInput(number, "the line is down, input is dropped");
     } // nothing reads what is typed after the end of a command
+    mDroppedBytes += length;
     return true;
 }
 

@@ -150,6 +150,8 @@ private:
     std::uint64_t mOutputBytes = 0;
     std::uint64_t mInputBytes = 0;
     std::uint64_t mStarts = 0;
+    std::uint64_t mInputMessages = 0;
+    std::uint64_t mDroppedBytes = 0; ///< of input, before it was for the line
 
     State mState = State::Down;
     bool mIsRetired = false;

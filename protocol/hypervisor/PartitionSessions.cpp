@@ -184,7 +184,14 @@ void PartitionSessions::pSkipLost(std::uint16_t number, Session& session)
     if (session.next >= mOutput.begin()) return;
     const std::uint64_t kept = mOutput.end() - mOutput.begin();
     const std::uint64_t goOn = mOutput.end() - (number == kTyping ? kept : kept / 2);
+    pSkip(session, goOn);
+}
+
+/// Leaves out what a session has still to get before an offset, and says so in its data.
+void PartitionSessions::pSkip(Session& session, std::uint64_t goOn)
+{
     session.aside += skippedText(goOn - session.next);
+    mSkippedBytes += goOn - session.next;
     session.next = goOn;
 }
 
@@ -193,8 +200,7 @@ void PartitionSessions::pFinish(std::uint16_t number, Session& session)
 {
     pDeliver(number, session);
     if (!session.isSetUp || pIsCaughtUp(session)) return;
-    session.aside += skippedText(mOutput.end() - session.next);
-    session.next = mOutput.end();
+    pSkip(session, mOutput.end());
     session.console->link.post(pMessage(number, session.aside.data(), session.aside.size()));
     session.aside.clear();
 }
@@ -215,11 +221,12 @@ PartitionSessions::Sessions::iterator PartitionSessions::pEnd(Sessions::iterator
     return next;
 }
 
-std::unique_ptr<QelMessage> PartitionSessions::pMessage(std::uint16_t number, const char* data,
-                                                        std::size_t length) const
+std::unique_ptr<QelMessage> PartitionSessions::pMessage(std::uint16_t number, const char* data, std::size_t length)
 {
-    return std::make_unique<QelMessageVirtualSerialDataToDaxAsync>(mPartition, number,
-                                                                   static_cast<std::uint16_t>(length), data);
+    auto message = std::make_unique<QelMessageVirtualSerialDataToDaxAsync>(mPartition, number,
+                                                                           static_cast<std::uint16_t>(length), data);
+    ++mSentMessages;
+    return message;
 }
 
 } // namespace qel::protocol

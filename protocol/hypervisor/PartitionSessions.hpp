@@ -84,6 +84,11 @@ public:
     /// The sessions that are open, by number.
     std::vector<SessionState> states() const;
 
+    // Since the partition was added.
+
+    std::uint64_t sentMessages() const noexcept { return mSentMessages; }
+    std::uint64_t skippedBytes() const noexcept { return mSkippedBytes; }
+
     /// Sends what there is room for, a bounded part at a time.
     void deliver();
 
@@ -104,11 +109,14 @@ private:
     void pFinish(std::uint16_t number, Session& session);
     bool pIsCaughtUp(const Session& session) const;
     Sessions::iterator pEnd(Sessions::iterator session, CloseReason reason, const CommandEnd& end);
-    std::unique_ptr<QelMessage> pMessage(std::uint16_t number, const char* data, std::size_t length) const;
+    void pSkip(Session& session, std::uint64_t goOn);
+    std::unique_ptr<QelMessage> pMessage(std::uint16_t number, const char* data, std::size_t length);
 
     const std::uint16_t mPartition;
     const OutputHistory& mOutput;
     Sessions mSessions;
+    std::uint64_t mSentMessages = 0; ///< of serial data
+    std::uint64_t mSkippedBytes = 0; ///< of output, that sessions have not got
 };
 
 } // namespace qel::protocol

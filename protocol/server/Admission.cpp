@@ -1,7 +1,6 @@
 #include "server/Admission.hpp"
 
 #include <qel/common/util/TimeProvider.hpp>
-#include <qel/protocol/Error.hpp>
 #include <qel/protocol/Handshake.hpp>
 
 #include "server/LastWords.hpp"
@@ -17,13 +16,13 @@ PeerIdentity Admission::run(PollDeadline::time_point end)
 {
     if (!pAwaitFirstByte(end) || !pEnterStream()) {
         pTurnAway(end);
-        throw Error("the server stops");
+        throw NoMoreConsoles("the server stops");
     }
     limitTo(mClear, end);
     awaitUpgrade(mClear, mDescriptor);
     if (!mHypervisor.takesConsoles()) {
         pTurnAway(end);
-        throw Error("no more consoles are taken");
+        throw NoMoreConsoles("no more consoles are taken");
     }
     limitTo(mClear, end);
     grantUpgrade(mClear);

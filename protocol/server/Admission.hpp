@@ -4,6 +4,7 @@
 #include <qel/common/security/SSLStream.hpp>
 #include <qel/common/util/Mutex.hpp>
 #include <qel/common/util/Poll.hpp>
+#include <qel/protocol/Error.hpp>
 #include <qel/protocol/PeerIdentity.hpp>
 #include <qel/protocol/PeerPins.hpp>
 
@@ -12,6 +13,12 @@
 #include <string>
 
 namespace qel::protocol {
+
+/// The server takes no more consoles, or stops.
+class NoMoreConsoles : public Error {
+public:
+    using Error::Error;
+};
 
 /// The steps of one connection of the hypervisor end from the first byte to TLS: those of Handshake.hpp, and the check
 /// of the console's certificate.
@@ -33,6 +40,7 @@ public:
     /// @param end  the deadline of all steps
     /// @return who the console is
     /// @throws Error  it is not admitted; the caller closes the connection
+    /// @throws NoMoreConsoles  one of these errors
     /// @throws PosixError, SSLException, std::bad_alloc  something has run out
     PeerIdentity run(PollDeadline::time_point end);
 

@@ -115,6 +115,18 @@ bool Connection::dumpStatistics(std::ostream& os) const
     return true;
 }
 
+ConnectedConsole Connection::state() const
+{
+    ConnectedConsole state;
+    state.peer.id = mId;
+    state.peer.address = mAddress;
+    state.since = mSince;
+    state.received.mCount = mReceivedMessages.load(std::memory_order_relaxed);
+    state.received.mBytes = mReceivedBytes.load(std::memory_order_relaxed);
+    state.queue = queueState();
+    return state;
+}
+
 void Connection::resumeReading()
 {
     if (mHeldBack) mWake.interrupt();
@@ -193,13 +205,26 @@ void Connection::pReceiveAll()
         if (!mBuffered.hasPending()) sendOwn();
         mFrames.beginFrame();
         const std::unique_ptr<QelMessage> message = mMessages.read();
+        pCountReceived(*message);
         const Received received = pHandOver(*message);
         mayRead = received.mayReadNext;
         // The hypervisor closes the connection and ignores further messages. The console may still take what is queued
         // for it, within the linger time.
-        if (received.state == ConsoleState::Closing && !waitUntilWritten(mServices.limits.linger)) abort();
+        if (received.state == ConsoleState::Closing) {
+            pCountRefusal(ConnectionRefusal::RequestRefused);
+            if (!waitUntilWritten(mServices.limits.linger)) abort();
+        }
         if (received.state == ConsoleState::Identified && !mHandshake.isDisabled()) pOnIdentified();
     }
+    pCountRefusal(ConnectionRefusal::Left);
+}
+
+/// Without an instruction that locks: no other thread writes these.
+void Connection::pCountReceived(const QelMessage& message) noexcept
+{
+    constexpr auto kRelaxed = std::memory_order_relaxed;
+    mReceivedMessages.store(mReceivedMessages.load(kRelaxed) + 1, kRelaxed);
+    mReceivedBytes.store(mReceivedBytes.load(kRelaxed) + message.msgLength(), kRelaxed);
 }
 
 /// What the message causes for one other console goes out on this thread, unless the next message is waiting already.
@@ -260,6 +285,7 @@ void Connection::pFinish() noexcept
 void Connection::pReportFailure() noexcept
 {
     mWhy = DisconnectReason::Failure;
+    pCountRefusal(currentRefusal());
     try {
         throw;
     } catch (const QelMessageValidationException& error) {
@@ -272,6 +298,13 @@ void Connection::pReportFailure() noexcept
     } catch (...) {
         logCurrent(mName);
     }
+}
+
+/// Counts the connection as refused unless its console has been connected.
+void Connection::pCountRefusal(ConnectionRefusal reason) noexcept
+{
+    if (mHandshake.isDisabled() || std::exchange(mIsCounted, true)) return;
+    mServices.refusals.count(reason);
 }
 
 void Connection::pReport(const StreamIOException& error) noexcept

@@ -7,6 +7,7 @@
 #include <qel/common/security/SSLContext.hpp>
 #include <qel/common/security/SSLStream.hpp>
 #include <qel/common/util/Poll.hpp>
+#include <qel/common/util/TimeProvider.hpp>
 #include <qel/protocol/PeerPins.hpp>
 #include <qel/protocol/WakeUp.hpp>
 
@@ -17,11 +18,13 @@
 #include "server/LogThrottle.hpp"
 #include "server/Outbox.hpp"
 #include "server/RecordStream.hpp"
+#include "server/RefusalCounts.hpp"
 #include "server/WireStream.hpp"
 
 #include <atomic>
 #include <chrono>
 #include <cstddef>
+#include <cstdint>
 #include <memory>
 #include <optional>
 #include <ostream>
@@ -45,6 +48,7 @@ struct ConnectionServices {
     ConnectionLimits limits;
     LogThrottle& throttle;
     PollInterrupt& ended; ///< interrupted when a connection has ended
+    RefusalCounts& refusals;
 };
 
 /// A stream to a console, before anything has been transferred.
@@ -90,6 +94,9 @@ public:
     /// True once the threads have nothing left to do.
     bool hasEnded() const noexcept { return mEnded; }
 
+    /// What has passed so far. Of the peer only the id, 0 in the TLS handshake, and the address are set.
+    ConnectedConsole state() const;
+
     /// Prints a line that names the console, and the statistics of its queue, indented; nothing in the handshake.
     /// @return whether something was printed
     bool dumpStatistics(std::ostream& os) const;
@@ -115,11 +122,13 @@ private:
     void pJoinHandshake() noexcept;
     void pRead() noexcept;
     void pReceiveAll();
+    void pCountReceived(const QelMessage& message) noexcept;
     Received pHandOver(const QelMessage& message);
     void pOnIdentified();
     bool pAwaitReceive();
     void pFinish() noexcept;
     void pReportFailure() noexcept;
+    void pCountRefusal(ConnectionRefusal reason) noexcept;
     void pReport(const StreamIOException& error) noexcept;
     DisconnectReason pReasonOf(const StreamIOException& error) const noexcept;
 
@@ -128,6 +137,7 @@ private:
     void pClose() noexcept;
 
     const ConnectionServices mServices;
+    const std::chrono::system_clock::time_point mSince = TimeProvider::system();
     const std::string mAddress;
     const std::string mSource; // whom log lines count for until it is known who the console is
     std::string mBlamed;       // and afterwards: the source, and over TLS the certificate; set before there is a reader
@@ -147,10 +157,14 @@ private:
 
     DisconnectReason mWhy = DisconnectReason::Closed; // of the thread that reads
     PollDeadline mHandshake;                          // disabled: the console has identified itself; of the reader
-    std::atomic<ConsoleId> mId{0};                    // 0: in the handshake
-    std::string mName;                                // for the log, of its own threads: the address, later "console 1"
-    std::atomic<bool> mHeldBack{false};               // the reader waits for the hypervisor to take another message
-    std::atomic<bool> mClosed{false};                 // the stream is of no use any more
+    bool mIsCounted = false;                          // as refused
+    // Received so far. The reader alone writes them.
+    std::atomic<std::uint64_t> mReceivedMessages{0};
+    std::atomic<std::uint64_t> mReceivedBytes{0};
+    std::atomic<ConsoleId> mId{0};      // 0: in the handshake
+    std::string mName;                  // for the log, of its own threads: the address, later "console 1"
+    std::atomic<bool> mHeldBack{false}; // the reader waits for the hypervisor to take another message
+    std::atomic<bool> mClosed{false};   // the stream is of no use any more
     std::atomic<bool> mEnded{false};
 
     // Guards the thread objects while threads start and join each other.

@@ -34,9 +34,13 @@ HandshakePlaces::Place HandshakePlaces::take(const std::string& source)
 {
     std::string copy = source; // before anything is counted, as it may fail
     const MutexLock lock(mMutex);
-    if (mTaken >= mTotal) return Place("too many connections are in their handshake");
+    if (mTaken >= mTotal) {
+        return {"too many connections are in their handshake", ConnectionRefusal::TooManyHandshakes};
+    }
     unsigned int& taken = mTakenBySource[source];
-    if (taken >= mPerSource) return Place("too many connections from its address are in their handshake");
+    if (taken >= mPerSource) {
+        return {"too many connections from its address are in their handshake", ConnectionRefusal::TooManyFromAddress};
+    }
     ++taken;
     ++mTaken;
     return {*this, std::move(copy)};

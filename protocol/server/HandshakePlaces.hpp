@@ -2,6 +2,7 @@
 
 #include <qel/common/net/IPAddress.hpp>
 #include <qel/common/util/Mutex.hpp>
+#include <qel/protocol/ServerState.hpp>
 
 #include <map>
 #include <string>
@@ -30,15 +31,18 @@ public:
 
         /// Why there is none, for the log.
         const char* getRefusal() const noexcept { return mRefusal; }
+        /// The same for the counters.
+        ConnectionRefusal getReason() const noexcept { return mReason; }
 
     private:
         friend class HandshakePlaces;
-        explicit Place(const char* refusal) noexcept : mRefusal(refusal) {}
+        Place(const char* refusal, ConnectionRefusal reason) noexcept : mRefusal(refusal), mReason(reason) {}
         Place(HandshakePlaces& owner, std::string source) noexcept;
 
         HandshakePlaces* mOwner = nullptr; // null: no place
         std::string mSource;
         const char* mRefusal = "";
+        ConnectionRefusal mReason = ConnectionRefusal::Other;
     };
 
     /// @param total, perSource  more than 0

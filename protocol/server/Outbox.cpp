@@ -115,6 +115,23 @@ void Outbox::dumpStatistics(std::ostream& os, const Indent& indent) const
     mQueue.dumpStatistics(os, indent);
 }
 
+QueueState Outbox::queueState() const
+{
+    QueueState state;
+    {
+        const MutexLock lock(mMutex);
+        for (const Waiting& entry : mWaiting)
+            state.pending += *entry.message;
+    }
+    const QelMessageQueueStatistics statistics = mQueue.getStatistics();
+    state.pending += statistics.getPending();
+    state.sent = statistics.getCompleted();
+    state.dropped = statistics.getDropped();
+    state.mostBytes = statistics.getMaxPendingBytes();
+    state.latency = statistics.getE2ELatency();
+    return state;
+}
+
 void Outbox::startReading()
 {
     const MutexLock lock(mMutex);

@@ -5,6 +5,7 @@
 #include <qel/common/StreamFormatters.hpp>
 #include <qel/common/util/ConditionVariable.hpp>
 #include <qel/common/util/Mutex.hpp>
+#include <qel/protocol/ServerState.hpp>
 
 #include "hypervisor/ConsoleLink.hpp"
 #include "hypervisor/DeferredWakeUps.hpp"
@@ -70,6 +71,9 @@ public:
     /// Prints what waits for room and has waited for it, and the limits and the statistics of the queue.
     /// @param indent  at the start of every line
     void dumpStatistics(std::ostream& os, const Indent& indent) const;
+
+    /// What is on its way, and what has passed.
+    QueueState queueState() const;
 
     // The reader's side.
 

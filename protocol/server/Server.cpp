@@ -18,10 +18,14 @@
 #include "server/Listener.hpp"
 #include "server/LogThrottle.hpp"
 #include "server/QuietLog.hpp"
+#include "server/RefusalCounts.hpp"
 #include "server/SerialLoop.hpp"
 
 #include <algorithm>
+#include <atomic>
+#include <iterator>
 #include <list>
+#include <map>
 #include <optional>
 #include <sstream>
 #include <stdexcept>
@@ -56,6 +60,23 @@ std::unique_ptr<SSLServerContext> contextOf(const ServerOptions& options)
     return options.credentials ? options.credentials->makeServerContext() : nullptr;
 }
 
+/// Adds what has passed on a connection to the sums. What is pending is not: it is lost when a connection ends.
+void addTo(ServerState& sums, const ConnectedConsole& console)
+{
+    using Buckets = QelMessageLatencyBuckets;
+    QueueState& queues = sums.queues;
+    sums.received += console.received;
+    queues.sent += console.queue.sent;
+    queues.dropped += console.queue.dropped;
+    queues.mostBytes = std::max(queues.mostBytes, console.queue.mostBytes);
+    const auto& counts = console.queue.latency.getCounts();
+    for (std::size_t i = 0; i < counts.size(); ++i) {
+        constexpr std::size_t kLimits = std::size(Buckets::LIMITS);
+        const auto latency = i < kLimits ? Buckets::LIMITS[i] : Buckets::LIMITS[kLimits - 1] * 2;
+        queues.latency.increment(latency, counts[i]);
+    }
+}
+
 } // namespace
 
 struct Server::Impl {
@@ -66,6 +87,8 @@ struct Server::Impl {
     void run(const PollFd& stop);
     void serve(ServedStream stream, HandshakePlaces::Place place);
     void setCredentials(const Credentials& credentials);
+    void countAccepted() noexcept { mAccepted.fetch_add(1, std::memory_order_relaxed); }
+    ServerState state() const;
     void dumpStatistics(std::ostream& os);
     HypervisorEngine& engine() noexcept { return mEngine; }
     void finish() noexcept;
@@ -90,12 +113,16 @@ private:
     LogThrottle mThrottle{[this] { mWake.interrupt(); }};
     const std::string mAccepting = "new connections"; // for the throttle
     HandshakePlaces mPlaces;
+    const std::chrono::system_clock::time_point mSince = TimeProvider::system();
+    RefusalCounts mRefusals;
+    std::atomic<std::uint64_t> mAccepted{0};
     HypervisorEngine mEngine;
     const ConnectionServices mServices;
 
-    Mutex mMutex;
+    mutable Mutex mMutex;
     std::unique_ptr<SSLServerContext> mContext QEL_GUARDED_BY(mMutex); // null: connections are plain
     Connections mConnections QEL_GUARDED_BY(mMutex);
+    ServerState mPast QEL_GUARDED_BY(mMutex); // the sums of the connections that are no longer in the list
     bool mFinished QEL_GUARDED_BY(mMutex) = false;
 
     std::optional<Listener> mListener; // empty after finish()
@@ -108,7 +135,7 @@ Server::Impl::Impl(Hypervisor& hypervisor, const ServerOptions& options)
       mPlaces(options.maxHandshakes, options.maxHandshakesPerAddress),
       mEngine(hypervisor, options.maxConsoles, [this] { mSerialWake.interrupt(); },
               {options.idleTimeout, options.linger}),
-      mServices{mEngine, mPins, limitsOf(options), mThrottle, mWake}, mContext(contextOf(options)),
+      mServices{mEngine, mPins, limitsOf(options), mThrottle, mWake, mRefusals}, mContext(contextOf(options)),
       mListener(std::in_place, mListenAt), mEndpoints(mListener->endpoints()), mSerialLoop(mEngine, mSerialWake)
 {}
 
@@ -157,6 +184,7 @@ void Server::Impl::pAccept(const PollResult& ready)
 
 void Server::Impl::pServe(Socket socket)
 {
+    countAccepted();
     ServedStream served;
     std::unique_ptr<SocketStream> stream;
     try {
@@ -167,10 +195,14 @@ void Server::Impl::pServe(Socket socket)
         setKeepAlive(stream->getSocket(), mKeepAlive);
     } catch (const PosixError& error) {
         logLine(LogLevel::Info, "a connection ended before it was served: ", error.what());
+        mRefusals.count(ConnectionRefusal::Left);
         return;
     }
     HandshakePlaces::Place place = mPlaces.take(served.source);
-    if (!place) return pRefuse(*stream, served, place.getRefusal());
+    if (!place) {
+        mRefusals.count(place.getReason());
+        return pRefuse(*stream, served, place.getRefusal());
+    }
     served.descriptor = stream->getSocket().getFd();
     served.stream = std::move(stream);
     serve(std::move(served), std::move(place));
@@ -206,6 +238,32 @@ void Server::Impl::setCredentials(const Credentials& credentials)
     auto context = credentials.makeServerContext();
     const MutexLock lock(mMutex);
     mContext.swap(context);
+}
+
+ServerState Server::Impl::state() const
+{
+    std::map<ConsoleId, ConnectedConsole> known; // to the engine, whose lock comes after this one's
+    for (ConnectedConsole& console : mEngine.consoles())
+        known.emplace(console.peer.id, std::move(console));
+    const MutexLock lock(mMutex);
+    ServerState state = mPast;
+    state.since = mSince;
+    state.accepted = mAccepted.load(std::memory_order_relaxed);
+    state.refused = mRefusals.get();
+    for (const auto& connection : mConnections) {
+        ConnectedConsole console = connection->state();
+        addTo(state, console);
+        const auto found = known.find(console.peer.id);
+        if (found != known.end()) {
+            console.peer = std::move(found->second.peer);
+            console.isIdentified = found->second.isIdentified;
+        } else if (console.peer.id != 0 || connection->hasEnded()) {
+            continue; // it is on its way out
+        }
+        state.queues.pending += console.queue.pending;
+        state.consoles.push_back(std::move(console));
+    }
+    return state;
 }
 
 void Server::Impl::dumpStatistics(std::ostream& os)
@@ -272,7 +330,9 @@ bool Server::Impl::pDropEnded()
         const MutexLock lock(mMutex);
         for (auto next = mConnections.begin(); next != mConnections.end();) {
             const auto connection = next++;
-            if ((*connection)->hasEnded()) ended.splice(ended.end(), mConnections, connection);
+            if (!(*connection)->hasEnded()) continue;
+            addTo(mPast, (*connection)->state());
+            ended.splice(ended.end(), mConnections, connection);
         }
     }
     return !ended.empty(); // destroyed without the lock
@@ -292,6 +352,7 @@ void Server::serve(std::unique_ptr<Stream> stream, const std::string& address)
 {
     if (stream == nullptr) throw std::invalid_argument("stream");
     const int descriptor = descriptorOf(*stream);
+    mImpl->countAccepted();
     mImpl->serve({std::move(stream), descriptor, address, address}, {});
 }
 
@@ -317,6 +378,8 @@ bool Server::closeSession(std::uint16_t partition, std::uint16_t number)
 }
 
 bool Server::sendBreak(std::uint16_t partition) { return mImpl->engine().sendBreak(partition); }
+
+ServerState Server::state() const { return mImpl->state(); }
 
 void Server::dumpStatistics(std::ostream& os) { mImpl->dumpStatistics(os); }
 

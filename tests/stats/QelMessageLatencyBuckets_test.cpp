@@ -50,6 +50,15 @@ TEST(QelMessageLatencyBuckets, LabelsHaveTheSameWidth)
         EXPECT_EQ(std::strlen(label), Buckets::LABEL_WIDTH) << label;
 }
 
+TEST(QelMessageLatencyBuckets, GivesItsCountsToPrograms)
+{
+    Buckets buckets;
+    EXPECT_THAT(buckets.getCounts(), ElementsAre(0, 0, 0, 0, 0, 0));
+    buckets.increment(std::chrono::milliseconds(1), 2);
+    buckets.increment(std::chrono::seconds(11), 3);
+    EXPECT_THAT(buckets.getCounts(), ElementsAre(2, 0, 0, 0, 0, 3));
+}
+
 TEST(QelMessageLatencyBuckets, StartAtZero) { EXPECT_THAT(countsOf(Buckets()), ElementsAre(0, 0, 0, 0, 0, 0)); }
 
 struct Choice {

@@ -135,6 +135,22 @@ TEST_F(QelMessageQueueStatisticsTest, PrintEverything)
                       "      Avg Latency:    997500 us\n");
 }
 
+TEST_F(QelMessageQueueStatisticsTest, GiveTheirFiguresToPrograms)
+{
+    const SizedMessage small(100);
+    const SizedMessage large(200);
+    mStatistics.enqueued(small, nanoseconds(0));
+    mStatistics.enqueued(large, nanoseconds(0));
+    mStatistics.dropped(large);
+    mStatistics.dequeued(small, 2ms);
+    EXPECT_EQ(mStatistics.getMaxPendingBytes(), 300U);
+    EXPECT_EQ(mStatistics.getCompleted().mCount, 1U);
+    EXPECT_EQ(mStatistics.getCompleted().mBytes, 100U);
+    EXPECT_EQ(mStatistics.getDropped().mCount, 1U);
+    EXPECT_EQ(mStatistics.getDropped().mBytes, 200U);
+    EXPECT_THAT(mStatistics.getE2ELatency().getCounts(), testing::ElementsAre(0, 1, 0, 0, 0, 0));
+}
+
 TEST_F(QelMessageQueueStatisticsTest, PendingCountsMessagesInTheQueue)
 {
     EXPECT_EQ(mStatistics.getPending().mCount, 0U);

@@ -44,6 +44,8 @@ TEST_F(VirtualSerialWatchTest, AllNumbersSeeTheOutput)
     EXPECT_EQ(takeData(holder, 1), "for all");
     for (std::uint16_t number = 1; number <= 15; ++number)
         EXPECT_EQ(takeData(watchers.at(number - 1U), 1, number), "for all");
+    EXPECT_EQ(hypervisor->partitions().at(0).outputMessages, 16U);
+    EXPECT_EQ(hypervisor->partitions().at(0).skippedBytes, 0U);
 }
 
 TEST_F(VirtualSerialWatchTest, OneConsoleMayHaveSeveralNumbers)
@@ -98,6 +100,8 @@ TEST_F(VirtualSerialWatchTest, InputOfAWatcherIsDroppedAndAnsweredOnce)
     EXPECT_EQ(watcher.link.posted(), 0U);
     EXPECT_EQ(holder.link.posted(), 0U);
     EXPECT_EQ(port1->input, "");
+    EXPECT_EQ(hypervisor->partitions().at(0).inputMessages, 3U);
+    EXPECT_EQ(hypervisor->partitions().at(0).droppedBytes, 3U * typed.getSerialDataLength());
     EXPECT_THAT(log.lines(), IsEmpty());
 }
 
@@ -141,6 +145,7 @@ TEST_F(VirtualSerialWatchTest, ASlowWatcherHoldsNobodyUpAndIsToldWhatItMissed)
     hypervisor->serviceLines();
     // Half of what is kept is left to send.
     EXPECT_EQ(received(watcher, 1), "\r\n[qel: 12288 bytes skipped]\r\n" + std::string(4096, 'd'));
+    EXPECT_EQ(hypervisor->partitions().at(0).skippedBytes, 12288U);
     putOut("after");
     EXPECT_EQ(takeData(watcher, 1, 1), "after");
     EXPECT_EQ(watcher.link.posted(), 0U);

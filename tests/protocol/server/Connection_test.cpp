@@ -557,7 +557,7 @@ TEST_F(ConnectionTest, KeepsItsHandshakePlaceUntilItHasEnded)
     ConnectionLimits limits;
     limits.linger = Loopback::kDeadline;
     connection = std::make_unique<Connection>(
-        protocol::ConnectionServices{*hypervisor, pins, limits, throttle, ended},
+        protocol::ConnectionServices{*hypervisor, pins, limits, throttle, ended, refusals},
         protocol::ServedStream{std::move(ends.second), -1, "the test", "the source"}, nullptr, places.take("x"));
     connection->start();
     LoopbackMessages console(*ends.first);

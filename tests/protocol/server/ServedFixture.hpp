@@ -24,7 +24,7 @@ protected:
                                                 SSLServerContext* context = nullptr)
     {
         return std::make_unique<protocol::Connection>(
-            protocol::ConnectionServices{*hypervisor, pins, limits, throttle, ended},
+            protocol::ConnectionServices{*hypervisor, pins, limits, throttle, ended, refusals},
             protocol::ServedStream{std::move(stream), descriptor, "the test", "the source"}, context);
     }
 
@@ -48,6 +48,7 @@ protected:
     protocol::PeerPins pins;
     protocol::LogThrottle throttle{[] {}};
     protocol::WakeUp ended;
+    protocol::RefusalCounts refusals;
 };
 
 } // namespace qel::test

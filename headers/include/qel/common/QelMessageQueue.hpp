@@ -87,6 +87,9 @@ public:
     /// @return whether shutdown() has been called; takes no lock
     bool isShutdown() const noexcept { return mShutdown; }
 
+    /// @return the statistics of this moment: a copy, which takes the lock for a moment
+    QelMessageQueueStatistics getStatistics() const;
+
     /// Prints the limits, low priority first, and then the statistics, all of the same moment. Producers and consumers
     /// wait meanwhile: if the stream may be slow, print into a string first.
     /// @param os      borrowed for the call; left in the state that QelMessageQueueStatistics::dump() describes

@@ -34,8 +34,14 @@ struct PartitionState {
     std::uint64_t inputBytes;  ///< that the line has taken
     std::uint64_t starts;      ///< how often the line has come up
 
+    std::uint64_t outputMessages; ///< of serial data, for its consoles
+    std::uint64_t inputMessages;  ///< of serial data, from its consoles
+    std::uint64_t skippedBytes;   ///< of output, that consoles did not get because they were too slow
+    std::uint64_t droppedBytes;   ///< of input, that was not for the line: of watchers, or while the line was down
+
     std::size_t keptBytes;    ///< of output, for the next console
     std::size_t waitingBytes; ///< of input, that the line has not taken yet
+    std::size_t replayBytes;  ///< PartitionOptions::replayBytes
 };
 
 } // namespace qel::protocol

@@ -8,6 +8,7 @@
 #include <qel/protocol/PartitionState.hpp>
 #include <qel/protocol/ProtocolExport.hpp>
 #include <qel/protocol/ServerOptions.hpp>
+#include <qel/protocol/ServerState.hpp>
 
 #include <memory>
 #include <ostream>
@@ -40,8 +41,8 @@ namespace qel::protocol {
 /// Sockets cause no SIGPIPE.
 ///
 /// Lifetime: borrows the hypervisor, which must outlive this object. Thread safety: one thread owns it (constructor,
-/// run(), dumpStatistics(), finish(), destructor); endpoints(), setCredentials(), serve() and the operations on
-/// partitions from any thread.
+/// run(), dumpStatistics(), finish(), destructor); endpoints(), setCredentials(), serve(), state() and the
+/// operations on partitions from any thread.
 class QEL_PROTOCOL_EXPORT Server {
 public:
     /// Listens. Connections are accepted in run(); until then they wait.
@@ -117,6 +118,10 @@ public:
     /// @return false: the line has no break, is not up or could not send it, which is logged; or there is no such
     ///         partition
     bool sendBreak(std::uint16_t partition);
+
+    /// Who is connected, what has passed, and who was refused. From any thread, but not from an operation of the
+    /// hypervisor, a line or a tap. Takes each console's lock for a moment.
+    ServerState state() const;
 
     /// Prints the statistics of each console's queue, in the order of connecting. docs/connection.md explains them.
     void dumpStatistics(std::ostream& os);

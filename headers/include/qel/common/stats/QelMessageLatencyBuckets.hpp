@@ -35,6 +35,9 @@ public:
     /// Adds `count` to the bucket of the latency. A negative latency belongs to the first bucket. Does not allocate.
     void increment(const std::chrono::nanoseconds& latency, std::uint64_t count) noexcept;
 
+    /// @return the counts of the buckets, from the fastest to the slowest; owned by this object
+    const std::array<std::uint64_t, 6>& getCounts() const noexcept { return mBuckets; }
+
     class Table;
 
 private:

@@ -39,6 +39,18 @@ public:
     /// @return the messages in the queue; owned by this object
     const QelMessageCount& getPending() const noexcept { return mPending; }
 
+    /// @return the messages that were refused; owned by this object
+    const QelMessageCount& getDropped() const noexcept { return mDropped; }
+
+    /// @return the messages that have left the queue; owned by this object
+    const QelMessageCount& getCompleted() const noexcept { return mCompleted; }
+
+    /// @return the highest number of pending bytes so far
+    std::uint64_t getMaxPendingBytes() const noexcept { return mMaxPendingBytes; }
+
+    /// @return how long messages took from the call that enqueued them to leaving the queue; owned by this object
+    const QelMessageLatencyBuckets& getE2ELatency() const noexcept { return mE2ELatencyBuckets; }
+
     /// @return the messages and bytes that left the queue, per second during which it was not empty: integers, rounded
     ///         down; zero while that time is zero. The product of bytes and 10^9 wraps at 2^64, that is at 18 GB.
     QelMessageThroughput getThroughput() const noexcept;
