@@ -212,10 +212,14 @@ TEST(ConsoleReconnect, ThePersonCanLeaveWhileItConnects)
     auto server = std::make_unique<ServeProcess>(Arguments{"--partition", "1=exec cat"});
     PtyProcess person(consoleTo(server->endpoint(), {"1", "--reconnect"}));
     person.await("connected");
+    person.type("half a line");
+    person.await("half a line");
     server->stop();
     person.await("qel: session closed: the server shut down; connecting again\r\n");
     person.await("Connection refused); next attempt in 2 s\r\n");
-    person.type("typed to nobody\r~.");
+    person.type("~i");
+    person.await("qel: there is no session at the moment\r\n");
+    person.type("~.");
     const auto result = person.wait();
     EXPECT_EQ(result.exitStatus, 0);
     EXPECT_THAT(result.screen, EndsWith("\r\nqel: left partition 1\r\n"));
@@ -242,6 +246,26 @@ TEST_F(ConsoleScriptTest, AWatcherSeesWhatIsTypedAndCanTakeOver)
     watcher.type("~.");
     EXPECT_EQ(watcher.wait().exitStatus, 0);
     EXPECT_TRUE(watcher.isTerminalUntouched());
+}
+
+// Output from before.
+
+TEST(ConsoleReplay, IsNoAnswerToWhatAScriptTypes)
+{
+    const ServeProcess server({"--partition", "1=stty -echo; exec cat"});
+    const auto runConsole = [&](const Arguments& more) { return run(consoleTo(server.endpoint(), more)); };
+    ASSERT_EQ(runConsole({"1", "--send", "one\\rtwo\\r", "--expect", "two"}).exitStatus, 0);
+    EXPECT_EQ(runConsole({"1", "--send", "three\\r", "--expect", "two", "--timeout", "0.3"}).exitStatus, 6);
+    const auto result = runConsole({"1", "--expect", "one", "--send", "four\\r", "--expect", "four"});
+    EXPECT_EQ(result.exitStatus, 0) << "before it types, a script may expect what is there";
+}
+
+TEST(ConsoleReplay, ASessionThatEndsAtOnceEndsTheScript)
+{
+    const ServeProcess server({"--partition", "1=echo over"});
+    const auto result = run(consoleTo(server.endpoint(), {"1", "--expect", "over", "--expect", "never"}));
+    EXPECT_THAT(result.errors, HasSubstr("the session ended while waiting for output that matches \"never\""));
+    EXPECT_EQ(result.exitStatus, 8);
 }
 
 // A server that lets people watch, played by the test.

@@ -95,6 +95,32 @@ TEST_F(ConsoleStuckTest, LeavesAPartitionThatDoesNotReadIntoWhichMuchWasPasted)
     EXPECT_THAT(leave(person).screen, EndsWith(" bytes of input that were not sent are thrown away\r\n"));
 }
 
+TEST_F(ConsoleStuckTest, APartitionThatDoesNotReadIsFreeWhenItsConsoleHasLeft)
+{
+    PtyProcess person(console({"2"}));
+    person.await("ready");
+    person.type(std::string(1024 * 1024, 'x') + "\r");
+    person.await(" bytes of input are held back: ");
+    leave(person);
+    EXPECT_TRUE(comesTrue([&] {
+        PtyProcess next(console({"2"}));
+        next.await("partition 2 ");
+        next.type("\r~.");
+        return next.wait().exitStatus == 0; // not: it is held by another console
+    }));
+}
+
+TEST_F(ConsoleStuckTest, HeldInputThatIsLostWithTheConnectionIsTold)
+{
+    PtyProcess person(console({"2"}));
+    person.await("ready");
+    person.type(std::string(1024 * 1024, 'x') + "\r");
+    person.await(" bytes of input are held back: ");
+    server.process().signal(SIGKILL);
+    person.await(" bytes of input that were not sent are thrown away\r\n");
+    EXPECT_EQ(person.wait().exitStatus, 7);
+}
+
 TEST_F(ConsoleStuckTest, InputBeyondTheLimitIsDroppedAndNothingHangs)
 {
     PtyProcess person(console({"2"}));
@@ -197,6 +223,31 @@ TEST(ConsoleKeepAlive, AServerThatAnswersIsNotReported)
     const auto result = person.wait();
     EXPECT_EQ(result.exitStatus, 0);
     EXPECT_THAT(result.screen, ::testing::Not(HasSubstr("has sent nothing")));
+}
+
+TEST(ConsoleForce, WhoMayNotTakeASessionGoesOnWatching)
+{
+    const PlayedServer server([](LoopbackMessages& messages) {
+        EXPECT_EQ(PlayedServer::grantNext(messages), QelMessageOpCloseVirtualSerialSession);
+        const auto request = messages.receive();
+        const auto* const open = dynamic_cast<const QelMessageVirtualSerialOpenReq*>(request.get());
+        ASSERT_NE(open, nullptr);
+        EXPECT_EQ(open->getVssConnectionNumber(), 0);
+        QelMessageGeneric refusal(request->getCallerId(), request->getFunction(), request->getOperation(), MsgResponse);
+        refusal.setStatus(QelMessageStatusInvalidOperation);
+        messages.send(refusal);
+        EXPECT_EQ(PlayedServer::grantNext(messages), QelMessageOpOpenVirtualSerialSession);
+        EXPECT_EQ(PlayedServer::grantNext(messages), QelMessageOpSetupVirtualSerialSession);
+        messages.send(QelMessageVirtualSerialSessionClosedAsync(
+            1, 1, QelMessageVirtualSerialSessionClosedAsync::CloseReasonReadFailure));
+        PlayedServer::grantNext(messages); // to close the session
+    });
+    PtyProcess person(consoleTo(server.endpoint(), {"1", "--watch"}));
+    person.await("watching partition 1");
+    person.type("~f");
+    person.await("qel: the rules of the server do not let this console type in partition 1, or take it by force; ");
+    person.await("watching partition 1");
+    EXPECT_EQ(person.wait().exitStatus, 0);
 }
 
 /// A server whose connection stays there until the end of the test, but nothing comes any more.

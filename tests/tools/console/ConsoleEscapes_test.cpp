@@ -198,7 +198,7 @@ TEST_F(ConsoleEscapesTest, AFileCanBeStopped)
         pty.type("~#" + path + "\r");
         screenUntil(pty, "stops it\r\n");
         pty.type("\x03");
-        EXPECT_THAT(screenUntil(pty, "of the file\r\n"), EndsWith("qel: stopped after 4096 bytes of the file\r\n"));
+        EXPECT_THAT(screenUntil(pty, "of the file\r\n"), EndsWith("qel: stopped after 0 bytes of the file\r\n"));
         pty.type("~.");
     });
     EXPECT_EQ(run(InputOptions(), &pty).reason, ExitReason::Left);

@@ -147,6 +147,24 @@ TEST(EscapeFilter, CharactersHaveNames)
     EXPECT_EQ(characterName('\xFF'), "\\xff");
 }
 
+TEST(EscapeFilter, ALineCanBeginWithoutAReturn)
+{
+    EscapeFilter filter('~');
+    std::string forPartition;
+    std::string typed = "ls";
+    EXPECT_EQ(filter.take(typed, forPartition), Command::None);
+    filter.startLine();
+    typed = "~.";
+    EXPECT_EQ(filter.take(typed, forPartition), Command::Leave);
+    EXPECT_EQ(forPartition, "ls");
+    typed = "~";
+    EXPECT_EQ(filter.take(typed, forPartition), Command::None);
+    filter.startLine();
+    typed = ".x";
+    EXPECT_EQ(filter.take(typed, forPartition), Command::None) << "the escape character belongs to the line before";
+    EXPECT_EQ(forPartition, "ls.x");
+}
+
 } // namespace
 
 } // namespace qel::test

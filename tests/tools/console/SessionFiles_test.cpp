@@ -1,6 +1,7 @@
 // The files that a session is written to.
 
 #include <qel/common/util/PosixError.hpp>
+#include <qel/common/util/UniqueFd.hpp>
 
 #include "console/FileSender.hpp"
 #include "console/LogFile.hpp"
@@ -8,6 +9,7 @@
 #include "support/SettableClock.hpp"
 #include "support/TemporaryDirectory.hpp"
 
+#include <fcntl.h>
 #include <fstream>
 #include <gmock/gmock.h>
 #include <iterator>
@@ -179,6 +181,47 @@ TEST_F(SessionFilesTest, AFileThatIsNotThereOrIsADirectoryIsAnError)
 {
     EXPECT_THROW(FileSender(directory.file("none")), FileIOError);
     EXPECT_THROW(FileSender("/"), FileIOError);
+}
+
+TEST_F(SessionFilesTest, AGapEndsAControlSequenceThatHasBegun)
+{
+    LogFile log(path, LogFile::Content::Stripped);
+    show(log, "$ \x1B]title");
+    log.onGap("connection lost");
+    log.onGap("connected again");
+    show(log, "new\n");
+    EXPECT_EQ(content(), "$ \n[qel: connection lost]\n[qel: connected again]\nnew\n");
+}
+
+TEST_F(SessionFilesTest, APipeThatNobodyReadsEndsTheLogAndNotTheSession)
+{
+    ASSERT_EQ(::mkfifo(path.c_str(), 0600), 0);
+    EXPECT_THROW(LogFile(path, LogFile::Content::Raw), FileIOError);
+    EXPECT_THROW(Recording(path, "", {}), FileIOError);
+    const UniqueFd reader(::open(path.c_str(), O_RDONLY | O_NONBLOCK | O_CLOEXEC));
+    LogFile log(path, LogFile::Content::Raw);
+    Recording recording(path, "", {});
+    const std::string much(1000000, 'x');
+    show(log, much);
+    EXPECT_EQ(log.takeFailure(), "cannot write the log " + path + ": 11 (Resource temporarily unavailable)");
+    show(recording, much);
+    EXPECT_EQ(recording.takeFailure(),
+              "cannot write the recording " + path + ": 11 (Resource temporarily unavailable)");
+}
+
+TEST_F(SessionFilesTest, ACharacterThatIsNotCompletedIsRecordedAllTheSame)
+{
+    {
+        Recording recording(path, "", {});
+        show(recording, "a\xE2\x82");
+        recording.onGap("connection lost");
+        show(recording, "b\xE2");
+    }
+    const auto all = lines();
+    ASSERT_EQ(all.size(), 6U);
+    EXPECT_EQ(all[2], nlohmann::json::parse("[0.0, \"o\", \"\xEF\xBF\xBD\"]"));
+    EXPECT_EQ(all[3][1], "m");
+    EXPECT_EQ(all[5][2], "\xEF\xBF\xBD");
 }
 
 } // namespace

@@ -7,6 +7,8 @@
 #include <algorithm>
 #include <cerrno>
 #include <exception>
+#include <linux/sockios.h>
+#include <sys/ioctl.h>
 #include <sys/socket.h>
 
 namespace qel::tool {
@@ -52,6 +54,14 @@ void AttentiveStream::write(const char* buffer, std::size_t length)
         requireRetry(PosixErrorCode(errno), "socket stream send failure");
         pAwait(PollEvents::Write, timeout);
     }
+}
+
+void AttentiveStream::throwAwayUnsent() noexcept
+{
+    int unsent = 0;
+    if (::ioctl(getSocket().getFd(), SIOCOUTQNSD, &unsent) != 0 || unsent == 0) return;
+    const linger atOnce{1, 0};
+    static_cast<void>(::setsockopt(getSocket().getFd(), SOL_SOCKET, SO_LINGER, &atOnce, sizeof(atOnce)));
 }
 
 void AttentiveStream::pAwait(PollEvents events, milliseconds timeout) const

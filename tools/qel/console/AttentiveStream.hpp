@@ -38,6 +38,10 @@ public:
     /// From this time on nothing is waited for, whatever the deadlines say.
     void cutAt(std::chrono::steady_clock::time_point end) noexcept { mCut = end; }
 
+    /// Call it before the connection is closed: what the peer has taken no room for is thrown away then, and the peer
+    /// is told of the end at once, by a reset. It would hear of an orderly end only after that, if it reads at all.
+    void throwAwayUnsent() noexcept;
+
     void setReadDeadline(std::chrono::milliseconds timeout) override { mReadDeadline = timeout; }
     void setWriteDeadline(std::chrono::milliseconds timeout) override { mWriteDeadline = timeout; }
     std::size_t read(char* buffer, std::size_t length) override;

@@ -21,7 +21,7 @@ namespace {
 using TimePoint = ConsoleConnection::TimePoint;
 
 /// How long the keyboard may wait for the resolver.
-constexpr std::chrono::milliseconds kShortLookup{90};
+constexpr std::chrono::milliseconds kShortLookup{75};
 
 std::unique_ptr<AttentiveStream> streamOver(Socket socket, const std::string& server)
 {

@@ -7,6 +7,7 @@
 #include "console/ConsoleLoop.hpp"
 #include "console/ConsoleTexts.hpp"
 
+#include <algorithm>
 #include <sys/ioctl.h>
 #include <utility>
 
@@ -49,7 +50,8 @@ void ConsoleLoop::pExecute(EscapeFilter::Command command)
     default:
         break;
     }
-    if (mSession != nullptr) pExecuteInSession(command);
+    if (mSession == nullptr) return mScreen.say(texts::kNoSession);
+    pExecuteInSession(command);
 }
 
 void ConsoleLoop::pExecuteInSession(EscapeFilter::Command command)
@@ -169,7 +171,7 @@ void ConsoleLoop::pFeedFile()
     const auto now = TimeProvider::steady();
     try {
         const std::string piece = mFile->next();
-        if (piece.empty()) return pEndFile(texts::kFileDone);
+        if (piece.empty()) return pEndFile(texts::kFileDone, mFile->sent());
         mHeld.add(piece, now);
     } catch (const FileIOError& error) {
         mFile.reset();
@@ -180,11 +182,18 @@ void ConsoleLoop::pFeedFile()
     mScreen.say(filled(texts::kFileProgress, {std::to_string(mFile->sent()), std::to_string(mFile->size())}));
 }
 
-void ConsoleLoop::pEndFile(const char* text)
+/// Throws away the piece that is held, which has been read and not been typed.
+void ConsoleLoop::pStopFile()
 {
-    const std::string sent = std::to_string(mFile->sent());
+    const std::uint64_t held = std::min<std::uint64_t>(mHeld.size(), mFile->sent());
+    mHeld.clear();
+    pEndFile(texts::kFileStopped, mFile->sent() - held);
+}
+
+void ConsoleLoop::pEndFile(const char* text, std::uint64_t sent)
+{
     mFile.reset();
-    mScreen.say(filled(text, {sent}));
+    mScreen.say(filled(text, {std::to_string(sent)}));
 }
 
 void ConsoleLoop::pNoteResize()

@@ -75,12 +75,14 @@ ConsoleLoop::Outcome ConsoleLoop::run(Console& console, SerialSession& session, 
     pBegin(console, session);
     const Attending attending(mMode.isTerminal() ? stream : nullptr, this);
     pShowReceived();
+    if (mSession->getEnd() != SessionEnd::None) pExit(ExitReason::Ended); // in an earlier call; nothing more comes
     while (!pIsDone())
         pPollOnce();
     mConsole = nullptr;
     mSession = nullptr;
     mPrompt.reset();
     mFile.reset();
+    mEscape.startLine(); // what was typed of a line has gone with the session
     if (mFailure && mOutcome.reason == ExitReason::Ended) std::rethrow_exception(mFailure);
     return mOutcome;
 }
@@ -322,8 +324,7 @@ void ConsoleLoop::pTakeTyped(const char* data, std::size_t length)
             continue;
         }
         if (mFile && typed.find(kInterrupt) != std::string::npos) {
-            mHeld.clear();
-            return pEndFile(texts::kFileStopped);
+            return pStopFile();
         }
         std::string forPartition;
         const EscapeFilter::Command command = mEscape.take(typed, forPartition);

@@ -160,7 +160,8 @@ private:
     void pAnswerPrompt(std::string& typed);
     void pBeginFile(const std::string& typed);
     void pFeedFile();
-    void pEndFile(const char* text);
+    void pStopFile();
+    void pEndFile(const char* text, std::uint64_t sent);
     void pNoteResize();
     void pReportFailures();
 

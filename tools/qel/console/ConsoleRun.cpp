@@ -1,6 +1,7 @@
 #include "console/ConsoleRun.hpp"
 
 #include <qel/common/QelMessageDax.hpp>
+#include <qel/common/QelMessageInterfaceComponent.hpp>
 #include <qel/common/util/TimeProvider.hpp>
 #include <qel/protocol/Error.hpp>
 
@@ -24,8 +25,12 @@ namespace {
 
 using std::chrono::milliseconds;
 
-/// How long a person waits for the server when leaving.
-constexpr milliseconds kFarewell{90};
+/// How long a person waits for the server when leaving: a tenth of a second, less what the rest of leaving takes.
+constexpr milliseconds kFarewell{75};
+
+/// How long output from before may take to come, and how long a pause in it may be.
+constexpr milliseconds kReplayPatience{1000};
+constexpr milliseconds kReplayPause{100};
 
 constexpr milliseconds kFirstWait{1000}; // before connecting again
 constexpr milliseconds kLongestWait{30000};
@@ -104,7 +109,9 @@ ExitStatus ConsoleRun::run()
     try {
         pUse(ConsoleConnection(mOptions.connect, end, mKnown));
         pOpen(end);
-        const ConsoleLoop::Outcome outcome = pRunLoop();
+        const SessionTools tools = pTools();
+        if (pTypesTexts()) pAwaitReplay();
+        const ConsoleLoop::Outcome outcome = pRunLoop(tools);
         const SessionEnd sessionEnd = mSession ? mSession->getEnd() : SessionEnd::ConnectionClosed;
         const std::string endText = mSession ? mSession->describeEnd() : std::string();
         if (outcome.reason == ConsoleLoop::ExitReason::Signal) {
@@ -115,8 +122,7 @@ ExitStatus ConsoleRun::run()
         return pConclude(outcome, sessionEnd, endText);
     } catch (const StatusError& refusal) {
         pLeave();
-        throw CommandFailure(ExitStatus::Refused,
-                             refusalText(refusal.getResponse(), "partition " + std::to_string(mOptions.partition)));
+        throw CommandFailure(ExitStatus::Refused, pRefusalText(refusal));
     } catch (const DeadlinePassed& error) {
         pLeave();
         if (!mConnection) throw;
@@ -126,6 +132,11 @@ ExitStatus ConsoleRun::run()
         pLeave();
         throw;
     }
+}
+
+std::string ConsoleRun::pRefusalText(const StatusError& refusal) const
+{
+    return refusalText(refusal.getResponse(), "partition " + std::to_string(mOptions.partition));
 }
 
 SessionTools ConsoleRun::pTools()
@@ -177,12 +188,42 @@ SerialSession ConsoleRun::pOpenFirstFree(TimePoint end)
     }
 }
 
-ConsoleLoop::Outcome ConsoleRun::pRunLoop()
+bool ConsoleRun::pTypesTexts() const
+{
+    return std::any_of(mOptions.steps.begin(), mOptions.steps.end(),
+                       [](const ScriptStep& step) { return step.kind == ScriptStep::Kind::Send; });
+}
+
+/// Takes the output that the server has kept from before, so that a script does not take it for the answer to what it
+/// types. Nothing marks its end, so the server is asked for something else, and then has a moment, until no output has
+/// come meanwhile. A partition that never pauses ends that in time.
+void ConsoleRun::pAwaitReplay()
+{
+    const TimePoint end = TimeProvider::steady() + kReplayPatience;
+    bool hasReceived = false;
+    do {
+        Console& console = mConnection->console();
+        try {
+            console.request(QelMessageGetQelTodReq());
+        } catch (const StatusError&) {  // an answer as well
+        } catch (const LimitReached&) { // there is room when it has been shown
+        }
+        hasReceived = mScreen.showOutput(*mSession) > 0;
+        if (!hasReceived && PollSet(console.getPollFd(PollEvents::Read)).wait(kReplayPause).anyReady()) {
+            console.process();
+            mScreen.showOutput(*mSession);
+            hasReceived = true;
+        }
+        mScreen.output().writeSome();
+    } while (hasReceived && mSession->getEnd() == SessionEnd::None && TimeProvider::steady() < end);
+}
+
+ConsoleLoop::Outcome ConsoleRun::pRunLoop(const SessionTools& tools)
 {
     // Signals are watched only while the terminal may have to be restored. At all other times they end this process at
     // once.
     SignalWatch signals(kSignals);
-    ConsoleLoop loop(mScreen, STDIN_FILENO, mMode, signals, mOptions.input, pTools());
+    ConsoleLoop loop(mScreen, STDIN_FILENO, mMode, signals, mOptions.input, tools);
     ConsoleLoop::Outcome outcome;
     while (pRunOnce(loop, outcome))
         continue;
@@ -200,10 +241,12 @@ bool ConsoleRun::pRunOnce(ConsoleLoop& loop, ConsoleLoop::Outcome& outcome)
             outcome = loop.outcome();
             return outcome.reason == ConsoleLoop::ExitReason::Force;
         }
+        pTellThrownAway(outcome);
         const bool isLost = outcome.reason == ConsoleLoop::ExitReason::Ended && isLoss(mSession->getEnd());
         if (!mOptions.reconnect || !isLost) return false;
         reason = mSession->describeEnd();
     } catch (const Error& error) {
+        pTellThrownAway(loop.outcome());
         if (!mOptions.reconnect || !isTemporary(error, mOptions.connect.transport.plain)) throw;
         reason = error.what();
     }
@@ -212,14 +255,29 @@ bool ConsoleRun::pRunOnce(ConsoleLoop& loop, ConsoleLoop::Outcome& outcome)
     return isBack;
 }
 
+/// Input that was held when the session ended. Who leaves is told in the line about that.
+void ConsoleRun::pTellThrownAway(const ConsoleLoop::Outcome& outcome)
+{
+    const std::string text = pThrownAwayText(outcome);
+    if (outcome.reason == ConsoleLoop::ExitReason::Ended && !text.empty()) mScreen.say(text);
+}
+
 /// Opens the session to type, by force, on the same connection.
 void ConsoleRun::pOpenAgain(ConsoleLoop& loop)
 {
     mConnection->stream().setAttendant(&loop.attendant());
     mSession->close();
+    const SerialOptions before = mSerial;
     mSerial.connection = 0;
     mSerial.force = true;
-    pOpen(TimeProvider::steady() + mOptions.connect.timeout());
+    const TimePoint end = TimeProvider::steady() + mOptions.connect.timeout();
+    try {
+        pOpen(end);
+    } catch (const StatusError& refusal) { // by the rules of the server
+        mScreen.say(pRefusalText(refusal));
+        mSerial = before;
+        pOpen(end);
+    }
 }
 
 /// @return false: the user left, or a signal came
@@ -285,6 +343,7 @@ void ConsoleRun::pClose()
         if (!isPerson) throw;
         logLine(LogLevel::Debug, "while leaving: ", explain(error));
     }
+    mConnection->stream().throwAwayUnsent();
     mConnection->console().leave();
 }
 
@@ -293,6 +352,7 @@ void ConsoleRun::pLeave() noexcept
     if (!mConnection) return;
     if (mMode.isTerminal()) mConnection->stream().cutAt(TimeProvider::steady() + kFarewell);
     mConnection->stream().setAttendant(nullptr);
+    mConnection->stream().throwAwayUnsent();
     mConnection->console().leave();
 }
 
@@ -343,9 +403,16 @@ ExitStatus ConsoleRun::pStatusOf(SessionEnd end) const
 
 std::string ConsoleRun::pLeftText(const ConsoleLoop::Outcome& outcome) const
 {
-    std::string text = filled(texts::kLeft, {std::to_string(mOptions.partition)});
-    if (outcome.thrownAway == 0) return text;
-    return text + filled(texts::kThrownAway, {std::to_string(outcome.thrownAway)});
+    const std::string text = filled(texts::kLeft, {std::to_string(mOptions.partition)});
+    const std::string lost = pThrownAwayText(outcome);
+    return lost.empty() ? text : text + "; " + lost;
+}
+
+/// Empty: nothing was thrown away.
+std::string ConsoleRun::pThrownAwayText(const ConsoleLoop::Outcome& outcome) const
+{
+    if (outcome.thrownAway == 0) return {};
+    return filled(texts::kThrownAway, {std::to_string(outcome.thrownAway)});
 }
 
 } // namespace qel::tool

@@ -1,6 +1,7 @@
 #pragma once
 
 #include <qel/common/net/IPEndpoint.hpp>
+#include <qel/protocol/Error.hpp>
 #include <qel/protocol/SerialSession.hpp>
 
 #include "base/ExitStatus.hpp"
@@ -63,7 +64,9 @@ private:
     void pOpen(TimePoint end);
     SerialSession pOpenFirstFree(TimePoint end);
     void pOpenAgain(ConsoleLoop& loop);
-    ConsoleLoop::Outcome pRunLoop();
+    bool pTypesTexts() const;
+    void pAwaitReplay();
+    ConsoleLoop::Outcome pRunLoop(const SessionTools& tools);
     bool pRunOnce(ConsoleLoop& loop, ConsoleLoop::Outcome& outcome);
     bool pReconnect(ConsoleLoop& loop, const std::string& reason);
     bool pTryToReconnect(ConsoleLoop& loop, std::chrono::milliseconds& delay);
@@ -72,7 +75,10 @@ private:
     void pLeave() noexcept;
     ExitStatus pConclude(const ConsoleLoop::Outcome& outcome, SessionEnd end, const std::string& endText);
     ExitStatus pStatusOf(SessionEnd end) const;
+    std::string pRefusalText(const StatusError& refusal) const;
     std::string pLeftText(const ConsoleLoop::Outcome& outcome) const;
+    std::string pThrownAwayText(const ConsoleLoop::Outcome& outcome) const;
+    void pTellThrownAway(const ConsoleLoop::Outcome& outcome);
 
     const ConsoleRunOptions mOptions;
     TerminalMode mMode;

@@ -24,7 +24,7 @@ constexpr const char* kNoEscape = "there is no escape character";
 constexpr const char* kPlain = "plain";
 constexpr const char* kProtected = "$1, TLS 1.3"; // the library accepts no other version
 constexpr const char* kLeft = "left partition $1";
-constexpr const char* kThrownAway = "; $1 bytes of input that were not sent are thrown away";
+constexpr const char* kThrownAway = "$1 bytes of input that were not sent are thrown away";
 
 // Input that finds no room.
 constexpr const char* kHeld = "$1 bytes of input are held back: the partition or the server takes none";
@@ -66,6 +66,7 @@ constexpr const char* kReadWrite = "what is typed is sent again";
 constexpr const char* kBreak =
     "the protocol carries no break; on the server's machine, qel status --break $1 sends one where the line can";
 constexpr const char* kNoWindow = "the size of this window is not known";
+constexpr const char* kNoSession = "there is no session at the moment";
 constexpr const char* kForcing = "opening partition $1 again by force";
 
 constexpr const char* kInfoTraffic = "$1 bytes received, $2 sent, $3 held";

@@ -51,6 +51,12 @@ EscapeFilter::Command EscapeFilter::take(std::string& typed, std::string& forPar
     return command;
 }
 
+void EscapeFilter::startLine() noexcept
+{
+    mAtLineStart = true;
+    mEscaped = false;
+}
+
 std::string EscapeFilter::help(const std::string& lineEnd) const
 {
     if (!mEscape) return texts::kNoEscape;

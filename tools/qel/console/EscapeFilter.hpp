@@ -26,6 +26,9 @@ public:
     /// @return the command; None: all characters have been read
     Command take(std::string& typed, std::string& forPartition);
 
+    /// What is typed next begins a line.
+    void startLine() noexcept;
+
     /// The list of commands, with `lineEnd` between the lines.
     std::string help(const std::string& lineEnd) const;
 

@@ -11,7 +11,8 @@ namespace qel::tool {
 
 LogFile::LogFile(std::string path, Content content, TimeStamps::Style style)
     : mPath(std::move(path)), mContent(content),
-      mFile(::open(mPath.c_str(), O_WRONLY | O_APPEND | O_CREAT | O_CLOEXEC, 0600)), mStamps(style)
+      mFile(::open(mPath.c_str(), O_WRONLY | O_APPEND | O_CREAT | O_CLOEXEC | O_NOCTTY | O_NONBLOCK, 0600)),
+      mStamps(style)
 {
     const PosixErrorCode error = errno;
     if (mFile.get() < 0) throw FileIOError(error, "cannot write the log " + mPath);
@@ -30,7 +31,9 @@ void LogFile::onOutput(const char* data, std::size_t length)
 
 void LogFile::onGap(const std::string& text)
 {
-    const std::string line = "\n[qel: " + text + "]\n";
+    if (!mIsOn) return;
+    const std::string line = (mEndsLine ? "[qel: " : "\n[qel: ") + text + "]\n";
+    mStripper = ControlStripper(); // a control sequence that has begun is not continued
     onOutput(line.data(), line.size());
 }
 
@@ -38,6 +41,7 @@ std::string LogFile::takeFailure() { return std::exchange(mFailure, {}); }
 
 void LogFile::pWrite(const std::string& text)
 {
+    if (!text.empty()) mEndsLine = text.back() == '\n';
     std::size_t written = 0;
     while (written < text.size()) {
         const ssize_t count = ::write(mFile.get(), text.data() + written, text.size() - written);

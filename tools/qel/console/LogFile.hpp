@@ -13,7 +13,8 @@ namespace qel::tool {
 
 /// Appends the output of a session to a file: the bytes as they are, or readable text.
 ///
-/// A file that cannot be written any more ends the log, not the session: takeFailure() says so.
+/// A file that cannot be written any more ends the log, not the session: takeFailure() says so. The session does not
+/// wait for a pipe either: one that nobody reads is such a file.
 /// Thread safety: one thread.
 class LogFile : public SessionTap {
 public:
@@ -45,6 +46,7 @@ private:
     const Content mContent;
     UniqueFd mFile;
     bool mIsOn = true;
+    bool mEndsLine = true; // what has been written
     ControlStripper mStripper;
     TimeStamps mStamps;
     std::string mFailure;

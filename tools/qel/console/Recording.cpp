@@ -45,7 +45,8 @@ std::size_t incompleteBytes(const std::string& text)
 } // namespace
 
 Recording::Recording(std::string path, const std::string& title, Size size)
-    : mPath(std::move(path)), mFile(::open(mPath.c_str(), O_WRONLY | O_TRUNC | O_CREAT | O_CLOEXEC, 0600)),
+    : mPath(std::move(path)),
+      mFile(::open(mPath.c_str(), O_WRONLY | O_TRUNC | O_CREAT | O_CLOEXEC | O_NOCTTY | O_NONBLOCK, 0600)),
       mStart(TimeProvider::steady())
 {
     const PosixErrorCode error = errno;
@@ -58,6 +59,8 @@ Recording::Recording(std::string path, const std::string& title, Size size)
     pWrite(lineOf(header));
 }
 
+Recording::~Recording() { pWriteRest(); }
+
 void Recording::onOutput(const char* data, std::size_t length)
 {
     mRest.append(data, length);
@@ -67,7 +70,11 @@ void Recording::onOutput(const char* data, std::size_t length)
     mRest.erase(0, complete);
 }
 
-void Recording::onGap(const std::string& text) { pWriteEvent("m", text); }
+void Recording::onGap(const std::string& text)
+{
+    pWriteRest();
+    pWriteEvent("m", text);
+}
 
 void Recording::onResize(Size size)
 {
@@ -75,6 +82,12 @@ void Recording::onResize(Size size)
 }
 
 std::string Recording::takeFailure() { return std::exchange(mFailure, {}); }
+
+/// A character whose last bytes do not come any more.
+void Recording::pWriteRest()
+{
+    if (!mRest.empty()) pWriteEvent("o", std::exchange(mRest, {}));
+}
 
 void Recording::pWriteEvent(const char* kind, const std::string& data)
 {

@@ -14,8 +14,8 @@ namespace qel::tool {
 /// Records what a session shows in the format asciicast v2: a header, and one line of JSON for each piece of output,
 /// with its time. What is typed is not recorded, since it may be secret; the partition's echo is output.
 ///
-/// A file that cannot be written any more ends the recording, not the session: takeFailure() says so.
-/// Thread safety: one thread.
+/// A file that cannot be written any more ends the recording, not the session: takeFailure() says so. A pipe that
+/// nobody reads is such a file. Thread safety: one thread.
 class Recording : public SessionTap {
 public:
     struct Size {
@@ -27,6 +27,10 @@ public:
     /// @throws FileIOError  the file cannot be written
     Recording(std::string path, const std::string& title, Size size);
 
+    ~Recording() override;
+    Recording(const Recording&) = delete;
+    Recording& operator=(const Recording&) = delete;
+
     void onOutput(const char* data, std::size_t length) override;
     void onGap(const std::string& text) override;
 
@@ -37,6 +41,7 @@ public:
     std::string takeFailure();
 
 private:
+    void pWriteRest();
     void pWriteEvent(const char* kind, const std::string& data);
     void pWrite(const std::string& line);
 

@@ -75,6 +75,8 @@ std::string SessionScript::takeInput(TimePoint now)
 std::string SessionScript::pBegin(Step& step, TimePoint now)
 {
     if (step.step.kind == ScriptStep::Kind::Send) {
+        if (!mHasTyped) mUnused.clear(); // from before the session
+        mHasTyped = true;
         std::string text = std::move(step.step.text);
         mSteps.pop_front();
         return text;

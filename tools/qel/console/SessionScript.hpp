@@ -27,7 +27,7 @@ struct ScriptStep {
 };
 
 /// Follows the steps of a script in a session. Each step begins when the one before it is done; output that came before
-/// a step that expects some counts too, unless an earlier step has used it.
+/// a step that expects some counts too, unless an earlier step has used it, or it came before the first text was typed.
 ///
 /// A command runs as `sh -c COMMAND` between two marks that the shell prints. The marks are composed by the shell, so
 /// that the echo of the typed line does not contain them.
@@ -89,6 +89,7 @@ private:
     std::deque<Step> mSteps;
     std::string mUnused; // output that no step has used
     PollDeadline mDeadline;
+    bool mHasTyped = false;    // a text
     bool mIsInCommand = false; // its first mark has come
     std::string mCommandOutput;
     std::optional<int> mStatus;
