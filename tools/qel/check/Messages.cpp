@@ -1,5 +1,7 @@
 #include "check/Messages.hpp"
 
+#include <utility>
+
 namespace qel::tool::check {
 
 namespace {
@@ -107,5 +109,32 @@ Draft dataToPartition(unsigned int partition, unsigned int number, const std::st
 }
 
 Draft upgradeNotice() { return Draft::notice(kHandshake, kUpgrade); }
+
+std::vector<NamedRequest> requestsAfterVersion()
+{
+    std::vector<NamedRequest> requests{
+        {"open-session", openSession()},
+        {"close-session", closeSession()},
+        {"capabilities", capabilitiesRequest(4, std::string(4, '\xFF'))},
+        {"limits", limitsRequest()},
+        {"broadcast", broadcastRequest({})},
+        {"time", timeRequest()},
+        {"set-mode", setMode(1, "")},
+        {"get-mode", interfaceRequest(kGetMode)},
+        {"set-metadata", setMetadata("")},
+        {"get-metadata", interfaceRequest(kGetMetadata)},
+    };
+    for (NamedRequest& request : serialRequests(1))
+        requests.push_back(std::move(request));
+    return requests;
+}
+
+std::vector<NamedRequest> serialRequests(unsigned int partition)
+{
+    return {{"open-serial", openSerial(partition, 0)},
+            {"close-serial", closeSerial(partition, 0)},
+            {"max-serial", maxSerial()},
+            {"set-up-serial", setUpSerial(partition, 0)}};
+}
 
 } // namespace qel::tool::check

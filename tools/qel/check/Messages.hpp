@@ -4,6 +4,7 @@
 
 #include <cstdint>
 #include <string>
+#include <vector>
 
 /// @file
 /// The requests and notices of a console, by the tables of docs/wire-format.md.
@@ -115,5 +116,15 @@ Draft maxSerial();
 Draft dataToPartition(unsigned int partition, unsigned int number, const std::string& data, unsigned int length = ~0U);
 
 Draft upgradeNotice();
+
+/// A request with its name in ids of cases.
+struct NamedRequest {
+    const char* name;
+    Draft draft;
+};
+/// All requests but the version request, each well-formed. They change nothing while they are refused.
+std::vector<NamedRequest> requestsAfterVersion();
+/// Those of the virtual serial function.
+std::vector<NamedRequest> serialRequests(unsigned int partition);
 
 } // namespace qel::tool::check

@@ -52,8 +52,8 @@ std::string responseTo(const Draft& draft)
 } // namespace
 
 Wire::Wire(std::unique_ptr<Stream> stream, int descriptor, Options options, Transcript& transcript)
-    : mOptions(std::move(options)), mTranscript(transcript), mStream(std::move(stream)), mDescriptor(descriptor),
-      mLastCallerId(kFirstCallerId * mOptions.number)
+    : mOptions(std::move(options)), mTimeout(mOptions.timeout), mTranscript(transcript), mStream(std::move(stream)),
+      mDescriptor(descriptor), mLastCallerId(kFirstCallerId * mOptions.number)
 {}
 
 Wire::~Wire() = default;
@@ -61,25 +61,25 @@ Wire::~Wire() = default;
 void Wire::send(const std::string& bytes)
 {
     mTranscript.add({mOptions.number, Event::Kind::Sent, bytes, ""});
-    mStream->setWriteDeadline(mOptions.timeout);
+    mStream->setWriteDeadline(mTimeout);
     try {
         mStream->write(bytes.data(), bytes.size());
     } catch (const StreamIOException& error) {
         if (!isDeadline(error)) return pNote("the connection has ended");
-        pFail("the peer to read what is sent", "no room for it within " + secondsText(mOptions.timeout));
+        pFail("the peer to read what is sent", "no room for it within " + secondsText(mTimeout));
     }
 }
 
 void Wire::sendByteByByte(const std::string& bytes)
 {
     mTranscript.add({mOptions.number, Event::Kind::Sent, bytes, "byte by byte"});
-    mStream->setWriteDeadline(mOptions.timeout);
+    mStream->setWriteDeadline(mTimeout);
     try {
         for (const char& byte : bytes)
             mStream->write(&byte, 1);
     } catch (const StreamIOException& error) {
         if (!isDeadline(error)) return pNote("the connection has ended");
-        pFail("the peer to read what is sent", "no room for it within " + secondsText(mOptions.timeout));
+        pFail("the peer to read what is sent", "no room for it within " + secondsText(mTimeout));
     }
 }
 
@@ -160,10 +160,29 @@ void Wire::expectEndWithoutFrame()
     expectNothingKept("the end of the connection without another frame");
 }
 
-bool Wire::isQuiet() const
+std::string Wire::drain()
+{
+    mStream->setReadDeadline(mTimeout);
+    std::string bytes;
+    std::size_t count = 0;
+    do {
+        std::array<char, 4096> buffer{};
+        const ReadEnd end = pFill(buffer.data(), buffer.size(), count);
+        bytes.append(buffer.data(), count);
+        if (end == ReadEnd::TimedOut) pFail("the end of the connection", "none within " + secondsText(mTimeout));
+        mHasEnded = end == ReadEnd::Ended;
+    } while (!mHasEnded);
+    if (!bytes.empty()) mTranscript.add({mOptions.number, Event::Kind::Seen, bytes, ""});
+    pNote("the peer ends the connection");
+    return bytes;
+}
+
+bool Wire::isQuiet() const { return !awaitInput(std::chrono::milliseconds(0)); }
+
+bool Wire::awaitInput(std::chrono::milliseconds time) const
 {
     const PollFd socket(mDescriptor, PollEvents::Read);
-    return !PollSet{socket}.wait(std::chrono::milliseconds(0)).contains(socket);
+    return PollSet{socket}.wait(time).contains(socket);
 }
 
 void Wire::endSending()
@@ -190,7 +209,7 @@ void Wire::beginLeaving() noexcept
 void Wire::leave() noexcept
 {
     if (mStream == nullptr || mHasEnded) return;
-    const auto end = TimeProvider::steady() + mOptions.timeout;
+    const auto end = TimeProvider::steady() + mTimeout;
     try {
         while (pReceiveAny("the end of the connection") && TimeProvider::steady() < end)
             continue;
@@ -227,7 +246,7 @@ std::optional<Frame> Wire::pReceive(const std::string& what)
 std::optional<Frame> Wire::pReceiveAny(const std::string& what)
 {
     if (mHasEnded) return std::nullopt;
-    mStream->setReadDeadline(mOptions.timeout);
+    mStream->setReadDeadline(mTimeout);
     std::array<char, kMaxFrame> buffer; // NOLINT(cppcoreguidelines-pro-type-member-init): only read bytes are used
     std::size_t count = 0;
     std::size_t length = kPrefix;
@@ -252,7 +271,7 @@ std::optional<Frame> Wire::pReceiveAny(const std::string& what)
     }
     if (end == ReadEnd::TimedOut) {
         const std::string seen = count == 0 ? "nothing" : std::to_string(count) + " bytes of a frame";
-        pFail(what, seen + " within " + secondsText(mOptions.timeout));
+        pFail(what, seen + " within " + secondsText(mTimeout));
     }
     return parseFrame(bytes);
 }

@@ -80,8 +80,17 @@ public:
     /// The connection must end without a frame before.
     void expectEndWithoutFrame();
 
+    /// Reads whatever comes until the connection ends, frames or not. @return the bytes
+    std::string drain();
+
     /// Whether nothing, not even the end, has arrived at this moment.
     bool isQuiet() const;
+
+    /// Waits until something arrives. @return false: nothing has within this time
+    bool awaitInput(std::chrono::milliseconds time) const;
+
+    /// For what follows.
+    void setTimeout(std::chrono::milliseconds timeout) { mTimeout = timeout; }
 
     // Ending.
 
@@ -107,6 +116,7 @@ private:
     [[noreturn]] void pFail(const std::string& expected, const std::string& seen) const;
 
     const Options mOptions;
+    std::chrono::milliseconds mTimeout;
     Transcript& mTranscript;
     std::unique_ptr<Stream> mStream; // null after reset()
     int mDescriptor;

@@ -1,5 +1,6 @@
 #include "check/Anchors.hpp"
 #include "check/Trial.hpp"
+#include "check/server/Checks.hpp"
 #include "check/server/ServerCases.hpp"
 
 #include <string>
@@ -27,17 +28,6 @@ Case isAnswered(std::string id, std::string requirement, const char* anchor, Dra
     return {std::move(id), std::move(requirement),
             anchor,        Level::Wire,
             kNothing,      [draft](Trial& trial) { trial.console().expectStatus(draft, 0); }};
-}
-
-/// A case that sends one message that must be ignored.
-Case isIgnored(std::string id, std::string requirement, const char* anchor, Draft draft)
-{
-    return {std::move(id), std::move(requirement), anchor, Level::Wire, kNothing, [draft](Trial& trial) {
-                Wire& wire = trial.console();
-                wire.send(draft);
-                wire.fence();
-                wire.expectNothingKept("no answer");
-            }};
 }
 
 /// The request of most of these cases; its payload is ignored.
@@ -195,19 +185,19 @@ Cases flagCases()
                                   "A message with the flags " + text +
                                       " is a response, and one that no one asked for "
                                       "is ignored.",
-                                  kAnswered, plain().flags(flags)));
+                                  kAnswered, Level::Wire, identified, plain().flags(flags)));
     }
     for (const unsigned int flags : {0x00U, 0x01U, 0x3FU}) {
         const std::string text = hexNumber(flags, 2);
         cases.push_back(isIgnored("frame/flags/" + text + "-is-a-notice",
                                   "A message with the flags " + text + " is a notice, and has no answer.", kAnswered,
-                                  plain().flags(flags)));
+                                  Level::Wire, identified, plain().flags(flags)));
     }
     for (const unsigned int flags : {0xC0U, 0xFFU}) {
         const std::string text = hexNumber(flags, 2);
         cases.push_back(isIgnored("frame/flags/" + text + "-is-neither",
                                   "A message with the flags " + text + ", both request and response, is ignored.",
-                                  kAnswered, plain().flags(flags)));
+                                  kAnswered, Level::Wire, identified, plain().flags(flags)));
     }
     return cases;
 }
@@ -245,12 +235,7 @@ Cases fieldCases()
 
 Cases frameHeaderCases()
 {
-    Cases all;
-    for (const auto cases : {eyecatcherCases, lengthCases, newPadCases, oldHeaderCases, flagCases, fieldCases}) {
-        for (Case& aCase : cases())
-            all.push_back(std::move(aCase));
-    }
-    return all;
+    return joined(eyecatcherCases, lengthCases, newPadCases, oldHeaderCases, flagCases, fieldCases);
 }
 
 } // namespace qel::tool::check

@@ -1,5 +1,6 @@
 #include "check/Anchors.hpp"
 #include "check/Trial.hpp"
+#include "check/server/Checks.hpp"
 #include "check/server/ServerCases.hpp"
 
 #include <string>
@@ -180,10 +181,8 @@ Cases frameStreamCases()
         all.push_back(splitAt(bytes));
     for (const std::size_t bytes : {1U, 8U, 9U, 31U, 32U, 38U})
         all.push_back(cutAt(bytes));
-    for (const auto cases : {joinedCases, endCases}) {
-        for (Case& aCase : cases())
-            all.push_back(std::move(aCase));
-    }
+    for (Case& aCase : joined(joinedCases, endCases))
+        all.push_back(std::move(aCase));
     return all;
 }
 

@@ -1,17 +1,14 @@
 #include "check/server/ServerCases.hpp"
 
-#include <iterator>
+#include "check/server/Checks.hpp"
 
 namespace qel::tool::check {
 
 Cases serverCases()
 {
-    Cases all;
-    for (const auto family : {frameHeaderCases, frameStreamCases}) {
-        Cases cases = family();
-        all.insert(all.end(), std::make_move_iterator(cases.begin()), std::make_move_iterator(cases.end()));
-    }
-    return all;
+    return joined(frameHeaderCases, frameStreamCases, versionCases, sessionCases, requestCases, responseCases,
+                  capabilitiesCases, timeCases, modeCases, metadataCases, broadcastCases, serialCases, serialDataCases,
+                  tlsCases, plainCases, robustCases);
 }
 
 } // namespace qel::tool::check
