@@ -77,12 +77,13 @@ TEST_F(ConsoleScriptTest, FailuresOfTheConsoleItselfKeepClearOfTheStatusOfAComma
     EXPECT_EQ(runConsole({"9"}).exitStatus, 1);
 }
 
-TEST_F(ConsoleScriptTest, WhoLeavesBeforeTheEndOfAScriptHasNotFinishedIt)
+TEST_F(ConsoleScriptTest, AScriptLeavesTheTerminalAloneAndControlCEndsIt)
 {
-    PtyProcess person(consoleTo(server.endpoint(), {"1", "--exec", "sleep 1000"}));
-    person.await("connected");
-    person.type("~.");
-    EXPECT_EQ(person.wait().exitStatus, 248);
+    PtyProcess person(consoleTo(server.endpoint(), {"1", "--send", "echo up$((6 * 7))\\r", "--expect", "never"}));
+    person.await("up42");
+    EXPECT_TRUE(person.isTerminalUntouched());
+    person.type("\x03");
+    EXPECT_EQ(person.wait().signal, SIGINT);
 }
 
 TEST_F(ConsoleScriptTest, StepsAreDoneInTheirOrder)
@@ -155,6 +156,21 @@ TEST_F(ConsoleScriptTest, WatchingExcludesTyping)
 {
     EXPECT_EQ(runConsole({"1", "--watch", "--force"}).exitStatus, 2);
     EXPECT_EQ(runConsole({"1", "--watch", "--connection", "1"}).exitStatus, 2);
+}
+
+TEST_F(ConsoleScriptTest, AsciinemaTakesARecording)
+{
+    const Process::Result found = run({"/bin/sh", "-c", "command -v asciinema"});
+    if (found.exitStatus != 0) GTEST_SKIP() << "there is no asciinema here; script/setup installs it";
+    const std::string recording = directory.file("recording");
+    const auto recorded = runConsole({"1", "--record", recording, "--send",
+                                      "printf '\\\\033[1m\\\\303\\\\251%s\\\\n' $((6 * 7))\\r", "--expect", "42"});
+    ASSERT_EQ(recorded.exitStatus, 0) << recorded.errors;
+    PtyProcess player({"/usr/bin/env", "LC_ALL=C.UTF-8", "asciinema", "cat", recording});
+    const auto played = player.wait();
+    EXPECT_EQ(played.exitStatus, 0);
+    EXPECT_THAT(played.screen, HasSubstr("\x1B[1m\xC3\xA9"
+                                         "42"));
 }
 
 // Profiles.

@@ -62,7 +62,7 @@ start_server() {
         --partition '2=stty raw -echo; echo ready; exec sleep 1000' >"$work/address" 2>"$work/serve.log" &
     server=$!
     attempts=0
-    until grep -q -o '127.0.0.1:[0-9]*' "$work/address"; do
+    until grep -q -o '127.0.0.1:[0-9]*' "$work/address" 2>/dev/null; do
         attempts=$((attempts + 1))
         [ "$attempts" -lt 1000 ] || fail "the server does not listen"
         sleep 0.02

@@ -154,7 +154,7 @@ TEST_F(ProfilesTest, AWordThatIsNoPartitionIsAnsweredWithTheNearestName)
     EXPECT_EQ(answer("web1"), "\"web1\"" + text + "did you mean \"lab/web1\"?");
     EXPECT_EQ(answer("web"), "\"web\"" + text + "did you mean \"lab/web1\"?");
     EXPECT_EQ(answer("lab"), "\"lab\"" + text + "did you mean \"lab/PARTITION\"?");
-    EXPECT_EQ(answer("something"), "\"something\"" + text + "qel list shows the names of the profiles");
+    EXPECT_EQ(answer("something"), "\"something\"" + text + "qel list shows what there is");
 }
 
 } // namespace

@@ -162,6 +162,15 @@ TEST(SessionScript, TheStatusIsThatOfTheFirstCommandThatFails)
     EXPECT_EQ(script.commandStatus(), 3);
 }
 
+TEST(SessionScript, ControlCharactersOfACommandAreNotTyped)
+{
+    const std::string command = "printf %s 'a\tb\\c\x7F' | tr '\t' -\necho \"'\x01'\"\n(exit 3)";
+    const std::string line = tool::commandLineWithMarks(command, "9");
+    EXPECT_EQ(line.find_first_of("\t\n\x01\x7F"), std::string::npos) << line;
+    const auto result = run({"/bin/sh", "-c", line});
+    EXPECT_EQ(result.output, "qel-begin-9\na-b\\c\x7F'\x01'\nqel-end-9:3\n");
+}
+
 } // namespace
 
 } // namespace qel::test

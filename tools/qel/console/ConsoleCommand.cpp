@@ -9,6 +9,7 @@
 #include "base/UsageErrors.hpp"
 #include "client/ConnectOptions.hpp"
 #include "console/ConsoleRun.hpp"
+#include "console/ConsoleTexts.hpp"
 #include "console/EscapeFilter.hpp"
 #include "console/Profiles.hpp"
 #include "console/TypedText.hpp"
@@ -81,10 +82,10 @@ std::string checkEscape(std::string& text)
     if (text == "none") return {};
     const bool isPrintable = text.size() == 1 && text[0] > ' ' && text[0] < '\x7F';
     if (!isPrintable && !isControlText(text)) {
-        return tool::quoted(text) + " is not one printable character, ^ and a character from @ to _, or none";
+        return filled(texts::kNotAnEscape, {tool::quoted(text)});
     }
     if (EscapeFilter::isCommandCharacter(*parseEscape(text)))
-        return tool::quoted(text) + " is a command after the escape character";
+        return filled(texts::kEscapeIsCommand, {tool::quoted(text)});
     return {};
 }
 

@@ -21,7 +21,7 @@ constexpr std::chrono::seconds kProgressInterval{1};
 std::string secondsText(PollDeadline::time_point::duration duration)
 {
     const auto milliseconds = std::chrono::floor<std::chrono::milliseconds>(duration);
-    return numberText(std::chrono::duration<double>(milliseconds).count()) + " s";
+    return filled(texts::kSeconds, {numberText(std::chrono::duration<double>(milliseconds).count())});
 }
 
 /// @return false: the descriptor has no window, or does not know its size
@@ -97,7 +97,7 @@ void ConsoleLoop::pTellAbout()
         mScreen.say(filled(texts::kInfoRoundTrip, {numberText(milliseconds)}));
     }
     for (const LogFile* log : mTools.logs)
-        mScreen.say(filled(texts::kInfoLog, {log->isOn() ? "on" : "off", log->path()}));
+        mScreen.say(filled(log->isOn() ? texts::kLogOn : texts::kLogOff, {log->path()}));
 }
 
 void ConsoleLoop::pToggleLogs()

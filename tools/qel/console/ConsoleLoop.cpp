@@ -127,7 +127,8 @@ std::string ConsoleLoop::pGreeting() const
     const std::string escapes = mInputOptions.escape ? filled(texts::kEscapes, {characterName(*mInputOptions.escape)})
                                                      : std::string(texts::kNoEscape);
     std::string partition = std::to_string(mSession->getPartition());
-    if (!mInputOptions.partitionName.empty()) partition += " (" + printable(mInputOptions.partitionName) + ")";
+    if (!mInputOptions.partitionName.empty())
+        partition = filled(texts::kNamed, {partition, printable(mInputOptions.partitionName)});
     const char* const text = mSession->getConnection() == 0 ? texts::kConnected : texts::kWatching;
     return filled(text, {partition, mConsole->getServer(), peer, escapes});
 }
@@ -310,7 +311,7 @@ void ConsoleLoop::pReadInput()
     if (count > 0) return pTakeTyped(buffer.data(), static_cast<std::size_t>(count));
     if (count == 0) return pEndInput();
     if (error == EIO && mMode.isTerminal()) return pEndInput(); // it hung up
-    if (error != EAGAIN && error != EINTR) throw PosixError(error, "cannot read standard input");
+    if (error != EAGAIN && error != EINTR) throw PosixError(error, texts::kCannotReadInput);
 }
 
 void ConsoleLoop::pTakeTyped(const char* data, std::size_t length)

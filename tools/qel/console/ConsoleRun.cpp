@@ -32,6 +32,9 @@ constexpr milliseconds kFarewell{75};
 constexpr milliseconds kReplayPatience{1000};
 constexpr milliseconds kReplayPause{100};
 
+/// A script reads no keyboard, and control-C ends it.
+constexpr int kNoTerminal = -1;
+
 constexpr milliseconds kFirstWait{1000}; // before connecting again
 constexpr milliseconds kLongestWait{30000};
 
@@ -53,7 +56,7 @@ void addHandlers(Console& console, ConsoleScreen& screen)
 [[noreturn]] void endBy(int signal)
 {
     static_cast<void>(::raise(signal));
-    throw CommandFailure(ExitStatus::Failed, "signal " + std::to_string(signal) + " did not end this process");
+    throw CommandFailure(ExitStatus::Failed, filled(texts::kSignalIgnored, {std::to_string(signal)}));
 }
 
 /// True when the next attempt to connect may succeed.
@@ -90,13 +93,14 @@ Recording::Size windowSize(int descriptor)
 } // namespace
 
 ConsoleRun::ConsoleRun(const ConsoleRunOptions& options)
-    : mOptions(options), mMode(STDIN_FILENO), mMessages(STDERR_FILENO),
+    : mOptions(options), mMode(options.steps.empty() ? STDIN_FILENO : kNoTerminal), mMessages(STDERR_FILENO),
       mScreen(STDOUT_FILENO, mMessages, ::isatty(STDERR_FILENO) == 1, mMode), mSerial(options.serial)
 {
     if (!options.log.empty()) mLog.emplace(options.log, LogFile::Content::Raw);
     if (!options.logStrip.empty()) mStrippedLog.emplace(options.logStrip, LogFile::Content::Stripped, options.stamps);
     if (!options.record.empty()) {
-        const std::string title = "partition " + std::to_string(options.partition) + " of " + options.connect.server;
+        const std::string title =
+            filled(texts::kRecordingTitle, {std::to_string(options.partition), options.connect.server});
         mRecording.emplace(options.record, title, windowSize(STDOUT_FILENO));
     }
     if (!options.steps.empty()) mScript.emplace(options.steps, options.connect.timeout(), randomMark());
@@ -136,7 +140,7 @@ ExitStatus ConsoleRun::run()
 
 std::string ConsoleRun::pRefusalText(const StatusError& refusal) const
 {
-    return refusalText(refusal.getResponse(), "partition " + std::to_string(mOptions.partition));
+    return refusalText(refusal.getResponse(), filled(texts::kPartition, {std::to_string(mOptions.partition)}));
 }
 
 SessionTools ConsoleRun::pTools()
@@ -350,7 +354,7 @@ void ConsoleRun::pClose()
 void ConsoleRun::pLeave() noexcept
 {
     if (!mConnection) return;
-    if (mMode.isTerminal()) mConnection->stream().cutAt(TimeProvider::steady() + kFarewell);
+    mConnection->stream().cutAt(TimeProvider::steady() + kFarewell);
     mConnection->stream().setAttendant(nullptr);
     mConnection->stream().throwAwayUnsent();
     mConnection->console().leave();
@@ -365,7 +369,7 @@ ExitStatus ConsoleRun::pConclude(const ConsoleLoop::Outcome& outcome, SessionEnd
         mScreen.output().writeSome();
         mScreen.output().drop(); // nobody waits for the screen
         if (mMode.isTerminal()) mScreen.say(pLeftText(outcome));
-        return mScript && !mScript->isDone() ? ExitStatus::CommandFailed : ExitStatus::Done;
+        return ExitStatus::Done;
     case ConsoleLoop::ExitReason::Ended:
         if (mScript && !mScript->isDone()) {
             throw CommandFailure(ExitStatus::CommandFailed,

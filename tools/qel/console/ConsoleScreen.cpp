@@ -3,6 +3,7 @@
 #include <qel/protocol/Text.hpp>
 
 #include "base/Library.hpp"
+#include "console/ConsoleTexts.hpp"
 
 #include <array>
 #include <cstddef>
@@ -67,8 +68,8 @@ void ConsoleScreen::echo(const std::string& text)
 void ConsoleScreen::showBroadcast(const QelMessageDaxBroadcastOutboundAsync& broadcast)
 {
     const std::string text(broadcast.getDaxPacket(), broadcast.getBroadcastMsgLen());
-    say("broadcast from tool type " + std::to_string(broadcast.getSenderToolType()) + ", " +
-        quoted(broadcast.getSenderToolId()) + ": " + printable(text));
+    say(filled(texts::kBroadcast,
+               {std::to_string(broadcast.getSenderToolType()), quoted(broadcast.getSenderToolId()), printable(text)}));
 }
 
 } // namespace qel::tool

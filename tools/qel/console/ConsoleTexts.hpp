@@ -26,6 +26,12 @@ constexpr const char* kProtected = "$1, TLS 1.3"; // the library accepts no othe
 constexpr const char* kLeft = "left partition $1";
 constexpr const char* kThrownAway = "$1 bytes of input that were not sent are thrown away";
 
+constexpr const char* kPartition = "partition $1";
+constexpr const char* kNamed = "$1 ($2)"; // a partition with a name
+constexpr const char* kBroadcast = "broadcast from tool type $1, $2: $3";
+constexpr const char* kCannotReadInput = "cannot read standard input";
+constexpr const char* kSignalIgnored = "signal $1 did not end this process";
+
 // Input that finds no room.
 constexpr const char* kHeld = "$1 bytes of input are held back: the partition or the server takes none";
 constexpr const char* kHeldLeave = "; $1. at the start of a line leaves and throws them away";
@@ -74,7 +80,7 @@ constexpr const char* kInfoOutput = "the partition's last output came $1 ago";
 constexpr const char* kInfoNoOutput = "the partition has put out nothing so far";
 constexpr const char* kInfoHeard = "the server was heard $1 ago";
 constexpr const char* kInfoRoundTrip = "it last answered in $1 ms";
-constexpr const char* kInfoLog = "log $1: $2";
+constexpr const char* kSeconds = "$1 s";
 
 constexpr const char* kFilePrompt = "qel: file to type (return alone cancels): ";
 constexpr const char* kFileCancelled = "no file is typed";
@@ -83,7 +89,15 @@ constexpr const char* kFileProgress = "$1 of $2 bytes of the file are typed";
 constexpr const char* kFileDone = "the file is typed: $1 bytes";
 constexpr const char* kFileStopped = "stopped after $1 bytes of the file";
 
+// Files.
+constexpr const char* kCannotLog = "cannot write the log $1";
+constexpr const char* kCannotRecord = "cannot write the recording $1";
+constexpr const char* kCannotRead = "cannot read $1";
+constexpr const char* kRecordingTitle = "partition $1 of $2";
+
 // Without a person.
+constexpr const char* kWaitsForOutput = "output that matches $1";
+constexpr const char* kWaitsForCommand = "the end of $1";
 constexpr const char* kStepLate = "timed out after $1 s (--timeout): waiting for $2";
 constexpr const char* kStepUnfinished = "the session ended while waiting for $1: $2";
 constexpr const char* kCommandStatus = "the command exited with status $1";
@@ -98,6 +112,19 @@ constexpr const char* kWatchersFull = "15 consoles watch partition $1 already; w
 constexpr const char* kLost = "$1; connecting again";
 constexpr const char* kNextAttempt = "$1; next attempt in $2 s";
 constexpr const char* kBackAgain = "connected again after $1 s; output may be missing";
+
+// The command line.
+constexpr const char* kNotAnEscape = "$1 is not one printable character, ^ and a character from @ to _, or none";
+constexpr const char* kEscapeIsCommand = "$1 is a command after the escape character";
+constexpr const char* kNotTypedText =
+    "$1 has a backslash that is not followed by r, n, t, e, a backslash, or x and two digits";
+constexpr const char* kNotARegex = "$1 is not a regular expression: $2";
+constexpr const char* kNoProfile = "there is no profile $1";
+constexpr const char* kNoPartition = "there is no partition $1";
+constexpr const char* kNotAPartition = "$1 is no partition id from 0 to 65535 and no PROFILE/PARTITION";
+constexpr const char* kDidYouMean = "; did you mean $1?";
+constexpr const char* kSeeList = "; qel list shows what there is";
+constexpr const char* kSlashInProfile = "the name of a profile must not contain a slash";
 
 } // namespace texts
 

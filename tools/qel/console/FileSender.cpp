@@ -2,6 +2,8 @@
 
 #include <qel/common/util/PosixError.hpp>
 
+#include "console/ConsoleTexts.hpp"
+
 #include <cerrno>
 #include <fcntl.h>
 #include <sys/stat.h>
@@ -20,10 +22,10 @@ FileSender::FileSender(std::string path)
     : mPath(std::move(path)), mFile(::open(mPath.c_str(), O_RDONLY | O_CLOEXEC | O_NONBLOCK))
 {
     const PosixErrorCode error = errno;
-    if (mFile.get() < 0) throw FileIOError(error, "cannot read " + mPath);
+    if (mFile.get() < 0) throw FileIOError(error, filled(texts::kCannotRead, {mPath}));
     struct stat status {};
     if (::fstat(mFile.get(), &status) != 0) return;
-    if (S_ISDIR(status.st_mode)) throw FileIOError(PosixErrorCode(EISDIR), "cannot read " + mPath);
+    if (S_ISDIR(status.st_mode)) throw FileIOError(PosixErrorCode(EISDIR), filled(texts::kCannotRead, {mPath}));
     mSize = static_cast<std::uint64_t>(status.st_size);
 }
 
@@ -32,7 +34,7 @@ std::string FileSender::next()
     std::string piece(kPiece, '\0');
     const ssize_t count = ::read(mFile.get(), piece.data(), piece.size());
     const PosixErrorCode error = errno;
-    if (count < 0) throw FileIOError(error, "cannot read " + mPath);
+    if (count < 0) throw FileIOError(error, filled(texts::kCannotRead, {mPath}));
     piece.resize(static_cast<std::size_t>(count));
     mSent += piece.size();
     return piece;

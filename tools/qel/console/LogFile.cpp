@@ -1,22 +1,15 @@
 #include "console/LogFile.hpp"
 
-#include <qel/common/util/PosixError.hpp>
+#include "console/ConsoleTexts.hpp"
 
-#include <cerrno>
 #include <fcntl.h>
-#include <unistd.h>
 #include <utility>
 
 namespace qel::tool {
 
 LogFile::LogFile(std::string path, Content content, TimeStamps::Style style)
-    : mPath(std::move(path)), mContent(content),
-      mFile(::open(mPath.c_str(), O_WRONLY | O_APPEND | O_CREAT | O_CLOEXEC | O_NOCTTY | O_NONBLOCK, 0600)),
-      mStamps(style)
-{
-    const PosixErrorCode error = errno;
-    if (mFile.get() < 0) throw FileIOError(error, "cannot write the log " + mPath);
-}
+    : mContent(content), mFile(std::move(path), O_APPEND, texts::kCannotLog), mStamps(style)
+{}
 
 void LogFile::onOutput(const char* data, std::size_t length)
 {
@@ -37,23 +30,10 @@ void LogFile::onGap(const std::string& text)
     onOutput(line.data(), line.size());
 }
 
-std::string LogFile::takeFailure() { return std::exchange(mFailure, {}); }
-
 void LogFile::pWrite(const std::string& text)
 {
     if (!text.empty()) mEndsLine = text.back() == '\n';
-    std::size_t written = 0;
-    while (written < text.size()) {
-        const ssize_t count = ::write(mFile.get(), text.data() + written, text.size() - written);
-        const PosixErrorCode error = errno;
-        if (count > 0) {
-            written += static_cast<std::size_t>(count);
-        } else if (error != EINTR) {
-            mFailure = FileIOError(error, "cannot write the log " + mPath).what();
-            mIsOn = false;
-            return;
-        }
-    }
+    if (!mFile.write(text)) mIsOn = false;
 }
 
 } // namespace qel::tool

@@ -1,8 +1,7 @@
 #pragma once
 
-#include <qel/common/util/UniqueFd.hpp>
-
 #include "console/ControlStripper.hpp"
+#include "console/SessionFile.hpp"
 #include "console/SessionTap.hpp"
 #include "console/TimeStamps.hpp"
 
@@ -27,7 +26,7 @@ public:
     /// @throws FileIOError  the file cannot be opened
     LogFile(std::string path, Content content, TimeStamps::Style style = TimeStamps::Style::Off);
 
-    const std::string& path() const noexcept { return mPath; }
+    const std::string& path() const noexcept { return mFile.path(); }
 
     bool isOn() const noexcept { return mIsOn; }
     /// Turns it off, or on again; a file that has failed is tried again.
@@ -37,19 +36,17 @@ public:
     void onGap(const std::string& text) override;
 
     /// @return why the log ended since the last call; empty: it did not
-    std::string takeFailure();
+    std::string takeFailure() { return mFile.takeFailure(); }
 
 private:
     void pWrite(const std::string& text);
 
-    const std::string mPath;
     const Content mContent;
-    UniqueFd mFile;
+    SessionFile mFile;
     bool mIsOn = true;
     bool mEndsLine = true; // what has been written
     ControlStripper mStripper;
     TimeStamps mStamps;
-    std::string mFailure;
 };
 
 } // namespace qel::tool

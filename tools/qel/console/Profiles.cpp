@@ -7,6 +7,7 @@
 #include "base/Library.hpp"
 #include "base/OptionChecks.hpp"
 #include "base/UsageErrors.hpp"
+#include "console/ConsoleTexts.hpp"
 
 #include <algorithm>
 #include <filesystem>
@@ -21,17 +22,21 @@ namespace {
 constexpr const char* kPartitions = "partitions";
 constexpr std::uint16_t kMaxPartition = std::numeric_limits<std::uint16_t>::max();
 
-[[noreturn]] void failUnknown(const char* kind, const std::string& word, const std::vector<std::string>& known)
+/// The nearest of the words that are known, or where they are listed.
+std::string hintAt(const std::string& guess)
 {
-    const std::string guess = nearestWord(word, known);
-    const std::string hint = guess.empty() ? "; qel list shows what there is" : "; did you mean " + quoted(guess) + "?";
-    throw CommandFailure(ExitStatus::Usage, std::string("there is no ") + kind + " " + quoted(word) + hint);
+    return guess.empty() ? texts::kSeeList : filled(texts::kDidYouMean, {quoted(guess)});
+}
+
+[[noreturn]] void failUnknown(const char* text, const std::string& word, const std::vector<std::string>& known)
+{
+    throw CommandFailure(ExitStatus::Usage, filled(text, {quoted(word)}) + hintAt(nearestWord(word, known)));
 }
 
 Profile readProfile(const TomlEntry& entry)
 {
     Profile profile{entry.key, tableOf(entry), {}};
-    if (entry.key.find('/') != std::string::npos) failAt(entry.place, "the name of a profile must not contain a slash");
+    if (entry.key.find('/') != std::string::npos) failAt(entry.place, texts::kSlashInProfile);
     const TomlEntry* const partitions = profile.options.find(kPartitions);
     if (partitions == nullptr) return profile;
     for (const TomlEntry& each : tableOf(*partitions).entries)
@@ -46,7 +51,7 @@ const Profile& findProfile(const std::string& name, const std::vector<Profile>& 
         if (profile.name == name) return profile;
         names.push_back(profile.name);
     }
-    failUnknown("profile", name, names);
+    failUnknown(texts::kNoProfile, name, names);
 }
 
 std::uint16_t findPartition(const std::string& name, const Profile& profile)
@@ -58,7 +63,7 @@ std::uint16_t findPartition(const std::string& name, const Profile& profile)
     }
     const std::optional<std::uint64_t> number = parseInteger(name);
     if (number && *number <= kMaxPartition) return static_cast<std::uint16_t>(*number);
-    failUnknown("partition", profile.name + "/" + name, names);
+    failUnknown(texts::kNoPartition, profile.name + "/" + name, names);
 }
 
 /// The options that are for one run. The order of the steps of a script counts, and keys of a table have none.
@@ -152,12 +157,8 @@ void failNoPartition(const std::string& word, const std::vector<Profile>& profil
         targets.push_back(profile.name + "/PARTITION");
     }
     const auto guess = std::find(words.begin(), words.end(), nearestWord(word, words));
-    const std::string hint =
-        guess == words.end()
-            ? "; qel list shows the names of the profiles"
-            : "; did you mean " + tool::quoted(targets[static_cast<std::size_t>(guess - words.begin())]) + "?";
-    throw CommandFailure(ExitStatus::Usage, quoted(word) + " is no partition id from 0 to " +
-                                                std::to_string(kMaxPartition) + " and no PROFILE/PARTITION" + hint);
+    const std::string target = guess == words.end() ? "" : targets[static_cast<std::size_t>(guess - words.begin())];
+    throw CommandFailure(ExitStatus::Usage, filled(texts::kNotAPartition, {quoted(word)}) + hintAt(target));
 }
 
 } // namespace qel::tool

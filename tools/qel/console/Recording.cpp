@@ -1,16 +1,15 @@
 #include "console/Recording.hpp"
 
-#include <qel/common/util/PosixError.hpp>
 #include <qel/common/util/TimeProvider.hpp>
+
+#include "console/ConsoleTexts.hpp"
 
 #include <algorithm>
 #include <array>
-#include <cerrno>
 #include <cstdio>
 #include <cstdlib>
 #include <fcntl.h>
 #include <nlohmann/json.hpp>
-#include <unistd.h>
 #include <utility>
 
 namespace qel::tool {
@@ -45,12 +44,8 @@ std::size_t incompleteBytes(const std::string& text)
 } // namespace
 
 Recording::Recording(std::string path, const std::string& title, Size size)
-    : mPath(std::move(path)),
-      mFile(::open(mPath.c_str(), O_WRONLY | O_TRUNC | O_CREAT | O_CLOEXEC | O_NOCTTY | O_NONBLOCK, 0600)),
-      mStart(TimeProvider::steady())
+    : mFile(std::move(path), O_TRUNC, texts::kCannotRecord), mStart(TimeProvider::steady())
 {
-    const PosixErrorCode error = errno;
-    if (mFile.get() < 0) throw FileIOError(error, "cannot write the recording " + mPath);
     Json header{{"version", 2}, {"width", size.columns}, {"height", size.rows}};
     header["timestamp"] = std::chrono::system_clock::to_time_t(TimeProvider::system());
     header["title"] = title;
@@ -81,8 +76,6 @@ void Recording::onResize(Size size)
     pWriteEvent("r", std::to_string(size.columns) + "x" + std::to_string(size.rows));
 }
 
-std::string Recording::takeFailure() { return std::exchange(mFailure, {}); }
-
 /// A character whose last bytes do not come any more.
 void Recording::pWriteRest()
 {
@@ -91,7 +84,7 @@ void Recording::pWriteRest()
 
 void Recording::pWriteEvent(const char* kind, const std::string& data)
 {
-    if (mFile.get() < 0) return;
+    if (mHasFailed) return;
     const double seconds = std::chrono::duration<double>(TimeProvider::steady() - mStart).count();
     std::array<char, 32> time{};
     std::snprintf(time.data(), time.size(), "%.6f", seconds);
@@ -100,20 +93,6 @@ void Recording::pWriteEvent(const char* kind, const std::string& data)
     pWrite(line);
 }
 
-void Recording::pWrite(const std::string& line)
-{
-    std::size_t written = 0;
-    while (written < line.size()) {
-        const ssize_t count = ::write(mFile.get(), line.data() + written, line.size() - written);
-        const PosixErrorCode error = errno;
-        if (count > 0) {
-            written += static_cast<std::size_t>(count);
-        } else if (error != EINTR) {
-            mFailure = FileIOError(error, "cannot write the recording " + mPath).what();
-            mFile.reset();
-            return;
-        }
-    }
-}
+void Recording::pWrite(const std::string& line) { mHasFailed = !mFile.write(line); }
 
 } // namespace qel::tool

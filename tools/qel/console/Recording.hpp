@@ -1,7 +1,6 @@
 #pragma once
 
-#include <qel/common/util/UniqueFd.hpp>
-
+#include "console/SessionFile.hpp"
 #include "console/SessionTap.hpp"
 
 #include <chrono>
@@ -38,18 +37,17 @@ public:
     void onResize(Size size);
 
     /// @return why the recording ended since the last call; empty: it did not
-    std::string takeFailure();
+    std::string takeFailure() { return mFile.takeFailure(); }
 
 private:
     void pWriteRest();
     void pWriteEvent(const char* kind, const std::string& data);
     void pWrite(const std::string& line);
 
-    const std::string mPath;
-    UniqueFd mFile;
+    SessionFile mFile;
+    bool mHasFailed = false;
     const std::chrono::steady_clock::time_point mStart;
     std::string mRest; // the first bytes of a character whose last ones have not come yet
-    std::string mFailure;
 };
 
 } // namespace qel::tool

@@ -3,9 +3,11 @@
 #include <qel/protocol/Text.hpp>
 
 #include "base/Library.hpp"
+#include "console/ConsoleTexts.hpp"
 
 #include <algorithm>
 #include <array>
+#include <cstdio>
 #include <cstdlib>
 #include <stdexcept>
 #include <utility>
@@ -16,6 +18,7 @@ namespace {
 
 constexpr const char* kBegin = "qel-begin-";
 constexpr const char* kEnd = "qel-end-";
+constexpr char kDelete = 0x7F;
 
 /// In single quotes for a shell.
 std::string shellQuoted(const std::string& text)
@@ -24,6 +27,20 @@ std::string shellQuoted(const std::string& text)
     for (const char c : text)
         quoted += c == '\'' ? std::string("'\\''") : std::string(1, c);
     return quoted + "'";
+}
+
+/// What sh -c runs. Control characters, which a terminal or the editor of a shell would act on, are made by printf.
+std::string shellText(const std::string& command)
+{
+    const auto isControl = [](char c) { return static_cast<unsigned char>(c) < ' ' || c == kDelete; };
+    if (std::none_of(command.begin(), command.end(), isControl)) return shellQuoted(command);
+    std::string text;
+    for (const char c : command) {
+        std::array<char, 8> octal{};
+        std::snprintf(octal.data(), octal.size(), "\\0%03o", static_cast<unsigned int>(c));
+        text += c == '\\' ? "\\\\" : isControl(c) ? octal.data() : std::string(1, c);
+    }
+    return "\"$(printf %b " + shellQuoted(text) + ")\"";
 }
 
 } // namespace
@@ -37,7 +54,7 @@ struct SessionScript::Pattern {
         if (error == 0) return;
         std::array<char, 256> reason{};
         ::regerror(error, &regex, reason.data(), reason.size());
-        throw std::invalid_argument(quoted(text) + " is not a regular expression: " + reason.data());
+        throw std::invalid_argument(filled(texts::kNotARegex, {quoted(text), reason.data()}));
     }
     ~Pattern() { ::regfree(&regex); }
     Pattern(const Pattern&) = delete;
@@ -48,7 +65,7 @@ struct SessionScript::Pattern {
 
 std::string commandLineWithMarks(const std::string& command, const std::string& mark)
 {
-    return std::string("printf '%s%s\\n' ") + kBegin + " " + mark + "; sh -c " + shellQuoted(command) +
+    return std::string("printf '%s%s\\n' ") + kBegin + " " + mark + "; sh -c " + shellText(command) +
            " </dev/null; printf '%s%s:%d\\n' " + kEnd + " " + mark + " $?";
 }
 
@@ -158,7 +175,7 @@ std::string SessionScript::waitsFor() const
     if (mSteps.empty()) return {};
     const ScriptStep& step = mSteps.front().step;
     const bool isExpect = step.kind == ScriptStep::Kind::Expect;
-    return (isExpect ? "output that matches " : "the end of ") + quoted(step.text);
+    return filled(isExpect ? texts::kWaitsForOutput : texts::kWaitsForCommand, {quoted(step.text)});
 }
 
 std::string SessionScript::takeCommandOutput()

@@ -3,6 +3,7 @@
 #include <qel/protocol/Text.hpp>
 
 #include "base/Library.hpp"
+#include "console/ConsoleTexts.hpp"
 #include "console/SessionScript.hpp"
 
 #include <cctype>
@@ -61,7 +62,7 @@ std::optional<std::string> parseTypedText(const std::string& text)
 std::string checkTypedText(std::string& text)
 {
     if (parseTypedText(text)) return {};
-    return tool::quoted(text) + " has a backslash that is not followed by r, n, t, e, a backslash, or x and two digits";
+    return filled(texts::kNotTypedText, {tool::quoted(text)});
 }
 
 std::string checkPattern(std::string& text)
