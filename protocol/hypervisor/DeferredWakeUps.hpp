@@ -42,6 +42,9 @@ public:
     DeferredWakeUps(const DeferredWakeUps&) = delete;
     DeferredWakeUps& operator=(const DeferredWakeUps&) = delete;
 
+    /// From here on it is done so at the end. Does nothing inside another one.
+    void change(How how) noexcept { mHow = how; }
+
     /// Wakes a writer: at the end of the object of this thread, or at once if there is none, or no memory to remember
     /// the writer.
     static void wake(const std::shared_ptr<LinkWriter>& writer) noexcept;
@@ -49,7 +52,7 @@ public:
 private:
     void pAdd(const std::shared_ptr<LinkWriter>& writer);
 
-    const How mHow;
+    How mHow;
     const bool mIsOutermost;
     std::array<std::shared_ptr<LinkWriter>, 2> mFirst; // more are rare: a broadcast to all
     std::size_t mCount = 0;                            // of mFirst

@@ -29,6 +29,9 @@ constexpr std::uint8_t kUnicast = 1;
 /// Bytes of capability bits in an answer: one for every eight of the 32.
 constexpr std::uint32_t kCapabilityBytes = QelCapabilities::size() / 8;
 
+/// Output that the serial thread sends itself.
+constexpr std::uint64_t kShortOutput = 256;
+
 /// Where the limits response says how many consoles are supported: offset from the first payload byte.
 constexpr std::size_t kConsolesSupportedOffset = 8;
 
@@ -131,9 +134,11 @@ std::vector<SerialWatch> HypervisorEngine::serialWatches() const
 void HypervisorEngine::serviceSerial(std::uint16_t partition)
 {
     {
-        const DeferredWakeUps wakeUps; // until the lock is released
+        DeferredWakeUps wakeUps; // until the lock is released
         const MutexLock lock(mMutex);
-        mPartitions.service(partition);
+        const std::uint64_t bytes = mPartitions.service(partition);
+        // The echo of a key needs no turn of one more thread. With more, the writer sends while this thread reads on.
+        if (bytes <= kShortOutput) wakeUps.change(DeferredWakeUps::How::SendForOne);
     }
     pTellTaps();
 }

@@ -102,19 +102,30 @@ bool Partition::feed(const ConsoleEntry& console, std::uint16_t number, const ch
 {
     if (!mSessions.isOf(number, console) || !mSessions.isSetUp(number)) return false;
     if (length == 0) return true;
-    mEvents.changed = true;
     ++mInputMessages;
+    const auto waitsFor = [this] {
+        return std::make_tuple(pWantsToWrite(), mLine.advanceAt(), mSessions.canDeliver());
+    };
+    const auto before = waitsFor();
+    pFeed(number, data, length);
+    // The serial thread is not woken for a key that the line has taken.
+    if (waitsFor() != before) mEvents.changed = true;
+    return true;
+}
+
+void Partition::pFeed(std::uint16_t number, const char* data, std::size_t length)
+{
     if (number != PartitionSessions::kTyping) {
         mSessions.refuseInput(number, "watching only, input is not passed on");
     } else if (!mIsLost && (mState == State::Up || mState == State::ComingUp || pIsFirstStartDue())) {
         mInput.append(data, length);
         pPumpInput();
-        return true;
+        pNoteRoom();
+        return;
     } else if (mIsLost) { // also while it connects: the second half of a line that was typed blindly is worse than none
         mSessions.refuseInput(number, "the line is down, input is dropped");
     } // nothing reads what is typed after the end of a command
     mDroppedBytes += length;
-    return true;
 }
 
 /// Whether the line is to be brought up for the first time in a moment, as when a console comes right after the start
@@ -136,7 +147,7 @@ void Partition::release(const ConsoleEntry& console)
 
 bool Partition::mayAddInput(const ConsoleEntry& console) const
 {
-    return mInput.size() < kInputLimit || !mSessions.isOf(PartitionSessions::kTyping, console) ||
+    return !mIsInputFull || !mSessions.isOf(PartitionSessions::kTyping, console) ||
            !mSessions.isSetUp(PartitionSessions::kTyping);
 }
 
@@ -183,7 +194,7 @@ std::optional<PollFd> Partition::watch() const
     if ((mState != State::Up && mState != State::ComingUp) || mTurns.isPausing()) return std::nullopt;
     const bool isUp = mState == State::Up;
     const bool wantsOutput = !isUp || pWantsOutput();
-    const bool wantsToWrite = (isUp && !mInput.empty()) || mLine.wantsToWrite();
+    const bool wantsToWrite = pWantsToWrite();
     if (!mSessions.isEmpty() && !wantsOutput && !wantsToWrite) return std::nullopt;
     // Without a session nothing may be read, but a hang-up is noticed: poll(2) always reports it.
     PollFd fd(mLine.descriptor(), PollEvents::Error);
@@ -219,12 +230,14 @@ PollDeadline Partition::pNextStep(TimePoint now) const
     return mSetUpBy.isExpired(now) ? PollDeadline() : mSetUpBy; // room in a link comes with a wake-up
 }
 
-void Partition::service()
+std::uint64_t Partition::service()
 {
+    const std::uint64_t outputBefore = mOutputBytes;
     const auto progress = [this] { return std::make_tuple(mState, mStarts, mOutputBytes, mInputBytes, mInput.size()); };
     const auto before = progress();
     pTakeTurn();
     mTurns.count(progress() != before, TimeProvider::steady());
+    return mOutputBytes - outputBefore;
 }
 
 void Partition::pTakeTurn()
@@ -411,21 +424,20 @@ void Partition::pTakeDown(CloseReason reason, const CommandEnd& end)
 
 void Partition::pStopLine()
 {
-    const bool wasFull = mInput.size() >= kInputLimit;
     mState = State::Down;
     mInput.clear();
+    const bool hasRoom = pNoteRoom();
     mIsDraining = false;
     mTurns = FruitlessTurns();
     mStartAt = mExitBy = mSetUpBy = mGiveUpBy = PollDeadline();
     mEvents.changed = true;
     mLine.stop();
-    if (wasFull) mSessions.resumeTyping();
+    if (hasRoom) mSessions.resumeTyping();
 }
 
 void Partition::pPumpInput()
 {
     if (mInput.empty() || mState != State::Up) return;
-    const bool wasFull = mInput.size() >= kInputLimit;
     if (mLine.hasHungUp()) mInput.clear(); // nothing is left that reads it
     while (!mInput.empty()) {
         const std::optional<std::size_t> taken = mLine.write(mInput.data(), mInput.size());
@@ -434,7 +446,17 @@ void Partition::pPumpInput()
         mInput.erase(0, *taken);
         mInputBytes += *taken;
     }
-    if (wasFull && mInput.size() < kInputLimit) mSessions.resumeTyping();
+    if (pNoteRoom()) mSessions.resumeTyping();
+}
+
+/// To be called when the input has become more or less. @return whether there is room for more again
+bool Partition::pNoteRoom() noexcept
+{
+    const bool isFull = mInput.size() >= kInputLimit;
+    const bool wasFull = std::exchange(mIsInputFull, isFull);
+    if (isFull && !wasFull) ++mEvents.fullInputs;
+    if (wasFull && !isFull) --mEvents.fullInputs;
+    return wasFull && !isFull;
 }
 
 /// Reads one piece of output and passes it on. @return false: there was none
@@ -474,6 +496,9 @@ void Partition::pDrain()
         if (!pReadOutput()) return;
     }
 }
+
+/// Whether the line has to be called when it takes bytes.
+bool Partition::pWantsToWrite() const { return (mState == State::Up && !mInput.empty()) || mLine.wantsToWrite(); }
 
 bool Partition::pWantsOutput() const
 {

@@ -102,7 +102,8 @@ public:
     PollDeadline deadline(TimePoint now) const;
 
     /// Moves what can be moved, at most one piece of output of the line.
-    void service();
+    /// @return the bytes of the output that were read
+    std::uint64_t service();
 
     /// Does what is due: brings the line up or takes it down, and sends what consoles have got room for.
     void serviceTime(TimePoint now);
@@ -110,6 +111,7 @@ public:
 private:
     using State = PartitionState::Line;
 
+    void pFeed(std::uint16_t number, const char* data, std::size_t length);
     bool pIsFirstStartDue() const;
     bool pBringUp(bool mayRestart);
     bool pStart(TimePoint now);
@@ -128,8 +130,10 @@ private:
     bool pMayHoldRestart() const;
     void pCheckStall(TimePoint now);
     void pPumpInput();
+    bool pNoteRoom() noexcept;
     bool pReadOutput();
     void pDrain();
+    bool pWantsToWrite() const;
     bool pWantsOutput() const;
     bool pPeerHasFinished() const noexcept;
     PollDeadline pNextStep(TimePoint now) const;
@@ -146,6 +150,7 @@ private:
     OutputHistory mOutput;
     PartitionSessions mSessions;
     std::string mInput; ///< from consoles, not yet taken by the line
+    bool mIsInputFull = false;
 
     std::uint64_t mOutputBytes = 0;
     std::uint64_t mInputBytes = 0;

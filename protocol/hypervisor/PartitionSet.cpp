@@ -103,6 +103,7 @@ void PartitionSet::shutDown()
 
 bool PartitionSet::hasInputRoom(const ConsoleEntry& console) const
 {
+    if (mEvents.fullInputs == 0) return true; // asked for each message
     return std::all_of(mPartitions.begin(), mPartitions.end(),
                        [&](const auto& entry) { return entry.second.mayAddInput(console); });
 }
@@ -129,10 +130,10 @@ bool PartitionSet::takeChanged() { return std::exchange(mEvents.changed, false);
 
 std::vector<TapCall> PartitionSet::takeTapCalls() { return std::exchange(mEvents.tapCalls, {}); }
 
-void PartitionSet::service(std::uint16_t id)
+std::uint64_t PartitionSet::service(std::uint16_t id)
 {
     Partition* const partition = pFind(id);
-    if (partition != nullptr) partition->service();
+    return partition == nullptr ? 0 : partition->service();
 }
 
 void PartitionSet::serviceTime(Partition::TimePoint now)

@@ -110,7 +110,8 @@ public:
     std::vector<TapCall> takeTapCalls();
 
     /// Moves what can be moved on one partition, at most one piece of output of its line.
-    void service(std::uint16_t id);
+    /// @return the bytes of the output that were read
+    std::uint64_t service(std::uint16_t id);
 
     /// Does what is due on all partitions: brings lines up and takes them down, and sends what consoles have got room
     /// for.

@@ -2,6 +2,7 @@
 
 #include <qel/protocol/SerialTap.hpp>
 
+#include <cstddef>
 #include <cstdint>
 #include <memory>
 #include <string>
@@ -21,6 +22,7 @@ struct TapCall {
 struct SerialEvents {
     bool changed = false;          ///< what to wait for may have changed
     std::vector<TapCall> tapCalls; ///< in the order of what happened
+    std::size_t fullInputs = 0;    ///< partitions that have as much input waiting as they may
 };
 
 } // namespace qel::protocol

@@ -78,6 +78,17 @@ TEST_F(DeferredWakeUpsTest, ASingleWriterSendsOnThisThreadIfThatWasAskedFor)
     EXPECT_EQ(first->woken, 0U);
 }
 
+TEST_F(DeferredWakeUpsTest, HowToWakeMayChangeUntilTheEnd)
+{
+    {
+        DeferredWakeUps wakeUps;
+        DeferredWakeUps::wake(first);
+        wakeUps.change(DeferredWakeUps::How::SendForOne);
+    }
+    EXPECT_EQ(first->sent, 1U);
+    EXPECT_EQ(first->woken, 0U);
+}
+
 TEST_F(DeferredWakeUpsTest, TheOutermostOneCollects)
 {
     {

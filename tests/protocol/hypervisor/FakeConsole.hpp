@@ -4,6 +4,7 @@
 #include <qel/common/QelMessageRegistry.hpp>
 
 #include "hypervisor/ConsoleLink.hpp"
+#include "hypervisor/DeferredWakeUps.hpp"
 #include "support/Allocations.hpp"
 
 #include <deque>
@@ -21,6 +22,7 @@ public:
     bool finished = false;
     bool isCut = false;
     unsigned resumed = 0;
+    std::shared_ptr<protocol::LinkWriter> writer; ///< woken for serial data; null: none
 
     void post(std::unique_ptr<QelMessage> message) override
     {
@@ -32,6 +34,7 @@ public:
     {
         if (!serialRoom) throw std::logic_error("serial data without room");
         post(std::move(message));
+        if (writer != nullptr) protocol::DeferredWakeUps::wake(writer);
     }
     bool offer(std::unique_ptr<QelMessage> message) override
     {

@@ -29,6 +29,24 @@ TEST_F(VirtualSerialTest, DataFlowsBothWays)
     EXPECT_THAT(log.lines(), IsEmpty());
 }
 
+TEST_F(VirtualSerialTest, TheSerialThreadSendsShortOutputItselfAndWakesTheWriterForMore)
+{
+    struct Writer : protocol::LinkWriter {
+        void wake() noexcept override { calls += 'w'; }
+        void send() noexcept override { calls += 's'; }
+        std::string calls;
+    };
+    const auto writer = std::make_shared<Writer>();
+    Peer peer;
+    setUpSerial(peer, "a", 1);
+    peer.link.writer = writer;
+    port1->output = {std::string(256, 'x'), std::string(257, 'y')};
+    hypervisor->serviceSerial(1);
+    EXPECT_EQ(writer->calls, "s");
+    hypervisor->serviceSerial(1);
+    EXPECT_EQ(writer->calls, "sw");
+}
+
 TEST_F(VirtualSerialTest, EmptyDataIsAcceptedWithoutAWarning)
 {
     Peer peer;
@@ -127,7 +145,12 @@ TEST_F(VirtualSerialTest, OnlyChangesToALineWakeTheSerialThread)
         EXPECT_EQ(serialWakes, wakes + 1);
         wakes = serialWakes;
     };
-    wakesOnce("input", QelMessageVirtualSerialDataToOsAsync(1, 0, 1, "x"));
+    receive(peer, QelMessageVirtualSerialDataToOsAsync(1, 0, 1, "x"));
+    EXPECT_EQ(serialWakes, wakes); // the line takes it at once
+    port1->takes = 0;
+    wakesOnce("input that the line does not take", QelMessageVirtualSerialDataToOsAsync(1, 0, 1, "y"));
+    receive(peer, QelMessageVirtualSerialDataToOsAsync(1, 0, 1, "z"));
+    EXPECT_EQ(serialWakes, wakes); // the serial thread waits already
     wakesOnce("close", QelMessageVirtualSerialCloseReq(1, 0, false));
     wakesOnce("open", QelMessageVirtualSerialOpenReq(1, 0, false));
     wakesOnce("set up", QelMessageVirtualSerialSetupSessionReq(1, 0));

@@ -66,7 +66,8 @@ void DescriptorOutput::flush()
     }
 }
 
-bool DescriptorOutput::pIsReady() const { return PollSet(getPollFd()).poll().anyReady(); }
+/// A terminal says so itself: it is not written to in a way that waits.
+bool DescriptorOutput::pIsReady() const { return mOwn.get() >= 0 || PollSet(getPollFd()).poll().anyReady(); }
 
 /// @return the number of bytes written; 0: none at the moment
 std::size_t DescriptorOutput::pWrite(const char* data, std::size_t length) const

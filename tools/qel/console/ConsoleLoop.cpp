@@ -21,6 +21,9 @@ namespace {
 
 constexpr char kEndOfFile = 'D' & 0x1F; // control-D
 
+/// For messages that poll(2) has announced: it spares the console the question whether there are any.
+constexpr std::chrono::milliseconds kAnnounced(1);
+
 /// A SignalWatch blocks its signals, so it receives ignored ones too. A signal that was ignored when this process
 /// started, as nohup(1) does it, must not end the process.
 bool isIgnored(int signal)
@@ -194,13 +197,18 @@ void ConsoleLoop::pPollOnce()
     // TLS may hold received bytes while the socket has none.
     const bool isPending = pWantsMessages() && mConsole->hasPending();
     const auto timeout = pDeadline().getTimeout(TimeProvider::steady());
+    mMayBeTaken = false;
     const PollResult ready = isPending ? set.poll() : set.wait(timeout);
 
     if (ready.contains(mSignals.getPollFd())) pHandleSignal();
     if (ready.contains(output)) pWriteOutput();
-    if (pWantsMessages() && (isPending || ready.contains(messages))) pReceive();
+    if (pWantsMessages() && (isPending || ready.contains(messages))) pReceive(ready.contains(messages));
     if (pWantsToSend() && ready.contains(sending)) pSend();
-    if (pWantsInput() && ready.contains(input)) pReadInput();
+    if (pWantsInput() && ready.contains(input)) {
+        pReadInput();
+        // A key goes out now, and not after all the others have been asked again.
+        if (pWantsToSend() && PollSet(sending).poll().contains(sending)) pSend();
+    }
     if (!ready.anyReady() && !isPending) pCheckEndTimer();
     pCheckHeld();
     pCheckSilence();
@@ -245,6 +253,7 @@ void ConsoleLoop::pHandleSignal()
 void ConsoleLoop::pSuspend()
 {
     mMode.restore();
+    mMayBeTaken = true; // by a shell
     stop();
     mMode.enterRaw();
     mKeepAlive.postpone(TimeProvider::steady());
@@ -256,10 +265,13 @@ void ConsoleLoop::pWriteOutput()
     mScreen.output().writeSome();
 }
 
-void ConsoleLoop::pReceive()
+/// @param isAnnounced  the connection is readable
+void ConsoleLoop::pReceive(bool isAnnounced)
 {
+    mMayBeTaken = true; // while a stream waits (attend())
     try {
-        if (mConsole->process()) pReport(mKeepAlive.noteHeard(TimeProvider::steady()));
+        if (mConsole->process(isAnnounced ? kAnnounced : std::chrono::milliseconds::zero()))
+            pReport(mKeepAlive.noteHeard(TimeProvider::steady()));
     } catch (...) {
         // When the user leaves while a message is received, the connection breaks.
         if (pIsRunning() && mSession->getEnd() == SessionEnd::None) mFailure = std::current_exception();
@@ -267,6 +279,8 @@ void ConsoleLoop::pReceive()
     }
     pShowReceived();
     if (mSession->getEnd() != SessionEnd::None) pExit(ExitReason::Ended);
+    // The echo of a key is written now; with more to come, all is written together.
+    if (!mScreen.output().isEmpty() && !mConsole->hasPending()) pWriteOutput();
 }
 
 void ConsoleLoop::pShowReceived()
@@ -282,6 +296,7 @@ void ConsoleLoop::pShowReceived()
 /// the longest message. The send therefore does not block; if it does, the session's timeout limits it.
 void ConsoleLoop::pSend()
 {
+    mMayBeTaken = true; // as in pReceive()
     try {
         const auto now = TimeProvider::steady();
         mQuietSince = now;
@@ -303,8 +318,8 @@ void ConsoleLoop::pSend()
 
 void ConsoleLoop::pReadInput()
 {
-    // It may have been read since it was ready, while the connection waited (attend()).
-    if (!PollSet(PollFd(mInput, PollEvents::Read)).poll().anyReady()) return;
+    if (mMayBeTaken && !PollSet(PollFd(mInput, PollEvents::Read)).poll().anyReady()) return;
+    mMayBeTaken = true;
     std::array<char, SerialSession::kMaxData> buffer;
     const ssize_t count = ::read(mInput, buffer.data(), buffer.size());
     const int error = errno;

@@ -139,7 +139,7 @@ private:
     void pHandleSignal();
     void pSuspend();
     void pWriteOutput();
-    void pReceive();
+    void pReceive(bool isAnnounced);
     void pSend();
     void pReadInput();
     void pTakeTyped(const char* data, std::size_t length);
@@ -192,6 +192,7 @@ private:
     std::uint64_t mReceived = 0;                         // bytes
     std::optional<PollDeadline::time_point> mLastOutput; // when the partition's last output came
 
+    bool mMayBeTaken = false;               // input may have been read since poll(2) has announced it
     bool mIsAttending = false;              // inside a call of the library: it must not be called again
     bool mInputOpen = true;                 // false after the end of the input
     bool mSendBroken = false;               // sending failed; messages may still be received
