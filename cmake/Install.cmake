@@ -11,8 +11,9 @@ foreach(directory IN ITEMS CMAKE_INSTALL_INCLUDEDIR CMAKE_INSTALL_LIBDIR)
   endif()
 endforeach()
 
-# Four components: what programs need to run (qel_runtime), what is needed to build them (qel_development), the program
-# qel (qel_program, beside its target) and the documents with the licence (qel_documentation).
+# Five components: what programs need to run (qel_runtime), what is needed to build them (qel_development), the program
+# qel (qel_program, beside its target), its systemd units (qel_systemd), which name the prefix, and the documents with the
+# licence (qel_documentation).
 install(TARGETS qelcommon EXPORT qelTargets
   LIBRARY DESTINATION ${CMAKE_INSTALL_LIBDIR}
     COMPONENT qel_runtime NAMELINK_COMPONENT qel_development

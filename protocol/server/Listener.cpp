@@ -9,6 +9,8 @@
 #include <exception>
 #include <fcntl.h>
 #include <limits>
+#include <string>
+#include <sys/socket.h>
 
 namespace qel::protocol {
 
@@ -27,6 +29,33 @@ Socket listenAt(const IPEndpoint& endpoint)
         return socket;
     } catch (const PosixError& error) {
         std::throw_with_nested(CannotListen("cannot listen on " + endpoint.str() + ": " + error.what()));
+    }
+}
+
+int optionOf(int descriptor, int name)
+{
+    int value = 0;
+    socklen_t length = sizeof(value);
+    if (::getsockopt(descriptor, SOL_SOCKET, name, &value, &length) != 0) throw PosixError(errno, "getsockopt");
+    return value;
+}
+
+/// A socket of our own for one that was made elsewhere.
+Socket adopt(int descriptor)
+{
+    const std::string failure = "cannot listen on descriptor " + std::to_string(descriptor) + ": ";
+    try {
+        const int family = optionOf(descriptor, SO_DOMAIN);
+        if ((family != AF_INET && family != AF_INET6) || optionOf(descriptor, SO_TYPE) != SOCK_STREAM) {
+            throw CannotListen(failure + "it is not a TCP socket");
+        }
+        if (optionOf(descriptor, SO_ACCEPTCONN) == 0) throw CannotListen(failure + "it does not listen");
+        Socket socket(::fcntl(descriptor, F_DUPFD_CLOEXEC, 0));
+        if (socket.getFd() < 0) throw PosixError(errno, "fcntl");
+        socket.setFlags(socket.getFlags() | O_NONBLOCK); // see listenAt()
+        return socket;
+    } catch (const PosixError& error) {
+        std::throw_with_nested(CannotListen(failure + error.what()));
     }
 }
 
@@ -52,10 +81,12 @@ bool isTransient(int error)
 
 } // namespace
 
-Listener::Listener(const std::vector<IPEndpoint>& endpoints)
+Listener::Listener(const std::vector<IPEndpoint>& endpoints, const std::vector<int>& descriptors)
 {
     for (const IPEndpoint& endpoint : endpoints)
         mSockets.push_back(listenAt(endpoint));
+    for (const int descriptor : descriptors)
+        mSockets.push_back(adopt(descriptor));
 }
 
 Listener::~Listener() = default;

@@ -20,8 +20,9 @@ public:
     static constexpr std::chrono::milliseconds kPause{1000};
 
     /// @param endpoints  port 0 lets the system choose one
-    /// @throws CannotListen  "cannot listen on ENDPOINT: ..."
-    explicit Listener(const std::vector<IPEndpoint>& endpoints);
+    /// @param descriptors  of sockets that listen already; duplicated
+    /// @throws CannotListen  "cannot listen on ENDPOINT: ...", "cannot listen on descriptor N: ..."
+    explicit Listener(const std::vector<IPEndpoint>& endpoints, const std::vector<int>& descriptors = {});
     ~Listener();
     Listener(const Listener&) = delete;
     Listener& operator=(const Listener&) = delete;

@@ -29,6 +29,7 @@ SerialLoop::~SerialLoop()
 void SerialLoop::pRun() noexcept
 {
     while (!mStopping) {
+        ++mTurns;
         try {
             pPollOnce();
         } catch (...) {

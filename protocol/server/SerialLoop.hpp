@@ -5,6 +5,7 @@
 #include "hypervisor/HypervisorEngine.hpp"
 
 #include <atomic>
+#include <cstdint>
 #include <thread>
 
 namespace qel::protocol {
@@ -23,6 +24,9 @@ public:
     SerialLoop(const SerialLoop&) = delete;
     SerialLoop& operator=(const SerialLoop&) = delete;
 
+    /// How many turns it has begun. Any thread.
+    std::uint64_t turns() const noexcept { return mTurns; }
+
 private:
     void pRun() noexcept;
     void pPollOnce();
@@ -30,6 +34,7 @@ private:
     HypervisorEngine& mHypervisor;
     PollInterrupt& mWake;
     std::atomic<bool> mStopping{false};
+    std::atomic<std::uint64_t> mTurns{0};
     std::thread mThread;
 };
 

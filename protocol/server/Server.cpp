@@ -6,6 +6,7 @@
 #include <qel/protocol/Handshake.hpp>
 #include <qel/protocol/Logging.hpp>
 #include <qel/protocol/Server.hpp>
+#include <qel/protocol/ServerAddress.hpp>
 #include <qel/protocol/WakeUp.hpp>
 
 #include "base/Guard.hpp"
@@ -55,6 +56,17 @@ ConnectionLimits limitsOf(const ServerOptions& options)
     return {options.handshakeTimeout, options.frameTimeout, options.linger, options.queueBytes};
 }
 
+/// Sockets that were made elsewhere may listen anywhere.
+std::vector<IPEndpoint> checkEndpoints(std::vector<IPEndpoint> endpoints, bool isPlain)
+{
+    for (const IPEndpoint& endpoint : endpoints) {
+        if (isPlain && !isLoopback(endpoint.getAddress())) {
+            throw std::invalid_argument("plain: for loopback addresses only");
+        }
+    }
+    return endpoints;
+}
+
 std::unique_ptr<SSLServerContext> contextOf(const ServerOptions& options)
 {
     return options.credentials ? options.credentials->makeServerContext() : nullptr;
@@ -90,6 +102,7 @@ struct Server::Impl {
     void countAccepted() noexcept { mAccepted.fetch_add(1, std::memory_order_relaxed); }
     ServerState state() const;
     void dumpStatistics(std::ostream& os);
+    bool hasPulse();
     HypervisorEngine& engine() noexcept { return mEngine; }
     void finish() noexcept;
 
@@ -128,6 +141,7 @@ private:
     std::optional<Listener> mListener; // empty after finish()
     const std::vector<IPEndpoint> mEndpoints;
     SerialLoop mSerialLoop;
+    std::uint64_t mSeenTurns = 0; // of the serial loop, by hasPulse()
 };
 
 Server::Impl::Impl(Hypervisor& hypervisor, const ServerOptions& options)
@@ -136,7 +150,8 @@ Server::Impl::Impl(Hypervisor& hypervisor, const ServerOptions& options)
       mEngine(hypervisor, options.maxConsoles, [this] { mSerialWake.interrupt(); },
               {options.idleTimeout, options.linger}),
       mServices{mEngine, mPins, limitsOf(options), mThrottle, mWake, mRefusals}, mContext(contextOf(options)),
-      mListener(std::in_place, mListenAt), mEndpoints(mListener->endpoints()), mSerialLoop(mEngine, mSerialWake)
+      mListener(std::in_place, mListenAt, options.sockets),
+      mEndpoints(checkEndpoints(mListener->endpoints(), mIsPlain)), mSerialLoop(mEngine, mSerialWake)
 {}
 
 void Server::Impl::run(const PollFd& stop)
@@ -266,6 +281,15 @@ ServerState Server::Impl::state() const
     return state;
 }
 
+bool Server::Impl::hasPulse()
+{
+    const std::uint64_t turns = mSerialLoop.turns();
+    const bool isAlive = turns != mSeenTurns;
+    mSeenTurns = turns;
+    mSerialWake.interrupt();
+    return isAlive;
+}
+
 void Server::Impl::dumpStatistics(std::ostream& os)
 {
     static_cast<void>(pDropEnded());
@@ -380,6 +404,8 @@ bool Server::closeSession(std::uint16_t partition, std::uint16_t number)
 bool Server::sendBreak(std::uint16_t partition) { return mImpl->engine().sendBreak(partition); }
 
 ServerState Server::state() const { return mImpl->state(); }
+
+bool Server::hasPulse() { return mImpl->hasPulse(); }
 
 void Server::dumpStatistics(std::ostream& os) { mImpl->dumpStatistics(os); }
 

@@ -5,7 +5,6 @@
 
 #include <algorithm>
 #include <filesystem>
-#include <fstream>
 #include <gmock/gmock.h>
 #include <random>
 #include <sstream>
@@ -39,24 +38,6 @@ std::size_t told(const std::string& log, const std::string& part)
         found += end == std::string::npos ? 1 : std::stoul(line.substr(line.rfind(' ', end - 1) + 1));
     }
     return found;
-}
-
-/// @return how many children a process has, zombies included
-std::size_t childrenOf(pid_t parent)
-{
-    std::size_t children = 0;
-    for (const auto& entry : std::filesystem::directory_iterator("/proc")) {
-        std::ifstream stat(entry.path() / "stat");
-        std::string text;
-        if (!std::getline(stat, text)) continue; // not a process, or one that has just ended
-        // After the name, which is in parentheses and may contain anything: the state and the parent. See proc(5).
-        std::istringstream rest(text.substr(text.rfind(')') + 1));
-        std::string state;
-        pid_t parentOfIt = 0;
-        rest >> state >> parentOfIt;
-        if (parentOfIt == parent) ++children;
-    }
-    return children;
 }
 
 /// Lowers the descriptor limit of a process until release() or destruction.
@@ -179,7 +160,7 @@ TEST(ServeFaults, VanishedConsolesLeakNothing)
         }
     }
     EXPECT_TRUE(comesTrue(quiet));
-    EXPECT_EQ(childrenOf(server.process().pid()), 1U); // the command goes on
+    EXPECT_EQ(server.process().children(), 1U); // the command goes on
     server.stop();
 }
 
@@ -195,7 +176,7 @@ TEST(ServeFaults, EndedCommandsLeakNothing)
     }
     // The notice goes out before the terminal is closed.
     EXPECT_TRUE(comesTrue([&] { return server.process().descriptors() == before; }));
-    EXPECT_TRUE(comesTrue([&] { return childrenOf(server.process().pid()) == 0; }));
+    EXPECT_TRUE(comesTrue([&] { return server.process().children() == 0; }));
     server.stop();
 }
 

@@ -1,5 +1,7 @@
 #include "support/Process.hpp"
 
+#include <qel/common/util/UniqueFd.hpp>
+
 #include <algorithm>
 #include <array>
 #include <cerrno>
@@ -49,9 +51,20 @@ std::vector<char*> pointers(std::vector<std::string>& texts)
     return result;
 }
 
-pid_t spawn(std::vector<std::string> arguments, std::vector<std::string> environment, const Pipe& input,
-            const Pipe& output, const Pipe& errors)
+/// The descriptors, out of the way of those that they are to become, and closed in other programs.
+std::vector<UniqueFd> outOfTheWay(const std::vector<int>& descriptors)
 {
+    constexpr int kFrom = 100;
+    std::vector<UniqueFd> copies;
+    for (const int descriptor : descriptors)
+        copies.emplace_back(::fcntl(descriptor, F_DUPFD_CLOEXEC, kFrom));
+    return copies;
+}
+
+pid_t spawn(std::vector<std::string> arguments, std::vector<std::string> environment, const Pipe& input,
+            const Pipe& output, const Pipe& errors, const std::vector<int>& descriptors)
+{
+    const std::vector<UniqueFd> copies = outOfTheWay(descriptors);
     posix_spawn_file_actions_t actions;
     posix_spawnattr_t attributes;
     ::posix_spawn_file_actions_init(&actions);
@@ -59,6 +72,8 @@ pid_t spawn(std::vector<std::string> arguments, std::vector<std::string> environ
     ::posix_spawn_file_actions_adddup2(&actions, input.readEnd(), STDIN_FILENO);
     ::posix_spawn_file_actions_adddup2(&actions, output.writeEnd(), STDOUT_FILENO);
     ::posix_spawn_file_actions_adddup2(&actions, errors.writeEnd(), STDERR_FILENO);
+    for (std::size_t i = 0; i < copies.size(); ++i)
+        ::posix_spawn_file_actions_adddup2(&actions, copies[i].get(), STDERR_FILENO + 1 + static_cast<int>(i));
     sigset_t none;
     ::sigemptyset(&none);
     ::posix_spawnattr_setsigmask(&attributes, &none);
@@ -88,13 +103,14 @@ bool readSome(int fd, std::string& text)
 
 } // namespace
 
-Process::Process(const std::vector<std::string>& arguments, const std::map<std::string, std::string>& environment)
+Process::Process(const std::vector<std::string>& arguments, const std::map<std::string, std::string>& environment,
+                 const std::vector<int>& descriptors)
 {
     static_cast<void>(std::signal(SIGPIPE, SIG_IGN)); // a process that does not read must not end the test
     const Pipe input;
     const Pipe output;
     const Pipe errors;
-    mPid = spawn(arguments, environmentWith(environment), input, output, errors);
+    mPid = spawn(arguments, environmentWith(environment), input, output, errors, descriptors);
     ::close(input.readEnd());
     ::close(output.writeEnd());
     ::close(errors.writeEnd());
@@ -200,6 +216,23 @@ std::size_t Process::descriptors() const
     namespace fs = std::filesystem;
     const fs::path directory = "/proc/" + std::to_string(mPid) + "/fd";
     return static_cast<std::size_t>(std::distance(fs::directory_iterator(directory), fs::directory_iterator()));
+}
+
+std::size_t Process::children() const
+{
+    std::size_t children = 0;
+    for (const auto& entry : std::filesystem::directory_iterator("/proc")) {
+        std::ifstream stat(entry.path() / "stat");
+        std::string text;
+        if (!std::getline(stat, text)) continue; // not a process, or one that has just ended
+        // After the name, which is in parentheses and may contain anything: the state and the parent. See proc(5).
+        std::istringstream rest(text.substr(text.rfind(')') + 1));
+        std::string state;
+        pid_t parent = 0;
+        rest >> state >> parent;
+        if (parent == mPid) ++children;
+    }
+    return children;
 }
 
 std::size_t Process::residentBytes() const

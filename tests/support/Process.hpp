@@ -29,9 +29,11 @@ public:
 
     /// Starts a program. Standard input is a pipe from writeInput(); variables are added to the environment.
     /// @param arguments  the path of the program first
+    /// @param descriptors  the program has them as 3, 4, ...
     /// @throws std::runtime_error  it cannot be started
     explicit Process(const std::vector<std::string>& arguments,
-                     const std::map<std::string, std::string>& environment = {});
+                     const std::map<std::string, std::string>& environment = {},
+                     const std::vector<int>& descriptors = {});
     ~Process();
     Process(const Process&) = delete;
     Process& operator=(const Process&) = delete;
@@ -60,6 +62,9 @@ public:
 
     /// The number of descriptors it has open.
     std::size_t descriptors() const;
+
+    /// The number of its children, zombies included.
+    std::size_t children() const;
 
     /// Bytes of memory it has in use (resident).
     std::size_t residentBytes() const;

@@ -1,14 +1,19 @@
 // What the server does when the system has nothing left.
 
 #include <qel/common/QelDebug.hpp>
+#include <qel/common/net/Listen.hpp>
 #include <qel/common/util/Poll.hpp>
 #include <qel/common/util/TimeProvider.hpp>
+#include <qel/common/util/UniqueFd.hpp>
+#include <qel/protocol/Error.hpp>
 
 #include "protocol/server/ServerFixture.hpp"
 #include "server/Listener.hpp"
 #include "support/Allocations.hpp"
 #include "support/ComesTrue.hpp"
+#include "support/Loopback.hpp"
 
+#include <fcntl.h>
 #include <fstream>
 #include <gmock/gmock.h>
 #include <netinet/in.h>
@@ -133,6 +138,58 @@ TEST(Listener, ItsBacklogIsAsLargeAsTheSystemAllows)
     std::ifstream("/proc/sys/net/core/somaxconn") >> most;
     EXPECT_GT(most, 64U);
     EXPECT_EQ(info.tcpi_sacked, most); // of a listening socket: the backlog
+}
+
+TEST(Listener, ListensOnSocketsOfOthersAsWell)
+{
+    const Socket other = makeListener();
+    protocol::Listener listener({IPEndpoint("127.0.0.1:0")}, {other.getFd()});
+    ASSERT_EQ(listener.endpoints().size(), 2U);
+    EXPECT_EQ(listener.endpoints()[1], other.getSocketName());
+    EXPECT_NE(other.getFlags() & O_NONBLOCK, 0);
+    Socket client(IPFamily::IPv4, SOCK_STREAM | SOCK_CLOEXEC, 0);
+    client.connect(other.getSocketName(), Loopback::kDeadline);
+    PollSet set;
+    listener.addTo(set);
+    const std::optional<Socket> accepted = listener.accept(set.wait(Loopback::kDeadline));
+    ASSERT_TRUE(accepted);
+    EXPECT_EQ(accepted->getPeerName(), client.getSocketName());
+}
+
+TEST(Listener, RefusesWhatIsNotAListeningSocketOfTcp)
+{
+    const auto refusalOf = [](int descriptor) {
+        try {
+            const protocol::Listener listener({}, {descriptor});
+            return std::string("none");
+        } catch (const protocol::CannotListen& error) {
+            return std::string(error.what());
+        }
+    };
+    const Socket silent(IPFamily::IPv4, SOCK_STREAM | SOCK_CLOEXEC, 0);
+    const Socket datagrams(IPFamily::IPv4, SOCK_DGRAM | SOCK_CLOEXEC, 0);
+    const Socket local(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+    const UniqueFd null(::open("/dev/null", O_RDWR | O_CLOEXEC));
+    const auto prefix = [](int descriptor) {
+        return "cannot listen on descriptor " + std::to_string(descriptor) + ": ";
+    };
+    EXPECT_EQ(refusalOf(silent.getFd()), prefix(silent.getFd()) + "it does not listen");
+    EXPECT_EQ(refusalOf(datagrams.getFd()), prefix(datagrams.getFd()) + "it is not a TCP socket");
+    EXPECT_EQ(refusalOf(local.getFd()), prefix(local.getFd()) + "it is not a TCP socket");
+    EXPECT_THAT(refusalOf(null.get()), StartsWith(prefix(null.get()) + "getsockopt"));
+    EXPECT_THAT(refusalOf(-1), StartsWith(prefix(-1) + "getsockopt"));
+}
+
+TEST(Listener, APlainServerRefusesASocketThatIsNotOfALoopbackAddress)
+{
+    const Socket everywhere = listenOn(IPEndpoint("0.0.0.0:0"), 1);
+    protocol::Hypervisor machine;
+    protocol::ServerOptions options;
+    options.plain = true;
+    options.listen.clear();
+    options.sockets = {everywhere.getFd()};
+    EXPECT_THAT([&] { protocol::Server(machine, options); },
+                ::testing::ThrowsMessage<std::invalid_argument>("plain: for loopback addresses only"));
 }
 
 } // namespace

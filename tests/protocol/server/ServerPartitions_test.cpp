@@ -5,6 +5,7 @@
 
 #include "support/ComesTrue.hpp"
 
+#include <atomic>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <stdexcept>
@@ -57,6 +58,36 @@ TEST_F(ServerPartitionsTest, AnAddedCommandIsStartedAndReadAndARemovedOneIsGone)
     server.finish();
     EXPECT_THAT([&] { server.addPartition(8, protocol::commandLine("cat")); },
                 ThrowsMessage<std::logic_error>("the server has finished"));
+}
+
+/// Blocks the thread that calls it, until it may go on.
+class BlockingTap : public protocol::SerialTap {
+public:
+    void onOutput(std::uint16_t, const char*, std::size_t) noexcept override
+    {
+        isBlocked = true;
+        while (isBlocked)
+            std::this_thread::yield();
+    }
+    void onEvent(std::uint16_t, const std::string&) noexcept override {}
+
+    std::atomic<bool> isBlocked{false};
+};
+
+TEST_F(ServerPartitionsTest, HasNoPulseWhileATapBlocksTheThreadOfTheLines)
+{
+    EXPECT_TRUE(server.hasPulse() || comesTrue([this] { return server.hasPulse(); })); // it may just have begun
+    EXPECT_TRUE(comesTrue([this] { return server.hasPulse(); }));                      // without anything to do
+    const auto tap = std::make_shared<BlockingTap>();
+    PartitionOptions tapped = boot();
+    tapped.tap = tap;
+    server.addPartition(1, protocol::commandLine("echo x; exec cat"), tapped);
+    ASSERT_TRUE(comesTrue([&] { return tap->isBlocked.load(); }));
+    server.hasPulse(); // of the turns before
+    EXPECT_FALSE(server.hasPulse());
+    EXPECT_FALSE(server.hasPulse());
+    tap->isBlocked = false;
+    EXPECT_TRUE(comesTrue([this] { return server.hasPulse(); }));
 }
 
 TEST_F(ServerPartitionsTest, SeveralThreadsMayChangePartitions)

@@ -97,6 +97,32 @@ TEST(ServeConfig, LimitsNamesAndDescriptions)
     EXPECT_EQ(described(257), "f:4:15: description: longer than 256 bytes");
 }
 
+TEST(ServeConfig, APartitionIsATableWithAName)
+{
+    const std::string hint = "is not a table: write [partition.NAME] for each partition";
+    EXPECT_EQ(failureOf("[partition]\nid = 1\nline = 'x'"), "f:2:1: \"id\" " + hint);
+    EXPECT_EQ(failureOf("[[partition.web]]\nid = 1\nline = 'x'"), "f:1:13: \"web\" " + hint);
+}
+
+TEST(ServeConfig, ADescriptionIsALine)
+{
+    const std::string partition = "[partition.a]\nid = 1\nline = 'x'\ndescription = ";
+    EXPECT_EQ(failureOf(partition + "\"a\\nb\""), "f:4:15: description: has control characters");
+    EXPECT_EQ(failureOf(partition + "\"\\u001b[2J\""), "f:4:15: description: has control characters");
+    EXPECT_EQ(failureOf(partition + "\"\\u007f\""), "f:4:15: description: has control characters");
+    EXPECT_EQ(failureOf(partition + "\"\u00e4 \\\"b\\\"\""), "no error");
+}
+
+TEST(ServeConfig, ARuleThatLooksLimitedIsLimited)
+{
+    EXPECT_EQ(failureOf("[[rule]]\nname = 'a'\nfingerprint = []\nmay = 'type'"),
+              "f:3:15: fingerprint: the list is empty; name = \"*\" is for everybody");
+    EXPECT_EQ(failureOf("[[rule]]\nname = []\nfingerprint = '" + kFingerprint + "'\nmay = 'type'"),
+              "f:2:8: name: the list is empty; name = \"*\" is for everybody");
+    EXPECT_EQ(failureOf("[[rule]]\nname = ['a', '']\nmay = 'type'"), "f:2:8: name: a name is empty");
+    EXPECT_EQ(failureOf("[partition.a]\nid = 1\nline = 'x'\naccess = ''"), "f:4:10: access: a name is empty");
+}
+
 TEST(ServeConfig, NamesTheNearestKeyOfAll)
 {
     EXPECT_EQ(failureOf("lisen = 1"), "f:1:1: unknown key \"lisen\"; did you mean \"listen\"?");
@@ -192,21 +218,21 @@ TEST(ServeConfig, AnEmptyAccessListIsARuleForNobody)
 
 TEST(ServeConfig, PrintsWhatItHasReadSoThatItCanBeReadAgain)
 {
-    const std::string text = "[partition.web]\nid = 40\nline = 'a \"b\" \\'\ndescription = \"t\\tab\"\n"
+    const std::string text = "[partition.web]\nid = 40\nline = \"a\\t\\\"b\\\" \\\\\"\ndescription = \"t \\\"ab\\\"\"\n"
                              "access = ['alice']\n\n[[rule]]\nname = 'bob'\nmay = ['watch']\npartitions = ['1-4', 7]\n";
     std::ostringstream first;
     tool::printServeConfig(first, read(text));
     EXPECT_EQ(first.str(), "\n[partition.web]  # f:1\n"
-                           "id = 40                    # f:2\n"
-                           "line = \"a \\\"b\\\" \\\\\"        # f:3\n"
-                           "description = \"t\\u0009ab\"  # f:4\n"
-                           "access = [\"alice\"]         # f:5\n"
+                           "id = 40                   # f:2\n"
+                           "line = \"a\\u0009\\\"b\\\" \\\\\"  # f:3\n"
+                           "description = \"t \\\"ab\\\"\"  # f:4\n"
+                           "access = [\"alice\"]        # f:5\n"
                            "\n[[rule]]  # f:7\n"
                            "name = \"bob\"             # f:8\n"
                            "may = [\"watch\"]          # f:9\n"
                            "partitions = [\"1-4\", 7]  # f:10\n");
-    EXPECT_EQ(read(first.str()).partitions.at(0).line, "a \"b\" \\");
-    EXPECT_EQ(read(first.str()).partitions.at(0).description, "t\tab");
+    EXPECT_EQ(read(first.str()).partitions.at(0).line, "a\t\"b\" \\");
+    EXPECT_EQ(read(first.str()).partitions.at(0).description, "t \"ab\"");
 }
 
 } // namespace

@@ -281,6 +281,21 @@ TEST_F(ServePlanning, AWrongLogOfAPartitionIsRefusedWithItsPlace)
     EXPECT_EQ(saidOf(partition + "log = ['/']\n"), ":5:7: log takes true, false or a directory, not a list");
 }
 
+TEST_F(ServePlanning, AnEmptyListIsNotTheDefault)
+{
+    EXPECT_EQ(saidOf("plain = true\nlisten = []\n"), ":2:10: listen: the list is empty; leave the key out");
+    EXPECT_EQ(planOf("plain = true\npeer-name = []\n").server.pins.names.size(), 0U); // which is the default
+}
+
+TEST_F(ServePlanning, AWrongTextIsShownOnOneLine)
+{
+    EXPECT_EQ(saidOf("plain = true\nterm = \"a\\nb\\u001b\"\n"),
+              ":2:8: term: \"a\\x0ab\\x1b\" is not a terminal type, such as vt220");
+    EXPECT_EQ(saidOf("plain = true\nterm = \"vt220\\u0000x\"\n"), ":2:8: term: has a null character");
+    EXPECT_EQ(saidOf("plain = true\n[partition.a]\nid = 1\nline = \"cat\\u0000x\"\n"),
+              ":4:8: line: has a null character");
+}
+
 TEST_F(ServePlanning, TakesTheIdleTimeoutAndTheMutedBroadcasts)
 {
     const ServePlan plain = plan({"--plain"});

@@ -125,6 +125,17 @@ std::string readLimited(const std::string& path)
     failAt({path, 1, 1}, "longer than 1 MiB");
 }
 
+/// A text of a file that is part of a reason may have any characters, but the reason is one line.
+std::string withoutControls(const std::string& text)
+{
+    std::string safe;
+    for (const char c : text) {
+        const auto byte = static_cast<unsigned char>(c);
+        safe += byte < 0x20 || byte == 0x7F ? printable(std::string(1, c)) : std::string(1, c);
+    }
+    return safe;
+}
+
 [[noreturn]] void failKind(const std::string& key, const TomlValue& value, const char* expected)
 {
     failAt(value.place, key + " takes " + expected + ", not " + kindName(value.kind));
@@ -172,7 +183,7 @@ TomlValue parseToml(const std::string& text, const std::string& file)
 
 void failAt(const TomlPlace& place, const std::string& reason)
 {
-    throw CommandFailure(ExitStatus::Usage, toText(place) + ": " + reason);
+    throw CommandFailure(ExitStatus::Usage, toText(place) + ": " + withoutControls(reason));
 }
 
 void requireKnownKeys(const TomlValue& table, const std::vector<std::string>& known)

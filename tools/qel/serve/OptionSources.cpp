@@ -154,10 +154,15 @@ void applyEntry(CLI::Option& option, const TomlEntry& entry)
     if (!isList(option) && entry.value.kind == TomlValue::Kind::List) {
         failAt(entry.value.place, entry.key + " takes one value, not a list");
     }
+    // It would count as the default, which is not what it looks like.
+    if (itemsOf(entry).empty() && !option.get_default_str().empty()) {
+        failAt(entry.value.place, entry.key + ": the list is empty; leave the key out");
+    }
     for (const TomlValue* item : itemsOf(entry)) {
         const bool isScalar = item->kind == TomlValue::Kind::Text || item->kind == TomlValue::Kind::Integer ||
                               item->kind == TomlValue::Kind::Number;
         if (!isScalar) failAt(item->place, entry.key + " takes a text or a number, not " + kindName(item->kind));
+        if (item->text.find('\0') != std::string::npos) failAt(item->place, entry.key + ": has a null character");
         try {
             // Values are checked one by one, so that an error names the right one.
             option.add_result(item->text);

@@ -1,5 +1,7 @@
 #include "serve/ServeCommand.hpp"
 
+#include <qel/common/util/TimeProvider.hpp>
+#include <qel/common/util/UniqueFd.hpp>
 #include <qel/protocol/Hypervisor.hpp>
 #include <qel/protocol/Server.hpp>
 
@@ -12,13 +14,17 @@
 #include "serve/ServeMachine.hpp"
 #include "serve/ServePlan.hpp"
 #include "serve/ServeReload.hpp"
+#include "serve/ServiceManager.hpp"
 #include "transport/TransportOptions.hpp"
 
+#include <algorithm>
+#include <chrono>
 #include <csignal>
 #include <initializer_list>
 #include <iostream>
 #include <memory>
 #include <sstream>
+#include <stdexcept>
 #include <string>
 #include <sys/time.h>
 #include <utility>
@@ -39,11 +45,19 @@ void addPartitions(Hypervisor& machine, const ServePlan& plan, LineLogs& logs)
 }
 
 /// The key leaves the memory when the server has been made.
-std::unique_ptr<Server> makeServer(Hypervisor& machine, const ServePlan& plan)
+/// @param handed  sockets to listen on in place of those that it would make
+std::unique_ptr<Server> makeServer(Hypervisor& machine, const ServePlan& plan, const std::vector<UniqueFd>& handed)
 {
     ServerOptions options = plan.server;
     options.credentials = loadCredentials(plan.transport);
-    return std::make_unique<Server>(machine, options);
+    if (!handed.empty()) options.listen.clear();
+    for (const UniqueFd& socket : handed)
+        options.sockets.push_back(socket.get());
+    try {
+        return std::make_unique<Server>(machine, options);
+    } catch (const std::invalid_argument& error) { // the other options have been checked
+        throw CommandFailure(ExitStatus::Usage, std::string("the sockets that are handed over: ") + error.what());
+    }
 }
 
 void announce(const Server& server)
@@ -57,11 +71,51 @@ void announce(const Server& server)
         logLine(LogLevel::Info, "listening on ", endpoint);
 }
 
-/// Has SIGALRM sent once a day.
-void alarmEveryDay()
+constexpr std::chrono::hours kDay(24);
+
+/// Has SIGALRM sent once a day, and as often as the watchdog of a service manager is to be fed.
+void setAlarm(std::chrono::microseconds watchdog)
 {
-    constexpr itimerval kDaily{{24 * 60 * 60, 0}, {24 * 60 * 60, 0}};
-    static_cast<void>(::setitimer(ITIMER_REAL, &kDaily, nullptr));
+    const std::chrono::microseconds time =
+        watchdog.count() == 0 ? kDay : std::min<std::chrono::microseconds>(watchdog, kDay);
+    const auto seconds = std::chrono::duration_cast<std::chrono::seconds>(time);
+    const timeval interval{static_cast<time_t>(seconds.count()), static_cast<suseconds_t>((time - seconds).count())};
+    const itimerval timer{interval, interval};
+    static_cast<void>(::setitimer(ITIMER_REAL, &timer, nullptr));
+}
+
+/// What is done from time to time, on SIGALRM.
+class Chores {
+public:
+    Chores(Server& server, const ServeReload& reload, ServiceManager& manager)
+        : mServer(server), mReload(reload), mManager(manager), mWarnAt(TimeProvider::steady() + kDay)
+    {}
+
+    void run()
+    {
+        const bool feeds = mManager.watchdogInterval().count() > 0;
+        // A server whose thread of the serial lines is stuck is of no use, though it accepts connections.
+        if (feeds && mServer.hasPulse()) mManager.feedWatchdog();
+        if (feeds && TimeProvider::steady() < mWarnAt) return;
+        mWarnAt = TimeProvider::steady() + kDay;
+        mReload.warnOfExpiry();
+    }
+
+private:
+    Server& mServer;
+    const ServeReload& mReload;
+    ServiceManager& mManager;
+    std::chrono::steady_clock::time_point mWarnAt;
+};
+
+/// A line for those who ask the service manager how the server is.
+std::string statusText(const Server& server)
+{
+    std::string text = "serving " + countText(server.partitions().size(), "partition") + " on ";
+    const char* separator = "";
+    for (const IPEndpoint& endpoint : server.endpoints())
+        text += std::exchange(separator, ", ") + endpoint.str();
+    return text;
 }
 
 /// On SIGUSR1 and at the end: logs the statistics of the queues.
@@ -73,16 +127,20 @@ void logStatistics(Server& server)
 }
 
 /// @return the signal that ended it
-int serveUntilStopped(Server& server, SignalWatch& signals, ServeReload& reload, LineLogs& logs)
+int serveUntilStopped(Server& server, SignalWatch& signals, ServeReload& reload, LineLogs& logs,
+                      ServiceManager& manager)
 {
+    Chores chores(server, reload, manager);
     for (;;) {
         server.run(signals.getPollFd());
         const int signal = signals.take();
         if (signal == SIGHUP) {
+            manager.reloading();
             logs.rotate(); // before new ones are opened
             reload.run();
+            manager.ready(statusText(server));
         } else if (signal == SIGALRM) {
-            reload.warnOfExpiry();
+            chores.run();
         } else if (signal == SIGUSR1) {
             logStatistics(server);
         } else if (signal != 0) {
@@ -93,6 +151,7 @@ int serveUntilStopped(Server& server, SignalWatch& signals, ServeReload& reload,
 
 ExitStatus runServe(const ServePlan& plan)
 {
+    const std::vector<UniqueFd> handed = takeHandedSockets();
     startLogging(plan.log, "qel-serve.log");
     static_cast<void>(std::signal(SIGPIPE, SIG_IGN)); // a log pipe without a reader must not end the server
     static_cast<void>(std::signal(SIGCHLD, SIG_DFL)); // ignored, as a parent may leave it, it hides how commands end
@@ -100,12 +159,15 @@ ExitStatus runServe(const ServePlan& plan)
     ServeMachine machine(plan.machine, plan.capabilities, plan.policy);
     LineLogs logs(plan.lineLogBytes);
     addPartitions(machine, plan, logs);
-    const auto server = makeServer(machine, plan);
+    const auto server = makeServer(machine, plan, handed);
     announce(*server);
     ServeReload reload(*server, machine, logs, plan);
     reload.warnOfExpiry();
-    alarmEveryDay();
-    const int signal = serveUntilStopped(*server, signals, reload, logs);
+    ServiceManager manager = ServiceManager::fromEnvironment();
+    setAlarm(manager.watchdogInterval());
+    manager.ready(statusText(*server));
+    const int signal = serveUntilStopped(*server, signals, reload, logs, manager);
+    manager.stopping();
 
     logLine(LogLevel::Info, "stopping: signal ", signal);
     logStatistics(*server);

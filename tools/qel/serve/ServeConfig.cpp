@@ -56,12 +56,24 @@ bool isName(const std::string& name)
            });
 }
 
+bool hasControls(const std::string& text)
+{
+    return std::any_of(text.begin(), text.end(), [](unsigned char byte) { return byte < 0x20 || byte == 0x7F; });
+}
+
 /// A text of at least one byte.
 std::string filledTextOf(const TomlEntry& entry)
 {
     std::string text = textOf(entry);
     if (text.empty()) failAt(entry.value.place, entry.key + " is empty");
+    if (text.find('\0') != std::string::npos) failAt(entry.value.place, entry.key + ": has a null character");
     return text;
+}
+
+/// Common names: any texts but the empty one, which no certificate has.
+void requireName(const std::string& name, const TomlEntry& entry)
+{
+    if (name.empty()) failAt(entry.value.place, entry.key + ": a name is empty");
 }
 
 /// Those of the texts that are fingerprints go to the one list, the others to the other.
@@ -70,6 +82,7 @@ void addPeers(AccessRule& rule, const TomlEntry& entry)
     for (const std::string& text : textsOf(entry)) {
         const std::string fingerprint = normalizedFingerprint(text);
         if (fingerprint.empty()) {
+            requireName(text, entry);
             rule.names.push_back(text);
         } else {
             rule.fingerprints.push_back(fingerprint);
@@ -101,7 +114,10 @@ PartitionConfig readPartition(const TomlEntry& entry)
         failAt(entry.place, quoted(entry.key) + " is not a name for a partition: a letter, then letters, digits, '_' "
                                                 "and '-', at most 64");
     }
-    const TomlValue& table = tableOf(entry);
+    if (entry.value.kind != TomlValue::Kind::Table) {
+        failAt(entry.place, quoted(entry.key) + " is not a table: write [partition.NAME] for each partition");
+    }
+    const TomlValue& table = entry.value;
     requireKnownKeys(table, kPartitionKeys);
     PartitionConfig partition;
     partition.entry = entry;
@@ -114,6 +130,7 @@ PartitionConfig readPartition(const TomlEntry& entry)
     if (partition.description.size() > kMaxDescriptionBytes) {
         failAt(description->value.place, "description: longer than 256 bytes");
     }
+    if (hasControls(partition.description)) failAt(description->value.place, "description: has control characters");
     return partition;
 }
 
@@ -178,6 +195,12 @@ AccessRight readRights(const TomlEntry& entry)
     return rights;
 }
 
+/// An empty list would not limit whom the rule is for, though it looks as if it did.
+void requireFilled(const std::vector<std::string>& texts, const TomlEntry& entry)
+{
+    if (texts.empty()) failAt(entry.value.place, entry.key + ": the list is empty; name = \"*\" is for everybody");
+}
+
 std::vector<std::string> fingerprintsOf(const TomlEntry& entry)
 {
     std::vector<std::string> fingerprints;
@@ -188,7 +211,17 @@ std::vector<std::string> fingerprintsOf(const TomlEntry& entry)
         }
         fingerprints.push_back(fingerprint);
     }
+    requireFilled(fingerprints, entry);
     return fingerprints;
+}
+
+std::vector<std::string> namesOf(const TomlEntry& entry)
+{
+    std::vector<std::string> names = textsOf(entry);
+    requireFilled(names, entry);
+    for (const std::string& name : names)
+        requireName(name, entry);
+    return names;
 }
 
 AccessRule readRule(const TomlValue& table, const std::vector<PartitionConfig>& partitions)
@@ -198,9 +231,9 @@ AccessRule readRule(const TomlValue& table, const std::vector<PartitionConfig>& 
     AccessRule rule;
     const TomlEntry* const name = table.find("name");
     const TomlEntry* const fingerprint = table.find("fingerprint");
-    if (name != nullptr) rule.names = textsOf(*name);
+    if (name != nullptr) rule.names = namesOf(*name);
     if (fingerprint != nullptr) rule.fingerprints = fingerprintsOf(*fingerprint);
-    if (rule.names.empty() && rule.fingerprints.empty()) {
+    if (name == nullptr && fingerprint == nullptr) {
         failAt(table.place, "whom the rule is for is missing: name, fingerprint, or name = \"*\" for everybody");
     }
     rule.rights = readRights(require(table, "may", table.place));

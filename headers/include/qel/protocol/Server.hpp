@@ -41,7 +41,7 @@ namespace qel::protocol {
 /// Sockets cause no SIGPIPE.
 ///
 /// Lifetime: borrows the hypervisor, which must outlive this object. Thread safety: one thread owns it (constructor,
-/// run(), dumpStatistics(), finish(), destructor); endpoints(), setCredentials(), serve(), state() and the
+/// run(), hasPulse(), dumpStatistics(), finish(), destructor); endpoints(), setCredentials(), serve(), state() and the
 /// operations on partitions from any thread.
 class QEL_PROTOCOL_EXPORT Server {
 public:
@@ -50,7 +50,7 @@ public:
     ///         nor plain), "plain" (also with credentials, or to listen on an address that is not a loopback address),
     ///         "pins" (with plain), "maxConsoles", "maxHandshakes", "maxHandshakesPerAddress", "queueBytes",
     ///         "handshakeTimeout", "frameTimeout", "keepAlive", "idleTimeout", "linger"
-    /// @throws CannotListen  "cannot listen on ENDPOINT: ..."
+    /// @throws CannotListen  "cannot listen on ENDPOINT: ...", "cannot listen on descriptor N: ..."
     /// @throws SSLException  OpenSSL cannot use the credentials
     /// @throws std::logic_error  another server serves the hypervisor
     /// @throws PosixError, std::system_error  no descriptor or thread is left
@@ -62,8 +62,8 @@ public:
     Server(const Server&) = delete;
     Server& operator=(const Server&) = delete;
 
-    /// Where it listens, in the order of the options, with the ports that the system has chosen. They stay
-    /// the same after finish(), when nothing listens there any more.
+    /// Where it listens, in the order of the options, `sockets` last, with the ports that the system has chosen. They
+    /// stay the same after finish(), when nothing listens there any more.
     std::vector<IPEndpoint> endpoints() const;
 
     /// Accepts connections until `stop` becomes readable. Consoles are served meanwhile and afterwards, until finish().
@@ -122,6 +122,11 @@ public:
     /// Who is connected, what has passed, and who was refused. From any thread, but not from an operation of the
     /// hypervisor, a line or a tap. Takes each console's lock for a moment.
     ServerState state() const;
+
+    /// Whether the thread of the serial lines is alive: it has made a turn since the last call, or since the start of
+    /// the server. Makes it begin another one. A thread that a tap or a line blocks has no pulse. Call it at intervals
+    /// that are long for a turn: seconds.
+    bool hasPulse();
 
     /// Prints the statistics of each console's queue, in the order of connecting. docs/connection.md explains them.
     void dumpStatistics(std::ostream& os);

@@ -19,6 +19,10 @@ struct ServerOptions {
     /// nowhere, Server::serve() brings the connections.
     std::vector<std::string> listen{"127.0.0.1:0"};
 
+    /// Descriptors of sockets that listen already, such as those of a service manager; the server listens on them too.
+    /// Borrowed for the constructor, which duplicates them. They are made non-blocking.
+    std::vector<int> sockets;
+
     std::optional<Credentials> credentials; ///< for TLS
     bool plain = false;                     ///< no TLS; for loopback addresses and Server::serve() only
     PeerPins pins;                          ///< which consoles are admitted over TLS
