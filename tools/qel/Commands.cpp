@@ -7,6 +7,7 @@
 #include "console/ConsoleCommand.hpp"
 #include "console/ListCommand.hpp"
 #include "decode/DecodeCommand.hpp"
+#include "proxy/ProxyCommand.hpp"
 #include "serve/ServeCommand.hpp"
 
 namespace qel::tool {
@@ -19,6 +20,7 @@ void addCommands(CLI::App& app, Action& action)
     addListCommand(app, action);
     addBenchCommand(app, action);
     addDecodeCommand(app, action);
+    addProxyCommand(app, action);
     addCheckCommand(app, action);
     addCaCommand(app, action);
 }

@@ -100,4 +100,10 @@ void printJson(std::ostream& os, const nlohmann::ordered_json& document)
     os << withControlsEscaped(text) << "\n";
 }
 
+std::string jsonLine(const nlohmann::ordered_json& document)
+{
+    constexpr int kOneLine = -1;
+    return withControlsEscaped(document.dump(kOneLine, ' ', false, nlohmann::ordered_json::error_handler_t::replace));
+}
+
 } // namespace qel::tool

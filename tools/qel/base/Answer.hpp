@@ -46,4 +46,7 @@ std::string statusName(QelMessageStatusCodes status);
 /// (U+0000 to U+001F and U+007F to U+009F) are escaped, so that printing it on a terminal is safe.
 void printJson(std::ostream& os, const nlohmann::ordered_json& document);
 
+/// A document in one line, without a line end; else as printJson().
+std::string jsonLine(const nlohmann::ordered_json& document);
+
 } // namespace qel::tool

@@ -7,6 +7,7 @@
 #include "base/ExitStatus.hpp"
 #include "base/Library.hpp"
 #include "base/TerminalMode.hpp"
+#include "base/TimeStamps.hpp"
 #include "client/ConnectOptions.hpp"
 #include "console/ConsoleConnection.hpp"
 #include "console/ConsoleLoop.hpp"
@@ -15,7 +16,6 @@
 #include "console/MessageStream.hpp"
 #include "console/Recording.hpp"
 #include "console/SessionScript.hpp"
-#include "console/TimeStamps.hpp"
 
 #include <chrono>
 #include <exception>

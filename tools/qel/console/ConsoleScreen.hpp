@@ -6,8 +6,8 @@
 #include "base/DescriptorOutput.hpp"
 #include "base/Library.hpp"
 #include "base/TerminalMode.hpp"
+#include "base/TimeStamps.hpp"
 #include "console/SessionTap.hpp"
-#include "console/TimeStamps.hpp"
 
 #include <cstddef>
 #include <functional>

@@ -1,9 +1,9 @@
 #pragma once
 
+#include "base/TimeStamps.hpp"
 #include "console/ControlStripper.hpp"
 #include "console/SessionFile.hpp"
 #include "console/SessionTap.hpp"
-#include "console/TimeStamps.hpp"
 
 #include <cstddef>
 #include <string>

@@ -12,6 +12,7 @@
 #include "base/OptionChecks.hpp"
 #include "decode/CaptureDecoder.hpp"
 #include "decode/FrameDecoder.hpp"
+#include "decode/FrameJson.hpp"
 #include "decode/HexText.hpp"
 #include "decode/PcapReader.hpp"
 #include "decode/PrefixedInput.hpp"
@@ -33,50 +34,6 @@ struct DecodeOptions {
     bool json = false;
     LogOptions log;
 };
-
-const char* classificationName(QelMessageClassification::Value classification)
-{
-    switch (classification) {
-    case QelMessageClassification::Request:
-        return "Request";
-    case QelMessageClassification::Response:
-        return "Response";
-    case QelMessageClassification::Async:
-        return "Async";
-    case QelMessageClassification::Unknown:
-        break;
-    }
-    return "Unknown";
-}
-
-std::string payloadOf(const QelMessage& message)
-{
-    return message.dataLength() == 0 ? std::string() : std::string(message.getData(), message.dataLength());
-}
-
-nlohmann::ordered_json describe(const FrameDecoder::Item& item)
-{
-    const QelMessage& message = *item.message;
-    nlohmann::ordered_json frame;
-    if (!item.stream.empty()) frame["stream"] = item.stream;
-    frame["offset"] = item.offset;
-    frame["length"] = message.msgLength();
-    frame["class"] = TypeInfo::getTypeName(message);
-    frame["callerId"] = message.getCallerId();
-    frame["function"] = static_cast<unsigned int>(message.getFunction());
-    frame["functionText"] = toString(message.getFunction());
-    frame["operation"] = static_cast<unsigned int>(message.getOperation());
-    frame["operationText"] = toString(std::make_pair(message.getFunction(), message.getOperation()));
-    frame["classification"] = classificationName(message.getClassification());
-    frame["flags"] = static_cast<unsigned int>(message.getFlags());
-    frame["status"] = static_cast<unsigned int>(message.getStatus());
-    frame["statusName"] = statusName(message.getStatus());
-    frame["statusDetail"] = message.getStatusDetail();
-    frame["payload"] = hexDigits(payloadOf(message));
-    frame["frame"] = hexDigits(std::string(message.serialize(), message.msgLength()));
-    frame["dump"] = toString(message.debug());
-    return frame;
-}
 
 /// The output: text is printed at once, JSON is collected into one document.
 class Report {
@@ -139,7 +96,7 @@ private:
     void pAddFrame(const FrameDecoder::Item& item)
     {
         if (mJson) {
-            mFrames.push_back(describe(item));
+            mFrames.push_back(frameJson(item));
             return;
         }
         // The dump contains texts of the frame, which are untrusted.

@@ -98,6 +98,11 @@ void FrameDecoder::pDecode(Item& item)
         return;
     }
     mLost = false;
+    decode(frame, length, item);
+}
+
+void FrameDecoder::decode(const char* frame, unsigned int length, Item& item)
+{
     const QelMessageRegistry& registry = registryFor(frame, length);
     try {
         item.message = registry.deserialize(frame, length);

@@ -33,6 +33,10 @@ public:
     /// @return false at the end of the input, and after a malformed length
     bool next(Item& item);
 
+    /// Decodes one frame that is in memory: sets the message and the reason, as next() does.
+    /// @param length  bytes of the frame, which its header gives too
+    static void decode(const char* frame, unsigned int length, Item& item);
+
     /// Bytes read so far.
     std::uint64_t offset() const noexcept { return mOffset; }
 

@@ -1,4 +1,4 @@
-#include "console/TimeStamps.hpp"
+#include "base/TimeStamps.hpp"
 #include "support/SettableClock.hpp"
 
 #include <gtest/gtest.h>

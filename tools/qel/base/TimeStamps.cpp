@@ -1,4 +1,4 @@
-#include "console/TimeStamps.hpp"
+#include "base/TimeStamps.hpp"
 
 #include <qel/common/util/TimeProvider.hpp>
 
@@ -13,9 +13,11 @@ namespace {
 
 using std::chrono::milliseconds;
 
-std::string isoTime(std::chrono::system_clock::time_point now)
+} // namespace
+
+std::string TimeStamps::iso(std::chrono::system_clock::time_point when)
 {
-    const auto sinceEpoch = std::chrono::floor<milliseconds>(now.time_since_epoch());
+    const auto sinceEpoch = std::chrono::floor<milliseconds>(when.time_since_epoch());
     const auto seconds = std::chrono::floor<std::chrono::seconds>(sinceEpoch);
     const std::time_t time = seconds.count();
     std::tm utc{};
@@ -26,8 +28,6 @@ std::string isoTime(std::chrono::system_clock::time_point now)
     std::snprintf(fraction.data(), fraction.size(), ".%03dZ", static_cast<int>((sinceEpoch - seconds).count()));
     return std::string(text.data(), length) + fraction.data();
 }
-
-} // namespace
 
 void TimeStamps::cycle()
 {
@@ -64,7 +64,7 @@ void TimeStamps::skip(const char* data, std::size_t length)
 
 std::string TimeStamps::pStamp()
 {
-    if (mStyle == Style::Iso) return "[" + isoTime(TimeProvider::system()) + "] ";
+    if (mStyle == Style::Iso) return "[" + iso(TimeProvider::system()) + "] ";
     const auto now = TimeProvider::steady();
     const double seconds = mLast ? std::chrono::duration<double>(now - *mLast).count() : 0;
     mLast = now;

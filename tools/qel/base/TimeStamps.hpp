@@ -17,6 +17,9 @@ public:
         Delta ///< "[+1.234] ", the seconds since the line before
     };
 
+    /// A time in UTC: "2026-11-22T09:43:00.123Z".
+    static std::string iso(std::chrono::system_clock::time_point time);
+
     explicit TimeStamps(Style style = Style::Off) : mStyle(style) {}
 
     Style style() const noexcept { return mStyle; }
