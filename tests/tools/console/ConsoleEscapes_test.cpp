@@ -147,6 +147,30 @@ TEST_F(ConsoleEscapesTest, TheSizeOfTheWindowIsTyped)
     EXPECT_EQ(sent, "stty rows 50 cols 132\r");
 }
 
+TEST_F(ConsoleEscapesTest, WhoWatchesTypesNeitherTheSizeOfTheWindowNorAFile)
+{
+    protocol::SerialOptions watching;
+    watching.connection = 1;
+    session.emplace(console.openSerial(kPartition, watching));
+    const std::string text = "qel: who watches types nothing; ~f opens the session to type\r\n";
+    EXPECT_EQ(runAndType("~w~#~.", "type\r\n"), text);
+    EXPECT_EQ(screenUntil(pty, "type\r\n"), text);
+}
+
+TEST_F(ConsoleEscapesTest, AFileThatTheEndOfTheSessionCutsOffIsTold)
+{
+    const TemporaryDirectory directory;
+    const std::string path = directory.file("text");
+    std::ofstream(path) << std::string(100000, 'x');
+    open([&](const std::string& all) {
+        if (all.size() == 4096) closeSession();
+    });
+    pty.type("~#" + path + "\r");
+    EXPECT_EQ(run(InputOptions(), &pty).reason, ExitReason::Ended);
+    EXPECT_THAT(screenUntil(pty, "of the file\r\n"), HasSubstr("qel: stopped after "));
+    EXPECT_EQ(sent.size() % 4096, 0U);
+}
+
 TEST_F(ConsoleEscapesTest, AWindowWithoutASizeIsNotTyped)
 {
     open([](const std::string&) {});

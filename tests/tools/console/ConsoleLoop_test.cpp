@@ -427,6 +427,20 @@ TEST_F(ConsoleLoopTest, PrintsBroadcasts)
     EXPECT_EQ(errors.str(), "qel: broadcast from tool type 1, \"them\": hi\n");
 }
 
+TEST_F(ConsoleLoopTest, InputThatIsNoTerminalWaitsForTheNextSession)
+{
+    typeAll("later");
+    tool::SignalWatch signals{SIGUSR1};
+    tool::TerminalMode mode(inputRead.get());
+    tool::ConsoleScreen screen(outputWrite.get(), errors, false, mode);
+    ConsoleLoop loop(screen, inputRead.get(), mode, signals, InputOptions());
+    EXPECT_EQ(loop.wait(std::chrono::milliseconds(10)).reason, ExitReason::None);
+    int bytes = 0;
+    ASSERT_EQ(::ioctl(inputRead.get(), FIONREAD, &bytes), 0);
+    EXPECT_EQ(bytes, 5);
+    EXPECT_EQ(errors.str(), "");
+}
+
 } // namespace
 
 } // namespace qel::test

@@ -20,6 +20,7 @@
 #include <memory>
 #include <optional>
 #include <string>
+#include <utility>
 #include <vector>
 
 namespace qel::tool {
@@ -255,6 +256,21 @@ void addScriptOptions(CLI::App& command, CommandOptions& options)
         ->check(textUpTo(kMaxCommand));
 }
 
+/// The help has many options; each group is what a user looks for at a time.
+void groupOptions(CLI::App& command)
+{
+    static const std::pair<const char*, std::vector<const char*>> kGroups[] = {
+        {"Session", {"connection", "force", "watch", "reconnect", "keepalive", "escape", "no-eof", "linger"}},
+        {"Files", {"log", "log-strip", "timestamps", "record"}},
+        {"Without a person", {"send", "expect", "exec"}},
+        {"Log of this program", {"log-dir", "log-level", "log-size"}},
+    };
+    for (const auto& group : kGroups) {
+        for (const char* name : group.second)
+            findOption(command, name)->group(group.first);
+    }
+}
+
 } // namespace
 
 CLI::App& addConsoleCommand(CLI::App& parent, Action& action)
@@ -278,6 +294,7 @@ CLI::App& addConsoleCommand(CLI::App& parent, Action& action)
     options->log.usual = LogLevel::Warn;
     options->log.quiet = true;
     addLogOptions(command, options->log);
+    groupOptions(command);
     command.footer(kFooter);
     command.callback([&action, &command, options] {
         findPartition(command, *options);

@@ -65,15 +65,23 @@ void ConsoleLoop::pExecuteInSession(EscapeFilter::Command command)
     case EscapeFilter::Command::Break:
         return mScreen.say(filled(texts::kBreak, {partition}));
     case EscapeFilter::Command::WindowSize:
-        return mIsReadOnly ? mScreen.say(texts::kReadOnly) : pTypeWindowSize();
+        return pMayType() ? pTypeWindowSize() : pSayWhyNot();
     case EscapeFilter::Command::SendFile:
-        return mIsReadOnly ? mScreen.say(texts::kReadOnly) : pAskForFile();
+        return pMayType() ? pAskForFile() : pSayWhyNot();
     case EscapeFilter::Command::Force:
         mScreen.say(filled(texts::kForcing, {partition}));
         return pExit(ExitReason::Force);
     default:
         return;
     }
+}
+
+bool ConsoleLoop::pMayType() const { return !mIsReadOnly && mSession->getConnection() == 0; }
+
+void ConsoleLoop::pSayWhyNot()
+{
+    const std::string escape = characterName(*mInputOptions.escape);
+    mScreen.say(mIsReadOnly ? texts::kReadOnly : filled(texts::kWatchingOnly, {escape}));
 }
 
 /// Characters typed before the command still go to the partition if it takes them at once.

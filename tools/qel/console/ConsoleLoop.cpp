@@ -84,7 +84,6 @@ ConsoleLoop::Outcome ConsoleLoop::run(Console& console, SerialSession& session, 
     mConsole = nullptr;
     mSession = nullptr;
     mPrompt.reset();
-    mFile.reset();
     mEscape.startLine(); // what was typed of a line has gone with the session
     if (mFailure && mOutcome.reason == ExitReason::Ended) std::rethrow_exception(mFailure);
     return mOutcome;
@@ -150,11 +149,12 @@ bool ConsoleLoop::pIsDone() const
     }
 }
 
-/// A terminal is read at all times, also while the last output is written.
+/// A terminal is read at all times, also while the last output is written. Other input waits where it is until it can
+/// be sent, also while there is no session.
 bool ConsoleLoop::pWantsInput() const
 {
     if (!mInputOpen || pHasLeft()) return false;
-    return mMode.isTerminal() || (pIsRunning() && mHeld.isEmpty() && mTools.script == nullptr);
+    return mMode.isTerminal() || (pIsRunning() && mSession != nullptr && mHeld.isEmpty() && mTools.script == nullptr);
 }
 
 /// Output waits while the user answers a prompt, so that it does not run into the answer.
@@ -429,6 +429,7 @@ void ConsoleLoop::pExit(ExitReason reason)
 {
     const bool isLater = reason == ExitReason::Signal || (reason == ExitReason::Left && !pHasLeft());
     if (pIsRunning() || isLater) mOutcome.reason = reason;
+    if (mFile) pStopFile();
     mOutcome.thrownAway += mHeld.size() + mHeld.dropped();
     mHeld.clear();
 }

@@ -155,6 +155,8 @@ private:
     void pToggleLogs();
     void pCycleStamps();
     void pToggleReadOnly();
+    bool pMayType() const;
+    void pSayWhyNot();
     void pTypeWindowSize();
     void pAskForFile();
     void pAnswerPrompt(std::string& typed);

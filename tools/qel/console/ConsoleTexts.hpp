@@ -69,6 +69,7 @@ constexpr const char* kStampsIso = "time stamps in UTC";
 constexpr const char* kStampsDelta = "time stamps: seconds since the line before";
 constexpr const char* kReadOnly = "read only: nothing that is typed is sent";
 constexpr const char* kReadWrite = "what is typed is sent again";
+constexpr const char* kWatchingOnly = "who watches types nothing; $1f opens the session to type";
 constexpr const char* kBreak =
     "the protocol carries no break; on the server's machine, qel status --break $1 sends one where the line can";
 constexpr const char* kNoWindow = "the size of this window is not known";
