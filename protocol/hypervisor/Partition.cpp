@@ -38,7 +38,8 @@ bool isSuccess(const CommandEnd& end) { return end.kind == CommandEnd::Kind::Exi
 Partition::Partition(std::uint16_t id, SerialLine& line, PartitionOptions options, SerialEvents& events)
     : mId(id), mOptions(std::move(options)), mEvents(events), mLine(id, line, !mOptions.keepsSession),
       mOutput(historyLimit(mOptions)), mSessions(id, mOutput),
-      mPause(mOptions.keepsSession ? kSettledConnection : kSettledCommand)
+      mPause(mOptions.keepsSession ? kSettledConnection : kSettledCommand,
+             mOptions.keepsSession ? RestartPause::shareOf(id) : std::uint16_t{0})
 {
     if (mOptions.keepsSession || mOptions.start == StartLine::Boot) mStartAt = TimeProvider::steady();
 }
@@ -74,6 +75,8 @@ QelMessageStatusCodes Partition::open(ConsoleEntry& console, std::uint16_t numbe
     if (!pBringUp(number == PartitionSessions::kTyping)) return QelMessageStatusCmdFailed;
     mSessions.end(number, CloseReason::CloseReasonForceClose);
     mSessions.open(number, console);
+    // A command that has ended waits for this session too, unless it is to be started again.
+    if (mState == State::Ended && mGiveUpBy.isDisabled()) mSetUpBy = TimeProvider::steady() + kSetUpTimeout;
     return QelMessageStatusNoError;
 }
 
@@ -347,23 +350,36 @@ void Partition::pLoseLine()
 {
     const auto now = TimeProvider::steady();
     const bool wasUp = mState == State::Up;
-    if (!std::exchange(mIsLost, true)) {
-        std::string text = pLossText(wasUp);
+    const bool isFirst = !std::exchange(mIsLost, true);
+    std::string reason = pLossReason();
+    if (isFirst || reason != mLossReason) { // not each attempt
+        std::string text = pLossText(wasUp, reason);
         static_cast<void>(
             runGuarded([&] { logLine(LogLevel::Warn, "partition ", mId, ": ", text); }, "partition ", mId));
-        pNote(std::move(text));
+        if (isFirst) pNote(std::move(text));
     }
+    mLossReason.swap(reason);
     pStopLine();
     mStartAt = now + mPause.next(wasUp ? now - mUpSince : RestartPause::Duration(0));
 }
 
 /// Without memory for the reason there is none.
-std::string Partition::pLossText(bool wasUp) const noexcept
+std::string Partition::pLossReason() const noexcept
 {
-    const char* const what = wasUp ? "line lost" : "line is down"; // short enough for a string without memory
     try {
         const std::string reason = mLine.failure();
-        return std::string(what) + ": " + (reason.empty() ? "it has ended" : reason) + "; connecting again";
+        return reason.empty() ? "it has ended" : reason;
+    } catch (const std::bad_alloc&) {
+        return {};
+    }
+}
+
+std::string Partition::pLossText(bool wasUp, const std::string& reason) const noexcept
+{
+    const char* const what = wasUp ? "line lost" : "line is down"; // short enough for a string without memory
+    if (reason.empty()) return what;
+    try {
+        return std::string(what) + ": " + reason + "; connecting again";
     } catch (const std::bad_alloc&) {
         return what;
     }
@@ -464,7 +480,7 @@ bool Partition::pReadOutput()
 {
     // Whatever needs memory comes before the reading: what has been read must not be lost.
     pFitHistory(0);
-    mOutput.reserve(PartitionSessions::kPiece);
+    pReserveOutput();
     if (mOptions.tap != nullptr) mEvents.tapCalls.reserve(mEvents.tapCalls.size() + 1);
     std::string tapped;
     if (mOptions.tap != nullptr) tapped.reserve(PartitionSessions::kPiece);
@@ -487,6 +503,17 @@ bool Partition::pReadOutput()
     }
     mSessions.deliver();
     return true;
+}
+
+/// Makes room for a piece of output. Without memory for a longer history the one that is there does, if no byte that
+/// the session that types has not got would go.
+void Partition::pReserveOutput()
+{
+    try {
+        mOutput.reserve(PartitionSessions::kPiece);
+    } catch (const std::bad_alloc&) {
+        if (mOutput.capacity() < mSessions.unseenBytes(PartitionSessions::kTyping) + PartitionSessions::kPiece) throw;
+    }
 }
 
 /// Reads what is left of the output of a command that has hung up, before it is started again.

@@ -132,12 +132,14 @@ private:
     void pPumpInput();
     bool pNoteRoom() noexcept;
     bool pReadOutput();
+    void pReserveOutput();
     void pDrain();
     bool pWantsToWrite() const;
     bool pWantsOutput() const;
     bool pPeerHasFinished() const noexcept;
     PollDeadline pNextStep(TimePoint now) const;
-    std::string pLossText(bool wasUp) const noexcept;
+    std::string pLossReason() const noexcept;
+    std::string pLossText(bool wasUp, const std::string& reason) const noexcept;
     void pFitHistory(std::size_t more);
     void pNote(std::string text) noexcept;
     bool pTryNote(const std::string& text) noexcept;
@@ -161,6 +163,7 @@ private:
     State mState = State::Down;
     bool mIsRetired = false;
     bool mIsLost = false;     ///< of a line that keeps its sessions: they have been told that it is down
+    std::string mLossReason;  ///< the newest one that has been logged
     bool mIsDraining = false; ///< the line has hung up: the rest of its output is read whoever looks
     TimePoint mUpSince;       ///< of the start of the line
     std::string mOwedNote;    ///< the newest line of the program's own that there was no memory for

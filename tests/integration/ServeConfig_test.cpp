@@ -55,6 +55,15 @@ TEST_F(ServeConfigured, ServesThePartitionsOfTheFile)
     server->stop();
 }
 
+TEST_F(ServeConfigured, SaysThatAnyCertificateOfTheRootMayDoAnything)
+{
+    const std::string note = "(I): [qel] any certificate of the root may do anything: there are no rules, and no "
+                             "--peer-name\n";
+    EXPECT_THAT(serve()->stop().errors, HasSubstr(note));
+    EXPECT_THAT(serve({"--peer-name", "client"})->stop().errors, Not(HasSubstr(note)));
+    EXPECT_THAT(serveWith("[[rule]]\nname = '*'\nmay = 'type'\n")->stop().errors, Not(HasSubstr(note)));
+}
+
 TEST_F(ServeConfigured, ACertificateWithoutARuleIsTurnedAway)
 {
     const auto server = serveWith(kPartitions + "[[rule]]\nname = 'somebody else'\nmay = 'type'\n");

@@ -16,6 +16,7 @@
 #include <string>
 #include <sys/file.h>
 #include <sys/ioctl.h>
+#include <unistd.h>
 #include <vector>
 
 namespace qel::test {
@@ -146,6 +147,25 @@ TEST_F(DeviceLineTest, StopRestoresTheSettings)
         line->start(7);
     }
     EXPECT_TRUE(mPty.attributes() == before) << "the destructor stops the line, too";
+}
+
+TEST_F(DeviceLineTest, StopDropsWhatHasNotBeenSent)
+{
+    const auto line = deviceLine(mPty.name());
+    line->start(7);
+    constexpr int kOn = 1;
+    ASSERT_EQ(::ioctl(mPty.master(), TIOCPKT, &kOn), 0); // the master reads what is done to the terminal
+    line->stop();
+    char done = 0;
+    ASSERT_EQ(::read(mPty.master(), &done, 1), 1);
+    EXPECT_NE(done & TIOCPKT_FLUSHWRITE, 0);
+}
+
+TEST_F(DeviceLineTest, IsClosedInOtherPrograms)
+{
+    const auto line = deviceLine(mPty.name());
+    line->start(7);
+    EXPECT_NE(::fcntl(line->descriptor(), F_GETFD) & FD_CLOEXEC, 0);
 }
 
 TEST_F(DeviceLineTest, AFormatThatThePortDoesNotTakeIsRefused)

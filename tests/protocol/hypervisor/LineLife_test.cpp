@@ -257,7 +257,7 @@ TEST_F(LineLifeTest, ALostConnectionKeepsItsSessionAndIsToldOnce)
     port1->output = {"again"};
     hypervisor->serviceSerial(1);
     EXPECT_EQ(received(peer), "again");
-    EXPECT_EQ(log.lines().size(), 1U);
+    EXPECT_EQ(log.lines().size(), 3U); // the two later reasons are new
 }
 
 TEST_F(LineLifeTest, AConnectionThatHasNeverBeenUpIsReportedAndRetried)

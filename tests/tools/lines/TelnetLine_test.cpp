@@ -269,6 +269,23 @@ TEST_F(TelnetLineTest, APeerThatDoesNotAgreeToTheSettingsIsWarnedAboutAfterFiveS
     EXPECT_TRUE(withSettings->advanceAt().isDisabled());
 }
 
+TEST_F(TelnetLineTest, ANewConnectionHasItsOwnTimeToAgree)
+{
+    const CapturedLog log(LogLevel::Warn);
+    const auto withSettings = tool::telnetLine(std::make_unique<WireLine>(wire), SerialSettings::parse("9600n8"));
+    withSettings->start(7);
+    EXPECT_TRUE(withSettings->advance());
+    clock.advance(std::chrono::seconds(3));
+    withSettings->stop();
+    EXPECT_TRUE(withSettings->advanceAt().isDisabled());
+    withSettings->start(7);
+    EXPECT_TRUE(withSettings->advance());
+    EXPECT_EQ(withSettings->advanceAt(), PollDeadline(clock.steady() + std::chrono::seconds(5)));
+    clock.advance(std::chrono::seconds(3)); // after the first one's time
+    EXPECT_TRUE(withSettings->advance());
+    EXPECT_THAT(log.lines(), IsEmpty());
+}
+
 TEST_F(TelnetLineTest, APeerThatBreaksTheProtocolEndsTheLine)
 {
     bringUp();

@@ -161,6 +161,10 @@ ExitStatus runServe(const ServePlan& plan)
     addPartitions(machine, plan, logs);
     const auto server = makeServer(machine, plan, handed);
     announce(*server);
+    const PeerPins& pins = plan.transport.pins;
+    if (!plan.transport.plain && plan.policy.rules.size() == 0 && pins.names.empty() && pins.fingerprints.empty()) {
+        logLine(LogLevel::Info, "any certificate of the root may do anything: there are no rules, and no --peer-name");
+    }
     ServeReload reload(*server, machine, logs, plan);
     reload.warnOfExpiry();
     ServiceManager manager = ServiceManager::fromEnvironment();
