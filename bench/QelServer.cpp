@@ -55,7 +55,7 @@ void checkNotStopped()
     if (isStopped()) throw std::runtime_error("interrupted");
 }
 
-QelServer::QelServer(Protection protection) : mProtection(protection)
+QelServer::QelServer(Protection protection, const std::vector<std::string>& more) : mProtection(protection)
 {
     std::vector<std::string> arguments{QEL_PROGRAM, "serve", "--listen", "127.0.0.1:0", "--max-consoles", "255"};
     if (protection == Protection::Plain) {
@@ -66,22 +66,28 @@ QelServer::QelServer(Protection protection) : mProtection(protection)
         run({"ca", "issue", pCredentials(), "operator", "--subject", "CN=operator"});
         arguments.insert(arguments.end(), {"--credentials", pCredentials(), "--name", "server"});
     }
+    arguments.insert(arguments.end(), more.begin(), more.end());
     mServer = std::make_unique<Process>(arguments);
     mEndpoint = mServer->readLine();
 }
 
+std::vector<std::string> QelServer::client(const std::string& subcommand, const std::vector<std::string>& more) const
+{
+    std::vector<std::string> command{QEL_PROGRAM, subcommand, "--connect", mEndpoint};
+    if (mProtection == Protection::Plain) {
+        command.emplace_back("--plain");
+    } else {
+        command.insert(command.end(), {"--credentials", pCredentials(), "--name", "operator", "--peer-name", "server"});
+    }
+    command.insert(command.end(), more.begin(), more.end());
+    return command;
+}
+
 QelServer::Figures QelServer::measure(unsigned int consoles, std::size_t payload, std::chrono::milliseconds time)
 {
-    std::vector<std::string> arguments{QEL_PROGRAM, "bench", "--connect", mEndpoint, "--json"};
-    if (mProtection == Protection::Plain) {
-        arguments.emplace_back("--plain");
-    } else {
-        arguments.insert(arguments.end(),
-                         {"--credentials", pCredentials(), "--name", "operator", "--peer-name", "server"});
-    }
-    arguments.insert(arguments.end(), {"--connections", std::to_string(consoles), "--size", std::to_string(payload),
-                                       "--seconds", std::to_string(std::chrono::duration<double>(time).count())});
-    Process bench(arguments);
+    Process bench(
+        client("bench", {"--json", "--connections", std::to_string(consoles), "--size", std::to_string(payload),
+                         "--seconds", std::to_string(std::chrono::duration<double>(time).count())}));
     awaitEnd(bench);
     Process::Result result = bench.wait();
     checkNotStopped();

@@ -7,6 +7,7 @@
 #include <cstddef>
 #include <memory>
 #include <string>
+#include <vector>
 
 /// @file
 /// `qel serve` and `qel bench` as processes, for the programs that measure them.
@@ -33,12 +34,21 @@ public:
         double p99;       // microseconds
     };
 
+    /// @param more  options of `qel serve`
     /// @throws std::runtime_error  one of the programs failed; what it wrote is in the text
-    explicit QelServer(Protection protection);
+    explicit QelServer(Protection protection, const std::vector<std::string>& more = {});
 
     /// Runs `qel bench`.
     /// @throws std::runtime_error  it failed, or isStopped()
     Figures measure(unsigned int consoles, std::size_t payload, std::chrono::milliseconds time);
+
+    /// `qel` with a subcommand that connects to the server, and then more of its arguments.
+    std::vector<std::string> client(const std::string& subcommand, const std::vector<std::string>& more) const;
+
+    const test::Process& process() const { return *mServer; }
+
+    /// Where the certificates are: "server.crt", "server.key", "operator.crt", "operator.key" and "root.crt".
+    std::string credentials() const { return pCredentials(); }
 
 private:
     std::string pCredentials() const { return mDirectory.file("authority"); }
