@@ -7,7 +7,9 @@
 
 #include <csignal>
 #include <cstdlib>
+#include <fstream>
 #include <gmock/gmock.h>
+#include <iterator>
 #include <memory>
 #include <string>
 #include <vector>
@@ -64,14 +66,14 @@ TEST_F(Guest, APersonLogsInWatchesAndFindsTheGuestAgainAfterItWasKilled)
 {
     auto guest = boot(mSocket);
     guest->awaitErrors("waiting for connection");
-    const auto server = serve({"--partition", "1=unix:" + mSocket});
+    const auto server = serve({"--partition", "1=unix:" + mSocket, "--line-log", mRuntime.path()});
     PtyProcess person(consoleCommand(*server, {"1"}));
     person.await("guest: Linux ");
     logIn(person);
     person.type("echo $((6 * 7)) from $(hostname)\r");
     person.await("42 from guest");
 
-    PtyProcess watcher(consoleCommand(*server, {"--tool-id", "watcher", "--connection", "1", "1"}));
+    PtyProcess watcher(consoleCommand(*server, {"1", "--watch"}));
     watcher.await("guest: Linux "); // the messages of the boot are kept
     watcher.await("42 from guest");
     person.type("echo seen by $((1 + 1))\r");
@@ -85,17 +87,29 @@ TEST_F(Guest, APersonLogsInWatchesAndFindsTheGuestAgainAfterItWasKilled)
     watcher.await("[qel: line is back]");
     person.await("guest: Linux ");
     logIn(person);
-    person.type("poweroff\r");
-    person.await("reboot: Power down");
-    watcher.await("reboot: Power down");
-    person.await("[qel: line lost: the peer has closed the connection; connecting again]");
-    EXPECT_EQ(guest->wait().exitStatus, 0);
-
     person.type("\r~.");
     EXPECT_EQ(person.wait().exitStatus, 0);
+
+    const auto command = run(consoleCommand(*server, {"1", "--exec", "echo $((6 * 7)); exit 3"}));
+    EXPECT_EQ(command.output, "42\n");
+    EXPECT_EQ(command.exitStatus, 3);
+    const auto last = run(
+        consoleCommand(*server, {"1", "--send", "poweroff\\r", "--expect", "reboot: Power down", "--timeout", "60"}));
+    EXPECT_EQ(last.exitStatus, 0) << last.errors;
+    watcher.await("reboot: Power down");
+    watcher.await("[qel: line lost: the peer has closed the connection; connecting again]");
+    EXPECT_EQ(guest->wait().exitStatus, 0);
+
     watcher.type("~.");
     EXPECT_EQ(watcher.wait().exitStatus, 0);
     EXPECT_THAT(server->stop().errors, HasSubstr("partition 1: line is back"));
+
+    std::ifstream log(mRuntime.file("partition-1.log"));
+    const std::string logged{std::istreambuf_iterator<char>(log), std::istreambuf_iterator<char>()};
+    const std::string boot = "Z guest: Linux ";
+    EXPECT_THAT(logged, HasSubstr(boot)) << "the messages of the first boot";
+    EXPECT_NE(logged.find(boot), logged.rfind(boot)) << "and of the second";
+    EXPECT_THAT(logged, HasSubstr("Z 42 from guest"));
 }
 
 } // namespace
