@@ -42,15 +42,16 @@ const char* const kNoCredentials = "credentials are missing: give --credentials 
 
 TEST(RefusedCommandLine, NamesUnknownSubcommandsAndOptions)
 {
-    expectRefused(
-        {},
-        {
-            {{}, "a subcommand is missing: serve, call, console, list, bench, decode, check, ca; see \"qel --help\""},
-            {{"nonsense"}, "unknown subcommand \"nonsense\"; see \"qel --help\""},
-            {{"--nonsense"}, "unknown option \"--nonsense\"; see \"qel --help\""},
-            {{"cosole", "--connect", "x"}, "unknown subcommand \"cosole\"; did you mean \"console\"?"},
-            {{"--connect", "x", "console"}, "write --connect after \"console\": it is an option of that subcommand"},
-        });
+    expectRefused({}, {
+                          {{},
+                           "a subcommand is missing: serve, call, console, list, status, bench, decode, proxy, check, "
+                           "ca; see \"qel --help\""},
+                          {{"nonsense"}, "unknown subcommand \"nonsense\"; see \"qel --help\""},
+                          {{"--nonsense"}, "unknown option \"--nonsense\"; see \"qel --help\""},
+                          {{"cosole", "--connect", "x"}, "unknown subcommand \"cosole\"; did you mean \"console\"?"},
+                          {{"--connect", "x", "console"},
+                           "write --connect after \"console\": it is an option of that subcommand"},
+                      });
 }
 
 TEST(RefusedCommandLine, NamesWhatServeLacks)

@@ -17,6 +17,13 @@ std::vector<std::string> serveArguments(const std::vector<std::string>& options,
     return qelCommand(arguments);
 }
 
+/// Without the default status socket, which all servers of a user would share.
+std::map<std::string, std::string> withoutRuntimeDirectory(std::map<std::string, std::string> environment)
+{
+    environment.emplace("XDG_RUNTIME_DIR", "");
+    return environment;
+}
+
 } // namespace
 
 std::vector<std::string> qelCommand(const std::vector<std::string>& arguments)
@@ -31,7 +38,8 @@ Process::Result runQel(const std::vector<std::string>& arguments) { return run(q
 ServeProcess::ServeProcess(const std::vector<std::string>& options, const std::string& listen,
                            const std::vector<std::string>& transport,
                            const std::map<std::string, std::string>& environment)
-    : mProcess(serveArguments(options, listen, transport), environment), mEndpoint(mProcess.readLine())
+    : mProcess(serveArguments(options, listen, transport), withoutRuntimeDirectory(environment)),
+      mEndpoint(mProcess.readLine())
 {}
 
 Process::Result ServeProcess::call(const std::vector<std::string>& arguments) const

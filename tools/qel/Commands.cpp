@@ -9,6 +9,7 @@
 #include "decode/DecodeCommand.hpp"
 #include "proxy/ProxyCommand.hpp"
 #include "serve/ServeCommand.hpp"
+#include "status/StatusCommand.hpp"
 
 namespace qel::tool {
 
@@ -18,6 +19,7 @@ void addCommands(CLI::App& app, Action& action)
     addCallCommand(app, action);
     addConsoleCommand(app, action);
     addListCommand(app, action);
+    addStatusCommand(app, action);
     addBenchCommand(app, action);
     addDecodeCommand(app, action);
     addProxyCommand(app, action);

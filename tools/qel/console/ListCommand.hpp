@@ -6,7 +6,7 @@
 
 namespace qel::tool {
 
-/// Adds "qel list": prints the partitions of the user's profiles.
+/// Adds "qel list": prints the partitions of the user's profiles, and who is on where that is known.
 /// @param action  set when the command line asks for it
 CLI::App& addListCommand(CLI::App& parent, Action& action);
 

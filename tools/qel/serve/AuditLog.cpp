@@ -75,6 +75,16 @@ std::string auditConnected(const Peer& peer)
 
 std::string auditLeft(const Peer& peer, DisconnectReason why) { return line("left", peer) + " why=" + wordFor(why); }
 
+std::string auditEnded(const Peer& peer, std::uint16_t partition, std::uint16_t connection, uid_t user)
+{
+    return line("ended", peer) + place(partition, connection) + " uid=" + std::to_string(user);
+}
+
+std::string auditBreak(std::uint16_t partition, uid_t user)
+{
+    return "audit: break partition=" + std::to_string(partition) + " uid=" + std::to_string(user);
+}
+
 std::string auditAnswered(const Peer& peer, const QelMessage& request, QelMessageStatusCodes status)
 {
     if (status != QelMessageStatusNoError) return refused(peer, request, status);

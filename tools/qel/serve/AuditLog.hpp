@@ -6,7 +6,9 @@
 
 #include "base/Library.hpp"
 
+#include <cstdint>
 #include <string>
+#include <sys/types.h>
 
 namespace qel::tool {
 
@@ -19,6 +21,13 @@ std::string auditConnected(const Peer& peer);
 
 /// "audit: left console=1 name="alice" ... why=closed"
 std::string auditLeft(const Peer& peer, DisconnectReason why);
+
+/// "audit: ended console=1 name="alice" ... partition=1 connection=0 uid=1000": an operator has ended a session.
+/// @param user  of the operator
+std::string auditEnded(const Peer& peer, std::uint16_t partition, std::uint16_t connection, uid_t user);
+
+/// "audit: break partition=1 uid=1000": an operator has sent a break.
+std::string auditBreak(std::uint16_t partition, uid_t user);
 
 /// The line about a request: opened, forced, watched, closed or refused.
 /// @param status  of the response

@@ -14,6 +14,7 @@
 #include "serve/ServeMachine.hpp"
 #include "serve/ServePlan.hpp"
 #include "serve/ServeReload.hpp"
+#include "serve/ServeStatus.hpp"
 #include "serve/ServiceManager.hpp"
 #include "transport/TransportOptions.hpp"
 
@@ -160,12 +161,15 @@ ExitStatus runServe(const ServePlan& plan)
     LineLogs logs(plan.lineLogBytes);
     addPartitions(machine, plan, logs);
     const auto server = makeServer(machine, plan, handed);
+    ServeStatus status(*server, plan);
+    std::unique_ptr<StatusServer> statusServer = startStatus(status, plan);
     announce(*server);
     const PeerPins& pins = plan.transport.pins;
     if (!plan.transport.plain && plan.policy.rules.size() == 0 && pins.names.empty() && pins.fingerprints.empty()) {
         logLine(LogLevel::Info, "any certificate of the root may do anything: there are no rules, and no --peer-name");
     }
-    ServeReload reload(*server, machine, logs, plan);
+    ServeReload reload(*server, machine, logs, plan,
+                       [&status](const ServePlan& inForce, bool hasLoaded) { status.note(inForce, hasLoaded); });
     reload.warnOfExpiry();
     ServiceManager manager = ServiceManager::fromEnvironment();
     setAlarm(manager.watchdogInterval());
@@ -173,6 +177,7 @@ ExitStatus runServe(const ServePlan& plan)
     const int signal = serveUntilStopped(*server, signals, reload, logs, manager);
     manager.stopping();
 
+    statusServer.reset();
     logLine(LogLevel::Info, "stopping: signal ", signal);
     logStatistics(*server);
     for (const int number : kSignals)

@@ -37,6 +37,7 @@ struct ServeInput::Options {
     std::string term = "vt220";
     PartitionChoices serving;
     LineLogOptions lineLog;
+    std::string statusSocket;
     std::uint32_t maxConsoles = ServerOptions().maxConsoles;
     std::uint32_t maxPerCertificate = 0;
     std::uint32_t idleSeconds = 0;
@@ -288,6 +289,12 @@ ServeInput::ServeInput(CLI::App& command)
         ->capture_default_str();
     addPartitionChoices(command, options.serving);
     addLineLogOptions(command, options.lineLog);
+    command
+        .add_option(
+            "--status-socket", options.statusSocket,
+            "Answer qel status over this Unix socket; none: do not; by default $XDG_RUNTIME_DIR/qel-status.sock, "
+            "if there is such a directory")
+        ->type_name("PATH");
     addLimitOptions(command, options);
     addIdentityOptions(command, options);
     addLogOptions(command, options.log);
@@ -341,6 +348,7 @@ ServePlan ServeInput::plan() const
     plan.warnExpiry = std::chrono::hours(24) * options.warnDays;
     plan.term = options.term;
     plan.lineLogBytes = options.lineLog.fileBytes;
+    plan.statusSocket = options.statusSocket;
     plan.machine = parseMachine(options);
     plan.capabilities = QelCapabilities(options.capabilities);
     plan.log = options.log;

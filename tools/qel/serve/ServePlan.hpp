@@ -38,6 +38,7 @@ struct ServePlan {
     std::chrono::hours warnExpiry{0}; ///< so long before its end a certificate is warned about
     std::string term;
     std::uint64_t lineLogBytes = 0; ///< of one file of a line's log
+    std::string statusSocket;       ///< "none": none; empty: the default one
     MachineInfo machine;
     QelCapabilities capabilities;
     TransportOptions transport;

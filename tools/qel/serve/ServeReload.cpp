@@ -41,8 +41,9 @@ MadeLine makePartition(std::uint16_t id, const PlannedPartition& partition, cons
     return made;
 }
 
-ServeReload::ServeReload(Server& server, ServeMachine& machine, LineLogs& logs, const ServePlan& plan)
-    : mServer(server), mMachine(machine), mLogs(logs), mPlan(plan)
+ServeReload::ServeReload(Server& server, ServeMachine& machine, LineLogs& logs, const ServePlan& plan,
+                         OnReload onReload)
+    : mServer(server), mMachine(machine), mLogs(logs), mPlan(plan), mOnReload(std::move(onReload))
 {}
 
 void ServeReload::run()
@@ -57,8 +58,9 @@ void ServeReload::run()
     } catch (const std::exception& error) {
         logLine(LogLevel::Error, "SIGHUP: the configuration stays as it was: ", userMessage(error));
     }
-    pLoadCredentials(wanted);
+    const bool hasLoaded = pLoadCredentials(wanted);
     warnOfExpiry();
+    mOnReload(mPlan, hasLoaded);
 }
 
 void ServeReload::warnOfExpiry() const
@@ -139,16 +141,21 @@ void ServeReload::pLogSettings(const ServePlan& next) const
 }
 
 /// @param wanted  where the credentials are now
-void ServeReload::pLoadCredentials(const TransportOptions& wanted)
+/// @return false: the server has those that it had
+bool ServeReload::pLoadCredentials(const TransportOptions& wanted)
 {
-    if (mPlan.transport.plain)
-        return logLine(LogLevel::Info, "SIGHUP: connections are plain, there is nothing to load");
+    if (mPlan.transport.plain) {
+        logLine(LogLevel::Info, "SIGHUP: connections are plain, there is nothing to load");
+        return false;
+    }
     try {
         mServer.setCredentials(*loadCredentials(wanted));
         mPlan.transport = wanted;
         logLine(LogLevel::Info, "SIGHUP: loaded ", mPlan.transport.paths().certificate, " for new connections");
+        return true;
     } catch (const std::exception& error) {
         logLine(LogLevel::Error, "SIGHUP: the credentials stay as they were: ", userMessage(error));
+        return false;
     }
 }
 

@@ -9,6 +9,7 @@
 #include "serve/ServePlan.hpp"
 
 #include <cstdint>
+#include <functional>
 #include <map>
 #include <utility>
 #include <vector>
@@ -24,8 +25,13 @@ MadeLine makePartition(std::uint16_t id, const PlannedPartition& partition, cons
 /// Lifetime: borrows the server, the machine and the logs. Thread safety: one thread.
 class ServeReload {
 public:
+    /// @param inForce  what is in force now
+    /// @param hasLoaded  whether the server has loaded its credentials again
+    using OnReload = std::function<void(const ServePlan& inForce, bool hasLoaded)>;
+
     /// @param plan  what the server has been started with
-    ServeReload(Server& server, ServeMachine& machine, LineLogs& logs, const ServePlan& plan);
+    /// @param onReload  called at the end of each run()
+    ServeReload(Server& server, ServeMachine& machine, LineLogs& logs, const ServePlan& plan, OnReload onReload);
 
     /// Reads the file and the credentials again. Partitions and rules follow the file; a session that is still allowed,
     /// on a line that stays the same, goes on. An error in the file changes nothing of them, and is logged.
@@ -42,12 +48,13 @@ private:
     void pApplyPartition(std::uint16_t id, MadeLine made);
     std::size_t pEndForbiddenSessions();
     void pLogSettings(const ServePlan& next) const;
-    void pLoadCredentials(const TransportOptions& wanted);
+    bool pLoadCredentials(const TransportOptions& wanted);
 
     Server& mServer;
     ServeMachine& mMachine;
     LineLogs& mLogs;
     ServePlan mPlan; ///< in force
+    const OnReload mOnReload;
 };
 
 /// "1 partition", "2 partitions"
