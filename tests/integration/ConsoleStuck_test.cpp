@@ -86,6 +86,28 @@ TEST_F(ConsoleStuckTest, LeavesAStoppedServerIntoWhichMuchWasPasted)
     EXPECT_THAT(leave(person).screen, EndsWith(" bytes of input that were not sent are thrown away\r\n"));
 }
 
+TEST_F(ConsoleStuckTest, LeavesAStoppedServerWhileTheSessionIsOpenedAgain)
+{
+    PtyProcess person(console({"1"}));
+    person.await("connected");
+    server.process().signal(SIGSTOP);
+    person.type("~f");
+    person.await("qel: opening partition 1 again by force\r\n");
+    EXPECT_THAT(leave(person).screen, EndsWith("by force\r\nqel: left partition 1\r\n"));
+}
+
+TEST_F(ConsoleStuckTest, ASignalEndsItWhileTheSessionIsOpenedAgain)
+{
+    PtyProcess person(console({"1"}));
+    person.await("connected");
+    server.process().signal(SIGSTOP);
+    person.type("~f");
+    person.await("qel: opening partition 1 again by force\r\n");
+    person.signal(SIGTERM);
+    EXPECT_EQ(person.wait().signal, SIGTERM);
+    EXPECT_TRUE(person.isTerminalUntouched());
+}
+
 TEST_F(ConsoleStuckTest, LeavesAPartitionThatDoesNotReadIntoWhichMuchWasPasted)
 {
     PtyProcess person(console({"2"}));

@@ -100,6 +100,31 @@ await 'seconds since the line before'
 type_keys '~t'
 await 'time stamps off'
 
+type_keys '~l'
+await 'there is no log; start with --log FILE'
+type_keys '~b'
+await 'the protocol carries no break'
+type_keys '~r'
+await 'nothing that is typed is sent'
+type_keys 'echo unseen'
+enter
+type_keys '~r'
+await 'what is typed is sent again'
+type_keys 'echo $((8 * 8))'
+enter
+await '64'
+[ "$(screen | grep -c unseen)" -eq 0 ] || fail 'what was typed while it was read only was sent'
+echo 'echo from the $((4 + 4))th file' >"$work/file"
+type_keys '~#'
+await 'file to type'
+type_keys "$work/file"
+enter
+await 'from the 8th file'
+enter
+type_keys '~~'
+enter
+await 'guest> ~'
+
 # The window gets another size, and the partition is told.
 person resize-window -t main -x 90 -y 40
 type_keys '~w'

@@ -113,7 +113,7 @@ ExitStatus ConsoleRun::run()
     try {
         pUse(ConsoleConnection(mOptions.connect, end, mKnown));
         pOpen(end);
-        const SessionTools tools = pTools();
+        const SessionTools tools = pAttachTools();
         if (pTypesTexts()) pAwaitReplay();
         const ConsoleLoop::Outcome outcome = pRunLoop(tools);
         const SessionEnd sessionEnd = mSession ? mSession->getEnd() : SessionEnd::ConnectionClosed;
@@ -143,7 +143,8 @@ std::string ConsoleRun::pRefusalText(const StatusError& refusal) const
     return refusalText(refusal.getResponse(), filled(texts::kPartition, {std::to_string(mOptions.partition)}));
 }
 
-SessionTools ConsoleRun::pTools()
+/// Lets the files and the script see what comes.
+SessionTools ConsoleRun::pAttachTools()
 {
     SessionTools tools;
     if (mLog) tools.logs.push_back(&*mLog);
@@ -231,6 +232,7 @@ ConsoleLoop::Outcome ConsoleRun::pRunLoop(const SessionTools& tools)
     ConsoleLoop::Outcome outcome;
     while (pRunOnce(loop, outcome))
         continue;
+    if (mConnection) mConnection->stream().setAttendant(nullptr); // the loop, which ends here
     return outcome;
 }
 
@@ -250,7 +252,11 @@ bool ConsoleRun::pRunOnce(ConsoleLoop& loop, ConsoleLoop::Outcome& outcome)
         if (!mOptions.reconnect || !isLost) return false;
         reason = mSession->describeEnd();
     } catch (const Error& error) {
-        pTellThrownAway(loop.outcome());
+        outcome = loop.outcome();
+        const bool isWanted = outcome.reason == ConsoleLoop::ExitReason::Left ||
+                              outcome.reason == ConsoleLoop::ExitReason::Signal; // and ended a wait
+        if (isWanted) return false;
+        pTellThrownAway(outcome);
         if (!mOptions.reconnect || !isTemporary(error, mOptions.connect.transport.plain)) throw;
         reason = error.what();
     }

@@ -59,7 +59,7 @@ public:
 private:
     using TimePoint = std::chrono::steady_clock::time_point;
 
-    SessionTools pTools();
+    SessionTools pAttachTools();
     void pUse(ConsoleConnection&& connection);
     void pOpen(TimePoint end);
     SerialSession pOpenFirstFree(TimePoint end);
