@@ -156,6 +156,33 @@ TEST_F(StatusTest, OverTlsTheDaysUntilCertificatesExpireAreKnown)
                 HasSubstr("\nWARNING: own certificate " + credentials.path() + "/server.crt expires at "));
 }
 
+TEST_F(StatusTest, AConsoleIsClosedByItsNameUnlessAPartitionHasTheSame)
+{
+    const CredentialDirectory credentials;
+    const std::string file = directory.file("serve.toml");
+    std::ofstream(file) << "[partition.other]\nid = 2\nline = \"exec cat\"\n";
+    ServeProcess server({"--config", file, "--status-socket", socket}, "127.0.0.1:0", credentials.options("server"));
+    const auto types = [&] { return report().at("partitions").back().at("sessions").size() == 1; };
+    Arguments command = qelCommand({"console", "--connect", server.endpoint(), "2"});
+    const Arguments own = credentials.options("client");
+    command.insert(command.end(), own.begin(), own.end());
+    Process first(command);
+    ASSERT_TRUE(comesTrue(types));
+    EXPECT_EQ(report().at("consoles").at(0).at("tls"), "1.3");
+    EXPECT_EQ(status({"--close", "client"}).output, "closed: client on partition 2, connection 0\n");
+    EXPECT_NE(first.wait().exitStatus, 0);
+
+    std::ofstream(file, std::ios::app) << "[partition.client]\nid = 1\nline = \"exec cat\"\n";
+    server.process().signal(SIGHUP);
+    server.process().awaitErrors("SIGHUP: read ");
+    Process second(command);
+    ASSERT_TRUE(comesTrue(types));
+    EXPECT_EQ(status({"--close", "client"}).errors,
+              "qel: client is a partition and a console: give the number of one, such as 1 or #1\n");
+    EXPECT_EQ(status({"--close", "#2"}).output, "closed: client on partition 2, connection 0\n");
+    EXPECT_NE(second.wait().exitStatus, 0);
+}
+
 TEST_F(StatusTest, WithoutATerminalWatchingPrintsOneReportAfterTheOther)
 {
     auto server = std::make_unique<ServeProcess>(serving());

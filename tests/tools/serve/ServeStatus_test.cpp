@@ -6,7 +6,9 @@
 #include "serve/ServeMachine.hpp"
 #include "serve/ServeStatus.hpp"
 #include "support/ComesTrue.hpp"
+#include "support/CredentialDirectory.hpp"
 
+#include <filesystem>
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 #include <memory>
@@ -106,6 +108,29 @@ TEST_F(ServeStatusTest, ReportsConsolesAndPartitions)
     EXPECT_EQ(report.at("consoles").at(0).at("received").at("messages"), 3);
     EXPECT_EQ(report.at("partitions").size(), 3U);
     EXPECT_EQ(report.at("partitions").at(0).at("sessions").dump(), R"([{"connection":0,"console":1,"setUp":false}])");
+}
+
+TEST_F(ServeStatusTest, TellsTheDatesOfTheCertificatesThatWereLoadedLast)
+{
+    const CredentialDirectory credentials;
+    tool::ServePlan protectedPlan;
+    protectedPlan.transport.directory = credentials.path();
+    protectedPlan.transport.name = "server";
+    status.note(protectedPlan, false); // loading has failed
+    EXPECT_THAT(ask("status").at("status").at("certificates"), IsEmpty());
+    status.note(protectedPlan, true);
+    const Json fine = ask("status").at("status").at("certificates");
+    ASSERT_EQ(fine.size(), 2U);
+    EXPECT_EQ(fine.at(0).at("file"), credentials.file("server.crt"));
+    EXPECT_EQ(fine.at(0).at("state"), "fine");
+    EXPECT_EQ(fine.at(1).at("file"), credentials.file("root.crt"));
+    protectedPlan.warnExpiry = std::chrono::hours(24) * 36500;
+    ASSERT_TRUE(std::filesystem::remove(credentials.file("server.crt")));
+    status.note(protectedPlan, false); // the new warning time counts, the certificates are those in use
+    const Json due = ask("status").at("status").at("certificates");
+    ASSERT_EQ(due.size(), 2U);
+    EXPECT_EQ(due.at(0).at("state"), "due");
+    EXPECT_EQ(due.at(0).at("notAfter"), fine.at(0).at("notAfter"));
 }
 
 TEST_F(ServeStatusTest, ClosesTheSessionThatTypesOrTheOneThatIsNamed)

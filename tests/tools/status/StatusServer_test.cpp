@@ -19,6 +19,7 @@
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/un.h>
+#include <sys/wait.h>
 #include <unistd.h>
 #include <vector>
 
@@ -136,6 +137,34 @@ TEST_F(StatusServerTest, TheSocketIsForItsUserAloneWhateverTheUmask)
         const StatusSocket socket(path);
         EXPECT_EQ(modeOf(path), 0600U & ~mask) << mask;
     }
+}
+
+/// Root tries what another user could do if somebody opened the socket to all.
+TEST_F(StatusServerTest, RefusesAnotherUserEvenIfTheFileDoesNot)
+{
+    if (::geteuid() != 0) GTEST_SKIP() << "only root can become another user";
+    serve();
+    ASSERT_EQ(::chmod(directory.path().c_str(), 0755), 0);
+    ASSERT_EQ(::chmod(path.c_str(), 0666), 0);
+    sockaddr_un address{};
+    address.sun_family = AF_UNIX;
+    path.copy(static_cast<char*>(address.sun_path), path.size());
+    const pid_t child = ::fork();
+    ASSERT_GE(child, 0);
+    if (child == 0) { // system calls alone from here on
+        constexpr uid_t kNobody = 65534;
+        char byte = 0;
+        const int fd = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+        if (::setuid(kNobody) != 0) ::_exit(3);
+        if (::connect(fd, reinterpret_cast<const sockaddr*>(&address), sizeof(address)) != 0) ::_exit(4);
+        static_cast<void>(::send(fd, "status\n", 7, MSG_NOSIGNAL));
+        ::_exit(::recv(fd, &byte, 1, 0) > 0 ? 1 : 0);
+    }
+    int status = -1;
+    ASSERT_EQ(::waitpid(child, &status, 0), child);
+    EXPECT_EQ(status, 0);
+    EXPECT_THAT(log.lines(), testing::Contains(HasSubstr("status socket: refused a process of another user")));
+    EXPECT_EQ(ask(), answer());
 }
 
 TEST_F(StatusServerTest, TheSocketIsRemovedAtTheEnd)
