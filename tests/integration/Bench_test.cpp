@@ -260,8 +260,8 @@ TEST(BenchFaults, MoreConnectionsThanTheServerTakesAreRefused)
     EXPECT_EQ(result.output, "");
     EXPECT_EQ(
         result.errors,
-        "qel: connection 4 of 4: the server takes no more consoles; wait until one leaves, or raise --max-consoles of "
-        "the server: 0x00000012 (QelMessageStatusTooManyConnections)\n");
+        "qel: connection 4 of 4: the server takes no more consoles, or its rules do not let this certificate in; its "
+        "log says which: 0x00000012 (QelMessageStatusTooManyConnections)\n");
 }
 
 TEST(BenchFaults, AToolIdInUseIsRefused)

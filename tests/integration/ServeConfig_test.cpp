@@ -69,8 +69,11 @@ TEST_F(ServeConfigured, ACertificateWithoutARuleIsTurnedAway)
     const auto server = serveWith(kPartitions + "[[rule]]\nname = 'somebody else'\nmay = 'type'\n");
     const auto result = call(*server);
     EXPECT_EQ(result.exitStatus, 1);
+    EXPECT_THAT(result.errors, HasSubstr("its rules do not let this certificate in"));
     EXPECT_THAT(result.errors, HasSubstr("0x00000012 (QelMessageStatusTooManyConnections)"));
-    EXPECT_THAT(server->stop().errors, HasSubstr("audit: refused console=1 name=\"client\" fingerprint="));
+    EXPECT_THAT(server->stop().errors,
+                AllOf(HasSubstr("audit: refused console=1 name=\"client\" fingerprint="),
+                      HasSubstr(" status=18 why=QelMessageStatusTooManyConnections by=rules\n")));
 }
 
 TEST_F(ServeConfigured, AForbiddenPartitionDoesNotExist)
@@ -78,7 +81,7 @@ TEST_F(ServeConfigured, AForbiddenPartitionDoesNotExist)
     const auto server = serveWith(kPartitions + "[[rule]]\nname = 'client'\nmay = 'type'\npartitions = 'web'\n");
     EXPECT_THAT(opening(*server, {"2"}), HasSubstr("0x00000015 (QelMessageStatusInvalidLparId)"));
     EXPECT_THAT(console(*server, "", {"1"}).output, HasSubstr("hello"));
-    server->stop();
+    EXPECT_THAT(server->stop().errors, HasSubstr(" status=21 why=QelMessageStatusInvalidLparId by=rules\n"));
 }
 
 TEST_F(ServeConfigured, WhoMayOnlyWatchIsToldSo)
@@ -115,7 +118,7 @@ TEST_F(ServeConfigured, OneCertificateCannotTakeAllPlaces)
     EXPECT_EQ(first.messages().receive()->getStatus(), QelMessageStatusNoError);
     EXPECT_THAT(call(*server).errors, HasSubstr("QelMessageStatusTooManyConnections"));
     EXPECT_EQ(call(*server, {}, "server").exitStatus, 0); // another certificate
-    server->stop();
+    EXPECT_THAT(server->stop().errors, HasSubstr(" by=max-consoles-per-certificate\n"));
 }
 
 TEST_F(ServeConfigured, LogsWhoDidWhat)
@@ -249,7 +252,7 @@ TEST_F(ServeConfigured, SighupMutesMessagesBetweenConsoles)
     const auto muted = broadcast();
     EXPECT_EQ(muted.exitStatus, 1);
     EXPECT_THAT(muted.errors, HasSubstr("0x00000001 (QelMessageStatusInvalidOperation)"));
-    EXPECT_THAT(server->stop().errors, Not(HasSubstr("need a restart")));
+    EXPECT_THAT(server->stop().errors, AllOf(Not(HasSubstr("need a restart")), HasSubstr(" by=no-broadcasts\n")));
 }
 
 TEST_F(ServeConfigured, AConsoleThatSaysNothingIsLetGo)

@@ -26,7 +26,7 @@ TEST(RefusalReason, SaysWhatToDoAboutEachRefusalOfTheServer)
     EXPECT_EQ(reason(0x6003, 0x0101, 37),
               "a console with this tool type and id is connected already; choose another --tool-id");
     EXPECT_EQ(reason(0x6003, 0x0101, 18),
-              "the server takes no more consoles; wait until one leaves, or raise --max-consoles of the server");
+              "the server takes no more consoles, or its rules do not let this certificate in; its log says which");
     EXPECT_EQ(reason(0x6003, 0x0102, 23), "this console has opened its session already");
     EXPECT_EQ(reason(0x6003, 0x0106, 19), "no other console has this tool type and id");
     EXPECT_EQ(reason(0x6003, 0x0106, 6), "the addressed console takes no more messages at the moment; try again later");

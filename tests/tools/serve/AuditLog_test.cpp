@@ -92,6 +92,8 @@ TEST(AuditLog, SaysWhatIsRefusedAndWhy)
               "audit: refused" + kWho + " request=\"time\" status=4 why=QelMessageStatusInvalidCmdSequence");
     EXPECT_EQ(line(QelMessageGeneric(1, 0x1234, 0x5678, MsgResponseExpected), QelMessageStatusInvalidFunction),
               "audit: refused" + kWho + " request=\"unknown\" status=15 why=QelMessageStatusInvalidFunction");
+    EXPECT_EQ(auditAnswered(alice(), QelMessageGetQelTodReq(), QelMessageStatusTooManyConnections, "rules"),
+              "audit: refused" + kWho + " request=\"time\" status=18 why=QelMessageStatusTooManyConnections by=rules");
 }
 
 TEST(AuditLog, WhatChangesNoSessionHasNoLine)

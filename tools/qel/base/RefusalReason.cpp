@@ -24,7 +24,7 @@ constexpr Row kReasons[] = {
     {kConnection, QelMessageOpGetEnclTypeAndInterfaceVersion, QelMessageStatusDaxAlreadyConnected,
      "a console with this tool type and id is connected already; choose another --tool-id"},
     {kConnection, QelMessageOpGetEnclTypeAndInterfaceVersion, QelMessageStatusTooManyConnections,
-     "the server takes no more consoles; wait until one leaves, or raise --max-consoles of the server"},
+     "the server takes no more consoles, or its rules do not let this certificate in; its log says which"},
     {kConnection, QelMessageOpOpenKrogSession, QelMessageStatusKrogSessionAlreadyOpen,
      "this console has opened its session already"},
     {kConnection, QelMessageOpDaxBroadcast, QelMessageStatusConnectionNotAvailable,

@@ -59,11 +59,12 @@ std::string placeOf(const QelMessage& request)
     return {};
 }
 
-std::string refused(const Peer& peer, const QelMessage& request, QelMessageStatusCodes status)
+std::string refused(const Peer& peer, const QelMessage& request, QelMessageStatusCodes status, const std::string& by)
 {
     const std::string name = requestName(request);
     return line("refused", peer) + placeOf(request) + " request=" + quoted(name.empty() ? "unknown" : name) +
-           " status=" + std::to_string(static_cast<unsigned int>(status)) + " why=" + statusName(status);
+           " status=" + std::to_string(static_cast<unsigned int>(status)) + " why=" + statusName(status) +
+           (by.empty() ? "" : " by=" + by);
 }
 
 } // namespace
@@ -85,9 +86,10 @@ std::string auditBreak(std::uint16_t partition, uid_t user)
     return "audit: break partition=" + std::to_string(partition) + " uid=" + std::to_string(user);
 }
 
-std::string auditAnswered(const Peer& peer, const QelMessage& request, QelMessageStatusCodes status)
+std::string auditAnswered(const Peer& peer, const QelMessage& request, QelMessageStatusCodes status,
+                          const std::string& by)
 {
-    if (status != QelMessageStatusNoError) return refused(peer, request, status);
+    if (status != QelMessageStatusNoError) return refused(peer, request, status, by);
     if (const auto* open = dynamic_cast<const QelMessageVirtualSerialOpenReq*>(&request)) {
         const bool types = open->getVssConnectionNumber() == 0;
         return line(open->isForceOpen() ? "forced" : (types ? "opened" : "watched"), peer) + placeOf(request);

@@ -31,7 +31,9 @@ std::string auditBreak(std::uint16_t partition, uid_t user);
 
 /// The line about a request: opened, forced, watched, closed or refused.
 /// @param status  of the response
+/// @param by  what of the configuration has refused it: "rules" and so on; empty: it was the server by itself
 /// @return empty: the request has no line, because it was granted and changes no session
-std::string auditAnswered(const Peer& peer, const QelMessage& request, QelMessageStatusCodes status);
+std::string auditAnswered(const Peer& peer, const QelMessage& request, QelMessageStatusCodes status,
+                          const std::string& by = {});
 
 } // namespace qel::tool

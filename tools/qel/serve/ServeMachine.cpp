@@ -24,23 +24,36 @@ void ServeMachine::setPolicy(ServePolicy policy)
 QelMessageStatusCodes ServeMachine::mayRequest(const Peer& peer, const QelMessage& request)
 {
     const MutexLock lock(mMutex);
+    return pDecideLocked(peer, request);
+}
+
+QelMessageStatusCodes ServeMachine::pDecideLocked(const Peer& peer, const QelMessage& request)
+{
     const bool introduces = dynamic_cast<const QelMessageGetEnclTypeAndInterfaceVersionReq*>(&request) != nullptr;
     if (introduces && mPolicy.maxPerCertificate > 0 && !peer.fingerprint.empty()) {
         const auto found = mConsoles.find(peer.fingerprint);
         if (found != mConsoles.end() && found->second >= mPolicy.maxPerCertificate) {
+            mRefusedBy = "max-consoles-per-certificate";
             return QelMessageStatusTooManyConnections;
         }
     }
     const QelMessageStatusCodes decision = mPolicy.rules.decide(peer, request);
-    if (decision != QelMessageStatusNoError) return decision;
+    if (decision != QelMessageStatusNoError) {
+        mRefusedBy = "rules";
+        return decision;
+    }
     const bool isMuted = mPolicy.mutesBroadcasts && dynamic_cast<const QelMessageDaxBroadcastReq*>(&request) != nullptr;
-    return isMuted ? QelMessageStatusInvalidOperation : QelMessageStatusNoError;
+    if (!isMuted) return QelMessageStatusNoError;
+    mRefusedBy = "no-broadcasts";
+    return QelMessageStatusInvalidOperation;
 }
 
 bool ServeMachine::mayOpen(const Peer& peer, std::uint16_t partition)
 {
     const MutexLock lock(mMutex);
-    return mPolicy.rules.mayOpen(peer, partition);
+    const bool mayOpen = mPolicy.rules.mayOpen(peer, partition);
+    if (!mayOpen) mRefusedBy = "rules";
+    return mayOpen;
 }
 
 std::vector<ServeMachine::SessionPlace> ServeMachine::sessionsToEnd() const
@@ -56,10 +69,11 @@ std::vector<ServeMachine::SessionPlace> ServeMachine::sessionsToEnd() const
 
 void ServeMachine::onAnswered(const Peer& peer, const QelMessage& request, QelMessageStatusCodes status)
 {
-    const std::string line = auditAnswered(peer, request, status);
+    const MutexLock lock(mMutex);
+    const char* const by = std::exchange(mRefusedBy, "");
+    const std::string line = auditAnswered(peer, request, status, by);
     if (!line.empty()) logLine(LogLevel::Info, line);
     if (status != QelMessageStatusNoError) return;
-    const MutexLock lock(mMutex);
     if (const auto* open = dynamic_cast<const QelMessageVirtualSerialOpenReq*>(&request)) {
         mSessions.insert_or_assign(SessionPlace(open->getLpId(), open->getVssConnectionNumber()), peer);
     } else if (const auto* close = dynamic_cast<const QelMessageVirtualSerialCloseReq*>(&request)) {

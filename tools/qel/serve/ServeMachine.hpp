@@ -44,10 +44,14 @@ public:
     void onDisconnected(const Peer& peer, DisconnectReason why) override;
 
 private:
+    QelMessageStatusCodes pDecideLocked(const Peer& peer, const QelMessage& request) QEL_REQUIRES(mMutex);
     void pForgetSessionsLocked(const Peer& peer) QEL_REQUIRES(mMutex);
 
     mutable Mutex mMutex; ///< guards what follows; only the logger's lock is taken under it
     ServePolicy mPolicy QEL_GUARDED_BY(mMutex);
+    /// What has refused the request that is being decided about, for its line in the log; empty: nothing so far. The
+    /// engine decides about one request at a time, and reports its answer before the next.
+    const char* mRefusedBy QEL_GUARDED_BY(mMutex) = "";
     std::map<SessionPlace, Peer> mSessions QEL_GUARDED_BY(mMutex);       ///< see sessionsToEnd()
     std::map<std::string, std::size_t> mConsoles QEL_GUARDED_BY(mMutex); ///< connected ones, by fingerprint
 };

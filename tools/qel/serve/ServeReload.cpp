@@ -77,7 +77,9 @@ void ServeReload::pApply(const ServePlan& next)
     for (const auto& entry : next.partitions)
         made.emplace_back(entry.first, makePartition(entry.first, entry.second, mPlan.term, mLogs));
     pLogSettings(next);
-    // Before the partitions: whatever happens to them, nobody may do what the file no longer allows.
+    // Before the partitions: whatever happens to them, nobody may do what the file no longer allows. And changing them
+    // takes the server's lock: what it was about to allow by the old rules is known to the machine when sessions are
+    // ended.
     mMachine.setPolicy(next.policy);
     mPlan.policy = next.policy;
     mPlan.warnExpiry = next.warnExpiry;
