@@ -286,6 +286,23 @@ TEST_F(TelnetLineTest, ANewConnectionHasItsOwnTimeToAgree)
     EXPECT_THAT(log.lines(), IsEmpty());
 }
 
+TEST_F(TelnetLineTest, APeerThatDoesNotAgreeIsNotWarnedAboutAtEachConnection)
+{
+    const CapturedLog log(LogLevel::Warn);
+    const auto withSettings = tool::telnetLine(std::make_unique<WireLine>(wire), SerialSettings::parse("9600n8"));
+    for (const std::string& answer : {std::string(), std::string(), kAgreed, std::string()}) {
+        withSettings->start(7);
+        EXPECT_TRUE(withSettings->advance());
+        wire.toRead = answer;
+        std::array<char, 100> buffer;
+        withSettings->read(buffer.data(), buffer.size());
+        clock.advance(std::chrono::seconds(5));
+        EXPECT_TRUE(withSettings->advance());
+        withSettings->stop();
+    }
+    EXPECT_EQ(log.lines().size(), 2U); // the first one, and the one after the peer that agreed
+}
+
 TEST_F(TelnetLineTest, APeerThatBreaksTheProtocolEndsTheLine)
 {
     bringUp();

@@ -121,7 +121,7 @@ bool TelnetCodec::beginBreak()
 
 void TelnetCodec::checkAgreement() const
 {
-    if (!mSettings || mHasSetPort) return;
+    if (agrees()) return;
     protocol::logLine(LogLevel::Warn, mName, ": the peer does not take ", mSettings->str(),
                       ": it does not speak RFC 2217");
 }

@@ -41,6 +41,8 @@ public:
     /// To be called some time after the beginning: logs a line at Warn if there are settings and the peer has not taken
     /// control of its port. A refusal is no event of libtelnet, and a peer may say nothing at all.
     void checkAgreement() const;
+    /// Whether there is nothing to be logged about.
+    bool agrees() const { return !mSettings || mHasSetPort; }
 
     /// Begins a break. @return whether it has to be ended: by RFC 2217 it lasts until then, by telnet's own it does not
     bool beginBreak();

@@ -54,7 +54,8 @@ public:
         if (mBreakEnd.isExpired(now)) pEndBreak();
         if (mAgreementEnd.isExpired(now)) {
             mAgreementEnd = PollDeadline();
-            mCodec->checkAgreement();
+            if (!mHasWarned) mCodec->checkAgreement();
+            mHasWarned = !mCodec->agrees();
         }
         pFlush();
         return true;
@@ -158,6 +159,7 @@ private:
     bool mIsBreakQueued = false;         // the beginning of a break waits to be sent
     PollDeadline mBreakEnd;              // enabled: a break is under way
     PollDeadline mAgreementEnd;          // enabled: the peer has time left to agree to the settings
+    bool mHasWarned = false;             // the last peer that had its time did not agree: one more is not news
     std::string mHeld;                   // input for after the break
     PollDeadline mBroken;                // enabled: when the peer has broken the protocol, after other data
     std::string mReason;                 // how the peer has broken the protocol
