@@ -385,6 +385,11 @@ TEST(StatusSocketDefault, IsInTheRuntimeDirectoryIfThatIsForThisUserAlone)
     ::unsetenv("QEL_STATUS_SOCKET");
     ASSERT_EQ(::chmod(directory.path().c_str(), 0755), 0);
     EXPECT_EQ(tool::defaultStatusSocket(), "");
+    ::setenv("RUNTIME_DIRECTORY", (directory.path() + ":/run/other").c_str(), 1); // as systemd sets it
+    EXPECT_EQ(tool::defaultStatusSocket(), directory.path() + "/status.sock");
+    ASSERT_EQ(::chmod(directory.path().c_str(), 0775), 0);
+    EXPECT_EQ(tool::defaultStatusSocket(), "");
+    ::unsetenv("RUNTIME_DIRECTORY");
     for (const char* other : {"", "relative", "/nowhere/at/all", "/"}) {
         ::setenv("XDG_RUNTIME_DIR", other, 1);
         EXPECT_EQ(tool::defaultStatusSocket(), "") << other;

@@ -30,9 +30,9 @@ using Json = nlohmann::ordered_json;
 
 std::vector<std::string> textsOf(const std::vector<IPEndpoint>& endpoints)
 {
-    std::vector<std::string> texts;
-    for (const IPEndpoint& endpoint : endpoints)
-        texts.push_back(endpoint.str());
+    std::vector<std::string> texts(endpoints.size());
+    std::transform(endpoints.begin(), endpoints.end(), texts.begin(),
+                   [](const IPEndpoint& endpoint) { return endpoint.str(); });
     return texts;
 }
 

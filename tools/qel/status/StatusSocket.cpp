@@ -67,6 +67,19 @@ UniqueFd lockDirectoryOf(const std::string& path)
     return fd;
 }
 
+/// The directory that a variable names: the first one of several.
+/// @param forbidden  permissions that make it unfit
+/// @return empty: the variable names none of this user's own
+std::string ownDirectory(const char* variable, mode_t forbidden)
+{
+    const char* const value = std::getenv(variable);
+    const std::string directory = value == nullptr ? std::string() : std::string(value, std::strcspn(value, ":"));
+    struct stat status {};
+    if (directory.empty() || directory.front() != '/' || ::stat(directory.c_str(), &status) != 0) return {};
+    const bool isOwn = S_ISDIR(status.st_mode) && status.st_uid == ::geteuid();
+    return isOwn && (status.st_mode & forbidden) == 0 ? directory : std::string();
+}
+
 /// Removes the file of a server that is dead.
 void removeStale(const std::string& path, const sockaddr_un& address)
 {
@@ -116,12 +129,10 @@ StatusSocket::~StatusSocket()
 
 std::string defaultStatusSocket()
 {
-    const char* const directory = std::getenv("XDG_RUNTIME_DIR");
-    struct stat status {};
-    if (directory == nullptr || *directory != '/' || ::stat(directory, &status) != 0) return {};
-    const bool isOwn = S_ISDIR(status.st_mode) && status.st_uid == ::geteuid();
-    if (!isOwn || (status.st_mode & (S_IRWXG | S_IRWXO)) != 0) return {};
-    return std::string(directory) + "/qel-status.sock";
+    const std::string ofUser = ownDirectory("XDG_RUNTIME_DIR", S_IRWXG | S_IRWXO);
+    if (!ofUser.empty()) return ofUser + "/qel-status.sock";
+    const std::string ofService = ownDirectory("RUNTIME_DIRECTORY", S_IWGRP | S_IWOTH);
+    return ofService.empty() ? std::string() : ofService + "/status.sock";
 }
 
 UniqueFd connectStatus(const std::string& path)

@@ -33,7 +33,8 @@ private:
 };
 
 /// Where a server of this user listens unless it is told otherwise: "qel-status.sock" in $XDG_RUNTIME_DIR, a directory
-/// of this user alone. Empty: there is no such directory.
+/// of this user alone; for a service of systemd "status.sock" in $RUNTIME_DIRECTORY, where only this user may write.
+/// Empty: there is no such directory.
 std::string defaultStatusSocket();
 
 /// A descriptor that is connected to the socket of a server, and closed on exec.
