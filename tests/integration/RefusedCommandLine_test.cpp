@@ -214,6 +214,8 @@ TEST(RefusedCommandLine, NamesTheArgumentOfConsoleThatIsWrong)
                       {{"65536"}, "partition: \"65536\" is not an integer in [0, 65535]"},
                       {{"1", "2"}, "unexpected argument \"2\"; see \"qel console --help\""},
                       {{"1", "--connection", "65536"}, "--connection: \"65536\" is not an integer in [0, 65535]"},
+                      {{"1", "--log", "x", "--record", "x"}, "--log and --record need a file each"},
+                      {{"1", "--log-strip", "x", "--log", "x"}, "--log and --log-strip need a file each"},
                       {{"1", "--linger", "-1"}, "--linger: \"-1\" is not a number in [0, 86400]"},
                       {{"1", "--linger", "86401"}, "--linger: \"86401\" is not a number in [0, 86400]"},
                       {{"1", "--timeout", "0"}, "--timeout: \"0\" is not a number in [0.001, 86400]"},

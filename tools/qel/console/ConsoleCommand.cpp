@@ -14,9 +14,11 @@
 #include "console/Profiles.hpp"
 #include "console/TypedText.hpp"
 
+#include <algorithm>
 #include <chrono>
 #include <csignal>
 #include <cstdint>
+#include <iterator>
 #include <memory>
 #include <optional>
 #include <string>
@@ -256,6 +258,19 @@ void addScriptOptions(CLI::App& command, CommandOptions& options)
         ->check(textUpTo(kMaxCommand));
 }
 
+/// One file for two purposes would be emptied by a recording, or written to by both.
+void checkFiles(const ConsoleRunOptions& run)
+{
+    const std::pair<const char*, const std::string&> files[] = {
+        {"--log", run.log}, {"--log-strip", run.logStrip}, {"--record", run.record}};
+    for (const auto* file = std::begin(files); file != std::end(files); ++file) {
+        const auto* const same =
+            std::find_if(std::begin(files), file, [file](const auto& other) { return other.second == file->second; });
+        if (same != file && !file->second.empty())
+            throw CommandFailure(ExitStatus::Usage, filled(texts::kSameFile, {same->first, file->first}));
+    }
+}
+
 /// The help has many options; each group is what a user looks for at a time.
 void groupOptions(CLI::App& command)
 {
@@ -299,6 +314,7 @@ CLI::App& addConsoleCommand(CLI::App& parent, Action& action)
     command.callback([&action, &command, options] {
         findPartition(command, *options);
         checkConnect(options->run.connect);
+        checkFiles(options->run);
         options->run.input = options->inputOptions();
         options->run.stamps = styleOf(options->stamps);
         options->run.steps = stepsOf(command, *options);

@@ -115,6 +115,7 @@ constexpr const char* kNextAttempt = "$1; next attempt in $2 s";
 constexpr const char* kBackAgain = "connected again after $1 s; output may be missing";
 
 // The command line.
+constexpr const char* kSameFile = "$1 and $2 need a file each";
 constexpr const char* kNotAnEscape = "$1 is not one printable character, ^ and a character from @ to _, or none";
 constexpr const char* kEscapeIsCommand = "$1 is a command after the escape character";
 constexpr const char* kNotTypedText =
