@@ -89,9 +89,10 @@ std::string Draft::bytes() const
     frame += bigEndian32(mDataLength.value_or(static_cast<std::uint32_t>(mPayload.size())));
     frame += bigEndian16(mOperation);
     frame.resize(header, '\0'); // status, status detail, reserved
+    frame += mPayload + pad;
     for (std::size_t i = 0; i + 1 < mOverlay.size(); i += 2)
-        frame[static_cast<unsigned char>(mOverlay[i])] = mOverlay[i + 1];
-    return frame + mPayload + pad;
+        frame.at(static_cast<unsigned char>(mOverlay[i])) = mOverlay[i + 1];
+    return frame;
 }
 
 } // namespace qel::tool::check

@@ -41,7 +41,8 @@ public:
     /// The length fields alone; the bytes stay as they are.
     Draft& msgLength(std::uint32_t length);
     Draft& dataLength(std::uint32_t length);
-    /// Any byte of the header, after everything else.
+    /// Any of the first 256 bytes of the frame, after everything else.
+    /// @throws std::out_of_range  from bytes(): the frame is shorter
     Draft& byte(std::size_t offset, unsigned int value);
 
     unsigned int getFunction() const noexcept { return mFunction; }

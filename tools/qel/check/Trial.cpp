@@ -11,6 +11,7 @@
 #include "base/Failures.hpp"
 
 #include <exception>
+#include <random>
 #include <utility>
 
 namespace qel::tool::check {
@@ -35,6 +36,12 @@ constexpr NeedRow kNeeds[] = {
 };
 
 } // namespace
+
+Target::Target(ServerAddress server) : address(std::move(server))
+{
+    std::random_device random;
+    run = static_cast<std::uint64_t>(random()) << 32U | random();
+}
 
 std::string missingFor(const Case& aCase, const Target& target)
 {
@@ -117,7 +124,10 @@ std::string Trial::newToolId()
     return mToolId;
 }
 
-std::string Trial::newText() { return "<" + mPrefix + "text-" + std::to_string(++mTexts) + ">"; }
+std::string Trial::newText()
+{
+    return "<" + mPrefix + std::to_string(mTarget.run) + "-" + std::to_string(++mTexts) + ">";
+}
 
 void Trial::atEnd(std::function<void()> work) { mAtEnd.push_back(std::move(work)); }
 

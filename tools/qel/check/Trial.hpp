@@ -25,7 +25,7 @@ namespace qel::tool::check {
 
 /// The server that is tested, and what is known about it. Shared by all cases; it does not change during a run.
 struct Target {
-    explicit Target(ServerAddress server) : address(std::move(server)) {}
+    explicit Target(ServerAddress server);
 
     ServerAddress address;
     std::vector<IPEndpoint> endpoints;         ///< of the address
@@ -35,6 +35,7 @@ struct Target {
     std::chrono::milliseconds timeout{2000}; ///< for each thing that the peer has to do
     std::uint32_t toolType = 1;
     std::string toolIdPrefix = "qel-check"; ///< at most 20 bytes; numbers follow
+    std::uint64_t run;                      ///< a random number: what this run types differs from that of all others
 
     std::optional<std::uint16_t> partition;            ///< may be opened, written to, and taken by force
     std::optional<std::uint16_t> echoPartition;        ///< its line sends back all it gets
@@ -86,7 +87,7 @@ public:
     const std::string& toolId() const noexcept { return mToolId; }
     std::uint32_t toolType() const noexcept { return mTarget.toolType; }
 
-    /// A text that occurs nowhere else in the run.
+    /// A text that occurs nowhere else, not even in another run: a partition repeats its output.
     std::string newText();
 
     /// The partitions; a case that calls them has the need.

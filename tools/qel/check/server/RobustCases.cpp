@@ -232,7 +232,7 @@ Cases deadlineCases()
          kStates, Level::Robust, kDeadline,
          [](Trial& trial) {
              Wire& wire = trial.console();
-             drip(trial, wire, limitsRequest().payload("0123456789").bytes().substr(0, 30));
+             drip(trial, wire, limitsRequest().payload("0123456789").bytes().substr(0, 12));
              expectCut(trial, wire);
          }},
         {"robust/deadline/idle", "The time between messages is not limited: an idle console stays.", kStates,

@@ -88,9 +88,9 @@ void requireBetween(Trial& trial, Data& data, const std::function<void()>& type,
     const std::string begin = trial.newText();
     const std::string end = trial.newText();
     data.type(begin);
+    data.readUntil(begin);
     type();
     data.type(end);
-    data.readUntil(begin);
     const std::string seen = data.readUntil(end);
     Trial::require(seen == expected, "exactly what was typed, " + std::to_string(expected.size()) + " bytes",
                    std::to_string(seen.size()) + (seen.size() == expected.size() ? " other bytes" : " bytes"));
