@@ -141,6 +141,8 @@ protected:
             *machine, protocol::HypervisorEngine::kDefaultMaxConsoles, [] {}, protocol::IdleLimits{kTimeout, kLinger});
     }
 
+    ~IdleConnection() override { connection.reset(); } // its threads read the clock
+
     void pass(std::chrono::seconds time)
     {
         clock.advance(time);
