@@ -20,6 +20,7 @@ namespace {
 using std::chrono::steady_clock;
 
 constexpr int kSilence = 200; // milliseconds
+constexpr char kKey = 'x';
 constexpr std::chrono::seconds kDeadline(20);
 
 [[noreturn]] void fail(const char* what) { throw std::system_error(errno, std::generic_category(), what); }
@@ -127,7 +128,8 @@ EchoedKeys::EchoedKeys(const std::vector<std::string>& command)
     }
     std::string screen;
     const auto giveUp = steady_clock::now() + kDeadline;
-    while (screen.find(kReady) == std::string::npos) {
+    while (screen.find(kKey) == std::string::npos) {
+        mTerminal.type({kKey});
         std::array<char, 1024> buffer;
         pollfd fd{mTerminal.master(), POLLIN, 0};
         if (::poll(&fd, 1, kSilence) > 0) {
@@ -145,12 +147,11 @@ EchoedKeys::~EchoedKeys() { end(mPid); }
 
 double EchoedKeys::type() const
 {
-    const char key = 'x';
     char echo = 0;
     const auto start = steady_clock::now();
-    if (::write(mTerminal.master(), &key, 1) != 1 || ::read(mTerminal.master(), &echo, 1) != 1) fail("terminal");
+    if (::write(mTerminal.master(), &kKey, 1) != 1 || ::read(mTerminal.master(), &echo, 1) != 1) fail("terminal");
     const std::chrono::duration<double, std::micro> time = steady_clock::now() - start;
-    if (echo != key) throw std::runtime_error("a key comes back as another one");
+    if (echo != kKey) throw std::runtime_error("a key comes back as another one");
     return time.count();
 }
 
