@@ -1,7 +1,7 @@
 #!/bin/sh
 # A person at "qel console", played by tmux: types, uses the escape commands, resizes the window, suspends and resumes,
-# pastes a mebibyte into a partition that does not read, and leaves servers that are stopped or dead. Waits for texts on
-# the screen, never for a fixed time.
+# pastes a mebibyte into a partition that does not read, and leaves servers that are stopped or dead; and at "qel status
+# --watch". Waits for texts on the screen, never for a fixed time.
 #
 #   console_tmux.sh QEL
 # shellcheck disable=SC2016 # what is typed is for the shells in the window
@@ -43,6 +43,16 @@ await() {
     done
 }
 
+# Waits until the shell of the partition has nothing more to say.
+await_prompt() {
+    attempts=0
+    until [ "$(screen | sed '/^ *$/d' | tail -n 1 | tr -d ' ')" = 'guest>' ]; do
+        attempts=$((attempts + 1))
+        [ "$attempts" -lt 1000 ] || fail "the prompt did not come"
+        sleep 0.02
+    done
+}
+
 type_keys() { person send-keys -t main -l -- "$1"; }
 enter() { person send-keys -t main Enter; }
 
@@ -58,7 +68,7 @@ leave() {
 }
 
 start_server() {
-    "$qel" serve --plain --listen 127.0.0.1:0 --partition "1=PS1='guest> ' exec /bin/sh" \
+    "$qel" serve --plain --listen 127.0.0.1:0 --status-socket "$work/status" --partition "1=PS1='guest> ' exec /bin/sh" \
         --partition '2=stty raw -echo; echo ready; exec sleep 1000' >"$work/address" 2>"$work/serve.log" &
     server=$!
     attempts=0
@@ -120,7 +130,10 @@ await 'file to type'
 type_keys "$work/file"
 enter
 await 'from the 8th file'
+await_prompt
+prompts=$(screen | grep -c -F 'guest>')
 enter
+await 'guest>' $((prompts + 1)) # otherwise the echo may come before the prompt
 type_keys '~~'
 enter
 await 'guest> ~'
@@ -153,6 +166,28 @@ person load-buffer "$work/paste"
 person paste-buffer -t main
 await 'bytes of input are held back'
 leave 'are thrown away' 'a partition that does not read'
+
+# The status is drawn again and again, goes when the job is suspended, and comes back with it.
+person send-keys -R -t main
+type_keys "$qel status --socket $work/status --watch 0.1"
+enter
+await 'Partitions: 2'
+await 'q leaves'
+person send-keys -t main C-z
+await 'Stopped'
+[ "$(screen | grep -c -F 'q leaves')" -eq 0 ] || fail "the status is still on the screen"
+type_keys 'stty -a | tr " " "\n" | grep -x -e icanon -e echo | sort | tr "\n" " "'
+enter
+await 'echo icanon'
+type_keys 'fg'
+enter
+await 'q leaves'
+type_keys 'q'
+await 'Stopped' # the screen as it was
+person send-keys -R -t main
+type_keys 'echo gone; stty -a | tr " " "\n" | grep -x -e icanon -e echo | sort | tr "\n" " "'
+enter
+await 'echo icanon'
 
 # The server is stopped.
 console --keepalive 0.5 1
