@@ -62,7 +62,7 @@ TEST_F(CheckReport, AFailureShowsWhatIsRequiredSentAndSeen)
 {
     std::ostringstream text;
     printFailures(text, all(), std::chrono::milliseconds(1260), false);
-    const std::string gap(64, ' ');
+    const std::string gap(80, ' ');
     EXPECT_EQ(text.str(), std::string("\nsession/b (rule)\n"
                                       "  required  A second one is refused.\n"
                                       "            docs/connection.md#states\n"
@@ -78,9 +78,10 @@ TEST_F(CheckReport, HexShowsTheBytes)
 {
     std::ostringstream text;
     printFailures(text, {fails}, std::chrono::nanoseconds(0), true);
-    EXPECT_NE(text.str().find("\n      0000  DE CA FF 20 00 00 00 20 00 00 01 01 60 03 80 00         |\n"
-                              "      0010  00 00 00 00 01 02 00 00 00 00 00 00 00 00 00 00         |\n"),
-              std::string::npos)
+    EXPECT_NE(
+        text.str().find("\n      0000  DE CA FF 20 00 00 00 20 00 00 01 01 60 03 80 00                         |\n"
+                        "      0010  00 00 00 00 01 02 00 00 00 00 00 00 00 00 00 00                         |\n"),
+        std::string::npos)
         << text.str();
 }
 
@@ -122,7 +123,7 @@ TEST_F(CheckReport, Junit)
 {
     std::ostringstream text;
     printJunit(text, "qel check server", all(), std::chrono::milliseconds(1500));
-    const std::string gap(64, ' ');
+    const std::string gap(80, ' ');
     EXPECT_EQ(
         text.str(),
         std::string(
@@ -175,7 +176,7 @@ TEST(CheckTranscript, NumbersTheConnectionsWhenThereAreSeveral)
     Transcript transcript;
     transcript.add({1, Event::Kind::Sent, "abc", "byte by byte"});
     transcript.add({2, Event::Kind::Note, "connection reset", ""});
-    const std::string gap(64, ' ');
+    const std::string gap(80, ' ');
     const std::string first = "3 bytes: 616263, byte by byte";
     EXPECT_EQ(transcriptText(transcript, false), "       sent" + gap.substr(4) + "| seen\n    #1 " + first +
                                                      gap.substr(first.size()) + "|\n    #2 - connection reset" +

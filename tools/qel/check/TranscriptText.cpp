@@ -12,7 +12,7 @@ namespace {
 
 using Lines = std::vector<std::string>;
 
-constexpr std::size_t kColumn = 64; // characters of what was sent
+constexpr std::size_t kColumn = 80; // characters of what was sent: most frames fit
 constexpr std::size_t kRow = 16;    // bytes of a dump
 constexpr std::size_t kMaxDump = 512;
 constexpr std::size_t kMaxDetails = 8;
