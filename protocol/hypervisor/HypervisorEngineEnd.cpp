@@ -66,7 +66,7 @@ void HypervisorEngine::pClose(ConsoleEntry& console)
 /// to see whether the server is there.
 void HypervisorEngine::pNoteHeard(ConsoleEntry& console, const QelMessage& message)
 {
-    if (mIdle.timeout == mIdle.timeout.zero() || console.state != ConsoleState::Identified) return;
+    if (mIdle.timeout.count() == 0 || console.state != ConsoleState::Identified) return;
     if (isKind<QelMessageGetQelTodReq>(message)) return;
     console.heardAt = TimeProvider::steady();
     const PollDeadline next(console.heardAt + mIdle.timeout);
