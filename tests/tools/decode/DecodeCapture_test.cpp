@@ -215,14 +215,6 @@ TEST_F(DecodeCapture, SurvivesEveryTruncation)
         static_cast<void>(tool::tcpSegmentOf(1, packet.substr(0, length)));
 }
 
-TEST_F(DecodeCapture, SaysHowToConvertPcapng)
-{
-    EXPECT_EQ(decode(std::string("\x0A\x0D\x0D\x0A\x1C\0\0\0\x4D\x3C\x2B\x1A", 12)), ExitStatus::Refused);
-    EXPECT_EQ(errors.str(),
-              "qel: the input is a capture in pcapng form, which is not supported: convert it to pcap, for "
-              "example with \"tshark -F pcap -r IN -w OUT\"\n");
-}
-
 TEST_F(DecodeCapture, TextThatBeginsLikeTheMagicIsText)
 {
     EXPECT_EQ(decode("\n\r\n\r\n"), ExitStatus::Done);

@@ -4,6 +4,7 @@
 
 #include "base/Failures.hpp"
 #include "decode/PcapReader.hpp"
+#include "decode/PcapngReader.hpp"
 
 #include <algorithm>
 #include <cstring>
@@ -35,25 +36,32 @@ std::string counted(std::size_t count, const char* what, const char* rest)
     return std::to_string(count) + " " + what + (count == 1 ? "" : "s") + rest;
 }
 
+void requireKnown(std::uint32_t linkType)
+{
+    if (isKnownLinkType(linkType)) return;
+    throw CommandFailure(ExitStatus::Refused, "the capture has link type " + std::to_string(linkType) +
+                                                  ", which is not supported: capture Ethernet, Linux cooked, raw "
+                                                  "IP or loopback");
+}
+
 } // namespace
 
-CaptureDecoder::CaptureDecoder(std::istream& input, Sink sink) : mInput(input), mSink(std::move(sink)) {}
+CaptureDecoder::CaptureDecoder(std::istream& input, bool isPcapng, Sink sink)
+    : mInput(input), mIsPcapng(isPcapng), mSink(std::move(sink))
+{}
 
 void CaptureDecoder::run()
 {
-    PcapReader reader(mInput);
-    if (!isKnownLinkType(reader.linkType())) {
-        throw CommandFailure(ExitStatus::Refused, "the capture has link type " + std::to_string(reader.linkType()) +
-                                                      ", which is not supported: capture Ethernet, Linux cooked, raw "
-                                                      "IP or loopback");
-    }
-    std::string packet;
-    while (reader.next(packet)) {
-        if (const auto segment = tcpSegmentOf(reader.linkType(), packet)) {
-            pTake(*segment);
-        } else {
-            ++mOtherPackets;
-        }
+    if (mIsPcapng) {
+        PcapngReader reader(mInput);
+        std::uint32_t linkType = 0;
+        for (std::string packet; reader.next(linkType, packet);)
+            pTakePacket(linkType, packet);
+    } else {
+        PcapReader reader(mInput);
+        requireKnown(reader.linkType());
+        for (std::string packet; reader.next(packet);)
+            pTakePacket(reader.linkType(), packet);
     }
     for (auto& entry : mDirections)
         pFinish(entry.first, entry.second);
@@ -74,6 +82,16 @@ std::string CaptureDecoder::skipped() const
     add(count(Content::Tls), "stream", " from where TLS begins");
     add(count(Content::Other), "stream", " from where no frame follows");
     return text;
+}
+
+void CaptureDecoder::pTakePacket(std::uint32_t linkType, const std::string& packet)
+{
+    requireKnown(linkType);
+    if (const auto segment = tcpSegmentOf(linkType, packet)) {
+        pTake(*segment);
+    } else {
+        ++mOtherPackets;
+    }
 }
 
 void CaptureDecoder::pTake(const TcpSegment& segment)

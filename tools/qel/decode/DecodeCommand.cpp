@@ -126,9 +126,9 @@ void decodeBytes(std::istream& bytes, Report& report)
     }
 }
 
-void decodeCapture(std::istream& capture, Report& report)
+void decodeCapture(std::istream& capture, bool isPcapng, Report& report)
 {
-    CaptureDecoder decoder(capture, [&report](const FrameDecoder::Item& item) { report.add(item); });
+    CaptureDecoder decoder(capture, isPcapng, [&report](const FrameDecoder::Item& item) { report.add(item); });
     try {
         decoder.run();
     } catch (const CommandFailure& failure) {
@@ -151,11 +151,9 @@ void decodeGuessed(std::istream& input, Report& report)
 {
     PrefixedInput buffer(input, PcapReader::kMagicBytes);
     std::istream bytes(&buffer);
-    if (PcapReader::isPcap(buffer.prefix())) {
-        decodeCapture(bytes, report);
-    } else if (PcapReader::isPcapng(buffer.prefix())) {
-        report.refuse("the input is a capture in pcapng form, which is not supported: convert it to pcap, for example "
-                      "with \"tshark -F pcap -r IN -w OUT\"");
+    const bool isPcapng = PcapReader::isPcapng(buffer.prefix());
+    if (isPcapng || PcapReader::isPcap(buffer.prefix())) {
+        decodeCapture(bytes, isPcapng, report);
     } else if (looksLikeHexText(bytes)) {
         decodeHexText(bytes, report);
     } else {
@@ -206,7 +204,7 @@ CLI::App& addDecodeCommand(CLI::App& parent, Action& action)
     const auto options = std::make_shared<DecodeOptions>();
     command
         .add_option("file", options->file,
-                    "The file; - is standard input. Raw frames, a pcap capture, or hexadecimal text")
+                    "The file; - is standard input. Raw frames, a pcap or pcapng capture, or hexadecimal text")
         ->type_name("FILE")
         ->capture_default_str()
         ->check(CLI::Validator(checkInput, ""));

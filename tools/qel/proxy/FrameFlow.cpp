@@ -124,13 +124,17 @@ void FrameFlow::pPassOther(TimePoint now)
     if (mHolds && mEnd > mParsed) {
         pFlushHeld(now, true);
         pFlushJoined(now);
-        pQueue(std::string(mInput.data() + mParsed, mEnd - mParsed), pDueAfter({}, now), false);
+        pQueue({mInput.data() + mParsed, mEnd - mParsed}, pDueAfter({}, now), false);
     }
     mParsed = mEnd;
 }
 
 void FrameFlow::pPass(const FrameView& frame, TimePoint now)
 {
+    if (!mHeld && mJoined.empty() && !pIsMeant(frame)) {
+        pQueue({frame.bytes(), frame.length()}, pDueAfter({}, now), false);
+        return;
+    }
     Outgoing outgoing = pApplyRules(frame);
     const FaultRule* const after = outgoing.after;
     if (outgoing.instead != nullptr) {
@@ -145,6 +149,13 @@ void FrameFlow::pPass(const FrameView& frame, TimePoint now)
     pFlushHeld(now, true);
     pFlushJoined(now);
     pQueueAction(*after, mFrames);
+}
+
+/// Whether a rule matches the frame.
+bool FrameFlow::pIsMeant(const FrameView& frame) const noexcept
+{
+    return std::any_of(mRules.begin(), mRules.end(),
+                       [&](const RuleState& state) { return state.rule->match.matchesFrame(frame, mFrames); });
 }
 
 /// A frame that is held back leaves after the one that follows it.
@@ -187,7 +198,7 @@ void FrameFlow::pEmit(Outgoing&& outgoing, TimePoint now)
         if (outgoing.split != nullptr) {
             pSplit(outgoing, due, now);
         } else {
-            pQueue(std::string(outgoing.bytes), due, false);
+            pQueue(outgoing.bytes, due, false);
         }
     }
 }
@@ -200,7 +211,7 @@ void FrameFlow::pSplit(const Outgoing& outgoing, TimePoint due, TimePoint now)
     std::size_t begin = 0;
     const auto add = [&](std::size_t end) {
         if (end <= begin) return;
-        pQueue(outgoing.bytes.substr(begin, end - begin), due, true);
+        pQueue(std::string_view(outgoing.bytes).substr(begin, end - begin), due, true);
         if (pauses) due += rule.pause;
         begin = end;
     };
@@ -236,7 +247,7 @@ void FrameFlow::pFlushJoined(TimePoint now)
             joined.size() == 1 ? std::string("not joined: no frame followed in time")
                                : "joined with the " + std::to_string(joined.size() - 1) +
                                      " that followed into one write of " + std::to_string(bytes.size()) + " bytes");
-    pQueue(std::move(bytes), pDueAfter(delay, now), true);
+    pQueue(bytes, pDueAfter(delay, now), true);
 }
 
 /// Frames keep their order, so one that is delayed delays those after it.
@@ -246,7 +257,7 @@ FrameFlow::TimePoint FrameFlow::pDueAfter(FaultRule::Time delay, TimePoint now)
     return mLastDue > now ? mLastDue : TimePoint::min();
 }
 
-void FrameFlow::pQueue(std::string&& bytes, TimePoint due, bool isOwnWrite)
+void FrameFlow::pQueue(std::string_view bytes, TimePoint due, bool isOwnWrite)
 {
     mLastDue = std::max(mLastDue, due);
     mQueuedBytes += bytes.size();
@@ -258,7 +269,8 @@ void FrameFlow::pQueue(std::string&& bytes, TimePoint due, bool isOwnWrite)
         }
     }
     Chunk chunk;
-    chunk.bytes = std::move(bytes);
+    if (!isOwnWrite) chunk.bytes = std::exchange(mSpare, {}); // has room for the frames that follow
+    chunk.bytes.assign(bytes);
     chunk.due = due;
     chunk.takesMore = !isOwnWrite;
     mQueue.push_back(std::move(chunk));
@@ -379,6 +391,7 @@ void FrameFlow::pConsume(std::size_t count)
     mFrontSent += count;
     if (mFrontSent < mQueue.front().bytes.size()) return;
     mQueuedBytes -= mQueue.front().bytes.size();
+    mSpare = std::move(mQueue.front().bytes);
     mQueue.pop_front();
     mFrontSent = 0;
 }

@@ -136,6 +136,7 @@ private:
     void pPass(const FrameView& frame, TimePoint now);
 
     // The rules.
+    bool pIsMeant(const FrameView& frame) const noexcept;
     Outgoing pApplyRules(const FrameView& frame);
     void pApply(const FaultRule& rule, const FrameView& frame, Outgoing& outgoing);
     void pCorrupt(const FaultRule& rule, const FrameView& frame, Outgoing& outgoing);
@@ -148,7 +149,7 @@ private:
     void pJoin(Outgoing&& outgoing, TimePoint now);
     void pFlushHeld(TimePoint now, bool isLate);
     void pFlushJoined(TimePoint now);
-    void pQueue(std::string&& bytes, TimePoint due, bool isOwnWrite);
+    void pQueue(std::string_view bytes, TimePoint due, bool isOwnWrite);
     void pQueueAction(const FaultRule& rule, std::uint64_t number);
     TimePoint pDueAfter(FaultRule::Time delay, TimePoint now);
 
@@ -179,6 +180,7 @@ private:
     std::deque<Chunk> mQueue;
     std::size_t mFrontSent = 0; // bytes of the first chunk
     std::size_t mQueuedBytes = 0;
+    std::string mSpare; // of a chunk that has been sent: its memory is used again
     TimePoint mLastDue = TimePoint::min();
     std::optional<Outgoing> mHeld; // until the next frame
     TimePoint mHeldUntil = kNever;

@@ -154,6 +154,8 @@ void Proxy::pAccept(Socket& listener, TimePoint now)
 
 void Proxy::finish()
 {
+    for (ProxyOpening& opening : mOpenings)
+        mObserver.onRefused(opening.number(), opening.breakOff());
     mOpenings.clear();
     for (ProxyConnection& connection : mConnections)
         connection.abort("the proxy ends");

@@ -12,6 +12,7 @@
 #include "base/OptionChecks.hpp"
 #include "base/SignalWatch.hpp"
 #include "proxy/FrameLines.hpp"
+#include "proxy/PcapngWriter.hpp"
 #include "proxy/Proxy.hpp"
 #include "transport/TransportOptions.hpp"
 
@@ -59,6 +60,8 @@ struct ProxyInput {
     bool quiet = false;
     std::string stamps = "iso";
     std::vector<std::string> filters;
+    std::string capture;
+    std::string capturedSides = "server";
     LogOptions log;
 };
 
@@ -151,6 +154,28 @@ void addOutputOptions(CLI::App& command, ProxyInput& input)
                     "repeated")
         ->type_name("MATCH")
         ->allow_extra_args(false);
+}
+
+void addCaptureOptions(CLI::App& command, ProxyInput& input)
+{
+    CLI::Option* const file =
+        command
+            .add_option("--write", input.capture,
+                        "Write what passes to this file, as a capture in pcapng form; TLS is decrypted")
+            ->type_name("FILE");
+    command
+        .add_option("--write-side", input.capturedSides,
+                    "Which connections the capture holds: those with the server, with the consoles, or both")
+        ->type_name("server|console|both")
+        ->check(oneOf({"server", "console", "both"}))
+        ->capture_default_str()
+        ->needs(file);
+}
+
+CapturedSides sidesOf(const std::string& text)
+{
+    if (text == "both") return CapturedSides::Both;
+    return text == "console" ? CapturedSides::Console : CapturedSides::Server;
 }
 
 TimeStamps::Style styleOf(const std::string& text)
@@ -273,13 +298,71 @@ void printLines(const std::string& lines)
     flushOutput();
 }
 
+/// Tells the lines, and the capture if there is one.
+class Listeners final : public ProxyObserver {
+public:
+    Listeners(FrameLines& lines, PcapngWriter* capture) : mLines(lines), mCapture(capture) {}
+
+    void onFrame(const FlowPlace& place, std::uint64_t number, const FrameView& frame) override
+    {
+        mLines.onFrame(place, number, frame);
+    }
+    void onFault(const FlowPlace& place, std::uint64_t number, const FaultRule& rule, const std::string& what) override
+    {
+        mLines.onFault(place, number, rule, what);
+        if (mCapture != nullptr) mCapture->onFault(place, number, rule, what);
+    }
+    void onNote(const FlowPlace& place, const std::string& text) override { mLines.onNote(place, text); }
+    void onOpened(std::uint64_t connection, const ProxyAddresses& addresses) override
+    {
+        mLines.onOpened(connection, addresses);
+        if (mCapture != nullptr) mCapture->onOpened(connection, addresses);
+    }
+    void onConnectionNote(std::uint64_t connection, const std::string& text) override
+    {
+        mLines.onConnectionNote(connection, text);
+    }
+    void onBytes(std::uint64_t connection, ProxySide side, Way way, std::string_view bytes) override
+    {
+        if (mCapture != nullptr) mCapture->onBytes(connection, side, way, bytes);
+    }
+    void onEnd(const FlowPlace& place) override
+    {
+        mLines.onEnd(place);
+        if (mCapture != nullptr) mCapture->onEnd(place);
+    }
+    void onClosed(std::uint64_t connection, const std::string& why, const FrameFlow& toServer,
+                  const FrameFlow& toConsole) override
+    {
+        mLines.onClosed(connection, why, toServer, toConsole);
+        if (mCapture != nullptr) mCapture->onClosed(connection, why, toServer, toConsole);
+    }
+    void onRefused(std::uint64_t connection, const std::string& why) override { mLines.onRefused(connection, why); }
+    void onIdle() override
+    {
+        mLines.onIdle();
+        if (mCapture == nullptr) return;
+        mCapture->onIdle();
+        const std::string failure = mCapture->takeFailure();
+        if (!failure.empty()) std::cerr << "qel: " << failure << std::endl;
+    }
+
+private:
+    FrameLines& mLines;
+    PcapngWriter* const mCapture;
+};
+
 ExitStatus runProxy(const ProxyPlan& plan)
 {
     startLogging(plan.input.log, "qel-proxy.log");
     static_cast<void>(std::signal(SIGPIPE, SIG_IGN)); // a reader of the lines that goes away is reported
     SignalWatch signals(kStopSignals);
     FrameLines lines(plan.lines, printLines);
-    Proxy proxy(optionsOf(plan), lines);
+    std::unique_ptr<PcapngWriter> capture;
+    if (!plan.input.capture.empty())
+        capture = std::make_unique<PcapngWriter>(plan.input.capture, sidesOf(plan.input.capturedSides));
+    Listeners listeners(lines, capture.get());
+    Proxy proxy(optionsOf(plan), listeners);
     if (!plan.faults.rules.empty() && !plan.input.seed)
         std::cerr << "qel: note: --seed " << plan.faults.seed << " repeats this run" << std::endl;
     lines.listening(proxy.endpoints(), plan.input.server, plan.faults.seed);
@@ -300,6 +383,7 @@ CLI::App& addProxyCommand(CLI::App& parent, Action& action)
     addSideOptions(command, *input);
     addFaultOptions(command, *input);
     addOutputOptions(command, *input);
+    addCaptureOptions(command, *input);
     input->log.usual = LogLevel::Error;
     input->log.quiet = true;
     addLogOptions(command, input->log);

@@ -34,12 +34,17 @@ ProxyOpening::ProxyOpening(std::uint64_t number, Socket console, const ProxyTarg
     pConnect();
 }
 
-ProxyOpening::~ProxyOpening()
+ProxyOpening::~ProxyOpening() { static_cast<void>(breakOff()); }
+
+std::string ProxyOpening::breakOff()
 {
-    if (!mThread.joinable()) return;
+    constexpr const char* kReason = "the proxy ends";
+    if (!mThread.joinable()) return kReason;
+    const bool hasFailed = mIsComplete;
     if (mConsole != nullptr) mConsole->cancel();
     if (mServer != nullptr) mServer->cancel();
     mThread.join();
+    return hasFailed && !mWhy.empty() ? mWhy : kReason;
 }
 
 /// Starts to connect to the next endpoint. Leaves no socket when there is none.
@@ -127,11 +132,11 @@ void ProxyOpening::pProtect()
     } catch (const std::exception& error) {
         mWhy = userMessage(error);
     }
+    mIsComplete = true; // what is left takes no time: the message finds room
     try {
         if (mayTellConsole && !mWhy.empty()) abortHandshake(mConsole->clear());
     } catch (const std::exception&) { // it is gone too
     }
-    mIsComplete = true;
     mDone.interrupt();
 }
 

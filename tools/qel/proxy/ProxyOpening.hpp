@@ -47,6 +47,9 @@ public:
     ProxyOpening(const ProxyOpening&) = delete;
     ProxyOpening& operator=(const ProxyOpening&) = delete;
 
+    /// Ends it. @return why it does not come about, in one line
+    std::string breakOff();
+
     std::uint64_t number() const noexcept { return mNumber; }
 
     /// Goes on as far as it does without waiting.
