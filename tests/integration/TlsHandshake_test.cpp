@@ -52,46 +52,48 @@ TEST_F(Tls, ATlsConsoleIsRefusedByAPlainServer)
                 HasSubstr("(W): [qel] console 1: closed, it asked for TLS, which is not done here\n"));
 }
 
-TEST_F(Tls, RefusesTlsInsideTls)
+// Consoles that go wrong on the way to TLS and inside it: cases of "qel check", and what the server logs about them.
+
+class TlsCase : public Tls {
+protected:
+    /// Runs one case, which must hold.
+    void expectHolds(const ServeProcess& server, const std::string& id) const
+    {
+        const auto result =
+            runQel(Arguments{"check", "server", "--connect", server.endpoint(), "--only", id, "--timeout", "20"} +
+                   directory.options("client"));
+        EXPECT_EQ(result.exitStatus, 0) << result.output;
+        EXPECT_THAT(result.output, HasSubstr("ok       " + id + "\n"));
+    }
+};
+
+TEST_F(TlsCase, RefusesTlsInsideTls)
 {
     const auto server = serve();
-    TlsConsole console(server->endpoint());
-    console.comeIn("a");
-    console.messages().send(QelMessageUpgradeConnectionAsync());
-    EXPECT_EQ(console.messages().receive()->getOperation(), kAbort);
-    EXPECT_TRUE(console.isClosed());
-    server->stop();
+    expectHolds(*server, "tls/inside/upgrade");
+    EXPECT_THAT(server->stop().errors, HasSubstr("closed, it asked for TLS, which is not done here\n"));
 }
 
-// Consoles that go wrong before TLS.
-
-TEST_F(Tls, IgnoresMessagesInTheClearInsteadOfTls)
+TEST_F(TlsCase, IgnoresMessagesInTheClearInsteadOfTls)
 {
     const auto server = serve();
-    TlsConsole console(server->endpoint());
-    console.ask();
-    ASSERT_EQ(console.takeAnswer(), kUpgrade);
-    console.sendBytes(frameOf(QelMessageGetEnclTypeAndInterfaceVersionReq(1, 1, 1, 0, "a")));
-    EXPECT_TRUE(console.isClosed());
+    expectHolds(*server, "tls/upgrade/clear-after-answer");
     EXPECT_THAT(server->stop().errors, AllOf(HasSubstr(": refused: the TLS handshake failed: SSL error 1\n"),
                                              Not(HasSubstr("console 1 connected"))));
 }
 
-TEST_F(Tls, IgnoresMessagesInTheClearAfterTheRequestForTls)
+TEST_F(TlsCase, IgnoresMessagesInTheClearAfterTheRequestForTls)
 {
     const auto server = serve();
-    TlsConsole console(server->endpoint());
-    console.sendBytes(frameOf(QelMessageUpgradeConnectionAsync()) +
-                      frameOf(QelMessageGetEnclTypeAndInterfaceVersionReq(1, 1, 1, 0, "a")));
-    server->process().awaitErrors(": refused: the peer sent data too early in the handshake\n");
-    EXPECT_THAT(server->stop().errors, Not(HasSubstr("console 1 connected")));
+    expectHolds(*server, "tls/upgrade/data-before-answer");
+    EXPECT_THAT(server->stop().errors, AllOf(HasSubstr(": refused: the peer sent data too early in the handshake\n"),
+                                             Not(HasSubstr("console 1 connected"))));
 }
 
-TEST_F(Tls, RefusesTlsWithoutARequest)
+TEST_F(TlsCase, RefusesTlsWithoutARequest)
 {
     const auto server = serve();
-    TlsConsole console(server->endpoint());
-    EXPECT_THROW(console.startTls(Authority::trusted().clientCredentials()), StreamIOException);
+    expectHolds(*server, "tls/first/tls-without-asking");
     EXPECT_THAT(server->stop().errors, HasSubstr(": refused: the peer did not ask for TLS but sent something "
                                                  "else: Invalid length\n"));
 }

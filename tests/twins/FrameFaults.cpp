@@ -129,7 +129,7 @@ std::vector<Fault> endFaults()
     Fault none;
     none.name = "ends-for-good-after-a-disturbance";
     none.mostConnections = 5;
-    none.only = {"robust/many/noise", "robust/many/reset"};
+    none.only = {"robust/many/noise", "robust/many/reset", "robust/every-byte/*"};
     Fault single;
     single.name = "serves-one-connection-in-all";
     single.mostConnections = 1;

@@ -147,6 +147,39 @@ Cases manyCases()
     };
 }
 
+/// A case that sends the version request once for each of its bytes, spoilt at this byte, on a connection of its own.
+Case atEveryByte(const char* name, const char* requirement, std::function<std::string(std::string, std::size_t)> spoil)
+{
+    return {std::string("robust/every-byte/") + name,
+            requirement,
+            kAnswered,
+            Level::Robust,
+            kShared,
+            [spoil = std::move(spoil)](Trial& trial) {
+                const std::string frame = versionRequest(trial.toolType(), trial.newToolId()).bytes();
+                for (std::size_t at = 0; at < frame.size(); ++at) {
+                    Wire& wire = trial.connect();
+                    wire.send(spoil(frame, at));
+                    wire.endSending();
+                    wire.expectEnd();
+                }
+                trial.console().fence();
+            }};
+}
+
+Cases everyByteCases()
+{
+    return {
+        atEveryByte("cut", "A version request that is cut at any of its bytes ends its own connection only.",
+                    [](const std::string& frame, std::size_t at) { return frame.substr(0, at); }),
+        atEveryByte("corrupt", "A version request with any of its bytes inverted does no harm to others.",
+                    [](std::string frame, std::size_t at) {
+                        frame[at] = static_cast<char>(~frame[at]);
+                        return frame;
+                    }),
+    };
+}
+
 /// Tries until the status is 0: the peer notices a reset connection in its own time.
 void untilGranted(Trial& trial, Wire& wire, const Draft& request, unsigned int refusal)
 {
@@ -276,6 +309,6 @@ Cases limitCases()
 
 } // namespace
 
-Cases robustCases() { return joined(floodCases, manyCases, resetCases, deadlineCases, limitCases); }
+Cases robustCases() { return joined(floodCases, manyCases, everyByteCases, resetCases, deadlineCases, limitCases); }
 
 } // namespace qel::tool::check
