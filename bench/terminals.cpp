@@ -6,6 +6,7 @@
 
 #include <algorithm>
 #include <chrono>
+#include <csignal>
 #include <cstddef>
 #include <cstdio>
 #include <cstdlib>
@@ -139,12 +140,11 @@ Use useOf(const test::Process& server)
     return {static_cast<double>(server.residentBytes()), threads};
 }
 
-/// Of a server whose consoles send each other 20 messages a second.
+/// Of a server whose consoles send each other 20 messages a second in all.
 Use useWith(QelServer& server, unsigned int consoles, const Plan& plan)
 {
-    const double seconds = std::chrono::duration<double>(plan.settle).count() * 2;
     test::Process bench(server.client("bench", {"--json", "--connections", std::to_string(consoles), "--size", "64",
-                                                "--rate", "20", "--seconds", std::to_string(seconds)}));
+                                                "--rate", "20", "--seconds", "60"}));
     const auto giveUp = std::chrono::steady_clock::now() + std::chrono::seconds(20);
     while (useOf(server.process()).threads < 2 * consoles) { // two for each console
         if (std::chrono::steady_clock::now() > giveUp) throw std::runtime_error("the consoles do not connect");
@@ -152,9 +152,9 @@ Use useWith(QelServer& server, unsigned int consoles, const Plan& plan)
     }
     std::this_thread::sleep_for(plan.settle);
     const Use use = useOf(server.process());
-    const test::Process::Result result = bench.wait();
+    bench.signal(SIGINT);
+    bench.wait();
     checkNotStopped();
-    if (result.exitStatus != 0) throw std::runtime_error("qel bench: " + result.errors);
     return use;
 }
 
@@ -234,7 +234,7 @@ void measureAll(const Plan& plan)
         besideOthers(plan, true, onAllCores);
         manyAtOnce(plan);
     }
-    std::printf("memory of the server for a console that sends 20 messages a second\n");
+    std::printf("memory of the server for a console, of %u that send 20 messages a second in all\n", plan.manyConsoles);
     memoryOfConsoles("plain", QelServer::Protection::Plain, 48, plan);
     memoryOfConsoles("TLS", QelServer::Protection::Tls, 124, plan);
     memoryOfPartitions(plan);
