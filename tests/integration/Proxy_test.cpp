@@ -107,6 +107,32 @@ TEST(ProxyProgram, WritesACaptureThatDecodeReads)
     EXPECT_EQ(nlohmann::json::parse(decoded.output)["frames"].size(), 4U);
 }
 
+TEST(ProxyProgram, ReplaysARecordingAndComparesTheAnswers)
+{
+    const TemporaryDirectory directory;
+    const std::string file = directory.file("capture.pcapng");
+    ServeProcess server;
+    ProxyProcess proxy(server.endpoint(), {"--write", file});
+    EXPECT_EQ(callThrough(proxy, "time").exitStatus, 0);
+    EXPECT_EQ(callThrough(proxy, "limits").exitStatus, 0);
+    proxy.stop();
+    const auto replay = [&](const ServeProcess& to) {
+        return runQel({"proxy", "--replay", file, "--plain", "--connect", to.endpoint()});
+    };
+    const Process::Result same = replay(server);
+    EXPECT_EQ(same.exitStatus, 0);
+    EXPECT_EQ(same.output, "frame 2 response op=GetEnclTypeAndInterfaceVersion: as recorded\n"
+                           "frame 4 response op=GetQelTod: as recorded\n"
+                           "frame 2 response op=GetEnclTypeAndInterfaceVersion: as recorded\n"
+                           "frame 4 response op=GetInterfaceImplementationLimits: as recorded\n"
+                           "sent 4, answers compared 4, different 0; notices recorded 0, seen 0\n");
+    ServeProcess other({"--system-serial", "other"});
+    const Process::Result different = replay(other);
+    EXPECT_EQ(different.exitStatus, 1);
+    EXPECT_THAT(different.output,
+                HasSubstr("frame 2 response op=GetEnclTypeAndInterfaceVersion: payload differs from byte "));
+}
+
 TEST(ProxyProgram, JsonLinesAreObjects)
 {
     ServeProcess server;

@@ -14,6 +14,7 @@
 #include "proxy/FrameLines.hpp"
 #include "proxy/PcapngWriter.hpp"
 #include "proxy/Proxy.hpp"
+#include "proxy/ReplayRun.hpp"
 #include "transport/TransportOptions.hpp"
 
 #include <algorithm>
@@ -62,6 +63,8 @@ struct ProxyInput {
     std::vector<std::string> filters;
     std::string capture;
     std::string capturedSides = "server";
+    std::string recording;
+    double answerSeconds = 10;
     LogOptions log;
 };
 
@@ -172,6 +175,26 @@ void addCaptureOptions(CLI::App& command, ProxyInput& input)
         ->needs(file);
 }
 
+void addReplayOptions(CLI::App& command, ProxyInput& input)
+{
+    CLI::Option* const replay =
+        command
+            .add_option(
+                "--replay", input.recording,
+                "Instead of listening: send the console's frames of this recording to the server and compare its "
+                "answers. A capture, raw frames or hexadecimal text")
+            ->type_name("FILE")
+            ->check(fileValidator());
+    for (const char* name : {"listen", "pass-through", "console-credentials", "console-peer-name", "console-plain",
+                             "server-plain", "fault", "faults", "seed", "filter", "write", "dump", "quiet"})
+        replay->excludes(findOption(command, name));
+    command.add_option("--answer-timeout", input.answerSeconds, "With --replay: seconds for each answer")
+        ->type_name("SECONDS")
+        ->check(numberIn(0.001, 86400))
+        ->capture_default_str()
+        ->needs(replay);
+}
+
 CapturedSides sidesOf(const std::string& text)
 {
     if (text == "both") return CapturedSides::Both;
@@ -262,6 +285,19 @@ ProxyPlan planOf(const ProxyInput& input)
     plan.lines.quiet = input.quiet;
     plan.lines.stamps = styleOf(input.stamps);
     planTransport(plan);
+    return plan;
+}
+
+ReplayPlan replayOf(const ProxyInput& input)
+{
+    checkLoopback(input, false, input.transport.plain);
+    ReplayPlan plan;
+    plan.file = input.recording;
+    plan.server = input.server;
+    plan.transport = input.transport;
+    plan.timeout =
+        std::chrono::duration_cast<std::chrono::milliseconds>(std::chrono::duration<double>(input.answerSeconds));
+    plan.json = input.json;
     return plan;
 }
 
@@ -384,10 +420,21 @@ CLI::App& addProxyCommand(CLI::App& parent, Action& action)
     addFaultOptions(command, *input);
     addOutputOptions(command, *input);
     addCaptureOptions(command, *input);
+    addReplayOptions(command, *input);
     input->log.usual = LogLevel::Error;
     input->log.quiet = true;
     addLogOptions(command, input->log);
-    command.callback([&action, input] { action = [plan = planOf(*input)] { return runProxy(plan); }; });
+    command.callback([&action, input] {
+        if (input->recording.empty()) {
+            action = [plan = planOf(*input)] { return runProxy(plan); };
+        } else {
+            checkCredentials(input->transport);
+            action = [plan = replayOf(*input), log = input->log] {
+                startLogging(log, "qel-proxy.log");
+                return runReplay(plan);
+            };
+        }
+    });
     return command;
 }
 
