@@ -14,7 +14,7 @@
 
 namespace qel::bench {
 
-/// Keeps the cores that the caller does not use busy with work that gives way to any other, for as long as it exists.
+/// Keeps the cores that the caller does not use busy with work of low priority, for as long as it exists.
 ///
 /// The system moves the bytes of a pseudo-terminal with threads of its own. Where another core is idle, it wakes that
 /// one for it, and how long this takes depends on how deep it sleeps, not on the programs that are measured.
