@@ -5,6 +5,7 @@
 
 #include <cstring>
 #include <memory>
+#include <stdexcept>
 #include <string>
 #include <vector>
 
@@ -66,6 +67,7 @@ public:
         while (taken < bytes.size()) {
             std::size_t room = 0;
             char* const buffer = flow.room(room);
+            if (room == 0) throw std::logic_error("the flow has no room");
             const std::size_t count = std::min(room, bytes.size() - taken);
             std::memcpy(buffer, bytes.data() + taken, count);
             flow.take(count, time(at));
