@@ -1,10 +1,13 @@
 // The status socket and the thread that serves it, with clients that mean no good.
 
+#include <qel/common/util/Poll.hpp>
+
 #include "base/Failures.hpp"
 #include "status/StatusClient.hpp"
 #include "status/StatusServer.hpp"
 #include "support/CapturedLog.hpp"
 #include "support/ComesTrue.hpp"
+#include "support/Loopback.hpp"
 #include "support/TemporaryDirectory.hpp"
 
 #include <array>
@@ -64,6 +67,10 @@ public:
         return ::send(mFd.get(), bytes.data(), bytes.size(), MSG_NOSIGNAL) == static_cast<ssize_t>(bytes.size());
     }
     void endSending() const { ::shutdown(mFd.get(), SHUT_WR); }
+    bool hears(std::chrono::milliseconds time) const
+    {
+        return PollSet(PollFd(mFd.get(), PollEvents::Read)).wait(time).anyReady();
+    }
 
     /// What comes until the end, or until the server cuts the connection.
     std::string receive() const
@@ -318,6 +325,26 @@ TEST_F(StatusServerTest, LogsWhatAHandlerThrowsAndGoesOn)
     EXPECT_EQ(ask("bad"), "");
     EXPECT_EQ(ask("good"), "good\n");
     EXPECT_THAT(log.lines(), testing::ElementsAre(HasSubstr("status socket: out of order")));
+}
+
+/// The lowest number of a descriptor that is free.
+rlim_t firstFree() { return static_cast<rlim_t>(UniqueFd(::dup(STDIN_FILENO)).get()); }
+
+TEST_F(StatusServerTest, LogsOnceThatItCannotAcceptUntilItCanAgain)
+{
+    serve();
+    for (int times = 1; times <= 2; ++times) {
+        {
+            const NoMoreDescriptors none(firstFree() + 1); // for the client alone
+            const Client waits(path);
+            EXPECT_TRUE(waits.send("well\n"));
+            EXPECT_FALSE(waits.hears(std::chrono::milliseconds(350))); // the server tries it every 100 ms
+        }
+        EXPECT_EQ(ask(), answer());
+        EXPECT_EQ(log.lines().size(), static_cast<std::size_t>(times));
+    }
+    EXPECT_THAT(log.lines(),
+                testing::Each("E: [qel] status socket: cannot accept a connection: 24 (Too many open files)"));
 }
 
 // The client against servers that are not what they should be.

@@ -77,9 +77,12 @@ void ServeReload::pApply(const ServePlan& next)
     for (const auto& entry : next.partitions)
         made.emplace_back(entry.first, makePartition(entry.first, entry.second, mPlan.term, mLogs));
     pLogSettings(next);
-    // Before the partitions: whatever happens to them, nobody may do what the file no longer allows. And changing them
-    // takes the server's lock: what it was about to allow by the old rules is known to the machine when sessions are
-    // ended.
+    // Before the rules: they are for the lines of the file, and would open the old line of a partition to those who may
+    // use the new one.
+    pRemovePartitions(next.partitions);
+    // Before the other partitions: whatever happens to them, nobody may do what the file no longer allows. And changing
+    // them takes the server's lock: what it was about to allow by the old rules is known to the machine when sessions
+    // are ended.
     mMachine.setPolicy(next.policy);
     mPlan.policy = next.policy;
     mPlan.warnExpiry = next.warnExpiry;
@@ -88,17 +91,21 @@ void ServeReload::pApply(const ServePlan& next)
             countText(next.policy.rules.size(), "rule"), ", ", countText(pEndForbiddenSessions(), "session"), " ended");
 }
 
-/// A partition whose line has changed is removed and added. One that fails is logged, and the others are applied; the
-/// next SIGHUP tries it again.
-void ServeReload::pApplyPartitions(const std::map<std::uint16_t, PlannedPartition>& next, MadeLines made)
+/// One whose line has changed is removed too, and added later.
+void ServeReload::pRemovePartitions(const std::map<std::uint16_t, PlannedPartition>& next)
 {
     const std::map<std::uint16_t, PlannedPartition> before = mPlan.partitions;
     for (const auto& entry : before) {
         const auto kept = next.find(entry.first);
         if (kept != next.end() && kept->second.line == entry.second.line) continue;
-        if (mServer.removePartition(entry.first)) logLine(LogLevel::Info, "partition ", entry.first, ": removed");
+        mServer.removePartition(entry.first);
         mPlan.partitions.erase(entry.first);
     }
+}
+
+/// One that fails is logged, and the others are applied; the next SIGHUP tries it again.
+void ServeReload::pApplyPartitions(const std::map<std::uint16_t, PlannedPartition>& next, MadeLines made)
+{
     for (auto& entry : made) {
         try {
             pApplyPartition(entry.first, std::move(entry.second));
@@ -114,7 +121,6 @@ void ServeReload::pApplyPartition(std::uint16_t id, MadeLine made)
 {
     if (mPlan.partitions.count(id) != 0) return static_cast<void>(mServer.changePartition(id, made.options));
     mServer.addPartition(id, std::move(made.line), made.options);
-    logLine(LogLevel::Info, "partition ", id, ": added");
 }
 
 /// @return how many sessions were ended

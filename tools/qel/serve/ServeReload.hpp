@@ -44,6 +44,7 @@ private:
     using MadeLines = std::vector<std::pair<std::uint16_t, MadeLine>>;
 
     void pApply(const ServePlan& next);
+    void pRemovePartitions(const std::map<std::uint16_t, PlannedPartition>& next);
     void pApplyPartitions(const std::map<std::uint16_t, PlannedPartition>& next, MadeLines made);
     void pApplyPartition(std::uint16_t id, MadeLine made);
     std::size_t pEndForbiddenSessions();

@@ -51,10 +51,11 @@ void StatusServer::pRun() noexcept
     for (;;) {
         try {
             if (pRunOnce()) return;
+            mIsFailing = false;
         } catch (const std::exception& error) {
             mClients.clear();
-            try {
-                logLine(LogLevel::Error, "status socket: ", explain(error));
+            try { // not each attempt: without descriptors that may go on for long
+                if (!std::exchange(mIsFailing, true)) logLine(LogLevel::Error, "status socket: ", explain(error));
             } catch (...) { // NOLINT(bugprone-empty-catch): without memory nothing can be said
             }
             ::usleep(std::chrono::microseconds(kPauseAfterFailure).count());

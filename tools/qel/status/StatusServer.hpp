@@ -65,6 +65,7 @@ private:
     const Handler mHandler;
     WakeUp mStop;
     std::list<Client> mClients; ///< of the thread, oldest first
+    bool mIsFailing = false;    ///< of the thread: the last turn has failed
     std::thread mThread;
 };
 
