@@ -105,6 +105,24 @@ TEST_F(ServiceManagerTest, OneThatDoesNotReadHoldsNothingUp)
     EXPECT_EQ(socket.take(), "WATCHDOG=1");
 }
 
+TEST_F(ServiceManagerTest, HearsWithTheNextBeatWhatFoundNoRoom)
+{
+    const DatagramSocket socket(path);
+    ServiceManager manager(path, microseconds(0));
+    while (log.lines().empty()) // until there is no room
+        manager.feedWatchdog();
+    manager.ready("too early");
+    manager.ready("serving");
+    for (std::string message = "WATCHDOG=1"; !message.empty(); message = socket.take())
+        EXPECT_EQ(message, "WATCHDOG=1");
+    manager.feedWatchdog();
+    manager.feedWatchdog();
+    EXPECT_EQ(socket.take(), "READY=1\nSTATUS=serving");
+    EXPECT_EQ(socket.take(), "WATCHDOG=1");
+    EXPECT_EQ(socket.take(), "WATCHDOG=1");
+    EXPECT_EQ(socket.take(), "");
+}
+
 TEST_F(ServiceManagerTest, IsReadFromTheVariables)
 {
     const Variables variables(Values{{"NOTIFY_SOCKET", path}, {"WATCHDOG_USEC", "30000000"}});

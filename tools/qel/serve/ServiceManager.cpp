@@ -101,32 +101,51 @@ ServiceManager::ServiceManager(const std::string& address, std::chrono::microsec
     if (mSocket.get() < 0) logLine(LogLevel::Warn, "the service manager is not told anything: ", PosixErrorCode(error));
 }
 
-void ServiceManager::ready(const std::string& status) { pSend("READY=1\nSTATUS=" + oneLine(status)); }
+void ServiceManager::ready(const std::string& status) { pTell("READY=1\nSTATUS=" + oneLine(status)); }
 
 void ServiceManager::reloading()
 {
     const auto now = std::chrono::duration_cast<std::chrono::microseconds>(TimeProvider::steady().time_since_epoch());
-    pSend("RELOADING=1\nMONOTONIC_USEC=" + std::to_string(now.count()));
+    pTell("RELOADING=1\nMONOTONIC_USEC=" + std::to_string(now.count()));
 }
 
-void ServiceManager::stopping() { pSend("STOPPING=1\nSTATUS=stopping"); }
+void ServiceManager::stopping() { pTell("STOPPING=1\nSTATUS=stopping"); }
 
-void ServiceManager::feedWatchdog() { pSend("WATCHDOG=1"); }
-
-void ServiceManager::pSend(const std::string& message) noexcept
+void ServiceManager::feedWatchdog()
 {
-    if (mSocket.get() < 0) return;
+    pTellOwed();
+    static_cast<void>(pSend("WATCHDOG=1"));
+}
+
+/// A manager that has not heard that the server is ready ends it after a time.
+void ServiceManager::pTell(std::string message)
+{
+    mOwed = std::move(message);
+    pTellOwed();
+}
+
+void ServiceManager::pTellOwed() noexcept
+{
+    if (!mOwed.empty() && pSend(mOwed)) mOwed.clear();
+}
+
+/// @return whether the manager has taken it
+bool ServiceManager::pSend(const std::string& message) noexcept
+{
+    if (mSocket.get() < 0) return false;
     const auto* const to = reinterpret_cast<const sockaddr*>(&mTo);
     ssize_t sent = -1;
     do {
         sent = ::sendto(mSocket.get(), message.data(), message.size(), MSG_NOSIGNAL, to, mToLength);
     } while (sent < 0 && errno == EINTR);
     const int error = errno;
-    if (sent >= 0 || std::exchange(mHasFailed, true)) return;
+    if (sent >= 0) return true;
+    if (std::exchange(mHasFailed, true)) return false;
     try {
         logLine(LogLevel::Warn, "cannot notify the service manager at ", quoted(mAddress), ": ", PosixErrorCode(error));
     } catch (const std::exception&) { // NOLINT(bugprone-empty-catch): a line of the log is not worth more
     }
+    return false;
 }
 
 std::vector<UniqueFd> takeHandedSockets()

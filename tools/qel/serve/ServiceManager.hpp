@@ -15,7 +15,8 @@ namespace qel::tool {
 /// The program that manages this one as a service, such as systemd: is told in datagrams when the server is ready,
 /// reloads, stops, and that it is alive. Without such a program every operation does nothing.
 ///
-/// No operation waits or throws: what the manager does not take is lost, and the first loss is logged.
+/// No operation waits. The newest state that the manager has not taken is told again with the next feedWatchdog();
+/// otherwise what it does not take is lost. The first time is logged.
 /// Thread safety: one thread.
 class ServiceManager {
 public:
@@ -42,13 +43,16 @@ public:
     void feedWatchdog();
 
 private:
-    void pSend(const std::string& message) noexcept;
+    void pTell(std::string message);
+    void pTellOwed() noexcept;
+    bool pSend(const std::string& message) noexcept;
 
     std::string mAddress;
     std::chrono::microseconds mWatchdog;
     sockaddr_un mTo{};
     socklen_t mToLength = 0;
-    UniqueFd mSocket; ///< none: there is no manager
+    UniqueFd mSocket;  ///< none: there is no manager
+    std::string mOwed; ///< the newest state, while the manager has not taken it
     bool mHasFailed = false;
 };
 
