@@ -25,15 +25,18 @@ class ActivatedServer {
 public:
     explicit ActivatedServer(const std::vector<int>& sockets, const std::string& count,
                              const std::vector<std::string>& options = {"--plain"})
-        : mProcess(pCommand(options), {{"LISTEN_FDS", count}}, sockets)
+        : mProcess(pCommand(sockets.empty(), options), {{"LISTEN_FDS", count}}, sockets)
     {}
 
     Process& process() { return mProcess; }
 
 private:
-    static std::vector<std::string> pCommand(const std::vector<std::string>& options)
+    static std::vector<std::string> pCommand(bool hasNone, const std::vector<std::string>& options)
     {
-        std::vector<std::string> command{"/bin/sh", "-c", "LISTEN_PID=$$; export LISTEN_PID; exec \"$@\"", "sh"};
+        // Whoever runs the tests may have left a descriptor 3 to them.
+        const std::string close = hasNone ? "exec 3<&-; " : "";
+        std::vector<std::string> command{"/bin/sh", "-c", close + "LISTEN_PID=$$; export LISTEN_PID; exec \"$@\"",
+                                         "sh"};
         const std::vector<std::string> serve = qelCommand({"serve"});
         command.insert(command.end(), serve.begin(), serve.end());
         command.insert(command.end(), options.begin(), options.end());

@@ -149,7 +149,14 @@ void Process::closeInput()
     mInput = -1;
 }
 
-void Process::signal(int number) const { ::kill(mPid, number); }
+void Process::signal(int number) const
+{
+    ::kill(mPid, number);
+    if (number != SIGSTOP) return;
+    siginfo_t info{};
+    while (::waitid(P_PID, static_cast<id_t>(mPid), &info, WSTOPPED | WNOWAIT) != 0 && errno == EINTR) {
+    }
+}
 
 std::string Process::output() const
 {

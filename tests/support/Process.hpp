@@ -44,6 +44,7 @@ public:
     void writeInput(const std::string& bytes);
     void closeInput();
 
+    /// Sends a signal. With SIGSTOP it returns when all threads of the process have stopped.
     void signal(int number) const;
 
     /// What it has written so far.

@@ -71,7 +71,9 @@ TEST_F(ServerStateTest, NamesAConsoleAndCountsWhatItSentAndGot)
     EXPECT_GT(found.queue.sent.mBytes, 0U);
     EXPECT_EQ(found.queue.mostBytes, found.queue.sent.mBytes);
     EXPECT_EQ(found.queue.pending.mCount, 0U);
-    EXPECT_EQ(found.queue.latency.getCounts().at(0), 1U);
+    const auto& classes = found.queue.latency.getCounts();
+    EXPECT_EQ(std::accumulate(classes.begin(), classes.end(), std::uint64_t{0}),
+              1U); // in which one, the machine decides
     EXPECT_EQ(state.accepted, 1U);
     EXPECT_EQ(state.received.mBytes, request);
 }
