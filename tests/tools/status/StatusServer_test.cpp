@@ -332,6 +332,9 @@ rlim_t firstFree() { return static_cast<rlim_t>(UniqueFd(::dup(STDIN_FILENO)).ge
 
 TEST_F(StatusServerTest, LogsOnceThatItCannotAcceptUntilItCanAgain)
 {
+#ifdef QEL_SANITIZES_UNDEFINED
+    GTEST_SKIP() << "the sanitizer needs descriptors for its check of object types and sees errors without them";
+#endif
     serve();
     for (int times = 1; times <= 2; ++times) {
         {
