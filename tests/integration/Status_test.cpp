@@ -134,7 +134,7 @@ TEST_F(StatusTest, ServersOfAUserShareADefaultThatTheFirstOneHas)
     const std::map<std::string, std::string> environment{{"XDG_RUNTIME_DIR", directory.path()}};
     ServeProcess first({}, "127.0.0.1:0", {"--plain"}, environment);
     ServeProcess second({}, "127.0.0.1:0", {"--plain"}, environment);
-    EXPECT_THAT(second.process().errors(), HasSubstr("no status socket: cannot listen on "));
+    second.process().awaitErrors("no status socket: cannot listen on ");
     Process asks(qelCommand({"status", "--json"}), environment);
     EXPECT_EQ(Json::parse(asks.wait().output).at("listen").at(0), first.endpoint());
     const ServeProcess none({"--status-socket", "none"}, "127.0.0.1:0", {"--plain"}, environment);
