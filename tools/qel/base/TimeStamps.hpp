@@ -18,7 +18,7 @@ public:
     };
 
     /// A time in UTC: "2026-11-22T09:43:00.123Z".
-    static std::string iso(std::chrono::system_clock::time_point time);
+    static std::string iso(std::chrono::system_clock::time_point when);
 
     explicit TimeStamps(Style style = Style::Off) : mStyle(style) {}
 

@@ -172,10 +172,11 @@ void printJunit(std::ostream& os, const std::string& suite, const std::vector<Ou
                 std::chrono::nanoseconds time)
 {
     const Counts counts = countsOf(outcomes);
-    const std::string totals = "tests=\"" + std::to_string(outcomes.size()) + "\" failures=\"" +
-                               std::to_string(counts.fails) + "\" errors=\"0\" skipped=\"" +
-                               std::to_string(counts.skipped) + "\" time=\"" + secondsText(time) + "\"";
-    os << "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n"
+    const std::string totals = R"(tests=")" + std::to_string(outcomes.size()) + R"(" failures=")" +
+                               std::to_string(counts.fails) + R"(" errors="0" skipped=")" +
+                               std::to_string(counts.skipped) + R"(" time=")" + secondsText(time) + "\"";
+    os << R"(<?xml version="1.0" encoding="UTF-8"?>)"
+       << "\n"
        << "<testsuites " << totals << ">\n  <testsuite name=\"" << escapedXml(suite) << "\" " << totals << ">\n";
     for (const Outcome& outcome : outcomes) {
         os << "    <testcase classname=\"" << escapedXml(familyOf(*outcome.test)) << "\" name=\""

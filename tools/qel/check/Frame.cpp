@@ -135,7 +135,7 @@ std::vector<std::string> frameDetails(const std::string& bytes)
 
 std::string messageName(unsigned int function, unsigned int operation)
 {
-    const std::string numbers = hexNumber(function, 4) + "/" + hexNumber(operation, 4);
+    std::string numbers = hexNumber(function, 4) + "/" + hexNumber(operation, 4);
     const std::string text = toString(
         std::make_pair(static_cast<QelMessageFunctionCodes>(function), static_cast<QelMessageOpTypes>(operation)));
     static const std::string kPrefix = "(QelMessageOp";

@@ -294,32 +294,40 @@ std::string_view FrameFlow::next(TimePoint now)
         if (!pPassLimits(now)) continue;
         std::string_view bytes = pWaiting(now);
         if (bytes.empty()) {
-            const bool isAction =
-                mHolds && !mQueue.empty() && mQueue.front().action != nullptr && mQueue.front().due <= now;
-            if (!isAction) return {};
-            const Chunk chunk = std::move(mQueue.front());
-            mQueue.pop_front();
-            static_cast<void>(pAct(*chunk.action, chunk.number, now));
+            if (!pActInTurn(now)) return {};
             continue;
         }
         for (const ByteLimit& limit : mLimits) {
             if (!limit.isDone) bytes = bytes.substr(0, *limit.rule->afterBytes - mSentBytes);
         }
-        if (mIsHalfClosed) {
-            pConsume(bytes.size());
-            continue;
-        }
-        if (mRate == nullptr) return bytes;
-        if (!mSaidRate) {
-            mSaidRate = true;
-            pReport(0, *mRate, "limited to " + std::to_string(mRate->bytesPerSecond) + " bytes a second");
-        }
-        if (now < mRateAt) return {};
-        constexpr std::uint64_t kWritesPerSecond = 100;
-        constexpr std::uint64_t kLongest = 16 * 1024;
-        const std::uint64_t piece = mRate->bytesPerSecond / kWritesPerSecond;
-        return bytes.substr(0, std::clamp<std::uint64_t>(piece, 1, kLongest));
+        if (!mIsHalfClosed) return mRate == nullptr ? bytes : pWithinRate(bytes, now);
+        pConsume(bytes.size());
     }
+}
+
+/// Lets the rule act whose turn in the queue has come.
+/// @return false: there is none
+bool FrameFlow::pActInTurn(TimePoint now)
+{
+    if (!mHolds || mQueue.empty() || mQueue.front().action == nullptr || mQueue.front().due > now) return false;
+    const Chunk chunk = std::move(mQueue.front());
+    mQueue.pop_front();
+    static_cast<void>(pAct(*chunk.action, chunk.number, now));
+    return true;
+}
+
+/// What the rate lets go now; empty: nothing.
+std::string_view FrameFlow::pWithinRate(std::string_view bytes, TimePoint now)
+{
+    if (!mSaidRate) {
+        mSaidRate = true;
+        pReport(0, *mRate, "limited to " + std::to_string(mRate->bytesPerSecond) + " bytes a second");
+    }
+    if (now < mRateAt) return {};
+    constexpr std::uint64_t kWritesPerSecond = 100;
+    constexpr std::uint64_t kLongest = 16 * 1024;
+    const std::uint64_t piece = mRate->bytesPerSecond / kWritesPerSecond;
+    return bytes.substr(0, std::clamp<std::uint64_t>(piece, 1, kLongest));
 }
 
 /// Lets the rules act whose number of bytes has been sent.

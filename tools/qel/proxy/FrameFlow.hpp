@@ -156,6 +156,8 @@ private:
     // What leaves.
     bool pAct(const FaultRule& rule, std::uint64_t number, TimePoint now);
     bool pPassLimits(TimePoint now);
+    bool pActInTurn(TimePoint now);
+    std::string_view pWithinRate(std::string_view bytes, TimePoint now);
     std::string_view pWaiting(TimePoint now);
     void pConsume(std::size_t count);
     std::size_t pUnsent() const noexcept;

@@ -93,6 +93,7 @@ std::string didYouMean(const std::string& word, const std::vector<std::string>& 
 {
     // The nearest one is looked for without regard to case, and named as it is written.
     std::vector<std::string> all;
+    all.reserve(candidates.size());
     for (const std::string& candidate : candidates)
         all.push_back(lower(candidate));
     const std::string guess = nearestWord(lower(word), all);

@@ -89,7 +89,7 @@ ServiceManager ServiceManager::fromEnvironment()
 ServiceManager::ServiceManager(const std::string& address, std::chrono::microseconds watchdog)
     : mAddress(address), mWatchdog(watchdog)
 {
-    if (address.empty()) mWatchdog = mWatchdog.zero(); // there is nobody to tell
+    if (address.empty()) mWatchdog = std::chrono::microseconds::zero(); // there is nobody to tell
     if (address.empty() || !addressProblem(address).empty()) return;
     mTo.sun_family = AF_UNIX;
     std::memcpy(mTo.sun_path, address.data(), address.size());
