@@ -126,7 +126,8 @@ void compare(const std::vector<std::string>& programs)
         std::sort(times[i].begin(), times[i].end());
         const double median = times[i][kRounds / 2];
         if (i == 0) first = median;
-        std::printf("%s: %u requests under way, plain: %.2f us each (%.2f to %.2f), ratio %.2f\n", programs[i].c_str(),
+        std::printf("%s: %u requests under way, plain: %.2f us each (%.2f to %.2f), ratio %.2f\n",
+                    programs.size() == 1 ? "qel serve" : programs[i].c_str(), // a path means nothing elsewhere
                     kWindow, median, times[i].front(), times[i].back(), median / first);
     }
 }
