@@ -5,6 +5,7 @@
 
 #include <algorithm>
 #include <cctype>
+#include <charconv>
 #include <utility>
 
 namespace qel::protocol {
@@ -57,6 +58,29 @@ std::uint64_t kindOf(LogLevel::Level level, const std::string& text)
     return std::max<std::uint64_t>(hash, kOtherKinds + 1);
 }
 
+/// The number after the last " partition=" of a line: what a peer calls itself comes before it.
+std::optional<unsigned int> partitionOf(const std::string& line)
+{
+    constexpr const char* kWord = " partition=";
+    const std::size_t found = line.rfind(kWord);
+    if (found == std::string::npos) return std::nullopt;
+    const char* const digits = line.data() + found + std::char_traits<char>::length(kWord);
+    unsigned int number = 0;
+    const auto read = std::from_chars(digits, line.data() + line.size(), number);
+    if (read.ec != std::errc()) return std::nullopt;
+    return number;
+}
+
+/// " (partitions 1, 2 and others)"; empty without any.
+std::string listOf(const std::set<unsigned int>& partitions, bool hasOthers)
+{
+    if (partitions.empty()) return {};
+    std::string list;
+    for (const unsigned int partition : partitions)
+        list += (list.empty() ? "" : ", ") + std::to_string(partition);
+    return (partitions.size() == 1 ? " (partition " : " (partitions ") + list + (hasOthers ? " and others)" : ")");
+}
+
 } // namespace
 
 LogThrottle::Scope::Scope(LogThrottle& throttle, const std::string& peer) noexcept
@@ -103,6 +127,7 @@ bool LogThrottle::pAdmits(const std::string& peer, LogLevel::Level level, const 
         --kind.credit;
         return true;
     }
+    pNotePartition(kind, partitionOf(line));
     if (kind.heldBack == 0) kind.since = now;
     ++kind.heldBack;
     kind.level = level;
@@ -112,6 +137,16 @@ bool LogThrottle::pAdmits(const std::string& peer, LogLevel::Level level, const 
         mOnHeldBack();
     }
     return false;
+}
+
+void LogThrottle::pNotePartition(Kind& kind, std::optional<unsigned int> partition)
+{
+    if (!partition || kind.partitions.count(*partition) != 0) return;
+    if (kind.partitions.size() < kMaxPartitions) {
+        kind.partitions.insert(*partition);
+    } else {
+        kind.hasOthers = true;
+    }
 }
 
 LogThrottle::Kinds& LogThrottle::pKindsOfLocked(const std::string& peer, TimePoint now)
@@ -167,6 +202,7 @@ void LogThrottle::pReport(TimePoint until)
         LogLevel::Level level;
         std::uint64_t count;
         std::string peer;
+        std::string partitions;
         std::string last;
     };
     std::vector<Line> lines;
@@ -181,7 +217,10 @@ void LogThrottle::pReport(TimePoint until)
                     mNextReport = std::min(mNextReport, kind.since + kPeriod);
                     continue;
                 }
-                lines.push_back({kind.level, kind.heldBack, peer, std::move(kind.lastLine)});
+                lines.push_back({kind.level, kind.heldBack, peer, listOf(kind.partitions, kind.hasOthers),
+                                 std::move(kind.lastLine)});
+                kind.partitions.clear();
+                kind.hasOthers = false;
                 kind.heldBack = 0;
                 kind.credit = 1;
                 kind.since = now;
@@ -189,7 +228,7 @@ void LogThrottle::pReport(TimePoint until)
         }
     }
     for (const Line& line : lines)
-        logLine(line.level, line.peer, ": ", line.count, " more lines like this one: ", line.last);
+        logLine(line.level, line.peer, ": ", line.count, " more lines like this one", line.partitions, ": ", line.last);
 }
 
 } // namespace qel::protocol

@@ -8,6 +8,8 @@
 #include <cstdint>
 #include <functional>
 #include <map>
+#include <optional>
+#include <set>
 #include <string>
 #include <vector>
 
@@ -20,7 +22,10 @@ namespace qel::protocol {
 /// and one more for each second without any. Further lines are counted; once a second report() sums them up. Lines at
 /// Debug always go out.
 ///
-/// Memory is bounded: the kinds of a peer beyond kMaxKinds count as one, and so do the peers beyond kMaxPeers.
+/// A sum names the partitions ("partition=N") of the lines that it stands for, so that none of them goes unsaid.
+///
+/// Memory is bounded: the partitions of a sum beyond kMaxPartitions are its "others", the kinds of a peer beyond
+/// kMaxKinds count as one, and so do the peers beyond kMaxPeers.
 ///
 /// The clock is TimeProvider::steady(). Thread safety: any thread.
 class LogThrottle {
@@ -28,6 +33,7 @@ public:
     static constexpr unsigned int kBurst = 10;
     static constexpr std::size_t kMaxKinds = 8;
     static constexpr std::size_t kMaxPeers = 128;
+    static constexpr std::size_t kMaxPartitions = 256;
     static constexpr std::chrono::seconds kPeriod{1};
 
     using TimePoint = std::chrono::steady_clock::time_point;
@@ -78,13 +84,16 @@ private:
         TimePoint since;              ///< of the latest change of the credit, or of the first line held back
         std::uint64_t heldBack = 0;
         LogLevel::Level level = LogLevel::Debug;
-        std::string lastLine; ///< of those held back
+        std::string lastLine;              ///< of those held back
+        std::set<unsigned int> partitions; ///< of those held back
+        bool hasOthers = false;            ///< there were more of them than kMaxPartitions
     };
     using Kinds = std::vector<Kind>;
 
     bool pAdmits(const std::string& peer, LogLevel::Level level, const std::string& line);
     Kinds& pKindsOfLocked(const std::string& peer, TimePoint now) QEL_REQUIRES(mMutex);
     static Kind& pKindOf(Kinds& kinds, std::uint64_t hash, TimePoint now);
+    static void pNotePartition(Kind& kind, std::optional<unsigned int> partition);
     static void pRefill(Kind& kind, TimePoint now);
     void pForgetIdleLocked(TimePoint now) QEL_REQUIRES(mMutex);
     void pReport(TimePoint until);

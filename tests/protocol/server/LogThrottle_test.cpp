@@ -134,6 +134,45 @@ TEST_F(LogThrottleTest, APeerThatWasQuietGetsABurstAgain)
     EXPECT_THAT(lines(), SizeIs(kBurst));
 }
 
+TEST_F(LogThrottleTest, ASumNamesThePartitionsOfItsLines)
+{
+    const LogThrottle::Scope scope(throttle, peer);
+    const auto opened = [](unsigned partition) {
+        logLine(LogLevel::Info, "audit: opened name=\"a partition=77\" partition=", partition, " connection=0");
+    };
+    for (unsigned i = 0; i < kBurst + 3; ++i)
+        opened(1);
+    opened(2);
+    opened(1);
+    lines();
+    throttle.reportAll();
+    EXPECT_THAT(lines(), ElementsAre("I): [qel] 192.0.2.7: 5 more lines like this one (partitions 1, 2): audit: opened "
+                                     "name=\"a partition=77\" partition=1 connection=0"));
+    clock.advance(LogThrottle::kPeriod);
+    for (int i = 0; i < 5; ++i)
+        opened(3);
+    lines();
+    throttle.reportAll();
+    EXPECT_THAT(lines(), ElementsAre(HasSubstr(" more lines like this one (partition 3): ")));
+}
+
+TEST_F(LogThrottleTest, ASumNamesSoManyPartitionsAndSaysThatThereAreOthers)
+{
+    const LogThrottle::Scope scope(throttle, peer);
+    for (unsigned i = 0; i < kBurst; ++i)
+        logLine(LogLevel::Info, "opened partition=1");
+    for (unsigned partition = 1; partition <= LogThrottle::kMaxPartitions; ++partition)
+        logLine(LogLevel::Info, "opened partition=", partition);
+    lines();
+    throttle.reportAll();
+    EXPECT_THAT(lines(), ElementsAre(HasSubstr(", 255, 256): opened")));
+    for (unsigned partition = 1; partition <= LogThrottle::kMaxPartitions + 2; ++partition)
+        logLine(LogLevel::Info, "opened partition=", partition);
+    lines();
+    throttle.reportAll();
+    EXPECT_THAT(lines(), ElementsAre(HasSubstr(" and others): opened")));
+}
+
 TEST_F(LogThrottleTest, EachKindOfLineCountsByItself)
 {
     const LogThrottle::Scope scope(throttle, peer);
